@@ -1,0 +1,250 @@
+#include "FileUtils.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/statfs.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdint>
+#include <cstdio>
+#include <cstring>
+#include <new>
+#include <stdexcept>
+#include <utility>
+
+#include "LarderException.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+using std::string;
+
+constexpr mode_t kDirectoryMode = 0775;
+constexpr mode_t kDirectoryBit = 0040000;
+
+[[noreturn]] void throwSystemError(const string& operation, int error) {
+  const string reason = std::strerror(error);  // NOLINT(concurrency-mt-unsafe): thread-safe in every libc we build for
+  throw FileUtilsIoException(error, operation + (operation.empty() || reason.empty() ? "" : ": ") + reason);
+}
+
+// A stdio stream that is closed on every way out.
+class File {
+ public:
+  File(const string& path, const char* mode) : stream_(std::fopen(path.c_str(), mode)) {
+    if (stream_ == nullptr) throwSystemError("Could not open file", errno);
+  }
+  ~File() {
+    if (stream_ != nullptr) (void)std::fclose(stream_);
+  }
+  File(const File&) = delete;
+  File& operator=(const File&) = delete;
+
+  std::FILE* get() { return stream_; }
+
+  // Closing may be what writes the last bytes, so it can fail for want of space.
+  void close() {
+    if (std::fclose(std::exchange(stream_, nullptr)) != 0) throwSystemError("Could not close file", errno);
+  }
+
+ private:
+  std::FILE* stream_;
+};
+
+std::size_t sizeOf(File& file) {
+  if (std::fseek(file.get(), 0, SEEK_END) != 0) throwSystemError("Could not seek to end of file", errno);
+  const long size = std::ftell(file.get());
+  if (size == -1) throwSystemError("Could not determine size of file", errno);
+  if (std::fseek(file.get(), 0, SEEK_SET) != 0) throwSystemError("Could not seek to start of file", errno);
+  return static_cast<std::size_t>(size);
+}
+
+// The memory for a whole file. What is no regular file may claim any size: then the first byte tells what is wrong with
+// it.
+std::vector<unsigned char> allocate(std::size_t size, File& file) {
+  try {
+    return std::vector<unsigned char>(size);
+  } catch (const std::bad_alloc&) {
+  } catch (const std::length_error&) {
+  }
+  errno = 0;
+  (void)std::fgetc(file.get());
+  throwSystemError("File read failed", errno != 0 ? errno : ENOMEM);
+}
+
+// A directory stream that is closed on every way out.
+class DirectoryStream {
+ public:
+  explicit DirectoryStream(DIR* stream) : stream_(stream) {
+    if (stream == nullptr) throwSystemError("Could not open directory", errno);
+  }
+  ~DirectoryStream() { (void)::closedir(stream_); }
+  DirectoryStream(const DirectoryStream&) = delete;
+  DirectoryStream& operator=(const DirectoryStream&) = delete;
+
+  // The next entry other than "." and "..", or null at the end.
+  const dirent* next() {
+    const dirent* entry = nullptr;
+    do {
+      entry = ::readdir(stream_);  // NOLINT(concurrency-mt-unsafe): the stream is this object's own
+    } while (entry != nullptr && (std::strcmp(entry->d_name, ".") == 0 || std::strcmp(entry->d_name, "..") == 0));
+    return entry;
+  }
+
+ private:
+  DIR* stream_;
+};
+
+// Opens a directory to empty it: whatever has become of the path meanwhile, a link is not followed.
+DIR* openUnlessLink(const string& path) {
+  const int descriptor = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (descriptor == -1) return nullptr;
+  DIR* stream = ::fdopendir(descriptor);
+  if (stream == nullptr) {
+    const int error = errno;
+    (void)::close(descriptor);
+    errno = error;
+  }
+  return stream;
+}
+
+// The last character that counts for the last component: trailing slashes are skipped, but never the first character.
+std::size_t lastComponentEnd(const string& path) {
+  std::size_t end = path.size() - 1;
+  while (end > 0 && path[end] == '/') --end;
+  return end;
+}
+
+}  // namespace
+
+FileUtils::Info::Info(const string& path_, long long size_, Type type_) : path(path_), size(size_), type(type_) {}
+
+FileUtils::DiskSpace::DiskSpace(long long total_, long long available_) : total(total_), available(available_) {}
+
+FileUtils::~FileUtils() = default;
+
+string FileUtils::combinePath(const string& a, const string& b) {
+  return a.empty() || a.back() == '/' ? a + b : a + "/" + b;
+}
+
+string FileUtils::basename(const string& path) {
+  if (path.empty()) return path;
+  const std::size_t end = lastComponentEnd(path);
+  const std::size_t slash = path.rfind('/', end);
+  return slash == string::npos ? path : path.substr(slash + 1, end - slash);
+}
+
+string FileUtils::parentPath(const string& path) {
+  if (path.empty()) return path;
+  const std::size_t slash = path.rfind('/', lastComponentEnd(path));
+  return slash == string::npos ? "" : path.substr(0, slash);
+}
+
+std::vector<unsigned char> FileUtils::readFile(const string& path) {
+  File file(path, "rb");
+  std::vector<unsigned char> data = allocate(sizeOf(file), file);
+  errno = 0;
+  if (std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
+    throwSystemError("File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
+  }
+  file.close();
+  return data;
+}
+
+void FileUtils::writeFile(const string& path, const std::vector<unsigned char>& data) {
+  File file(path, "wb");
+  if (std::fwrite(data.data(), 1, data.size(), file.get()) != data.size()) {
+    throwSystemError("File write failed", errno);
+  }
+  file.close();
+}
+
+void FileUtils::deleteFile(const string& path) {
+  if (std::remove(path.c_str()) != 0) throwSystemError("Could not remove file", errno);
+}
+
+void FileUtils::recursiverDirectoryDelete(const string& path) {
+  if (isSymLink(path)) return deleteFile(path);
+  DirectoryStream directory(openUnlessLink(path));
+  while (const dirent* entry = directory.next()) {
+    const string entryPath = combinePath(path, entry->d_name);
+    if (entry->d_type == DT_DIR) {
+      recursiverDirectoryDelete(entryPath);
+    } else {
+      deleteFile(entryPath);
+    }
+  }
+  deleteFile(path);
+}
+
+void FileUtils::rename(const string& from, const string& to) {
+  if (std::rename(from.c_str(), to.c_str()) != 0) throwSystemError("", errno);
+}
+
+void FileUtils::createDirectory(const string& path, bool recursive) {
+  if (path.empty()) return;
+  if (pathExists(path)) {
+    if (isDirectory(path)) return;
+    throw FileUtilsIoException(0, "Could not create directory at \"" + path + "\": file exists");
+  }
+  if (recursive) createDirectory(parentPath(path), true);
+  if (::mkdir(path.c_str(), kDirectoryMode) != 0) throwSystemError("", errno);
+}
+
+void FileUtils::createSymLink(const string& linkPath, const string& targetPath) {
+  if (::symlink(targetPath.c_str(), linkPath.c_str()) != 0) throwSystemError("Could not create symlink", errno);
+}
+
+bool FileUtils::isDirectory(const string& path) {
+  struct stat status {};
+  return ::stat(path.c_str(), &status) == 0 && (status.st_mode & kDirectoryBit) != 0;
+}
+
+bool FileUtils::pathExists(const string& path) {
+  struct stat status {};
+  return ::stat(path.c_str(), &status) == 0;
+}
+
+FileUtils::DiskSpace FileUtils::getDiskSpace(const string& path) {
+  struct statfs status {};
+  if (::statfs(path.c_str(), &status) != 0) {
+    throwSystemError("Could not get file system statistics for the path \"" + path + "\"", errno);
+  }
+  const auto blockSize = static_cast<std::uint64_t>(status.f_bsize);
+  return {static_cast<long long>(status.f_blocks * blockSize), static_cast<long long>(status.f_bavail * blockSize)};
+}
+
+std::vector<string> FileUtils::listDirectories(const string& path) {
+  std::vector<string> names;
+  DirectoryStream directory(::opendir(path.c_str()));
+  while (const dirent* entry = directory.next()) {
+    if (entry->d_type == DT_DIR) names.emplace_back(entry->d_name);
+  }
+  return names;
+}
+
+std::vector<FileUtils::Info> FileUtils::listDirectory(const string& path) {
+  std::vector<Info> entries;
+  DirectoryStream directory(::opendir(path.c_str()));
+  while (const dirent* entry = directory.next()) {
+    const string entryPath = combinePath(path, entry->d_name);
+    if (entry->d_type == DT_REG) {
+      struct stat status {};
+      if (::stat(entryPath.c_str(), &status) == 0) entries.emplace_back(entryPath, status.st_size, Type::File);
+    } else if (entry->d_type == DT_LNK) {
+      entries.emplace_back(entryPath, 0, Type::SymLink);
+    } else if (entry->d_type == DT_DIR) {
+      entries.emplace_back(entryPath, 0, Type::Directory);
+    }
+  }
+  return entries;
+}
+
+bool FileUtils::isSymLink(const string& path) {
+  struct stat status {};
+  return ::lstat(path.c_str(), &status) == 0 && S_ISLNK(status.st_mode);
+}
+
+}  // namespace velmora::mobile::xplat::cellar
