@@ -1,0 +1,85 @@
+#pragma once
+
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <typeinfo>
+
+#include "Configuration.h"
+#include "Export.h"
+#include "Store.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class AttributeStore;
+class DiskSizeCalculator;
+class LazyDispatcher;
+class StoreDirectoryNameBuilder;
+class StoreManagerImpl;
+
+namespace detail {
+[[noreturn]] CELLAR_EXPORT void throwStoreTypeMismatch(const std::string& identifier, const std::type_info& wanted,
+                                                       const Store& store);
+}
+
+// The host's handle on one manager: a directory of stores that are kept within their limits. Obtained from a
+// `StoreManagerFactory`. Any thread may call. Letting the handle go stops nothing that is under way and loses no data.
+class CELLAR_EXPORT StoreManager {
+ public:
+  // Builds the manager and starts it. With `runMaintenance` it is cleansed first if that is forced or necessary, and
+  // what other versions and sessions left behind is cleaned up in the background, and stores are pruned. Always:
+  // unmanaged stores are registered for measuring, and the configured stores are created in the background when the
+  // lazy dispatcher says so. Throws what creating the manager's directories throws. `analyticsReporter` and
+  // `lazyDispatcher` may be null.
+  StoreManager(const std::string& parentPath, const StoreManagerDefinition& definition, bool forceCleanse,
+               const std::shared_ptr<StoreDirectoryNameBuilder>& nameBuilder,
+               const std::shared_ptr<TrashCollector>& trashCollector,
+               const std::shared_ptr<TaskQueueFactory>& taskQueueFactory,
+               const std::shared_ptr<DiskSizeCalculator>& diskSizeCalculator,
+               const std::shared_ptr<AnalyticsEventReporter>& analyticsReporter,
+               const std::shared_ptr<FileUtils>& fileUtils, const std::shared_ptr<AttributeStore>& attributeStore,
+               const std::shared_ptr<LazyDispatcher>& lazyDispatcher, bool runMaintenance);
+  ~StoreManager();
+  StoreManager(const StoreManager&) = delete;
+  StoreManager& operator=(const StoreManager&) = delete;
+
+  // The store of that identifier, created by the first call; concurrent callers wait for it. `strategy` counts only in
+  // the call that creates a disk cache; `Null` takes what its definition names. Empty for an identifier that the
+  // manager does not have (one error line) and once the manager is invalid. Throws what creating the store throws;
+  // later callers of that identifier then wait without end.
+  std::shared_ptr<Store> getStoreImpl(const std::string& identifier, PruneStrategyIdentifier strategy);
+
+  // The same, as a store of that type. Empty only where `getStoreImpl` is; a store of another type throws
+  // `std::logic_error`.
+  template <class StoreType>
+  std::shared_ptr<StoreType> getStore(const std::string& identifier,
+                                      PruneStrategyIdentifier strategy = PruneStrategyIdentifier::Null) {
+    const std::shared_ptr<Store> store = getStoreImpl(identifier, strategy);
+    auto typed = std::dynamic_pointer_cast<StoreType>(store);
+    if (store != nullptr && typed == nullptr) detail::throwStoreTypeMismatch(identifier, typeid(StoreType), *store);
+    return typed;
+  }
+
+  // A directory of the manager's for short-lived files: emptied whenever the manager is built.
+  std::string getTemporaryDirectory();
+
+  // Makes the store begin empty the next time it is created, normally at the next start of the application. Nothing is
+  // deleted now. Throws `std::logic_error` for an identifier that the manager does not have.
+  void trashStoreOnStartup(const std::string& identifier);
+
+  // Invalidates all stores and discards the manager's directory with all its data. Waits until the stores have finished
+  // what they were writing: must not be called on one of their queues. A second call does nothing.
+  void invalidate();
+
+  bool isValid();
+
+  // Whether managers built from now on discard their directories as they start. One flag for the process, off at first
+  // and never reset by the library.
+  static bool forceCleanseOnInit();
+  static void setForceCleanseOnInit(bool force);
+
+ private:
+  const std::shared_ptr<StoreManagerImpl> impl_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar

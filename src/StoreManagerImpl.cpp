@@ -1,0 +1,245 @@
+#include "StoreManagerImpl.h"
+
+#include <glog/logging.h>
+
+#include <exception>
+#include <stdexcept>
+#include <utility>
+
+#include "DiskSizeCalculator.h"
+#include "FileUtils.h"
+#include "LarderException.h"
+#include "LazyDispatcher.h"
+#include "Store.h"
+#include "TrashCollector.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+// One store of a round, as it was when the round was decided.
+struct StoreManagerImpl::PruneRequest {
+  std::string identifier;
+  std::shared_ptr<Store> store;
+  std::string name;
+  std::uint32_t currentSize;
+  std::uint32_t maxSize;
+  bool survivalMode;
+};
+
+StoreManagerImpl::StoreManagerImpl(const std::string& parentPath, const StoreManagerDefinition& definition,
+                                   std::shared_ptr<StoreDirectoryNameBuilder> nameBuilder,
+                                   std::shared_ptr<TrashCollector> trashCollector,
+                                   std::shared_ptr<TaskQueueFactory> taskQueueFactory,
+                                   std::shared_ptr<DiskSizeCalculator> diskSizeCalculator,
+                                   std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
+                                   std::shared_ptr<FileUtils> fileUtils, std::shared_ptr<AttributeStore> attributeStore,
+                                   std::shared_ptr<LazyDispatcher> lazyDispatcher, bool maintenanceEnabled)
+    : maintenanceEnabled_(maintenanceEnabled),
+      analyticsReporter_(std::move(analyticsReporter)),
+      diskSizeCalculator_(std::move(diskSizeCalculator)),
+      fileUtils_(std::move(fileUtils)),
+      lazyDispatcher_(std::move(lazyDispatcher)),
+      taskQueueFactory_(std::move(taskQueueFactory)),
+      trashCollector_(std::move(trashCollector)),
+      common_(parentPath, trashCollector_, fileUtils_, std::move(nameBuilder), std::move(attributeStore), definition),
+      queue_(taskQueueFactory_->createQueue()) {}
+
+StoreManagerImpl::~StoreManagerImpl() = default;
+
+std::shared_ptr<Store> StoreManagerImpl::getStoreImpl(const std::string& identifier, PruneStrategyIdentifier strategy) {
+  std::shared_ptr<const StoreDefinition> definition;
+  try {
+    definition = common_.getStoreDefinition(identifier);
+  } catch (const std::logic_error& error) {
+    LOG(ERROR) << error.what();
+  }
+  if (definition == nullptr) return nullptr;
+
+  const auto onSizeChanged = [self = shared_from_this(), identifier](unsigned int size) {
+    self->onStoreSizeChanged(identifier, size);
+  };
+  bool created = false;
+  auto store = common_.getStore(identifier, taskQueueFactory_, trashCollector_, analyticsReporter_, onSizeChanged,
+                                strategy, created);
+  if (created && !definition->isManaged) measureNewUnmanagedStore(identifier, definition);
+  return store;
+}
+
+// The library does not see what the host writes there, so this is when the size of such a store is looked at.
+void StoreManagerImpl::measureNewUnmanagedStore(const std::string& identifier,
+                                                const std::shared_ptr<const StoreDefinition>& definition) {
+  const std::string path = getStorePath(definition);
+  long long size = diskSizeCalculator_->fetchDirectorySize(path);
+  const auto report = [&](StoreManagerEvent::Type type) {
+    reportEventToAnalytics(definition->name, type, static_cast<unsigned int>(size), definition->maxSize);
+  };
+  report(StoreManagerEvent::Type::Initialization);
+  if (definition->isCache && size > static_cast<long long>(definition->maxSize) && trashCollector_->collectPath(path)) {
+    fileUtils_->createDirectory(path, true);
+    report(StoreManagerEvent::Type::Eviction);
+    size = 0;
+  }
+  queue_->dispatch([self = shared_from_this(), identifier, size] {
+    self->onStoreSizeChanged(identifier, static_cast<unsigned int>(size));
+  });
+}
+
+std::string StoreManagerImpl::getTemporaryDirectory() { return common_.getTemporaryDirectory(); }
+
+void StoreManagerImpl::trashStoreOnStartup(const std::string& identifier) { common_.trashStoreOnStartup(identifier); }
+
+void StoreManagerImpl::cleanupOldStores() { common_.cleanupOldStores(); }
+
+void StoreManagerImpl::cleanupParentDirectory() { common_.cleanupParentDirectory(); }
+
+std::string StoreManagerImpl::getStorePath(std::shared_ptr<const StoreDefinition> definition) {
+  return common_.getStorePath(std::move(definition));
+}
+
+void StoreManagerImpl::invalidate() { common_.invalidate(); }
+
+bool StoreManagerImpl::isValid() { return common_.isValid(); }
+
+void StoreManagerImpl::cleanseIfNecessary(bool force) {
+  if (!fileUtils_->pathExists(common_.managerPath())) return;
+  bool cleanse = force;
+  try {
+    const std::int64_t diskSpace = fileUtils_->getDiskSpace(common_.managerPath()).total;
+    cleanse = cleanse || diskSpace < kCleanseMinimumFreeSizeTrash;
+  } catch (const LarderException& error) {
+    LOG(ERROR) << "Could not read disk space: " << error.what();
+  }
+  if (cleanse) common_.trashDirectories(common_.parentPath(), {common_.managerDirectoryName()}, {});
+}
+
+void StoreManagerImpl::startCleanup() {
+  queue_->dispatch([self = shared_from_this()] {
+    self->cleanupOldStores();
+    self->cleanupParentDirectory();
+  });
+}
+
+void StoreManagerImpl::startCalculatingUnmanagedStoresSize() {
+  for (const auto& [identifier, definition] : common_.definition().stores) {
+    if (definition->isManaged) continue;
+    const std::string path = getStorePath(definition);
+    if (fileUtils_->pathExists(path)) diskSizeCalculator_->addDirectory(path, DiskSizeCalculator::STALE_INTERVAL);
+  }
+}
+
+void StoreManagerImpl::initAllStoresLazy() {
+  if (lazyDispatcher_ == nullptr) return;
+  const auto createStores = [weakThis = weak_from_this()] {
+    if (const auto self = weakThis.lock()) self->createAllStores();
+  };
+  lazyDispatcher_->addTask(createStores, taskQueueFactory_->createWorkQueue());
+}
+
+void StoreManagerImpl::createAllStores() {
+  for (const auto& [identifier, definition] : common_.definition().stores) {
+    try {
+      getStoreImpl(identifier, PruneStrategyIdentifier::LRU);
+    } catch (const LarderException& error) {
+      LOG(ERROR) << "Could not initialize store " << identifier << ": " << error.what();
+    }
+  }
+}
+
+void StoreManagerImpl::onStoreSizeChanged(const std::string& identifier, unsigned int size) {
+  const auto item = common_.getExistingStore(identifier);  // empty also when the manager is invalid
+  if (item == nullptr) return;
+
+  std::uint32_t oldSize = 0;
+  {
+    const std::lock_guard<std::mutex> lock(item->mutex);
+    oldSize = item->currentSize;
+    if (!item->sizeReported) {
+      reportEventToAnalytics(item->name, StoreManagerEvent::Type::Initialization, size, item->maxSize);
+      item->sizeReported = true;
+    }
+    item->currentSize = size;
+  }
+
+  const std::lock_guard<std::mutex> lock(mutex_);
+  totalSize_ = size + (totalSize_ - oldSize);
+  if (maintenanceEnabled_) queue_->dispatch([self = shared_from_this()] { self->pruneStoresIfNecessary(); });
+}
+
+void StoreManagerImpl::pruneStoresIfNecessary() {
+  // A store may finish at once, on this thread, and report back: no lock is held while it is asked.
+  for (const PruneRequest& request : beginPruneRound()) startPruning(request);
+}
+
+// Decides which stores to prune and marks them. From then on, if there are any, the round is in progress.
+std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  const StoreManagerDefinition& definition = common_.definition();
+  if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
+  const auto nextPruneTime = static_cast<std::int64_t>(lastPruneTime_) + definition.pruneInterval;
+  if (static_cast<std::int64_t>(std::time(nullptr)) < nextPruneTime) return {};
+  const bool survivalMode = isInSurvivalMode();
+  if (totalSize_ <= definition.maxSize && !survivalMode) return {};
+
+  std::vector<PruneRequest> requests;
+  for (const auto& [identifier, item] : common_.copyStoreMap()) {
+    const std::lock_guard<std::mutex> itemLock(item->mutex);
+    if (item->store == nullptr || !item->store->isPrunable() || item->isPruning) continue;
+    if (item->currentSize <= item->maxSize && !survivalMode) continue;
+    item->isPruning = true;
+    requests.push_back({identifier, item->store, item->name, item->currentSize, item->maxSize, survivalMode});
+  }
+  pruneInProgress_ = !requests.empty();
+  return requests;
+}
+
+// Called with the mutex held.
+bool StoreManagerImpl::isInSurvivalMode() {
+  try {
+    return fileUtils_->getDiskSpace(common_.managerPath()).total < kMinimumFreeSizeSurvivalMode;
+  } catch (const LarderException& error) {
+    LOG(ERROR) << "Could not read disk space: " << error.what();
+    return false;
+  }
+}
+
+void StoreManagerImpl::startPruning(const PruneRequest& request) {
+  const auto onSuccess = [self = shared_from_this(), identifier = request.identifier] {
+    self->onStorePruneBackToNormalComplete(identifier);
+  };
+  const auto onError = [self = shared_from_this(), identifier = request.identifier](const std::exception& error) {
+    self->onStorePruneBackToNormalComplete(identifier);
+    LOG(ERROR) << "Failed to prune store " << error.what();
+  };
+  try {
+    reportEventToAnalytics(request.name, StoreManagerEvent::Type::Pruning, request.currentSize, request.maxSize);
+    request.store->pruneBackToNormal(onSuccess, onError, request.survivalMode);
+  } catch (const std::exception& error) {
+    onError(error);
+  }
+}
+
+void StoreManagerImpl::onStorePruneBackToNormalComplete(const std::string& identifier) {
+  if (const auto item = common_.getExistingStore(identifier)) {
+    const std::lock_guard<std::mutex> lock(item->mutex);
+    item->isPruning = false;
+  }
+  checkPruneCompletion();
+}
+
+void StoreManagerImpl::checkPruneCompletion() {
+  bool anyIsPruning = false;
+  for (const auto& [identifier, item] : common_.copyStoreMap()) {
+    const std::lock_guard<std::mutex> lock(item->mutex);
+    anyIsPruning = anyIsPruning || item->isPruning;
+  }
+  const std::lock_guard<std::mutex> lock(mutex_);
+  pruneInProgress_ = anyIsPruning;
+  if (!anyIsPruning) lastPruneTime_ = std::time(nullptr);
+}
+
+void StoreManagerImpl::reportEventToAnalytics(const std::string& storeName, StoreManagerEvent::Type type,
+                                              unsigned int currentSize, unsigned int maxSize) {
+  if (analyticsReporter_ == nullptr) return;
+  analyticsReporter_->reportEvent(StoreManagerEvent(type, storeName, currentSize, maxSize));
+}
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,189 @@
+#include "StoreManagerImplCommon.h"
+
+#include <glog/logging.h>
+
+#include <algorithm>
+#include <stdexcept>
+#include <utility>
+
+#include "AttributeStore.h"
+#include "FileUtils.h"
+#include "LarderException.h"
+#include "Store.h"
+#include "StoreDirectoryNameBuilder.h"
+#include "TrashCollector.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+const std::string StoreManagerImplCommon::TemporaryDirectoryName = "tmp";
+const std::string StoreManagerImplCommon::TrashOnStartupKey = "trash_on_start_up";
+
+StoreManagerImplCommon::StoreManagerImplCommon(const std::string& parentPath,
+                                               std::shared_ptr<TrashCollector> trashCollector,
+                                               std::shared_ptr<FileUtils> fileUtils,
+                                               std::shared_ptr<StoreDirectoryNameBuilder> nameBuilder,
+                                               std::shared_ptr<AttributeStore> attributeStore,
+                                               const StoreManagerDefinition& definition)
+    : definition_(definition),
+      parentPath_(parentPath),
+      trashCollector_(std::move(trashCollector)),
+      fileUtils_(std::move(fileUtils)),
+      nameBuilder_(std::move(nameBuilder)),
+      attributeStore_(std::move(attributeStore)),
+      managerDirectoryName_(nameBuilder_->buildStoreManagerName()),
+      managerPath_(fileUtils_->combinePath(parentPath_, managerDirectoryName_)),
+      temporaryDirectoryPath_(fileUtils_->combinePath(managerPath_, TemporaryDirectoryName)) {
+  if (fileUtils_->pathExists(temporaryDirectoryPath_)) trashCollector_->collectPath(temporaryDirectoryPath_);
+  fileUtils_->createDirectory(temporaryDirectoryPath_, true);
+}
+
+StoreManagerImplCommon::~StoreManagerImplCommon() = default;
+
+std::shared_ptr<Store> StoreManagerImplCommon::getStore(const std::string& identifier,
+                                                        std::shared_ptr<TaskQueueFactory> taskQueueFactory,
+                                                        std::shared_ptr<TrashCollector> trashCollector,
+                                                        std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
+                                                        std::function<void(unsigned int)> sizeChangedCallback,
+                                                        PruneStrategyIdentifier pruneStrategy, bool& created) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  if (invalid_) return nullptr;
+  std::shared_ptr<Item>& slot = stores_[identifier];
+  if (slot != nullptr) {
+    const std::shared_ptr<Item> item = slot;
+    lock.unlock();
+    std::unique_lock<std::mutex> itemLock(item->mutex);
+    item->condition.wait(itemLock, [&item] { return item->store != nullptr; });
+    return item->store;
+  }
+  slot = std::make_shared<Item>();
+  const std::shared_ptr<Item> item = slot;
+  lock.unlock();
+
+  created = true;
+  return createStore(identifier, item, std::move(taskQueueFactory), std::move(trashCollector),
+                     std::move(analyticsReporter), std::move(sizeChangedCallback), pruneStrategy);
+}
+
+std::shared_ptr<StoreManagerImplCommon::Item> StoreManagerImplCommon::getExistingStore(const std::string& identifier) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  if (invalid_) return nullptr;
+  const auto found = stores_.find(identifier);
+  return found == stores_.end() ? nullptr : found->second;
+}
+
+std::shared_ptr<Store> StoreManagerImplCommon::createStore(const std::string& identifier, std::shared_ptr<Item> item,
+                                                           std::shared_ptr<TaskQueueFactory> taskQueueFactory,
+                                                           std::shared_ptr<TrashCollector> trashCollector,
+                                                           std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
+                                                           std::function<void(unsigned int)> sizeChangedCallback,
+                                                           PruneStrategyIdentifier pruneStrategy) {
+  const auto storeDefinition = getStoreDefinition(identifier);
+  const std::string storePath = getStorePath(storeDefinition);
+  if (isMarkedForTrashing(storePath)) trashCollector_->collectPath(storePath);
+  fileUtils_->createDirectory(storePath, true);
+  auto store = storeDefinition->createStore(storePath, temporaryDirectoryPath_, std::move(taskQueueFactory),
+                                            std::move(trashCollector), std::move(analyticsReporter), fileUtils_,
+                                            std::move(sizeChangedCallback), pruneStrategy, storeDefinition);
+  {
+    const std::lock_guard<std::mutex> lock(item->mutex);
+    item->store = store;
+    item->maxSize = storeDefinition->maxSize;
+    item->name = storeDefinition->name;
+  }
+  item->condition.notify_all();
+
+  // Whoever invalidated the manager meanwhile could not see this store.
+  if (!isValid()) store->invalidate();
+  return store;
+}
+
+std::shared_ptr<const StoreDefinition> StoreManagerImplCommon::getStoreDefinition(const std::string& identifier) {
+  const auto found = definition_.stores.find(identifier);
+  if (found == definition_.stores.end()) {
+    throw std::logic_error("Definition not defined for store with identifier " + identifier +
+                           " in StoreManager with name '" + definition_.name + "'");
+  }
+  return found->second;
+}
+
+std::string StoreManagerImplCommon::getStorePath(std::shared_ptr<const StoreDefinition> definition) {
+  return fileUtils_->combinePath(managerPath_, nameBuilder_->buildStoreName(*definition));
+}
+
+StoreManagerImplCommon::StoreMap StoreManagerImplCommon::copyStoreMap() {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  return stores_;
+}
+
+void StoreManagerImplCommon::trashStoreOnStartup(const std::string& identifier) {
+  const std::string storePath = getStorePath(getStoreDefinition(identifier));
+  if (fileUtils_->pathExists(storePath)) attributeStore_->set(storePath, {{TrashOnStartupKey, true}});
+}
+
+void StoreManagerImplCommon::cleanupOldStores() {
+  try {
+    if (!fileUtils_->pathExists(managerPath_)) return;
+    std::vector<std::string> keep;
+    for (const auto& [identifier, store] : definition_.stores) keep.push_back(nameBuilder_->buildStoreName(*store));
+    keep.push_back(TemporaryDirectoryName);
+    trashDirectories(managerPath_, fileUtils_->listDirectories(managerPath_), keep);
+  } catch (const LarderException& error) {
+    LOG(ERROR) << "Cleanup of old stores failed " << error.what();
+  }
+}
+
+void StoreManagerImplCommon::cleanupParentDirectory() {
+  try {
+    if (!nameBuilder_->hasStaleNamesInParent(definition_)) return;
+    const auto names = nameBuilder_->filterStoreManagerNames(definition_, fileUtils_->listDirectories(parentPath_));
+    trashDirectories(parentPath_, names, {managerDirectoryName_});
+  } catch (const LarderException& error) {
+    LOG(ERROR) << "Cleanup of parent directory failed " << error.what();
+  }
+}
+
+void StoreManagerImplCommon::trashDirectories(const std::string& parent, const std::vector<std::string>& names,
+                                              const std::vector<std::string>& keep) {
+  for (const std::string& name : names) {
+    if (std::find(keep.begin(), keep.end(), name) != keep.end()) continue;
+    trashCollector_->collectPath(fileUtils_->combinePath(parent, name));
+  }
+}
+
+void StoreManagerImplCommon::invalidate() {
+  StoreMap slots;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    if (invalid_) return;
+    invalid_ = true;
+    slots.swap(stores_);
+  }
+  std::vector<std::shared_ptr<Store>> stores;
+  for (const auto& [identifier, item] : slots) {
+    const std::lock_guard<std::mutex> lock(item->mutex);
+    if (item->store != nullptr) stores.push_back(item->store);
+  }
+  // Waiting for a store under a lock would hang when its queue needs that lock to get on.
+  for (const auto& store : stores) store->invalidate();
+  trashCollector_->collectPath(managerPath_);
+}
+
+bool StoreManagerImplCommon::isValid() {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  return !invalid_;
+}
+
+bool StoreManagerImplCommon::isMarkedForTrashing(const std::string& storePath) {
+  const JsonValue attributes = attributeStore_->get(storePath);
+  if (!attributes.is_object()) return false;
+  const auto mark = attributes.find(TrashOnStartupKey);
+  return mark != attributes.end() && mark->is_boolean() && mark->get<bool>();
+}
+
+const StoreManagerDefinition& StoreManagerImplCommon::definition() const { return definition_; }
+const std::string& StoreManagerImplCommon::parentPath() const { return parentPath_; }
+const std::string& StoreManagerImplCommon::managerPath() const { return managerPath_; }
+const std::string& StoreManagerImplCommon::managerDirectoryName() const { return managerDirectoryName_; }
+const std::string& StoreManagerImplCommon::getTemporaryDirectory() const { return temporaryDirectoryPath_; }
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,135 @@
+#pragma once
+
+#include <condition_variable>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "Configuration.h"
+#include "Export.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class AttributeStore;
+class StoreDirectoryNameBuilder;
+
+// What the lite and the full manager share: one manager's directory tree and its stores, each created once and handed
+// to every caller.
+//
+//   <parent path>/                       the area, given by the host
+//     <manager directory name>/          "_store_" + session tag, or "_sessionlessStore"
+//       <store directory name>/          one for each store
+//       tmp/                             the temporary directory, emptied whenever a manager is built
+//
+// Any thread may call. Lock order: the manager mutex, then one item's. Neither is held while a store is created, waited
+// for or invalidated.
+class CELLAR_EXPORT StoreManagerImplCommon {
+ public:
+  static const std::string TemporaryDirectoryName;  // "tmp"
+  static const std::string TrashOnStartupKey;       // "trash_on_start_up", in the attributes of a store's directory
+
+  // The slot of one store, shared by the store map and everybody who waits for the store.
+  struct CELLAR_EXPORT Item {
+    std::shared_ptr<Store> store;       // empty until the store has been created
+    std::uint32_t currentSize = 0;      // bytes that the store reported last
+    std::uint32_t maxSize = 0;          // bytes, the definition's
+    std::string name;                   // the definition's
+    bool isPruning = false;             // a prune of the store is under way
+    bool sizeReported = false;          // its first size has been reported
+    std::mutex mutex;                   // guards all of the above
+    std::condition_variable condition;  // signalled when `store` has been set
+  };
+
+  // Moves a temporary directory that an earlier run left behind to the trash and creates a fresh one, with the manager
+  // directory and its parents. Throws what the file utilities throw.
+  StoreManagerImplCommon(const std::string& parentPath, std::shared_ptr<TrashCollector> trashCollector,
+                         std::shared_ptr<FileUtils> fileUtils, std::shared_ptr<StoreDirectoryNameBuilder> nameBuilder,
+                         std::shared_ptr<AttributeStore> attributeStore, const StoreManagerDefinition& definition);
+  ~StoreManagerImplCommon();
+  StoreManagerImplCommon(const StoreManagerImplCommon&) = delete;
+  StoreManagerImplCommon& operator=(const StoreManagerImplCommon&) = delete;
+
+  // The store of that identifier, created by the first caller while the others wait; `created` is set to true only in
+  // the call that created it. Empty once the manager is invalid. What creating throws reaches the first caller, and
+  // then later callers of that identifier wait without end: there is deliberately no timeout.
+  std::shared_ptr<Store> getStore(const std::string& identifier, std::shared_ptr<TaskQueueFactory> taskQueueFactory,
+                                  std::shared_ptr<TrashCollector> trashCollector,
+                                  std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
+                                  std::function<void(unsigned int)> sizeChangedCallback,
+                                  PruneStrategyIdentifier pruneStrategy, bool& created);
+
+  // The slot of that identifier; empty when nobody has asked for the store or the manager is invalid.
+  std::shared_ptr<Item> getExistingStore(const std::string& identifier);
+
+  // Creates the store, in an emptied directory when it was marked for trashing, publishes it in `item` and wakes who
+  // waits for it. If the manager has been invalidated meanwhile the store is invalidated too. Called by `getStore`
+  // only.
+  std::shared_ptr<Store> createStore(const std::string& identifier, std::shared_ptr<Item> item,
+                                     std::shared_ptr<TaskQueueFactory> taskQueueFactory,
+                                     std::shared_ptr<TrashCollector> trashCollector,
+                                     std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
+                                     std::function<void(unsigned int)> sizeChangedCallback,
+                                     PruneStrategyIdentifier pruneStrategy);
+
+  // Throws `std::logic_error` that names identifier and manager when the manager has no such store.
+  std::shared_ptr<const StoreDefinition> getStoreDefinition(const std::string& identifier);
+
+  // The directory of a store of that definition.
+  std::string getStorePath(std::shared_ptr<const StoreDefinition> definition);
+
+  // The slots as they are now; the slots themselves are shared.
+  std::unordered_map<std::string, std::shared_ptr<Item>> copyStoreMap();
+
+  // Makes the next creation of the store, normally at the next start, begin with an empty directory. Nothing is deleted
+  // now, and nothing happens when the directory does not exist. The mark replaces whatever else the directory's
+  // attributes held, a kept size among them, and the next measurement of the directory replaces the mark.
+  void trashStoreOnStartup(const std::string& identifier);
+
+  // Moves every directory in the manager's directory to the trash that is not the current name of a configured store:
+  // what another version or locale, or a store that is no longer configured, left behind. A failure is one error line.
+  void cleanupOldStores();
+
+  // Moves the manager directories of other sessions to the trash. A failure is one error line.
+  void cleanupParentDirectory();
+
+  // Moves those of `names` that are not in `keep` from `parent` to the trash.
+  void trashDirectories(const std::string& parent, const std::vector<std::string>& names,
+                        const std::vector<std::string>& keep);
+
+  // Invalidates all stores and moves the manager's directory with all its data to the trash. Waits until the stores
+  // have finished what they were writing, so it must not be called on one of their queues. A second call does nothing.
+  void invalidate();
+
+  bool isValid();
+
+  const StoreManagerDefinition& definition() const;
+  const std::string& parentPath() const;
+  const std::string& managerPath() const;
+  const std::string& managerDirectoryName() const;
+  const std::string& getTemporaryDirectory() const;
+
+ private:
+  using StoreMap = std::unordered_map<std::string, std::shared_ptr<Item>>;
+
+  bool isMarkedForTrashing(const std::string& storePath);
+
+  const StoreManagerDefinition definition_;
+  const std::string parentPath_;
+  const std::shared_ptr<TrashCollector> trashCollector_;
+  const std::shared_ptr<FileUtils> fileUtils_;
+  const std::shared_ptr<StoreDirectoryNameBuilder> nameBuilder_;
+  const std::shared_ptr<AttributeStore> attributeStore_;
+  const std::string managerDirectoryName_;
+  const std::string managerPath_;
+  const std::string temporaryDirectoryPath_;
+
+  std::mutex mutex_;  // guards the two below
+  StoreMap stores_;   // by identifier; emptied by invalidation, which parts manager and stores
+  bool invalid_ = false;
+};
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,32 @@
+#include "StoreManagerLite.h"
+
+#include <stdexcept>
+
+#include "StoreManagerImplCommon.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+StoreManagerLite::StoreManagerLite(const std::string& parentPath, const StoreManagerDefinition& definition,
+                                   const std::shared_ptr<FileUtils>& fileUtils,
+                                   const std::shared_ptr<StoreDirectoryNameBuilder>& nameBuilder,
+                                   const std::shared_ptr<TrashCollector>& trashCollector,
+                                   const std::shared_ptr<AttributeStore>& attributeStore)
+    : common_(std::make_unique<StoreManagerImplCommon>(parentPath, trashCollector, fileUtils, nameBuilder,
+                                                       attributeStore, definition)) {}
+
+StoreManagerLite::~StoreManagerLite() = default;
+
+std::shared_ptr<Store> StoreManagerLite::getStoreImpl(const std::string& identifier) {
+  // Checked before the core makes a slot for the store: whoever asked for it again would wait there without end.
+  if (common_->getStoreDefinition(identifier)->isManaged) {
+    throw std::logic_error("Store '" + identifier + "' needs a task queue factory, which a lite manager has not.");
+  }
+  bool created = false;
+  return common_->getStore(identifier, nullptr, nullptr, nullptr, nullptr, PruneStrategyIdentifier::Null, created);
+}
+
+void StoreManagerLite::invalidate() { common_->invalidate(); }
+
+bool StoreManagerLite::isValid() { return common_->isValid(); }
+
+}  // namespace velmora::mobile::xplat::cellar
