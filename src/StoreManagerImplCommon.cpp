@@ -3,17 +3,32 @@
 #include <glog/logging.h>
 
 #include <algorithm>
+#include <exception>
 #include <stdexcept>
 #include <utility>
 
 #include "AttributeStore.h"
 #include "FileUtils.h"
 #include "LarderException.h"
+#include "PersistentKeyValueStore.h"
 #include "Store.h"
 #include "StoreDirectoryNameBuilder.h"
 #include "TrashCollector.h"
 
 namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+// Without waiting: this thread may be the one that the store's queues run on, and there is nothing yet to wait for.
+void invalidateNewStore(Store& store) {
+  if (auto* keyValueStore = dynamic_cast<PersistentKeyValueStore*>(&store)) {
+    keyValueStore->invalidateSoon();
+  } else {
+    store.invalidate();
+  }
+}
+
+}  // namespace
 
 const std::string StoreManagerImplCommon::TemporaryDirectoryName = "tmp";
 const std::string StoreManagerImplCommon::TrashOnStartupKey = "trash_on_start_up";
@@ -93,7 +108,7 @@ std::shared_ptr<Store> StoreManagerImplCommon::createStore(const std::string& id
   item->condition.notify_all();
 
   // Whoever invalidated the manager meanwhile could not see this store.
-  if (!isValid()) store->invalidate();
+  if (!isValid()) invalidateNewStore(*store);
   return store;
 }
 
@@ -164,7 +179,13 @@ void StoreManagerImplCommon::invalidate() {
     if (item->store != nullptr) stores.push_back(item->store);
   }
   // Waiting for a store under a lock would hang when its queue needs that lock to get on.
-  for (const auto& store : stores) store->invalidate();
+  for (const auto& store : stores) {
+    try {
+      store->invalidate();
+    } catch (const std::exception& error) {
+      LOG(ERROR) << "Could not invalidate store at \"" << store->path << "\": " << error.what();
+    }
+  }
   trashCollector_->collectPath(managerPath_);
 }
 

@@ -1,0 +1,158 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "DiskCacheItem.h"
+#include "Export.h"
+#include "ManifestPersistence.h"
+#include "PruneStrategy.h"
+#include "executor/AsyncExecutor.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class ExtendedMetadataFactory;
+
+// What a store knows of its items. A key without a record is never an error. Always held by shared pointers; any thread
+// may call.
+class CELLAR_EXPORT DiskCacheManifestInterface : public std::enable_shared_from_this<DiskCacheManifestInterface> {
+ public:
+  virtual ~DiskCacheManifestInterface();
+
+  virtual void clear() = 0;
+  virtual void load() = 0;
+  virtual void invalidate() = 0;
+  virtual void setItem(const DiskCacheItem& item) = 0;
+  virtual std::unique_ptr<DiskCacheItem> getItem(const std::string& key) = 0;
+  virtual void updateLastAccessDate(const std::string& key) = 0;
+  virtual std::optional<std::int32_t> getModificationDate(const std::string& key) = 0;
+  virtual void removeItem(const std::string& key) = 0;
+  virtual std::vector<unsigned char> getInlineData(const std::string& key) = 0;
+  virtual void setInlineData(const std::string& key, const std::vector<unsigned char>& data) = 0;
+  virtual void removeInlineData(const std::string& key) = 0;
+  virtual std::vector<DiskCacheItem> pruneToSize(std::uint32_t size, std::uint32_t count) = 0;
+  virtual std::vector<DiskCacheItem> pruneOldEntries(long date, std::uint32_t count) = 0;
+  virtual std::unique_ptr<DiskCacheItem> pruneOldestItem() = 0;
+  virtual std::vector<std::string> getAllKeys() = 0;
+  virtual std::uint32_t size() = 0;
+  virtual std::uint32_t count() = 0;
+  virtual bool isLoaded() = 0;
+
+  // A weak pointer to this manifest as a T; empty when it is not owned by a shared pointer, or no T.
+  template <class T> std::weak_ptr<T> weak_from_this() { return std::dynamic_pointer_cast<T>(weak_from_this().lock()); }
+  using std::enable_shared_from_this<DiskCacheManifestInterface>::weak_from_this;
+};
+
+// Every item's record in memory, with the total of their sizes, and written through to a persistence at once. Access
+// dates are the exception: they change with every read, so they wait in memory and are written every 120 seconds, when
+// more than 512 of them have come together, and at destruction. A killed process loses what waits; items then look less
+// recently used than they were.
+//
+// Before it is loaded, single records are read from the persistence as they are asked for, and prunes do nothing. What
+// the persistence throws passes through and leaves memory as it was. Sizes are unsigned 32-bit bytes and their total
+// wraps; dates are seconds since the Unix epoch.
+class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
+ public:
+  // A manifest over the database at `path`. Access dates are written on `executor`. `strategy` orders `pruneToSize`;
+  // null: least recently used first. Without a metadata factory (null), metadata is written but not read back. Throws
+  // `ManifestCorruptedException` for a damaged or foreign database, `ManifestPersistenceException` for one that cannot
+  // be opened.
+  static std::shared_ptr<DiskCacheManifest> createDiskCacheManifest(const std::string& path,
+                                                                    std::shared_ptr<AsyncExecutor> executor,
+                                                                    std::shared_ptr<ExtendedMetadataFactory> factory,
+                                                                    std::shared_ptr<PruneStrategyBase> strategy);
+
+  // Over any persistence. The manifest must be owned by a shared pointer.
+  DiskCacheManifest(std::unique_ptr<ManifestPersistence> persistence, std::shared_ptr<AsyncExecutor> executor,
+                    std::shared_ptr<PruneStrategyBase> strategy);
+  ~DiskCacheManifest() override;
+  DiskCacheManifest(const DiskCacheManifest&) = delete;
+  DiskCacheManifest& operator=(const DiskCacheManifest&) = delete;
+
+  // Starts again from nothing, loaded. The caller has removed the persistence's file before.
+  void clear() override;
+
+  // Reads every record; those that are in memory already are newer and stay. Starts the writing of access dates every
+  // 120 seconds.
+  void load() override;
+
+  // Silences the persistence for good: what changes from now on is not written. Memory keeps working.
+  void invalidate() override;
+
+  // Replaces the record of the item's key, and drops its inline value.
+  void setItem(const DiskCacheItem& item) override;
+
+  // A copy of the record; null when there is none.
+  std::unique_ptr<DiskCacheItem> getItem(const std::string& key) override;
+
+  // Notes that the item was used now.
+  void updateLastAccessDate(const std::string& key) override;
+
+  // Empty when there is no record.
+  std::optional<std::int32_t> getModificationDate(const std::string& key) override;
+
+  void removeItem(const std::string& key) override;
+
+  // The inline value; empty when the item has none.
+  std::vector<unsigned char> getInlineData(const std::string& key) override;
+
+  // Adds the value to the item's record and marks it as inline; size and dates stay as they are.
+  void setInlineData(const std::string& key, const std::vector<unsigned char>& data) override;
+
+  // Drops the value and the mark.
+  void removeInlineData(const std::string& key) override;
+
+  // The three prunes return the removed records in the order of removal; the caller deletes their files. One that fails
+  // midway returns what it has removed so far; one that fails at its first item throws.
+
+  // Removes items in the strategy's order until the total is at most `size`, but no more than `count`.
+  std::vector<DiskCacheItem> pruneToSize(std::uint32_t size, std::uint32_t count) override;
+
+  // Removes items last used strictly before `date`, oldest first, but no more than `count`.
+  std::vector<DiskCacheItem> pruneOldEntries(long date, std::uint32_t count) override;
+
+  // Removes the item that was used least recently; null when there is none.
+  std::unique_ptr<DiskCacheItem> pruneOldestItem() override;
+
+  // Throws `DiskCacheManifestException` before the manifest is loaded.
+  std::vector<std::string> getAllKeys() override;
+
+  std::uint32_t size() override;   // total bytes of the items in memory
+  std::uint32_t count() override;  // number of items in memory
+  bool isLoaded() override;
+
+ private:
+  using Items = std::unordered_map<std::string, std::unique_ptr<DiskCacheItem>>;
+  using AccessDates = std::unordered_map<std::string, std::int32_t>;
+
+  // These are called with the items mutex held.
+  DiskCacheItem* findOrRead(const std::string& key);
+  DiskCacheItem* storeInMemory(std::unique_ptr<DiskCacheItem> item);
+  std::unique_ptr<DiskCacheItem> remove(Items::iterator position);
+  template <class MayGo> std::vector<DiskCacheItem> prune(const Comparator& order, std::uint32_t count, MayGo mayGo);
+
+  void armFlushTimer();
+  void flush();
+  void commitAccessTimeUpdates(const AccessDates& dates);
+
+  const std::unique_ptr<ManifestPersistence> persistence_;
+  const std::shared_ptr<AsyncExecutor> executor_;
+  const Comparator strategyOrder_;
+  const Comparator accessDateOrder_;
+
+  std::mutex loadMutex_;   // keeps load, clear and removal apart; taken before itemsMutex_
+  std::mutex itemsMutex_;  // guards the below
+  Items items_;
+  std::uint32_t totalSize_ = 0;
+  bool loaded_ = false;
+  bool invalidated_ = false;
+  AccessDates pendingAccessDates_;
+  std::unique_ptr<AsyncTimer> flushTimer_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar

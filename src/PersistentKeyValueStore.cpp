@@ -1,0 +1,854 @@
+#include "PersistentKeyValueStore.h"
+
+#include <glog/logging.h>
+
+#include <algorithm>
+#include <ctime>
+#include <stdexcept>
+#include <utility>
+
+#include "AnalyticsEventReporter.h"
+#include "AttributeStore.h"
+#include "Configuration.h"
+#include "DiskCacheManifest.h"
+#include "FileUtils.h"
+#include "LarderException.h"
+#include "StoreDefaults.h"
+#include "TrashCollector.h"
+#include "WritesInFlight.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+const std::string kManifestName = "manifest_v1.sqlite";
+const std::string kManifestCompanions[] = {"-journal", "-wal", "-shm"};
+
+constexpr long kFirstStaleRemovalDelay = 300;  // seconds
+constexpr long kStaleRemovalInterval = 3600;   // seconds
+constexpr std::uint64_t kNanosecondsPerSecond = 1'000'000'000;
+
+std::int64_t currentTime() { return static_cast<std::int64_t>(std::time(nullptr)); }
+std::int32_t currentDate() { return static_cast<std::int32_t>(currentTime()); }
+
+// Fulfils the promise with what the operation does or throws. No lock may be held: an inline callback runs here.
+template <class Operation> void settle(Promise<void>& promise, Operation operation) {
+  try {
+    operation();
+  } catch (...) {
+    promise.setException(std::current_exception());
+    return;
+  }
+  promise.setValue();
+}
+
+}  // namespace
+
+// A write of a file, on its way through the queues.
+struct PersistentKeyValueStore::FileWrite {
+  std::string key;
+  std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
+  Writer writer;
+  std::shared_ptr<Promise<void>> promise = std::make_shared<Promise<void>>();
+  std::shared_ptr<WritesInFlight::Write> inFlight;  // once its record stands in the manifest
+
+  DiskCacheItem record(std::uint32_t size) const {
+    const std::int32_t date = currentDate();
+    return {key, key, size, false, date, date, extendedMetadata};
+  }
+};
+
+std::shared_ptr<PersistentKeyValueStore> PersistentKeyValueStore::createPersistentKeyValueStore(
+    const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
+    std::optional<std::uint64_t> capacity, long staleAge, bool inlineData,
+    std::shared_ptr<TaskQueueFactory> taskQueueFactory, std::shared_ptr<TrashCollector> trashCollector,
+    std::shared_ptr<AnalyticsEventReporter> analyticsReporter, std::shared_ptr<DiskCacheManifestInterface> manifest,
+    std::shared_ptr<FileUtils> fileUtils, std::function<void(unsigned int)> sizeChangedCallback,
+    unsigned int batchSize) {
+  auto store = std::make_shared<PersistentKeyValueStore>(
+      directory, temporaryDirectoryPath, name, capacity, staleAge, inlineData, std::move(taskQueueFactory), nullptr,
+      std::move(trashCollector), nullptr, std::move(analyticsReporter), std::move(manifest), std::move(fileUtils),
+      std::move(sizeChangedCallback), batchSize);
+  store->loadManifest();
+  return store;
+}
+
+PersistentKeyValueStore::PersistentKeyValueStore(
+    const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
+    std::optional<std::uint64_t> capacity, long staleAge, bool inlineData,
+    std::shared_ptr<TaskQueueFactory> taskQueueFactory,
+    std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory, std::shared_ptr<TrashCollector> trashCollector,
+    std::shared_ptr<PruneStrategyBase> pruneStrategy, std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
+    std::shared_ptr<DiskCacheManifestInterface> manifest, std::shared_ptr<FileUtils> fileUtils,
+    std::function<void(unsigned int)> sizeChangedCallback, unsigned int batchSize)
+    : Store(directory),
+      name_(name),
+      capacity_(capacity),
+      inlineData_(inlineData),
+      extendedMetadataFactory_(std::move(extendedMetadataFactory)),
+      trashCollector_(std::move(trashCollector)),
+      pruneStrategy_(std::move(pruneStrategy)),
+      analyticsReporter_(std::move(analyticsReporter)),
+      fileUtils_(std::move(fileUtils)),
+      batchSize_(batchSize),
+      sizeChangedCallback_(std::move(sizeChangedCallback)),
+      temporaryDirectoryPath_(temporaryDirectoryPath),
+      manifestPath_(fileUtils_->combinePath(directory, kManifestName)),
+      staleAge_(staleAge),
+      writesInFlight_(std::make_unique<WritesInFlight>()),
+      manifest_(std::move(manifest)) {
+  fileUtils_->createDirectory(directory, true);
+  fileQueue_ = taskQueueFactory->createQueue();
+  workQueue_ = taskQueueFactory->createWorkQueue();
+}
+
+// Writes that have not begun will not begin any more: their records must not stay behind without a file.
+PersistentKeyValueStore::~PersistentKeyValueStore() {
+  if (invalidated_) return;
+  for (const auto& write : writesInFlight_->all()) {
+    try {
+      if (!write->isRevoked) manifest_->removeItem(write->key);
+    } catch (const std::exception& error) {
+      LOG(ERROR) << "Could not remove the record of an unfinished write: " << error.what();
+    }
+    deleteLeftoverFile(write->key);
+  }
+}
+
+// --- Storing ---
+
+Future<void> PersistentKeyValueStore::store(const std::string& key, const std::vector<unsigned char>& data,
+                                            std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata) {
+  const auto value = std::make_shared<const std::vector<unsigned char>>(data);
+  if (!inlineData_) {
+    return store(key, std::move(extendedMetadata), [fileUtils = fileUtils_, value](const std::string& filePath) {
+      fileUtils->writeFile(filePath, *value);
+      return static_cast<unsigned int>(value->size());
+    });
+  }
+  const auto promise = std::make_shared<Promise<void>>();
+  Future<void> future = promise->getFuture();
+  dispatchWork({key}, promise,
+               [weakThis = weak_from_this<PersistentKeyValueStore>(), key, value, extendedMetadata, promise] {
+                 settle(*promise, [&] {
+                   const auto self = weakThis.lock();
+                   if (self == nullptr) return;
+                   const std::lock_guard<std::mutex> lock(self->mutex_);
+                   self->throwIfInvalid();
+                   self->writeInline(key, *value, extendedMetadata);
+                 });
+               });
+  return future;
+}
+
+Future<void> PersistentKeyValueStore::store(const std::string& key,
+                                            std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
+                                            Writer writer) {
+  const auto write = std::make_shared<FileWrite>();
+  write->key = key;
+  write->extendedMetadata = std::move(extendedMetadata);
+  write->writer = std::move(writer);
+  Future<void> future = write->promise->getFuture();
+  if (inlineData_ && !invalidated_) {
+    const std::runtime_error unsupported("Write callback not supported by inline store.");
+    write->promise->setException(std::make_exception_ptr(unsupported));
+    return future;
+  }
+  dispatchWork({key}, write->promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), write] {
+    const auto self = weakThis.lock();
+    if (self == nullptr) return write->promise->setValue();
+    std::exception_ptr failure;
+    try {
+      const std::lock_guard<std::mutex> lock(self->mutex_);
+      self->throwIfInvalid();
+      self->beginFileWrite(write);
+    } catch (...) {
+      failure = std::current_exception();
+    }
+    if (failure != nullptr) return write->promise->setException(failure);
+    if (write->inFlight == nullptr) write->promise->setValue();  // the store was purged instead
+  });
+  return future;
+}
+
+// Puts a provisional record into the manifest and the write on the file queue; neither, if the store had to be purged.
+void PersistentKeyValueStore::beginFileWrite(const std::shared_ptr<FileWrite>& write) {
+  try {
+    prepareWrite(write->key);
+    getManifest()->setItem(write->record(0));
+  } catch (const ManifestPersistenceException& error) {
+    return purge(error);
+  }
+  write->inFlight = writesInFlight_->begin(write->key);
+  try {
+    fileQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), write] {
+      if (const auto self = weakThis.lock()) {
+        self->finishFileWrite(*write);
+      } else {
+        write->promise->setValue();
+      }
+    });
+  } catch (...) {
+    writesInFlight_->end(write->inFlight);
+    getManifest()->removeItem(write->key);
+    throw;
+  }
+}
+
+void PersistentKeyValueStore::finishFileWrite(const FileWrite& write) {
+  settle(*write.promise, [&] {
+    if (startWriter(write) && recordWritten(write, runWriter(write))) return;
+    deleteLeftoverFile(write.key);
+  });
+}
+
+// False when the write was revoked before it began.
+bool PersistentKeyValueStore::startWriter(const FileWrite& write) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  if (write.inFlight->isRevoked) {
+    writesInFlight_->end(write.inFlight);
+    return false;
+  }
+  write.inFlight->isRunning = true;
+  return true;
+}
+
+unsigned int PersistentKeyValueStore::runWriter(const FileWrite& write) {
+  try {
+    return write.writer(getFilePath(write.key));
+  } catch (...) {
+    giveUp(write);
+    throw;
+  }
+}
+
+// False when the write was revoked while it ran.
+bool PersistentKeyValueStore::recordWritten(const FileWrite& write, unsigned int size) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  writesInFlight_->end(write.inFlight);
+  if (write.inFlight->isRevoked) return false;
+  try {
+    getManifest()->setItem(write.record(size));
+  } catch (const ManifestPersistenceException& error) {
+    purge(error);
+  }
+  reportSize();
+  return true;
+}
+
+// Leaves a miss where a write has failed. A later write of the key has its own record there already.
+void PersistentKeyValueStore::giveUp(const FileWrite& write) {
+  try {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    writesInFlight_->end(write.inFlight);
+    if (!write.inFlight->isRevoked && !writesInFlight_->contains(write.key)) getManifest()->removeItem(write.key);
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Could not remove the record of a failed write: " << error.what();
+  }
+  deleteLeftoverFile(write.key);
+}
+
+void PersistentKeyValueStore::deleteLeftoverFile(const std::string& key) {
+  try {
+    const std::string filePath = getFilePath(key);
+    if (fileUtils_->pathExists(filePath) && !fileUtils_->isDirectory(filePath)) fileUtils_->deleteFile(filePath);
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Could not remove the file of an unfinished write: " << error.what();
+  }
+}
+
+void PersistentKeyValueStore::writeInline(const std::string& key, const std::vector<unsigned char>& data,
+                                          std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata) {
+  try {
+    prepareWrite(key);
+    const auto manifest = getManifest();
+    const std::int32_t date = currentDate();
+    const auto size = static_cast<std::uint32_t>(data.size());
+    manifest->setItem({key, key, size, false, date, date, std::move(extendedMetadata)});
+    manifest->setInlineData(key, data);
+  } catch (const ManifestPersistenceException& error) {
+    purge(error);
+  }
+  reportSize();
+}
+
+void PersistentKeyValueStore::prepareWrite(const std::string& key) {
+  for (const auto& storedSince : clearsUnderWay_) {
+    if (const auto keys = storedSince.lock()) keys->insert(key);
+  }
+  if (capacity_) removeOldestItemIfOverMaxCapacity();
+}
+
+// --- Fetching ---
+
+Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetch(const std::string& key) {
+  // Called on a store that is alive: the loader runs from a task that holds it.
+  return fetch(key, [this](std::shared_ptr<const DiskCacheItem> item, const std::string& filePath,
+                           std::vector<unsigned char>& value) { return readValue(std::move(item), filePath, value); });
+}
+
+Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetch(const std::string& key,
+                                                                                             Reader reader) {
+  return fetch(key, [reader = std::move(reader)](const std::shared_ptr<const DiskCacheItem>& /*item*/,
+                                                 const std::string& filePath, std::vector<unsigned char>& value) {
+    value = reader(filePath);
+    return true;
+  });
+}
+
+Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetch(const std::string& key,
+                                                                                             Loader loader) {
+  return fetchFirst({key}, std::move(loader));
+}
+
+Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetchFirst(
+    const std::vector<std::string>& keys, Loader loader) {
+  const auto promise = std::make_shared<Promise<Fetched>>();
+  Future<Fetched> future = promise->getFuture();
+  dispatchWork(keys, promise,
+               [weakThis = weak_from_this<PersistentKeyValueStore>(), keys, loader = std::move(loader), promise] {
+                 if (const auto self = weakThis.lock()) {
+                   self->find(keys, loader, promise);
+                 } else {
+                   promise->setValue(nullptr);
+                 }
+               });
+  return future;
+}
+
+void PersistentKeyValueStore::find(const std::vector<std::string>& keys, const Loader& loader,
+                                   const std::shared_ptr<Promise<Fetched>>& promise) {
+  try {
+    std::shared_ptr<const DiskCacheItem> item;
+    {
+      const std::lock_guard<std::mutex> lock(mutex_);
+      throwIfInvalid();
+      for (auto key = keys.begin(); key != keys.end() && item == nullptr; ++key) item = lookUp(*key);
+    }
+    if (!keys.empty()) reportAccess(item.get(), keys.front());
+    if (item != nullptr) {
+      const std::lock_guard<std::mutex> lock(mutex_);
+      throwIfInvalid();  // nothing may get behind the barrier of an invalidation
+      fileQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), item, loader, promise] {
+        if (const auto self = weakThis.lock()) {
+          self->load(item, loader, *promise);
+        } else {
+          promise->setValue(nullptr);
+        }
+      });
+      return;
+    }
+  } catch (...) {
+    return promise->setException(std::current_exception());
+  }
+  promise->setValue(nullptr);
+}
+
+// The item's record; null for a miss, and when looking for it purged the store.
+std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(const std::string& key) {
+  try {
+    return getManifest()->getItem(key);
+  } catch (const ManifestCorruptedException& error) {
+    purge(error);
+    return nullptr;
+  }
+}
+
+void PersistentKeyValueStore::load(const std::shared_ptr<const DiskCacheItem>& item, const Loader& loader,
+                                   Promise<Fetched>& promise) {
+  Fetched result;
+  try {
+    auto fetched = std::make_unique<FetchResult>(FetchResult{item->key, {}, item->modificationDate});
+    if (loader(item, getFilePath(item->filename), fetched->value)) {
+      const std::lock_guard<std::mutex> lock(mutex_);
+      try {
+        getManifest()->updateLastAccessDate(item->key);
+      } catch (const ManifestCorruptedException& error) {
+        purge(error);
+      }
+      result = std::move(fetched);
+    }
+  } catch (...) {
+    if (!hasLostItem(*item)) return promise.setException(std::current_exception());
+  }
+  promise.setValue(std::move(result));
+}
+
+// Whether the store itself has taken the item away since it was looked up: removed it, or removed it and stored it
+// anew.
+bool PersistentKeyValueStore::hasLostItem(const DiskCacheItem& item) {
+  try {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    if (getManifest()->getItem(item.key) == nullptr) return true;
+    return writesInFlight_->contains(item.key) && !fileUtils_->pathExists(getFilePath(item.filename));
+  } catch (const std::exception&) {
+    return false;
+  }
+}
+
+bool PersistentKeyValueStore::readValue(std::shared_ptr<const DiskCacheItem> item, const std::string& filePath,
+                                        std::vector<unsigned char>& value) {
+  if (!item->hasInlineData) {
+    value = fileUtils_->readFile(filePath);
+    return true;
+  }
+  try {
+    const auto manifest = getManifest();
+    value = manifest->getInlineData(item->key);
+    return !value.empty() || manifest->getItem(item->key) != nullptr;
+  } catch (const ManifestCorruptedException& error) {
+    handleCorruptedManifest(error);
+    return false;
+  }
+}
+
+std::vector<std::string> PersistentKeyValueStore::getAllKeys() {
+  throwIfInvalid();
+  return getManifest()->getAllKeys();
+}
+
+std::optional<std::int32_t> PersistentKeyValueStore::fetchModificationDate(const std::string& key) {
+  throwIfInvalid();
+  throwIfReserved(key);
+  try {
+    return getManifest()->getModificationDate(key);
+  } catch (const ManifestCorruptedException& error) {
+    handleCorruptedManifest(error);
+    return std::nullopt;
+  }
+}
+
+Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& key) {
+  const auto promise = std::make_shared<Promise<void>>();
+  Future<void> future = promise->getFuture();
+  dispatchWork({key}, promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+    settle(*promise, [&] {
+      const auto self = weakThis.lock();
+      if (self == nullptr) return;
+      self->throwIfInvalid();
+      if (self->analyticsReporter_ != nullptr) {
+        self->analyticsReporter_->reportEvent(
+            PersistentKeyValueStoreEventBuilder(PersistentKeyValueStoreEvent::Hit::Found, self->name_, key).get());
+      }
+      const std::lock_guard<std::mutex> lock(self->mutex_);
+      try {
+        self->getManifest()->updateLastAccessDate(key);
+      } catch (const ManifestCorruptedException& error) {
+        self->purge(error);
+      }
+    });
+  });
+  return future;
+}
+
+// A hit carries the item found; a miss, the key that was looked for first.
+void PersistentKeyValueStore::reportAccess(const DiskCacheItem* item, const std::string& key) {
+  if (analyticsReporter_ == nullptr) return;
+  using Hit = PersistentKeyValueStoreEvent::Hit;
+  PersistentKeyValueStoreEventBuilder event(item != nullptr ? Hit::Found : Hit::Missing, name_,
+                                            item != nullptr ? item->key : key);
+  if (item != nullptr) event.age(static_cast<long>(currentTime() - item->modificationDate)).size(item->size);
+  analyticsReporter_->reportEvent(event.get());
+}
+
+// --- Removing ---
+
+Future<void> PersistentKeyValueStore::removeItem(const std::string& key) {
+  const auto promise = std::make_shared<Promise<void>>();
+  Future<void> future = promise->getFuture();
+  dispatchWork({key}, promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+    if (const auto self = weakThis.lock()) {
+      self->remove(key, promise);
+    } else {
+      promise->setValue();
+    }
+  });
+  return future;
+}
+
+void PersistentKeyValueStore::remove(const std::string& key, const std::shared_ptr<Promise<void>>& promise) {
+  bool leftToWrite = false;
+  const auto removeAll = [&] {
+    std::string filename;
+    {
+      const std::lock_guard<std::mutex> lock(mutex_);
+      throwIfInvalid();
+      const auto item = lookUp(key);
+      if (item != nullptr) getManifest()->removeItem(key);
+      if (item != nullptr && !item->hasInlineData) filename = item->filename;
+      // A write that is on its way deletes what it finds; the removal is done when the file queue has got past it.
+      if (writesInFlight_->revoke(key)) {
+        fileQueue_->dispatch([promise] { promise->setValue(); });
+        leftToWrite = true;
+        return;
+      }
+    }
+    if (!filename.empty()) fileUtils_->deleteFile(getFilePath(filename));
+  };
+  try {
+    removeAll();
+  } catch (...) {
+    return promise->setException(std::current_exception());
+  }
+  if (!leftToWrite) promise->setValue();
+}
+
+void PersistentKeyValueStore::clear(std::function<void()> onSuccess,
+                                    std::function<void(const std::exception&)> onError) {
+  const auto storedSince = std::make_shared<KeySet>();
+  const auto takeNextBatch = [weakThis = weak_from_this<PersistentKeyValueStore>(), storedSince,
+                              begun = std::make_shared<bool>(false)]() -> std::vector<DiskCacheItem> {
+    const auto self = weakThis.lock();
+    if (self == nullptr) return {};
+    return self->takeBatch([&](DiskCacheManifestInterface&) { return self->takeForClear(storedSince, *begun); });
+  };
+  deleteFilesInBatches(takeNextBatch, std::move(onSuccess), std::move(onError));
+}
+
+// The next items to go. Pruning to nothing leaves items of no size, and would take what has been stored since the clear
+// began.
+std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shared_ptr<KeySet>& storedSince,
+                                                                 bool& begun) {
+  if (!begun) {
+    const auto hasEnded = [](const std::weak_ptr<KeySet>& keys) { return keys.expired(); };
+    clearsUnderWay_.erase(std::remove_if(clearsUnderWay_.begin(), clearsUnderWay_.end(), hasEnded),
+                          clearsUnderWay_.end());
+    clearsUnderWay_.push_back(storedSince);
+    writesInFlight_->revokeAll();
+    if (!getManifest()->isLoaded()) getManifest()->load();
+    begun = true;
+  }
+  if (storedSince->empty()) {
+    auto items = getManifest()->pruneToSize(0, batchSize_);
+    if (!items.empty()) return items;
+  }
+  return takeAllBut(*storedSince);
+}
+
+std::vector<DiskCacheItem> PersistentKeyValueStore::takeAllBut(const KeySet& keep) {
+  std::vector<DiskCacheItem> items;
+  const auto manifest = getManifest();
+  for (const std::string& key : manifest->getAllKeys()) {
+    if (items.size() == batchSize_) break;
+    const auto item = keep.count(key) > 0 ? nullptr : manifest->getItem(key);
+    if (item == nullptr) continue;
+    try {
+      manifest->removeItem(key);
+    } catch (const ManifestPersistenceException&) {
+      if (items.empty()) throw;
+      break;  // the files of those that went must go too
+    }
+    items.push_back(*item);
+  }
+  return items;
+}
+
+void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
+  const auto manifest = getManifest();
+  if (!capacity_ || manifest->count() < *capacity_) return;
+  const auto item = manifest->pruneOldestItem();
+  if (item == nullptr || item->hasInlineData) return;
+  if (writesInFlight_->revoke(item->key)) return;
+  fileQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), filename = item->filename] {
+    const auto self = weakThis.lock();
+    if (self == nullptr) return;
+    try {
+      self->fileUtils_->deleteFile(self->getFilePath(filename));
+    } catch (const LarderException& error) {
+      LOG(ERROR) << "Failed to remove the oldest item " << error.what();
+    }
+  });
+}
+
+std::vector<DiskCacheItem> PersistentKeyValueStore::takeBatch(
+    const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  throwIfInvalid();
+  std::vector<DiskCacheItem> items;
+  try {
+    items = prune(*getManifest());
+  } catch (const ManifestCorruptedException& error) {
+    purge(error);
+    return {};
+  }
+  for (DiskCacheItem& item : items) {
+    if (writesInFlight_->revoke(item.key)) item.filename.clear();  // its file is left to that write
+  }
+  return items;
+}
+
+void PersistentKeyValueStore::deleteFilesInBatches(std::function<const std::vector<DiskCacheItem>()> provider,
+                                                   std::function<void()> onSuccess,
+                                                   std::function<void(const std::exception&)> onError) {
+  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), provider = std::move(provider),
+                        onSuccess = std::move(onSuccess), onError = std::move(onError)] {
+    if (const auto self = weakThis.lock()) self->deleteNextBatch(provider, onSuccess, onError);
+  });
+}
+
+void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<DiskCacheItem>()> provider,
+                                              std::function<void()> onSuccess,
+                                              std::function<void(const std::exception&)> onError) {
+  bool done = false;
+  try {
+    throwIfInvalid();
+    const std::vector<DiskCacheItem> batch = provider();
+    if (batch.empty()) {
+      reportSize();
+      done = true;
+    } else {
+      std::vector<std::string> paths;
+      for (const DiskCacheItem& item : batch) {
+        if (!item.hasInlineData && !item.filename.empty()) paths.push_back(getFilePath(item.filename));
+      }
+      deleteBatch(paths).then(workQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), provider, onSuccess,
+                                           onError](std::future<void>& deleted) {
+        const auto self = weakThis.lock();
+        if (self == nullptr) return;
+        try {
+          deleted.get();
+        } catch (const std::exception& error) {
+          if (onError) onError(error);
+          return;
+        }
+        self->deleteNextBatch(provider, onSuccess, onError);
+      });
+    }
+  } catch (const std::exception& error) {
+    if (onError) onError(error);
+  }
+  if (done && onSuccess) onSuccess();
+}
+
+Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>& paths) {
+  try {
+    return dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), paths] {
+      const auto self = weakThis.lock();
+      if (self == nullptr) return;
+      for (const std::string& filePath : paths) {
+        try {
+          self->fileUtils_->deleteFile(filePath);
+        } catch (const LarderException& error) {
+          LOG(ERROR) << "Failed to delete file at \"" << filePath << "\" " << error.what();
+        }
+      }
+    });
+  } catch (...) {
+    Promise<void> failed;
+    failed.setException(std::current_exception());
+    return failed.getFuture();
+  }
+}
+
+// --- Expiry ---
+
+void PersistentKeyValueStore::loadManifest() {
+  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>()] {
+    const auto self = weakThis.lock();
+    if (self == nullptr) return;
+    const std::lock_guard<std::mutex> lock(self->mutex_);
+    if (self->invalidated_) return;
+    // Armed whatever happens: a load that fails for a passing reason is tried again then.
+    std::exception_ptr failure;
+    try {
+      self->getManifest()->load();
+    } catch (const ManifestCorruptedException& error) {
+      self->purge(error);
+    } catch (...) {
+      failure = std::current_exception();
+    }
+    self->armStaleRemoval(kFirstStaleRemovalDelay);
+    if (failure != nullptr) std::rethrow_exception(failure);
+  });
+}
+
+void PersistentKeyValueStore::scheduleStaleRemoval(long delaySeconds) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  armStaleRemoval(delaySeconds);
+}
+
+void PersistentKeyValueStore::armStaleRemoval(long delaySeconds) {
+  if (invalidated_) return;
+  const auto delay = static_cast<std::int64_t>(static_cast<std::uint64_t>(delaySeconds) * kNanosecondsPerSecond);
+  const auto onTimer = [weakThis = weak_from_this<PersistentKeyValueStore>()] {
+    if (const auto self = weakThis.lock()) self->startStaleItemRemoval();
+  };
+  staleRemovalTimer_ = workQueue_->scheduleAfter(delay, onTimer, nullptr);
+}
+
+void PersistentKeyValueStore::startStaleItemRemoval() {
+  const auto onError = [weakThis = weak_from_this<PersistentKeyValueStore>()](const std::exception& error) {
+    if (const auto self = weakThis.lock()) self->scheduleStaleRemoval(kStaleRemovalInterval);
+    LOG(ERROR) << "Failed to delete stale items: " << error.what();
+  };
+  const auto onSuccess = [weakThis = weak_from_this<PersistentKeyValueStore>()] {
+    if (const auto self = weakThis.lock()) self->scheduleStaleRemoval(kStaleRemovalInterval);
+  };
+
+  long cutoff = 0;
+  try {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    if (invalidated_) return;
+    try {
+      if (!getManifest()->isLoaded()) getManifest()->load();
+    } catch (const ManifestCorruptedException& error) {
+      purge(error);
+    }
+    reportSize();
+    const std::int64_t now = currentTime();
+    cutoff = staleAge_ > now ? 0 : static_cast<long>(now - staleAge_);
+  } catch (const std::exception& error) {
+    return onError(error);
+  }
+
+  const auto takeStaleItems = [weakThis = weak_from_this<PersistentKeyValueStore>(),
+                               cutoff]() -> std::vector<DiskCacheItem> {
+    const auto self = weakThis.lock();
+    if (self == nullptr) return {};
+    return self->takeBatch(
+        [&](DiskCacheManifestInterface& manifest) { return manifest.pruneOldEntries(cutoff, self->batchSize_); });
+  };
+  deleteFilesInBatches(takeStaleItems, onSuccess, onError);
+}
+
+void PersistentKeyValueStore::overrideConfiguration(long staleAge) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  staleAge_ = staleAge;
+}
+
+bool PersistentKeyValueStore::isPrunable() { return false; }
+
+// --- Invalidation and recovery ---
+
+void PersistentKeyValueStore::invalidate() {
+  Future<void> barrier;
+  if (!markInvalid(barrier)) return;
+  try {
+    barrier.get();
+  } catch (const std::future_error&) {
+    // The file queue is shut down, so nothing is being written either.
+  }
+  silenceManifest();
+}
+
+Future<void> PersistentKeyValueStore::invalidateWithFuture() {
+  Future<void> barrier;
+  if (markInvalid(barrier)) return barrier;
+  Promise<void> done;
+  done.setValue();
+  return done.getFuture();
+}
+
+void PersistentKeyValueStore::invalidateSoon() {
+  Future<void> barrier;
+  if (!markInvalid(barrier)) return;
+  barrier.then(nullptr, [weakThis = weak_from_this<PersistentKeyValueStore>()](std::future<void>&) {
+    if (const auto self = weakThis.lock()) self->silenceManifest();
+  });
+}
+
+// False when the store is invalid already.
+bool PersistentKeyValueStore::markInvalid(Future<void>& barrier) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  if (invalidated_) return false;
+  invalidated_ = true;
+  staleRemovalTimer_.reset();
+  barrier = dispatchTask<void>(fileQueue_, [] {});
+  return true;
+}
+
+void PersistentKeyValueStore::silenceManifest() {
+  const std::lock_guard<std::mutex> lock(manifestMutex_);
+  if (manifest_ != nullptr) manifest_->invalidate();
+}
+
+void PersistentKeyValueStore::throwIfInvalid() {
+  if (invalidated_) throw InvalidatedException("Store has been invalidated.");
+}
+
+void PersistentKeyValueStore::handleCorruptedManifest(const LarderException& error) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  purge(error);
+}
+
+void PersistentKeyValueStore::purge(const LarderException& error) {
+  writesInFlight_->revokeRunning();
+  trashCollector_->collectPath(path);
+  fileUtils_->createDirectory(path, true);
+  const auto manifest = getManifest();
+  manifest->clear();
+  manifest->load();
+  LOG(ERROR) << "Store \"" << name_ << "\" purged due to corrupted manifest. " << error.what();
+}
+
+void PersistentKeyValueStore::reportSize() {
+  if (!sizeChangedCallback_) return;
+  const auto manifest = getManifest();
+  if (!manifest->isLoaded()) return;
+  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), size = manifest->size()] {
+    if (const auto self = weakThis.lock()) self->sizeChangedCallback_(size);
+  });
+}
+
+// --- Parts ---
+
+std::shared_ptr<DiskCacheManifestInterface> PersistentKeyValueStore::getManifest() {
+  if (manifestCreated_) return manifest_;
+  const std::lock_guard<std::mutex> lock(manifestMutex_);
+  if (manifest_ == nullptr) {
+    const auto create = [this] {
+      return DiskCacheManifest::createDiskCacheManifest(manifestPath_, workQueue_, extendedMetadataFactory_,
+                                                        pruneStrategy_);
+    };
+    try {
+      manifest_ = create();
+    } catch (const ManifestCorruptedException&) {
+      trashCollector_->collectPath(path);
+      fileUtils_->createDirectory(path, true);
+      manifest_ = create();
+    }
+  }
+  manifestCreated_ = true;
+  return manifest_;
+}
+
+std::string PersistentKeyValueStore::getFilePath(const std::string& filename) {
+  return fileUtils_->combinePath(path, filename);
+}
+
+std::string PersistentKeyValueStore::getTemporaryDirectoryPath() { return temporaryDirectoryPath_; }
+
+// Hands the task over, or fails the promise with the reason why not.
+template <class T> void PersistentKeyValueStore::dispatchWork(const std::vector<std::string>& keys,
+                                                              const std::shared_ptr<Promise<T>>& promise,
+                                                              std::function<void()> task) {
+  try {
+    throwIfInvalid();
+    for (const std::string& key : keys) throwIfReserved(key);
+    workQueue_->dispatch(std::move(task));
+  } catch (...) {
+    promise->setException(std::current_exception());
+  }
+}
+
+// The store's own files stand beside the values.
+void PersistentKeyValueStore::throwIfReserved(const std::string& key) const {
+  if (inlineData_) return;
+  bool reserved = key == kManifestName || key == AttributeStore::fileName;
+  for (const std::string& companion : kManifestCompanions) reserved = reserved || key == kManifestName + companion;
+  if (reserved) throw std::invalid_argument("Key '" + key + "' is reserved.");
+}
+
+std::shared_ptr<Store> PKVSDefinition::createStore(
+    const std::string& storePath, const std::string& temporaryDirectoryPath,
+    std::shared_ptr<TaskQueueFactory> taskQueueFactory, std::shared_ptr<TrashCollector> trashCollector,
+    std::shared_ptr<AnalyticsEventReporter> analyticsReporter, std::shared_ptr<FileUtils> fileUtils,
+    std::function<void(unsigned int)> sizeChangedCallback, PruneStrategyIdentifier /*pruneStrategy*/,
+    std::shared_ptr<const StoreDefinition> /*definition*/) const {
+  return PersistentKeyValueStore::createPersistentKeyValueStore(
+      storePath, temporaryDirectoryPath, name, capacity, staleAgeOf(staleAge), inlineData, std::move(taskQueueFactory),
+      std::move(trashCollector), std::move(analyticsReporter), nullptr, std::move(fileUtils),
+      std::move(sizeChangedCallback), kDefaultBatchSize);
+}
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,280 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <exception>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <unordered_set>
+#include <vector>
+
+#include "DiskCacheItem.h"
+#include "Export.h"
+#include "Future.h"
+#include "Store.h"
+#include "executor/TaskQueueFactory.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class AnalyticsEventReporter;
+class DiskCacheManifestInterface;
+class ExtendedMetadataFactory;
+class FileUtils;
+class LarderException;
+class PruneStrategyBase;
+class TrashCollector;
+class WritesInFlight;
+
+// Values by key, in a directory of their own: one file for each, or inside the manifest ("inline", for small ones).
+// Found again after a restart, expired when they have not been used for long, limited in number if configured.
+//
+//   <store directory>/
+//     manifest_v1.sqlite      the records of all items, and the inline values (with SQLite's companions "-wal" and
+//     "-shm") <key>                   the value, for a store with files; the key is the file name as it stands
+//
+// Threads. Any thread may call. Calls only take their arguments in and return a future: the manifest is used on the
+// work queue and files on the file queue, both the host's and serial. `getAllKeys`, `fetchModificationDate`,
+// `getManifest` and `invalidate` work on the caller's thread. Operations on one key take effect in the order in which
+// they were called. A store that has gone leaves what it had not begun undone.
+//
+// Errors travel in the futures: `InvalidatedException` after invalidation, `FileUtilsIoException` for files, what a
+// writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (the manifest's and
+// the attributes' file names). A manifest that is damaged, or cannot be written, fails nothing: the store is PURGED,
+// all its values go to the trash, the log says so in one line, and work goes on with an empty store.
+//
+// Keys are file names as they stand: one that holds a "/" or is ".." reaches outside the store's directory. Encode what
+// is not under your own control.
+//
+// What survives. The process killed: every value whose future has been fulfilled. Caught in the middle of an overwrite:
+// the old value, the new one, or a part of it; of a first write: a part, or an error. Power cut: as much as the file
+// system kept; the last records may be lost. Full disk: a write fails with its error and leaves a miss; if the manifest
+// itself cannot be written, the store is purged.
+class CELLAR_EXPORT PersistentKeyValueStore : public Store {
+ public:
+  // Creates the file at `path` and returns its size in bytes. Called on the file queue.
+  using Writer = std::function<unsigned int(const std::string& path)>;
+
+  // The value in the file at `path`. Called on the file queue.
+  using Reader = std::function<std::vector<unsigned char>(const std::string& path)>;
+
+  // Fills in the value of the item, whose file (unless it is inline) is at `path`; false: the fetch is a miss. Called
+  // on the file queue.
+  using Loader = std::function<bool(std::shared_ptr<const DiskCacheItem> item, const std::string& path,
+                                    std::vector<unsigned char>& value)>;
+
+  struct CELLAR_EXPORT FetchResult {
+    std::string key;
+    std::vector<unsigned char> value;
+    long modificationDate;  // seconds since the Unix epoch
+  };
+
+  // Creates the store's directory, takes two queues from the factory and starts loading the manifest. `name` appears in
+  // log lines and events. `capacity`: items, absent for no limit; checked before each write, which then evicts the one
+  // item used least recently, also when it overwrites. `staleAge`: seconds without access after which an item expires;
+  // checked 300 seconds after loading and then every hour, in batches of `batchSize`. `manifest` may be null: one is
+  // then created in the directory on first use. `analyticsReporter` may be null and `sizeChangedCallback` empty; the
+  // latter is called on the work queue. Throws what creating the directory throws.
+  static std::shared_ptr<PersistentKeyValueStore> createPersistentKeyValueStore(
+      const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
+      std::optional<std::uint64_t> capacity, long staleAge, bool inlineData,
+      std::shared_ptr<TaskQueueFactory> taskQueueFactory, std::shared_ptr<TrashCollector> trashCollector,
+      std::shared_ptr<AnalyticsEventReporter> analyticsReporter, std::shared_ptr<DiskCacheManifestInterface> manifest,
+      std::shared_ptr<FileUtils> fileUtils, std::function<void(unsigned int)> sizeChangedCallback,
+      unsigned int batchSize);
+
+  // As `createPersistentKeyValueStore`, but loads nothing. The store must be owned by a shared pointer.
+  PersistentKeyValueStore(const std::string& directory, const std::string& temporaryDirectoryPath,
+                          const std::string& name, std::optional<std::uint64_t> capacity, long staleAge,
+                          bool inlineData, std::shared_ptr<TaskQueueFactory> taskQueueFactory,
+                          std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory,
+                          std::shared_ptr<TrashCollector> trashCollector,
+                          std::shared_ptr<PruneStrategyBase> pruneStrategy,
+                          std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
+                          std::shared_ptr<DiskCacheManifestInterface> manifest, std::shared_ptr<FileUtils> fileUtils,
+                          std::function<void(unsigned int)> sizeChangedCallback, unsigned int batchSize);
+  ~PersistentKeyValueStore() override;
+
+  // --- Values ---
+
+  // Stores the value under the key, replacing what is there. The bytes are copied once, here. Fulfilled when value and
+  // record are written.
+  Future<void> store(const std::string& key, const std::vector<unsigned char>& data,
+                     std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata = nullptr);
+
+  // The same with a value that `writer` writes into its file. When the writer throws, the future fails with that
+  // exception and the key is a miss. An inline store fails with `std::runtime_error`.
+  Future<void> store(const std::string& key, std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
+                     Writer writer);
+
+  // The value; a null result for a miss. A hit counts as a use of the item. A file that has vanished behind the store
+  // is an error, unless the store itself removed it meanwhile: that is a miss.
+  Future<std::unique_ptr<FetchResult>> fetch(const std::string& key);
+  Future<std::unique_ptr<FetchResult>> fetch(const std::string& key, Reader reader);
+  Future<std::unique_ptr<FetchResult>> fetch(const std::string& key, Loader loader);
+
+  // The value of the first of the keys that has an item; the result says which. A null result when none has, or there
+  // are no keys.
+  Future<std::unique_ptr<FetchResult>> fetchFirst(const std::vector<std::string>& keys, Loader loader);
+
+  // The loader of a plain fetch: the inline value, or the bytes of the file.
+  bool readValue(std::shared_ptr<const DiskCacheItem> item, const std::string& path, std::vector<unsigned char>& value);
+
+  // Removes value and record. Not an error: a key that is not there.
+  Future<void> removeItem(const std::string& key);
+
+  // Removes every item, in batches, and calls one of the two on the work queue when that is done. What is stored after
+  // the first batch has been taken stays.
+  void clear(std::function<void()> onSuccess, std::function<void(const std::exception&)> onError);
+
+  // The keys of all items, in no order. Throws `DiskCacheManifestException` before the manifest is loaded, and
+  // `InvalidatedException`.
+  std::vector<std::string> getAllKeys();
+
+  // When the value was stored, in seconds since the Unix epoch; empty for a miss. Reads one record from disk before the
+  // manifest is loaded. Throws `InvalidatedException`, and what reading throws.
+  std::optional<std::int32_t> fetchModificationDate(const std::string& key);
+
+  // Counts as a use of the item, and is reported as one. Not an error: a key that is not there.
+  Future<void> updateLastAccessDate(const std::string& key);
+
+  // --- Maintenance ---
+
+  bool isPrunable() override;  // never
+
+  // Refuses all work from now on. What still waits on the work queue fails with `InvalidatedException`; file writes
+  // that have been queued are finished first: this blocks until then, and must not be called on one of the store's
+  // queues. The files stay, theirs to discard who invalidates. A second call does nothing.
+  void invalidate() override;
+
+  // The same without waiting: fulfilled when the file queue has got so far. Leaves the manifest open.
+  Future<void> invalidateWithFuture();
+
+  // Invalidates without waiting, on any thread; the manifest is closed when the file queue has got so far.
+  void invalidateSoon();
+
+  // Throws `InvalidatedException` "Store has been invalidated." once that is so.
+  void throwIfInvalid();
+
+  // Replaces the stale age (seconds), from the next expiry on.
+  void overrideConfiguration(long staleAge);
+
+  // Loads the manifest on the work queue and arms the first expiry.
+  void loadManifest();
+
+  // Arms the next expiry, in so many seconds, in place of the one that is armed. Does nothing once invalidated.
+  void scheduleStaleRemoval(long delaySeconds);
+
+  // Expires what is stale now. Called on the work queue.
+  void startStaleItemRemoval();
+
+  // Evicts the item used least recently if the store is at its capacity. Called with the store's mutex held.
+  void removeOldestItemIfOverMaxCapacity();
+
+  // Deletes the files of what `provider` yields, batch by batch, until a batch is empty. Each batch is asked for on the
+  // work queue when the files of the last one are gone. Then one of the callbacks is called there. No lock is held
+  // around any of the three.
+  void deleteFilesInBatches(std::function<const std::vector<DiskCacheItem>()> provider, std::function<void()> onSuccess,
+                            std::function<void(const std::exception&)> onError);
+
+  // One step of it. Called on the work queue.
+  void deleteNextBatch(std::function<const std::vector<DiskCacheItem>()> provider, std::function<void()> onSuccess,
+                       std::function<void(const std::exception&)> onError);
+
+  // Deletes the files on the file queue, in order. One that cannot be deleted is one error line.
+  Future<void> deleteBatch(const std::vector<std::string>& paths);
+
+  // Purges the store: its directory goes to the trash, and it goes on empty. Throws when it cannot even begin again.
+  void handleCorruptedManifest(const LarderException& error);
+
+  // Tells the size callback the total bytes of all items, on the work queue, if the manifest is loaded.
+  void reportSize();
+
+  // --- Parts ---
+
+  // The manifest, created on first use. What creating it throws is thrown again by later calls that try anew; a
+  // corrupted one is replaced by an empty one together with all files.
+  std::shared_ptr<DiskCacheManifestInterface> getManifest();
+
+  std::string getFilePath(const std::string& filename);
+  std::string getTemporaryDirectoryPath();
+
+ protected:
+  std::mutex& mutex() { return mutex_; }
+  unsigned int batchSize() const { return batchSize_; }
+  const std::shared_ptr<PruneStrategyBase>& pruneStrategy() const { return pruneStrategy_; }
+
+  // Takes a batch out of the manifest by `prune`, for `deleteFilesInBatches`. Locks the mutex; a corrupted manifest
+  // purges the store and yields an empty batch.
+  std::vector<DiskCacheItem> takeBatch(
+      const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune);
+
+ private:
+  using Fetched = std::unique_ptr<FetchResult>;
+  using KeySet = std::unordered_set<std::string>;
+  struct FileWrite;
+
+  // These are called with the mutex held.
+  void beginFileWrite(const std::shared_ptr<FileWrite>& write);
+  void writeInline(const std::string& key, const std::vector<unsigned char>& data,
+                   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
+  void prepareWrite(const std::string& key);
+  std::unique_ptr<DiskCacheItem> lookUp(const std::string& key);
+  std::vector<DiskCacheItem> takeForClear(const std::shared_ptr<KeySet>& storedSince, bool& begun);
+  std::vector<DiskCacheItem> takeAllBut(const KeySet& keep);
+  void purge(const LarderException& error);
+  void armStaleRemoval(long delaySeconds);
+
+  // These run on the file queue.
+  void finishFileWrite(const FileWrite& write);
+  bool startWriter(const FileWrite& write);
+  unsigned int runWriter(const FileWrite& write);
+  bool recordWritten(const FileWrite& write, unsigned int size);
+  void giveUp(const FileWrite& write);
+  void load(const std::shared_ptr<const DiskCacheItem>& item, const Loader& loader, Promise<Fetched>& promise);
+  bool hasLostItem(const DiskCacheItem& item);
+  void deleteLeftoverFile(const std::string& key);
+
+  // These run on the work queue.
+  void remove(const std::string& key, const std::shared_ptr<Promise<void>>& promise);
+  void find(const std::vector<std::string>& keys, const Loader& loader,
+            const std::shared_ptr<Promise<Fetched>>& promise);
+  void reportAccess(const DiskCacheItem* item, const std::string& key);
+
+  template <class T> void dispatchWork(const std::vector<std::string>& keys, const std::shared_ptr<Promise<T>>& promise,
+                                       std::function<void()> task);
+  void throwIfReserved(const std::string& key) const;
+  bool markInvalid(Future<void>& barrier);
+  void silenceManifest();
+
+  const std::string name_;
+  const std::optional<std::uint64_t> capacity_;
+  const bool inlineData_;
+  const std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory_;
+  const std::shared_ptr<TrashCollector> trashCollector_;
+  const std::shared_ptr<PruneStrategyBase> pruneStrategy_;
+  const std::shared_ptr<AnalyticsEventReporter> analyticsReporter_;
+  const std::shared_ptr<FileUtils> fileUtils_;
+  const unsigned int batchSize_;
+  const std::function<void(unsigned int)> sizeChangedCallback_;
+  const std::string temporaryDirectoryPath_;
+  const std::string manifestPath_;
+  std::shared_ptr<AsyncExecutor> fileQueue_;
+  std::shared_ptr<AsyncExecutor> workQueue_;
+
+  std::mutex mutex_;  // one operation on the manifest and its bookkeeping at a time; guards the four below
+  long staleAge_;
+  std::unique_ptr<AsyncTimer> staleRemovalTimer_;
+  const std::unique_ptr<WritesInFlight> writesInFlight_;
+  std::vector<std::weak_ptr<KeySet>> clearsUnderWay_;  // for each, the keys stored since it began
+
+  std::atomic<bool> invalidated_{false};  // set under the mutex
+
+  std::mutex manifestMutex_;  // taken after mutex_; guards the creation of the manifest
+  std::atomic<bool> manifestCreated_{false};
+  std::shared_ptr<DiskCacheManifestInterface> manifest_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar
