@@ -48,7 +48,7 @@ StoreManager::StoreManager(const std::string& parentPath, const StoreManagerDefi
   impl_->initAllStoresLazy();
 }
 
-StoreManager::~StoreManager() = default;
+StoreManager::~StoreManager() { impl_->close(); }
 
 std::shared_ptr<Store> StoreManager::getStoreImpl(const std::string& identifier, PruneStrategyIdentifier strategy) {
   return impl_->getStoreImpl(identifier, strategy);

@@ -97,6 +97,8 @@ std::string StoreManagerImpl::getStorePath(std::shared_ptr<const StoreDefinition
 
 void StoreManagerImpl::invalidate() { common_.invalidate(); }
 
+void StoreManagerImpl::close() { common_.close(); }
+
 bool StoreManagerImpl::isValid() { return common_.isValid(); }
 
 void StoreManagerImpl::cleanseIfNecessary(bool force) {

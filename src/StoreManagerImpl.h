@@ -62,6 +62,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   void cleanupParentDirectory();
   std::string getStorePath(std::shared_ptr<const StoreDefinition> definition);
   void invalidate();
+  void close();
   bool isValid();
 
   // Moves the manager's whole directory to the trash when forced, or when the file system is smaller than

@@ -61,7 +61,7 @@ std::shared_ptr<Store> StoreManagerImplCommon::getStore(const std::string& ident
                                                         std::function<void(unsigned int)> sizeChangedCallback,
                                                         PruneStrategyIdentifier pruneStrategy, bool& created) {
   std::unique_lock<std::mutex> lock(mutex_);
-  if (invalid_) return nullptr;
+  if (invalid_ || closed_) return nullptr;
   std::shared_ptr<Item>& slot = stores_[identifier];
   if (slot != nullptr) {
     const std::shared_ptr<Item> item = slot;
@@ -187,6 +187,13 @@ void StoreManagerImplCommon::invalidate() {
     }
   }
   trashCollector_->collectPath(managerPath_);
+}
+
+void StoreManagerImplCommon::close() {
+  StoreMap slots;  // destroyed without the lock: a store's last owner may be here
+  const std::lock_guard<std::mutex> lock(mutex_);
+  closed_ = true;
+  slots.swap(stores_);
 }
 
 bool StoreManagerImplCommon::isValid() {

@@ -104,6 +104,10 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   // have finished what they were writing, so it must not be called on one of their queues. A second call does nothing.
   void invalidate();
 
+  // Lets go of all stores and hands out no more, without touching their data: the manager's handle has gone. A store's size callback
+  // keeps the manager, so the two would keep each other for ever.
+  void close();
+
   bool isValid();
 
   const StoreManagerDefinition& definition() const;
@@ -127,9 +131,10 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   const std::string managerPath_;
   const std::string temporaryDirectoryPath_;
 
-  std::mutex mutex_;  // guards the two below
-  StoreMap stores_;   // by identifier; emptied by invalidation, which parts manager and stores
+  std::mutex mutex_;  // guards the three below
+  StoreMap stores_;   // by identifier; emptied by invalidation and closing, which part manager and stores
   bool invalid_ = false;
+  bool closed_ = false;
 };
 
 }  // namespace velmora::mobile::xplat::cellar
