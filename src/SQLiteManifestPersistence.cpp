@@ -1,0 +1,242 @@
+#include "SQLiteManifestPersistence.h"
+
+#include <array>
+#include <cstddef>
+#include <cstdint>
+#include <utility>
+
+#include "ExtendedMetadata.h"
+#include "LarderException.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+constexpr const char* tableName = "LarderManifest";
+
+constexpr const char* createTable =
+    "PRAGMA journal_mode = WAL;"
+    "PRAGMA synchronous = NORMAL;"
+    "CREATE TABLE IF NOT EXISTS LarderManifest ("
+    "key               TEXT,   "
+    "filename          TEXT,   "
+    "size              INTEGER,   "
+    "has_inline_data   BOOLEAN,   "
+    "inline_data       BLOB,   "
+    "modification_date INTEGER,   "
+    "last_access_date  INTEGER,   "
+    "extended_manifest BLOB,   "
+    "PRIMARY KEY(key));"
+    "CREATE INDEX IF NOT EXISTS last_access_date_idx   ON LarderManifest(last_access_date);";
+
+struct ExpectedColumn {
+  const char* name;
+  const char* type;
+};
+
+constexpr std::array<ExpectedColumn, 7> firstVersionColumns = {{{"key", "TEXT"},
+                                                                {"filename", "TEXT"},
+                                                                {"size", "INTEGER"},
+                                                                {"has_inline_data", "BOOLEAN"},
+                                                                {"inline_data", "BLOB"},
+                                                                {"modification_date", "INTEGER"},
+                                                                {"last_access_date", "INTEGER"}}};
+constexpr ExpectedColumn metadataColumn = {"extended_manifest", "BLOB"};
+
+void checkColumn(const std::vector<SQLiteStoreColumn>& columns, std::size_t position, const ExpectedColumn& expected) {
+  const bool matches =
+      position < columns.size() && columns[position].name == expected.name && columns[position].type == expected.type;
+  if (!matches) throw SQLiteStoreCorruptedException("Invalid schema.", -1);
+}
+
+void initializeDatabase(SQLiteStore& store) {
+  store.exec(createTable);
+  const auto columns = store.info(tableName);
+  for (std::size_t position = 0; position < firstVersionColumns.size(); ++position) {
+    checkColumn(columns, position, firstVersionColumns[position]);
+  }
+  if (columns.size() == firstVersionColumns.size()) {
+    store.exec("ALTER TABLE LarderManifest ADD extended_manifest BLOB");
+    return;
+  }
+  checkColumn(columns, firstVersionColumns.size(), metadataColumn);
+}
+
+// The layers above know the manifest's exceptions and nothing of SQLite.
+template <class Action> auto translatingExceptions(Action action) {
+  try {
+    return action();
+  } catch (const SQLiteStoreCorruptedException& exception) {
+    throw ManifestCorruptedException(exception.description(), exception.code());
+  } catch (const SQLiteStoreException& exception) {
+    throw ManifestPersistenceException(exception.description(), exception.code());
+  }
+}
+
+// By way of the signed 64-bit number, so that a date before the epoch keeps its sign on disk.
+void bindDate(SQLiteStoreCursor& cursor, int index, std::int64_t date) {
+  cursor.bind<unsigned long long>(index, static_cast<unsigned long long>(date));
+}
+
+std::int32_t dateIn(SQLiteStoreCursor& cursor, int column) {
+  return static_cast<std::int32_t>(cursor.get<unsigned long long>(column));
+}
+
+}  // namespace
+
+SQLiteManifestPersistence::SQLiteManifestPersistence(const std::string& path,
+                                                     std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory,
+                                                     SQLiteStoreFactory storeFactory)
+    : path_(path),
+      extendedMetadataFactory_(std::move(extendedMetadataFactory)),
+      storeFactory_(std::move(storeFactory)) {
+  translatingExceptions([this] {
+    store_ = openStore();
+    initializeDatabase(*store_);
+  });
+}
+
+SQLiteManifestPersistence::~SQLiteManifestPersistence() = default;
+
+std::unique_ptr<SQLiteStore> SQLiteManifestPersistence::openStore() const {
+  if (storeFactory_) return storeFactory_(path_);
+  return SQLiteStore::createEnsuredSQLiteStore(path_, nullptr);
+}
+
+template <class Operation> auto SQLiteManifestPersistence::perform(Operation operation) const {
+  using Result = decltype(operation());
+  const std::lock_guard<std::mutex> lock(mutex_);
+  if (invalidated_) return Result();
+  return translatingExceptions(std::move(operation));
+}
+
+void SQLiteManifestPersistence::clearItems() {
+  perform([this] {
+    // The old connection takes SQLite's companion files along when it closes, so the new one must not have made its own
+    // by then: it is opened before, because opening can fail, but used only afterwards.
+    store_ = openStore();
+    initializeDatabase(*store_);
+  });
+}
+
+void SQLiteManifestPersistence::setItem(const DiskCacheItem& item) {
+  perform([&] {
+    SQLiteStoreCursor cursor = store_->cursor(
+        "INSERT OR REPLACE INTO LarderManifest("
+        "key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest )"
+        "VALUES  (?1, ?2, ?3, ?4, ?5, ?6, ?7);");
+    cursor.bind<std::string>(1, item.key);
+    cursor.bind<std::string>(2, item.filename);
+    cursor.bind<unsigned long long>(3, item.size);
+    cursor.bind<bool>(4, item.hasInlineData);
+    bindDate(cursor, 5, item.modificationDate);
+    bindDate(cursor, 6, item.lastAccessDate);
+    if (item.extendedMetadata != nullptr) {
+      cursor.bind<std::vector<unsigned char>>(7, item.extendedMetadata->serialize());
+    }
+    cursor.next();
+  });
+}
+
+std::unique_ptr<DiskCacheItem> SQLiteManifestPersistence::getItem(const std::string& key) const {
+  return perform([&] {
+    SQLiteStoreCursor cursor = store_->cursor(
+        "SELECT  key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest "
+        "FROM LarderManifest WHERE key = ?1;");
+    cursor.bind<std::string>(1, key);
+    return cursor.next() ? itemInRowOf(cursor) : nullptr;
+  });
+}
+
+void SQLiteManifestPersistence::removeItem(const std::string& key) {
+  perform([&] {
+    SQLiteStoreCursor cursor = store_->cursor("DELETE FROM LarderManifest WHERE key = ?1;");
+    cursor.bind<std::string>(1, key);
+    cursor.next();
+  });
+}
+
+void SQLiteManifestPersistence::updateLastAccessDate(const std::string& key, long date) {
+  perform([&] {
+    SQLiteStoreCursor cursor = store_->cursor("UPDATE LarderManifest SET last_access_date = ?2 WHERE key = ?1;");
+    cursor.bind<std::string>(1, key);
+    bindDate(cursor, 2, date);
+    cursor.next();
+  });
+}
+
+std::vector<std::unique_ptr<DiskCacheItem>> SQLiteManifestPersistence::getItemsLastAccessedBefore(long date) const {
+  return perform([&] {
+    SQLiteStoreCursor cursor = store_->cursor(
+        "SELECT  key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest "
+        "FROM LarderManifest WHERE last_access_date < ?1;");
+    bindDate(cursor, 1, date);
+    return itemsOf(cursor);
+  });
+}
+
+void SQLiteManifestPersistence::invalidate() {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  store_.reset();
+  invalidated_ = true;
+}
+
+std::vector<std::unique_ptr<DiskCacheItem>> SQLiteManifestPersistence::getAllItems() const {
+  return perform([this] {
+    SQLiteStoreCursor cursor = store_->cursor(
+        "SELECT  key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest "
+        "FROM LarderManifest;");
+    return itemsOf(cursor);
+  });
+}
+
+std::vector<unsigned char> SQLiteManifestPersistence::getInlineData(const std::string& key) const {
+  return perform([&] {
+    SQLiteStoreCursor cursor =
+        store_->cursor("SELECT  inline_data FROM  LarderManifest WHERE  has_inline_data IS 1 AND  key = ?1");
+    cursor.bind<std::string>(1, key);
+    return cursor.next() ? cursor.get<std::vector<unsigned char>>(0) : std::vector<unsigned char>();
+  });
+}
+
+void SQLiteManifestPersistence::setInlineData(const std::string& key, const std::vector<unsigned char>& data) {
+  perform([&] {
+    SQLiteStoreCursor cursor =
+        store_->cursor("UPDATE   LarderManifest SET   has_inline_data = 1,  inline_data = ?2 WHERE   key = ?1;");
+    cursor.bind<std::string>(1, key);
+    cursor.bind<std::vector<unsigned char>>(2, data);
+    cursor.next();
+  });
+}
+
+void SQLiteManifestPersistence::removeInlineData(const std::string& key) {
+  perform([&] {
+    SQLiteStoreCursor cursor =
+        store_->cursor("UPDATE   LarderManifest SET   has_inline_data = 0,   inline_data = NULL WHERE   key = ?1;");
+    cursor.bind<std::string>(1, key);
+    cursor.next();
+  });
+}
+
+std::unique_ptr<DiskCacheItem> SQLiteManifestPersistence::itemInRowOf(SQLiteStoreCursor& cursor) const {
+  auto item = std::make_unique<DiskCacheItem>();
+  item->key = cursor.get<std::string>(0);
+  item->filename = cursor.get<std::string>(1);
+  item->size = static_cast<std::uint32_t>(cursor.get<unsigned long long>(2));
+  item->hasInlineData = cursor.get<bool>(3);
+  item->modificationDate = dateIn(cursor, 4);
+  item->lastAccessDate = dateIn(cursor, 5);
+  if (extendedMetadataFactory_ != nullptr) {
+    item->extendedMetadata = extendedMetadataFactory_->getExtendedMetadata();
+    item->extendedMetadata->deserialize(cursor.get<std::vector<unsigned char>>(6));
+  }
+  return item;
+}
+
+std::vector<std::unique_ptr<DiskCacheItem>> SQLiteManifestPersistence::itemsOf(SQLiteStoreCursor& cursor) const {
+  std::vector<std::unique_ptr<DiskCacheItem>> items;
+  while (cursor.next()) items.push_back(itemInRowOf(cursor));
+  return items;
+}
+
+}  // namespace velmora::mobile::xplat::cellar

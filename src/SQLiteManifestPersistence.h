@@ -1,0 +1,82 @@
+#pragma once
+
+// The manifest on disk: an SQLite database ("manifest_v1.sqlite" in the store's directory, with SQLite's own "-wal" and
+// "-shm" beside it while it is open) with one table.
+//
+//   LarderManifest
+//   +-------------------+---------+------------------------------------------------------------------+
+//   | key               | TEXT    | primary key                                                      |
+//   | filename          | TEXT    | the item's file within the store's directory                     |
+//   | size              | INTEGER | bytes                                                            |
+//   | has_inline_data   | BOOLEAN | 1 when the value lies in inline_data, 0 when it lies in the file |
+//   | inline_data       | BLOB    | the value, or NULL                                               |
+//   | modification_date | INTEGER | seconds since the Unix epoch                                     |
+//   | last_access_date  | INTEGER | seconds since the Unix epoch; index last_access_date_idx         |
+//   | extended_manifest | BLOB    | serialised extended metadata, or NULL                            |
+//   +-------------------+---------+------------------------------------------------------------------+
+//
+// The first version of the table ended with last_access_date: opening such a database adds the last column and keeps
+// every row. A table whose columns differ in name, type or order in any other way is foreign and is refused; columns
+// beyond these are left alone.
+
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "DiskCacheItem.h"
+#include "Export.h"
+#include "ManifestPersistence.h"
+#include "SQLiteStore.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class ExtendedMetadataFactory;
+
+// The manifest in an SQLite database. What an operation has written survives the death of the process; a power failure
+// may take the last writes with it, but never damages the rest. On a full disk an operation throws and changes nothing.
+// SQLite's description and code are found unchanged in the exceptions; a foreign table is ManifestCorruptedException
+// "Invalid schema." with code -1. Nothing is repaired, deleted or tried again here, but for the opening of the
+// database.
+class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
+ public:
+  // Opens the database at `path`, creating file and table when they are missing. Without a metadata factory, metadata
+  // is written but not read back. An empty store factory means SQLiteStore::createEnsuredSQLiteStore, which tries for
+  // about 120 ms. Throws what every operation throws.
+  SQLiteManifestPersistence(const std::string& path, std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory,
+                            SQLiteStoreFactory storeFactory);
+  ~SQLiteManifestPersistence() override;
+
+  SQLiteManifestPersistence(const SQLiteManifestPersistence&) = delete;
+  SQLiteManifestPersistence& operator=(const SQLiteManifestPersistence&) = delete;
+
+  // Opens the database anew and lets go of the old connection. When opening fails, the old one stays in use. Deletes no
+  // row: the table is empty afterwards only if the caller removed the database file before.
+  void clearItems() override;
+  void setItem(const DiskCacheItem& item) override;
+  std::unique_ptr<DiskCacheItem> getItem(const std::string& key) const override;
+  void removeItem(const std::string& key) override;
+  void updateLastAccessDate(const std::string& key, long date) override;
+  std::vector<std::unique_ptr<DiskCacheItem>> getItemsLastAccessedBefore(long date) const override;
+  void invalidate() override;
+  std::vector<std::unique_ptr<DiskCacheItem>> getAllItems() const override;
+  std::vector<unsigned char> getInlineData(const std::string& key) const override;
+  void setInlineData(const std::string& key, const std::vector<unsigned char>& data) override;
+  void removeInlineData(const std::string& key) override;
+
+ private:
+  template <class Operation> auto perform(Operation operation) const;
+
+  std::unique_ptr<SQLiteStore> openStore() const;
+  std::unique_ptr<DiskCacheItem> itemInRowOf(SQLiteStoreCursor& cursor) const;
+  std::vector<std::unique_ptr<DiskCacheItem>> itemsOf(SQLiteStoreCursor& cursor) const;
+
+  const std::string path_;
+  mutable std::mutex mutex_;  // held by every operation from its beginning to its end; guards the two below
+  bool invalidated_ = false;
+  std::unique_ptr<SQLiteStore> store_;  // null once invalidated
+  const std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory_;
+  const SQLiteStoreFactory storeFactory_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar
