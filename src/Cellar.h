@@ -1,6 +1,7 @@
 #pragma once
 
-// Every public header. The way in is StoreManagerFactory.h; what a host must bring is in executor/, PathLocations.h and XAnalytics.h.
+// Every public header. The way in is StoreManagerFactory.h; what a host must bring is in executor/, PathLocations.h and
+// XAnalytics.h.
 
 #include "AnalyticsEventReporter.h"
 #include "AttributeStore.h"

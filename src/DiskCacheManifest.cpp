@@ -171,15 +171,13 @@ std::vector<unsigned char> DiskCacheManifest::getInlineData(const std::string& k
 void DiskCacheManifest::setInlineData(const std::string& key, const std::vector<unsigned char>& data) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
   persistence_->setInlineData(key, data);
-  const auto found = items_.find(key);
-  if (found != items_.end()) found->second->hasInlineData = true;
+  if (DiskCacheItem* item = findOrRead(key)) item->hasInlineData = true;
 }
 
 void DiskCacheManifest::removeInlineData(const std::string& key) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
   persistence_->removeInlineData(key);
-  const auto found = items_.find(key);
-  if (found != items_.end()) found->second->hasInlineData = false;
+  if (DiskCacheItem* item = findOrRead(key)) item->hasInlineData = false;
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneToSize(std::uint32_t size, std::uint32_t count) {
@@ -298,18 +296,28 @@ void DiskCacheManifest::flush() {
   commitAccessTimeUpdates(dates);
 }
 
-// Dates that cannot be written now wait for the next time, unless the item has been used again or has gone meanwhile.
+// Dates of items that have been used or set again meanwhile, or have gone, are not written; those that cannot be
+// written now wait for the next time.
 void DiskCacheManifest::commitAccessTimeUpdates(const AccessDates& dates) {
   auto next = dates.begin();
   try {
-    for (; next != dates.end(); ++next) persistence_->updateLastAccessDate(next->first, next->second);
+    for (; next != dates.end(); ++next) {
+      if (isAccessDate(next->first, next->second)) persistence_->updateLastAccessDate(next->first, next->second);
+    }
   } catch (const LarderException& error) {
     LOG(ERROR) << "Could not write access dates: " << error.what();
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
     for (; next != dates.end(); ++next) {
-      if (items_.count(next->first) > 0) pendingAccessDates_.insert(*next);
+      if (!isAccessDate(next->first, next->second)) continue;
+      const std::lock_guard<std::mutex> lock(itemsMutex_);
+      pendingAccessDates_.insert(*next);
     }
   }
+}
+
+bool DiskCacheManifest::isAccessDate(const std::string& key, std::int32_t date) {
+  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const auto found = items_.find(key);
+  return found != items_.end() && found->second->lastAccessDate == date;
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -139,6 +139,7 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   void armFlushTimer();
   void flush();
   void commitAccessTimeUpdates(const AccessDates& dates);
+  bool isAccessDate(const std::string& key, std::int32_t date);
 
   const std::unique_ptr<ManifestPersistence> persistence_;
   const std::shared_ptr<AsyncExecutor> executor_;

@@ -146,7 +146,10 @@ std::vector<unsigned char> FileUtils::readFile(const string& path) {
   File file(path, "rb");
   std::vector<unsigned char> data = allocate(sizeOf(file), file);
   errno = 0;
-  if (std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
+  if (data.empty()) {
+    // Some file systems give directories no size: only reading tells them from empty files.
+    if (std::fgetc(file.get()) == EOF && errno == EISDIR) throwSystemError("File read failed", errno);
+  } else if (std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
     throwSystemError("File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
   }
   file.close();
@@ -190,7 +193,10 @@ void FileUtils::createDirectory(const string& path, bool recursive) {
     throw FileUtilsIoException(0, "Could not create directory at \"" + path + "\": file exists");
   }
   if (recursive) createDirectory(parentPath(path), true);
-  if (::mkdir(path.c_str(), kDirectoryMode) != 0) throwSystemError("", errno);
+  if (::mkdir(path.c_str(), kDirectoryMode) == 0) return;
+  const int error = errno;
+  if (error == EEXIST && isDirectory(path)) return;  // somebody else created it just now
+  throwSystemError("", error);
 }
 
 void FileUtils::createSymLink(const string& linkPath, const string& targetPath) {
@@ -243,8 +249,11 @@ std::vector<FileUtils::Info> FileUtils::listDirectory(const string& path) {
 }
 
 bool FileUtils::isSymLink(const string& path) {
+  if (path.empty()) return false;
+  // A slash at the end would make the system follow the link.
+  const string withoutSlashes = path.substr(0, lastComponentEnd(path) + 1);
   struct stat status {};
-  return ::lstat(path.c_str(), &status) == 0 && S_ISLNK(status.st_mode);
+  return ::lstat(withoutSlashes.c_str(), &status) == 0 && S_ISLNK(status.st_mode);
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -83,7 +83,7 @@ class CELLAR_EXPORT FileUtils {
   // file that vanishes while it is being listed.
   virtual std::vector<Info> listDirectory(const std::string& path);
 
-  // Whether the path itself is a link, dangling or not. Never throws.
+  // Whether the path itself, slashes at its end aside, is a link, dangling or not. Never throws.
   virtual bool isSymLink(const std::string& path);
 };
 

@@ -95,7 +95,10 @@ std::string StoreManagerImpl::getStorePath(std::shared_ptr<const StoreDefinition
   return common_.getStorePath(std::move(definition));
 }
 
-void StoreManagerImpl::invalidate() { common_.invalidate(); }
+void StoreManagerImpl::invalidate() {
+  common_.invalidate();
+  const std::lock_guard<std::mutex> lock(cleanupMutex_);  // no clean-up is under way any more when this returns
+}
 
 void StoreManagerImpl::close() { common_.close(); }
 
@@ -115,6 +118,9 @@ void StoreManagerImpl::cleanseIfNecessary(bool force) {
 
 void StoreManagerImpl::startCleanup() {
   queue_->dispatch([self = shared_from_this()] {
+    // One that comes late would take the next session's directories for stale.
+    const std::lock_guard<std::mutex> lock(self->cleanupMutex_);
+    if (!self->isValid()) return;
     self->cleanupOldStores();
     self->cleanupParentDirectory();
   });
@@ -177,7 +183,7 @@ std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() 
   const StoreManagerDefinition& definition = common_.definition();
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
   const auto nextPruneTime = static_cast<std::int64_t>(lastPruneTime_) + definition.pruneInterval;
-  if (static_cast<std::int64_t>(std::time(nullptr)) < nextPruneTime) return {};
+  if (lastPruneTime_ != 0 && static_cast<std::int64_t>(std::time(nullptr)) < nextPruneTime) return {};
   const bool survivalMode = isInSurvivalMode();
   if (totalSize_ <= definition.maxSize && !survivalMode) return {};
 

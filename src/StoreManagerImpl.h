@@ -112,6 +112,8 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   std::time_t lastPruneTime_ = 0;
   bool pruneInProgress_ = false;
 
+  std::mutex cleanupMutex_;  // held by a clean-up in the background
+
   const bool maintenanceEnabled_;
   const std::shared_ptr<AnalyticsEventReporter> analyticsReporter_;
   const std::shared_ptr<DiskSizeCalculator> diskSizeCalculator_;

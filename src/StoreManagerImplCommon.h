@@ -104,8 +104,8 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   // have finished what they were writing, so it must not be called on one of their queues. A second call does nothing.
   void invalidate();
 
-  // Lets go of all stores and hands out no more, without touching their data: the manager's handle has gone. A store's size callback
-  // keeps the manager, so the two would keep each other for ever.
+  // Lets go of all stores and hands out no more, without touching their data: the manager's handle has gone. A store's
+  // size callback keeps the manager, so the two would keep each other for ever.
   void close();
 
   bool isValid();

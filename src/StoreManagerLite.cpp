@@ -17,6 +17,7 @@ StoreManagerLite::StoreManagerLite(const std::string& parentPath, const StoreMan
 StoreManagerLite::~StoreManagerLite() = default;
 
 std::shared_ptr<Store> StoreManagerLite::getStoreImpl(const std::string& identifier) {
+  if (!isValid()) return nullptr;
   // Checked before the core makes a slot for the store: whoever asked for it again would wait there without end.
   if (common_->getStoreDefinition(identifier)->isManaged) {
     throw std::logic_error("Store '" + identifier + "' needs a task queue factory, which a lite manager has not.");

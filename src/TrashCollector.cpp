@@ -24,7 +24,7 @@ namespace {
 constexpr int kMaxListings = 10;
 
 // How often a path is moved again when a pass has just removed the trash directory under it.
-constexpr int kMaxMoves = 5;
+constexpr int kMaxMoves = 10;
 
 }  // namespace
 
@@ -37,7 +37,7 @@ class TrashCollector::Trash {
   void collect() {
     const std::lock_guard<std::mutex> lock(passMutex_);
     try {
-      while (running_ && fileUtils_->pathExists(path_)) recursiveDelete(path_);
+      while (running_ && fileUtils_->pathExists(path_)) deleteTrash();
     } catch (const std::exception& error) {
       LOG(ERROR) << "Cannot collect trash. " << error.what();
     }
@@ -55,26 +55,33 @@ class TrashCollector::Trash {
   std::uint32_t deletedCount() const { return deletedCount_; }
 
  private:
-  void recursiveDelete(const std::string& path) {
-    const bool isTree = !fileUtils_->isSymLink(path) && fileUtils_->isDirectory(path);
-    recursiveDelete(path, isTree ? FileUtils::Type::Directory : FileUtils::Type::File);
+  // The directory itself counts with what it held: emptying an empty trash deletes nothing worth telling.
+  void deleteTrash() {
+    const bool isDirectory = !fileUtils_->isSymLink(path_) && fileUtils_->isDirectory(path_);
+    const bool wasEmpty = isDirectory && !deleteContents(path_);
+    if (!running_) return;
+    if (!wasEmpty) ++deletedCount_;
+    fileUtils_->deleteFile(path_);
   }
 
   // The listing says what an entry is: asking the path again would follow a link.
-  void recursiveDelete(const std::string& path, FileUtils::Type type) {
+  void recursiveDelete(const FileUtils::Info& entry) {
     if (!running_) return;
-    if (type == FileUtils::Type::Directory) deleteContents(path);
+    if (entry.type == FileUtils::Type::Directory) deleteContents(entry.path);
     if (!running_) return;
     ++deletedCount_;
-    fileUtils_->deleteFile(path);
+    fileUtils_->deleteFile(entry.path);
   }
 
-  void deleteContents(const std::string& path) {
-    for (int listing = 0; listing < kMaxListings && running_; ++listing) {
+  // False when there was nothing in it.
+  bool deleteContents(const std::string& path) {
+    int listings = 0;
+    for (; listings < kMaxListings && running_; ++listings) {
       const auto entries = fileUtils_->listDirectory(path);
-      if (entries.empty()) return;
-      for (const FileUtils::Info& entry : entries) recursiveDelete(entry.path, entry.type);
+      if (entries.empty()) break;
+      for (const FileUtils::Info& entry : entries) recursiveDelete(entry);
     }
+    return listings > 0;
   }
 
   const std::string path_;
@@ -142,13 +149,14 @@ bool TrashCollector::removeFilesWithFilter(const std::string& path,
 void TrashCollector::moveToTrash(const std::string& path) {
   const std::string entry = freeTrashEntry();
   for (int move = 1;; ++move) {
-    fileUtils_->createDirectory(trashPath_, true);
     try {
+      fileUtils_->createDirectory(trashPath_, true);
       return fileUtils_->rename(path, entry);
     } catch (const FileUtilsIoException& error) {
-      // A pass may have removed the trash directory in between. Nothing else is worth another try.
+      // A pass may have removed the trash directory at any moment in between. Nothing else is worth another try.
+      const bool mayBePass = error.code() == ENOENT || error.code() == 0;
       const bool pathIsThere = fileUtils_->pathExists(path) || fileUtils_->isSymLink(path);
-      if (error.code() != ENOENT || !pathIsThere || move == kMaxMoves) throw;
+      if (!mayBePass || !pathIsThere || move == kMaxMoves) throw;
     }
   }
 }
