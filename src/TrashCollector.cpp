@@ -37,10 +37,19 @@ class TrashCollector::Trash {
   void collect() {
     const std::lock_guard<std::mutex> lock(passMutex_);
     try {
-      while (running_ && fileUtils_->pathExists(path_)) deleteTrash();
+      while (running_ && fileUtils_->pathExists(path_) && deleteTrash()) {
+      }
     } catch (const std::exception& error) {
       LOG(ERROR) << "Cannot collect trash. " << error.what();
     }
+  }
+
+  // Moves a path to its entry in the trash. No pass takes the trash directory away under it, but another process may.
+  void moveIn(const std::string& path, const std::string& entry) {
+    const std::lock_guard<std::recursive_mutex> lock(moveMutex_);
+    fileUtils_->createDirectory(path_, true);
+    fileUtils_->rename(path, entry);
+    ++moves_;
   }
 
   // Makes a pass that is under way return at its next step.
@@ -55,13 +64,19 @@ class TrashCollector::Trash {
   std::uint32_t deletedCount() const { return deletedCount_; }
 
  private:
-  // The directory itself counts with what it held: emptying an empty trash deletes nothing worth telling.
-  void deleteTrash() {
+  // False when the rest is left to the pass that follows upon somebody's `moveIn`.
+  bool deleteTrash() {
+    const unsigned int moves = moves_;
     const bool isDirectory = !fileUtils_->isSymLink(path_) && fileUtils_->isDirectory(path_);
     const bool wasEmpty = isDirectory && !deleteContents(path_);
-    if (!running_) return;
+    if (!running_) return false;
+    const std::unique_lock<std::recursive_mutex> lock(moveMutex_, std::try_to_lock);
+    if (!lock.owns_lock()) return false;
+    if (moves != moves_) return true;
+    // The directory itself counts with what it held: emptying an empty trash deletes nothing worth telling.
     if (!wasEmpty) ++deletedCount_;
     fileUtils_->deleteFile(path_);
+    return true;
   }
 
   // The listing says what an entry is: asking the path again would follow a link.
@@ -86,7 +101,10 @@ class TrashCollector::Trash {
 
   const std::string path_;
   const std::shared_ptr<FileUtils> fileUtils_;
-  std::mutex passMutex_;  // held by a pass: two at once would take each other's files away
+  std::mutex passMutex_;            // held by a pass: two at once would take each other's files away
+  std::recursive_mutex moveMutex_;  // held while a path is moved in, and while the directory goes; recursive because a
+                                    // substituted file layer may run a pass in the middle of a move
+  std::atomic<unsigned int> moves_{0};
   std::atomic<bool> running_{true};
   std::atomic<std::uint32_t> deletedCount_{0};
 };
@@ -150,13 +168,12 @@ void TrashCollector::moveToTrash(const std::string& path) {
   const std::string entry = freeTrashEntry();
   for (int move = 1;; ++move) {
     try {
-      fileUtils_->createDirectory(trashPath_, true);
-      return fileUtils_->rename(path, entry);
+      return trash_->moveIn(path, entry);
     } catch (const FileUtilsIoException& error) {
-      // A pass may have removed the trash directory at any moment in between. Nothing else is worth another try.
-      const bool mayBePass = error.code() == ENOENT || error.code() == 0;
+      // Somebody may have removed the trash directory at any moment in between. Nothing else is worth another try.
+      const bool mayHaveGone = error.code() == ENOENT || error.code() == 0;
       const bool pathIsThere = fileUtils_->pathExists(path) || fileUtils_->isSymLink(path);
-      if (!mayBePass || !pathIsThere || move == kMaxMoves) throw;
+      if (!mayHaveGone || !pathIsThere || move == kMaxMoves) throw;
     }
   }
 }
