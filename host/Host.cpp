@@ -1,0 +1,203 @@
+#include "host/Host.h"
+
+#include <glog/logging.h>
+
+#include <algorithm>
+#include <exception>
+#include <future>
+#include <map>
+#include <stdexcept>
+#include <utility>
+
+#include "AnalyticsEventReporter.h"
+#include "AttributeStore.h"
+#include "Configuration.h"
+#include "DiskSizeCalculator.h"
+#include "FileUtils.h"
+#include "JsonValue.h"
+#include "LarderException.h"
+#include "LazyDispatcher.h"
+#include "StoreDirectoryNameBuilder.h"
+#include "StoreManagerFactory.h"
+#include "TrashCollector.h"
+#include "host/DirectoryPathLocations.h"
+#include "host/ThreadQueueFactory.h"
+
+namespace velmora::mobile::xplat::cellar::host {
+
+namespace {
+
+// Managers of one area and scope have the same directory, and each takes the stores of the other for stale ones.
+void refuseSharedDirectories(const Configuration& configuration, const JsonValue& document) {
+  std::map<std::pair<Area, bool>, std::string> owners;
+  for (const auto& [name, ignored] : document.items()) {
+    const auto definition = configuration.getManager(name);
+    const auto [owner, isFree] = owners.emplace(std::pair(definition->area, definition->sessionScoped), name);
+    if (isFree) continue;
+    throw ConfigurationException("Managers '" + owner->second + "' and '" + name +
+                                 "' would share a directory, give them different areas or session scopes.");
+  }
+}
+
+std::shared_ptr<const Configuration> readConfiguration(const std::string& json) {
+  auto configuration = std::make_shared<const Configuration>(json);
+  refuseSharedDirectories(*configuration, JsonValue::parse(json));
+  return configuration;
+}
+
+std::string checkedRoot(std::string root) {
+  if (root.empty()) throw std::invalid_argument("A host needs a root directory.");
+  return root;
+}
+
+bool isPlainInDirectoryName(char byte) {
+  return (byte >= 'a' && byte <= 'z') || (byte >= '0' && byte <= '9') || byte == '-';
+}
+
+// Different keys give different names, on file systems that ignore case too.
+std::string escapedForDirectoryName(const std::string& sessionKey) {
+  constexpr char digits[] = "0123456789abcdef";
+  std::string name;
+  for (const char character : sessionKey) {
+    if (isPlainInDirectoryName(character)) {
+      name += character;
+      continue;
+    }
+    const auto byte = static_cast<unsigned char>(character);
+    name += {'%', digits[byte / 16], digits[byte % 16]};
+  }
+  return name;
+}
+
+std::shared_ptr<AnalyticsEventReporter> reporterFor(std::unique_ptr<XAnalytics> sink) {
+  if (sink == nullptr) return nullptr;
+  return std::make_shared<AnalyticsEventReporter>(std::move(sink));
+}
+
+HostOptions plainOptions(const std::string& configuration, const std::string& root) {
+  HostOptions options;
+  options.configuration = configuration;
+  options.root = root;
+  return options;
+}
+
+}  // namespace
+
+Host::Host(HostOptions options)
+    : configuration_(readConfiguration(options.configuration)),
+      fileUtils_(options.fileUtils ? options.fileUtils : std::make_shared<FileUtils>()),
+      locations_(std::make_shared<DirectoryPathLocations>(checkedRoot(options.root))),
+      nameBuilders_(std::make_shared<StoreDirectoryNameBuilderFactory>(options.versionTag, options.localeSecondTag,
+                                                                       options.localeFirstTag)),
+      sessionTagMapper_(options.sessionTagMapper ? options.sessionTagMapper : escapedForDirectoryName),
+      runMaintenance_(options.runMaintenance),
+      shutDownPatience_(options.shutDownPatience),
+      analytics_(reporterFor(std::move(options.analytics))),
+      threads_(options.taskQueueFactory ? nullptr : std::make_shared<ThreadQueueFactory>()),
+      taskQueueFactory_(threads_ ? threads_ : options.taskQueueFactory),
+      trash_(std::make_shared<TrashCollector>(fileUtils_->combinePath(options.root, "trash"), fileUtils_, analytics_,
+                                              taskQueueFactory_)),
+      attributes_(std::make_shared<AttributeStore>(fileUtils_)),
+      sizes_(std::make_shared<DiskSizeCalculator>(fileUtils_, attributes_, analytics_)),
+      lazyWork_(LazyDispatcher::createLazyDispatcher(taskQueueFactory_, options.lazyDelaySeconds)),
+      measuringQueue_(taskQueueFactory_->createWorkQueue()),
+      sessionScoped_(createFactory(true)),
+      sessionless_(createFactory(false)) {
+  sizes_->exclude(AttributeStore::fileName);
+  sizes_->setAnalytics(analytics_ != nullptr);
+}
+
+Host::Host(const std::string& configuration, const std::string& root) : Host(plainOptions(configuration, root)) {}
+
+Host::~Host() {
+  lazyWork_->willBeTriggeredExternally();
+  if (threads_ == nullptr) return;
+  if (threads_->drain(shutDownPatience_)) {
+    threads_->shutDown();
+  } else {
+    LOG(ERROR) << "Host is destroyed while its queues are at work, their threads are left behind.";
+    threads_->abandon();
+  }
+}
+
+std::shared_ptr<StoreManagerFactory> Host::createFactory(bool servesSessionScoped) const {
+  return std::make_shared<StoreManagerFactory>(servesSessionScoped, analytics_, attributes_, configuration_, sizes_,
+                                               fileUtils_, lazyWork_, locations_, nameBuilders_, taskQueueFactory_,
+                                               trash_, sessionTagMapper_);
+}
+
+std::shared_ptr<StoreManager> Host::manager(const std::string& name, const std::optional<std::string>& sessionKey) {
+  if (!configuration_->getManager(name)->sessionScoped) {
+    return remember(sessionless_->managerForIdentifier(name, "", runMaintenance_), sessionlessManagers_);
+  }
+  const std::shared_lock<std::shared_mutex> lock(sessionGate_);
+  const std::string session = openSession(sessionKey);
+  return remember(sessionScoped_->managerForIdentifier(name, session, runMaintenance_), sessionManagers_);
+}
+
+std::shared_ptr<StoreManager> Host::managerOfStore(const std::string& storeIdentifier,
+                                                   const std::optional<std::string>& sessionKey) {
+  return manager(configuration_->getStore(storeIdentifier)->managerName, sessionKey);
+}
+
+std::string Host::openSession(const std::optional<std::string>& sessionKey) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  if (!openSession_) openSession_ = sessionKey.value_or("");
+  if (sessionKey && *sessionKey != *openSession_) {
+    throw std::logic_error("Another session is open, log out before you ask for a new one.");
+  }
+  return *openSession_;
+}
+
+std::shared_ptr<StoreManager> Host::remember(std::shared_ptr<StoreManager> manager, Managers& managers) {
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    if (std::find(managers.begin(), managers.end(), manager) != managers.end()) return manager;
+    managers.push_back(manager);
+  }
+  // A new manager has registered the directories of its unmanaged stores; measuring them is nobody else's task.
+  lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
+  return manager;
+}
+
+void Host::logOut() {
+  const std::unique_lock<std::shared_mutex> gate(sessionGate_);
+  std::optional<std::string> session;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    session.swap(openSession_);
+  }
+  if (!session) return;
+  invalidateAll(*sessionScoped_, sessionManagers_);
+  trashSessionDirectories(*session);
+}
+
+void Host::invalidate() {
+  logOut();
+  invalidateAll(*sessionless_, sessionlessManagers_);
+}
+
+void Host::invalidateAll(StoreManagerFactory& factory, Managers& managers) {
+  Managers handedOut;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    handedOut.swap(managers);
+  }
+  try {
+    factory.invalidate();
+  } catch (const std::future_error&) {
+    // A manager that could not be built stopped the factory on its way; its first caller knows why.
+  }
+  for (const auto& manager : handedOut) manager->invalidate();
+}
+
+void Host::trashSessionDirectories(const std::string& sessionKey) {
+  const auto names = nameBuilders_->createStoreDirectoryNameBuilder(sessionTagMapper_(sessionKey));
+  for (const Area area : {Area::Caches, Area::Documents, Area::Shared}) {
+    const std::string directory =
+        fileUtils_->combinePath(locations_->pathForArea(area, sessionKey), names->buildStoreManagerName());
+    if (fileUtils_->pathExists(directory)) trash_->collectPath(directory);
+  }
+}
+
+}  // namespace velmora::mobile::xplat::cellar::host

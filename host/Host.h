@@ -1,0 +1,164 @@
+#pragma once
+
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <shared_mutex>
+#include <string>
+#include <vector>
+
+#include "Export.h"
+#include "StoreManager.h"
+#include "XAnalytics.h"
+#include "executor/TaskQueueFactory.h"
+#include "session/Invalidatable.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class AnalyticsEventReporter;
+class AttributeStore;
+class Configuration;
+class DiskSizeCalculator;
+class FileUtils;
+class LazyDispatcher;
+class StoreDirectoryNameBuilderFactory;
+class StoreManagerFactory;
+class TrashCollector;
+struct PathLocations;
+
+namespace host {
+
+class ThreadQueueFactory;
+
+// What a host is built from. The first two are required.
+struct HostOptions {
+  std::string configuration;  // the JSON document of managers and stores
+  std::string root;           // the directory that everything is kept in; created when it is missing
+
+  std::string versionTag;      // part of the names of stores without a version of their own: changing it retires them
+  std::string localeFirstTag;  // parts of the names of locale-sensitive stores, "en" and "US" say
+  std::string localeSecondTag;
+
+  // Makes the name of a session's directories out of its key. Empty: the key itself, with all but a-z, 0-9 and "-"
+  // written as
+  // "%" and two hexadecimal digits for each byte. A key that is a secret or longer than some 80 bytes wants a mapper of
+  // yours.
+  std::function<std::string(const std::string& sessionKey)> sessionTagMapper;
+
+  std::unique_ptr<XAnalytics> analytics;  // null: nothing is reported
+
+  long lazyDelaySeconds =
+      10;  // until stores that nobody has asked for are created, and directories measured, in the background
+  bool runMaintenance = true;  // whether managers clean up what is stale and prune what is over its limit
+  std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for work that is under way
+
+  std::shared_ptr<FileUtils> fileUtils;                // null: the real file system
+  std::shared_ptr<TaskQueueFactory> taskQueueFactory;  // null: threads of the host's own
+};
+
+// Everything that an application needs to use the library, built in one go:
+//
+//   Host host(configurationText, "/data/app/storage");
+//   auto thumbs = host.store<DiskCache>("thumbs");
+//   await(thumbs->store("cat", bytes));
+//   auto letters = host.store<PersistentKeyValueStore>("letters", "session-42");
+//   host.logOut();
+//
+// Under the root: "caches", "documents", "shared" (the areas) and "trash". Any thread may call.
+//
+// Sessions: one at a time. The first request that gives a session key opens that session, a request without one for a
+// session-scoped manager opens the session "", and requests without a key mean the open one. Asking for another session
+// throws until `logOut`, because a manager keeps its first session and its maintenance removes all others. Managers
+// without session scope ignore keys.
+//
+// Destroying the host loses no data: work that waits for the lazy delay is dropped, what is queued is finished, then
+// the host's own threads end. Managers and stores that are still held do no work from then on: their futures are broken
+// promises. Queues that came with the options are not waited for. The destructor may run on one of the host's own
+// queues, and then waits for nothing.
+class CELLAR_EXPORT Host : public session::Invalidatable {
+ public:
+  // Throws what `Configuration` throws; `ConfigurationException` when two managers of one area are both session scoped
+  // or both not (they would have one directory and clean up each other's stores); `std::invalid_argument` when the root
+  // is empty. Touches no disk: directories are created with the managers.
+  explicit Host(HostOptions options);
+  Host(const std::string& configuration, const std::string& root);
+  ~Host() override;
+  Host(const Host&) = delete;
+  Host& operator=(const Host&) = delete;
+
+  // The manager of that name, built on first request; never empty. Throws `ConfigurationException` when there is none,
+  // `std::logic_error` when another session is open, and what building it throws; when that has failed, later requests
+  // throw `std::future_error` until `logOut` or `invalidate`.
+  std::shared_ptr<StoreManager> manager(const std::string& name,
+                                        const std::optional<std::string>& sessionKey = std::nullopt);
+
+  // The manager that owns the store. The same.
+  std::shared_ptr<StoreManager> managerOfStore(const std::string& storeIdentifier,
+                                               const std::optional<std::string>& sessionKey = std::nullopt);
+
+  // The store of that identifier, of whichever manager, pruned in the order that its definition names. Throws as
+  // `manager`, what creating the store throws (later callers then wait without end), and `std::logic_error` when it is
+  // no `StoreType`. Empty only when the session ends at that moment.
+  template <class StoreType>
+  std::shared_ptr<StoreType> store(const std::string& storeIdentifier,
+                                   const std::optional<std::string>& sessionKey = std::nullopt) {
+    return managerOfStore(storeIdentifier, sessionKey)->template getStore<StoreType>(storeIdentifier);
+  }
+
+  // Ends the open session: its managers and stores become invalid and its directories go to the trash, those of
+  // managers that nobody has asked for included. The next request may open another session. Requests for session-scoped
+  // managers wait meanwhile, and stores finish what they are writing: must not be called on one of their queues, nor in
+  // a callback that runs there. Not an error: no session is open.
+  void logOut();
+
+  // Ends the open session and discards the data of the other managers that were asked for, too. As `logOut` otherwise.
+  void invalidate() override;
+
+  // The services behind it, for those who build more on them. None is null but `analytics`.
+  const std::shared_ptr<const Configuration>& configuration() const { return configuration_; }
+  const std::shared_ptr<FileUtils>& files() const { return fileUtils_; }
+  const std::shared_ptr<AnalyticsEventReporter>& analytics() const { return analytics_; }
+  const std::shared_ptr<TaskQueueFactory>& queues() const { return taskQueueFactory_; }
+  const std::shared_ptr<TrashCollector>& trash() const { return trash_; }
+  const std::shared_ptr<AttributeStore>& attributes() const { return attributes_; }
+  const std::shared_ptr<DiskSizeCalculator>& sizes() const { return sizes_; }
+  const std::shared_ptr<LazyDispatcher>& lazyWork() const { return lazyWork_; }
+
+ private:
+  using Managers = std::vector<std::shared_ptr<StoreManager>>;
+
+  std::shared_ptr<StoreManagerFactory> createFactory(bool servesSessionScoped) const;
+  std::string openSession(const std::optional<std::string>& sessionKey);
+  std::shared_ptr<StoreManager> remember(std::shared_ptr<StoreManager> manager, Managers& managers);
+  void invalidateAll(StoreManagerFactory& factory, Managers& managers);
+  void trashSessionDirectories(const std::string& sessionKey);
+
+  const std::shared_ptr<const Configuration> configuration_;
+  const std::shared_ptr<FileUtils> fileUtils_;
+  const std::shared_ptr<PathLocations> locations_;
+  const std::shared_ptr<StoreDirectoryNameBuilderFactory> nameBuilders_;
+  const std::function<std::string(const std::string&)> sessionTagMapper_;
+  const bool runMaintenance_;
+  const std::chrono::seconds shutDownPatience_;
+  const std::shared_ptr<AnalyticsEventReporter> analytics_;
+  const std::shared_ptr<ThreadQueueFactory> threads_;  // null when the queues are somebody else's
+  const std::shared_ptr<TaskQueueFactory> taskQueueFactory_;
+  const std::shared_ptr<TrashCollector> trash_;
+  const std::shared_ptr<AttributeStore> attributes_;
+  const std::shared_ptr<DiskSizeCalculator> sizes_;
+  const std::shared_ptr<LazyDispatcher> lazyWork_;
+  const std::shared_ptr<AsyncExecutor> measuringQueue_;
+  const std::shared_ptr<StoreManagerFactory> sessionScoped_;
+  const std::shared_ptr<StoreManagerFactory> sessionless_;
+
+  std::shared_mutex sessionGate_;  // shared while a session's manager is asked for, exclusive while the session ends
+  std::mutex mutex_;               // guards the three below; taken after the gate, never held while anything is called
+  std::optional<std::string> openSession_;
+  Managers sessionManagers_;  // handed out so far
+  Managers sessionlessManagers_;
+};
+
+}  // namespace host
+}  // namespace velmora::mobile::xplat::cellar

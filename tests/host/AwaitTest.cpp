@@ -1,0 +1,136 @@
+#include "host/Await.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <future>
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <utility>
+
+#include "Future.h"
+#include "host/ThreadQueueFactory.h"
+#include "support/Barrier.h"
+
+namespace velmora::mobile::xplat::cellar::host {
+namespace {
+
+using test::Latch;
+
+FutureError::Code codeOfAwaiting(Future<void> future) {
+  try {
+    await(std::move(future));
+  } catch (const FutureError& error) {
+    return error.code();
+  }
+  throw std::logic_error("Awaiting worked.");
+}
+
+TEST(Await, ReturnsAValueThatIsThereAlready) {
+  Promise<std::unique_ptr<std::string>> promise;
+  Future<std::unique_ptr<std::string>> future = promise.getFuture();
+  promise.setValue(std::make_unique<std::string>("value"));
+  EXPECT_EQ(*await(std::move(future)), "value");
+}
+
+TEST(Await, ReturnsANullValueAsSuch) {
+  Promise<std::unique_ptr<std::string>> promise;
+  promise.setValue(nullptr);
+  EXPECT_EQ(await(promise.getFuture()), nullptr);
+}
+
+TEST(Await, BlocksUntilTheValueComes) {
+  ThreadQueueFactory queues;
+  const auto queue = queues.createQueue();
+  Latch gate(1);
+  const Future<std::unique_ptr<int>> future = dispatchTask<std::unique_ptr<int>>(queue, [&] {
+    gate.wait();
+    return std::make_unique<int>(42);
+  });
+  std::thread opener([&] { gate.countDown(); });
+  EXPECT_EQ(*await(future), 42);
+  opener.join();
+}
+
+TEST(Await, WaitsForWorkWithoutAResult) {
+  ThreadQueueFactory queues;
+  bool ran = false;
+  await(dispatchTask<void>(queues.createQueue(), [&] { ran = true; }));
+  EXPECT_TRUE(ran);
+}
+
+TEST(Await, RethrowsTheStoredException) {
+  ThreadQueueFactory queues;
+  const auto queue = queues.createQueue();
+  try {
+    await(dispatchTask<void>(queue, [] { throw std::runtime_error("no luck"); }));
+    FAIL() << "The task has failed.";
+  } catch (const std::runtime_error& error) {
+    // The thread sanitizer does not see how the standard library counts the holders of an exception: let the queue go
+    // first.
+    EXPECT_TRUE(queues.drain(std::chrono::hours(1)));
+    EXPECT_STREQ(error.what(), "no luck");
+  }
+}
+
+TEST(Await, RethrowsTheExceptionOfAValueToo) {
+  Promise<std::unique_ptr<int>> promise;
+  promise.setException(std::make_exception_ptr(std::out_of_range("far away")));
+  EXPECT_THROW(await(promise.getFuture()), std::out_of_range);
+}
+
+TEST(Await, ThrowsABrokenPromiseWhenTheWorkWasDropped) {
+  Future<void> future;
+  {
+    Promise<void> promise;
+    future = promise.getFuture();
+  }
+  try {
+    await(future);
+    FAIL() << "There is no value.";
+  } catch (const std::future_error& error) {
+    EXPECT_EQ(error.code(), std::future_errc::broken_promise);
+  }
+}
+
+TEST(Await, ThrowsABrokenPromiseWhenTheQueueIsClosed) {
+  ThreadQueueFactory queues;
+  const auto queue = queues.createQueue();
+  queues.shutDown();
+  EXPECT_THROW(await(dispatchTask<void>(queue, [] {})), std::future_error);
+}
+
+TEST(Await, RefusesAnEmptyFuture) { EXPECT_EQ(codeOfAwaiting({}), FutureError::Code::InvalidSharedState); }
+
+TEST(Await, RefusesAFutureWhoseValueWasTaken) {
+  Promise<void> promise;
+  const Future<void> future = promise.getFuture();
+  promise.setValue();
+  await(future);
+  EXPECT_EQ(codeOfAwaiting(future), FutureError::Code::ValueAlreadyFetched);
+}
+
+TEST(Await, RefusesAFutureThatHasACallback) {
+  Promise<void> promise;
+  Future<void> future = promise.getFuture();
+  future.then(nullptr, [](std::future<void>&) {});
+  EXPECT_EQ(codeOfAwaiting(future), FutureError::Code::CallbackAlreadySet);
+}
+
+TEST(Await, ManyThreadsMayAwaitTheirOwnResults) {
+  ThreadQueueFactory queues;
+  const auto queue = queues.createWorkQueue();
+  test::runOnThreads(4, [&](std::size_t thread) {
+    for (std::size_t i = 0; i < 100; ++i) {
+      const std::size_t number = thread * 100 + i;
+      const auto result = await(
+          dispatchTask<std::unique_ptr<std::size_t>>(queue, [=] { return std::make_unique<std::size_t>(number); }));
+      EXPECT_EQ(*result, number);
+    }
+  });
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar::host

@@ -1,0 +1,676 @@
+#include "host/Host.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <filesystem>
+#include <future>
+#include <memory>
+#include <mutex>
+#include <stdexcept>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "Configuration.h"
+#include "DiskCache.h"
+#include "DiskSizeCalculator.h"
+#include "Future.h"
+#include "JsonValue.h"
+#include "LarderException.h"
+#include "LazyDispatcher.h"
+#include "PersistentKeyValueStore.h"
+#include "Store.h"
+#include "StoreManager.h"
+#include "TrashCollector.h"
+#include "host/Await.h"
+#include "host/JsonLinesAnalytics.h"
+#include "host/ThreadQueueFactory.h"
+#include "support/Barrier.h"
+#include "support/FaultyFileUtils.h"
+#include "support/LogCapture.h"
+#include "support/ManualQueue.h"
+#include "support/RecordingAnalytics.h"
+#include "support/TemporaryDirectory.h"
+
+namespace velmora::mobile::xplat::cellar::host {
+namespace {
+
+using test::EventLog;
+using test::FaultyFileUtils;
+using test::Latch;
+using test::LogCapture;
+using test::ManualQueueFactory;
+using test::runOnThreads;
+using test::TemporaryDirectory;
+
+constexpr std::chrono::hours kLongPatience(1);
+constexpr long kHourInSeconds = 3600;
+
+const char* const kConfiguration = R"({
+  "media": {
+    "session_scoped": false,
+    "stores": {
+      "thumbs": {"type": "unmanaged"},
+      "pages": {"type": "unmanaged", "locale_sensitive": true, "has_version": true, "version": 3}
+    }
+  },
+  "inbox": {"stores": {"letters": {"type": "unmanaged", "has_version": true}}},
+  "archive": {"area": "documents", "stores": {"files": {"type": "unmanaged", "has_version": true}}}
+})";
+
+const char* const kConfigurationOfValues = R"({
+  "media": {"stores": {
+    "covers": {"type": "disk_cache", "lru_size_limit": "1MB", "prune_strategy": "lru"},
+    "letters": {"type": "pkvs"}
+  }}
+})";
+
+// A store type that no configuration has.
+class OtherStore : public Store {
+  using Store::Store;
+};
+
+class HostTest : public testing::Test {
+ protected:
+  // Lazy work waits longer than any test unless a test releases it.
+  HostOptions options() const {
+    HostOptions options;
+    options.configuration = kConfiguration;
+    options.root = directory.path();
+    options.versionTag = "250";
+    options.localeFirstTag = "en";
+    options.localeSecondTag = "US";
+    options.lazyDelaySeconds = kHourInSeconds;
+    return options;
+  }
+
+  std::unique_ptr<Host> start() const { return std::make_unique<Host>(options()); }
+
+  // What the error of asking for it says.
+  template <class Error, class Request> static std::string errorOf(const Request& request) {
+    try {
+      request();
+    } catch (const Error& error) {
+      return error.what();
+    }
+    return "no error";
+  }
+
+  static std::string descriptionOfStarting(const std::string& configuration) {
+    try {
+      const Host host(configuration, "/nowhere");
+    } catch (const LarderException& error) {
+      return error.description();
+    }
+    return "no error";
+  }
+
+  const TemporaryDirectory directory;
+};
+
+// Getting started
+
+TEST_F(HostTest, AConfigurationAndARootAreEnough) {
+  Host host(kConfiguration, directory.path());
+  const auto thumbs = host.store<UnmanagedStore>("thumbs");
+  EXPECT_EQ(thumbs->path, directory.file("caches/_sessionlessStore/thumbs__v1"));
+  EXPECT_TRUE(directory.exists("caches/_sessionlessStore/thumbs__v1"));
+}
+
+TEST_F(HostTest, TagsArePartOfTheNamesOfStores) {
+  const auto host = start();
+  EXPECT_EQ(host->store<UnmanagedStore>("thumbs")->path, directory.file("caches/_sessionlessStore/thumbs_250_v1"));
+  EXPECT_EQ(host->store<UnmanagedStore>("pages")->path, directory.file("caches/_sessionlessStore/pages_en_US_v3"));
+}
+
+TEST_F(HostTest, StartingTouchesNoDisk) {
+  const auto host = start();
+  EXPECT_TRUE(directory.names().empty());
+}
+
+TEST_F(HostTest, EveryRequestGetsTheSameManagerAndTheSameStore) {
+  const auto host = start();
+  EXPECT_EQ(host->manager("media"), host->manager("media"));
+  EXPECT_EQ(host->manager("media"), host->managerOfStore("thumbs"));
+  EXPECT_EQ(host->store<UnmanagedStore>("thumbs"), host->store<UnmanagedStore>("thumbs"));
+  EXPECT_EQ(host->store<Store>("thumbs"), host->manager("media")->getStore<UnmanagedStore>("thumbs"));
+}
+
+TEST_F(HostTest, ManyThreadsThatAskAtOnceGetTheSameManager) {
+  const auto host = start();
+  std::vector<std::shared_ptr<StoreManager>> managers(8);
+  runOnThreads(8, [&](std::size_t i) { managers[i] = host->manager(i % 2 == 0 ? "media" : "inbox"); });
+  for (std::size_t i = 2; i < managers.size(); ++i) EXPECT_EQ(managers[i], managers[i - 2]);
+  EXPECT_NE(managers[0], managers[1]);
+}
+
+TEST_F(HostTest, ServicesAreThereForWhoeverBuildsMoreOnThem) {
+  const auto host = start();
+  EXPECT_EQ(host->configuration()->getManager("archive")->area, Area::Documents);
+  EXPECT_NE(host->files(), nullptr);
+  EXPECT_NE(host->attributes(), nullptr);
+  EXPECT_NE(host->sizes(), nullptr);
+  EXPECT_NE(host->lazyWork(), nullptr);
+  EXPECT_EQ(host->analytics(), nullptr);
+  await(dispatchTask<void>(host->queues()->createQueue(), [] {}));
+  directory.write("trash/old", "bytes");
+  host->trash()->emptyAllTrash();
+  EXPECT_FALSE(directory.exists("trash"));
+}
+
+// Errors
+
+TEST_F(HostTest, AnUnknownManagerThrowsEachTime) {
+  const auto host = start();
+  for (int i = 0; i < 2; ++i) {
+    EXPECT_NE(errorOf<ConfigurationException>([&] { host->manager("music"); }).find("Manager 'music' not found."),
+              std::string::npos);
+  }
+}
+
+TEST_F(HostTest, AnUnknownStoreThrowsEachTime) {
+  const auto host = start();
+  for (int i = 0; i < 2; ++i) {
+    EXPECT_NE(errorOf<ConfigurationException>([&] { host->store<Store>("songs"); }).find("Store 'songs' not found."),
+              std::string::npos);
+  }
+}
+
+TEST_F(HostTest, AStoreOfAnotherTypeThrows) {
+  const auto host = start();
+  EXPECT_NE(errorOf<std::logic_error>([&] { host->store<OtherStore>("thumbs"); }).find("Store 'thumbs'"),
+            std::string::npos);
+}
+
+TEST_F(HostTest, ErrorsOfTheConfigurationPassThrough) {
+  EXPECT_THROW(Host("{", "/nowhere"), JsonValue::parse_error);
+  EXPECT_EQ(errorOf<std::invalid_argument>([] { Host(R"({"media": {"area": "attic"}})", "/nowhere"); }),
+            "Invalid area 'attic', use caches, documents or shared.");
+  EXPECT_EQ(descriptionOfStarting(R"({"a": {"stores": {"s": {"type": "unmanaged"}, "s": {"type": "unmanaged"}}}})"),
+            "Duplicate store definition.");
+}
+
+TEST_F(HostTest, AnEmptyRootThrows) {
+  EXPECT_EQ(errorOf<std::invalid_argument>([] { Host("{}", ""); }), "A host needs a root directory.");
+}
+
+TEST_F(HostTest, ManagersThatWouldShareADirectoryAreRefused) {
+  EXPECT_EQ(descriptionOfStarting(R"({"a": {}, "b": {"area": "caches"}})"),
+            "Managers 'a' and 'b' would share a directory, give them different areas or session scopes.");
+  EXPECT_EQ(descriptionOfStarting(R"({"a": {}, "b": {"session_scoped": false}, "c": {"area": "shared"}})"), "no error");
+}
+
+TEST_F(HostTest, AFailureToBuildAManagerReachesTheCallerAndLogOutMakesRoomForAnotherTry) {
+  auto files = std::make_shared<FaultyFileUtils>();
+  HostOptions faulty = options();
+  faulty.fileUtils = files;
+  Host host(std::move(faulty));
+  files->failAlways(FaultyFileUtils::Operation::CreateDirectory, ENOSPC);
+  EXPECT_THROW(host.manager("inbox"), FileUtilsIoException);
+  files->heal();
+  EXPECT_THROW(host.manager("inbox"), std::future_error);
+  host.logOut();
+  EXPECT_TRUE(host.manager("inbox")->isValid());
+}
+
+// Sessions
+
+TEST_F(HostTest, ASessionHasDirectoriesOfItsOwn) {
+  const auto host = start();
+  host->manager("inbox", "alice");
+  EXPECT_EQ(host->store<UnmanagedStore>("letters")->path, directory.file("caches/_store_alice/letters_v1"));
+}
+
+TEST_F(HostTest, AStoreMayOpenTheSession) {
+  const auto host = start();
+  EXPECT_EQ(host->store<UnmanagedStore>("letters", "alice")->path, directory.file("caches/_store_alice/letters_v1"));
+}
+
+TEST_F(HostTest, SessionKeysBecomeNamesThatAreSafeInAPath) {
+  const auto host = start();
+  host->manager("inbox", "../Al_\xFF-9");
+  EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_store_%2e%2e%2f%41l%5f%ff-9"});
+}
+
+TEST_F(HostTest, AMapperOfTheApplicationNamesSessions) {
+  HostOptions mapped = options();
+  mapped.sessionTagMapper = [](const std::string& key) { return "of-" + key; };
+  Host host(std::move(mapped));
+  host.manager("inbox", "Alice");
+  EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_store_of-Alice"});
+}
+
+TEST_F(HostTest, RequestsWithoutAKeyMeanTheOpenSession) {
+  const auto host = start();
+  const auto inbox = host->manager("inbox", "alice");
+  EXPECT_EQ(host->manager("inbox"), inbox);
+  EXPECT_EQ(host->store<UnmanagedStore>("files")->path, directory.file("documents/_store_alice/files_v1"));
+}
+
+TEST_F(HostTest, ARequestWithoutAKeyOpensTheEmptySession) {
+  const auto host = start();
+  EXPECT_EQ(host->store<UnmanagedStore>("letters")->path, directory.file("caches/_store_/letters_v1"));
+  EXPECT_EQ(host->manager("inbox"), host->manager("inbox", ""));
+  EXPECT_THROW(host->manager("inbox", "alice"), std::logic_error);
+}
+
+TEST_F(HostTest, AnotherSessionIsRefusedUntilTheFirstLogsOut) {
+  const auto host = start();
+  const auto inbox = host->manager("inbox", "alice");
+  const std::string refusal = "Another session is open, log out before you ask for a new one.";
+  EXPECT_EQ(errorOf<std::logic_error>([&] { host->manager("inbox", "bob"); }), refusal);
+  EXPECT_EQ(errorOf<std::logic_error>([&] { host->store<Store>("files", "bob"); }), refusal);
+  EXPECT_EQ(host->manager("inbox", "alice"), inbox);
+  EXPECT_FALSE(directory.exists("documents"));
+}
+
+TEST_F(HostTest, ManagersWithoutSessionScopeIgnoreKeysAndOpenNoSession) {
+  const auto host = start();
+  EXPECT_EQ(host->manager("media", "alice"), host->manager("media", "bob"));
+  EXPECT_NO_THROW(host->manager("inbox", "carol"));
+  EXPECT_EQ(host->manager("media", "dave"), host->manager("media"));
+}
+
+TEST_F(HostTest, OfManySessionsThatAreAskedForAtOnceOneOpens) {
+  const auto host = start();
+  std::atomic<int> opened{0};
+  std::atomic<int> refused{0};
+  runOnThreads(4, [&](std::size_t i) {
+    try {
+      host->manager("inbox", "user-" + std::to_string(i));
+      ++opened;
+    } catch (const std::logic_error&) {
+      ++refused;
+    }
+  });
+  EXPECT_EQ(opened, 1);
+  EXPECT_EQ(refused, 3);
+  EXPECT_EQ(directory.names("caches").size(), 1U);
+}
+
+// Logging out
+
+TEST_F(HostTest, LoggingOutDiscardsTheSessionAndLeavesTheRest) {
+  const auto host = start();
+  const auto inbox = host->manager("inbox", "alice");
+  const auto media = host->manager("media");
+  directory.write("caches/_store_alice/letters_v1/letter", "secret");
+  host->logOut();
+  EXPECT_FALSE(inbox->isValid());
+  EXPECT_TRUE(media->isValid());
+  EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_sessionlessStore"});
+}
+
+TEST_F(HostTest, AfterLoggingOutAnotherSessionMayOpen) {
+  const auto host = start();
+  const auto ofAlice = host->store<UnmanagedStore>("letters", "alice");
+  host->logOut();
+  const auto ofBob = host->store<UnmanagedStore>("letters", "bob");
+  EXPECT_NE(ofBob, ofAlice);
+  EXPECT_EQ(ofBob->path, directory.file("caches/_store_bob/letters_v1"));
+  EXPECT_TRUE(host->manager("inbox")->isValid());
+}
+
+TEST_F(HostTest, ASessionThatOpensAgainBeginsEmpty) {
+  const auto host = start();
+  host->store<UnmanagedStore>("letters", "alice");
+  directory.write("caches/_store_alice/letters_v1/letter", "secret");
+  host->logOut();
+  host->store<UnmanagedStore>("letters", "alice");
+  EXPECT_TRUE(directory.names("caches/_store_alice/letters_v1").empty());
+}
+
+TEST_F(HostTest, LoggingOutDiscardsWhatEarlierRunsLeftToManagersThatNobodyAskedFor) {
+  start()->store<UnmanagedStore>("files", "alice");
+  directory.write("documents/_store_alice/files_v1/file", "secret");
+  const auto host = start();
+  host->manager("inbox", "alice");
+  host->logOut();
+  EXPECT_TRUE(directory.names("documents").empty());
+}
+
+TEST_F(HostTest, LoggingOutLeavesOtherSessionsToMaintenance) {
+  HostOptions withoutMaintenance = options();
+  withoutMaintenance.runMaintenance = false;
+  Host host(std::move(withoutMaintenance));
+  directory.makeDirectory("caches/_store_bob");
+  host.manager("inbox", "alice");
+  host.logOut();
+  EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_store_bob"});
+}
+
+TEST_F(HostTest, MaintenanceRemovesOtherSessions) {
+  directory.makeDirectory("caches/_store_bob");
+  start()->manager("inbox", "alice");  // destroyed at once, with everything that was queued done
+  EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_store_alice"});
+}
+
+TEST_F(HostTest, LoggingOutWithoutASessionDoesNothing) {
+  directory.makeDirectory("caches/_store_");
+  const auto host = start();
+  host->logOut();
+  EXPECT_TRUE(directory.exists("caches/_store_"));
+}
+
+TEST_F(HostTest, LoggingOutTwiceIsLoggingOutOnce) {
+  const auto host = start();
+  host->manager("inbox", "alice");
+  host->logOut();
+  host->logOut();
+  EXPECT_TRUE(host->manager("inbox", "bob")->isValid());
+}
+
+TEST_F(HostTest, AManagerThatCouldNotBeBuiltKeepsNoOtherFromBeingLoggedOut) {
+  for (const std::string broken : {"caches", "documents"}) {
+    auto files = std::make_shared<FaultyFileUtils>();
+    HostOptions faulty = options();
+    faulty.fileUtils = files;
+    Host host(std::move(faulty));
+    files->failPath(FaultyFileUtils::Operation::CreateDirectory, directory.file(broken + "/_store_alice/tmp"), ENOSPC);
+    std::vector<std::shared_ptr<StoreManager>> built;
+    for (const std::string name : {"inbox", "archive"}) {
+      try {
+        built.push_back(host.manager(name, "alice"));
+      } catch (const FileUtilsIoException&) {
+      }
+    }
+    ASSERT_EQ(built.size(), 1U);
+    host.logOut();
+    EXPECT_FALSE(built.front()->isValid());
+    EXPECT_FALSE(directory.exists("caches/_store_alice"));
+    EXPECT_FALSE(directory.exists("documents/_store_alice"));
+  }
+}
+
+TEST_F(HostTest, NoManagerOfASessionSurvivesItsLogOut) {
+  const auto host = start();
+  std::mutex mutex;
+  std::vector<std::shared_ptr<StoreManager>> managers;
+  runOnThreads(4, [&](std::size_t thread) {
+    for (int i = 0; i < 20; ++i) {
+      if (thread == 0) {
+        host->logOut();
+        continue;
+      }
+      auto manager = host->manager(thread == 1 ? "archive" : "inbox");
+      const std::lock_guard<std::mutex> lock(mutex);
+      managers.push_back(std::move(manager));
+    }
+  });
+  host->logOut();
+  EXPECT_EQ(managers.size(), 60U);
+  for (const auto& manager : managers) EXPECT_FALSE(manager->isValid());
+}
+
+TEST_F(HostTest, InvalidatingDiscardsEverythingThatWasAskedFor) {
+  const auto host = start();
+  const auto inbox = host->manager("inbox", "alice");
+  const auto media = host->manager("media");
+  host->invalidate();
+  EXPECT_FALSE(inbox->isValid());
+  EXPECT_FALSE(media->isValid());
+  EXPECT_TRUE(directory.names("caches").empty());
+  EXPECT_TRUE(host->manager("media")->isValid());
+  EXPECT_NO_THROW(host->manager("inbox", "bob"));
+}
+
+TEST_F(HostTest, InvalidatingWithoutASessionDiscardsTheOtherManagers) {
+  const auto host = start();
+  const auto media = host->manager("media");
+  session::Invalidatable& invalidatable = *host;
+  invalidatable.invalidate();
+  EXPECT_FALSE(media->isValid());
+}
+
+TEST_F(HostTest, ALateCleanupOfASessionLeavesTheNextSessionAlone) {
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  HostOptions manual = options();
+  manual.taskQueueFactory = queues;
+  Host host(std::move(manual));
+  host.manager("inbox", "alice");  // its cleanup is queued and not run yet
+  host.logOut();
+  host.store<UnmanagedStore>("letters", "bob");
+  queues->runAll();
+  EXPECT_TRUE(directory.exists("caches/_store_bob/letters_v1"));
+}
+
+// Stores of values
+
+TEST_F(HostTest, ValuesAreKeptFromRunToRun) {
+  const std::vector<unsigned char> picture = {0xff, 0xd8};
+  {
+    Host host(kConfigurationOfValues, directory.path());
+    await(host.store<DiskCache>("covers", "alice")->store("sunrise", picture));
+    host.store<PersistentKeyValueStore>("letters")->store("first", {1, 2, 3});  // the end of the host waits for it
+  }
+  Host host(kConfigurationOfValues, directory.path());
+  const auto cover = await(host.store<DiskCache>("covers", "alice")->fetch("sunrise"));
+  ASSERT_NE(cover, nullptr);
+  EXPECT_EQ(cover->value, picture);
+  const auto letter = await(host.store<PersistentKeyValueStore>("letters")->fetch("first"));
+  ASSERT_NE(letter, nullptr);
+  EXPECT_EQ(letter->value, (std::vector<unsigned char>{1, 2, 3}));
+}
+
+TEST_F(HostTest, AKeyThatIsNotThereIsANullResult) {
+  Host host(kConfigurationOfValues, directory.path());
+  EXPECT_EQ(await(host.store<DiskCache>("covers")->fetch("sunset")), nullptr);
+}
+
+TEST_F(HostTest, ValuesOfASessionAreGoneAfterLoggingOut) {
+  Host host(kConfigurationOfValues, directory.path());
+  const auto before = host.store<DiskCache>("covers", "alice");
+  await(before->store("sunrise", {1}));
+  host.logOut();
+  EXPECT_THROW(await(before->fetch("sunrise")), InvalidatedException);
+  EXPECT_EQ(await(host.store<DiskCache>("covers", "alice")->fetch("sunrise")), nullptr);
+}
+
+TEST_F(HostTest, AStoreThatIsHeldAfterTheHostFailsItsFutures) {
+  auto host = std::make_unique<Host>(kConfigurationOfValues, directory.path());
+  const auto covers = host->store<DiskCache>("covers");
+  host.reset();
+  EXPECT_THROW(await(covers->store("sunrise", {1})), std::future_error);
+}
+
+// Lazy work
+
+TEST_F(HostTest, LazyWorkCreatesTheStoresThatNobodyAskedFor) {
+  auto host = start();
+  host->manager("media");
+  EXPECT_EQ(directory.names("caches/_sessionlessStore"), std::vector<std::string>{"tmp"});
+  host->lazyWork()->dispatchNow();
+  host.reset();
+  EXPECT_EQ(directory.names("caches/_sessionlessStore"),
+            (std::vector<std::string>{"pages_en_US_v3", "thumbs_250_v1", "tmp"}));
+}
+
+TEST_F(HostTest, LazyWorkIsReleasedAfterItsDelay) {
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  HostOptions manual = options();
+  manual.taskQueueFactory = queues;
+  manual.lazyDelaySeconds = 7;
+  Host host(std::move(manual));
+  host.manager("media");
+  queues->runAll();
+  EXPECT_FALSE(directory.exists("caches/_sessionlessStore/thumbs_250_v1"));
+  EXPECT_TRUE(queues->workQueue(0)->fireTimer(7'000'000'000));
+  queues->runAll();
+  EXPECT_TRUE(directory.exists("caches/_sessionlessStore/thumbs_250_v1"));
+}
+
+TEST_F(HostTest, DirectoriesOfUnmanagedStoresAreMeasuredWithTheLazyWork) {
+  start()->store<UnmanagedStore>("thumbs");
+  directory.write("caches/_sessionlessStore/thumbs_250_v1/a", "12345");
+  directory.write("caches/_sessionlessStore/thumbs_250_v1/b/c", "678");
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  const auto events = std::make_shared<EventLog>();
+  HostOptions observed = options();
+  observed.taskQueueFactory = queues;
+  observed.analytics = std::make_unique<test::RecordingAnalytics>(events);
+  Host host(std::move(observed));
+  const std::string path = host.store<UnmanagedStore>("thumbs")->path;
+  host.lazyWork()->dispatchNow();
+  queues->runAll();
+  EXPECT_EQ(host.sizes()->fetchDirectorySize(path), 8);
+  EXPECT_EQ(events->named("qzdisk_size_calculator_logging").size(), 2U);  // the directory and the one inside
+}
+
+TEST_F(HostTest, ManagersThatAreBuiltAfterTheLazyWorkAreMeasuredToo) {
+  start()->store<UnmanagedStore>("files");
+  directory.write("documents/_store_/files_v1/file", "1234567");
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  HostOptions manual = options();
+  manual.taskQueueFactory = queues;
+  Host host(std::move(manual));
+  host.lazyWork()->dispatchNow();
+  host.manager("archive");
+  queues->runAll();
+  EXPECT_EQ(host.sizes()->fetchDirectorySize(directory.file("documents/_store_/files_v1")), 7);
+}
+
+TEST_F(HostTest, ReportsGoToTheSink) {
+  HostOptions observed = options();
+  observed.analytics = std::make_unique<JsonLinesAnalytics>(directory.file("events"));
+  Host host(std::move(observed));
+  ASSERT_NE(host.analytics(), nullptr);
+  host.store<UnmanagedStore>("thumbs");
+  const std::string written = directory.read("events");
+  const JsonValue event = JsonValue::parse(written.substr(0, written.find('\n')));
+  EXPECT_EQ(event.at("event"), "qzdiskstore_logging");
+  EXPECT_EQ(event.at("payload").at("store_name"), "thumbs");
+}
+
+// The end
+
+TEST_F(HostTest, DestroyingTheHostKeepsTheData) {
+  start()->store<UnmanagedStore>("letters", "alice");
+  directory.write("caches/_store_alice/letters_v1/letter", "kept");
+  start()->store<UnmanagedStore>("letters", "alice");
+  EXPECT_EQ(directory.read("caches/_store_alice/letters_v1/letter"), "kept");
+}
+
+TEST_F(HostTest, DestroyingTheHostFinishesWhatIsQueuedAndWhatThatQueues) {
+  auto host = start();
+  const auto file = host->queues()->createQueue();
+  const auto work = host->queues()->createWorkQueue();
+  std::atomic<int> ran{0};
+  for (int i = 0; i < 50; ++i) {
+    work->dispatch([&] {
+      ++ran;
+      file->dispatch([&] { ++ran; });
+    });
+  }
+  host.reset();
+  EXPECT_EQ(ran, 100);
+}
+
+TEST_F(HostTest, DestroyingTheHostDropsTheLazyWork) {
+  auto host = start();
+  host->manager("media");
+  host.reset();
+  EXPECT_EQ(directory.names("caches/_sessionlessStore"), std::vector<std::string>{"tmp"});
+}
+
+TEST_F(HostTest, WhatIsHeldAfterTheHostDoesNoMoreWork) {
+  auto host = start();
+  const auto media = host->manager("media");
+  const auto thumbs = host->store<UnmanagedStore>("thumbs");
+  const auto queue = host->queues()->createQueue();
+  host.reset();
+  EXPECT_TRUE(media->isValid());
+  EXPECT_EQ(media->getTemporaryDirectory(), directory.file("caches/_sessionlessStore/tmp"));
+  EXPECT_EQ(thumbs->path, directory.file("caches/_sessionlessStore/thumbs_250_v1"));
+  EXPECT_THROW(await(dispatchTask<void>(queue, [] {})), std::future_error);
+}
+
+TEST_F(HostTest, AManagerThatIsHeldAfterTheHostMayStillBeInvalidated) {
+  auto host = start();
+  const auto media = host->manager("media");
+  host.reset();
+  media->invalidate();
+  EXPECT_FALSE(media->isValid());
+  EXPECT_FALSE(directory.exists("caches/_sessionlessStore"));
+}
+
+TEST_F(HostTest, WorkThatIsStuckIsLeftBehindAfterThePatience) {
+  const LogCapture log;
+  HostOptions impatient = options();
+  impatient.shutDownPatience = std::chrono::seconds(0);
+  auto host = std::make_unique<Host>(std::move(impatient));
+  const auto queue = host->queues()->createQueue();
+  Latch begun(1);
+  const auto gate = std::make_shared<Latch>(1);
+  const auto over = std::make_shared<Latch>(1);
+  queue->dispatch([&begun, gate, over] {
+    begun.countDown();
+    gate->wait();
+    over->countDown();
+  });
+  begun.wait();
+  host.reset();
+  EXPECT_EQ(log.messages(),
+            std::vector<std::string>{"Host is destroyed while its queues are at work, their threads are left behind."});
+  EXPECT_FALSE(over->isOpen());
+  gate->countDown();
+  over->wait();
+}
+
+TEST_F(HostTest, TheHostMayBeDestroyedByATaskOfItsOwnQueue) {
+  std::shared_ptr<Host> host = start();
+  host->store<UnmanagedStore>("thumbs");
+  const auto queue = host->queues()->createQueue();
+  const auto destroyed = std::make_shared<Latch>(1);
+  const auto released = std::make_shared<Latch>(1);
+  queue->dispatch([released, destroyed, host]() mutable {
+    released->wait();
+    host.reset();
+    destroyed->countDown();
+  });
+  host.reset();
+  released->countDown();
+  destroyed->wait();
+  EXPECT_TRUE(directory.exists("caches/_sessionlessStore/thumbs_250_v1"));
+}
+
+TEST_F(HostTest, QueuesThatWereBroughtAlongAreNotWaitedForAndGoOn) {
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  HostOptions manual = options();
+  manual.taskQueueFactory = queues;
+  auto host = std::make_unique<Host>(std::move(manual));
+  EXPECT_EQ(host->queues(), queues);
+  host->manager("media");
+  host.reset();
+  for (const auto& queue : queues->all()) EXPECT_TRUE(queue->armedDelays().empty());
+  EXPECT_GT(queues->runAll(), 0U);  // the cleanup that the manager had queued
+  EXPECT_EQ(directory.names("caches/_sessionlessStore"), std::vector<std::string>{"tmp"});
+}
+
+TEST_F(HostTest, QueuesMayBeSharedWithTheApplication) {
+  const auto queues = std::make_shared<ThreadQueueFactory>();
+  HostOptions shared = options();
+  shared.taskQueueFactory = queues;
+  auto host = std::make_unique<Host>(std::move(shared));
+  host->store<UnmanagedStore>("thumbs");
+  host.reset();
+  bool ran = false;
+  await(dispatchTask<void>(queues->createQueue(), [&] { ran = true; }));
+  EXPECT_TRUE(ran);
+  EXPECT_TRUE(queues->drain(kLongPatience));
+}
+
+TEST_F(HostTest, FilesGoThroughTheFileUtilitiesThatWereBroughtAlong) {
+  const auto files = std::make_shared<FaultyFileUtils>();
+  HostOptions recorded = options();
+  recorded.fileUtils = files;
+  Host host(std::move(recorded));
+  EXPECT_EQ(host.files(), files);
+  host.store<UnmanagedStore>("thumbs");
+  EXPECT_GT(files->calls(FaultyFileUtils::Operation::CreateDirectory), 0U);
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar::host
