@@ -61,17 +61,20 @@ std::size_t sizeOf(File& file) {
   return static_cast<std::size_t>(size);
 }
 
-// The memory for a whole file. What is no regular file may claim any size: then the first byte tells what is wrong with
-// it.
-std::vector<unsigned char> allocate(std::size_t size, File& file) {
+std::vector<unsigned char> allocate(std::size_t size) {
   try {
     return std::vector<unsigned char>(size);
   } catch (const std::bad_alloc&) {
   } catch (const std::length_error&) {
   }
-  errno = 0;
-  (void)std::fgetc(file.get());
-  throwSystemError("File read failed", errno != 0 ? errno : ENOMEM);
+  throwSystemError("File read failed", ENOMEM);
+}
+
+// What size a directory claims to have differs from one file system to the next.
+void throwIfDirectory(File& file) {
+  struct stat status {};
+  if (::fstat(::fileno(file.get()), &status) == 0 && S_ISDIR(status.st_mode))
+    throwSystemError("File read failed", EISDIR);
 }
 
 // A directory stream that is closed on every way out.
@@ -144,12 +147,10 @@ string FileUtils::parentPath(const string& path) {
 
 std::vector<unsigned char> FileUtils::readFile(const string& path) {
   File file(path, "rb");
-  std::vector<unsigned char> data = allocate(sizeOf(file), file);
+  throwIfDirectory(file);
+  std::vector<unsigned char> data = allocate(sizeOf(file));
   errno = 0;
-  if (data.empty()) {
-    // Some file systems give directories no size: only reading tells them from empty files.
-    if (std::fgetc(file.get()) == EOF && errno == EISDIR) throwSystemError("File read failed", errno);
-  } else if (std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
+  if (!data.empty() && std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
     throwSystemError("File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
   }
   file.close();
@@ -158,7 +159,7 @@ std::vector<unsigned char> FileUtils::readFile(const string& path) {
 
 void FileUtils::writeFile(const string& path, const std::vector<unsigned char>& data) {
   File file(path, "wb");
-  if (std::fwrite(data.data(), 1, data.size(), file.get()) != data.size()) {
+  if (!data.empty() && std::fwrite(data.data(), 1, data.size(), file.get()) != data.size()) {
     throwSystemError("File write failed", errno);
   }
   file.close();

@@ -234,12 +234,13 @@ void StoreManagerImpl::onStorePruneBackToNormalComplete(const std::string& ident
 }
 
 void StoreManagerImpl::checkPruneCompletion() {
+  // Looking and noting under one lock: of two stores that finish at once, the later to note has seen both.
+  const std::lock_guard<std::mutex> lock(mutex_);
   bool anyIsPruning = false;
   for (const auto& [identifier, item] : common_.copyStoreMap()) {
-    const std::lock_guard<std::mutex> lock(item->mutex);
+    const std::lock_guard<std::mutex> itemLock(item->mutex);
     anyIsPruning = anyIsPruning || item->isPruning;
   }
-  const std::lock_guard<std::mutex> lock(mutex_);
   pruneInProgress_ = anyIsPruning;
   if (!anyIsPruning) lastPruneTime_ = std::time(nullptr);
 }

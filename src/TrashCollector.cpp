@@ -171,7 +171,7 @@ void TrashCollector::moveToTrash(const std::string& path) {
       return trash_->moveIn(path, entry);
     } catch (const FileUtilsIoException& error) {
       // Somebody may have removed the trash directory at any moment in between. Nothing else is worth another try.
-      const bool mayHaveGone = error.code() == ENOENT || error.code() == 0;
+      const bool mayHaveGone = error.code() == ENOENT || error.code() == EEXIST || error.code() == 0;
       const bool pathIsThere = fileUtils_->pathExists(path) || fileUtils_->isSymLink(path);
       if (!mayHaveGone || !pathIsThere || move == kMaxMoves) throw;
     }

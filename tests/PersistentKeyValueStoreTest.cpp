@@ -1,0 +1,1312 @@
+#include "PersistentKeyValueStore.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <cstddef>
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <future>
+#include <limits>
+#include <memory>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "AttributeStore.h"
+#include "Configuration.h"
+#include "DiskCacheManifest.h"
+#include "LarderException.h"
+#include "StoreDefaults.h"
+#include "support/KeyValueStoreFixture.h"
+
+namespace velmora::mobile::xplat::cellar {
+namespace {
+
+using test::Bytes;
+using test::bytesOf;
+using test::Fetched;
+using test::FetchResult;
+using test::isA;
+using test::KeyValueStoreFixture;
+using test::LogCapture;
+using test::ManifestCall;
+using test::ManualExecutor;
+using test::ManualQueueFactory;
+using test::Operation;
+using test::textOf;
+using test::told;
+using test::watch;
+using test::whatOf;
+using test::Written;
+using testing::ElementsAre;
+using testing::ElementsAreArray;
+using testing::IsEmpty;
+using testing::Pair;
+using testing::UnorderedElementsAre;
+
+using Contents = std::map<std::string, std::string>;
+using Loader = PersistentKeyValueStore::Loader;
+
+const std::string kInvalid =
+    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
+
+class StoreFixture : public KeyValueStoreFixture {
+ protected:
+  static Loader answering(const std::string& value) {
+    return [value](const std::shared_ptr<const DiskCacheItem>&, const std::string&, Bytes& bytes) {
+      bytes = bytesOf(value);
+      return true;
+    };
+  }
+
+  // Writes the text to the file it is told, and claims a size of its own.
+  PersistentKeyValueStore::Writer writing(const std::string& value, unsigned int size) const {
+    return [files = files, value, size](const std::string& path) {
+      files->writeFile(path, bytesOf(value));
+      return size;
+    };
+  }
+};
+
+class CreatingAStore : public StoreFixture {};
+class StoringAValue : public StoreFixture {};
+class FetchingAValue : public StoreFixture {};
+class FetchingTheFirst : public StoreFixture {};
+class RemovingAValue : public StoreFixture {};
+class AskingForDates : public StoreFixture {};
+class StoringInline : public StoreFixture {
+ protected:
+  void SetUp() override { options.inlineData = true; }
+};
+class ReservedKeys : public StoreFixture {};
+class HostileKeys : public StoreFixture {};
+class AGoneStore : public StoreFixture {};
+class AFailingQueue : public StoreFixture {};
+
+// --- Creating ---
+
+TEST_F(CreatingAStore, MakesItsDirectoryAndTheOnesAboveIt) {
+  const std::string path = directory.file("a/b/store");
+  const PersistentKeyValueStore made(path, "", "larder", std::nullopt, 10, false, queues, nullptr, trash, nullptr,
+                                     nullptr, nullptr, files, nullptr, 50);
+  EXPECT_TRUE(std::filesystem::is_directory(path));
+  EXPECT_EQ(queues->queueCount(), 1U);
+  EXPECT_EQ(queues->workQueueCount(), 1U);
+}
+
+TEST_F(CreatingAStore, ThrowsWhatCreatingTheDirectoryThrows) {
+  files->failNext(Operation::CreateDirectory, EROFS);
+  EXPECT_THROW(openUnloaded(), FileUtilsIoException);
+}
+
+TEST_F(CreatingAStore, TouchesNoManifestOnTheCallersThread) {
+  openUnloaded();
+  EXPECT_THAT(directory.names("store"), IsEmpty());
+  EXPECT_EQ(work().pending(), 1U);
+  EXPECT_EQ(file().pending(), 0U);
+  EXPECT_TRUE(work().runNext());
+  EXPECT_TRUE(directory.exists("store/manifest_v1.sqlite"));
+  EXPECT_EQ(file().pending(), 0U);
+}
+
+TEST_F(CreatingAStore, LoadsOnceAndArmsTheFirstExpiryInFiveMinutes) {
+  openWatchedUnloaded();
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+  settle();
+  EXPECT_EQ(manifest->calls(ManifestCall::Load), 1U);
+  EXPECT_THAT(work().armedDelays(), ElementsAre(300 * kSecond));
+  EXPECT_TRUE(work().timers().at(0).viaSchedule);
+  EXPECT_THAT(file().armedDelays(), IsEmpty());
+}
+
+TEST_F(CreatingAStore, IsNotPrunableAndSaysSoWhenAskedToPrune) {
+  open();
+  EXPECT_FALSE(store->isPrunable());
+  EXPECT_THROW(store->pruneBackToNormal(nullptr, nullptr, false), std::logic_error);
+}
+
+TEST_F(CreatingAStore, KeepsThePathsItWasGiven) {
+  open();
+  EXPECT_EQ(store->path, storePath());
+  EXPECT_EQ(store->getFilePath("name"), storePath() + "/name");
+  EXPECT_EQ(store->getFilePath("a/b"), storePath() + "/a/b");
+  EXPECT_EQ(store->getTemporaryDirectoryPath(), directory.file("temporary"));
+  EXPECT_FALSE(directory.exists("temporary"));
+}
+
+TEST_F(CreatingAStore, UsesTheManifestItIsGivenAndMakesNoOther) {
+  openWatched();
+  EXPECT_EQ(store->getManifest(), manifest);
+  put("key", "value");
+  EXPECT_THAT(directory.names("store"), ElementsAre("key"));
+}
+
+TEST_F(CreatingAStore, MakesOneManifestHoweverOftenItIsAskedFor) {
+  openUnloaded();
+  const auto first = store->getManifest();
+  EXPECT_NE(first, nullptr);
+  settle();
+  EXPECT_EQ(store->getManifest(), first);
+}
+
+TEST_F(CreatingAStore, FromADefinitionDeletesInBatchesOfFiftyFromFiveMinutesOn) {
+  const PKVSDefinition definition("larder", "manager", false, false, 0, std::nullopt, false, 100);
+  const auto made = definition.createStore(
+      storePath(), directory.file("temporary"), queues, trash, reporter, files,
+      [this](unsigned int size) { sizes.push_back(size); }, PruneStrategyIdentifier::Null, nullptr);
+  store = std::dynamic_pointer_cast<PersistentKeyValueStore>(made);
+  ASSERT_NE(store, nullptr);
+  settle();
+  for (int i = 0; i < 51; ++i) put("key" + std::to_string(i), "v");
+  clock.advance(101);
+  ASSERT_TRUE(fire(300));
+  ASSERT_TRUE(work().runNext());  // the size of the cycle's beginning
+  ASSERT_TRUE(work().runNext());  // the first batch leaves the manifest
+  EXPECT_EQ(store->getAllKeys().size(), 1U);
+  EXPECT_EQ(valueFiles().size(), 51U);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(valueFiles().size(), 1U);
+  settle();
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  EXPECT_THAT(work().armedDelays(), testing::Contains(3600 * kSecond));
+}
+
+TEST_F(CreatingAStore, FromADefinitionTakesOverCapacityAndInlineData) {
+  const PKVSDefinition definition("larder", "manager", false, false, 0, 1, true, 100);
+  const auto made = definition.createStore(storePath(), "", queues, trash, nullptr, files, nullptr,
+                                           PruneStrategyIdentifier::Null, nullptr);
+  store = std::dynamic_pointer_cast<PersistentKeyValueStore>(made);
+  ASSERT_NE(store, nullptr);
+  put("a", "1");
+  put("b", "2");
+  EXPECT_EQ(contents(), (Contents{{"b", "2"}}));
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST(StaleAgeOf, KeepsSecondsAndNeverTurnsNegative) {
+  EXPECT_EQ(staleAgeOf(0), 0);
+  EXPECT_EQ(staleAgeOf(100), 100);
+  EXPECT_GT(staleAgeOf(std::numeric_limits<std::uint32_t>::max()), 0);
+}
+
+// --- Storing ---
+
+TEST_F(StoringAValue, IsFetchedAgain) {
+  open();
+  put("key", "value");
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_EQ(valueFile("key"), "value");
+}
+
+TEST_F(StoringAValue, IsFoundAgainAfterARestart) {
+  open();
+  put("key", "value");
+  put("empty", "");
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"key", "value"}, {"empty", ""}}));
+}
+
+TEST_F(StoringAValue, WritesARowWithTheKeyAsFileNameAndTheDatesOfNow) {
+  open();
+  put("key", "value");
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 0 1000000 1000000 -"));
+}
+
+TEST_F(StoringAValue, DoesNothingOnTheCallersThread) {
+  openWatched();
+  keepJournal();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  EXPECT_THAT(takeJournal(), IsEmpty());
+  EXPECT_EQ(work().pending(), 1U);
+  EXPECT_EQ(file().pending(), 0U);
+  EXPECT_TRUE(written->isPending());
+}
+
+TEST_F(StoringAValue, RecordsProvisionallyThenWritesTheFileThenRecordsTheSize) {
+  openWatched();
+  keepJournal();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("setItem key 0"));
+  EXPECT_TRUE(written->isPending());
+  EXPECT_EQ(work().pending(), 0U);
+  EXPECT_EQ(file().pending(), 1U);
+
+  ASSERT_TRUE(file().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("writeFile key", "setItem key 5"));
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_THAT(sizes, IsEmpty());  // the size is told on the work queue
+  EXPECT_EQ(work().runAll(), 1U);
+  EXPECT_THAT(sizes, ElementsAre(5U));
+  EXPECT_THAT(takeJournal(), IsEmpty());
+}
+
+TEST_F(StoringAValue, DatesBothRecordsWithTheirOwnNow) {
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  clock.set(2'000'000);
+  ASSERT_TRUE(work().runNext());
+  const DiskCacheItem provisional = medium->rows().at("key").item;
+  EXPECT_EQ(provisional.filename, "key");
+  EXPECT_EQ(provisional.size, 0U);
+  EXPECT_FALSE(provisional.hasInlineData);
+  EXPECT_EQ(provisional.modificationDate, 2'000'000);
+  EXPECT_EQ(provisional.lastAccessDate, 2'000'000);
+  clock.set(3'000'000);
+  ASSERT_TRUE(file().runNext());
+  const DiskCacheItem real = medium->rows().at("key").item;
+  EXPECT_EQ(real.filename, "key");
+  EXPECT_EQ(real.size, 5U);
+  EXPECT_FALSE(real.hasInlineData);
+  EXPECT_EQ(real.modificationDate, 3'000'000);
+  EXPECT_EQ(real.lastAccessDate, 3'000'000);
+}
+
+TEST_F(StoringAValue, KeepsTheMetadataInBothRecords) {
+  class Metadata final : public DiskCacheItem::ExtendedMetadata {
+   public:
+    std::vector<unsigned char> serialize() const override { return {1}; }
+    void deserialize(const std::vector<unsigned char>& /*bytes*/) override {}
+  };
+  openWatched();
+  const auto metadata = std::make_shared<Metadata>();
+  watch(store->store("key", bytesOf("value"), metadata));
+  ASSERT_TRUE(work().runNext());
+  EXPECT_EQ(medium->rows().at("key").item.extendedMetadata, metadata);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(medium->rows().at("key").item.extendedMetadata, metadata);
+}
+
+TEST_F(StoringAValue, CopiesTheBytesAtTheCall) {
+  open();
+  Bytes data = bytesOf("value");
+  const Written written = watch(store->store("key", data));
+  data = bytesOf("other");
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(StoringAValue, OverwritesTheFileInPlaceAndReplacesTheRow) {
+  open();
+  put("key", "a long value");
+  std::filesystem::create_hard_link(pathOf("key"), directory.file("same file"));
+  files->clearTrace();
+  clock.set(2'000'000);
+  put("key", "short");
+  EXPECT_EQ(directory.read("same file"), "short");
+  EXPECT_EQ(files->calls(Operation::DeleteFile), 0U);
+  EXPECT_EQ(files->calls(Operation::Rename), 0U);
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 0 2000000 2000000 -"));
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
+}
+
+TEST_F(StoringAValue, ChangesTheReportedTotalByTheDifferenceWhenItOverwrites) {
+  open();
+  put("key", "a long value");
+  put("key", "short");
+  EXPECT_THAT(sizes, ElementsAre(12U, 5U));
+}
+
+TEST_F(StoringAValue, OfAWriterRecordsTheSizeTheWriterReturns) {
+  open();
+  std::string path;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& filePath) {
+    path = filePath;
+    files->writeFile(filePath, bytesOf("value"));
+    return 77U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(path, pathOf("key"));
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 77 0 1000000 1000000 -"));
+  EXPECT_THAT(sizes, ElementsAre(77U));
+}
+
+TEST_F(StoringAValue, CallsTheWriterOnTheFileQueueWithNoLockHeld) {
+  open();
+  bool called = false;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& filePath) {
+    called = true;
+    store->overrideConfiguration(5);  // takes the store's lock
+    files->writeFile(filePath, bytesOf("value"));
+    return 5U;
+  }));
+  ASSERT_TRUE(work().runNext());
+  EXPECT_FALSE(called);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_TRUE(called);
+  EXPECT_EQ(told(written), "<done>");
+}
+
+TEST_F(StoringAValue, WithoutAWriterFailsAndLeavesAMiss) {
+  open();
+  const Written written = watch(store->store("key", nullptr, nullptr));
+  settle();
+  EXPECT_TRUE(isA<std::bad_function_call>(written->failure)) << told(written);
+  EXPECT_EQ(get("key"), "<miss>");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+}
+
+TEST_F(StoringAValue, WorksWithoutReporterAndSizeCallback) {
+  store = PersistentKeyValueStore::createPersistentKeyValueStore(storePath(), "", "larder", std::nullopt, 10, false,
+                                                                 queues, trash, nullptr, nullptr, files, nullptr, 50);
+  put("key", "value");
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_EQ(get("other"), "<miss>");
+  const Written used = watch(store->updateLastAccessDate("key"));
+  settle();
+  EXPECT_EQ(told(used), "<done>");
+}
+
+TEST_F(StoringAValue, BeforeTheManifestIsLoadedWorksAndReportsNoSize) {
+  openWatchedUnloaded();
+  work().dropAll();  // the loading never comes
+  put("key", "value");
+  EXPECT_THAT(sizes, IsEmpty());
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_EQ(keysInMedium(), (std::vector<std::string>{"key"}));
+}
+
+// --- Fetching ---
+
+TEST_F(FetchingAValue, OfAnUnknownKeyIsAMissThatTouchesNoFile) {
+  openWatched();
+  keepJournal();
+  EXPECT_EQ(get("key"), "<miss>");
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem key"));
+  EXPECT_THAT(accesses(), ElementsAre("1 key 0 0"));
+}
+
+TEST_F(FetchingAValue, LooksUpOnTheWorkQueueAndReadsOnTheFileQueue) {
+  openWatched();
+  put("key", "value");
+  keepJournal();
+  const Fetched fetched = watch(store->fetch("key"));
+  EXPECT_THAT(takeJournal(), IsEmpty());
+  EXPECT_EQ(file().pending(), 0U);
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem key"));
+  EXPECT_EQ(file().pending(), 1U);
+  EXPECT_TRUE(fetched->isPending());
+  ASSERT_TRUE(file().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("readFile key", "updateLastAccessDate key"));
+  EXPECT_EQ(told(fetched), "value");
+  EXPECT_EQ(work().pending() + file().pending(), 0U);
+}
+
+TEST_F(FetchingAValue, TellsTheKeyAndWhenItWasStored) {
+  open();
+  put("key", "value");
+  clock.advance(70);
+  const Fetched fetched = watch(store->fetch("key"));
+  settle();
+  ASSERT_EQ(told(fetched), "value");
+  EXPECT_EQ((*fetched->value)->key, "key");
+  EXPECT_EQ((*fetched->value)->modificationDate, kStart);
+}
+
+TEST_F(FetchingAValue, ReportsOneHitWithAgeAndSize) {
+  open();
+  put("key", "value");
+  clock.advance(70);
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_THAT(accesses(), ElementsAre("0 key 70 5"));
+}
+
+TEST_F(FetchingAValue, ReportsBeforeTheFileIsRead) {
+  open();
+  put("key", "value");
+  watch(store->fetch("key"));
+  EXPECT_THAT(accesses(), IsEmpty());
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(accesses(), ElementsAre("0 key 0 5"));
+  settle();
+  EXPECT_EQ(accesses().size(), 1U);
+}
+
+TEST_F(FetchingAValue, CountsAsAUseOfTheItem) {
+  openWatched();
+  put("key", "value");
+  clock.advance(70);
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_EQ(manifest->getItem("key")->lastAccessDate, kStart + 70);
+  EXPECT_EQ(manifest->getItem("key")->modificationDate, kStart);
+}
+
+TEST_F(FetchingAValue, WithAReaderGivesWhatTheReaderReturns) {
+  open();
+  put("key", "value");
+  std::string path;
+  const Fetched fetched = watch(store->fetch("key", [&](const std::string& filePath) {
+    path = filePath;
+    return bytesOf("read");
+  }));
+  settle();
+  EXPECT_EQ(told(fetched), "read");
+  EXPECT_EQ(path, pathOf("key"));
+}
+
+TEST_F(FetchingAValue, WithAReaderThatThrowsFailsWithThatAndIsNoUse) {
+  openWatched();
+  put("key", "value");
+  const Fetched fetched =
+      watch(store->fetch("key", [](const std::string&) -> Bytes { throw std::out_of_range("Not here."); }));
+  settle();
+  EXPECT_EQ(told(fetched), "<error> Not here.");
+  EXPECT_TRUE(isA<std::out_of_range>(fetched->failure));
+  EXPECT_EQ(manifest->calls(ManifestCall::UpdateLastAccessDate), 0U);
+}
+
+TEST_F(FetchingAValue, WithALoaderPassesTheItemThePathAndEmptyBytes) {
+  open();
+  put("key", "value");
+  std::shared_ptr<const DiskCacheItem> seen;
+  std::string path;
+  const Fetched fetched = watch(
+      store->fetch("key", [&](std::shared_ptr<const DiskCacheItem> item, const std::string& filePath, Bytes& value) {
+        seen = std::move(item);
+        path = filePath;
+        EXPECT_THAT(value, IsEmpty());
+        value = bytesOf("loaded");
+        return true;
+      }));
+  settle();
+  EXPECT_EQ(told(fetched), "loaded");
+  ASSERT_NE(seen, nullptr);
+  EXPECT_EQ(seen->key, "key");
+  EXPECT_EQ(seen->size, 5U);
+  EXPECT_EQ(path, pathOf("key"));
+}
+
+TEST_F(FetchingAValue, WithALoaderThatRefusesIsAMissAndNoUse) {
+  openWatched();
+  put("key", "value");
+  const Fetched fetched =
+      watch(store->fetch("key", [](const std::shared_ptr<const DiskCacheItem>&, const std::string&, Bytes& value) {
+        value = bytesOf("half");
+        return false;
+      }));
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_EQ(manifest->calls(ManifestCall::UpdateLastAccessDate), 0U);
+  EXPECT_THAT(accesses(), ElementsAre("0 key 0 5"));  // the item was there
+}
+
+TEST_F(FetchingAValue, CallsTheLoaderWithNoLockHeld) {
+  open();
+  put("key", "value");
+  const Fetched fetched = watch(
+      store->fetch("key", [&](const std::shared_ptr<const DiskCacheItem>& item, const std::string& path, Bytes& value) {
+        store->overrideConfiguration(5);
+        return store->readValue(item, path, value);
+      }));
+  settle();
+  EXPECT_EQ(told(fetched), "value");
+}
+
+TEST_F(FetchingAValue, WhoseFileVanishedBehindTheStoreIsTheErrorOfReading) {
+  open();
+  put("key", "value");
+  std::filesystem::remove(pathOf("key"));
+  const Fetched fetched = watch(store->fetch("key"));
+  settle();
+  EXPECT_TRUE(isA<FileUtilsIoException>(fetched->failure)) << told(fetched);
+  EXPECT_THAT(told(fetched), testing::HasSubstr("Could not open file"));
+  EXPECT_THAT(store->getAllKeys(), ElementsAre("key"));
+}
+
+TEST_F(FetchingAValue, WhoseFileIsTakenByALaterRemovalIsAMiss) {
+  open();
+  put("key", "value");
+  const Fetched fetched = watch(store->fetch("key"));
+  const Written removed = watch(store->removeItem("key"));
+  EXPECT_EQ(work().runAll(), 2U);  // looked up, then removed; the reading comes after both
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_EQ(told(removed), "<done>");
+}
+
+TEST_F(FetchingAValue, WhoseFileIsTakenByALaterRemovalAndWrittenAnewIsAMissAndNoError) {
+  open();
+  put("key", "value");
+  const Fetched fetched = watch(store->fetch("key"));
+  watch(store->removeItem("key"));
+  watch(store->store("key", bytesOf("new")));
+  work().runAll();
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_EQ(get("key"), "new");
+}
+
+TEST_F(FetchingAValue, CompletesAPendingWriteOfTheKeyFirst) {
+  open();
+  watch(store->store("key", bytesOf("value")));
+  const Fetched fetched = watch(store->fetch("key"));
+  settle();
+  EXPECT_EQ(told(fetched), "value");
+}
+
+TEST_F(FetchingAValue, BeforeTheManifestIsLoadedReadsTheOneRecord) {
+  open();
+  put("key", "value");
+  close();
+  openUnloaded();
+  work().dropAll();
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_FALSE(store->getManifest()->isLoaded());
+}
+
+TEST_F(FetchingAValue, FailsWithWhatTheManifestThrowsWhenItIsNotDamaged) {
+  openWatched();
+  put("key", "value");
+  manifest->failNext(ManifestCall::GetItem, unwritable);
+  EXPECT_EQ(get("key"), std::string("<error> ") + unwritable.what());
+  EXPECT_EQ(get("key"), "value");
+}
+
+// --- readValue ---
+
+TEST_F(FetchingAValue, ReadValueReadsTheFileOfAnOrdinaryItem) {
+  open();
+  const std::string path = directory.write("elsewhere", "bytes");
+  const auto item = std::make_shared<DiskCacheItem>("key", "key", 5, false, 0, 0, nullptr);
+  Bytes value;
+  EXPECT_TRUE(store->readValue(item, path, value));
+  EXPECT_EQ(textOf(value), "bytes");
+  EXPECT_THROW(store->readValue(item, directory.file("nowhere"), value), FileUtilsIoException);
+}
+
+TEST_F(FetchingAValue, ReadValueReadsTheManifestForAnInlineItem) {
+  options.inlineData = true;
+  openWatched();
+  put("key", "value");
+  const std::shared_ptr<const DiskCacheItem> item = manifest->getItem("key");
+  Bytes value;
+  EXPECT_TRUE(store->readValue(item, directory.file("nowhere"), value));
+  EXPECT_EQ(textOf(value), "value");
+}
+
+TEST_F(FetchingAValue, ReadValueOfADamagedManifestPurgesAndRefuses) {
+  options.inlineData = true;
+  openWatched();
+  put("key", "value");
+  const std::shared_ptr<const DiskCacheItem> item = manifest->getItem("key");
+  manifest->failNext(ManifestCall::GetInlineData, corrupted);
+  const LogCapture log;
+  Bytes value;
+  EXPECT_FALSE(store->readValue(item, "", value));
+  EXPECT_THAT(errorLines(log), ElementsAre(purgeLine(corrupted)));
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+}
+
+// --- The first of several ---
+
+TEST_F(FetchingTheFirst, OfNoKeysIsAMissThatReportsNothingAndAsksNothing) {
+  openWatched();
+  keepJournal();
+  const Fetched fetched = watch(store->fetchFirst({}, answering("x")));
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_THAT(takeJournal(), IsEmpty());
+  EXPECT_THAT(events->events(), IsEmpty());
+}
+
+TEST_F(FetchingTheFirst, OfUnknownKeysAsksForAllAndReportsOneMissOfTheFirst) {
+  openWatched();
+  keepJournal();
+  const Fetched fetched = watch(store->fetchFirst({"a", "b", "c"}, answering("x")));
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem a", "getItem b", "getItem c"));
+  EXPECT_THAT(accesses(), ElementsAre("1 a 0 0"));
+}
+
+TEST_F(FetchingTheFirst, StopsAtTheFirstKeyThatIsThereAndNamesIt) {
+  openWatched();
+  put("b", "bee");
+  put("c", "sea");
+  clock.advance(9);
+  keepJournal();
+  std::string path;
+  const Fetched fetched = watch(store->fetchFirst({"a", "b", "c"}, [&](const std::shared_ptr<const DiskCacheItem>& item,
+                                                                       const std::string& filePath, Bytes& value) {
+    path = filePath;
+    return store->readValue(item, filePath, value);
+  }));
+  settle();
+  EXPECT_EQ(told(fetched), "bee");
+  EXPECT_EQ((*fetched->value)->key, "b");
+  EXPECT_EQ((*fetched->value)->modificationDate, kStart);
+  EXPECT_EQ(path, pathOf("b"));
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem a", "getItem b", "readFile b", "updateLastAccessDate b"));
+  EXPECT_THAT(accesses(), ElementsAre("0 b 9 3"));
+}
+
+TEST_F(FetchingTheFirst, OfKeysInAnotherOrderFindsAnotherOne) {
+  open();
+  put("b", "bee");
+  put("c", "sea");
+  const Fetched fetched = watch(store->fetchFirst({"c", "b"}, answering("x")));
+  settle();
+  EXPECT_EQ(told(fetched), "x");
+  EXPECT_EQ((*fetched->value)->key, "c");
+}
+
+TEST_F(FetchingTheFirst, EndsTheSearchAsAMissWhenTheManifestIsDamaged) {
+  openWatched();
+  put("b", "bee");
+  keepJournal();
+  manifest->failNext(ManifestCall::GetItem, corrupted);
+  const LogCapture log;
+  const Fetched fetched = watch(store->fetchFirst({"a", "b"}, answering("x")));
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_THAT(errorLines(log), ElementsAre(purgeLine(corrupted)));
+  EXPECT_THAT(accesses(), ElementsAre("1 a 0 0"));
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(FetchingTheFirst, DoesNotGoOnToTheNextKeyWhenTheLoaderRefuses) {
+  open();
+  put("a", "1");
+  put("b", "2");
+  int calls = 0;
+  const Fetched fetched =
+      watch(store->fetchFirst({"a", "b"}, [&](const std::shared_ptr<const DiskCacheItem>&, const std::string&, Bytes&) {
+        ++calls;
+        return false;
+      }));
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_EQ(calls, 1);
+}
+
+TEST_F(FetchingTheFirst, OfTheSameKeyTwiceIsLikeOnce) {
+  open();
+  put("a", "1");
+  const Fetched fetched = watch(store->fetchFirst({"a", "a"}, answering("x")));
+  settle();
+  EXPECT_EQ(told(fetched), "x");
+  EXPECT_EQ(accesses().size(), 1U);
+}
+
+// --- Removing ---
+
+TEST_F(RemovingAValue, TakesRecordAndFileOnTheWorkQueue) {
+  openWatched();
+  put("key", "value");
+  keepJournal();
+  const Written removed = watch(store->removeItem("key"));
+  EXPECT_THAT(takeJournal(), IsEmpty());
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem key", "removeItem key", "deleteFile key"));
+  EXPECT_EQ(told(removed), "<done>");
+  EXPECT_EQ(file().pending(), 0U);
+}
+
+TEST_F(RemovingAValue, IsAMissAtOnceAndAfterARestart) {
+  open();
+  put("key", "value");
+  put("other", "kept");
+  EXPECT_EQ(drop("key"), "<done>");
+  EXPECT_EQ(get("key"), "<miss>");
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"other", "kept"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("other"));
+}
+
+TEST_F(RemovingAValue, ThatIsNotThereSucceedsAndTouchesNothing) {
+  openWatched();
+  keepJournal();
+  EXPECT_EQ(drop("key"), "<done>");
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem key"));
+}
+
+TEST_F(RemovingAValue, TwiceSucceedsTwice) {
+  open();
+  put("key", "value");
+  const Written first = watch(store->removeItem("key"));
+  const Written second = watch(store->removeItem("key"));
+  settle();
+  EXPECT_EQ(told(first), "<done>");
+  EXPECT_EQ(told(second), "<done>");
+}
+
+TEST_F(RemovingAValue, WhoseFileHasVanishedFailsButTakesTheRecord) {
+  open();
+  put("key", "value");
+  std::filesystem::remove(pathOf("key"));
+  const Written removed = watch(store->removeItem("key"));
+  settle();
+  EXPECT_TRUE(isA<FileUtilsIoException>(removed->failure)) << told(removed);
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  EXPECT_EQ(drop("key"), "<done>");
+}
+
+TEST_F(RemovingAValue, ThatTheManifestCannotForgetFailsAndKeepsTheFile) {
+  openWatched();
+  put("key", "value");
+  manifest->failNext(ManifestCall::RemoveItem, unwritable);
+  EXPECT_EQ(drop("key"), std::string("<error> ") + unwritable.what());
+  EXPECT_EQ(get("key"), "value");
+}
+
+// --- Dates ---
+
+TEST_F(AskingForDates, OfAnUnknownKeyIsEmpty) {
+  open();
+  EXPECT_EQ(store->fetchModificationDate("key"), std::nullopt);
+}
+
+TEST_F(AskingForDates, GivesWhenTheValueWasStoredAndIsNoUseAndNoEvent) {
+  openWatched();
+  put("key", "value");
+  clock.advance(50);
+  EXPECT_EQ(store->fetchModificationDate("key"), kStart);
+  EXPECT_EQ(manifest->getItem("key")->lastAccessDate, kStart);
+  EXPECT_THAT(accesses(), IsEmpty());
+}
+
+TEST_F(AskingForDates, BeforeTheManifestIsLoadedReadsTheOneRecord) {
+  open();
+  put("key", "value");
+  close();
+  openUnloaded();
+  EXPECT_EQ(store->fetchModificationDate("key"), kStart);
+  EXPECT_FALSE(store->getManifest()->isLoaded());
+}
+
+TEST_F(AskingForDates, UpdatingTheAccessDateReportsAHitOfTheKeyAloneAndMovesTheDate) {
+  openWatched();
+  put("key", "value");
+  clock.advance(50);
+  const Written used = watch(store->updateLastAccessDate("key"));
+  EXPECT_EQ(manifest->calls(ManifestCall::UpdateLastAccessDate), 0U);
+  EXPECT_THAT(accesses(), IsEmpty());
+  ASSERT_TRUE(work().runNext());
+  EXPECT_EQ(told(used), "<done>");
+  EXPECT_EQ(manifest->getItem("key")->lastAccessDate, kStart + 50);
+  EXPECT_THAT(accesses(), ElementsAre("0 key 0 0"));
+  EXPECT_EQ(file().pending(), 0U);
+}
+
+TEST_F(AskingForDates, UpdatingTheAccessDateOfAnUnknownKeyIsNoError) {
+  open();
+  const Written used = watch(store->updateLastAccessDate("key"));
+  settle();
+  EXPECT_EQ(told(used), "<done>");
+  EXPECT_THAT(accesses(), ElementsAre("0 key 0 0"));
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+}
+
+TEST_F(AskingForDates, KeysBeforeLoadingAreRefused) {
+  openUnloaded();
+  EXPECT_THROW(store->getAllKeys(), DiskCacheManifestException);
+  settle();
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+}
+
+// --- Inline ---
+
+TEST_F(StoringInline, KeepsTheBytesInTheRowAndMakesNoFile) {
+  open();
+  put("key", "value");
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 1 1000000 1000000 value"));
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  EXPECT_EQ(get("key"), "value");
+  reopen();
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(StoringInline, RecordsTheItemThenTheBytesOnTheWorkQueueAndReportsTheSize) {
+  openWatched();
+  keepJournal();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  EXPECT_THAT(takeJournal(), IsEmpty());
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("setItem key 5", "setInlineData key 5"));
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(file().pending(), 0U);
+  EXPECT_EQ(work().runAll(), 1U);
+  EXPECT_THAT(sizes, ElementsAre(5U));
+}
+
+TEST_F(StoringInline, OfNothingIsAnEmptyValueAndNoMiss) {
+  open();
+  put("key", "");
+  EXPECT_EQ(get("key"), "");
+  reopen();
+  EXPECT_EQ(get("key"), "");
+}
+
+TEST_F(StoringInline, ReplacesTheValue) {
+  open();
+  put("key", "a long value");
+  put("key", "short");
+  EXPECT_EQ(get("key"), "short");
+  EXPECT_THAT(sizes, ElementsAre(12U, 5U));
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 1 1000000 1000000 short"));
+}
+
+TEST_F(StoringInline, KeepsBytesOfEveryKind) {
+  open();
+  const std::string value("a\0b\xff\n\0", 6);
+  put("key", value);
+  reopen();
+  EXPECT_EQ(get("key"), value);
+}
+
+TEST_F(StoringInline, IsReadOnTheFileQueue) {
+  openWatched();
+  put("key", "value");
+  keepJournal();
+  const Fetched fetched = watch(store->fetch("key"));
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem key"));
+  ASSERT_TRUE(file().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("getInlineData key", "updateLastAccessDate key"));
+  EXPECT_EQ(told(fetched), "value");
+}
+
+TEST_F(StoringInline, RefusesAWriterAtOnceAndNeverCallsIt) {
+  openWatched();
+  keepJournal();
+  bool called = false;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string&) {
+    called = true;
+    return 1U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<error> Write callback not supported by inline store.");
+  EXPECT_TRUE(isA<std::runtime_error>(written->failure));
+  EXPECT_FALSE(isA<LarderException>(written->failure));
+  EXPECT_FALSE(called);
+  EXPECT_THAT(takeJournal(), IsEmpty());
+}
+
+TEST_F(StoringInline, RemovesWithoutDeletingAFile) {
+  openWatched();
+  put("key", "value");
+  directory.write("store/key", "a file that is not the store's");
+  keepJournal();
+  EXPECT_EQ(drop("key"), "<done>");
+  EXPECT_THAT(takeJournal(), ElementsAre("getItem key", "removeItem key"));
+  EXPECT_EQ(get("key"), "<miss>");
+}
+
+TEST_F(StoringInline, RemovedBetweenLookingUpAndReadingIsAMiss) {
+  open();
+  put("key", "value");
+  const Fetched fetched = watch(store->fetch("key"));
+  watch(store->removeItem("key"));
+  work().runAll();
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+}
+
+TEST_F(StoringInline, TakesAnyKey) {
+  open();
+  const std::vector<std::string> keys = {"",
+                                         ".",
+                                         "..",
+                                         "a/b",
+                                         "manifest_v1.sqlite",
+                                         AttributeStore::fileName,
+                                         std::string("a\0b", 3),
+                                         "\xff\xfe",
+                                         std::string(5000, 'x')};
+  for (const std::string& key : keys) put(key, "value of " + key);
+  for (const std::string& key : keys) EXPECT_EQ(get(key), "value of " + key);
+  reopen();
+  EXPECT_EQ(contents().size(), keys.size());
+  for (const std::string& key : keys) EXPECT_EQ(get(key), "value of " + key);
+  for (const std::string& key : keys) EXPECT_EQ(drop(key), "<done>");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+}
+
+// --- Reserved keys ---
+
+TEST_F(ReservedKeys, FailEveryOperationOfAStoreWithFilesAndTouchNothing) {
+  open();
+  put("key", "value");
+  const std::string before = directory.read("store/manifest_v1.sqlite");
+  const std::vector<std::string> reserved = {"manifest_v1.sqlite", "manifest_v1.sqlite-journal",
+                                             "manifest_v1.sqlite-wal", "manifest_v1.sqlite-shm",
+                                             "_cellar_extended_attributes"};
+  files->clearTrace();
+  for (const std::string& key : reserved) {
+    const std::string message = "Key '" + key + "' is reserved.";
+    const std::vector<Written> written = {watch(store->store(key, bytesOf("x"))),
+                                          watch(store->store(key, nullptr, writing("x", 1))),
+                                          watch(store->removeItem(key)), watch(store->updateLastAccessDate(key))};
+    const std::vector<Fetched> fetched = {
+        watch(store->fetch(key)), watch(store->fetch(key, [](const std::string&) { return Bytes(); })),
+        watch(store->fetch(key, answering("x"))), watch(store->fetchFirst({"key", key}, answering("x")))};
+    settle();
+    for (const Written& outcome : written) {
+      EXPECT_EQ(told(outcome), "<error> " + message);
+      EXPECT_TRUE(isA<std::invalid_argument>(outcome->failure));
+    }
+    for (const Fetched& outcome : fetched) {
+      EXPECT_EQ(told(outcome), "<error> " + message);
+      EXPECT_TRUE(isA<std::invalid_argument>(outcome->failure));
+    }
+    try {
+      store->fetchModificationDate(key);
+      FAIL() << key;
+    } catch (const std::invalid_argument& error) {
+      EXPECT_EQ(error.what(), message);
+    }
+  }
+  EXPECT_THAT(files->trace(), IsEmpty());
+  EXPECT_EQ(directory.read("store/manifest_v1.sqlite"), before);
+  EXPECT_THAT(accesses(), IsEmpty());
+  EXPECT_EQ(contents(), (Contents{{"key", "value"}}));
+}
+
+TEST_F(ReservedKeys, AreThoseNamesAloneAndNotTheirNeighbours) {
+  open();
+  for (const std::string key : {"manifest_v1.sqlit", "manifest_v1.sqlite-", "manifest_v1.sqlite-walnut",
+                                "Manifest_v1.sqlite", "_cellar_extended_attribute"}) {
+    put(key, "value");
+    EXPECT_EQ(get(key), "value") << key;
+  }
+}
+
+// --- Hostile keys ---
+
+TEST_F(HostileKeys, ThatNameADirectoryFailAndLeaveNothing) {
+  open();
+  directory.write("store/sub/file", "kept");
+  for (const std::string key : {"", ".", "..", "sub", "sub/"}) {
+    const Written written = watch(store->store(key, bytesOf("value")));
+    settle();
+    EXPECT_TRUE(isA<FileUtilsIoException>(written->failure)) << key << told(written);
+    EXPECT_EQ(get(key), "<miss>") << key;
+    EXPECT_EQ(drop(key), "<done>") << key;
+  }
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  EXPECT_EQ(directory.read("store/sub/file"), "kept");
+  put("key", "value");
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(HostileKeys, WithASlashAddressFilesBelow) {
+  open();
+  const Written refused = watch(store->store("a/b", bytesOf("value")));
+  settle();
+  EXPECT_TRUE(isA<FileUtilsIoException>(refused->failure)) << told(refused);
+  EXPECT_EQ(get("a/b"), "<miss>");
+  directory.makeDirectory("store/a");
+  put("a/b", "value");
+  EXPECT_EQ(directory.read("store/a/b"), "value");
+  EXPECT_EQ(get("a/b"), "value");
+  EXPECT_EQ(drop("a/b"), "<done>");
+  EXPECT_FALSE(directory.exists("store/a/b"));
+}
+
+TEST_F(HostileKeys, ThatAreTooLongForAFileNameFailAndTheLongestWorks) {
+  open();
+  const std::string longest(255, 'x');
+  put(longest, "value");
+  EXPECT_EQ(get(longest), "value");
+  for (const std::size_t length : {256U, 100'000U}) {
+    const std::string key(length, 'y');
+    const Written written = watch(store->store(key, bytesOf("value")));
+    settle();
+    EXPECT_TRUE(isA<FileUtilsIoException>(written->failure)) << told(written);
+    EXPECT_EQ(get(key), "<miss>");
+  }
+  EXPECT_EQ(rowsOnDisk().size(), 1U);
+}
+
+TEST_F(HostileKeys, ThatAreNotUtf8Work) {
+  open();
+  const std::string key = "\xff\xfe\x80'; DROP TABLE LarderManifest; --%s\n";
+  put(key, "value");
+  reopen();
+  EXPECT_EQ(get(key), "value");
+  EXPECT_EQ(accesses().size(), 1U);
+  EXPECT_EQ(drop(key), "<done>");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+}
+
+TEST_F(HostileKeys, WithAZeroByteLeaveOtherKeysAndTheManifestAlone) {
+  open();
+  put("a", "1");
+  watch(store->store(std::string("a\0b", 3), bytesOf("other")));
+  settle();
+  EXPECT_EQ(get("a"), "1");
+  watch(store->store(std::string("manifest_v1.sqlite\0", 19), bytesOf("other")));
+  settle();
+  reopen();
+  EXPECT_EQ(get("a"), "1");
+}
+
+// --- A store that has gone ---
+
+TEST_F(AGoneStore, FulfilsWhatWaitsOnItsWorkQueueAndDoesNothing) {
+  openWatched();
+  put("key", "value");
+  manifest->clearTrace();
+  files->clearTrace();
+  const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))),
+                                        watch(store->store("newer", nullptr, writing("x", 1))),
+                                        watch(store->removeItem("key")), watch(store->updateLastAccessDate("key"))};
+  const std::vector<Fetched> fetched = {watch(store->fetch("key")), watch(store->fetchFirst({"key"}, answering("x")))};
+  store.reset();
+  settle();
+  for (const Written& outcome : written) EXPECT_EQ(told(outcome), "<done>");
+  for (const Fetched& outcome : fetched) EXPECT_EQ(told(outcome), "<miss>");
+  EXPECT_THAT(manifest->trace(), IsEmpty());
+  EXPECT_THAT(files->trace(), IsEmpty());
+  EXPECT_THAT(accesses(), IsEmpty());
+}
+
+TEST_F(AGoneStore, FulfilsInlineWritesAndWritesNothing) {
+  options.inlineData = true;
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("x")));
+  store.reset();
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_THAT(keysInMedium(), IsEmpty());
+}
+
+TEST_F(AGoneStore, LeavesNoProvisionalRecordOfAWriteThatHasNotBegun) {
+  open();
+  bool called = false;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string&) {
+    called = true;
+    return 1U;
+  }));
+  ASSERT_TRUE(work().runNext());
+  EXPECT_EQ(rowsOnDisk().size(), 1U);
+  store.reset();
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_FALSE(called);
+}
+
+TEST_F(AGoneStore, LeavesNeitherRecordNorFileOfAnOverwriteThatHasNotBegun) {
+  open();
+  put("key", "old");
+  const Written written = watch(store->store("key", bytesOf("new")));
+  ASSERT_TRUE(work().runNext());
+  store.reset();
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(AGoneStore, AnswersAFetchThatWaitsForItsFileWithNothing) {
+  open();
+  put("key", "value");
+  const Fetched fetched = watch(store->fetch("key"));
+  ASSERT_TRUE(work().runNext());
+  files->clearTrace();
+  store.reset();
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_THAT(files->trace(), IsEmpty());
+}
+
+TEST_F(AGoneStore, IsKeptAliveByATaskThatRuns) {
+  open();
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    store.reset();
+    files->writeFile(path, bytesOf("value"));
+    return 5U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  open();
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(AGoneStore, LoadsNothingAndTellsNoSize) {
+  openWatchedUnloaded();
+  store.reset();
+  settle();
+  EXPECT_EQ(manifest->calls(ManifestCall::Load), 0U);
+  openWatched();
+  watch(store->store("key", bytesOf("value")));
+  ASSERT_TRUE(work().runNext());
+  ASSERT_TRUE(file().runNext());
+  store.reset();
+  settle();
+  EXPECT_THAT(sizes, IsEmpty());
+}
+
+TEST_F(AGoneStore, CancelsItsTimer) {
+  openWatched();
+  ManualExecutor& queue = work();
+  EXPECT_THAT(queue.armedDelays(), ElementsAre(300 * kSecond));
+  store.reset();
+  EXPECT_THAT(queue.armedDelays(), IsEmpty());
+}
+
+// --- Queues that fail ---
+
+TEST_F(AFailingQueue, ThatDropsItsTasksBreaksTheirPromises) {
+  open();
+  put("key", "value");
+  const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))), watch(store->removeItem("key")),
+                                        watch(store->updateLastAccessDate("key"))};
+  const Fetched fetched = watch(store->fetch("key"));
+  work().dropAll();
+  for (const Written& outcome : written) {
+    EXPECT_TRUE(isA<std::future_error>(outcome->failure)) << told(outcome);
+    EXPECT_EQ(outcome->completions, 1);
+  }
+  EXPECT_TRUE(isA<std::future_error>(fetched->failure)) << told(fetched);
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(AFailingQueue, ThatDropsTheReadingBreaksTheFetch) {
+  open();
+  put("key", "value");
+  const Fetched fetched = watch(store->fetch("key"));
+  ASSERT_TRUE(work().runNext());
+  file().dropAll();
+  EXPECT_TRUE(isA<std::future_error>(fetched->failure)) << told(fetched);
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(AFailingQueue, ThatDropsAWriteLeavesNoRecordWithoutAFile) {
+  open();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  ASSERT_TRUE(work().runNext());
+  file().dropAll();
+  EXPECT_TRUE(isA<std::future_error>(written->failure)) << told(written);
+  reopen();
+  EXPECT_EQ(get("key"), "<miss>");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+}
+
+TEST_F(AFailingQueue, ThatDroppedAWriteOnceDoesNotCostALaterValueOfTheKey) {
+  open();
+  watch(store->store("key", bytesOf("first")));
+  ASSERT_TRUE(work().runNext());
+  file().dropAll();
+  put("key", "second");
+  reopen();
+  EXPECT_EQ(get("key"), "second");
+}
+
+TEST_F(AFailingQueue, ThatDroppedAWriteOnceDoesNotKeepALaterRemovalFromTheFile) {
+  open();
+  watch(store->store("key", bytesOf("first")));
+  ASSERT_TRUE(work().runNext());
+  file().dropAll();
+  put("key", "second");
+  EXPECT_EQ(drop("key"), "<done>");
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+}
+
+TEST_F(AFailingQueue, ThatTakesNoWorkFailsTheFuturesAndThrowsNothing) {
+  open();
+  put("key", "value");
+  work().throwOnDispatch(true);
+  const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))),
+                                        watch(store->store("new", nullptr, writing("x", 1))),
+                                        watch(store->removeItem("key")), watch(store->updateLastAccessDate("key"))};
+  const Fetched fetched = watch(store->fetch("key"));
+  for (const Written& outcome : written) EXPECT_EQ(told(outcome), "<error> The queue takes no tasks.");
+  EXPECT_EQ(told(fetched), "<error> The queue takes no tasks.");
+  work().throwOnDispatch(false);
+  EXPECT_EQ(contents(), (Contents{{"key", "value"}}));
+}
+
+TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsAFirstWriteAndLeavesAMiss) {
+  open();
+  file().throwOnDispatch(true);
+  const Written written = watch(store->store("key", bytesOf("x")));
+  work().runAll();
+  file().throwOnDispatch(false);
+  EXPECT_EQ(told(written), "<error> The queue takes no tasks.");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  put("key", "value");
+  EXPECT_EQ(drop("key"), "<done>");
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsAnOverwriteAndLeavesNoFileWithoutARecord) {
+  open();
+  put("key", "old");
+  file().throwOnDispatch(true);
+  const Written written = watch(store->store("key", bytesOf("new")));
+  work().runAll();
+  file().throwOnDispatch(false);
+  EXPECT_EQ(told(written), "<error> The queue takes no tasks.");
+  EXPECT_EQ(valueFiles().size(), rowsOnDisk().size());
+}
+
+TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsTheFetch) {
+  open();
+  put("key", "value");
+  file().throwOnDispatch(true);
+  const Fetched fetched = watch(store->fetch("key"));
+  work().runAll();
+  file().throwOnDispatch(false);
+  EXPECT_EQ(told(fetched), "<error> The queue takes no tasks.");
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(AFailingQueue, ThatTakesNoEvictionLeavesNoFileWithoutARecord) {
+  options.capacity = 1;
+  open();
+  put("old", "value");
+  file().throwOnDispatch(true);
+  const Written written = watch(store->store("new", bytesOf("x")));
+  work().runAll();
+  file().throwOnDispatch(false);
+  EXPECT_EQ(told(written), "<error> The queue takes no tasks.");
+  EXPECT_EQ(valueFiles().size(), rowsOnDisk().size());
+}
+
+// --- After invalidation ---
+
+TEST_F(CreatingAStore, AfterInvalidationEveryOperationIsRefused) {
+  open();
+  put("key", "value");
+  file().onDispatch = [this] { file().runAll(); };
+  store->invalidate();
+  files->clearTrace();
+  const std::vector<Written> written = {watch(store->store("key", bytesOf("x"))),
+                                        watch(store->store("key", nullptr, writing("x", 1))),
+                                        watch(store->removeItem("key")), watch(store->updateLastAccessDate("key")),
+                                        watch(store->store("manifest_v1.sqlite", bytesOf("x")))};
+  const std::vector<Fetched> fetched = {
+      watch(store->fetch("key")), watch(store->fetch("key", [](const std::string&) { return Bytes(); })),
+      watch(store->fetch("key", answering("x"))), watch(store->fetchFirst({"key"}, answering("x"))),
+      watch(store->fetchFirst({}, answering("x")))};
+  for (const Written& outcome : written) EXPECT_EQ(told(outcome), "<error> " + kInvalid);
+  for (const Fetched& outcome : fetched) EXPECT_EQ(told(outcome), "<error> " + kInvalid);
+  EXPECT_TRUE(isA<InvalidatedException>(fetched.front()->failure));
+  EXPECT_THROW(store->getAllKeys(), InvalidatedException);
+  EXPECT_THROW(store->fetchModificationDate("key"), InvalidatedException);
+  EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
+  EXPECT_THAT(files->trace(), IsEmpty());
+  EXPECT_EQ(valueFile("key"), "value");
+}
+
+TEST_F(StoringInline, AfterInvalidationIsRefusedWithAWriterToo) {
+  open();
+  file().onDispatch = [this] { file().runAll(); };
+  store->invalidate();
+  EXPECT_EQ(told(watch(store->store("key", bytesOf("x")))), "<error> " + kInvalid);
+  EXPECT_EQ(told(watch(store->store("key", nullptr, writing("x", 1)))), "<error> " + kInvalid);
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar

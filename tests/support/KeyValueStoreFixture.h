@@ -1,0 +1,329 @@
+#pragma once
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <algorithm>
+#include <cstddef>
+#include <cstdint>
+#include <ctime>
+#include <exception>
+#include <functional>
+#include <future>
+#include <map>
+#include <memory>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "DiskCache.h"
+#include "DiskCacheManifest.h"
+#include "Future.h"
+#include "LarderException.h"
+#include "PersistentKeyValueStore.h"
+#include "TrashCollector.h"
+#include "support/FaultyFileUtils.h"
+#include "support/FaultyManifest.h"
+#include "support/LogCapture.h"
+#include "support/ManagerServices.h"
+#include "support/ManualQueue.h"
+#include "support/RecordingAnalytics.h"
+#include "support/TemporaryDirectory.h"
+#include "support/TestClock.h"
+
+namespace velmora::mobile::xplat::cellar::test {
+
+using Bytes = std::vector<unsigned char>;
+using FetchResult = PersistentKeyValueStore::FetchResult;
+
+inline Bytes bytesOf(const std::string& text) { return {text.begin(), text.end()}; }
+inline std::string textOf(const Bytes& bytes) { return {bytes.begin(), bytes.end()}; }
+
+// What an exception says; "" for none.
+inline std::string whatOf(const std::exception_ptr& failure) {
+  if (failure == nullptr) return "";
+  try {
+    std::rethrow_exception(failure);
+  } catch (const std::exception& error) {
+    return error.what();
+  } catch (...) {
+    return "something else";
+  }
+}
+
+template <class Exception> bool isA(const std::exception_ptr& failure) {
+  if (failure == nullptr) return false;
+  try {
+    std::rethrow_exception(failure);
+  } catch (const Exception&) {
+    return true;
+  } catch (...) {
+    return false;
+  }
+}
+
+// What has become of a future, told by its callback.
+template <class T> struct Outcome {
+  int completions = 0;
+  std::exception_ptr failure;
+  std::optional<T> value;
+
+  bool isPending() const { return completions == 0; }
+  bool hasSucceeded() const { return completions == 1 && failure == nullptr; }
+};
+
+struct Done {};
+using Written = std::shared_ptr<Outcome<Done>>;
+using Fetched = std::shared_ptr<Outcome<std::unique_ptr<FetchResult>>>;
+
+inline Written watch(Future<void> future) {
+  auto outcome = std::make_shared<Outcome<Done>>();
+  future.then(nullptr, [outcome](std::future<void>& result) {
+    ++outcome->completions;
+    try {
+      result.get();
+      outcome->value = Done();
+    } catch (...) {
+      outcome->failure = std::current_exception();
+    }
+  });
+  return outcome;
+}
+
+inline Fetched watch(Future<std::unique_ptr<FetchResult>> future) {
+  auto outcome = std::make_shared<Outcome<std::unique_ptr<FetchResult>>>();
+  future.then(nullptr, [outcome](std::future<std::unique_ptr<FetchResult>>& result) {
+    ++outcome->completions;
+    try {
+      outcome->value = result.get();
+    } catch (...) {
+      outcome->failure = std::current_exception();
+    }
+  });
+  return outcome;
+}
+
+// "<pending>", "<miss>", "<error>" with its text, or the value.
+inline std::string told(const Fetched& fetched) {
+  if (fetched->isPending()) return "<pending>";
+  if (fetched->failure != nullptr) return "<error> " + whatOf(fetched->failure);
+  const std::unique_ptr<FetchResult>& result = *fetched->value;
+  return result == nullptr ? "<miss>" : textOf(result->value);
+}
+
+// "<pending>", "<done>" or "<error>" with its text.
+inline std::string told(const Written& written) {
+  if (written->isPending()) return "<pending>";
+  return written->failure == nullptr ? "<done>" : "<error> " + whatOf(written->failure);
+}
+
+// A store with everything around it under the test's control: its queues, its files, its collector and the time.
+class KeyValueStoreFixture : public testing::Test {
+ public:
+  static constexpr std::int64_t kSecond = 1'000'000'000;
+  static constexpr std::time_t kStart = 1'000'000;
+
+  struct Options {
+    std::optional<std::uint64_t> capacity;
+    long staleAge = 1000;
+    bool inlineData = false;
+    unsigned int batchSize = 50;
+    std::shared_ptr<DiskCacheManifestInterface> manifest;
+  };
+
+  // --- The store's life ---
+
+  // Creates the store; its loading waits on the work queue.
+  void openUnloaded() {
+    store = PersistentKeyValueStore::createPersistentKeyValueStore(
+        storePath(), directory.file("temporary"), "larder", options.capacity, options.staleAge, options.inlineData,
+        queues, trash, reporter, options.manifest, files, [this](unsigned int size) { sizes.push_back(size); },
+        options.batchSize);
+  }
+
+  void open() {
+    openUnloaded();
+    settle();
+  }
+
+  // The store over a manifest that fails on demand and keeps its records in `medium`.
+  void openWatched() {
+    openWatchedUnloaded();
+    settle();
+    manifest->clearTrace();
+    files->clearTrace();
+  }
+
+  void openWatchedUnloaded() {
+    manifest = std::make_shared<FaultyManifest>(std::make_shared<DiskCacheManifest>(
+        std::make_unique<MemoryPersistence>(medium), std::make_shared<ManualExecutor>(), nullptr));
+    options.manifest = manifest;
+    openUnloaded();
+  }
+
+  void close() {
+    settle();
+    store.reset();
+    settle();
+    options.manifest.reset();
+    manifest.reset();
+  }
+
+  void reopen() {
+    close();
+    open();
+  }
+
+  void reopenWatched() {
+    close();
+    openWatched();
+  }
+
+  // --- The queues of the latest store ---
+
+  ManualExecutor& work() const { return *queues->workQueue(queues->workQueueCount() - 1); }
+  ManualExecutor& file() const { return *queues->queue(queues->queueCount() - 1); }
+  void settle() const { queues->runAll(); }
+  bool fire(long seconds) const { return work().fireTimer(seconds * kSecond); }
+
+  // --- Operations, to the end ---
+
+  void put(const std::string& key, const std::string& value) {
+    const Written written = watch(store->store(key, bytesOf(value)));
+    settle();
+    ASSERT_EQ(told(written), "<done>") << key;
+  }
+
+  std::string get(const std::string& key) {
+    const Fetched fetched = watch(store->fetch(key));
+    settle();
+    return told(fetched);
+  }
+
+  std::string drop(const std::string& key) {
+    const Written removed = watch(store->removeItem(key));
+    settle();
+    return told(removed);
+  }
+
+  // How a clear ended.
+  std::string clear() {
+    std::string ending = "<pending>";
+    store->clear([&ending] { ending = "<done>"; },
+                 [&ending](const std::exception& error) { ending = std::string("<error> ") + error.what(); });
+    settle();
+    return ending;
+  }
+
+  // --- What is there ---
+
+  std::string storePath() const { return directory.file("store"); }
+  std::string pathOf(const std::string& key) const { return storePath() + "/" + key; }
+
+  // The names of the value files.
+  std::vector<std::string> valueFiles() const {
+    std::vector<std::string> names = directory.names("store");
+    const auto isManifest = [](const std::string& name) { return name.rfind("manifest_v1.sqlite", 0) == 0; };
+    names.erase(std::remove_if(names.begin(), names.end(), isManifest), names.end());
+    return names;
+  }
+
+  std::string valueFile(const std::string& key) const { return directory.read("store/" + key); }
+
+  // Every key with what a fetch says of it.
+  std::map<std::string, std::string> contents() {
+    std::map<std::string, std::string> values;
+    for (const std::string& key : store->getAllKeys()) values[key] = get(key);
+    return values;
+  }
+
+  // The rows of the database, seen by a connection of the test's own: "key filename size inline date date data".
+  std::vector<std::string> rowsOnDisk() const {
+    sqlite3* database = nullptr;
+    const std::string path = pathOf("manifest_v1.sqlite");
+    EXPECT_EQ(sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READWRITE, nullptr), SQLITE_OK) << path;
+    std::vector<std::string> rows;
+    const auto collect = [](void* target, int, char** values, char**) {
+      static_cast<std::vector<std::string>*>(target)->emplace_back(values[0]);
+      return 0;
+    };
+    EXPECT_EQ(sqlite3_exec(database,
+                           "SELECT key || ' ' || filename || ' ' || size || ' ' || has_inline_data || ' ' || "
+                           "modification_date || ' ' || last_access_date || ' ' || ifnull(inline_data, '-') "
+                           "FROM LarderManifest ORDER BY key",
+                           collect, &rows, nullptr),
+              SQLITE_OK);
+    sqlite3_close(database);
+    return rows;
+  }
+
+  std::vector<std::string> keysInMedium() const {
+    std::vector<std::string> keys;
+    for (const auto& row : medium->rows()) keys.push_back(row.first);
+    return keys;
+  }
+
+  // From now on every call of the watched manifest and every change or reading of files, in one order, in `journal`.
+  void keepJournal() {
+    journal.clear();
+    manifest->onCall = [this](ManifestCall, const std::string& text) { journal.push_back(text); };
+    files->onCall = [this](Operation operation, const std::string& path) {
+      static const std::map<Operation, std::string> names = {{Operation::ReadFile, "readFile"},
+                                                             {Operation::WriteFile, "writeFile"},
+                                                             {Operation::DeleteFile, "deleteFile"},
+                                                             {Operation::CreateDirectory, "createDirectory"}};
+      const auto name = names.find(operation);
+      if (name != names.end()) journal.push_back(name->second + " " + path.substr(path.rfind('/') + 1));
+    };
+  }
+
+  std::vector<std::string> takeJournal() { return std::exchange(journal, {}); }
+
+  static std::string purgeLine(const std::exception& error) {
+    return std::string("Store \"larder\" purged due to corrupted manifest. ") + error.what();
+  }
+
+  static std::vector<std::string> errorLines(const LogCapture& log) {
+    std::vector<std::string> messages;
+    for (const LogLine& line : log.lines()) {
+      if (line.severity == google::GLOG_ERROR) messages.push_back(line.message);
+    }
+    return messages;
+  }
+
+  // Each access event as "hit key age size".
+  std::vector<std::string> accesses() const {
+    std::vector<std::string> lines;
+    for (const LoggedEvent& event : events->named("qzpkvs_access")) {
+      const JsonValue json = event.json();
+      EXPECT_EQ(json.at("store_name"), "larder");
+      EXPECT_EQ(json.at("tag"), "");
+      lines.push_back(json.at("hit").dump() + " " + json.at("key").get<std::string>() + " " +
+                      json.at("itemAge").dump() + " " + json.at("size").dump());
+    }
+    return lines;
+  }
+
+  Options options;
+  TestClock clock{kStart};
+  TemporaryDirectory directory;
+  std::shared_ptr<FaultyFileUtils> files = std::make_shared<FaultyFileUtils>();
+  std::shared_ptr<EventLog> events = std::make_shared<EventLog>();
+  std::shared_ptr<AnalyticsEventReporter> reporter = recordingReporter(events);
+  std::shared_ptr<ManualQueueFactory> trashQueues = std::make_shared<ManualQueueFactory>();
+  std::shared_ptr<RecordingTrashCollector> trash = std::make_shared<RecordingTrashCollector>(
+      directory.file("trash"), std::make_shared<FileUtils>(), nullptr, trashQueues);
+  std::shared_ptr<MemoryMedium> medium = std::make_shared<MemoryMedium>();
+  std::shared_ptr<FaultyManifest> manifest;
+  std::vector<std::string> journal;
+  std::vector<unsigned int> sizes;  // what the size callback was told
+  std::shared_ptr<ManualQueueFactory> queues = std::make_shared<ManualQueueFactory>();
+  std::shared_ptr<PersistentKeyValueStore> store;
+
+  const ManifestCorruptedException corrupted{"It is rotten.", 11};
+  const ManifestPersistenceException unwritable{"The disk is full.", 13};
+};
+
+}  // namespace velmora::mobile::xplat::cellar::test

@@ -1,0 +1,39 @@
+#pragma once
+
+#include <ostream>
+#include <string>
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// Where a command writes: plain lines, or a terminal that understands colours and lines that change.
+class Console {
+ public:
+  Console(std::ostream& out, bool isTerminal, bool hasColours);
+
+  // Standard output as it is: colours only on a terminal, and not when NO_COLOR is set.
+  static Console standardOutput();
+
+  bool isTerminal() const;
+
+  void heading(const std::string& text);
+  void line(const std::string& text);  // indented
+  void good(const std::string& text);  // indented
+  void bad(const std::string& text);   // indented
+  void raw(const std::string& text);   // as it stands
+
+  void verdict(const std::string& text, bool isGood);
+
+  std::string dim(const std::string& text) const;
+
+  // Replaces the line that the cursor is in. On terminals only.
+  void rewriteLine(const std::string& text);
+
+ private:
+  std::string coloured(const char* code, const std::string& text) const;
+
+  std::ostream& out_;
+  const bool isTerminal_;
+  const bool hasColours_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar::tools

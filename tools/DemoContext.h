@@ -1,0 +1,90 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <map>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "Checks.h"
+#include "Configuration.h"
+#include "DemoApp.h"
+#include "ErrorLog.h"
+#include "EventLog.h"
+#include "SourceFiles.h"
+#include "Trees.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+class Console;
+
+// What the steps of the demonstration share: the application as it runs now, and what its stores should hold.
+class DemoContext {
+ public:
+  using Definition = std::shared_ptr<const StoreDefinition>;
+
+  // `root` is absolute; `source` and `console` outlive this.
+  DemoContext(Console& console, const SourceFiles& source, const std::string& root);
+  DemoContext(const DemoContext&) = delete;
+  DemoContext& operator=(const DemoContext&) = delete;
+
+  // Ends the run of the application that there is, and starts another without asking for any store.
+  void launch(const std::string& release, const std::string& user);
+
+  // The same with all stores opened.
+  void start(const std::string& release, const std::string& user);
+
+  // The same, saying how long it took.
+  void startTimed(const std::string& release, const std::string& user);
+
+  // Starts the same release for the same user again.
+  void restartTimed();
+
+  void stop();
+
+  bool isRunning() const;
+
+  // Valid while it is running.
+  DemoApp& app();
+
+  std::vector<Definition> stores();
+  std::vector<Definition> unmanagedStores();
+  bool belongsToSession(const StoreDefinition& store);
+
+  // The store's directory as it should be, below the root.
+  std::string shortDirectory(const StoreDefinition& store);
+
+  // The events of that type that managers have reported so far, oldest first.
+  std::vector<JsonValue> storeEvents(const std::string& type) const;
+
+  // Checks that each unmanaged store holds what `contents` says, counted by a walk of our own.
+  void checkContents();
+
+  // Checks that the work in the background comes to its end and leaves no trash.
+  void checkTrashVanishes();
+
+  // Checks that a store with keys holds so many values.
+  void checkKeys(const std::string& store, std::size_t count);
+
+  // Checks that nobody has logged an error since the last call.
+  void checkLog();
+
+  // Keeps each store's size if it is the greatest so far.
+  void noteSizes();
+
+  Console& console;
+  Checks checks;
+  const SourceFiles& source;
+  const std::string root;
+  EventLog events;
+  std::map<std::string, TreeSize> contents;  // by store, for the unmanaged ones
+  std::map<std::string, TreeSize> fullest;   // by store
+  std::chrono::nanoseconds measuringTime{0};
+
+ private:
+  ErrorLog log_;
+  std::unique_ptr<DemoApp> app_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,26 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <string>
+
+#include "Trees.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// "850 B", "1.2 KB", "12.0 MB": powers of 1024, as in the configuration.
+std::string formatSize(std::uint64_t bytes);
+
+// "20,000"
+std::string formatCount(std::uint64_t count);
+
+// "1 file", "20,000 files"
+std::string formatCount(std::uint64_t count, const std::string& singular, const std::string& plural);
+
+// "0.3 ms", "45 ms", "1.2 s"
+std::string formatTime(std::chrono::nanoseconds duration);
+
+// "1 file, 850 B"
+std::string formatFiles(const TreeSize& size);
+
+}  // namespace velmora::mobile::xplat::cellar::tools

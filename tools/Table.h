@@ -1,0 +1,35 @@
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <vector>
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// Rows of text under a header, set in columns that are as wide as they need to be.
+class Table {
+ public:
+  enum class Align { Left, Right };
+
+  struct Column {
+    std::string title;
+    Align align;
+  };
+
+  explicit Table(std::vector<Column> columns);
+
+  // One cell a column.
+  void addRow(std::vector<std::string> cells);
+
+  // The lines, each indented and ended. A column that is empty throughout still shows its title.
+  std::string text() const;
+
+ private:
+  std::string line(const std::vector<std::string>& cells) const;
+
+  std::vector<Column> columns_;
+  std::vector<std::size_t> widths_;
+  std::vector<std::vector<std::string>> rows_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,94 @@
+#include <glog/logging.h>
+
+#include <CLI/CLI.hpp>
+#include <exception>
+#include <iostream>
+#include <string>
+#include <vector>
+
+#include "Console.h"
+#include "Demo.h"
+#include "InputError.h"
+
+namespace {
+
+namespace tools = velmora::mobile::xplat::cellar::tools;
+
+constexpr int kPassed = 0;
+constexpr int kFailed = 1;
+constexpr int kUsage = 2;
+
+constexpr const char* kVersion = "cellar " CELLAR_VERSION;
+
+// The log goes where a command sends it; on the terminal it would tear the output apart.
+void keepLogOffTheTerminal(const char* program) {
+  google::InitGoogleLogging(program);
+  for (int severity = 0; severity < google::NUM_SEVERITIES; ++severity) google::SetLogDestination(severity, "");
+  FLAGS_stderrthreshold = google::GLOG_FATAL;
+}
+
+void describe(CLI::App& app) {
+  app.description("Cellar manages an application's storage on a device. This program shows it at work.");
+  app.footer(
+      "Example:\n  cellar demo ~/Pictures\n\nExit status: 0 when all checks passed, 1 when one failed, 2 for "
+      "usage and input errors.");
+  app.set_version_flag("--version", kVersion);
+  app.require_subcommand(1);
+}
+
+CLI::App* addDemo(CLI::App& app, tools::DemoOptions& options) {
+  CLI::App* const demo = app.add_subcommand("demo", "Play a day in the life of an application's storage on real files");
+  demo->add_option("DIRECTORY", options.directory, "Whose files to use")->capture_default_str();
+  demo->add_option("--root", options.root,
+                   "Keep the stores in this directory, with the log and the analytics events, and leave what remains\n"
+                   "there to be looked at. It must be new, empty or of an earlier demo, which is cleared.\n"
+                   "Without it: a temporary directory, removed at the end")
+      ->type_name("DIR");
+  demo->footer(
+      "Stores are filled, measured, evicted, retired by an update, cleaned up after another user, trashed and\n"
+      "cleansed, and each step is checked against the file system. Files are copied, at most 20,000 and 300 MB\n"
+      "of them; nothing is changed in DIRECTORY.\n\n"
+      "Example:\n  cellar demo /usr/share/doc --root /tmp/cellar-demo");
+  return demo;
+}
+
+int report(const std::string& problem) {
+  std::cerr << "cellar: " << problem << std::endl;
+  return kUsage;
+}
+
+int runProgram(int argc, char** argv) {
+  CLI::App app;
+  tools::DemoOptions demoOptions;
+  demoOptions.directory = "/usr/share";
+  app.name("cellar");
+  describe(app);
+  addDemo(app, demoOptions);
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::Success& wish) {
+    return app.exit(wish);  // help or version
+  } catch (const CLI::ParseError& error) {
+    const std::vector<std::string> unknown = app.remaining();
+    if (app.get_subcommands().empty() && !unknown.empty() && unknown.front().front() != '-') {
+      return report("no command '" + unknown.front() + "' (see cellar --help)");
+    }
+    return report(std::string(error.what()) + " (see cellar --help)");
+  }
+  tools::Console console = tools::Console::standardOutput();
+  return tools::runDemo(demoOptions, console) ? kPassed : kFailed;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  keepLogOffTheTerminal(argv[0]);
+  try {
+    return runProgram(argc, argv);
+  } catch (const tools::InputError& error) {
+    return report(error.what());
+  } catch (const std::exception& error) {
+    std::cerr << "cellar: " << error.what() << std::endl;
+    return kFailed;
+  }
+}
