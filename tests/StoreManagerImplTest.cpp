@@ -1180,9 +1180,10 @@ TEST_F(StoreManagerImplTest, ReportsPrunesAndLookupsFromManyThreadsLeaveTheRight
   EXPECT_EQ(initializations, 4U);
 }
 
-TEST_F(StoreManagerImplTest, ARoundWhoseStoresFinishAtTheSameTimeEnds) {
-  constexpr std::size_t kThreads = 4;
+TEST_F(StoreManagerImplTest, ARoundWhoseLastStoresFinishAtTheSameTimeEnds) {
   constexpr std::size_t kStores = 16;
+  constexpr std::size_t kThreads = 4;  // more than there may be processors: one that is interrupted comes late
+  reporter = nullptr;
   Stores definitions;
   for (std::size_t i = 0; i < kStores; ++i) definitions["s" + std::to_string(i)] = fake("s" + std::to_string(i));
   build(manager(definitions, 0, 1));
@@ -1191,14 +1192,12 @@ TEST_F(StoreManagerImplTest, ARoundWhoseStoresFinishAtTheSameTimeEnds) {
     all.push_back(get("s" + std::to_string(i)));
     all.back()->reportSize(1);
   }
-  for (std::size_t round = 1; round <= 400; ++round) {
+  for (std::size_t round = 1; round <= 1500; ++round) {
     all[0]->reportSize(static_cast<unsigned int>(round));
     settle();
     for (const auto& store : all) ASSERT_EQ(store->pruneCount(), round) << "the round before has not ended";
-    std::vector<PruneRequest> requests;
-    for (const auto& store : all) requests.push_back(store->takePrune());
     test::runOnThreads(kThreads, [&](std::size_t thread) {
-      for (std::size_t i = thread; i < kStores; i += kThreads) requests[i].onSuccess();
+      for (std::size_t i = thread; i < kStores; i += kThreads) all[i]->finishPrune();
     });
     clock_.advance(1);
   }

@@ -130,6 +130,7 @@ class KeyValueStoreFixture : public testing::Test {
     long staleAge = 1000;
     bool inlineData = false;
     unsigned int batchSize = 50;
+    bool hasSizeCallback = true;
     std::shared_ptr<DiskCacheManifestInterface> manifest;
   };
 
@@ -137,10 +138,11 @@ class KeyValueStoreFixture : public testing::Test {
 
   // Creates the store; its loading waits on the work queue.
   void openUnloaded() {
+    std::function<void(unsigned int)> onSizeChange;
+    if (options.hasSizeCallback) onSizeChange = [this](unsigned int size) { sizes.push_back(size); };
     store = PersistentKeyValueStore::createPersistentKeyValueStore(
         storePath(), directory.file("temporary"), "larder", options.capacity, options.staleAge, options.inlineData,
-        queues, trash, reporter, options.manifest, files, [this](unsigned int size) { sizes.push_back(size); },
-        options.batchSize);
+        queues, trash, reporter, options.manifest, files, std::move(onSizeChange), options.batchSize);
   }
 
   void open() {

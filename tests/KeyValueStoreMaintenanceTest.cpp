@@ -1,0 +1,1206 @@
+// How a key-value store keeps within its limits: expiry, capacity, clearing, batched deletion, invalidation.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstddef>
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <future>
+#include <limits>
+#include <map>
+#include <memory>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "DiskCacheManifest.h"
+#include "LarderException.h"
+#include "PersistentKeyValueStore.h"
+#include "support/Barrier.h"
+#include "support/KeyValueStoreFixture.h"
+
+namespace velmora::mobile::xplat::cellar {
+namespace {
+
+using test::bytesOf;
+using test::Bytes;
+using test::Fetched;
+using test::isA;
+using test::KeyValueStoreFixture;
+using test::Latch;
+using test::LogCapture;
+using test::ManifestCall;
+using test::Operation;
+using test::told;
+using test::watch;
+using test::whatOf;
+using test::Written;
+using testing::Contains;
+using testing::Each;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::Not;
+using testing::UnorderedElementsAre;
+
+using Contents = std::map<std::string, std::string>;
+using Batch = std::vector<DiskCacheItem>;
+using Provider = std::function<const Batch()>;
+
+const std::string kInvalid =
+    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
+
+class MaintenanceFixture : public KeyValueStoreFixture {
+ protected:
+  void putMany(int count, const std::string& value = "v") {
+    for (int i = 0; i < count; ++i) put("key" + std::to_string(i), value);
+  }
+
+  DiskCacheItem itemOf(const std::string& key, bool isInline = false) const {
+    return {key, key, 1, isInline, 0, 0, nullptr};
+  }
+
+  // Yields the batches one after the other, then empty ones.
+  static Provider yielding(std::vector<Batch> batches) {
+    return [batches = std::move(batches), next = std::make_shared<std::size_t>(0)]() -> const Batch {
+      return *next < batches.size() ? batches[(*next)++] : Batch();
+    };
+  }
+
+  // How a batched deletion ends, in `ending`.
+  std::function<void()> onSuccess() {
+    return [this] { ending += "<done>"; };
+  }
+  std::function<void(const std::exception&)> onError() {
+    return [this](const std::exception& error) { ending += std::string("<error> ") + error.what(); };
+  }
+
+  // Whoever puts something on the file queue finds it done.
+  void runFilesAtOnce() const {
+    file().onDispatch = [&queue = file()] { queue.runAll(); };
+  }
+
+  std::string ending;
+};
+
+class Expiry : public MaintenanceFixture {};
+class Capacity : public MaintenanceFixture {};
+class Clearing : public MaintenanceFixture {};
+class DeletingInBatches : public MaintenanceFixture {};
+class Invalidation : public MaintenanceFixture {};
+class SizeReport : public MaintenanceFixture {};
+
+// --- Expiry ---
+
+TEST_F(Expiry, KeepsAnItemThatWasUsedExactlyAtTheCutoff) {
+  open();
+  put("key", "value");
+  clock.set(kStart + 1000);
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(Expiry, TakesAnItemThatWasUsedASecondBeforeTheCutoffWithItsFile) {
+  open();
+  put("key", "value");
+  clock.set(kStart + 1001);
+  put("fresh", "value");
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_THAT(store->getAllKeys(), ElementsAre("fresh"));
+  EXPECT_THAT(valueFiles(), ElementsAre("fresh"));
+  EXPECT_EQ(rowsOnDisk().size(), 1U);
+}
+
+TEST_F(Expiry, GoesByTheLastUseAndNotByTheDateOfWriting) {
+  open();
+  put("used", "value");
+  put("idle", "value");
+  clock.set(kStart + 900);
+  EXPECT_EQ(get("used"), "value");
+  clock.set(kStart + 1500);
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_THAT(store->getAllKeys(), ElementsAre("used"));
+}
+
+TEST_F(Expiry, ComesAnHourAfterTheLastOne) {
+  open();
+  ASSERT_TRUE(fire(300));
+  EXPECT_THAT(work().armedDelays(), Not(Contains(3600 * kSecond)));  // only when the cycle is through
+  settle();
+  EXPECT_THAT(work().armedDelays(), UnorderedElementsAre(120 * kSecond, 3600 * kSecond));  // and the manifest's own
+  ASSERT_TRUE(fire(3600));
+  settle();
+  EXPECT_THAT(work().armedDelays(), UnorderedElementsAre(120 * kSecond, 3600 * kSecond));
+}
+
+TEST_F(Expiry, WithAStaleAgeBeyondTheClockTakesNothing) {
+  options.staleAge = kStart + 1;
+  openWatched();
+  put("key", "value");
+  manifest->setItem({"ancient", "ancient", 1, false, 0, 0, nullptr});
+  manifest->clearTrace();
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_THAT(manifest->trace(), ElementsAre("pruneOldEntries 0 50"));
+  EXPECT_THAT(store->getAllKeys(), UnorderedElementsAre("key", "ancient"));
+}
+
+TEST_F(Expiry, CutsAtZeroWhenTheStaleAgeIsTheClockAndAboveItWhenItIsLess) {
+  options.staleAge = kStart;
+  openWatched();
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_THAT(manifest->trace(), ElementsAre("pruneOldEntries 0 50"));
+  store->overrideConfiguration(kStart - 1);
+  manifest->clearTrace();
+  ASSERT_TRUE(fire(3600));
+  settle();
+  EXPECT_THAT(manifest->trace(), ElementsAre("pruneOldEntries 1 50"));
+}
+
+TEST_F(Expiry, FollowsAnOverriddenStaleAgeFromTheNextCycleOn) {
+  open();
+  put("key", "value");
+  clock.advance(500);
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_EQ(store->getAllKeys().size(), 1U);
+  store->overrideConfiguration(499);
+  EXPECT_EQ(store->getAllKeys().size(), 1U);
+  ASSERT_TRUE(fire(3600));
+  settle();
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+}
+
+TEST_F(Expiry, WithTheSmallestAndTheLargestStaleAgeGoesOn) {
+  open();
+  put("key", "value");
+  store->overrideConfiguration(std::numeric_limits<long>::min());
+  ASSERT_TRUE(fire(300));
+  settle();
+  store->overrideConfiguration(std::numeric_limits<long>::max());
+  put("key", "value");
+  ASSERT_TRUE(fire(3600));
+  settle();
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
+}
+
+TEST_F(Expiry, ReportsTheSizeBeforeAndAfter) {
+  open();
+  put("key", "value");
+  sizes.clear();
+  clock.advance(1001);
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_THAT(sizes, ElementsAre(5U, 0U));
+}
+
+TEST_F(Expiry, TakesFiftyAtATimeAndWaitsForTheirFiles) {
+  openWatched();
+  putMany(101);
+  clock.advance(1001);
+  keepJournal();
+  ASSERT_TRUE(fire(300));
+  EXPECT_THAT(takeJournal(), IsEmpty());  // the first step is a task of its own
+  const auto deletions = [this] {
+    std::size_t count = 0;
+    for (const std::string& line : takeJournal()) count += line.rfind("deleteFile ", 0) == 0 ? 1U : 0U;
+    return count;
+  };
+  const std::vector<std::size_t> left = {51, 1, 0};
+  const std::vector<std::size_t> gone = {50, 50, 1};
+  for (std::size_t batch = 0; batch < 3; ++batch) {
+    work().runAll();
+    EXPECT_THAT(takeJournal(), ElementsAre("pruneOldEntries 1000001 50"));
+    EXPECT_EQ(medium->rows().size(), left[batch]);
+    EXPECT_EQ(work().pending(), 0U);  // nothing goes on before the files are gone
+    EXPECT_EQ(file().pending(), 1U);
+    ASSERT_TRUE(file().runNext());
+    EXPECT_EQ(deletions(), gone[batch]);
+    EXPECT_EQ(work().pending(), 1U);
+  }
+  EXPECT_THAT(work().armedDelays(), Not(Contains(3600 * kSecond)));
+  work().runAll();
+  EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
+  EXPECT_EQ(file().pending(), 0U);
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(Expiry, OfInlineItemsDeletesNoFile) {
+  options.inlineData = true;
+  openWatched();
+  put("key", "value");
+  directory.write("store/key", "a file that is not the store's");
+  clock.advance(1001);
+  files->clearTrace();
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+  EXPECT_THAT(files->trace(), IsEmpty());
+}
+
+TEST_F(Expiry, ThatFailsLogsAndComesAgainInAnHour) {
+  openWatched();
+  manifest->failNext(ManifestCall::PruneOldEntries, unwritable);
+  const LogCapture log;
+  ASSERT_TRUE(fire(300));
+  settle();
+  ASSERT_THAT(errorLines(log), ElementsAre(std::string("Failed to delete stale items: ") + unwritable.what()));
+  EXPECT_EQ(log.lines().front().file, "PersistentKeyValueStore.cpp");
+  EXPECT_THAT(work().armedDelays(), ElementsAre(3600 * kSecond));
+}
+
+TEST_F(Expiry, WhoseFilesCannotBeDeletedLogsEachAndIsNoFailure) {
+  open();
+  put("a", "1");
+  put("b", "2");
+  clock.advance(1001);
+  files->failPath(Operation::DeleteFile, pathOf("a"), EACCES);
+  const LogCapture log;
+  ASSERT_TRUE(fire(300));
+  settle();
+  const FileUtilsIoException failure(EACCES, std::generic_category().message(EACCES));
+  ASSERT_THAT(errorLines(log), ElementsAre("Failed to delete file at \"" + pathOf("a") + "\" " + failure.what()));
+  EXPECT_EQ(log.lines().front().file, "PersistentKeyValueStore.cpp");
+  EXPECT_THAT(valueFiles(), ElementsAre("a"));
+  EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
+}
+
+TEST_F(Expiry, ReplacesTheTimerThatIsArmed) {
+  openWatched();
+  store->scheduleStaleRemoval(10);
+  EXPECT_THAT(work().armedDelays(), ElementsAre(10 * kSecond));
+  store->scheduleStaleRemoval(20);
+  EXPECT_THAT(work().armedDelays(), ElementsAre(20 * kSecond));
+  EXPECT_EQ(work().companions(), 0U);
+}
+
+TEST_F(Expiry, TakesAnyDelay) {
+  openWatched();
+  for (const long delay : {0L, -1L, std::numeric_limits<long>::max(), std::numeric_limits<long>::min()}) {
+    store->scheduleStaleRemoval(delay);
+    EXPECT_EQ(work().armedDelays().size(), 1U);
+  }
+  store->scheduleStaleRemoval(-1);
+  EXPECT_THAT(work().armedDelays(), ElementsAre(-kSecond));
+}
+
+TEST_F(Expiry, LoadsFirstWhenTheFirstLoadingFailed) {
+  manifest.reset();
+  openWatchedUnloaded();
+  manifest->failNext(ManifestCall::Load, unwritable);
+  EXPECT_THROW(work().runNext(), ManifestPersistenceException);
+  EXPECT_THAT(work().armedDelays(), ElementsAre(300 * kSecond));
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_TRUE(manifest->isLoaded());
+  EXPECT_EQ(manifest->calls(ManifestCall::Load), 2U);
+}
+
+TEST_F(Expiry, WhoseLoadingFailsAgainLogsAndComesAgain) {
+  openWatchedUnloaded();
+  manifest->failNext(ManifestCall::Load, unwritable);
+  manifest->failNext(ManifestCall::Load, unwritable);
+  EXPECT_THROW(work().runNext(), ManifestPersistenceException);
+  const LogCapture log;
+  ASSERT_TRUE(fire(300));
+  EXPECT_THAT(errorLines(log), ElementsAre(std::string("Failed to delete stale items: ") + unwritable.what()));
+  EXPECT_THAT(work().armedDelays(), ElementsAre(3600 * kSecond));
+}
+
+TEST_F(Expiry, IsArmedThoughTheFirstLoadingCouldNotEvenPurge) {
+  openWatchedUnloaded();
+  manifest->failNext(ManifestCall::Load, corrupted);
+  files->failNext(Operation::CreateDirectory, ENOSPC);
+  EXPECT_ANY_THROW(work().runNext());
+  EXPECT_THAT(work().armedDelays(), ElementsAre(300 * kSecond));
+}
+
+TEST_F(Expiry, ComesAgainThoughTheQueueTookNoWork) {
+  options.hasSizeCallback = false;
+  openWatched();
+  work().throwOnDispatch(true);
+  try {
+    fire(300);
+  } catch (const std::exception&) {
+    // Either way: the next cycle must be armed.
+  }
+  work().throwOnDispatch(false);
+  EXPECT_THAT(work().armedDelays(), ElementsAre(3600 * kSecond));
+}
+
+TEST_F(Expiry, ComesAgainThoughTheQueueDroppedItsDeletions) {
+  open();
+  put("key", "value");
+  clock.advance(1001);
+  const LogCapture log;
+  ASSERT_TRUE(fire(300));
+  work().runAll();
+  file().dropAll();
+  settle();
+  EXPECT_THAT(errorLines(log), ElementsAre(testing::StartsWith("Failed to delete stale items: ")));
+  EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
+}
+
+TEST_F(Expiry, ThatWaitsWhenItsStoreGoesDoesNothing) {
+  openWatched();
+  put("key", "value");
+  clock.advance(1001);
+  ASSERT_TRUE(fire(300));
+  manifest->clearTrace();
+  store.reset();
+  settle();
+  EXPECT_THAT(manifest->trace(), IsEmpty());
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
+}
+
+// --- Capacity ---
+
+TEST_F(Capacity, OfThreeEvictsExactlyTheOldestForTheFourthBeforeItIsRecorded) {
+  options.capacity = 3;
+  openWatched();
+  for (const char* key : {"a", "b", "c"}) {
+    put(key, "value");
+    clock.advance(1);
+  }
+  EXPECT_EQ(manifest->calls(ManifestCall::PruneOldestItem), 0U);
+  keepJournal();
+  const Written written = watch(store->store("d", bytesOf("value")));
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("pruneOldestItem", "setItem d 0"));
+  EXPECT_THAT(valueFiles(), ElementsAre("a", "b", "c"));
+  ASSERT_TRUE(file().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("deleteFile a"));
+  ASSERT_TRUE(file().runNext());
+  EXPECT_THAT(takeJournal(), ElementsAre("writeFile d", "setItem d 5"));
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(keysInMedium(), (std::vector<std::string>{"b", "c", "d"}));
+  EXPECT_THAT(valueFiles(), ElementsAre("b", "c", "d"));
+}
+
+TEST_F(Capacity, EvictsWhatWasUsedLeastRecently) {
+  options.capacity = 2;
+  open();
+  put("a", "1");
+  clock.advance(1);
+  put("b", "2");
+  clock.advance(1);
+  EXPECT_EQ(get("a"), "1");
+  put("c", "3");
+  EXPECT_EQ(contents(), (Contents{{"a", "1"}, {"c", "3"}}));
+}
+
+TEST_F(Capacity, EvictsAlsoWhenItOverwrites) {
+  options.capacity = 2;
+  open();
+  put("a", "1");
+  clock.advance(1);
+  put("b", "2");
+  clock.advance(1);
+  put("b", "new");
+  EXPECT_EQ(contents(), (Contents{{"b", "new"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("b"));
+}
+
+TEST_F(Capacity, MayEvictTheVeryItemThatIsOverwritten) {
+  options.capacity = 1;
+  open();
+  put("a", "1");
+  put("a", "2");
+  EXPECT_EQ(contents(), (Contents{{"a", "2"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("a"));
+  const Written first = watch(store->store("a", bytesOf("3")));
+  const Written second = watch(store->store("a", bytesOf("4")));
+  settle();
+  EXPECT_EQ(told(first), "<done>");
+  EXPECT_EQ(told(second), "<done>");
+  EXPECT_EQ(contents(), (Contents{{"a", "4"}}));
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"a", "4"}}));
+}
+
+TEST_F(Capacity, OfZeroHoldsTheLastItemAlone) {
+  options.capacity = 0;
+  openWatched();
+  put("a", "1");
+  EXPECT_EQ(manifest->calls(ManifestCall::PruneOldestItem), 1U);  // and there was none
+  EXPECT_EQ(get("a"), "1");
+  put("b", "2");
+  EXPECT_EQ(contents(), (Contents{{"b", "2"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("b"));
+}
+
+TEST_F(Capacity, AbsentNeverEvicts) {
+  openWatched();
+  putMany(60);
+  EXPECT_EQ(manifest->calls(ManifestCall::PruneOldestItem), 0U);
+  EXPECT_EQ(store->getAllKeys().size(), 60U);
+}
+
+TEST_F(Capacity, BeyondThirtyTwoBitsNeverEvicts) {
+  options.capacity = std::uint64_t{1} << 32U;
+  openWatched();
+  putMany(3);
+  EXPECT_EQ(manifest->calls(ManifestCall::PruneOldestItem), 0U);
+}
+
+TEST_F(Capacity, FarExceededIsWorkedOffOneItemAWrite) {
+  open();
+  putMany(5);
+  close();
+  options.capacity = 2;
+  open();
+  clock.advance(1);
+  put("a", "1");
+  EXPECT_EQ(store->getAllKeys().size(), 5U);
+  put("b", "2");
+  EXPECT_EQ(store->getAllKeys().size(), 5U);
+  EXPECT_EQ(valueFiles().size(), 5U);
+}
+
+TEST_F(Capacity, OfInlineItemsEvictsWithoutDeletingAFile) {
+  options.capacity = 1;
+  options.inlineData = true;
+  openWatched();
+  put("a", "1");
+  clock.advance(1);
+  directory.write("store/a", "a file that is not the store's");
+  keepJournal();
+  put("b", "2");
+  EXPECT_THAT(takeJournal(), ElementsAre("pruneOldestItem", "setItem b 1", "setInlineData b 1"));
+  EXPECT_EQ(contents(), (Contents{{"b", "2"}}));
+}
+
+TEST_F(Capacity, WhoseEvictedFileCannotBeDeletedLogsAndStoresAllTheSame) {
+  options.capacity = 1;
+  open();
+  put("a", "1");
+  clock.advance(1);
+  files->failPath(Operation::DeleteFile, pathOf("a"), EACCES);
+  const LogCapture log;
+  put("b", "2");
+  const FileUtilsIoException failure(EACCES, std::generic_category().message(EACCES));
+  ASSERT_THAT(errorLines(log), ElementsAre(std::string("Failed to remove the oldest item ") + failure.what()));
+  EXPECT_EQ(log.lines().front().file, "PersistentKeyValueStore.cpp");
+  EXPECT_EQ(get("b"), "2");
+}
+
+TEST_F(Capacity, EvictsAWriteThatIsStillOnItsWayWithoutATrace) {
+  options.capacity = 1;
+  open();
+  const Written first = watch(store->store("a", bytesOf("1")));
+  const Written second = watch(store->store("b", bytesOf("2")));
+  const Fetched fetched = watch(store->fetch("a"));
+  work().runAll();
+  settle();
+  EXPECT_EQ(told(first), "<done>");
+  EXPECT_EQ(told(second), "<done>");
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_EQ(contents(), (Contents{{"b", "2"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("b"));
+}
+
+// --- Clearing ---
+
+TEST_F(Clearing, TakesEveryItemOfNoSizeToo) {
+  open();
+  put("empty", "");
+  put("key", "value");
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  EXPECT_EQ(sizes.back(), 0U);
+}
+
+TEST_F(Clearing, TakesEmptyItemsAloneToo) {
+  open();
+  put("a", "");
+  put("b", "");
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(Clearing, OfAnEmptyStoreSucceedsAfterOneEmptyBatchAndReportsTheSize) {
+  open();
+  store->clear(onSuccess(), onError());
+  EXPECT_EQ(ending, "");
+  ASSERT_TRUE(work().runNext());
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_EQ(file().pending(), 0U);
+  settle();
+  EXPECT_THAT(sizes, ElementsAre(0U));
+}
+
+TEST_F(Clearing, TakesABatchAtATime) {
+  options.batchSize = 2;
+  openWatched();
+  putMany(5);
+  store->clear(onSuccess(), onError());
+  for (const std::size_t left : {3U, 1U, 0U}) {
+    EXPECT_EQ(work().runAll(), 1U);
+    EXPECT_EQ(medium->rows().size(), left);
+    EXPECT_EQ(file().runAll(), 1U);
+    EXPECT_EQ(valueFiles().size(), left);
+    EXPECT_EQ(ending, "");
+  }
+  settle();
+  EXPECT_EQ(ending, "<done>");
+}
+
+TEST_F(Clearing, TakesWhatWasStoredBeforeItAndIsStillOnItsWay) {
+  open();
+  put("old", "value");
+  const Written first = watch(store->store("new", bytesOf("1")));
+  const Written overwrite = watch(store->store("old", bytesOf("2")));
+  store->clear(onSuccess(), onError());
+  work().runAll();
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_EQ(told(first), "<done>");
+  EXPECT_EQ(told(overwrite), "<done>");
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+}
+
+TEST_F(Clearing, LeavesWhatIsStoredAfterIt) {
+  open();
+  put("old", "value");
+  put("kept", "old value");
+  store->clear(onSuccess(), onError());
+  watch(store->store("kept", bytesOf("new")));
+  watch(store->store("empty", bytesOf("")));
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_EQ(contents(), (Contents{{"kept", "new"}, {"empty", ""}}));
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"kept", "new"}, {"empty", ""}}));
+}
+
+TEST_F(Clearing, LeavesWhatIsStoredBetweenItsBatches) {
+  options.batchSize = 1;
+  open();
+  putMany(4);
+  store->clear(onSuccess(), onError());
+  ASSERT_TRUE(work().runNext());
+  EXPECT_EQ(store->getAllKeys().size(), 3U);
+  for (int i = 0; i < 4; ++i) watch(store->store("key" + std::to_string(i), bytesOf("new")));
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_EQ(contents(), (Contents{{"key0", "new"}, {"key1", "new"}, {"key2", "new"}, {"key3", "new"}}));
+}
+
+TEST_F(Clearing, TwiceAtOnceSucceedsTwice) {
+  options.batchSize = 1;
+  open();
+  putMany(5);
+  store->clear(onSuccess(), onError());
+  store->clear(onSuccess(), onError());
+  settle();
+  EXPECT_EQ(ending, "<done><done>");
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(Clearing, AgainTakesWhatTheFirstOneLeft) {
+  options.batchSize = 1;
+  open();
+  putMany(3);
+  store->clear(onSuccess(), onError());
+  ASSERT_TRUE(work().runNext());
+  watch(store->store("between", bytesOf("new")));
+  store->clear(onSuccess(), onError());
+  settle();
+  EXPECT_EQ(ending, "<done><done>");
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(Clearing, OfInlineItemsDeletesNoFile) {
+  options.inlineData = true;
+  openWatched();
+  put("key", "value");
+  put("empty", "");
+  directory.write("store/key", "a file that is not the store's");
+  files->clearTrace();
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_THAT(keysInMedium(), IsEmpty());
+  EXPECT_THAT(files->trace(), IsEmpty());
+}
+
+TEST_F(Clearing, LoadsTheManifestWhenThatHasNotBeenDone) {
+  open();
+  put("key", "value");
+  close();
+  openUnloaded();
+  work().dropAll();
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(Clearing, TellsWhenTheManifestFails) {
+  openWatched();
+  put("key", "value");
+  manifest->failNext(ManifestCall::PruneToSize, unwritable);
+  EXPECT_EQ(clear(), std::string("<error> ") + unwritable.what());
+  EXPECT_EQ(get("key"), "value");
+  EXPECT_EQ(clear(), "<done>");
+}
+
+TEST_F(Clearing, DeletesTheFilesOfThoseThatWentBeforeTheManifestFailed) {
+  openWatched();
+  for (const char* key : {"a", "b", "c"}) put(key, "");
+  int removals = 0;
+  manifest->onCall = [&](ManifestCall call, const std::string&) {
+    if (call == ManifestCall::RemoveItem && ++removals == 2) throw unwritable;
+  };
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_THAT(keysInMedium(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(Clearing, WithoutCallbacksClears) {
+  openWatched();
+  put("key", "value");
+  store->clear(nullptr, nullptr);
+  settle();
+  EXPECT_THAT(keysInMedium(), IsEmpty());
+  manifest->failNext(ManifestCall::PruneToSize, unwritable);
+  put("key", "value");
+  store->clear(nullptr, nullptr);
+  settle();
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(Clearing, OfAnInvalidatedStoreIsRefused) {
+  open();
+  put("key", "value");
+  watch(store->invalidateWithFuture());
+  EXPECT_EQ(clear(), "<error> " + kInvalid);
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
+}
+
+// --- Deleting in batches ---
+
+TEST_F(DeletingInBatches, DeletesBatchAfterBatchOnTheQueuesOfEach) {
+  open();
+  for (const char* name : {"a", "b", "c"}) directory.write(std::string("store/") + name, "x");
+  store->deleteFilesInBatches(yielding({{itemOf("a"), itemOf("b")}, {itemOf("c")}}), onSuccess(), onError());
+  EXPECT_THAT(valueFiles(), ElementsAre("a", "b", "c"));
+  ASSERT_TRUE(work().runNext());
+  EXPECT_THAT(valueFiles(), ElementsAre("a", "b", "c"));
+  ASSERT_TRUE(file().runNext());
+  EXPECT_THAT(valueFiles(), ElementsAre("c"));
+  ASSERT_TRUE(work().runNext());
+  ASSERT_TRUE(file().runNext());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  EXPECT_EQ(ending, "");
+  ASSERT_TRUE(work().runNext());
+  EXPECT_EQ(ending, "<done>");
+  settle();
+  EXPECT_THAT(sizes, ElementsAre(0U));
+}
+
+TEST_F(DeletingInBatches, SkipsInlineItems) {
+  open();
+  for (const char* name : {"a", "b"}) directory.write(std::string("store/") + name, "x");
+  store->deleteFilesInBatches(yielding({{itemOf("a", true), itemOf("b")}, {itemOf("a", true)}}), onSuccess(),
+                              onError());
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_THAT(valueFiles(), ElementsAre("a"));
+}
+
+TEST_F(DeletingInBatches, LogsAFileThatCannotBeDeletedAndGoesOn) {
+  open();
+  for (const char* name : {"a", "c"}) directory.write(std::string("store/") + name, "x");
+  const LogCapture log;
+  store->deleteFilesInBatches(yielding({{itemOf("a"), itemOf("gone"), itemOf("c")}}), onSuccess(), onError());
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  ASSERT_THAT(errorLines(log), ElementsAre(testing::StartsWith("Failed to delete file at \"" + pathOf("gone") +
+                                                               "\" domain: ")));
+}
+
+TEST_F(DeletingInBatches, EndsWithAnyOtherFailureAfterTheFilesBefore) {
+  open();
+  for (const char* name : {"a", "b", "c"}) directory.write(std::string("store/") + name, "x");
+  files->onCall = [this](Operation operation, const std::string& path) {
+    if (operation == Operation::DeleteFile && path == pathOf("b")) throw std::runtime_error("No more.");
+  };
+  const LogCapture log;
+  store->deleteFilesInBatches(yielding({{itemOf("a"), itemOf("b"), itemOf("c")}, {itemOf("c")}}), onSuccess(),
+                              onError());
+  work().runAll();
+  file().runAll();
+  EXPECT_EQ(ending, "");  // told on the work queue
+  settle();
+  EXPECT_EQ(ending, "<error> No more.");
+  EXPECT_THAT(valueFiles(), ElementsAre("b", "c"));
+  EXPECT_THAT(errorLines(log), IsEmpty());
+}
+
+TEST_F(DeletingInBatches, EndsWithWhatTheProviderThrows) {
+  open();
+  store->deleteFilesInBatches([]() -> const Batch { throw std::out_of_range("No batch."); }, onSuccess(), onError());
+  settle();
+  EXPECT_EQ(ending, "<error> No batch.");
+}
+
+TEST_F(DeletingInBatches, EndsWithAnErrorWhenTheFileQueueDropsABatch) {
+  open();
+  store->deleteFilesInBatches(yielding({{itemOf("a")}}), onSuccess(), onError());
+  work().runAll();
+  file().dropAll();
+  EXPECT_EQ(ending, "");
+  settle();
+  EXPECT_THAT(ending, testing::StartsWith("<error> "));
+}
+
+TEST_F(DeletingInBatches, EndsWithAnErrorWhenTheFileQueueTakesNone) {
+  open();
+  file().throwOnDispatch(true);
+  store->deleteFilesInBatches(yielding({{itemOf("a")}}), onSuccess(), onError());
+  settle();
+  EXPECT_EQ(ending, "<error> The queue takes no tasks.");
+}
+
+TEST_F(DeletingInBatches, LetsProviderAndCallbacksCallTheStoreAgain) {
+  open();
+  put("key", "value");
+  Batch batch = {itemOf("key")};
+  int rounds = 0;
+  std::function<void()> again = [&] {
+    store->overrideConfiguration(77);
+    store->scheduleStaleRemoval(5);
+    watch(store->store("after", bytesOf("1")));
+    store->handleCorruptedManifest(corrupted);
+    if (++rounds < 3) store->deleteFilesInBatches(yielding({}), again, nullptr);
+  };
+  const Provider provider = [&]() -> const Batch {
+    store->overrideConfiguration(78);
+    store->reportSize();
+    store->startStaleItemRemoval();
+    const Batch now = std::exchange(batch, {});
+    if (now.empty()) store->clear(nullptr, nullptr);
+    return now;
+  };
+  const LogCapture log;
+  store->deleteFilesInBatches(provider, again, onError());
+  settle();
+  EXPECT_EQ(rounds, 3);
+  EXPECT_EQ(ending, "");
+  EXPECT_EQ(get("after"), "1");
+}
+
+TEST_F(DeletingInBatches, LetsAnErrorCallbackCallTheStoreAgain) {
+  open();
+  store->deleteFilesInBatches([]() -> const Batch { throw std::runtime_error("No batch."); }, nullptr,
+                              [&](const std::exception&) {
+                                store->overrideConfiguration(1);
+                                store->handleCorruptedManifest(corrupted);
+                                store->clear(onSuccess(), onError());
+                              });
+  settle();
+  EXPECT_EQ(ending, "<done>");
+}
+
+TEST_F(DeletingInBatches, WhoseStoreGoesCallsNothing) {
+  open();
+  directory.write("store/a", "x");
+  bool asked = false;
+  store->deleteFilesInBatches(
+      [&]() -> const Batch {
+        asked = true;
+        return {};
+      },
+      onSuccess(), onError());
+  store.reset();
+  settle();
+  EXPECT_FALSE(asked);
+  EXPECT_EQ(ending, "");
+  open();
+  store->deleteFilesInBatches(yielding({{itemOf("a")}}), onSuccess(), onError());
+  ASSERT_TRUE(work().runNext());
+  store.reset();
+  settle();
+  EXPECT_EQ(ending, "");
+}
+
+TEST_F(DeletingInBatches, OneBatchIsDeletedInOrderOnTheFileQueue) {
+  open();
+  for (const char* name : {"a", "b"}) directory.write(std::string("store/") + name, "x");
+  files->clearTrace();
+  const Written deleted = watch(store->deleteBatch({pathOf("b"), pathOf("a")}));
+  EXPECT_THAT(files->trace(), IsEmpty());
+  EXPECT_EQ(file().runAll(), 1U);
+  EXPECT_THAT(files->trace(), ElementsAre("deleteFile " + pathOf("b"), "deleteFile " + pathOf("a")));
+  EXPECT_EQ(told(deleted), "<done>");
+}
+
+TEST_F(DeletingInBatches, AnEmptyBatchIsDoneWhenTheFileQueueHasGotSoFar) {
+  open();
+  const Written deleted = watch(store->deleteBatch({}));
+  EXPECT_TRUE(deleted->isPending());
+  settle();
+  EXPECT_EQ(told(deleted), "<done>");
+}
+
+TEST_F(DeletingInBatches, OneBatchThatTheQueueDoesNotTakeIsAFailedFuture) {
+  open();
+  file().throwOnDispatch(true);
+  EXPECT_EQ(told(watch(store->deleteBatch({pathOf("a")}))), "<error> The queue takes no tasks.");
+}
+
+// --- Size report ---
+
+TEST_F(SizeReport, ComesAfterEachWriteAndEachDeletionRunAndNeverInBetween) {
+  open();
+  put("a", "12345");
+  put("b", "123");
+  EXPECT_EQ(get("a"), "12345");
+  EXPECT_EQ(drop("missing"), "<done>");
+  EXPECT_THAT(sizes, ElementsAre(5U, 8U));
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_THAT(sizes, ElementsAre(5U, 8U, 0U));
+}
+
+TEST_F(SizeReport, TellsTheSizeOfTheMomentItWasAskedFor) {
+  open();
+  watch(store->store("a", bytesOf("12345")));
+  work().runAll();
+  file().runAll();
+  watch(store->store("b", bytesOf("123")));
+  settle();
+  EXPECT_THAT(sizes, ElementsAre(5U, 8U));
+}
+
+TEST_F(SizeReport, IsSilentBeforeLoading) {
+  openUnloaded();
+  work().dropAll();
+  store->reportSize();
+  settle();
+  EXPECT_THAT(sizes, IsEmpty());
+}
+
+TEST_F(SizeReport, MayCallTheStoreAgain) {
+  std::shared_ptr<PersistentKeyValueStore>* target = &store;
+  int calls = 0;
+  store = PersistentKeyValueStore::createPersistentKeyValueStore(
+      storePath(), "", "larder", std::nullopt, 10, false, queues, trash, nullptr, nullptr, files,
+      [&](unsigned int) {
+        if (++calls > 3) return;
+        (*target)->overrideConfiguration(5);
+        (*target)->reportSize();
+        watch((*target)->store("key" + std::to_string(calls), bytesOf("1")));
+      },
+      50);
+  put("key", "value");
+  EXPECT_GT(calls, 3);
+  EXPECT_EQ(get("key1"), "1");
+}
+
+// --- Invalidation ---
+
+TEST_F(Invalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {
+  openWatched();
+  watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  const Written barrier = watch(store->invalidateWithFuture());
+  EXPECT_EQ(file().pending(), 2U);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_TRUE(barrier->isPending());
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+}
+
+TEST_F(Invalidation, ASecondTimeIsDoneAtOnce) {
+  open();
+  const Written first = watch(store->invalidateWithFuture());
+  const Written second = watch(store->invalidateWithFuture());
+  EXPECT_TRUE(first->isPending());
+  EXPECT_EQ(told(second), "<done>");
+  EXPECT_EQ(file().pending(), 1U);
+  settle();
+  EXPECT_EQ(told(first), "<done>");
+}
+
+TEST_F(Invalidation, BlocksUntilTheWritesThatAreUnderWayAreFinishedThenSilencesTheManifest) {
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  Latch barrierIsSet(1);
+  file().onDispatch = [&] { barrierIsSet.countDown(); };
+  std::atomic<bool> returned{false};
+  std::thread caller([&] {
+    store->invalidate();
+    returned = true;
+  });
+  barrierIsSet.wait();
+  EXPECT_FALSE(returned);
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_FALSE(returned);
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  EXPECT_EQ(medium->rows().at("key").item.size, 5U);
+  ASSERT_TRUE(file().runNext());
+  caller.join();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, ASecondBlockingCallReturnsAtOnceAndSilencesNothing) {
+  openWatched();
+  Latch barrierIsSet(1);
+  file().onDispatch = [&] { barrierIsSet.countDown(); };
+  std::thread caller([&] { store->invalidate(); });
+  barrierIsSet.wait();
+  store->invalidate();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  file().runAll();
+  caller.join();
+  store->invalidate();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, WithoutWaitingSilencesTheManifestWhenTheFileQueueHasGotSoFar) {
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  store->invalidateSoon();
+  EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  EXPECT_EQ(told(written), "<done>");
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+  store->invalidateSoon();
+  store->invalidate();
+  settle();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, RefusesWhatWaitsOnTheWorkQueueAndItHasNoEffect) {
+  openWatched();
+  put("key", "value");
+  const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))), watch(store->removeItem("key")),
+                                        watch(store->updateLastAccessDate("key"))};
+  const std::vector<Fetched> fetched = {
+      watch(store->fetch("key")), watch(store->fetchFirst({"other", "key"}, [](const auto&, const auto&, Bytes&) {
+        return true;
+      }))};
+  store->clear(onSuccess(), onError());
+  watch(store->invalidateWithFuture());
+  manifest->clearTrace();
+  files->clearTrace();
+  settle();
+  for (const Written& outcome : written) EXPECT_EQ(told(outcome), "<error> " + kInvalid);
+  for (const Fetched& outcome : fetched) EXPECT_EQ(told(outcome), "<error> " + kInvalid);
+  EXPECT_EQ(ending, "<error> " + kInvalid);
+  EXPECT_THAT(manifest->trace(), IsEmpty());
+  EXPECT_THAT(files->trace(), IsEmpty());
+  EXPECT_THAT(accesses(), IsEmpty());
+}
+
+TEST_F(Invalidation, RefusesInlineWritesThatWait) {
+  options.inlineData = true;
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("x")));
+  watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(told(written), "<error> " + kInvalid);
+  EXPECT_THAT(keysInMedium(), IsEmpty());
+}
+
+TEST_F(Invalidation, FinishesAWriteAndAReadingThatAreOnTheFileQueue) {
+  open();
+  put("key", "value");
+  const Written written = watch(store->store("new", bytesOf("12345")));
+  const Fetched fetched = watch(store->fetch("key"));
+  work().runAll();
+  const Written barrier = watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(fetched), "value");
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(valueFile("new"), "12345");
+  EXPECT_THAT(rowsOnDisk(), Contains("new new 5 0 1000000 1000000 -"));
+}
+
+TEST_F(Invalidation, CancelsTheTimerAndArmsNoOther) {
+  openWatched();
+  put("key", "value");
+  clock.advance(1001);
+  ASSERT_TRUE(fire(300));
+  work().runAll();
+  watch(store->invalidateWithFuture());
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+  settle();
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+  store->scheduleStaleRemoval(10);
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, OfARealManifestLeavesNoTimerAtAll) {
+  open();
+  EXPECT_EQ(work().armedDelays().size(), 2U);
+  runFilesAtOnce();
+  store->invalidate();
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+  settle();
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, BeforeLoadingLoadsNothingAndArmsNothing) {
+  openWatchedUnloaded();
+  watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(manifest->calls(ManifestCall::Load), 0U);
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, CreatesNoManifest) {
+  openUnloaded();
+  runFilesAtOnce();
+  store->invalidate();
+  settle();
+  EXPECT_THAT(directory.names("store"), IsEmpty());
+}
+
+TEST_F(Invalidation, StartsNoExpiry) {
+  openWatched();
+  watch(store->invalidateWithFuture());
+  manifest->clearTrace();
+  store->startStaleItemRemoval();
+  settle();
+  EXPECT_THAT(manifest->trace(), IsEmpty());
+  EXPECT_THAT(sizes, IsEmpty());
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, EndsADeletionBetweenItsBatches) {
+  options.batchSize = 1;
+  openWatched();
+  putMany(3);
+  store->clear(onSuccess(), onError());
+  work().runAll();
+  watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(ending, "<error> " + kInvalid);
+  EXPECT_EQ(medium->rows().size(), 2U);
+  EXPECT_EQ(valueFiles().size(), 2U);  // the files of the batch that was taken are gone
+}
+
+TEST_F(Invalidation, LeavesTheFilesAndWritesNothingMore) {
+  open();
+  put("key", "value");
+  runFilesAtOnce();
+  store->invalidate();
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 0 1000000 1000000 -"));
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
+  reopen();
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(Invalidation, WhoseStoreGoesBeforeAWriteBeginsLeavesNoRecordWithoutAFile) {
+  open();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  const Written barrier = watch(store->invalidateWithFuture());
+  store.reset();
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(valueFiles().size(), rowsOnDisk().size());
+}
+
+TEST_F(Invalidation, OfAShutDownFileQueueReturnsAndSilencesTheManifest) {
+  openWatched();
+  file().onDispatch = [&queue = file()] { queue.dropAll(); };
+  store->invalidate();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+  EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
+}
+
+TEST_F(Invalidation, OfAFileQueueThatTakesNothingRefusesWorkAndSilencesTheManifest) {
+  openWatched();
+  file().throwOnDispatch(true);
+  EXPECT_NO_THROW(store->invalidate());
+  EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, FromWithinAWriterLetsThatWriteFinish) {
+  openWatched();
+  Written barrier;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    barrier = watch(store->invalidateWithFuture());
+    files->writeFile(path, bytesOf("value"));
+    return 5U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(medium->rows().at("key").item.size, 5U);
+}
+
+TEST_F(Invalidation, RacesWithOperationsOfManyThreads) {
+  open();
+  std::atomic<bool> stop{false};
+  std::thread workThread([&] {
+    while (!stop) {
+      if (!work().runNext()) std::this_thread::yield();
+    }
+    work().runAll();
+  });
+  std::thread fileThread([&] {
+    while (!stop) {
+      if (!file().runNext()) std::this_thread::yield();
+    }
+    file().runAll();
+  });
+  std::atomic<int> completed{0};
+  constexpr int kRounds = 40;
+  test::runOnThreads(4, [&](std::size_t thread) {
+    for (int i = 0; i < kRounds; ++i) {
+      const std::string key = "key" + std::to_string(i % 3);
+      store->store(key, bytesOf("value")).then(nullptr, [&](std::future<void>&) { ++completed; });
+      store->fetch(key).then(nullptr, [&](std::future<std::unique_ptr<test::FetchResult>>&) { ++completed; });
+      store->removeItem(key).then(nullptr, [&](std::future<void>&) { ++completed; });
+      store->updateLastAccessDate(key).then(nullptr, [&](std::future<void>&) { ++completed; });
+      store->clear([&] { ++completed; }, [&](const std::exception&) { ++completed; });
+      store->overrideConfiguration(i);
+      try {
+        store->getAllKeys();
+        store->fetchModificationDate(key);
+      } catch (const InvalidatedException&) {
+        // What the other thread is about.
+      }
+      if (thread == 0 && i == kRounds / 2) store->invalidate();
+      if (thread == 1 && i == kRounds / 2) store->invalidate();
+    }
+  });
+  stop = true;
+  workThread.join();
+  fileThread.join();
+  settle();
+  EXPECT_EQ(completed, 4 * kRounds * 5);
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar
