@@ -18,15 +18,14 @@ using std::string;
 // A value of the document. Objects keep their members in document order and a name that is met twice twice, both of
 // which the JSON library's own objects fold away; any other value is kept as the library reads it.
 struct Node {
-  using Members = std::vector<std::pair<string, Node>>;
-
+  string name;      // as a member of the object that holds it
   JsonValue value;  // an empty object or array for those
-  Members members;
+  std::vector<Node> members;
 
   // The member of that name, the last when there are several; null when there is none or this is no object.
-  const Node* find(const string& name) const {
+  const Node* find(const string& wanted) const {
     for (auto member = members.rbegin(); member != members.rend(); ++member) {
-      if (member->first == name) return &member->second;
+      if (member->name == wanted) return &*member;
     }
     return nullptr;
   }
@@ -102,9 +101,9 @@ class NodeBuilder : public nlohmann::json_sax<JsonValue> {
       root_.value = std::move(value);
       return &root_;
     }
-    Node::Members& members = path_.back()->members;
-    members.push_back({std::move(name_), Node{std::move(value), {}}});
-    return &members.back().second;
+    std::vector<Node>& members = path_.back()->members;
+    members.push_back({std::move(name_), std::move(value), {}});
+    return &members.back();
   }
 
   Node root_;
@@ -200,10 +199,9 @@ std::optional<std::int64_t> readCapacity(const Node& store) {
 
 const char* const kDefaultStaleAge = "50 years";
 
-std::shared_ptr<const StoreDefinition> readStore(const string& managerName, const string& identifier,
-                                                 const Node& store) {
+std::shared_ptr<const StoreDefinition> readStore(const string& managerName, const Node& store) {
   store.requireObject();
-  const auto name = read<string>(store, "name", identifier);
+  const auto name = read<string>(store, "name", store.name);
   const StoreDefinition::Type type = parseType(readRequired(store, "type"));
   const auto localeSensitive = read<bool>(store, "locale_sensitive", false);
   const auto hasVersion = read<bool>(store, "has_version", false);
@@ -279,7 +277,8 @@ DiskCacheDefinition::DiskCacheDefinition(const string& name_, const string& mana
 
 Configuration::Configuration(const string& json) {
   const Node document = parseDocument(json);
-  for (const auto& [managerName, manager] : document.members) {
+  for (const Node& manager : document.members) {
+    const string& managerName = manager.name;
     if (managers_.count(managerName) > 0) throw ConfigurationException("Duplicate store manager definition.");
     manager.requireObject();
     StoreManagerDefinition definition{};
@@ -289,9 +288,10 @@ Configuration::Configuration(const string& json) {
     definition.pruneInterval = parseDuration(read<string>(manager, "prune_interval", "1 hours"));
     definition.sessionScoped = read<bool>(manager, "session_scoped", true);
     if (const Node* stores = manager.find("stores")) {
-      for (const auto& [identifier, store] : stores->members) {
+      for (const Node& store : stores->members) {
+        const string& identifier = store.name;
         if (storeDefinitions_.count(identifier) > 0) throw ConfigurationException("Duplicate store definition.");
-        const auto storeDefinition = readStore(managerName, identifier, store);
+        const auto storeDefinition = readStore(managerName, store);
         definition.stores.emplace(identifier, storeDefinition);
         storeDefinitions_.emplace(identifier, storeDefinition);
       }

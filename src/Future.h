@@ -89,11 +89,12 @@ template <class T> class Future {
   // promise, nor in an inline callback of the same future.
   template <class U = T, class = std::enable_if_t<std::is_void_v<U>>> void get() {
     throwIfInvalid();
-    const std::lock_guard<std::mutex> lock(state_->mutex);
-    state_->throwIfTaken();
-    if (state_->callback) throw FutureError(FutureError::Code::FetchWithCallback);
-    state_->taken = true;
-    state_->future.get();
+    const auto state = state_;
+    const std::lock_guard<std::mutex> lock(state->mutex);
+    state->throwIfTaken();
+    if (state->callback) throw FutureError(FutureError::Code::FetchWithCallback);
+    state->taken = true;
+    state->future.get();
   }
 
   // Calls `callback` once, with the standard future that holds the value or exception: on `executor`, or with a null
@@ -102,12 +103,13 @@ template <class T> class Future {
   // it.
   void then(std::shared_ptr<AsyncExecutor> executor, std::function<void(std::future<T>&)>&& callback) {
     throwIfInvalid();
-    const std::lock_guard<std::mutex> lock(state_->mutex);
-    state_->throwIfTaken();
-    if (state_->callback) throw FutureError(FutureError::Code::CallbackAlreadySet);
-    state_->callback = std::move(callback);
-    state_->executor = std::move(executor);
-    if (state_->fulfilled) state_->runCallback(state_);
+    const auto state = state_;  // the callback may destroy this future
+    const std::lock_guard<std::mutex> lock(state->mutex);
+    state->throwIfTaken();
+    if (state->callback) throw FutureError(FutureError::Code::CallbackAlreadySet);
+    state->callback = std::move(callback);
+    state->executor = std::move(executor);
+    if (state->fulfilled) state->runCallback(state);
   }
 
  private:
@@ -149,10 +151,11 @@ template <class T> class Promise {
   // Delivers the value to the callback, if there is one. Called by the setters.
   void onFulfilled() {
     fulfilled_ = true;
-    if (state_ == nullptr) return;
-    const std::lock_guard<std::mutex> lock(state_->mutex);
-    state_->fulfilled = true;
-    if (state_->callback) state_->runCallback(state_);
+    const auto state = state_;  // the callback may destroy this promise
+    if (state == nullptr) return;
+    const std::lock_guard<std::mutex> lock(state->mutex);
+    state->fulfilled = true;
+    if (state->callback) state->runCallback(state);
   }
 
   // Fails the future with a broken promise, if one was handed out and is still waiting.

@@ -222,6 +222,8 @@ void StoreManagerImpl::startPruning(const PruneRequest& request) {
     request.store->pruneBackToNormal(onSuccess, onError, request.survivalMode);
   } catch (const std::exception& error) {
     onError(error);
+  } catch (...) {
+    onError(std::runtime_error("unknown exception"));
   }
 }
 

@@ -67,7 +67,7 @@ std::shared_ptr<Store> StoreManagerImplCommon::getStore(const std::string& ident
     const std::shared_ptr<Item> item = slot;
     lock.unlock();
     std::unique_lock<std::mutex> itemLock(item->mutex);
-    item->condition.wait(itemLock, [&item] { return item->store != nullptr; });
+    item->condition.wait(itemLock, [&item] { return item->store != nullptr || item->isAbandoned; });
     return item->store;
   }
   slot = std::make_shared<Item>();
@@ -75,8 +75,22 @@ std::shared_ptr<Store> StoreManagerImplCommon::getStore(const std::string& ident
   lock.unlock();
 
   created = true;
-  return createStore(identifier, item, std::move(taskQueueFactory), std::move(trashCollector),
-                     std::move(analyticsReporter), std::move(sizeChangedCallback), pruneStrategy);
+  try {
+    return createStore(identifier, item, std::move(taskQueueFactory), std::move(trashCollector),
+                       std::move(analyticsReporter), std::move(sizeChangedCallback), pruneStrategy);
+  } catch (...) {
+    if (!isValid()) abandon(*item);
+    throw;
+  }
+}
+
+// The directory has gone from under the creator. Whoever waits for the store gets what later callers get: none.
+void StoreManagerImplCommon::abandon(Item& item) {
+  {
+    const std::lock_guard<std::mutex> lock(item.mutex);
+    item.isAbandoned = true;
+  }
+  item.condition.notify_all();
 }
 
 std::shared_ptr<StoreManagerImplCommon::Item> StoreManagerImplCommon::getExistingStore(const std::string& identifier) {

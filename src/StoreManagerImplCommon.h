@@ -40,8 +40,9 @@ class CELLAR_EXPORT StoreManagerImplCommon {
     std::string name;                   // the definition's
     bool isPruning = false;             // a prune of the store is under way
     bool sizeReported = false;          // its first size has been reported
+    bool isAbandoned = false;           // creating the store failed while the manager was being invalidated
     std::mutex mutex;                   // guards all of the above
-    std::condition_variable condition;  // signalled when `store` has been set
+    std::condition_variable condition;  // signalled when `store` has been set, or the item abandoned
   };
 
   // Moves a temporary directory that an earlier run left behind to the trash and creates a fresh one, with the manager
@@ -55,7 +56,8 @@ class CELLAR_EXPORT StoreManagerImplCommon {
 
   // The store of that identifier, created by the first caller while the others wait; `created` is set to true only in
   // the call that created it. Empty once the manager is invalid. What creating throws reaches the first caller, and
-  // then later callers of that identifier wait without end: there is deliberately no timeout.
+  // then later callers of that identifier wait without end (there is deliberately no timeout) unless the manager was
+  // being invalidated: they get an empty pointer then.
   std::shared_ptr<Store> getStore(const std::string& identifier, std::shared_ptr<TaskQueueFactory> taskQueueFactory,
                                   std::shared_ptr<TrashCollector> trashCollector,
                                   std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
@@ -119,6 +121,7 @@ class CELLAR_EXPORT StoreManagerImplCommon {
  private:
   using StoreMap = std::unordered_map<std::string, std::shared_ptr<Item>>;
 
+  static void abandon(Item& item);
   bool isMarkedForTrashing(const std::string& storePath);
 
   const StoreManagerDefinition definition_;
