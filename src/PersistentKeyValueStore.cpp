@@ -49,8 +49,25 @@ struct PersistentKeyValueStore::FileWrite {
   std::string key;
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
   Writer writer;
+  std::weak_ptr<PersistentKeyValueStore> store;
   std::shared_ptr<Promise<void>> promise = std::make_shared<Promise<void>>();
   std::shared_ptr<WritesInFlight::Write> inFlight;  // once its record stands in the manifest
+
+  FileWrite(const std::string& key_, std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata_, Writer writer_,
+            std::weak_ptr<PersistentKeyValueStore> store_)
+      : key(key_),
+        extendedMetadata(std::move(extendedMetadata_)),
+        writer(std::move(writer_)),
+        store(std::move(store_)) {}
+  FileWrite(const FileWrite&) = delete;
+  FileWrite& operator=(const FileWrite&) = delete;
+
+  // A queue may drop the write without running it. Another write of the key may be at the file just now.
+  ~FileWrite() {
+    if (inFlight == nullptr || inFlight->isOver) return;
+    const auto owner = store.lock();
+    if (owner != nullptr && !owner->takeBack(*this)) owner->deleteLeftoverFile(key);
+  }
 
   DiskCacheItem record(std::uint32_t size) const {
     const std::int32_t date = currentDate();
@@ -104,7 +121,6 @@ PersistentKeyValueStore::PersistentKeyValueStore(
 
 // Writes that have not begun will not begin any more: their records must not stay behind without a file.
 PersistentKeyValueStore::~PersistentKeyValueStore() {
-  if (invalidated_) return;
   for (const auto& write : writesInFlight_->all()) {
     try {
       if (!write->isRevoked) manifest_->removeItem(write->key);
@@ -144,18 +160,16 @@ Future<void> PersistentKeyValueStore::store(const std::string& key, const std::v
 Future<void> PersistentKeyValueStore::store(const std::string& key,
                                             std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
                                             Writer writer) {
-  const auto write = std::make_shared<FileWrite>();
-  write->key = key;
-  write->extendedMetadata = std::move(extendedMetadata);
-  write->writer = std::move(writer);
+  const auto write = std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer),
+                                                 weak_from_this<PersistentKeyValueStore>());
   Future<void> future = write->promise->getFuture();
   if (inlineData_ && !invalidated_) {
     const std::runtime_error unsupported("Write callback not supported by inline store.");
     write->promise->setException(std::make_exception_ptr(unsupported));
     return future;
   }
-  dispatchWork({key}, write->promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), write] {
-    const auto self = weakThis.lock();
+  dispatchWork({key}, write->promise, [write] {
+    const auto self = write->store.lock();
     if (self == nullptr) return write->promise->setValue();
     std::exception_ptr failure;
     try {
@@ -177,22 +191,18 @@ void PersistentKeyValueStore::beginFileWrite(const std::shared_ptr<FileWrite>& w
     prepareWrite(write->key);
     getManifest()->setItem(write->record(0));
   } catch (const ManifestPersistenceException& error) {
+    writesInFlight_->revoke(write->key);  // an earlier value must not take the place of this one
     return purge(error);
   }
   write->inFlight = writesInFlight_->begin(write->key);
-  try {
-    fileQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), write] {
-      if (const auto self = weakThis.lock()) {
-        self->finishFileWrite(*write);
-      } else {
-        write->promise->setValue();
-      }
-    });
-  } catch (...) {
-    writesInFlight_->end(write->inFlight);
-    getManifest()->removeItem(write->key);
-    throw;
-  }
+  // A queue that takes no task drops the write: its end takes the record away again.
+  fileQueue_->dispatch([write] {
+    if (const auto self = write->store.lock()) {
+      self->finishFileWrite(*write);
+    } else {
+      write->promise->setValue();
+    }
+  });
 }
 
 void PersistentKeyValueStore::finishFileWrite(const FileWrite& write) {
@@ -217,7 +227,8 @@ unsigned int PersistentKeyValueStore::runWriter(const FileWrite& write) {
   try {
     return write.writer(getFilePath(write.key));
   } catch (...) {
-    giveUp(write);
+    takeBack(write);
+    deleteLeftoverFile(write.key);
     throw;
   }
 }
@@ -236,16 +247,18 @@ bool PersistentKeyValueStore::recordWritten(const FileWrite& write, unsigned int
   return true;
 }
 
-// Leaves a miss where a write has failed. A later write of the key has its own record there already.
-void PersistentKeyValueStore::giveUp(const FileWrite& write) {
+// Takes the record of a write that failed or was dropped away again. True when another write of the key is on its way,
+// whose record it is by now.
+bool PersistentKeyValueStore::takeBack(const FileWrite& write) {
   try {
     const std::lock_guard<std::mutex> lock(mutex_);
     writesInFlight_->end(write.inFlight);
-    if (!write.inFlight->isRevoked && !writesInFlight_->contains(write.key)) getManifest()->removeItem(write.key);
+    if (writesInFlight_->contains(write.key)) return true;
+    if (!write.inFlight->isRevoked) getManifest()->removeItem(write.key);
   } catch (const std::exception& error) {
     LOG(ERROR) << "Could not remove the record of a failed write: " << error.what();
   }
-  deleteLeftoverFile(write.key);
+  return false;
 }
 
 void PersistentKeyValueStore::deleteLeftoverFile(const std::string& key) {
@@ -267,6 +280,7 @@ void PersistentKeyValueStore::writeInline(const std::string& key, const std::vec
     manifest->setItem({key, key, size, false, date, date, std::move(extendedMetadata)});
     manifest->setInlineData(key, data);
   } catch (const ManifestPersistenceException& error) {
+    writesInFlight_->revoke(key);
     purge(error);
   }
   reportSize();
@@ -392,12 +406,13 @@ bool PersistentKeyValueStore::readValue(std::shared_ptr<const DiskCacheItem> ite
     value = fileUtils_->readFile(filePath);
     return true;
   }
+  const std::lock_guard<std::mutex> lock(mutex_);  // record and value are written one after the other
   try {
     const auto manifest = getManifest();
     value = manifest->getInlineData(item->key);
     return !value.empty() || manifest->getItem(item->key) != nullptr;
   } catch (const ManifestCorruptedException& error) {
-    handleCorruptedManifest(error);
+    purge(error);
     return false;
   }
 }
@@ -473,8 +488,13 @@ void PersistentKeyValueStore::remove(const std::string& key, const std::shared_p
     {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
-      const auto item = lookUp(key);
-      if (item != nullptr) getManifest()->removeItem(key);
+      auto item = lookUp(key);
+      try {
+        if (item != nullptr) getManifest()->removeItem(key);
+      } catch (const ManifestCorruptedException& error) {
+        purge(error);
+        item = nullptr;
+      }
       if (item != nullptr && !item->hasInlineData) filename = item->filename;
       // A write that is on its way deletes what it finds; the removal is done when the file queue has got past it.
       if (writesInFlight_->revoke(key)) {
@@ -514,9 +534,13 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shar
     clearsUnderWay_.erase(std::remove_if(clearsUnderWay_.begin(), clearsUnderWay_.end(), hasEnded),
                           clearsUnderWay_.end());
     clearsUnderWay_.push_back(storedSince);
-    writesInFlight_->revokeAll();
-    if (!getManifest()->isLoaded()) getManifest()->load();
     begun = true;
+    if (!getManifest()->isLoaded()) getManifest()->load();
+    // Not in their turn like the others: a write that is called off must not leave its record to a later batch.
+    for (const auto& write : writesInFlight_->all()) {
+      getManifest()->removeItem(write->key);
+      write->isRevoked = true;
+    }
   }
   if (storedSince->empty()) {
     auto items = getManifest()->pruneToSize(0, batchSize_);
@@ -549,7 +573,7 @@ void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
   const auto item = manifest->pruneOldestItem();
   if (item == nullptr || item->hasInlineData) return;
   if (writesInFlight_->revoke(item->key)) return;
-  fileQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), filename = item->filename] {
+  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), filename = item->filename] {
     const auto self = weakThis.lock();
     if (self == nullptr) return;
     try {
@@ -557,7 +581,13 @@ void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
     } catch (const LarderException& error) {
       LOG(ERROR) << "Failed to remove the oldest item " << error.what();
     }
-  });
+  };
+  try {
+    fileQueue_->dispatch(deleteIt);
+  } catch (...) {
+    deleteIt();  // its record has gone already
+    throw;
+  }
 }
 
 std::vector<DiskCacheItem> PersistentKeyValueStore::takeBatch(
@@ -834,6 +864,7 @@ template <class T> void PersistentKeyValueStore::dispatchWork(const std::vector<
 // The store's own files stand beside the values.
 void PersistentKeyValueStore::throwIfReserved(const std::string& key) const {
   if (inlineData_) return;
+  if (key.find('\0') != std::string::npos) throw std::invalid_argument("Key '" + key + "' holds a zero byte.");
   bool reserved = key == kManifestName || key == AttributeStore::fileName;
   for (const std::string& companion : kManifestCompanions) reserved = reserved || key == kManifestName + companion;
   if (reserved) throw std::invalid_argument("Key '" + key + "' is reserved.");

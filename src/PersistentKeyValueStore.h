@@ -46,7 +46,7 @@ class WritesInFlight;
 // all its values go to the trash, the log says so in one line, and work goes on with an empty store.
 //
 // Keys are file names as they stand: one that holds a "/" or is ".." reaches outside the store's directory. Encode what
-// is not under your own control.
+// is not under your own control. A key that holds a zero byte fails with `std::invalid_argument`.
 //
 // What survives. The process killed: every value whose future has been fulfilled. Caught in the middle of an overwrite:
 // the old value, the new one, or a part of it; of a first write: a part, or an error. Power cut: as much as the file
@@ -232,7 +232,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   bool startWriter(const FileWrite& write);
   unsigned int runWriter(const FileWrite& write);
   bool recordWritten(const FileWrite& write, unsigned int size);
-  void giveUp(const FileWrite& write);
+  bool takeBack(const FileWrite& write);
   void load(const std::shared_ptr<const DiskCacheItem>& item, const Loader& loader, Promise<Fetched>& promise);
   bool hasLostItem(const DiskCacheItem& item);
   void deleteLeftoverFile(const std::string& key);

@@ -16,6 +16,7 @@ class WritesInFlight {
     const std::string key;
     bool isRunning = false;  // the writer has been called
     bool isRevoked = false;
+    bool isOver = false;
   };
 
   std::shared_ptr<Write> begin(const std::string& key) {
@@ -25,6 +26,7 @@ class WritesInFlight {
   }
 
   void end(const std::shared_ptr<Write>& write) {
+    write->isOver = true;
     const auto range = writes_.equal_range(write->key);
     for (auto it = range.first; it != range.second; ++it) {
       if (it->second == write) {
@@ -41,10 +43,6 @@ class WritesInFlight {
     const auto range = writes_.equal_range(key);
     for (auto it = range.first; it != range.second; ++it) it->second->isRevoked = true;
     return range.first != range.second;
-  }
-
-  void revokeAll() {
-    for (const auto& write : writes_) write.second->isRevoked = true;
   }
 
   // Revokes those whose file may have been taken away under their writer.

@@ -622,6 +622,20 @@ TEST_F(DiskCacheTest, ACacheThatGoesBetweenTwoBatchesIsPrunedNoFurther) {
   expectItems({"1", "2"});
 }
 
+TEST_F(DiskCacheTest, ACacheThatGoesWithAWriteOnItsWayLeavesNoRecordWithoutAFile) {
+  for (const bool isInvalidatedFirst : {false, true}) {
+    open();
+    begin("queued", 10);
+    ASSERT_TRUE(workQueue().runNext());
+    Future<void> barrier;
+    if (isInvalidatedFirst) barrier = cache_->invalidateWithFuture();
+    cache_.reset();
+    run();
+    open();
+    EXPECT_EQ(keys(), files()) << (isInvalidatedFirst ? "invalidated" : "let go");
+  }
+}
+
 TEST_F(DiskCacheTest, ItsQueuesHoldNoTimerAfterIt) {
   open();
   cache_.reset();
@@ -766,8 +780,10 @@ TEST_F(DiskCacheTest, AnInlineValueReadWhileItIsOverwrittenIsTheOldOrTheNewOne) 
 
   Bytes seen;
   bool hit = false;
+  Latch reading(1);
   Latch read(1);
   const auto loader = [&](std::shared_ptr<const DiskCacheItem> item, const std::string& path, Bytes& value) {
+    reading.countDown();
     hit = cache_->readValue(std::move(item), path, value);
     seen = value;
     read.countDown();
@@ -779,8 +795,9 @@ TEST_F(DiskCacheTest, AnInlineValueReadWhileItIsOverwrittenIsTheOldOrTheNewOne) 
   std::thread reader;
   intercepted_->afterSetItem = [&] {
     reader = std::thread([&] { fileQueue().runAll(); });
+    reading.wait();
     // The reader may have to wait for the writer; then it reads when this has returned.
-    for (int i = 0; i < 200 && !read.isOpen(); ++i) std::this_thread::yield();
+    for (int i = 0; i < 10000 && !read.isOpen(); ++i) std::this_thread::yield();
   };
   cache_->store("k", Bytes(7, 'y'));
   workQueue().runAll();

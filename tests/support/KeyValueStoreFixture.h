@@ -267,7 +267,8 @@ class KeyValueStoreFixture : public testing::Test {
     return keys;
   }
 
-  // From now on every call of the watched manifest and every change or reading of files, in one order, in `journal`.
+  // From now on every call of the watched manifest and every change or reading of the store's files, in one order, in
+  // `journal`.
   void keepJournal() {
     journal.clear();
     manifest->onCall = [this](ManifestCall, const std::string& text) { journal.push_back(text); };
@@ -277,7 +278,8 @@ class KeyValueStoreFixture : public testing::Test {
                                                              {Operation::DeleteFile, "deleteFile"},
                                                              {Operation::CreateDirectory, "createDirectory"}};
       const auto name = names.find(operation);
-      if (name != names.end()) journal.push_back(name->second + " " + path.substr(path.rfind('/') + 1));
+      const bool isTheStores = path.rfind(storePath(), 0) == 0;
+      if (name != names.end() && isTheStores) journal.push_back(name->second + " " + path.substr(path.rfind('/') + 1));
     };
   }
 

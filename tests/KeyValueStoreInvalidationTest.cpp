@@ -1,0 +1,382 @@
+// The end of a key-value store: what is refused, what is finished, who waits for whom.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstddef>
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <future>
+#include <limits>
+#include <map>
+#include <memory>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "DiskCacheManifest.h"
+#include "LarderException.h"
+#include "PersistentKeyValueStore.h"
+#include "support/Barrier.h"
+#include "support/KeyValueStoreFixture.h"
+
+namespace velmora::mobile::xplat::cellar {
+namespace {
+
+using test::bytesOf;
+using test::Bytes;
+using test::Fetched;
+using test::isA;
+using test::KeyValueStoreFixture;
+using test::Latch;
+using test::LogCapture;
+using test::ManifestCall;
+using test::Operation;
+using test::told;
+using test::watch;
+using test::whatOf;
+using test::Written;
+using testing::Contains;
+using testing::Each;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::Not;
+using testing::UnorderedElementsAre;
+
+using Contents = std::map<std::string, std::string>;
+using Batch = std::vector<DiskCacheItem>;
+using Provider = std::function<const Batch()>;
+
+const std::string kInvalid =
+    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
+
+class MaintenanceFixture : public KeyValueStoreFixture {
+ protected:
+  void putMany(int count, const std::string& value = "v") {
+    for (int i = 0; i < count; ++i) put("key" + std::to_string(i), value);
+  }
+
+  DiskCacheItem itemOf(const std::string& key, bool isInline = false) const {
+    return {key, key, 1, isInline, 0, 0, nullptr};
+  }
+
+  // Yields the batches one after the other, then empty ones.
+  static Provider yielding(std::vector<Batch> batches) {
+    return [batches = std::move(batches), next = std::make_shared<std::size_t>(0)]() -> const Batch {
+      return *next < batches.size() ? batches[(*next)++] : Batch();
+    };
+  }
+
+  // How a batched deletion ends, in `ending`.
+  std::function<void()> onSuccess() {
+    return [this] { ending += "<done>"; };
+  }
+  std::function<void(const std::exception&)> onError() {
+    return [this](const std::exception& error) { ending += std::string("<error> ") + error.what(); };
+  }
+
+  // Whoever puts something on the file queue finds it done.
+  void runFilesAtOnce() const {
+    file().onDispatch = [&queue = file()] { queue.runAll(); };
+  }
+
+  std::string ending;
+};
+
+class Invalidation : public MaintenanceFixture {};
+
+TEST_F(Invalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {
+  openWatched();
+  watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  const Written barrier = watch(store->invalidateWithFuture());
+  EXPECT_EQ(file().pending(), 2U);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_TRUE(barrier->isPending());
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+}
+
+TEST_F(Invalidation, ASecondTimeIsDoneAtOnce) {
+  open();
+  const Written first = watch(store->invalidateWithFuture());
+  const Written second = watch(store->invalidateWithFuture());
+  EXPECT_TRUE(first->isPending());
+  EXPECT_EQ(told(second), "<done>");
+  EXPECT_EQ(file().pending(), 1U);
+  settle();
+  EXPECT_EQ(told(first), "<done>");
+}
+
+TEST_F(Invalidation, BlocksUntilTheWritesThatAreUnderWayAreFinishedThenSilencesTheManifest) {
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  Latch barrierIsSet(1);
+  file().onDispatch = [&] { barrierIsSet.countDown(); };
+  std::atomic<bool> returned{false};
+  std::thread caller([&] {
+    store->invalidate();
+    returned = true;
+  });
+  barrierIsSet.wait();
+  EXPECT_FALSE(returned);
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_FALSE(returned);
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  EXPECT_EQ(medium->rows().at("key").item.size, 5U);
+  ASSERT_TRUE(file().runNext());
+  caller.join();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, ASecondBlockingCallReturnsAtOnceAndSilencesNothing) {
+  openWatched();
+  Latch barrierIsSet(1);
+  file().onDispatch = [&] { barrierIsSet.countDown(); };
+  std::thread caller([&] { store->invalidate(); });
+  barrierIsSet.wait();
+  store->invalidate();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  file().runAll();
+  caller.join();
+  store->invalidate();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, WithoutWaitingSilencesTheManifestWhenTheFileQueueHasGotSoFar) {
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  store->invalidateSoon();
+  EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+  EXPECT_EQ(told(written), "<done>");
+  ASSERT_TRUE(file().runNext());
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+  store->invalidateSoon();
+  store->invalidate();
+  settle();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, RefusesWhatWaitsOnTheWorkQueueAndItHasNoEffect) {
+  openWatched();
+  put("key", "value");
+  const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))), watch(store->removeItem("key")),
+                                        watch(store->updateLastAccessDate("key"))};
+  const std::vector<Fetched> fetched = {
+      watch(store->fetch("key")), watch(store->fetchFirst({"other", "key"}, [](const auto&, const auto&, Bytes&) {
+        return true;
+      }))};
+  store->clear(onSuccess(), onError());
+  watch(store->invalidateWithFuture());
+  manifest->clearTrace();
+  files->clearTrace();
+  settle();
+  for (const Written& outcome : written) EXPECT_EQ(told(outcome), "<error> " + kInvalid);
+  for (const Fetched& outcome : fetched) EXPECT_EQ(told(outcome), "<error> " + kInvalid);
+  EXPECT_EQ(ending, "<error> " + kInvalid);
+  EXPECT_THAT(manifest->trace(), IsEmpty());
+  EXPECT_THAT(files->trace(), IsEmpty());
+  EXPECT_THAT(accesses(), IsEmpty());
+}
+
+TEST_F(Invalidation, RefusesInlineWritesThatWait) {
+  options.inlineData = true;
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("x")));
+  watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(told(written), "<error> " + kInvalid);
+  EXPECT_THAT(keysInMedium(), IsEmpty());
+}
+
+TEST_F(Invalidation, FinishesAWriteAndAReadingThatAreOnTheFileQueue) {
+  open();
+  put("key", "value");
+  const Written written = watch(store->store("new", bytesOf("12345")));
+  const Fetched fetched = watch(store->fetch("key"));
+  work().runAll();
+  const Written barrier = watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(fetched), "value");
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(valueFile("new"), "12345");
+  EXPECT_THAT(rowsOnDisk(), Contains("new new 5 0 1000000 1000000 -"));
+}
+
+TEST_F(Invalidation, CancelsTheTimerAndArmsNoOther) {
+  openWatched();
+  put("key", "value");
+  clock.advance(1001);
+  ASSERT_TRUE(fire(300));
+  work().runAll();
+  watch(store->invalidateWithFuture());
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+  settle();
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+  store->scheduleStaleRemoval(10);
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, OfARealManifestLeavesNoTimerAtAll) {
+  open();
+  EXPECT_EQ(work().armedDelays().size(), 2U);
+  runFilesAtOnce();
+  store->invalidate();
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+  settle();
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, BeforeLoadingLoadsNothingAndArmsNothing) {
+  openWatchedUnloaded();
+  watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(manifest->calls(ManifestCall::Load), 0U);
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, CreatesNoManifest) {
+  openUnloaded();
+  runFilesAtOnce();
+  store->invalidate();
+  settle();
+  EXPECT_THAT(directory.names("store"), IsEmpty());
+}
+
+TEST_F(Invalidation, StartsNoExpiry) {
+  openWatched();
+  watch(store->invalidateWithFuture());
+  manifest->clearTrace();
+  store->startStaleItemRemoval();
+  settle();
+  EXPECT_THAT(manifest->trace(), IsEmpty());
+  EXPECT_THAT(sizes, IsEmpty());
+  EXPECT_THAT(work().armedDelays(), IsEmpty());
+}
+
+TEST_F(Invalidation, EndsADeletionBetweenItsBatches) {
+  options.batchSize = 1;
+  openWatched();
+  putMany(3);
+  store->clear(onSuccess(), onError());
+  work().runAll();
+  watch(store->invalidateWithFuture());
+  settle();
+  EXPECT_EQ(ending, "<error> " + kInvalid);
+  EXPECT_EQ(medium->rows().size(), 2U);
+  EXPECT_EQ(valueFiles().size(), 2U);  // the files of the batch that was taken are gone
+}
+
+TEST_F(Invalidation, LeavesTheFilesAndWritesNothingMore) {
+  open();
+  put("key", "value");
+  runFilesAtOnce();
+  store->invalidate();
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 0 1000000 1000000 -"));
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
+  reopen();
+  EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(Invalidation, WhoseStoreGoesBeforeAWriteBeginsLeavesNoRecordWithoutAFile) {
+  open();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  work().runAll();
+  const Written barrier = watch(store->invalidateWithFuture());
+  store.reset();
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(valueFiles().size(), rowsOnDisk().size());
+}
+
+TEST_F(Invalidation, OfAShutDownFileQueueReturnsAndSilencesTheManifest) {
+  openWatched();
+  file().onDispatch = [&queue = file()] { queue.dropAll(); };
+  store->invalidate();
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+  EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
+}
+
+TEST_F(Invalidation, OfAFileQueueThatTakesNothingRefusesWorkAndSilencesTheManifest) {
+  openWatched();
+  file().throwOnDispatch(true);
+  EXPECT_NO_THROW(store->invalidate());
+  EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
+  EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
+}
+
+TEST_F(Invalidation, FromWithinAWriterLetsThatWriteFinish) {
+  openWatched();
+  Written barrier;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    barrier = watch(store->invalidateWithFuture());
+    files->writeFile(path, bytesOf("value"));
+    return 5U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(barrier), "<done>");
+  EXPECT_EQ(medium->rows().at("key").item.size, 5U);
+}
+
+TEST_F(Invalidation, RacesWithOperationsOfManyThreads) {
+  open();
+  std::atomic<bool> stop{false};
+  std::thread workThread([&] {
+    while (!stop) {
+      if (!work().runNext()) std::this_thread::yield();
+    }
+    work().runAll();
+  });
+  std::thread fileThread([&] {
+    while (!stop) {
+      if (!file().runNext()) std::this_thread::yield();
+    }
+    file().runAll();
+  });
+  std::atomic<int> completed{0};
+  constexpr int kRounds = 40;
+  test::runOnThreads(4, [&](std::size_t thread) {
+    for (int i = 0; i < kRounds; ++i) {
+      const std::string key = "key" + std::to_string(i % 3);
+      store->store(key, bytesOf("value")).then(nullptr, [&](std::future<void>&) { ++completed; });
+      store->fetch(key).then(nullptr, [&](std::future<std::unique_ptr<test::FetchResult>>&) { ++completed; });
+      store->removeItem(key).then(nullptr, [&](std::future<void>&) { ++completed; });
+      store->updateLastAccessDate(key).then(nullptr, [&](std::future<void>&) { ++completed; });
+      store->clear([&] { ++completed; }, [&](const std::exception&) { ++completed; });
+      store->overrideConfiguration(i);
+      try {
+        store->getAllKeys();
+        store->fetchModificationDate(key);
+      } catch (const InvalidatedException&) {
+        // What the other thread is about.
+      }
+      if (thread == 0 && i == kRounds / 2) store->invalidate();
+      if (thread == 1 && i == kRounds / 2) store->invalidate();
+    }
+  });
+  stop = true;
+  workThread.join();
+  fileThread.join();
+  settle();
+  EXPECT_EQ(completed, 4 * kRounds * 5);
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar

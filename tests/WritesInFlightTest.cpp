@@ -1,0 +1,635 @@
+// Writes that are on their way while other operations on their keys come in between: in every order in which two queues
+// can run them, what is left is what the operations say, one after the other.
+
+#include "WritesInFlight.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "DiskCache.h"
+#include "DiskCacheManifest.h"
+#include "FileUtils.h"
+#include "LarderException.h"
+#include "TrashCollector.h"
+#include "support/KeyValueStoreFixture.h"
+
+namespace velmora::mobile::xplat::cellar {
+namespace {
+
+using test::bytesOf;
+using test::Bytes;
+using test::Fetched;
+using test::isA;
+using test::KeyValueStoreFixture;
+using test::LogCapture;
+using test::ManualQueueFactory;
+using test::MemoryMedium;
+using test::MemoryPersistence;
+using test::Operation;
+using test::TestClock;
+using test::textOf;
+using test::told;
+using test::watch;
+using test::Written;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::UnorderedElementsAre;
+
+using Contents = std::map<std::string, std::string>;
+
+// --- The bookkeeping ---
+
+TEST(WritesInFlight, KnowsAWriteFromItsBeginningToItsEnd) {
+  WritesInFlight writes;
+  EXPECT_FALSE(writes.contains("key"));
+  const auto write = writes.begin("key");
+  EXPECT_EQ(write->key, "key");
+  EXPECT_FALSE(write->isRunning);
+  EXPECT_FALSE(write->isRevoked);
+  EXPECT_TRUE(writes.contains("key"));
+  EXPECT_FALSE(writes.contains("other"));
+  writes.end(write);
+  EXPECT_FALSE(writes.contains("key"));
+  EXPECT_THAT(writes.all(), IsEmpty());
+}
+
+TEST(WritesInFlight, EndsOneOfSeveralOfAKeyAndNoneTwice) {
+  WritesInFlight writes;
+  const auto first = writes.begin("key");
+  const auto second = writes.begin("key");
+  EXPECT_FALSE(first->isOver);
+  writes.end(first);
+  writes.end(first);
+  EXPECT_TRUE(first->isOver);
+  EXPECT_THAT(writes.all(), ElementsAre(second));
+  EXPECT_TRUE(writes.contains("key"));
+}
+
+TEST(WritesInFlight, RevokesAllOfAKeyAndNoOther) {
+  WritesInFlight writes;
+  const auto first = writes.begin("key");
+  const auto second = writes.begin("key");
+  const auto other = writes.begin("other");
+  EXPECT_TRUE(writes.revoke("key"));
+  EXPECT_TRUE(first->isRevoked);
+  EXPECT_TRUE(second->isRevoked);
+  EXPECT_FALSE(other->isRevoked);
+  EXPECT_FALSE(writes.revoke("unknown"));
+}
+
+TEST(WritesInFlight, RevokesThoseThatRunAlone) {
+  WritesInFlight writes;
+  const auto running = writes.begin("running");
+  running->isRunning = true;
+  const auto waiting = writes.begin("waiting");
+  writes.revokeRunning();
+  EXPECT_TRUE(running->isRevoked);
+  EXPECT_FALSE(waiting->isRevoked);
+}
+
+// --- In one breath ---
+
+class InOneBreath : public KeyValueStoreFixture {
+ protected:
+  Written putting(const std::string& key, const std::string& value) const {
+    return watch(store->store(key, bytesOf(value)));
+  }
+
+  // A write that leaves `half` in its file and fails.
+  Written failing(const std::string& key, const std::optional<std::string>& half) const {
+    return watch(store->store(key, nullptr, [files = files, half](const std::string& path) -> unsigned int {
+      if (half) files->writeFile(path, bytesOf(*half));
+      throw std::runtime_error("The writer gave up.");
+    }));
+  }
+
+  // All of the work first, then the files.
+  void settleWorkFirst() const {
+    work().runAll();
+    settle();
+  }
+
+  void expectNothingOf(const std::string& key) {
+    EXPECT_EQ(get(key), "<miss>");
+    EXPECT_FALSE(directory.exists("store/" + key));
+    EXPECT_THAT(rowsOnDisk(), IsEmpty());
+    reopen();
+    EXPECT_EQ(get(key), "<miss>");
+  }
+};
+
+TEST_F(InOneBreath, StoredAndRemovedIsGone) {
+  open();
+  const Written written = putting("key", "value");
+  const Written removed = watch(store->removeItem("key"));
+  settleWorkFirst();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(removed), "<done>");
+  expectNothingOf("key");
+}
+
+TEST_F(InOneBreath, RemovedAndStoredIsThere) {
+  open();
+  put("key", "old");
+  const Written removed = watch(store->removeItem("key"));
+  putting("key", "new");
+  settleWorkFirst();
+  EXPECT_EQ(told(removed), "<done>");
+  EXPECT_EQ(get("key"), "new");
+}
+
+TEST_F(InOneBreath, StoredRemovedAndStoredHoldsTheLastValue) {
+  open();
+  putting("key", "first");
+  const Written removed = watch(store->removeItem("key"));
+  const Written last = putting("key", "last");
+  settleWorkFirst();
+  EXPECT_EQ(told(removed), "<done>");
+  EXPECT_EQ(told(last), "<done>");
+  EXPECT_EQ(contents(), (Contents{{"key", "last"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"key", "last"}}));
+}
+
+TEST_F(InOneBreath, TheRemovalOfAWriteOnItsWayIsDoneWhenItsFileIsGone) {
+  open();
+  put("key", "old");
+  putting("key", "new");
+  const Written removed = watch(store->removeItem("key"));
+  work().runAll();
+  EXPECT_TRUE(removed->isPending());
+  EXPECT_TRUE(file().runNext());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  EXPECT_TRUE(removed->isPending());
+  EXPECT_TRUE(file().runNext());
+  EXPECT_EQ(told(removed), "<done>");
+}
+
+TEST_F(InOneBreath, ARevokedWriteNeverCallsItsWriter) {
+  open();
+  bool called = false;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string&) {
+    called = true;
+    return 1U;
+  }));
+  watch(store->removeItem("key"));
+  settleWorkFirst();
+  EXPECT_FALSE(called);
+  EXPECT_EQ(told(written), "<done>");
+}
+
+TEST_F(InOneBreath, TwoWritesOfAKeyLeaveTheLater) {
+  open();
+  const Written first = putting("key", "first");
+  const Written second = putting("key", "second");
+  settleWorkFirst();
+  EXPECT_EQ(told(first), "<done>");
+  EXPECT_EQ(told(second), "<done>");
+  EXPECT_EQ(get("key"), "second");
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 6 0 1000000 1000000 -"));
+}
+
+TEST_F(InOneBreath, AFetchBetweenTwoWritesGivesTheValueBetween) {
+  open();
+  putting("key", "first");
+  const Fetched between = watch(store->fetch("key"));
+  putting("key", "second");
+  settleWorkFirst();
+  EXPECT_EQ(told(between), "first");
+  EXPECT_EQ(get("key"), "second");
+}
+
+TEST_F(InOneBreath, RemovedByTheRunningWriterItselfIsGone) {
+  open();
+  Written removed;
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    files->writeFile(path, bytesOf("half"));
+    removed = watch(store->removeItem("key"));
+    work().runAll();
+    files->writeFile(path, bytesOf("whole"));
+    return 5U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(removed), "<done>");
+  expectNothingOf("key");
+}
+
+TEST_F(InOneBreath, ClearedByTheRunningWriterItselfIsGone) {
+  open();
+  put("other", "value");
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    files->writeFile(path, bytesOf("half"));
+    store->clear(nullptr, nullptr);
+    work().runAll();
+    files->writeFile(path, bytesOf("whole"));
+    return 5U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  expectNothingOf("key");
+}
+
+TEST_F(InOneBreath, StoredAnewByTheRunningWriterItselfHoldsTheNewValue) {
+  open();
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    putting("key", "new");
+    work().runAll();
+    files->writeFile(path, bytesOf("older"));
+    return 5U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(contents(), (Contents{{"key", "new"}}));
+}
+
+TEST_F(InOneBreath, RemovedAndStoredAnewByTheRunningWriterHoldsTheNewValue) {
+  open();
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    watch(store->removeItem("key"));
+    putting("key", "new");
+    work().runAll();
+    files->writeFile(path, bytesOf("older"));
+    return 5U;
+  }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(contents(), (Contents{{"key", "new"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
+}
+
+// --- Writers that fail ---
+
+TEST_F(InOneBreath, AFirstWriteThatFailsLeavesNothing) {
+  for (const std::optional<std::string>& half : {std::optional<std::string>(), std::optional<std::string>("ha")}) {
+    open();
+    const Written written = failing("key", half);
+    settle();
+    EXPECT_EQ(told(written), "<error> The writer gave up.");
+    EXPECT_THAT(sizes, IsEmpty());
+    expectNothingOf("key");
+    close();
+  }
+}
+
+TEST_F(InOneBreath, AnOverwriteThatFailsLeavesAMiss) {
+  for (const std::optional<std::string>& half : {std::optional<std::string>(), std::optional<std::string>("ha")}) {
+    open();
+    put("key", "old");
+    const Written written = failing("key", half);
+    settle();
+    EXPECT_EQ(told(written), "<error> The writer gave up.");
+    expectNothingOf("key");
+    close();
+  }
+}
+
+TEST_F(InOneBreath, AWriteThatFailsLeavesANewerOneItsValue) {
+  open();
+  put("key", "old");
+  const Written failed = failing("key", "half");
+  const Fetched between = watch(store->fetch("key"));
+  const Written newer = putting("key", "newer");
+  settleWorkFirst();
+  EXPECT_EQ(told(failed), "<error> The writer gave up.");
+  EXPECT_EQ(told(between), "<miss>");
+  EXPECT_EQ(told(newer), "<done>");
+  EXPECT_EQ(contents(), (Contents{{"key", "newer"}}));
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"key", "newer"}}));
+}
+
+TEST_F(InOneBreath, ANewerWriteThatFailsTakesTheOlderValueAlong) {
+  open();
+  putting("key", "older");
+  const Written failed = failing("key", std::nullopt);
+  settleWorkFirst();
+  EXPECT_EQ(told(failed), "<error> The writer gave up.");
+  expectNothingOf("key");
+}
+
+TEST_F(InOneBreath, AWriterMayThrowAnything) {
+  open();
+  const Written written =
+      watch(store->store("key", nullptr, [](const std::string&) -> unsigned int { throw 42; }));  // NOLINT
+  settle();
+  EXPECT_TRUE(isA<int>(written->failure));
+  expectNothingOf("key");
+}
+
+TEST_F(InOneBreath, AWriterThatMakesNoFileLeavesARecordWhoseFetchFailsAndThatCanBeReplaced) {
+  open();
+  const Written written = watch(store->store("key", nullptr, [](const std::string&) { return 3U; }));
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_THAT(get("key"), testing::StartsWith("<error> "));
+  put("key", "value");
+  EXPECT_EQ(get("key"), "value");
+}
+
+// --- Every order of two queues ---
+
+// Files in memory, so that thousands of orders are tried in a moment. Only what a store needs; a missing file fails as it
+// does on a disk.
+class MemoryFiles final : public FileUtils {
+ public:
+  Contents files;  // by path
+
+  std::vector<unsigned char> readFile(const std::string& path) override {
+    throwUnlessThere(path);
+    return bytesOf(files[path]);
+  }
+  void writeFile(const std::string& path, const std::vector<unsigned char>& data) override {
+    files[path] = textOf(data);
+  }
+  void deleteFile(const std::string& path) override {
+    throwUnlessThere(path);
+    files.erase(path);
+  }
+  void createDirectory(const std::string& /*path*/, bool /*recursive*/) override {}
+  bool isDirectory(const std::string& /*path*/) override { return false; }
+  bool pathExists(const std::string& path) override { return files.count(path) > 0; }
+
+ private:
+  void throwUnlessThere(const std::string& path) const {
+    if (files.count(path) == 0) throw FileUtilsIoException(ENOENT, "There is no " + path);
+  }
+};
+
+// What a script's letters mean: A and B store a value under "a" and "b"; F fails to store one under "a" halfway; a and b
+// remove; g and h fetch "a" and "b"; C clears; P prunes to two bytes, which is one value; I invalidates; X lets go of the
+// store.
+struct Scenario {
+  std::string script;
+  Contents before;
+  std::optional<std::uint64_t> capacity;
+};
+
+// One way of running a script: each choice is who takes the next step, the caller or one of the queues.
+class Performance {
+ public:
+  Performance(const Scenario& scenario, TestClock& clock) : scenario_(scenario), model_(scenario.before) {
+    const auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_),
+                                                              std::make_shared<test::ManualExecutor>(), nullptr);
+    store_ = DiskCache::createDiskCache("store", "", "larder", scenario.capacity, 1000, 2, 2, false, queues_, nullptr,
+                                        std::make_shared<TrashCollector>("trash", files_, nullptr, nullptr), nullptr,
+                                        nullptr, manifest, files_, nullptr, 50);
+    clock.set(KeyValueStoreFixture::kStart);
+    for (const auto& item : scenario.before) store_->store(item.first, bytesOf(item.second));
+    queues_->runAll();
+    clock.advance(1);
+  }
+
+  std::vector<std::function<void()>> choices() {
+    std::vector<std::function<void()>> choices;
+    if (next_ < scenario_.script.size()) choices.emplace_back([this] { call(scenario_.script[next_++]); });
+    if (work().pending() > 0) choices.emplace_back([this] { work().runNext(); });
+    if (file().pending() > 0) choices.emplace_back([this] { file().runNext(); });
+    return choices;
+  }
+
+  void check() const {
+    for (const Written& written : written_) EXPECT_EQ(written->completions, 1);
+    for (const Written& written : mustSucceed_) {
+      EXPECT_TRUE(written->hasSucceeded() || isInvalidated_) << told(written);
+    }
+    for (const Expectation& expectation : fetched_) {
+      const std::string seen = told(expectation.fetched);
+      const bool asExpected = seen == expectation.value || (seen == "<miss>" && mayBeMissed(expectation));
+      EXPECT_TRUE(asExpected || isInvalidated_ || store_ == nullptr) << seen << " instead of " << expectation.value;
+      EXPECT_FALSE(expectation.fetched->isPending());
+    }
+    EXPECT_LE(ends_, clearsAndPrunes_);
+    EXPECT_TRUE(ends_ == clearsAndPrunes_ || store_ == nullptr) << "a clear or prune never ends";
+    checkDisk();
+  }
+
+ private:
+  struct Expectation {
+    Fetched fetched;
+    std::string value;  // by the order of the calls
+    std::string key;
+    std::size_t position;
+  };
+
+  test::ManualExecutor& work() const { return *queues_->workQueue(0); }
+  test::ManualExecutor& file() const { return *queues_->queue(0); }
+
+  void call(char operation) {
+    const std::string value = "v" + std::to_string(next_);
+    switch (operation) {
+      case 'A':
+        return put("a", value);
+      case 'B':
+        return put("b", value);
+      case 'F':
+        model_.erase("a");
+        return written_.push_back(watch(store_->store("a", nullptr, [this](const std::string& path) -> unsigned int {
+          files_->writeFile(path, bytesOf("half"));
+          throw std::runtime_error("The writer gave up.");
+        })));
+      case 'a':
+        return remove("a");
+      case 'b':
+        return remove("b");
+      case 'g':
+        return fetch("a");
+      case 'h':
+        return fetch("b");
+      case 'C':
+        model_.clear();
+        ++clearsAndPrunes_;
+        return store_->clear([this] { ++ends_; }, [this](const std::exception&) { ++ends_; });
+      case 'P':
+        ++clearsAndPrunes_;
+        return store_->pruneBackToNormal([this] { ++ends_; }, [this](const std::exception&) { ++ends_; }, false);
+      case 'I':
+        isInvalidated_ = true;
+        return written_.push_back(watch(store_->invalidateWithFuture()));
+      default:
+        return store_.reset();
+    }
+  }
+
+  void put(const std::string& key, const std::string& value) {
+    model_[key] = value;
+    mustSucceed_.push_back(watch(store_->store(key, bytesOf(value))));
+    written_.push_back(mustSucceed_.back());
+  }
+
+  void remove(const std::string& key) {
+    model_.erase(key);
+    mustSucceed_.push_back(watch(store_->removeItem(key)));
+    written_.push_back(mustSucceed_.back());
+  }
+
+  void fetch(const std::string& key) {
+    const auto found = model_.find(key);
+    fetched_.push_back({watch(store_->fetch(key)), found == model_.end() ? "<miss>" : found->second, key, next_});
+  }
+
+  // Pruned or evicted before it was looked up, or taken away between looking up and reading.
+  bool mayBeMissed(const Expectation& expectation) const {
+    if (isSelective()) return true;
+    const std::string later = scenario_.script.substr(expectation.position);
+    return later.find_first_of(expectation.key == "a" ? "aFC" : "bC") != std::string::npos;
+  }
+
+  // Whether it depends on the order which items go.
+  bool isSelective() const { return scenario_.capacity || scenario_.script.find('P') != std::string::npos; }
+
+  void checkDisk() const {
+    Contents files;
+    for (const auto& file : files_->files) files[file.first.substr(std::string("store/").size())] = file.second;
+    const auto rows = medium_->rows();
+    for (const auto& row : rows) {
+      ASSERT_EQ(files.count(row.first), 1U) << "a record without a file: " << row.first;
+      EXPECT_EQ(row.second.item.size, files[row.first].size()) << row.first;
+    }
+    if (store_ == nullptr) return;  // deletions that had not begun will not begin any more
+    for (const auto& file : files) ASSERT_EQ(rows.count(file.first), 1U) << "a file without a record: " << file.first;
+    if (isInvalidated_) return;
+    for (const auto& file : files) {
+      const auto expected = model_.find(file.first);
+      ASSERT_NE(expected, model_.end()) << "back again: " << file.first;
+      EXPECT_EQ(file.second, expected->second);
+    }
+    if (!isSelective()) {
+      EXPECT_EQ(files.size(), model_.size()) << "a value is lost";
+    }
+    if (scenario_.capacity) {
+      EXPECT_LE(files.size(), std::max<std::size_t>(*scenario_.capacity, scenario_.before.size()));
+    }
+  }
+
+  const Scenario& scenario_;
+  Contents model_;  // what the calls so far leave behind, one after the other
+  std::size_t next_ = 0;
+  bool isInvalidated_ = false;
+  int clearsAndPrunes_ = 0;
+  int ends_ = 0;
+  std::vector<Written> written_;
+  std::vector<Written> mustSucceed_;
+  std::vector<Expectation> fetched_;
+  std::shared_ptr<MemoryFiles> files_ = std::make_shared<MemoryFiles>();
+  std::shared_ptr<MemoryMedium> medium_ = std::make_shared<MemoryMedium>();
+  std::shared_ptr<ManualQueueFactory> queues_ = std::make_shared<ManualQueueFactory>();
+  std::shared_ptr<DiskCache> store_;
+};
+
+class InEveryOrder : public KeyValueStoreFixture {
+ protected:
+  // Runs the script in every order there is and checks each; the number of orders.
+  std::size_t perform(const Scenario& scenario) {
+    std::size_t orders = 0;
+    std::vector<std::size_t> path;  // which choice was taken at each step
+    do {
+      std::string told = scenario.script + " after " + std::to_string(scenario.before.size()) + ", steps";
+      std::vector<std::size_t> widths;
+      {
+        Performance performance(scenario, clock);
+        for (auto choices = performance.choices(); !choices.empty(); choices = performance.choices()) {
+          if (path.size() == widths.size()) path.push_back(0);
+          const std::size_t choice = path[widths.size()];
+          widths.push_back(choices.size());
+          told += " " + std::to_string(choice) + "/" + std::to_string(choices.size());
+          choices[choice]();
+        }
+        SCOPED_TRACE(told);
+        performance.check();
+      }
+      ++orders;
+      while (!path.empty() && path.back() + 1 == widths[path.size() - 1]) path.pop_back();
+      if (!path.empty()) ++path.back();
+    } while (!path.empty() && !HasFailure());
+    return orders;
+  }
+
+  // Every script of that length from those letters.
+  static std::vector<std::string> scripts(const std::string& letters, std::size_t length) {
+    std::vector<std::string> scripts = {""};
+    for (std::size_t i = 0; i < length; ++i) {
+      std::vector<std::string> longer;
+      for (const std::string& script : scripts) {
+        for (const char letter : letters) longer.push_back(script + letter);
+      }
+      scripts = std::move(longer);
+    }
+    return scripts;
+  }
+
+  void performAll(const std::vector<std::string>& scripts, const std::vector<Contents>& befores,
+                  std::optional<std::uint64_t> capacity = std::nullopt, const std::string& suffix = "") {
+    for (const std::string& script : scripts) {
+      for (const Contents& before : befores) {
+        perform({script + suffix, before, capacity});
+        if (HasFailure()) return;
+      }
+    }
+  }
+
+  const Contents none;
+  const Contents oldA = {{"a", "old"}};
+  const Contents oldB = {{"b", "old"}};
+};
+
+TEST_F(InEveryOrder, ThereAreAsManyOrdersAsThereAreWaysToMerge) {
+  EXPECT_EQ(perform({"A", none, std::nullopt}), 1U);
+  EXPECT_EQ(perform({"AA", none, std::nullopt}), 5U);
+  EXPECT_EQ(perform({"AAA", none, std::nullopt}), 42U);
+}
+
+TEST_F(InEveryOrder, TwoOperationsLeaveWhatTheySay) {
+  performAll(scripts("ABFabghCP", 2), {none, oldA, oldB, {{"a", "old"}, {"b", "old"}}});
+}
+
+TEST_F(InEveryOrder, ThreeOperationsOnOneKeyLeaveWhatTheySay) { performAll(scripts("AFag", 3), {none, oldA}); }
+
+TEST_F(InEveryOrder, StoringRemovingAndClearingLeaveWhatTheySay) {
+  for (const std::string& pair : scripts("ABFag", 2)) {
+    performAll({"C" + pair, pair.substr(0, 1) + "C" + pair.substr(1), pair + "C"}, {none, oldA, oldB});
+  }
+}
+
+TEST_F(InEveryOrder, PruningInBetweenLeavesNoHalves) {
+  for (const std::string& pair : scripts("ABFag", 2)) {
+    performAll({"P" + pair, pair.substr(0, 1) + "P" + pair.substr(1), pair + "P"}, {none, oldB});
+  }
+}
+
+TEST_F(InEveryOrder, EvictingInBetweenLeavesNoHalves) {
+  performAll(scripts("ABag", 3), {none, oldA, oldB}, 1);
+  performAll({"AFB", "FAB", "BFA", "BAF"}, {none, oldA, oldB}, 1);
+}
+
+TEST_F(InEveryOrder, LongerScriptsLeaveWhatTheySay) {
+  performAll({"AaAa", "AaAg", "AgaA", "AFAa", "FAFA", "ACAg"}, {oldA});
+}
+
+TEST_F(InEveryOrder, AStoreThatGoesLeavesNoRecordWithoutAFile) {
+  performAll(scripts("ABFaCP", 2), {none, oldA, oldB}, std::nullopt, "X");
+  performAll(scripts("AB", 2), {none, oldB}, 1, "X");
+}
+
+TEST_F(InEveryOrder, AnInvalidatedStoreLeavesNoHalves) {
+  performAll(scripts("ABFagCP", 2), {none, oldA, oldB}, std::nullopt, "I");
+  performAll(scripts("AB", 2), {none, oldB}, 1, "I");
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar
