@@ -58,10 +58,8 @@ class NodeBuilder : public nlohmann::json_sax<JsonValue> {
   bool parse_error(std::size_t /*position*/, const std::string& /*token*/,
                    const nlohmann::detail::exception& error) override {
     // The parser reports nothing but these; naming the class keeps it what the library's own reader throws.
-    if (const auto* parseError = dynamic_cast<const JsonValue::parse_error*>(&error))
-      throw JsonValue::parse_error(*parseError);
-    if (const auto* outOfRange = dynamic_cast<const JsonValue::out_of_range*>(&error))
-      throw JsonValue::out_of_range(*outOfRange);
+    rethrowAs<JsonValue::parse_error>(error);
+    rethrowAs<JsonValue::out_of_range>(error);
     return false;
   }
 
@@ -69,6 +67,10 @@ class NodeBuilder : public nlohmann::json_sax<JsonValue> {
 
  private:
   static constexpr std::size_t kDeepest = 4;  // document, manager, "stores", store
+
+  template <class Error> static void rethrowAs(const nlohmann::detail::exception& error) {
+    if (const auto* known = dynamic_cast<const Error*>(&error)) throw Error(*known);
+  }
 
   bool add(JsonValue value) {
     if (skipped_ == 0) place(std::move(value));
