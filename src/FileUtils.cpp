@@ -73,8 +73,8 @@ std::vector<unsigned char> allocate(std::size_t size) {
 // What size a directory claims to have differs from one file system to the next.
 void throwIfDirectory(File& file) {
   struct stat status {};
-  if (::fstat(::fileno(file.get()), &status) == 0 && S_ISDIR(status.st_mode))
-    throwSystemError("File read failed", EISDIR);
+  const bool isDirectory = ::fstat(::fileno(file.get()), &status) == 0 && S_ISDIR(status.st_mode);
+  if (isDirectory) throwSystemError("File read failed", EISDIR);
 }
 
 // A directory stream that is closed on every way out.

@@ -393,7 +393,7 @@ void PersistentKeyValueStore::load(const std::shared_ptr<const DiskCacheItem>& i
 bool PersistentKeyValueStore::hasLostItem(const DiskCacheItem& item) {
   try {
     const std::lock_guard<std::mutex> lock(mutex_);
-    if (getManifest()->getItem(item.key) == nullptr) return true;
+    if (lookUp(item.key) == nullptr) return true;
     return writesInFlight_->contains(item.key) && !fileUtils_->pathExists(getFilePath(item.filename));
   } catch (const std::exception&) {
     return false;
@@ -535,18 +535,29 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shar
                           clearsUnderWay_.end());
     clearsUnderWay_.push_back(storedSince);
     begun = true;
-    if (!getManifest()->isLoaded()) getManifest()->load();
-    // Not in their turn like the others: a write that is called off must not leave its record to a later batch.
-    for (const auto& write : writesInFlight_->all()) {
-      getManifest()->removeItem(write->key);
-      write->isRevoked = true;
-    }
+    callOffWrites();
   }
   if (storedSince->empty()) {
     auto items = getManifest()->pruneToSize(0, batchSize_);
     if (!items.empty()) return items;
   }
   return takeAllBut(*storedSince);
+}
+
+// Not in their turn like other items: a write that is called off must not leave its record to a later batch.
+void PersistentKeyValueStore::callOffWrites() {
+  const auto writes = writesInFlight_->all();
+  const auto manifest = getManifest();
+  try {
+    if (!manifest->isLoaded()) manifest->load();
+    for (const auto& write : writes) {
+      manifest->removeItem(write->key);
+      write->isRevoked = true;
+    }
+  } catch (const ManifestCorruptedException&) {
+    for (const auto& write : writes) write->isRevoked = true;  // the purge takes their records
+    throw;
+  }
 }
 
 std::vector<DiskCacheItem> PersistentKeyValueStore::takeAllBut(const KeySet& keep) {

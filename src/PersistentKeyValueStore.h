@@ -223,6 +223,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void prepareWrite(const std::string& key);
   std::unique_ptr<DiskCacheItem> lookUp(const std::string& key);
   std::vector<DiskCacheItem> takeForClear(const std::shared_ptr<KeySet>& storedSince, bool& begun);
+  void callOffWrites();
   std::vector<DiskCacheItem> takeAllBut(const KeySet& keep);
   void purge(const LarderException& error);
   void armStaleRemoval(long delaySeconds);

@@ -78,6 +78,7 @@ class InterceptedManifest final : public DiskCacheManifestInterface {
   std::function<void()> afterSetItem;
   std::function<void(std::uint32_t size, std::uint32_t count)> beforePruneToSize;
   std::function<void()> beforeRemoveItem;
+  std::function<void()> beforeGetItem;
 
   explicit InterceptedManifest(std::shared_ptr<DiskCacheManifestInterface> real) : real_(std::move(real)) {}
 
@@ -88,7 +89,10 @@ class InterceptedManifest final : public DiskCacheManifestInterface {
     real_->setItem(item);
     if (afterSetItem) afterSetItem();
   }
-  std::unique_ptr<DiskCacheItem> getItem(const std::string& key) override { return real_->getItem(key); }
+  std::unique_ptr<DiskCacheItem> getItem(const std::string& key) override {
+    if (beforeGetItem) beforeGetItem();
+    return real_->getItem(key);
+  }
   void updateLastAccessDate(const std::string& key) override { real_->updateLastAccessDate(key); }
   std::optional<std::int32_t> getModificationDate(const std::string& key) override {
     return real_->getModificationDate(key);
@@ -766,6 +770,51 @@ TEST_F(DiskCacheTest, AStoreThatMeetsADamagedManifestTakesAnEarlierQueuedWriteOf
   run();
   later.get();
   // The later value is lost with the purge; the earlier one must not take its place.
+  EXPECT_THAT(files(), IsEmpty());
+}
+
+TEST_F(DiskCacheTest, AFetchThatLostItsFileToARemovalIsAMissEvenWhenTheManifestIsDamagedByThen) {
+  intercept();
+  open();
+  store("k", 5);
+  Fetched fetched = std::make_unique<PersistentKeyValueStore::FetchResult>();
+  std::string error;
+  cache_->fetch("k").then(nullptr, [&](std::future<Fetched>& value) {
+    try {
+      fetched = value.get();
+    } catch (const std::exception& exception) {
+      error = exception.what();
+    }
+  });
+  cache_->removeItem("k");
+  workQueue().runAll();
+  intercepted_->beforeGetItem = [damaged = true]() mutable {
+    if (std::exchange(damaged, false)) throw ManifestCorruptedException("Damaged for the test.", SQLITE_CORRUPT);
+  };
+  const LogCapture log;
+  run();
+  EXPECT_EQ(error, "");
+  EXPECT_EQ(fetched, nullptr);
+  EXPECT_TRUE(log.contains("Store \"thumbs\" purged due to corrupted manifest. "));
+}
+
+TEST_F(DiskCacheTest, AClearThatMeetsADamagedManifestCallsQueuedWritesOffAllTheSame) {
+  intercept();
+  open();
+  auto queued = cache_->store("k", Bytes(1, 'a'));
+  ASSERT_TRUE(workQueue().runNext());
+  intercepted_->beforeRemoveItem = [damaged = true]() mutable {
+    if (std::exchange(damaged, false)) throw ManifestCorruptedException("Damaged for the test.", SQLITE_CORRUPT);
+  };
+  const LogCapture log;
+  Answers answers;
+  cache_->clear(answers.onSuccess(), answers.onError());
+  workQueue().runAll();
+  ASSERT_TRUE(log.contains("purged"));
+  run();
+  queued.get();
+  EXPECT_EQ(answers.successes, 1);
+  EXPECT_THAT(keys(), IsEmpty());
   EXPECT_THAT(files(), IsEmpty());
 }
 

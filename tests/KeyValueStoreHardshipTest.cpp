@@ -3,26 +3,17 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <cerrno>
 #include <cstddef>
-#include <cstdint>
-#include <filesystem>
-#include <functional>
 #include <future>
-#include <limits>
+#include <map>
 #include <memory>
-#include <optional>
 #include <stdexcept>
 #include <string>
-#include <utility>
 #include <vector>
 
-#include "AttributeStore.h"
-#include "Configuration.h"
 #include "DiskCacheManifest.h"
 #include "LarderException.h"
 #include "PersistentKeyValueStore.h"
-#include "StoreDefaults.h"
 #include "support/KeyValueStoreFixture.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -31,30 +22,18 @@ namespace {
 using test::Bytes;
 using test::bytesOf;
 using test::Fetched;
-using test::FetchResult;
 using test::isA;
 using test::KeyValueStoreFixture;
-using test::LogCapture;
 using test::ManifestCall;
 using test::ManualExecutor;
-using test::ManualQueueFactory;
-using test::Operation;
-using test::textOf;
 using test::told;
 using test::watch;
-using test::whatOf;
 using test::Written;
 using testing::ElementsAre;
-using testing::ElementsAreArray;
 using testing::IsEmpty;
-using testing::Pair;
-using testing::UnorderedElementsAre;
 
 using Contents = std::map<std::string, std::string>;
 using Loader = PersistentKeyValueStore::Loader;
-
-const std::string kInvalid =
-    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
 
 class StoreFixture : public KeyValueStoreFixture {
  protected:

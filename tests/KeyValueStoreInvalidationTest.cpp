@@ -4,20 +4,12 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <cerrno>
 #include <cstddef>
-#include <cstdint>
-#include <filesystem>
 #include <functional>
 #include <future>
-#include <limits>
-#include <map>
 #include <memory>
-#include <optional>
-#include <stdexcept>
 #include <string>
 #include <thread>
-#include <utility>
 #include <vector>
 
 #include "DiskCacheManifest.h"
@@ -29,48 +21,26 @@
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
-using test::bytesOf;
 using test::Bytes;
+using test::bytesOf;
 using test::Fetched;
-using test::isA;
 using test::KeyValueStoreFixture;
 using test::Latch;
-using test::LogCapture;
 using test::ManifestCall;
-using test::Operation;
 using test::told;
 using test::watch;
-using test::whatOf;
 using test::Written;
 using testing::Contains;
-using testing::Each;
 using testing::ElementsAre;
 using testing::IsEmpty;
-using testing::Not;
-using testing::UnorderedElementsAre;
-
-using Contents = std::map<std::string, std::string>;
-using Batch = std::vector<DiskCacheItem>;
-using Provider = std::function<const Batch()>;
 
 const std::string kInvalid =
     "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
 
-class MaintenanceFixture : public KeyValueStoreFixture {
+class Invalidation : public KeyValueStoreFixture {
  protected:
   void putMany(int count, const std::string& value = "v") {
     for (int i = 0; i < count; ++i) put("key" + std::to_string(i), value);
-  }
-
-  DiskCacheItem itemOf(const std::string& key, bool isInline = false) const {
-    return {key, key, 1, isInline, 0, 0, nullptr};
-  }
-
-  // Yields the batches one after the other, then empty ones.
-  static Provider yielding(std::vector<Batch> batches) {
-    return [batches = std::move(batches), next = std::make_shared<std::size_t>(0)]() -> const Batch {
-      return *next < batches.size() ? batches[(*next)++] : Batch();
-    };
   }
 
   // How a batched deletion ends, in `ending`.
@@ -88,8 +58,6 @@ class MaintenanceFixture : public KeyValueStoreFixture {
 
   std::string ending;
 };
-
-class Invalidation : public MaintenanceFixture {};
 
 TEST_F(Invalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {
   openWatched();
@@ -177,9 +145,8 @@ TEST_F(Invalidation, RefusesWhatWaitsOnTheWorkQueueAndItHasNoEffect) {
   const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))), watch(store->removeItem("key")),
                                         watch(store->updateLastAccessDate("key"))};
   const std::vector<Fetched> fetched = {
-      watch(store->fetch("key")), watch(store->fetchFirst({"other", "key"}, [](const auto&, const auto&, Bytes&) {
-        return true;
-      }))};
+      watch(store->fetch("key")),
+      watch(store->fetchFirst({"other", "key"}, [](const auto&, const auto&, Bytes&) { return true; }))};
   store->clear(onSuccess(), onError());
   watch(store->invalidateWithFuture());
   manifest->clearTrace();

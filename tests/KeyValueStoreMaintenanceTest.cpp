@@ -3,47 +3,38 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <cerrno>
 #include <cstddef>
 #include <cstdint>
-#include <filesystem>
 #include <functional>
-#include <future>
 #include <limits>
 #include <map>
 #include <memory>
 #include <optional>
 #include <stdexcept>
 #include <string>
-#include <thread>
+#include <system_error>
 #include <utility>
 #include <vector>
 
 #include "DiskCacheManifest.h"
 #include "LarderException.h"
 #include "PersistentKeyValueStore.h"
-#include "support/Barrier.h"
 #include "support/KeyValueStoreFixture.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::bytesOf;
-using test::Bytes;
 using test::Fetched;
-using test::isA;
 using test::KeyValueStoreFixture;
-using test::Latch;
 using test::LogCapture;
 using test::ManifestCall;
 using test::Operation;
 using test::told;
 using test::watch;
-using test::whatOf;
 using test::Written;
 using testing::Contains;
-using testing::Each;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::Not;
@@ -79,11 +70,6 @@ class MaintenanceFixture : public KeyValueStoreFixture {
   }
   std::function<void(const std::exception&)> onError() {
     return [this](const std::exception& error) { ending += std::string("<error> ") + error.what(); };
-  }
-
-  // Whoever puts something on the file queue finds it done.
-  void runFilesAtOnce() const {
-    file().onDispatch = [&queue = file()] { queue.runAll(); };
   }
 
   std::string ending;
@@ -730,8 +716,8 @@ TEST_F(DeletingInBatches, LogsAFileThatCannotBeDeletedAndGoesOn) {
   settle();
   EXPECT_EQ(ending, "<done>");
   EXPECT_THAT(valueFiles(), IsEmpty());
-  ASSERT_THAT(errorLines(log), ElementsAre(testing::StartsWith("Failed to delete file at \"" + pathOf("gone") +
-                                                               "\" domain: ")));
+  ASSERT_THAT(errorLines(log),
+              ElementsAre(testing::StartsWith("Failed to delete file at \"" + pathOf("gone") + "\" domain: ")));
 }
 
 TEST_F(DeletingInBatches, EndsWithAnyOtherFailureAfterTheFilesBefore) {

@@ -8,9 +8,8 @@
 #include <cstddef>
 #include <filesystem>
 #include <fstream>
-#include <functional>
 #include <map>
-#include <memory>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <system_error>
@@ -25,7 +24,6 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::bytesOf;
-using test::Bytes;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
@@ -37,7 +35,6 @@ using test::watch;
 using test::Written;
 using testing::ElementsAre;
 using testing::IsEmpty;
-using testing::StartsWith;
 
 using Contents = std::map<std::string, std::string>;
 
@@ -457,8 +454,8 @@ TEST_F(ADamagedDatabase, OfAnotherProgramIsReplacedWhenTheStoreOpens) {
   directory.makeDirectory("store");
   sqlite3* database = nullptr;
   ASSERT_EQ(sqlite3_open(pathOf("manifest_v1.sqlite").c_str(), &database), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(database, "CREATE TABLE LarderManifest (name TEXT, last_access_date INTEGER)", nullptr, nullptr,
-                         nullptr),
+  ASSERT_EQ(sqlite3_exec(database, "CREATE TABLE LarderManifest (name TEXT, last_access_date INTEGER)", nullptr,
+                         nullptr, nullptr),
             SQLITE_OK);
   sqlite3_close(database);
   open();

@@ -5,12 +5,12 @@
 
 #include <cerrno>
 #include <chrono>
-#include <cstddef>
 #include <cstdint>
 #include <filesystem>
 #include <functional>
 #include <future>
 #include <limits>
+#include <map>
 #include <memory>
 #include <optional>
 #include <stdexcept>
@@ -32,24 +32,17 @@ namespace {
 using test::Bytes;
 using test::bytesOf;
 using test::Fetched;
-using test::FetchResult;
 using test::isA;
 using test::KeyValueStoreFixture;
 using test::LogCapture;
 using test::ManifestCall;
-using test::ManualExecutor;
-using test::ManualQueueFactory;
 using test::Operation;
 using test::textOf;
 using test::told;
 using test::watch;
-using test::whatOf;
 using test::Written;
 using testing::ElementsAre;
-using testing::ElementsAreArray;
 using testing::IsEmpty;
-using testing::Pair;
-using testing::UnorderedElementsAre;
 
 using Contents = std::map<std::string, std::string>;
 using Loader = PersistentKeyValueStore::Loader;
@@ -912,8 +905,8 @@ TEST_F(StoringInline, OverwrittenWhileItIsReadIsReadWhole) {
   openWatched();
   put("key", "old");
   std::promise<void> read;
-  const Fetched fetched = watch(store->fetch(
-      "key", [&](std::shared_ptr<const DiskCacheItem> item, const std::string& path, Bytes& value) {
+  const Fetched fetched =
+      watch(store->fetch("key", [&](std::shared_ptr<const DiskCacheItem> item, const std::string& path, Bytes& value) {
         const bool found = store->readValue(std::move(item), path, value);
         read.set_value();
         return found;
