@@ -254,7 +254,11 @@ bool PersistentKeyValueStore::takeBack(const FileWrite& write) {
     const std::lock_guard<std::mutex> lock(mutex_);
     writesInFlight_->end(write.inFlight);
     if (writesInFlight_->contains(write.key)) return true;
-    if (!write.inFlight->isRevoked) getManifest()->removeItem(write.key);
+    try {
+      if (!write.inFlight->isRevoked) getManifest()->removeItem(write.key);
+    } catch (const ManifestCorruptedException& error) {
+      purge(error);
+    }
   } catch (const std::exception& error) {
     LOG(ERROR) << "Could not remove the record of a failed write: " << error.what();
   }
@@ -692,9 +696,11 @@ void PersistentKeyValueStore::loadManifest() {
     // Armed whatever happens: a load that fails for a passing reason is tried again then.
     std::exception_ptr failure;
     try {
-      self->getManifest()->load();
-    } catch (const ManifestCorruptedException& error) {
-      self->purge(error);
+      try {
+        self->getManifest()->load();
+      } catch (const ManifestCorruptedException& error) {
+        self->purge(error);
+      }
     } catch (...) {
       failure = std::current_exception();
     }
@@ -737,7 +743,9 @@ void PersistentKeyValueStore::startStaleItemRemoval() {
     }
     reportSize();
     const std::int64_t now = currentTime();
-    cutoff = staleAge_ > now ? 0 : static_cast<long>(now - staleAge_);
+    cutoff = staleAge_ > now
+                 ? 0
+                 : static_cast<long>(static_cast<std::uint64_t>(now) - static_cast<std::uint64_t>(staleAge_));
   } catch (const std::exception& error) {
     return onError(error);
   }
@@ -749,7 +757,11 @@ void PersistentKeyValueStore::startStaleItemRemoval() {
     return self->takeBatch(
         [&](DiskCacheManifestInterface& manifest) { return manifest.pruneOldEntries(cutoff, self->batchSize_); });
   };
-  deleteFilesInBatches(takeStaleItems, onSuccess, onError);
+  try {
+    deleteFilesInBatches(takeStaleItems, onSuccess, onError);
+  } catch (const std::exception& error) {
+    onError(error);
+  }
 }
 
 void PersistentKeyValueStore::overrideConfiguration(long staleAge) {
@@ -794,7 +806,13 @@ bool PersistentKeyValueStore::markInvalid(Future<void>& barrier) {
   if (invalidated_) return false;
   invalidated_ = true;
   staleRemovalTimer_.reset();
-  barrier = dispatchTask<void>(fileQueue_, [] {});
+  try {
+    barrier = dispatchTask<void>(fileQueue_, [] {});
+  } catch (...) {  // the file queue is shut down, so nothing is being written either
+    Promise<void> done;
+    barrier = done.getFuture();
+    done.setValue();
+  }
   return true;
 }
 
