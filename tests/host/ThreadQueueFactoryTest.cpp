@@ -566,7 +566,7 @@ TEST_F(ThreadQueueFactoryTest, ATimerThatComesDueAfterItsQueueIsDroppedUnrun) {
   Latch gone(1);
   std::atomic<bool> ran{false};
   const auto timer = queue->dispatchAfter(
-      2 * kMillisecond, [&ran, sentinel = countDownWhenGone(gone)] { ran = true; }, nullptr);
+      500 * kMillisecond, [&ran, sentinel = countDownWhenGone(gone)] { ran = true; }, nullptr);
   queue.reset();
   gate->countDown();
   gone.wait();
