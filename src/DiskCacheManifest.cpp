@@ -139,9 +139,15 @@ void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
     if (!loaded_ || pendingAccessDates_.size() <= kMaxPendingAccessDates) return;
     due->swap(pendingAccessDates_);
   }
-  executor_->dispatch([weakThis = weak_from_this<DiskCacheManifest>(), due] {
-    if (const auto self = weakThis.lock()) self->commitAccessTimeUpdates(*due);
-  });
+  try {
+    executor_->dispatch([weakThis = weak_from_this<DiskCacheManifest>(), due] {
+      if (const auto self = weakThis.lock()) self->commitAccessTimeUpdates(*due);
+    });
+  } catch (...) {
+    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    pendingAccessDates_.insert(due->begin(), due->end());  // those used again meanwhile stay as they are
+    throw;
+  }
 }
 
 std::optional<std::int32_t> DiskCacheManifest::getModificationDate(const std::string& key) {

@@ -107,7 +107,7 @@ PersistentKeyValueStore::PersistentKeyValueStore(
       pruneStrategy_(std::move(pruneStrategy)),
       analyticsReporter_(std::move(analyticsReporter)),
       fileUtils_(std::move(fileUtils)),
-      batchSize_(batchSize),
+      batchSize_(std::max(batchSize, 1U)),
       sizeChangedCallback_(std::move(sizeChangedCallback)),
       temporaryDirectoryPath_(temporaryDirectoryPath),
       manifestPath_(fileUtils_->combinePath(directory, kManifestName)),
@@ -239,6 +239,7 @@ bool PersistentKeyValueStore::recordWritten(const FileWrite& write, unsigned int
   writesInFlight_->end(write.inFlight);
   if (write.inFlight->isRevoked) return false;
   try {
+    if (!write.inFlight->hasRecord) removeOldestItemIfOverMaxCapacity();
     getManifest()->setItem(write.record(size));
   } catch (const ManifestPersistenceException& error) {
     purge(error);
@@ -488,6 +489,7 @@ Future<void> PersistentKeyValueStore::removeItem(const std::string& key) {
 void PersistentKeyValueStore::remove(const std::string& key, const std::shared_ptr<Promise<void>>& promise) {
   bool leftToWrite = false;
   const auto removeAll = [&] {
+    const std::lock_guard<std::mutex> removal(removalMutex_);
     std::string filename;
     {
       const std::lock_guard<std::mutex> lock(mutex_);
@@ -667,6 +669,8 @@ void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<Di
 
 Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>& paths) {
   try {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    throwIfInvalid();  // nothing may get behind the barrier of an invalidation
     return dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), paths] {
       const auto self = weakThis.lock();
       if (self == nullptr) return;
@@ -781,6 +785,7 @@ void PersistentKeyValueStore::invalidate() {
   } catch (const std::future_error&) {
     // The file queue is shut down, so nothing is being written either.
   }
+  { const std::lock_guard<std::mutex> removal(removalMutex_); }
   silenceManifest();
 }
 
@@ -831,7 +836,7 @@ void PersistentKeyValueStore::handleCorruptedManifest(const LarderException& err
 }
 
 void PersistentKeyValueStore::purge(const LarderException& error) {
-  writesInFlight_->revokeRunning();
+  writesInFlight_->loseRecords();
   trashCollector_->collectPath(path);
   fileUtils_->createDirectory(path, true);
   const auto manifest = getManifest();
@@ -894,8 +899,9 @@ template <class T> void PersistentKeyValueStore::dispatchWork(const std::vector<
 void PersistentKeyValueStore::throwIfReserved(const std::string& key) const {
   if (inlineData_) return;
   if (key.find('\0') != std::string::npos) throw std::invalid_argument("Key '" + key + "' holds a zero byte.");
-  bool reserved = key == kManifestName || key == AttributeStore::fileName;
-  for (const std::string& companion : kManifestCompanions) reserved = reserved || key == kManifestName + companion;
+  const std::string name = key.substr(key.rfind('/') + 1);  // whatever the way there, it may lead back here
+  bool reserved = name == kManifestName || name == AttributeStore::fileName;
+  for (const std::string& companion : kManifestCompanions) reserved = reserved || name == kManifestName + companion;
   if (reserved) throw std::invalid_argument("Key '" + key + "' is reserved.");
 }
 

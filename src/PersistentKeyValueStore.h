@@ -32,18 +32,19 @@ class WritesInFlight;
 // Found again after a restart, expired when they have not been used for long, limited in number if configured.
 //
 //   <store directory>/
-//     manifest_v1.sqlite      the records of all items, and the inline values (with SQLite's companions "-wal" and
-//     "-shm") <key>                   the value, for a store with files; the key is the file name as it stands
+//     manifest_v1.sqlite   the records of all items and the inline values (and SQLite's companions, -wal and -shm)
+//     <key>                the value, for a store with files; the key is the file name as it stands
 //
 // Threads. Any thread may call. Calls only take their arguments in and return a future: the manifest is used on the
 // work queue and files on the file queue, both the host's and serial. `getAllKeys`, `fetchModificationDate`,
 // `getManifest` and `invalidate` work on the caller's thread. Operations on one key take effect in the order in which
-// they were called. A store that has gone leaves what it had not begun undone.
+// they were called, but an inline value that is replaced while a fetch waits is delivered in its new form. A store that
+// has gone leaves what it had not begun undone.
 //
 // Errors travel in the futures: `InvalidatedException` after invalidation, `FileUtilsIoException` for files, what a
-// writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (the manifest's and
-// the attributes' file names). A manifest that is damaged, or cannot be written, fails nothing: the store is PURGED,
-// all its values go to the trash, the log says so in one line, and work goes on with an empty store.
+// writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (one that ends in
+// the manifest's or the attributes' file name). A manifest that is damaged, or cannot be written, fails nothing: the
+// store is PURGED, all its values go to the trash, the log says so in one line, and work goes on with an empty store.
 //
 // Keys are file names as they stand: one that holds a "/" or is ".." reaches outside the store's directory. Encode what
 // is not under your own control. A key that holds a zero byte fails with `std::invalid_argument`.
@@ -74,9 +75,9 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Creates the store's directory, takes two queues from the factory and starts loading the manifest. `name` appears in
   // log lines and events. `capacity`: items, absent for no limit; checked before each write, which then evicts the one
   // item used least recently, also when it overwrites. `staleAge`: seconds without access after which an item expires;
-  // checked 300 seconds after loading and then every hour, in batches of `batchSize`. `manifest` may be null: one is
-  // then created in the directory on first use. `analyticsReporter` may be null and `sizeChangedCallback` empty; the
-  // latter is called on the work queue. Throws what creating the directory throws.
+  // checked 300 seconds after loading and then every hour, in batches of `batchSize` (at least 1). `manifest` may be
+  // null: one is then created in the directory on first use. `analyticsReporter` may be null and `sizeChangedCallback`
+  // empty; the latter is called on the work queue. Throws what creating the directory throws.
   static std::shared_ptr<PersistentKeyValueStore> createPersistentKeyValueStore(
       const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
       std::optional<std::uint64_t> capacity, long staleAge, bool inlineData,
@@ -145,8 +146,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   bool isPrunable() override;  // never
 
   // Refuses all work from now on. What still waits on the work queue fails with `InvalidatedException`; file writes
-  // that have been queued are finished first: this blocks until then, and must not be called on one of the store's
-  // queues. The files stay, theirs to discard who invalidates. A second call does nothing.
+  // that have been queued, and a removal that has begun, are finished first: this blocks until then, and must not be
+  // called on one of the store's queues. The files stay, theirs to discard who invalidates. A second call does nothing.
   void invalidate() override;
 
   // The same without waiting: fulfilled when the file queue has got so far. Leaves the manifest open.
@@ -272,6 +273,9 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   std::vector<std::weak_ptr<KeySet>> clearsUnderWay_;  // for each, the keys stored since it began
 
   std::atomic<bool> invalidated_{false};  // set under the mutex
+
+  std::mutex
+      removalMutex_;  // taken before mutex_; held until a removal has deleted its file: invalidation waits for it
 
   std::mutex manifestMutex_;  // taken after mutex_; guards the creation of the manifest
   std::atomic<bool> manifestCreated_{false};

@@ -14,6 +14,7 @@ class WritesInFlight {
  public:
   struct Write {
     const std::string key;
+    bool hasRecord = true;   // the provisional one
     bool isRunning = false;  // the writer has been called
     bool isRevoked = false;
     bool isOver = false;
@@ -45,9 +46,12 @@ class WritesInFlight {
     return range.first != range.second;
   }
 
-  // Revokes those whose file may have been taken away under their writer.
-  void revokeRunning() {
-    for (const auto& write : writes_) write.second->isRevoked = write.second->isRevoked || write.second->isRunning;
+  // All records and files have gone. Revokes the writes whose file may have been taken away under their writer.
+  void loseRecords() {
+    for (const auto& write : writes_) {
+      write.second->hasRecord = false;
+      write.second->isRevoked = write.second->isRevoked || write.second->isRunning;
+    }
   }
 
   std::vector<std::shared_ptr<Write>> all() const {

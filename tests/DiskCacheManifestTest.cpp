@@ -823,6 +823,19 @@ TEST_F(DiskCacheManifestTest, TheFiveHundredAndThirteenthSendsAllOfThemInOneTask
   EXPECT_THAT(medium_->calls("updateLastAccessDate"), IsEmpty());
 }
 
+TEST_F(DiskCacheManifestTest, AnExecutorThatTakesNoTaskLosesNoDate) {
+  const TestClock clock(5000);
+  createLoaded();
+  fill(513);
+  medium_->forgetCalls();
+  use(512);
+  executor_->throwOnDispatch(true);
+  EXPECT_THROW(manifest_->updateLastAccessDate("512"), std::runtime_error);
+  executor_->throwOnDispatch(false);
+  ASSERT_TRUE(fireTimer());
+  EXPECT_THAT(medium_->calls("updateLastAccessDate"), SizeIs(513));
+}
+
 TEST_F(DiskCacheManifestTest, OneItemUsedOverAndOverIsOneDate) {
   createLoaded();
   fill(1);

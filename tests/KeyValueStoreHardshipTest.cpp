@@ -64,9 +64,13 @@ TEST_F(ReservedKeys, FailEveryOperationOfAStoreWithFilesAndTouchNothing) {
   open();
   put("key", "value");
   const std::string before = directory.read("store/manifest_v1.sqlite");
-  const std::vector<std::string> reserved = {"manifest_v1.sqlite", "manifest_v1.sqlite-journal",
-                                             "manifest_v1.sqlite-wal", "manifest_v1.sqlite-shm",
-                                             "_cellar_extended_attributes"};
+  const std::vector<std::string> reserved = {"manifest_v1.sqlite",
+                                             "manifest_v1.sqlite-journal",
+                                             "manifest_v1.sqlite-wal",
+                                             "manifest_v1.sqlite-shm",
+                                             "_cellar_extended_attributes",
+                                             "./manifest_v1.sqlite",
+                                             "below/..//_cellar_extended_attributes"};
   files->clearTrace();
   for (const std::string& key : reserved) {
     const std::string message = "Key '" + key + "' is reserved.";

@@ -4,7 +4,9 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
+#include <filesystem>
 #include <functional>
 #include <future>
 #include <memory>
@@ -27,6 +29,7 @@ using test::Fetched;
 using test::KeyValueStoreFixture;
 using test::Latch;
 using test::ManifestCall;
+using test::Operation;
 using test::told;
 using test::watch;
 using test::Written;
@@ -70,6 +73,40 @@ TEST_F(Invalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {
   ASSERT_TRUE(file().runNext());
   EXPECT_EQ(told(barrier), "<done>");
   EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
+}
+
+TEST_F(Invalidation, BlocksUntilARemovalThatIsUnderWayHasDeletedItsFile) {
+  openWatched();
+  put("key", "value");
+  Latch barrierIsSet(1);
+  file().onDispatch = [&] { barrierIsSet.countDown(); };
+  std::future<bool> sawFile;
+  files->onCall = [&](Operation operation, const std::string& path) {
+    if (operation != Operation::DeleteFile) return;
+    sawFile = std::async(std::launch::async, [this, path] {
+      store->invalidate();
+      return std::filesystem::exists(path);
+    });
+    barrierIsSet.wait();
+    file().runAll();
+    sawFile.wait_for(std::chrono::milliseconds(50));  // it must not get on before the file has gone
+  };
+  EXPECT_EQ(drop("key"), "<done>");
+  EXPECT_FALSE(sawFile.get());
+}
+
+TEST_F(Invalidation, BetweenABatchAndItsFilesLeavesThemToWhoInvalidates) {
+  openWatched();
+  put("key", "value");
+  const auto takeItThenInvalidate = [this]() -> std::vector<DiskCacheItem> {
+    const auto items = manifest->pruneToSize(0, 1);
+    watch(store->invalidateWithFuture());
+    return items;
+  };
+  store->deleteFilesInBatches(takeItThenInvalidate, onSuccess(), onError());
+  settle();
+  EXPECT_EQ(ending, "<error> " + kInvalid);
+  EXPECT_EQ(valueFile("key"), "value");
 }
 
 TEST_F(Invalidation, ASecondTimeIsDoneAtOnce) {

@@ -363,6 +363,19 @@ TEST_F(ADamagedManifest, PurgedWhileAWriteWaitsStillTakesThatWrite) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
+TEST_F(ADamagedManifest, PurgedWhileWritesWaitStaysWithinItsCapacity) {
+  options.capacity = 2;
+  openWatched();
+  for (const std::string key : {"a", "b"}) watch(store->store(key, bytesOf("value")));
+  work().runAll();
+  store->handleCorruptedManifest(corrupted);
+  for (const std::string key : {"c", "d"}) watch(store->store(key, bytesOf("value")));
+  work().runAll();
+  settle();
+  EXPECT_EQ(keysInMedium().size(), 2U);
+  EXPECT_EQ(valueFiles(), keysInMedium());
+}
+
 TEST_F(ADamagedManifest, PurgedByARunningWriterLeavesTheValueWholeOrAbsent) {
   for (const bool writesFirst : {true, false}) {
     openWatched();

@@ -86,14 +86,16 @@ TEST(WritesInFlight, RevokesAllOfAKeyAndNoOther) {
   EXPECT_FALSE(writes.revoke("unknown"));
 }
 
-TEST(WritesInFlight, RevokesThoseThatRunAlone) {
+TEST(WritesInFlight, ThatLoseTheirRecordsAreRevokedIfTheyRunAndGoOnWithoutOtherwise) {
   WritesInFlight writes;
   const auto running = writes.begin("running");
   running->isRunning = true;
   const auto waiting = writes.begin("waiting");
-  writes.revokeRunning();
+  EXPECT_TRUE(waiting->hasRecord);
+  writes.loseRecords();
   EXPECT_TRUE(running->isRevoked);
   EXPECT_FALSE(waiting->isRevoked);
+  EXPECT_FALSE(waiting->hasRecord);
 }
 
 // --- In one breath ---
