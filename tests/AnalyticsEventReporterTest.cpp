@@ -11,8 +11,8 @@
 #include <type_traits>
 #include <utility>
 
+#include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
-#include "support/RecordingAnalytics.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {

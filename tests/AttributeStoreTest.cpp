@@ -10,7 +10,7 @@
 #include <string>
 #include <vector>
 
-#include "support/FaultyFileUtils.h"
+#include "host/testing/FaultyFileUtils.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
 

@@ -25,9 +25,9 @@
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
 #include "PruneStrategy.h"
+#include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
-#include "support/ManualQueue.h"
 #include "support/TemporaryDirectory.h"
 #include "support/TestClock.h"
 

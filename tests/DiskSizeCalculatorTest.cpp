@@ -20,10 +20,11 @@
 #include <vector>
 
 #include "AttributeStore.h"
+#include "LarderException.h"
+#include "host/testing/FaultyFileUtils.h"
+#include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
-#include "support/FaultyFileUtils.h"
 #include "support/LogCapture.h"
-#include "support/RecordingAnalytics.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar {

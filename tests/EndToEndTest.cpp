@@ -33,9 +33,9 @@
 #include "host/Await.h"
 #include "host/DirectoryPathLocations.h"
 #include "host/ThreadQueueFactory.h"
+#include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
-#include "support/RecordingAnalytics.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar {

@@ -24,8 +24,8 @@
 #include <vector>
 
 #include "LarderException.h"
+#include "host/testing/FaultyFileUtils.h"
 #include "support/Barrier.h"
-#include "support/FaultyFileUtils.h"
 #include "support/TemporaryDirectory.h"
 
 namespace {

@@ -11,8 +11,8 @@
 #include <utility>
 #include <vector>
 
+#include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
-#include "support/ManualQueue.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {

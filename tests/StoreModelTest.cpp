@@ -35,8 +35,8 @@
 #include "PersistentKeyValueStore.h"
 #include "PruneStrategy.h"
 #include "TrashCollector.h"
+#include "host/testing/ManualQueue.h"
 #include "support/LogCapture.h"
-#include "support/ManualQueue.h"
 #include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar {

@@ -22,11 +22,11 @@
 #include <utility>
 #include <vector>
 
+#include "host/testing/FaultyFileUtils.h"
+#include "host/testing/ManualQueue.h"
+#include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
-#include "support/FaultyFileUtils.h"
 #include "support/LogCapture.h"
-#include "support/ManualQueue.h"
-#include "support/RecordingAnalytics.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar {

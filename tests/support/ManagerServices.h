@@ -15,10 +15,10 @@
 #include "DiskSizeCalculator.h"
 #include "StoreDirectoryNameBuilder.h"
 #include "TrashCollector.h"
+#include "host/testing/FaultyFileUtils.h"
+#include "host/testing/ManualQueue.h"
+#include "host/testing/RecordingAnalytics.h"
 #include "support/FakeStore.h"
-#include "support/FaultyFileUtils.h"
-#include "support/ManualQueue.h"
-#include "support/RecordingAnalytics.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar::test {

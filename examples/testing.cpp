@@ -1,0 +1,71 @@
+// Tests of a host's own use of a store: nothing runs before the test says so, the disk fails on demand, events are
+// kept. Exits with 0 when what it expects comes true.
+
+#include <cerrno>
+#include <cstdlib>
+#include <iostream>
+#include <memory>
+#include <string>
+
+#include "Cellar.h"
+#include "host/Await.h"
+#include "host/testing/FaultyFileUtils.h"
+#include "host/testing/ManualQueue.h"
+#include "host/testing/RecordingAnalytics.h"
+
+using namespace velmora::mobile::xplat::cellar;  // NOLINT: an example may
+
+// GUIDE: begin
+struct Surroundings {
+  std::shared_ptr<test::ManualQueueFactory> queues = std::make_shared<test::ManualQueueFactory>();
+  std::shared_ptr<test::FaultyFileUtils> files = std::make_shared<test::FaultyFileUtils>();
+  std::shared_ptr<test::EventLog> events = std::make_shared<test::EventLog>();
+  std::shared_ptr<AnalyticsEventReporter> reporter = test::recordingReporter(events);
+};
+
+std::shared_ptr<PersistentKeyValueStore> openDrafts(const Surroundings& with, const std::string& directory) {
+  const auto trash = std::make_shared<TrashCollector>(directory + "/trash", with.files, nullptr, with.queues);
+  return PersistentKeyValueStore::createPersistentKeyValueStore(directory + "/drafts", directory + "/tmp", "drafts", {},
+                                                                3600, false, with.queues, trash, with.reporter, nullptr,
+                                                                with.files, nullptr, 50);
+}
+
+// A draft is not there before the queues have run, and a full disk is an error that the caller sees.
+bool draftsKeepTheirPromises(const std::string& directory) {
+  const Surroundings with;
+  const auto drafts = openDrafts(with, directory);
+
+  Future<void> stored = drafts->store("letter", {'h', 'i'});
+  const bool waits = with.files->calls(test::Operation::WriteFile) == 0;
+  with.queues->runAll();
+  host::await(std::move(stored));
+
+  with.files->failNext(test::Operation::WriteFile, ENOSPC);
+  Future<void> refused = drafts->store("novel", {'.'});
+  with.queues->runAll();
+  bool wasRefused = false;
+  try {
+    host::await(std::move(refused));
+  } catch (const FileUtilsIoException& error) {
+    wasRefused = error.code() == ENOSPC;
+  }
+
+  auto fetched = drafts->fetch("letter");
+  with.queues->runAll();
+  const bool found = host::await(std::move(fetched)) != nullptr;
+  return waits && wasRefused && found && with.events->named("qzpkvs_access").size() == 1;
+}
+// GUIDE: end
+
+int main(int argc, char** argv) {
+  if (argc != 2) {
+    std::cerr << "usage: testing DIRECTORY\n";
+    return 2;
+  }
+  if (!draftsKeepTheirPromises(argv[1])) {
+    std::cerr << "a promise was not kept\n";
+    return EXIT_FAILURE;
+  }
+  std::cout << "all promises kept\n";
+  return EXIT_SUCCESS;
+}

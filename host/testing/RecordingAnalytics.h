@@ -1,0 +1,54 @@
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "AnalyticsEventReporter.h"
+#include "Export.h"
+#include "JsonValue.h"
+#include "XAnalytics.h"
+
+namespace velmora::mobile::xplat::cellar::test {
+
+// One call of the analytics sink, as it came.
+struct CELLAR_EXPORT LoggedEvent {
+  std::string name;
+  std::string category;
+  std::string payload;
+  std::string time;
+
+  // The payload, parsed. Throws what parsing throws.
+  JsonValue json() const;
+};
+
+// Remembers events in the order in which they arrived. Thread-safe.
+class CELLAR_EXPORT EventLog {
+ public:
+  void add(LoggedEvent event);
+  std::vector<LoggedEvent> events() const;
+  std::vector<LoggedEvent> named(const std::string& name) const;
+  void clear();
+
+ private:
+  mutable std::mutex mutex_;  // guards the events
+  std::vector<LoggedEvent> events_;
+};
+
+// A sink that writes into an event log, which the test keeps.
+class CELLAR_EXPORT RecordingAnalytics : public XAnalytics {
+ public:
+  explicit RecordingAnalytics(std::shared_ptr<EventLog> log);
+
+  void logEvent(const std::string& eventName, const std::string& category, const std::string& payload,
+                const std::string& time) override;
+
+ private:
+  std::shared_ptr<EventLog> log_;
+};
+
+// A reporter over such a sink.
+CELLAR_EXPORT std::shared_ptr<AnalyticsEventReporter> recordingReporter(std::shared_ptr<EventLog> log);
+
+}  // namespace velmora::mobile::xplat::cellar::test
