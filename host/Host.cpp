@@ -21,6 +21,7 @@
 #include "StoreManagerFactory.h"
 #include "TrashCollector.h"
 #include "host/DirectoryPathLocations.h"
+#include "host/FileNames.h"
 #include "host/ThreadQueueFactory.h"
 
 namespace velmora::mobile::xplat::cellar::host {
@@ -50,23 +51,8 @@ std::string checkedRoot(std::string root) {
   return root;
 }
 
-bool isPlainInDirectoryName(char byte) {
-  return (byte >= 'a' && byte <= 'z') || (byte >= '0' && byte <= '9') || byte == '-';
-}
-
-// Different keys give different names, on file systems that ignore case too.
-std::string escapedForDirectoryName(const std::string& sessionKey) {
-  constexpr char digits[] = "0123456789abcdef";
-  std::string name;
-  for (const char character : sessionKey) {
-    if (isPlainInDirectoryName(character)) {
-      name += character;
-      continue;
-    }
-    const auto byte = static_cast<unsigned char>(character);
-    name += {'%', digits[byte / 16], digits[byte % 16]};
-  }
-  return name;
+std::string nameOfSession(const std::string& sessionKey) {
+  return sessionKey.empty() ? sessionKey : encodeFileName(sessionKey);
 }
 
 std::shared_ptr<AnalyticsEventReporter> reporterFor(std::unique_ptr<XAnalytics> sink) {
@@ -89,7 +75,7 @@ Host::Host(HostOptions options)
       locations_(std::make_shared<DirectoryPathLocations>(checkedRoot(options.root))),
       nameBuilders_(std::make_shared<StoreDirectoryNameBuilderFactory>(options.versionTag, options.localeSecondTag,
                                                                        options.localeFirstTag)),
-      sessionTagMapper_(options.sessionTagMapper ? options.sessionTagMapper : escapedForDirectoryName),
+      sessionTagMapper_(options.sessionTagMapper ? options.sessionTagMapper : nameOfSession),
       runMaintenance_(options.runMaintenance),
       shutDownPatience_(options.shutDownPatience),
       analytics_(reporterFor(std::move(options.analytics))),

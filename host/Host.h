@@ -41,16 +41,14 @@ struct HostOptions {
   std::string localeFirstTag;  // parts of the names of locale-sensitive stores, "en" and "US" say
   std::string localeSecondTag;
 
-  // Makes the name of a session's directories out of its key. Empty: the key itself, with all but a-z, 0-9 and "-"
-  // written as
-  // "%" and two hexadecimal digits for each byte. A key that is a secret or longer than some 80 bytes wants a mapper of
-  // yours.
+  // Makes the name of a session's directories out of its key. Empty: `encodeFileName` of the key, which throws
+  // `std::length_error` for a long one. A key that is a secret or longer than some 80 bytes wants a mapper of yours.
   std::function<std::string(const std::string& sessionKey)> sessionTagMapper;
 
   std::unique_ptr<XAnalytics> analytics;  // null: nothing is reported
 
-  long lazyDelaySeconds =
-      10;  // until stores that nobody has asked for are created, and directories measured, in the background
+  // Until stores that nobody has asked for are created, and directories measured, in the background.
+  long lazyDelaySeconds = 10;
   bool runMaintenance = true;  // whether managers clean up what is stale and prune what is over its limit
   std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for work that is under way
 

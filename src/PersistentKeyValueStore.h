@@ -47,7 +47,8 @@ class WritesInFlight;
 // store is PURGED, all its values go to the trash, the log says so in one line, and work goes on with an empty store.
 //
 // Keys are file names as they stand: one that holds a "/" or is ".." reaches outside the store's directory. Encode what
-// is not under your own control. A key that holds a zero byte fails with `std::invalid_argument`.
+// is not under your own control (the host kit has `encodeFileName`). A key that holds a zero byte fails with
+// `std::invalid_argument`.
 //
 // What survives. The process killed: every value whose future has been fulfilled. Caught in the middle of an overwrite:
 // the old value, the new one, or a part of it; of a first write: a part, or an error. Power cut: as much as the file

@@ -232,7 +232,7 @@ TEST_F(HostTest, AStoreMayOpenTheSession) {
 TEST_F(HostTest, SessionKeysBecomeNamesThatAreSafeInAPath) {
   const auto host = start();
   host->manager("inbox", "../Al_\xFF-9");
-  EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_store_%2e%2e%2f%41l%5f%ff-9"});
+  EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_store_%2e.%2f%41l%5f%ff-9"});
 }
 
 TEST_F(HostTest, AMapperOfTheApplicationNamesSessions) {
