@@ -69,6 +69,51 @@ HostOptions plainOptions(const std::string& configuration, const std::string& ro
 
 }  // namespace
 
+// A request on its way: the managers of its scope do not end meanwhile. Refused while they are ending, for a callback
+// on a store's queue that waited here would be waited for by the end of that store.
+class Host::Request {
+ public:
+  Request(Host& host, Scope& scope) : host_(host), scope_(scope) {
+    const std::lock_guard<std::mutex> lock(host_.mutex_);
+    if (scope_.isEnding) throw InvalidatedException("The managers are being invalidated.");
+    ++scope_.requests;
+  }
+  ~Request() {
+    const std::lock_guard<std::mutex> lock(host_.mutex_);
+    --scope_.requests;
+    host_.changed_.notify_all();
+  }
+  Request(const Request&) = delete;
+  Request& operator=(const Request&) = delete;
+
+ private:
+  Host& host_;
+  Scope& scope_;
+};
+
+// The time in which a scope lets nobody in. One at a time; begins when the requests that are under way have got
+// through.
+class Host::Ending {
+ public:
+  Ending(Host& host, Scope& scope) : host_(host), scope_(scope) {
+    std::unique_lock<std::mutex> lock(host_.mutex_);
+    host_.changed_.wait(lock, [this] { return !scope_.isEnding; });
+    scope_.isEnding = true;
+    host_.changed_.wait(lock, [this] { return scope_.requests == 0; });
+  }
+  ~Ending() {
+    const std::lock_guard<std::mutex> lock(host_.mutex_);
+    scope_.isEnding = false;
+    host_.changed_.notify_all();
+  }
+  Ending(const Ending&) = delete;
+  Ending& operator=(const Ending&) = delete;
+
+ private:
+  Host& host_;
+  Scope& scope_;
+};
+
 Host::Host(HostOptions options)
     : configuration_(readConfiguration(options.configuration)),
       fileUtils_(options.fileUtils ? options.fileUtils : std::make_shared<FileUtils>()),
@@ -87,8 +132,8 @@ Host::Host(HostOptions options)
       sizes_(std::make_shared<DiskSizeCalculator>(fileUtils_, attributes_, analytics_)),
       lazyWork_(LazyDispatcher::createLazyDispatcher(taskQueueFactory_, options.lazyDelaySeconds)),
       measuringQueue_(taskQueueFactory_->createWorkQueue()),
-      sessionScoped_(createFactory(true)),
-      sessionless_(createFactory(false)) {
+      sessionScoped_{createFactory(true)},
+      sessionless_{createFactory(false)} {
   sizes_->exclude(AttributeStore::fileName);
   sizes_->setAnalytics(analytics_ != nullptr);
 }
@@ -113,12 +158,11 @@ std::shared_ptr<StoreManagerFactory> Host::createFactory(bool servesSessionScope
 }
 
 std::shared_ptr<StoreManager> Host::manager(const std::string& name, const std::optional<std::string>& sessionKey) {
-  if (!configuration_->getManager(name)->sessionScoped) {
-    return remember(sessionless_->managerForIdentifier(name, "", runMaintenance_), sessionlessManagers_);
-  }
-  const std::shared_lock<std::shared_mutex> lock(sessionGate_);
-  const std::string session = openSession(sessionKey);
-  return remember(sessionScoped_->managerForIdentifier(name, session, runMaintenance_), sessionManagers_);
+  const bool isSessionScoped = configuration_->getManager(name)->sessionScoped;
+  Scope& scope = isSessionScoped ? sessionScoped_ : sessionless_;
+  const Request request(*this, scope);
+  const std::string session = isSessionScoped ? openSession(sessionKey) : "";
+  return remember(scope.factory->managerForIdentifier(name, session, runMaintenance_), scope);
 }
 
 std::shared_ptr<StoreManager> Host::managerOfStore(const std::string& storeIdentifier,
@@ -135,11 +179,12 @@ std::string Host::openSession(const std::optional<std::string>& sessionKey) {
   return *openSession_;
 }
 
-std::shared_ptr<StoreManager> Host::remember(std::shared_ptr<StoreManager> manager, Managers& managers) {
+std::shared_ptr<StoreManager> Host::remember(std::shared_ptr<StoreManager> manager, Scope& scope) {
   {
     const std::lock_guard<std::mutex> lock(mutex_);
-    if (std::find(managers.begin(), managers.end(), manager) != managers.end()) return manager;
-    managers.push_back(manager);
+    auto& known = scope.handedOut;
+    if (std::find(known.begin(), known.end(), manager) != known.end()) return manager;
+    known.push_back(manager);
   }
   // A new manager has registered the directories of its unmanaged stores; measuring them is nobody else's task.
   lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
@@ -147,34 +192,35 @@ std::shared_ptr<StoreManager> Host::remember(std::shared_ptr<StoreManager> manag
 }
 
 void Host::logOut() {
-  const std::unique_lock<std::shared_mutex> gate(sessionGate_);
+  const Ending ending(*this, sessionScoped_);
   std::optional<std::string> session;
   {
     const std::lock_guard<std::mutex> lock(mutex_);
     session.swap(openSession_);
   }
   if (!session) return;
-  invalidateAll(*sessionScoped_, sessionManagers_);
+  invalidateAll(sessionScoped_);
   trashSessionDirectories(*session);
 }
 
 void Host::invalidate() {
   logOut();
-  invalidateAll(*sessionless_, sessionlessManagers_);
+  const Ending ending(*this, sessionless_);
+  invalidateAll(sessionless_);
 }
 
-void Host::invalidateAll(StoreManagerFactory& factory, Managers& managers) {
-  Managers handedOut;
+void Host::invalidateAll(Scope& scope) {
+  std::vector<std::shared_ptr<StoreManager>> managers;
   {
     const std::lock_guard<std::mutex> lock(mutex_);
-    handedOut.swap(managers);
+    managers.swap(scope.handedOut);
   }
   try {
-    factory.invalidate();
+    scope.factory->invalidate();
   } catch (const std::future_error&) {
     // A manager that could not be built stopped the factory on its way; its first caller knows why.
   }
-  for (const auto& manager : handedOut) manager->invalidate();
+  for (const auto& manager : managers) manager->invalidate();
 }
 
 void Host::trashSessionDirectories(const std::string& sessionKey) {

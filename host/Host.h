@@ -1,11 +1,11 @@
 #pragma once
 
 #include <chrono>
+#include <condition_variable>
 #include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
-#include <shared_mutex>
 #include <string>
 #include <vector>
 
@@ -87,8 +87,8 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   Host& operator=(const Host&) = delete;
 
   // The manager of that name, built on first request; never empty. Throws `ConfigurationException` when there is none,
-  // `std::logic_error` when another session is open, and what building it throws; when that has failed, later requests
-  // throw `std::future_error` until `logOut` or `invalidate`.
+  // `std::logic_error` when another session is open, `InvalidatedException` while its scope is being ended, and what
+  // building it throws; when that has failed, later requests throw `std::future_error` until `logOut` or `invalidate`.
   std::shared_ptr<StoreManager> manager(const std::string& name,
                                         const std::optional<std::string>& sessionKey = std::nullopt);
 
@@ -106,9 +106,9 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   }
 
   // Ends the open session: its managers and stores become invalid and its directories go to the trash, those of
-  // managers that nobody has asked for included. The next request may open another session. Requests for session-scoped
-  // managers wait meanwhile, and stores finish what they are writing: must not be called on one of their queues, nor in
-  // a callback that runs there. Not an error: no session is open.
+  // managers that nobody has asked for included. The next request may open another session. Stores finish what they are
+  // writing meanwhile, and requests for session-scoped managers are refused: must not be called on one of the stores'
+  // queues, nor in a callback that runs there. Not an error: no session is open.
   void logOut();
 
   // Ends the open session and discards the data of the other managers that were asked for, too. As `logOut` otherwise.
@@ -125,12 +125,20 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<LazyDispatcher>& lazyWork() const { return lazyWork_; }
 
  private:
-  using Managers = std::vector<std::shared_ptr<StoreManager>>;
+  // The managers of one scope, and who is asking for them. All but the factory is guarded by the mutex.
+  struct Scope {
+    const std::shared_ptr<StoreManagerFactory> factory;
+    std::vector<std::shared_ptr<StoreManager>> handedOut{};
+    std::size_t requests = 0;  // under way
+    bool isEnding = false;     // and lets no further request in
+  };
+  class Request;
+  class Ending;
 
   std::shared_ptr<StoreManagerFactory> createFactory(bool servesSessionScoped) const;
   std::string openSession(const std::optional<std::string>& sessionKey);
-  std::shared_ptr<StoreManager> remember(std::shared_ptr<StoreManager> manager, Managers& managers);
-  void invalidateAll(StoreManagerFactory& factory, Managers& managers);
+  std::shared_ptr<StoreManager> remember(std::shared_ptr<StoreManager> manager, Scope& scope);
+  void invalidateAll(Scope& scope);
   void trashSessionDirectories(const std::string& sessionKey);
 
   const std::shared_ptr<const Configuration> configuration_;
@@ -148,14 +156,12 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<DiskSizeCalculator> sizes_;
   const std::shared_ptr<LazyDispatcher> lazyWork_;
   const std::shared_ptr<AsyncExecutor> measuringQueue_;
-  const std::shared_ptr<StoreManagerFactory> sessionScoped_;
-  const std::shared_ptr<StoreManagerFactory> sessionless_;
 
-  std::shared_mutex sessionGate_;  // shared while a session's manager is asked for, exclusive while the session ends
-  std::mutex mutex_;               // guards the three below; taken after the gate, never held while anything is called
+  std::mutex mutex_;                 // guards the three below, never held while anything is called
+  std::condition_variable changed_;  // a scope's requests, or its end
+  Scope sessionScoped_;
+  Scope sessionless_;
   std::optional<std::string> openSession_;
-  Managers sessionManagers_;  // handed out so far
-  Managers sessionlessManagers_;
 };
 
 }  // namespace host

@@ -60,7 +60,7 @@ std::shared_ptr<Store> StoreManagerImpl::getStoreImpl(const std::string& identif
   bool created = false;
   auto store = common_.getStore(identifier, taskQueueFactory_, trashCollector_, analyticsReporter_, onSizeChanged,
                                 strategy, created);
-  if (created && !definition->isManaged) measureNewUnmanagedStore(identifier, definition);
+  if (created && store != nullptr && !definition->isManaged) measureNewUnmanagedStore(identifier, definition);
   return store;
 }
 

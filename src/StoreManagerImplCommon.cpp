@@ -110,6 +110,10 @@ std::shared_ptr<Store> StoreManagerImplCommon::createStore(const std::string& id
   const std::string storePath = getStorePath(storeDefinition);
   if (isMarkedForTrashing(storePath)) trashCollector_->collectPath(storePath);
   fileUtils_->createDirectory(storePath, true);
+  if (!isValid()) {
+    abandon(*item);  // the next manager of this directory may be opening the same files by now
+    return nullptr;
+  }
   auto store = storeDefinition->createStore(storePath, temporaryDirectoryPath_, std::move(taskQueueFactory),
                                             std::move(trashCollector), std::move(analyticsReporter), fileUtils_,
                                             std::move(sizeChangedCallback), pruneStrategy, storeDefinition);

@@ -512,6 +512,33 @@ TEST_F(StoreManagerImplCommonTest, AManagerInvalidatedWhileAStoreIsCreatedHasIts
   EXPECT_EQ(get("a"), nullptr);
 }
 
+// The next session's manager may be at work in the same directory by then.
+TEST_F(StoreManagerImplCommonTest, AManagerInvalidatedBeforeAStoreIsMadeMakesNoneAndLetsWaitersGo) {
+  Latch creating(1);
+  Latch release(1);
+  files->onCall = [&](Operation operation, const string& path) {
+    if (operation != Operation::CreateDirectory || path != managerPath() + "/a_250_v1") return;
+    creating.countDown();
+    release.wait();
+  };
+  build({{"a", fake("a")}});
+  std::shared_ptr<Store> creatorsStore;
+  std::thread creator([&] { creatorsStore = get("a"); });
+  creating.wait();
+  const auto item = common_->getExistingStore("a");
+  const long holders = item.use_count();
+  std::shared_ptr<Store> waitersStore;
+  std::thread waiter([&] { waitersStore = get("a"); });
+  waitForAnotherHolder(item, holders);
+  common_->invalidate();
+  release.countDown();
+  creator.join();
+  waiter.join();
+  EXPECT_EQ(creatorsStore, nullptr);
+  EXPECT_EQ(waitersStore, nullptr);
+  EXPECT_THROW((*stores)["a"], std::out_of_range);
+}
+
 TEST_F(StoreManagerImplCommonTest, AStoreMayInvalidateItsManagerAsItIsCreated) {
   stores->onCreate = [&](const string&, const auto&) { common_->invalidate(); };
   build({{"a", fake("a")}});
@@ -550,8 +577,10 @@ TEST_F(StoreManagerImplCommonTest, InvalidatingLetsTheStoresGo) {
 
 TEST_F(StoreManagerImplCommonTest, AKeyValueStoreCreatedForAnInvalidManagerIsInvalidatedWithoutWaitingForItsQueues) {
   build({{"kv", std::make_shared<PKVSDefinition>("kv", "media", false, false, 1U, std::nullopt, false, 1U)}});
+  int calls = 0;
   files->onCall = [&](Operation operation, const string& path) {
-    if (operation == Operation::CreateDirectory && path == managerPath() + "/kv_250_v1") common_->invalidate();
+    const bool isTheStores = operation == Operation::CreateDirectory && path == managerPath() + "/kv_250_v1";
+    if (isTheStores && ++calls == 2) common_->invalidate();  // the store itself makes sure of its directory
   };
   const auto store = std::dynamic_pointer_cast<PersistentKeyValueStore>(get("kv"));  // nobody runs its queues
   ASSERT_NE(store, nullptr);

@@ -11,6 +11,7 @@
 #include <mutex>
 #include <stdexcept>
 #include <string>
+#include <thread>
 #include <utility>
 #include <vector>
 
@@ -389,20 +390,71 @@ TEST_F(HostTest, NoManagerOfASessionSurvivesItsLogOut) {
   const auto host = start();
   std::mutex mutex;
   std::vector<std::shared_ptr<StoreManager>> managers;
+  std::atomic<std::size_t> refused{0};
   runOnThreads(4, [&](std::size_t thread) {
     for (int i = 0; i < 20; ++i) {
       if (thread == 0) {
         host->logOut();
         continue;
       }
-      auto manager = host->manager(thread == 1 ? "archive" : "inbox");
-      const std::lock_guard<std::mutex> lock(mutex);
-      managers.push_back(std::move(manager));
+      try {
+        auto manager = host->manager(thread == 1 ? "archive" : "inbox");
+        const std::lock_guard<std::mutex> lock(mutex);
+        managers.push_back(std::move(manager));
+      } catch (const InvalidatedException&) {
+        ++refused;  // asked for while the session was ending
+      }
     }
   });
   host->logOut();
-  EXPECT_EQ(managers.size(), 60U);
+  EXPECT_EQ(managers.size() + refused, 60U);
   for (const auto& manager : managers) EXPECT_FALSE(manager->isValid());
+}
+
+// Waiting would be for ever: the end of the session waits for the queue that the request is made on.
+TEST_F(HostTest, ARequestOnAStoresQueueIsRefusedWhileTheSessionEnds) {
+  Host host(kConfigurationOfValues, directory.path());
+  const auto letters = host.store<PersistentKeyValueStore>("letters");
+  Latch isWriting(1);
+  Latch isEnding(1);
+  std::string refusal;
+  auto written = letters->store("key", nullptr, [&](const std::string&) {
+    isWriting.countDown();
+    isEnding.wait();
+    refusal = errorOf<InvalidatedException>([&] { host.manager("media"); });
+    return 0U;
+  });
+  isWriting.wait();
+  std::thread ending([&] { host.logOut(); });
+  const auto isRefused = [&] { return errorOf<InvalidatedException>([&] { host.manager("media"); }) != "no error"; };
+  while (!isRefused()) std::this_thread::yield();
+  isEnding.countDown();
+  ending.join();
+  await(std::move(written));
+  EXPECT_EQ(refusal, InvalidatedException("The managers are being invalidated.").what());
+  EXPECT_TRUE(host.manager("media")->isValid());
+}
+
+TEST_F(HostTest, ManagersWithoutSessionAreRefusedWhileTheyAreInvalidatedAndOnlyThen) {
+  const auto host = start();
+  std::atomic<bool> isOver{false};
+  std::vector<std::shared_ptr<StoreManager>> managers;
+  runOnThreads(2, [&](std::size_t thread) {
+    if (thread == 0) {
+      for (int i = 0; i < 20; ++i) host->invalidate();
+      isOver = true;
+      return;
+    }
+    while (!isOver) {
+      try {
+        managers.push_back(host->manager("media"));
+      } catch (const InvalidatedException&) {
+        continue;
+      }
+    }
+  });
+  const auto latest = host->manager("media");
+  for (const auto& manager : managers) EXPECT_EQ(manager->isValid(), manager == latest);
 }
 
 TEST_F(HostTest, InvalidatingDiscardsEverythingThatWasAskedFor) {
