@@ -4,11 +4,11 @@
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <stdexcept>
 #include <system_error>
 #include <vector>
 
+#include "FileContents.h"
 #include "Progress.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -53,13 +53,9 @@ TreeSize FileWriter::copy(const SourceFiles::File& file, const std::string& dire
 }
 
 TreeSize FileWriter::render(const SourceFiles::File& file, std::size_t bytes, const std::string& path) {
-  std::ifstream in(file.path, std::ios::binary);
-  std::ostringstream model;
-  copyUpTo(std::min<std::uint64_t>(file.size, bytes), in, model);
-  std::string picture = model.str().empty() ? " " : model.str();
-  while (picture.size() < bytes) picture.append(picture, 0, bytes - picture.size());
+  const Bytes picture = pictureOf(file, bytes);
   std::ofstream out = create(path);
-  out << picture;
+  out.write(reinterpret_cast<const char*>(picture.data()), static_cast<std::streamsize>(picture.size()));
   close(out, path);
   return noted(picture.size());
 }

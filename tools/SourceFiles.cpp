@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <filesystem>
 #include <system_error>
+#include <utility>
 
 #include "AttributeStore.h"
 #include "Format.h"
@@ -16,6 +17,10 @@ namespace fs = std::filesystem;
 
 namespace {
 
+// Files beyond which a directory is not searched any further.
+constexpr std::size_t kMostLookedAt = 4 * SourceFiles::kMostFiles;
+
+// All files that there are to choose from.
 class Reader {
  public:
   Reader(const fs::path& directory, const fs::path& without) : directory_(directory), without_(without) {}
@@ -41,7 +46,7 @@ class Reader {
 
   void take(const std::vector<fs::directory_entry>& entries) {
     for (const fs::directory_entry& entry : entries) {
-      if (source_.files.size() == SourceFiles::kMostFiles) {
+      if (source_.files.size() == kMostLookedAt) {
         source_.isPart = true;
         return;
       }
@@ -71,10 +76,7 @@ class Reader {
     const std::uint64_t size = fs::file_size(path, error);
     if (error || access(path.c_str(), R_OK) != 0) {
       ++source_.unreadable;
-    } else if (source_.bytes + size > SourceFiles::kMostBytes) {
-      source_.isPart = true;
     } else {
-      source_.bytes += size;
       source_.files.push_back({path.string(), path.lexically_relative(directory_).string(), size});
     }
   }
@@ -83,6 +85,31 @@ class Reader {
   const fs::path without_;
   SourceFiles source_;
 };
+
+// In their order, none of more than `largest` bytes, as far as number and bytes allow.
+SourceFiles take(const SourceFiles& found, std::uint64_t largest) {
+  SourceFiles taken;
+  taken.unreadable = found.unreadable;
+  for (const SourceFiles::File& file : found.files) {
+    if (taken.files.size() == SourceFiles::kMostFiles) break;
+    if (file.size > largest || taken.bytes + file.size > SourceFiles::kMostBytes) continue;
+    taken.bytes += file.size;
+    taken.files.push_back(file);
+  }
+  taken.isPart = found.isPart || taken.files.size() < found.files.size();
+  return taken;
+}
+
+// Tries smaller and smaller files until there are enough, and settles for the largest ones that give the most.
+SourceFiles choose(const SourceFiles& found) {
+  const std::size_t enough = std::min(found.files.size(), SourceFiles::kMostFiles);
+  SourceFiles best = take(found, SourceFiles::kMostBytes);
+  for (std::uint64_t largest = SourceFiles::kMostBytes / 2; largest > 0 && best.files.size() < enough; largest /= 2) {
+    SourceFiles next = take(found, largest);
+    if (next.files.size() > best.files.size()) best = std::move(next);
+  }
+  return best;
+}
 
 void requireDirectory(const std::string& directory) {
   std::error_code error;
@@ -96,7 +123,7 @@ void requireDirectory(const std::string& directory) {
 
 SourceFiles readSourceFiles(const std::string& directory, const std::string& without) {
   requireDirectory(directory);
-  SourceFiles source = Reader(directory, without).read();
+  SourceFiles source = choose(Reader(directory, without).read());
   if (!source.files.empty()) return source;
   if (source.isPart) {
     throw InputError("DIRECTORY '" + directory + "' holds only files of more than " +

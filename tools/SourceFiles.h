@@ -11,7 +11,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 struct SourceFiles {
   // Files and bytes beyond which no more are taken.
   static constexpr std::size_t kMostFiles = 20000;
-  static constexpr std::uint64_t kMostBytes = 300U << 20U;
+  static constexpr std::uint64_t kMostBytes = 200U << 20U;
 
   struct File {
     std::string path;
@@ -26,8 +26,9 @@ struct SourceFiles {
 };
 
 // The readable regular files under `directory`, in the order of their names, so that every run takes the same ones.
-// Links inside it are not followed, and `without` (the demonstration's own directory, should it lie there) is left
-// out. Throws `InputError` when the directory is missing, cannot be read or gives no files.
+// Where there are more than may be taken, large ones are left out for the sake of the number. Links inside it are not
+// followed, and `without` (the demonstration's own directory, should it lie there) is left out. Throws `InputError`
+// when the directory is missing, cannot be read or gives no files.
 SourceFiles readSourceFiles(const std::string& directory, const std::string& without);
 
 }  // namespace velmora::mobile::xplat::cellar::tools
