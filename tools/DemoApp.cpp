@@ -2,11 +2,11 @@
 
 #include <chrono>
 
+#include "ClockedQueues.h"
 #include "EventLog.h"
 #include "JsonValue.h"
 #include "LazyDispatcher.h"
 #include "MediaApp.h"
-#include "host/ThreadQueueFactory.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -41,19 +41,30 @@ host::HostOptions optionsFor(const std::string& root, const std::string& release
 
 }  // namespace
 
-std::vector<FileUtils::Info> ListingCounter::listDirectory(const std::string& path) {
+std::vector<FileUtils::Info> WatchedFiles::listDirectory(const std::string& path) {
   ++listings_;
   return FileUtils::listDirectory(path);
 }
 
-std::uint64_t ListingCounter::listings() const { return listings_; }
+void WatchedFiles::deleteFile(const std::string& path) {
+  FileUtils::deleteFile(path);
+  const std::lock_guard<std::mutex> lock(mutex_);
+  deletions_.push_back(path);
+}
+
+std::uint64_t WatchedFiles::listings() const { return listings_; }
+
+std::vector<std::string> WatchedFiles::deletions() const {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  return deletions_;
+}
 
 DemoApp::DemoApp(const std::string& root, const std::string& release, const std::string& user, EventLog& events)
     : root_(root),
       release_(release),
       user_(user),
-      files_(std::make_shared<ListingCounter>()),
-      queues_(std::make_shared<host::ThreadQueueFactory>()) {
+      files_(std::make_shared<WatchedFiles>()),
+      queues_(std::make_shared<ClockedQueues>()) {
   host::HostOptions options = optionsFor(root, release, events);
   options.fileUtils = files_;
   options.taskQueueFactory = queues_;
@@ -111,7 +122,12 @@ std::string DemoApp::trashDirectory() const { return root_ + "/trash"; }
 
 bool DemoApp::settle() { return queues_->drain(kPatience); }
 
-std::uint64_t DemoApp::listings() const { return files_->listings(); }
+bool DemoApp::letPass(std::chrono::seconds time) {
+  queues_->moveOn(time);
+  return settle();
+}
+
+const WatchedFiles& DemoApp::files() const { return *files_; }
 
 host::Host& DemoApp::host() { return *host_; }
 std::string DemoApp::release() const { return release_; }

@@ -1,8 +1,10 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -12,22 +14,26 @@
 #include "Store.h"
 #include "host/Host.h"
 
-namespace velmora::mobile::xplat::cellar::host {
-class ThreadQueueFactory;
-}
-
 namespace velmora::mobile::xplat::cellar::tools {
 
+class ClockedQueues;
 class EventLog;
 
-// The file system, with the listings of directories counted.
-class ListingCounter : public FileUtils {
+// The file system, with a note taken of the listings of directories and of the deletions of files.
+class WatchedFiles : public FileUtils {
  public:
   std::vector<Info> listDirectory(const std::string& path) override;
+  void deleteFile(const std::string& path) override;
+
   std::uint64_t listings() const;
+
+  // The files deleted so far, in that order.
+  std::vector<std::string> deletions() const;
 
  private:
   std::atomic<std::uint64_t> listings_{0};
+  mutable std::mutex mutex_;  // guards the deletions
+  std::vector<std::string> deletions_;
 };
 
 // One run of the media application, from its start to its end: which release of it, and who uses it. Destroying it is
@@ -62,8 +68,12 @@ class DemoApp {
   // Waits until nothing is left to do in the background; false when that takes too long.
   bool settle();
 
-  // Directories listed so far in this run.
-  std::uint64_t listings() const;
+  // Lets that time pass for the timers of the application, and waits until what they set off is done; false when that
+  // takes too long. Dates are not changed by it.
+  bool letPass(std::chrono::seconds time);
+
+  // What it has done to the file system so far in this run.
+  const WatchedFiles& files() const;
 
   host::Host& host();
   std::string release() const;
@@ -73,8 +83,8 @@ class DemoApp {
   const std::string root_;
   const std::string release_;
   const std::string user_;
-  const std::shared_ptr<ListingCounter> files_;
-  const std::shared_ptr<host::ThreadQueueFactory> queues_;
+  const std::shared_ptr<WatchedFiles> files_;
+  const std::shared_ptr<ClockedQueues> queues_;
   std::unique_ptr<host::Host> host_;
 };
 

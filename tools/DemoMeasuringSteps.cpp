@@ -101,24 +101,24 @@ void fillStores(DemoContext& context) {
 }
 
 void measureStores(DemoContext& context) {
-  const std::uint64_t listingsBefore = context.app().listings();
+  const std::uint64_t listingsBefore = context.app().files().listings();
   const Measurement measurement = measure(context);
   context.measuringTime = measurement.time;
   context.console.line(formatFiles(measurement.total) + " in " +
-                       formatCount(context.app().listings() - listingsBefore, "directory", "directories") + ", in " +
-                       formatTime(measurement.time));
+                       formatCount(context.app().files().listings() - listingsBefore, "directory", "directories") +
+                       ", in " + formatTime(measurement.time));
   context.console.line("a walk that knows nothing of the library counts the same, store by store");
   checkFigures(context, measurement, false);
 }
 
 void measureStoresAgain(DemoContext& context) {
-  const std::uint64_t listingsBefore = context.app().listings();
+  const std::uint64_t listingsBefore = context.app().files().listings();
   const Measurement measurement = measure(context);
   context.console.line("the same " + formatFiles(measurement.total) + ", in " + formatTime(measurement.time) +
                        ", from what is kept with each directory");
   context.console.line(timesAsQuick(context.measuringTime, measurement.time) + " times as quick, no directory listed");
   checkFigures(context, measurement, true);
-  context.checks.equal("directories listed", 0, context.app().listings() - listingsBefore);
+  context.checks.equal("directories listed", 0, context.app().files().listings() - listingsBefore);
   if (context.measuringTime < kWorthComparing) return;
   context.checks.isTrue("the second measurement is quicker", measurement.time < context.measuringTime);
 }

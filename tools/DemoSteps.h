@@ -23,10 +23,20 @@ void measureStores(DemoContext& context);
 void measureStoresAgain(DemoContext& context);
 void evictOversizedCache(DemoContext& context);
 
-// Stores with keys (DemoKeyValueSteps.cpp).
+// Stores with keys: storing and fetching (DemoStoringSteps.cpp).
 void storeByKey(DemoContext& context);
-void pruneCaches(DemoContext& context);
+void useByKey(DemoContext& context);
 void findAgain(DemoContext& context);
+
+// Their manifests (DemoManifestSteps.cpp).
+void lookFromOutside(DemoContext& context);
+
+// Their limits (DemoPruningSteps.cpp).
+void pruneCaches(DemoContext& context);
+
+// Age, and clearing (DemoExpirySteps.cpp).
+void expireStale(DemoContext& context);
+void clearStore(DemoContext& context);
 
 // What comes to an end, and how its data goes (DemoCleaningSteps.cpp).
 void updateApplication(DemoContext& context);

@@ -45,9 +45,9 @@ CLI::App* addDemo(CLI::App& app, tools::DemoOptions& options) {
                    "Without it: a temporary directory, removed at the end")
       ->type_name("DIR");
   demo->footer(
-      "Stores are filled, measured, evicted, retired by an update, cleaned up after another user, trashed and\n"
-      "cleansed, and each step is checked against the file system. Files are copied, at most 20,000 and 200 MB\n"
-      "of them; nothing is changed in DIRECTORY.\n\n"
+      "Stores are filled, measured, pruned, expired, evicted, cleared, retired by an update, cleaned up after\n"
+      "another user, trashed and cleansed, and each step is checked against the file system. Files are copied\n"
+      "twice, at most 20,000 and 200 MB of them; nothing is changed in DIRECTORY.\n\n"
       "Example:\n  cellar demo /usr/share/doc --root /tmp/cellar-demo");
   return demo;
 }
