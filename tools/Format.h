@@ -4,7 +4,7 @@
 #include <cstdint>
 #include <string>
 
-#include "Trees.h"
+#include "demo/Trees.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 

@@ -7,8 +7,8 @@
 #include <vector>
 
 #include "Console.h"
-#include "Demo.h"
 #include "InputError.h"
+#include "demo/Demo.h"
 
 namespace {
 
