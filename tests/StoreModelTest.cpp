@@ -57,10 +57,10 @@ constexpr std::int64_t kSecond = 1'000'000'000;
 constexpr std::time_t kStart = 1'700'000'000;
 const std::string kManifestName = "manifest_v1.sqlite";
 
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr unsigned int kDefaultRuns = 40;
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || defined(__arm__)
+constexpr unsigned int kDefaultRuns = 40;  // each takes ten times as long there
 #else
-constexpr unsigned int kDefaultRuns = 300;
+constexpr unsigned int kDefaultRuns = 1000;
 #endif
 
 std::optional<unsigned int> numberFromEnvironment(const char* name) {

@@ -1,0 +1,131 @@
+// What thousands of outstanding operations cost in memory, and that all of it is given back. A program of its own,
+// because it counts every allocation.
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cstddef>
+#include <cstdlib>
+#include <iostream>
+#include <memory>
+#include <new>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "FileUtils.h"
+#include "PersistentKeyValueStore.h"
+#include "TrashCollector.h"
+#include "host/Await.h"
+#include "host/testing/ManualQueue.h"
+#include "support/TemporaryDirectory.h"
+
+namespace {
+
+std::atomic<std::size_t> bytesInUse{0};
+
+// The size stands in front of the block.
+constexpr std::size_t kHeader = alignof(std::max_align_t);
+
+void* allocate(std::size_t size) {
+  void* const block = std::malloc(size + kHeader);
+  if (block == nullptr) throw std::bad_alloc();
+  *static_cast<std::size_t*>(block) = size;
+  bytesInUse += size;
+  return static_cast<char*>(block) + kHeader;
+}
+
+void release(void* pointer) {
+  if (pointer == nullptr) return;
+  void* const block = static_cast<char*>(pointer) - kHeader;
+  bytesInUse -= *static_cast<std::size_t*>(block);
+  std::free(block);
+}
+
+}  // namespace
+
+void* operator new(std::size_t size) { return allocate(size); }
+void* operator new[](std::size_t size) { return allocate(size); }
+void operator delete(void* pointer) noexcept { release(pointer); }
+void operator delete[](void* pointer) noexcept { release(pointer); }
+void operator delete(void* pointer, std::size_t) noexcept { release(pointer); }
+void operator delete[](void* pointer, std::size_t) noexcept { release(pointer); }
+
+namespace velmora::mobile::xplat::cellar {
+namespace {
+
+constexpr std::size_t kOperations = 10'000;
+constexpr std::size_t kValueBytes = 4096;
+
+class OutstandingOperations : public testing::Test {
+ protected:
+  OutstandingOperations() { queues->runAll(); }
+
+  // What each of many calls holds until the queues get to it, and that nothing stays behind.
+  template <class Call> std::size_t bytesOfACall(const char* name, Call call) {
+    using Result = decltype(call(std::string()));
+    const std::string key(24, 'k');
+    call(key);
+    queues->runAll();
+    const std::size_t before = bytesInUse;
+    std::vector<Result> futures;
+    futures.reserve(kOperations);
+    const std::size_t begun = bytesInUse;
+    for (std::size_t i = 0; i < kOperations; ++i) futures.push_back(call(key));
+    const std::size_t bytes = (bytesInUse - begun) / kOperations;
+    queues->runAll();
+    for (auto& future : futures) host::await(std::move(future));
+    futures.clear();
+    futures.shrink_to_fit();
+    EXPECT_LT(bytesInUse, before + 64 * 1024) << name;
+    std::cout << name << ": " << bytes << " bytes for each outstanding call\n";
+    RecordProperty(name, static_cast<int>(bytes));
+    return bytes;
+  }
+
+  const test::TemporaryDirectory directory;
+  const std::shared_ptr<FileUtils> files = std::make_shared<FileUtils>();
+  const std::shared_ptr<test::ManualQueueFactory> queues = std::make_shared<test::ManualQueueFactory>();
+  const std::shared_ptr<TrashCollector> trash =
+      std::make_shared<TrashCollector>(directory.file("trash"), files, nullptr, queues);
+  const std::shared_ptr<PersistentKeyValueStore> store = PersistentKeyValueStore::createPersistentKeyValueStore(
+      directory.file("store"), directory.file("tmp"), "larder", std::nullopt, 1000, false, queues, trash, nullptr,
+      nullptr, files, nullptr, 50);
+};
+
+TEST_F(OutstandingOperations, HoldTheirValueOnceAndLittleElse) {
+  const std::vector<unsigned char> value(kValueBytes, 'x');
+  const std::size_t bytes = bytesOfACall("store", [&](const std::string& key) { return store->store(key, value); });
+  EXPECT_GE(bytes, kValueBytes);
+  EXPECT_LE(bytes, kValueBytes + 1536);
+}
+
+TEST_F(OutstandingOperations, ThatBringNoValueAreSmall) {
+  EXPECT_LE(bytesOfACall("fetch", [&](const std::string& key) { return store->fetch(key); }), 1024U);
+  EXPECT_LE(bytesOfACall("removeItem", [&](const std::string& key) { return store->removeItem(key); }), 1024U);
+  EXPECT_LE(
+      bytesOfACall("updateLastAccessDate", [&](const std::string& key) { return store->updateLastAccessDate(key); }),
+      1024U);
+}
+
+TEST_F(OutstandingOperations, OfAStoreThatGoesWithItsQueueFullAreGivenBack) {
+  const std::size_t before = bytesInUse;
+  {
+    const test::TemporaryDirectory another;
+    auto doomed = PersistentKeyValueStore::createPersistentKeyValueStore(another.file("store"), another.file("tmp"),
+                                                                         "doomed", std::nullopt, 1000, false, queues,
+                                                                         trash, nullptr, nullptr, files, nullptr, 50);
+    std::vector<Future<void>> futures;
+    for (std::size_t i = 0; i < kOperations; ++i) {
+      futures.push_back(doomed->store("key" + std::to_string(i), std::vector<unsigned char>(kValueBytes, 'x')));
+    }
+    doomed.reset();
+    queues->runAll();
+    for (auto& future : futures) host::await(std::move(future));
+    EXPECT_TRUE(another.names("store").empty());
+  }
+  EXPECT_LT(bytesInUse, before + 64 * 1024);
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar
