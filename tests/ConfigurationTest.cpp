@@ -5,7 +5,6 @@
 
 #include <cstdint>
 #include <limits>
-#include <locale>
 #include <memory>
 #include <optional>
 #include <stdexcept>
@@ -18,30 +17,13 @@
 #include "JsonValue.h"
 #include "LarderException.h"
 #include "support/Barrier.h"
+#include "support/GroupingLocale.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using std::string;
 using testing::HasSubstr;
-
-// Writes and reads 1024 as "1.024", as many hosts' locales do.
-class GroupingDigits : public std::numpunct<char> {
- protected:
-  char do_thousands_sep() const override { return '.'; }
-  string do_grouping() const override { return "\3"; }
-};
-
-class GlobalLocale {
- public:
-  explicit GlobalLocale(const std::locale& locale) : before_(std::locale::global(locale)) {}
-  GlobalLocale(const GlobalLocale&) = delete;
-  GlobalLocale& operator=(const GlobalLocale&) = delete;
-  ~GlobalLocale() { std::locale::global(before_); }
-
- private:
-  std::locale before_;
-};
 
 string quoted(const string& text) { return JsonValue(text).dump(); }
 
@@ -424,7 +406,7 @@ TEST(Configuration, EverySizeAndDurationOfAStoreIsChecked) {
 }
 
 TEST(Configuration, NumbersAreReadAlikeWhateverTheProcessLocale) {
-  const GlobalLocale locale(std::locale(std::locale::classic(), new GroupingDigits));
+  const test::GroupingLocale locale;
   EXPECT_EQ(sizeOf("1024KB"), 1048576U);
   EXPECT_EQ(sizeError("1.024KB"), badSizeUnit(".024KB"));
   EXPECT_EQ(durationOf("1000 minutes"), 60000U);

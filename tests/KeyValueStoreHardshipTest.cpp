@@ -35,28 +35,10 @@ using testing::IsEmpty;
 using Contents = std::map<std::string, std::string>;
 using Loader = PersistentKeyValueStore::Loader;
 
-class StoreFixture : public KeyValueStoreFixture {
- protected:
-  static Loader answering(const std::string& value) {
-    return [value](const std::shared_ptr<const DiskCacheItem>&, const std::string&, Bytes& bytes) {
-      bytes = bytesOf(value);
-      return true;
-    };
-  }
-
-  // Writes the text to the file it is told, and claims a size of its own.
-  PersistentKeyValueStore::Writer writing(const std::string& value, unsigned int size) const {
-    return [files = files, value, size](const std::string& path) {
-      files->writeFile(path, bytesOf(value));
-      return size;
-    };
-  }
-};
-
-class ReservedKeys : public StoreFixture {};
-class HostileKeys : public StoreFixture {};
-class AGoneStore : public StoreFixture {};
-class AFailingQueue : public StoreFixture {};
+class ReservedKeys : public KeyValueStoreFixture {};
+class HostileKeys : public KeyValueStoreFixture {};
+class AGoneStore : public KeyValueStoreFixture {};
+class AFailingQueue : public KeyValueStoreFixture {};
 
 // --- Reserved keys ---
 

@@ -27,6 +27,7 @@ using test::Bytes;
 using test::bytesOf;
 using test::Fetched;
 using test::KeyValueStoreFixture;
+using test::kInvalid;
 using test::Latch;
 using test::ManifestCall;
 using test::Operation;
@@ -37,29 +38,12 @@ using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
 
-const std::string kInvalid =
-    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
-
 class Invalidation : public KeyValueStoreFixture {
  protected:
-  void putMany(int count, const std::string& value = "v") {
-    for (int i = 0; i < count; ++i) put("key" + std::to_string(i), value);
-  }
-
-  // How a batched deletion ends, in `ending`.
-  std::function<void()> onSuccess() {
-    return [this] { ending += "<done>"; };
-  }
-  std::function<void(const std::exception&)> onError() {
-    return [this](const std::exception& error) { ending += std::string("<error> ") + error.what(); };
-  }
-
   // Whoever puts something on the file queue finds it done.
   void runFilesAtOnce() const {
     file().onDispatch = [&queue = file()] { queue.runAll(); };
   }
-
-  std::string ending;
 };
 
 TEST_F(Invalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {

@@ -28,6 +28,7 @@ namespace {
 using test::bytesOf;
 using test::Fetched;
 using test::KeyValueStoreFixture;
+using test::kInvalid;
 using test::LogCapture;
 using test::ManifestCall;
 using test::Operation;
@@ -44,15 +45,8 @@ using Contents = std::map<std::string, std::string>;
 using Batch = std::vector<DiskCacheItem>;
 using Provider = std::function<const Batch()>;
 
-const std::string kInvalid =
-    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
-
 class MaintenanceFixture : public KeyValueStoreFixture {
  protected:
-  void putMany(int count, const std::string& value = "v") {
-    for (int i = 0; i < count; ++i) put("key" + std::to_string(i), value);
-  }
-
   DiskCacheItem itemOf(const std::string& key, bool isInline = false) const {
     return {key, key, 1, isInline, 0, 0, nullptr};
   }
@@ -63,16 +57,6 @@ class MaintenanceFixture : public KeyValueStoreFixture {
       return *next < batches.size() ? batches[(*next)++] : Batch();
     };
   }
-
-  // How a batched deletion ends, in `ending`.
-  std::function<void()> onSuccess() {
-    return [this] { ending += "<done>"; };
-  }
-  std::function<void(const std::exception&)> onError() {
-    return [this](const std::exception& error) { ending += std::string("<error> ") + error.what(); };
-  }
-
-  std::string ending;
 };
 
 class Expiry : public MaintenanceFixture {};

@@ -4,37 +4,18 @@
 
 #include <climits>
 #include <exception>
-#include <locale>
 #include <memory>
 #include <stdexcept>
 #include <string>
 #include <type_traits>
 
 #include "Future.h"
+#include "support/GroupingLocale.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using std::string;
-
-// Writes 1234567 as "1.234.567", as many hosts' locales do.
-class GroupingDigits : public std::numpunct<char> {
- protected:
-  char do_thousands_sep() const override { return '.'; }
-  string do_grouping() const override { return "\3"; }
-};
-
-// Sets the process's locale for as long as it lives.
-class GlobalLocale {
- public:
-  explicit GlobalLocale(const std::locale& locale) : before_(std::locale::global(locale)) {}
-  GlobalLocale(const GlobalLocale&) = delete;
-  GlobalLocale& operator=(const GlobalLocale&) = delete;
-  ~GlobalLocale() { std::locale::global(before_); }
-
- private:
-  std::locale before_;
-};
 
 template <class Caught, class Thrown> bool catches(const Thrown& thrown) {
   try {
@@ -69,7 +50,7 @@ TEST(LarderException, NegativeAndExtremeCodesArePrintedWithTheirSign) {
 }
 
 TEST(LarderException, TheCodeIsPrintedPlainlyWhateverTheProcessLocale) {
-  const GlobalLocale locale(std::locale(std::locale::classic(), new GroupingDigits));
+  const test::GroupingLocale locale;
   EXPECT_STREQ(LarderException("t", "D", 1234567).what(), "domain: D; code: 1234567; description: t .");
 }
 

@@ -34,6 +34,7 @@ using test::bytesOf;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
+using test::kInvalid;
 using test::LogCapture;
 using test::ManifestCall;
 using test::Operation;
@@ -47,34 +48,13 @@ using testing::IsEmpty;
 using Contents = std::map<std::string, std::string>;
 using Loader = PersistentKeyValueStore::Loader;
 
-const std::string kInvalid =
-    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
-
-class StoreFixture : public KeyValueStoreFixture {
- protected:
-  static Loader answering(const std::string& value) {
-    return [value](const std::shared_ptr<const DiskCacheItem>&, const std::string&, Bytes& bytes) {
-      bytes = bytesOf(value);
-      return true;
-    };
-  }
-
-  // Writes the text to the file it is told, and claims a size of its own.
-  PersistentKeyValueStore::Writer writing(const std::string& value, unsigned int size) const {
-    return [files = files, value, size](const std::string& path) {
-      files->writeFile(path, bytesOf(value));
-      return size;
-    };
-  }
-};
-
-class CreatingAStore : public StoreFixture {};
-class StoringAValue : public StoreFixture {};
-class FetchingAValue : public StoreFixture {};
-class FetchingTheFirst : public StoreFixture {};
-class RemovingAValue : public StoreFixture {};
-class AskingForDates : public StoreFixture {};
-class StoringInline : public StoreFixture {
+class CreatingAStore : public KeyValueStoreFixture {};
+class StoringAValue : public KeyValueStoreFixture {};
+class FetchingAValue : public KeyValueStoreFixture {};
+class FetchingTheFirst : public KeyValueStoreFixture {};
+class RemovingAValue : public KeyValueStoreFixture {};
+class AskingForDates : public KeyValueStoreFixture {};
+class StoringInline : public KeyValueStoreFixture {
  protected:
   void SetUp() override { options.inlineData = true; }
 };

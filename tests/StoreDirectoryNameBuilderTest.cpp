@@ -3,12 +3,12 @@
 #include <gtest/gtest.h>
 
 #include <limits>
-#include <locale>
 #include <memory>
 #include <string>
 #include <vector>
 
 #include "Configuration.h"
+#include "support/GroupingLocale.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -34,23 +34,6 @@ class UpperCaseNames : public StoreDirectoryNameBuilder {
     return {"OLD"};
   }
   string buildStoreName(const StoreDefinition& store) const override { return "STORE-" + store.name; }
-};
-
-// Writes numbers the way some languages do.
-class GroupedDigits : public std::numpunct<char> {
-  char do_thousands_sep() const override { return '.'; }
-  string do_grouping() const override { return "\3"; }
-};
-
-class GlobalLocale {
- public:
-  explicit GlobalLocale(const std::locale& locale) : previous_(std::locale::global(locale)) {}
-  GlobalLocale(const GlobalLocale&) = delete;
-  GlobalLocale& operator=(const GlobalLocale&) = delete;
-  ~GlobalLocale() { std::locale::global(previous_); }
-
- private:
-  std::locale previous_;
 };
 
 class StoreDirectoryNameBuilderTest : public testing::Test {
@@ -102,7 +85,7 @@ TEST_F(StoreDirectoryNameBuilderTest, VersionsAreUnsigned) {
 }
 
 TEST_F(StoreDirectoryNameBuilderTest, VersionsDoNotDependOnTheProcessesLocale) {
-  const GlobalLocale locale(std::locale(std::locale::classic(), new GroupedDigits));  // owned by the locale
+  const test::GroupingLocale locale;
   EXPECT_EQ(session_->buildStoreName(definition("a", true, false, 1234567)), "a_en_US_250_v1234567");
 }
 

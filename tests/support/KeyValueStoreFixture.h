@@ -119,6 +119,10 @@ inline std::string told(const Written& written) {
   return written->failure == nullptr ? "<done>" : "<error> " + whatOf(written->failure);
 }
 
+// What an operation of an invalidated store says.
+inline const std::string kInvalid =
+    "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store has been invalidated. .";
+
 // A store with everything around it under the test's control: its queues, its files, its collector and the time.
 class KeyValueStoreFixture : public testing::Test {
  public:
@@ -190,6 +194,31 @@ class KeyValueStoreFixture : public testing::Test {
   void settle() const { queues->runAll(); }
   bool fire(long seconds) const { return work().fireTimer(seconds * kSecond); }
 
+  // --- What operations are given ---
+
+  static PersistentKeyValueStore::Loader answering(const std::string& value) {
+    return [value](const std::shared_ptr<const DiskCacheItem>&, const std::string&, Bytes& bytes) {
+      bytes = bytesOf(value);
+      return true;
+    };
+  }
+
+  // Writes the text to the file it is told, and claims a size of its own.
+  PersistentKeyValueStore::Writer writing(const std::string& value, unsigned int size) const {
+    return [files = files, value, size](const std::string& path) {
+      files->writeFile(path, bytesOf(value));
+      return size;
+    };
+  }
+
+  // How a batched deletion ends, in `ending`.
+  std::function<void()> onSuccess() {
+    return [this] { ending += "<done>"; };
+  }
+  std::function<void(const std::exception&)> onError() {
+    return [this](const std::exception& error) { ending += std::string("<error> ") + error.what(); };
+  }
+
   // --- Operations, to the end ---
 
   void put(const std::string& key, const std::string& value) {
@@ -204,6 +233,10 @@ class KeyValueStoreFixture : public testing::Test {
     return told(fetched);
   }
 
+  void putMany(int count, const std::string& value = "v") {
+    for (int i = 0; i < count; ++i) put("key" + std::to_string(i), value);
+  }
+
   std::string drop(const std::string& key) {
     const Written removed = watch(store->removeItem(key));
     settle();
@@ -212,11 +245,10 @@ class KeyValueStoreFixture : public testing::Test {
 
   // How a clear ended.
   std::string clear() {
-    std::string ending = "<pending>";
-    store->clear([&ending] { ending = "<done>"; },
-                 [&ending](const std::exception& error) { ending = std::string("<error> ") + error.what(); });
+    ending.clear();
+    store->clear(onSuccess(), onError());
     settle();
-    return ending;
+    return ending.empty() ? "<pending>" : ending;
   }
 
   // --- What is there ---
@@ -322,6 +354,7 @@ class KeyValueStoreFixture : public testing::Test {
   std::shared_ptr<MemoryMedium> medium = std::make_shared<MemoryMedium>();
   std::shared_ptr<FaultyManifest> manifest;
   std::vector<std::string> journal;
+  std::string ending;               // of a batched deletion
   std::vector<unsigned int> sizes;  // what the size callback was told
   std::shared_ptr<ManualQueueFactory> queues = std::make_shared<ManualQueueFactory>();
   std::shared_ptr<PersistentKeyValueStore> store;
