@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "FileUtils.h"
+#include "JsonValue.h"
 #include "LarderException.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -31,7 +32,9 @@ JsonValue AttributeStore::get(const std::string& directory) {
   try {
     const std::string path = pathFor(directory);
     if (!fileUtils_->pathExists(path)) return JsonValue::object();
-    return JsonValue::parse(fileUtils_->readFile(path));
+    const std::vector<unsigned char> bytes = fileUtils_->readFile(path);
+    // As a string, like the configuration: each further kind of input costs an instance of the whole parser.
+    return JsonValue::parse(std::string(bytes.begin(), bytes.end()));
   } catch (const FileUtilsIoException& error) {
     LOG(ERROR) << "Could not get attributes: " << error.what();
   } catch (const std::exception& error) {

@@ -5,17 +5,26 @@
 #include <cstdint>
 #include <ctime>
 #include <exception>
+#include <type_traits>
 #include <vector>
 
 #include "AnalyticsEventReporter.h"
 #include "AttributeStore.h"
 #include "FileUtils.h"
+#include "JsonValue.h"
 
 namespace velmora::mobile::xplat::cellar {
 
 namespace {
 
 constexpr double kClockTicksPerSecond = 1000000.0;
+
+// With 32 bits the clock begins anew every 72 minutes of processor time; the difference is right across that.
+double secondsSince(std::clock_t start) {
+  const auto now = static_cast<std::make_unsigned_t<std::clock_t>>(std::clock());
+  const auto elapsed = now - static_cast<std::make_unsigned_t<std::clock_t>>(start);
+  return static_cast<double>(elapsed) / kClockTicksPerSecond;
+}
 
 std::int64_t currentTime() { return static_cast<std::int64_t>(std::time(nullptr)); }
 
@@ -128,7 +137,7 @@ DiskSizeCalculator::Stats DiskSizeCalculator::traverseDirectory(
       stats.fileCount += nested.fileCount;
     }
   }
-  stats.timeSpent += static_cast<double>(std::clock() - start) / kClockTicksPerSecond;
+  stats.timeSpent += secondsSince(start);
 
   setCachedStats(path, stats);
   reportAnalytics(path, stats);

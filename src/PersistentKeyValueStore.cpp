@@ -467,7 +467,7 @@ void PersistentKeyValueStore::reportAccess(const DiskCacheItem* item, const std:
   using Hit = PersistentKeyValueStoreEvent::Hit;
   PersistentKeyValueStoreEventBuilder event(item != nullptr ? Hit::Found : Hit::Missing, name_,
                                             item != nullptr ? item->key : key);
-  if (item != nullptr) event.age(static_cast<long>(currentTime() - item->modificationDate)).size(item->size);
+  if (item != nullptr) event.age(ageOf(currentTime() - item->modificationDate)).size(item->size);
   analyticsReporter_->reportEvent(event.get());
 }
 

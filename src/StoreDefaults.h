@@ -15,4 +15,9 @@ inline long staleAgeOf(std::uint32_t seconds) {
   return static_cast<long>(std::min<std::uint64_t>(seconds, std::numeric_limits<long>::max()));
 }
 
+// The seconds between two dates as an event reports them: where `long` has 32 bits, the greatest it holds at most.
+inline long ageOf(std::int64_t seconds) {
+  return static_cast<long>(std::min<std::int64_t>(seconds, std::numeric_limits<long>::max()));
+}
+
 }  // namespace velmora::mobile::xplat::cellar

@@ -9,6 +9,7 @@
 
 #include "AttributeStore.h"
 #include "FileUtils.h"
+#include "JsonValue.h"
 #include "LarderException.h"
 #include "PersistentKeyValueStore.h"
 #include "Store.h"

@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "JsonValue.h"
 #include "host/testing/FaultyFileUtils.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"

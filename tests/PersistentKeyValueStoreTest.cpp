@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdint>
@@ -388,6 +389,17 @@ TEST_F(FetchingAValue, ReportsOneHitWithAgeAndSize) {
   clock.advance(70);
   EXPECT_EQ(get("key"), "value");
   EXPECT_THAT(accesses(), ElementsAre("0 key 70 5"));
+}
+
+TEST_F(FetchingAValue, ReportsAnAgeBeyondWhatLongHoldsAsTheGreatestAndNeverAsANegativeOne) {
+  open();
+  clock.set(std::numeric_limits<std::int32_t>::min());  // what a date after 2038 is read as
+  put("key", "value");
+  clock.set(kStart);
+  EXPECT_EQ(get("key"), "value");
+  const std::int64_t age = std::int64_t{kStart} - std::numeric_limits<std::int32_t>::min();
+  const std::int64_t reported = std::min<std::int64_t>(age, std::numeric_limits<long>::max());
+  EXPECT_THAT(accesses(), ElementsAre("0 key " + std::to_string(reported) + " 5"));
 }
 
 TEST_F(FetchingAValue, ReportsBeforeTheFileIsRead) {

@@ -577,7 +577,8 @@ TEST_F(StoreManagerImplTest, TheFirstRoundWaitsForNoIntervalHoweverLong) {
   EXPECT_EQ(store->pruneCount(), 1U);
 }
 
-TEST_F(StoreManagerImplTest, ALongIntervalIsNotShortenedByTheWidthOfTheClock) {
+TEST_F(StoreManagerImplTest, ALongIntervalIsKeptToTheSecond) {
+  clock_.set(500'000'000);  // so that its end can be reached with a clock of 32 bits
   build(manager({{"a", fake("a")}}, 0, 1'600'000'000));
   const auto store = get("a");
   report("a", 1);
@@ -588,6 +589,19 @@ TEST_F(StoreManagerImplTest, ALongIntervalIsNotShortenedByTheWidthOfTheClock) {
   clock_.advance(1);
   report("a", 3);
   EXPECT_EQ(store->pruneCount(), 2U);
+}
+
+TEST_F(StoreManagerImplTest, AnIntervalIsNotShortenedByTheWidthOfTheClock) {
+  clock_.set(1'700'000'000);
+  build(manager({{"a", fake("a")}}, 0, 4'000'000'000));
+  const auto store = get("a");
+  report("a", 1);
+  store->finishPrune();
+  for (const std::time_t now : {1'700'000'001, 2'000'000'000, std::numeric_limits<std::int32_t>::max()}) {
+    clock_.set(now);
+    report("a", 2);
+    EXPECT_EQ(store->pruneCount(), 1U) << now;
+  }
 }
 
 TEST_F(StoreManagerImplTest, WhileARoundIsInProgressNoOtherStartsHoweverLongItTakes) {

@@ -15,6 +15,7 @@
 #include <functional>
 #include <future>
 #include <iterator>
+#include <limits>
 #include <map>
 #include <memory>
 #include <optional>
@@ -671,10 +672,10 @@ class SettledSequence {
 
   void expire() {
     if (script_.oneIn(3) && !items_.empty()) {  // to the second: what was used at that very second stays
-      setup_.staleAge =
-          static_cast<long>(now_ - std::next(items_.begin(), script_.below(items()))->second.lastAccessDate);
+      setup_.staleAge = static_cast<long>(
+          now_ - std::next(items_.begin(), static_cast<std::ptrdiff_t>(script_.below(items())))->second.lastAccessDate);
     } else if (script_.oneIn(3)) {
-      setup_.staleAge = script_.oneIn(2) ? 4'000'000'000L : static_cast<long>(script_.below(60));
+      setup_.staleAge = script_.oneIn(2) ? std::numeric_limits<long>::max() : static_cast<long>(script_.below(60));
     }
     script_.say("expire what is older than " + std::to_string(setup_.staleAge));
     session_->store->overrideConfiguration(setup_.staleAge);
@@ -872,7 +873,7 @@ class InterleavedSequence {
     open();
     const unsigned int steps = 15 + script_.below(40);
     for (unsigned int i = 0; i < steps && !testing::Test::HasFailure(); ++i) {
-      clock_.advance(script_.below(3));
+      clock_.advance(static_cast<std::time_t>(script_.below(3)));
       call();
       pump(script_.below(4));
       if (script_.oneIn(12)) settle();

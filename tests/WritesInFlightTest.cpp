@@ -511,7 +511,7 @@ class Performance {
       EXPECT_EQ(files.size(), model_.size()) << "a value is lost";
     }
     if (scenario_.capacity) {
-      EXPECT_LE(files.size(), std::max<std::size_t>(*scenario_.capacity, scenario_.before.size()));
+      EXPECT_LE(files.size(), std::max<std::uint64_t>(*scenario_.capacity, scenario_.before.size()));
     }
   }
 

@@ -9,7 +9,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-constexpr std::uint64_t kBarWidth = 30;
+constexpr std::size_t kBarWidth = 30;
 constexpr std::chrono::milliseconds kDrawingInterval(40);
 constexpr std::uint64_t kWorthPlainLines = 2000;  // files: fewer are written before anybody wonders
 
@@ -36,7 +36,7 @@ void Progress::drawBar() {
   const auto now = std::chrono::steady_clock::now();
   if (now < nextDrawing_) return;
   nextDrawing_ = now + kDrawingInterval;
-  const std::uint64_t done = std::min(kBarWidth, files_ * kBarWidth / totalFiles_);
+  const auto done = static_cast<std::size_t>(std::min<std::uint64_t>(kBarWidth, files_ * kBarWidth / totalFiles_));
   console_.rewriteLine("  [" + std::string(done, '#') + std::string(kBarWidth - done, '.') + "] " + figures());
 }
 
