@@ -4,7 +4,7 @@
 #include <memory>
 #include <utility>
 
-#include "Future.h"
+#include <cellar/Future.h>
 
 namespace velmora::mobile::xplat::cellar::host {
 

@@ -2,8 +2,8 @@
 
 #include <string>
 
-#include "Export.h"
-#include "PathLocations.h"
+#include <cellar/Export.h>
+#include <cellar/PathLocations.h>
 
 namespace velmora::mobile::xplat::cellar::host {
 

@@ -9,11 +9,11 @@
 #include <string>
 #include <vector>
 
-#include "Export.h"
-#include "StoreManager.h"
-#include "XAnalytics.h"
-#include "executor/TaskQueueFactory.h"
-#include "session/Invalidatable.h"
+#include <cellar/Export.h>
+#include <cellar/StoreManager.h>
+#include <cellar/XAnalytics.h>
+#include <cellar/executor/TaskQueueFactory.h>
+#include <cellar/session/Invalidatable.h>
 
 namespace velmora::mobile::xplat::cellar {
 

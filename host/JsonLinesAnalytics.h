@@ -6,8 +6,8 @@
 #include <ostream>
 #include <string>
 
-#include "Export.h"
-#include "XAnalytics.h"
+#include <cellar/Export.h>
+#include <cellar/XAnalytics.h>
 
 namespace velmora::mobile::xplat::cellar::host {
 

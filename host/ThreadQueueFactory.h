@@ -3,8 +3,8 @@
 #include <chrono>
 #include <memory>
 
-#include "Export.h"
-#include "executor/TaskQueueFactory.h"
+#include <cellar/Export.h>
+#include <cellar/executor/TaskQueueFactory.h>
 
 namespace velmora::mobile::xplat::cellar::host {
 
