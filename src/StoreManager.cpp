@@ -12,7 +12,7 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 std::mutex forceCleanseMutex;
-bool forceCleanse = false;  // guarded by forceCleanseMutex
+bool forceCleanseAtStart = false;  // guarded by forceCleanseMutex
 
 std::string readable(const std::type_info& type) {
   int status = 0;
@@ -64,12 +64,12 @@ bool StoreManager::isValid() { return impl_->isValid(); }
 
 bool StoreManager::forceCleanseOnInit() {
   const std::lock_guard<std::mutex> lock(forceCleanseMutex);
-  return forceCleanse;
+  return forceCleanseAtStart;
 }
 
 void StoreManager::setForceCleanseOnInit(bool force) {
   const std::lock_guard<std::mutex> lock(forceCleanseMutex);
-  forceCleanse = force;
+  forceCleanseAtStart = force;
 }
 
 }  // namespace velmora::mobile::xplat::cellar
