@@ -3,11 +3,12 @@ include(GNUInstallDirs)
 include(CMakePackageConfigHelpers)
 set(CMAKE_SKIP_INSTALL_ALL_DEPENDENCY ON)  # tests and examples need not be built for it
 
-foreach(target cellar cellar_host)
+foreach(target cellar cellar_host cellar_testing)
   set_target_properties(${target} PROPERTIES INSTALL_RPATH $ORIGIN)
 endforeach()
 set_target_properties(cellar_host PROPERTIES EXPORT_NAME host)
-install(TARGETS cellar cellar_host EXPORT cellar-targets
+set_target_properties(cellar_testing PROPERTIES EXPORT_NAME testing)
+install(TARGETS cellar cellar_host cellar_testing EXPORT cellar-targets
   LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT libraries NAMELINK_COMPONENT development
   ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT development)
 

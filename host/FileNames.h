@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "Export.h"
+#include <cellar/Export.h>
 
 namespace velmora::mobile::xplat::cellar::host {
 

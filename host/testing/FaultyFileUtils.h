@@ -10,8 +10,8 @@
 #include <utility>
 #include <vector>
 
-#include "Export.h"
-#include "FileUtils.h"
+#include <cellar/Export.h>
+#include <cellar/FileUtils.h>
 
 namespace velmora::mobile::xplat::cellar::test {
 

@@ -7,9 +7,9 @@
 #include <mutex>
 #include <vector>
 
-#include "Export.h"
-#include "executor/AsyncExecutor.h"
-#include "executor/TaskQueueFactory.h"
+#include <cellar/Export.h>
+#include <cellar/executor/AsyncExecutor.h>
+#include <cellar/executor/TaskQueueFactory.h>
 
 namespace velmora::mobile::xplat::cellar::test {
 

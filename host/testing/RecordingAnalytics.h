@@ -5,10 +5,10 @@
 #include <string>
 #include <vector>
 
-#include "AnalyticsEventReporter.h"
-#include "Export.h"
-#include "JsonValue.h"
-#include "XAnalytics.h"
+#include <cellar/AnalyticsEventReporter.h>
+#include <cellar/Export.h>
+#include <cellar/JsonValue.h>
+#include <cellar/XAnalytics.h>
 
 namespace velmora::mobile::xplat::cellar::test {
 
