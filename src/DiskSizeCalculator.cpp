@@ -41,6 +41,11 @@ double numberIn(const JsonValue& document, const std::string& key) {
   return member->get_ref<const JsonValue::number_float_t&>();
 }
 
+// Figures that others have written into the attributes may be of any size: their sum wraps.
+void add(long long& sum, long long figure) {
+  sum = static_cast<long long>(static_cast<unsigned long long>(sum) + static_cast<unsigned long long>(figure));
+}
+
 }  // namespace
 
 const std::string DiskSizeCalculator::ATTR_SIZE = "qzDirectorySizeCalculationSize";
@@ -127,14 +132,14 @@ DiskSizeCalculator::Stats DiskSizeCalculator::traverseDirectory(
     if (excluded.count(fileUtils_->basename(entry.path)) > 0) continue;
     if (entry.type == FileUtils::Type::File) {
       stats.timeSpent += MIN_TIME_SPENT;
-      stats.size += entry.size;
-      ++stats.fileCount;
+      add(stats.size, entry.size);
+      add(stats.fileCount, 1);
       if (entry.size >= LARGE_FILE_SIZE) reportAnalytics(entry.path, Stats(false, 0.0, 1, entry.size));
     } else if (entry.type == FileUtils::Type::Directory) {
       const Stats nested = traverseDirectory(entry.path, directories, excluded);
       stats.timeSpent += nested.timeSpent;
-      stats.size += nested.size;
-      stats.fileCount += nested.fileCount;
+      add(stats.size, nested.size);
+      add(stats.fileCount, nested.fileCount);
     }
   }
   stats.timeSpent += secondsSince(start);

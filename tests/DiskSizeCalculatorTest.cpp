@@ -494,6 +494,14 @@ TEST_F(DiskSizeCalculatorTest, ADamagedResultOfANestedDirectoryDoesNotSpoilTheTr
   EXPECT_EQ(calculator_.calculateDirectorySize(directory_.file("root")).size, 321);
 }
 
+TEST_F(DiskSizeCalculatorTest, KeptFiguresBeyondAllBoundsWrapWhenTheyAreAdded) {
+  makeTree();
+  keep("root/sub", 0, LLONG_MAX, LLONG_MAX);
+  const Stats stats = calculator_.calculateDirectorySize(directory_.file("root"));
+  EXPECT_EQ(stats.size, LLONG_MIN + 20);
+  EXPECT_EQ(stats.fileCount, LLONG_MIN + 1);
+}
+
 TEST_F(DiskSizeCalculatorTest, AResultThatCannotBeWrittenIsOnlyLost) {
   makeTree();
   files_->failAlways(Operation::WriteFile, ENOSPC);
