@@ -231,7 +231,7 @@ bool hasDoubleNames(const std::string& text) {
     if (event == Document::parse_event_t::key) found = !open.back().insert(parsed.get<std::string>()).second || found;
     return true;
   };
-  (void)Document::parse(text, look);
+  [[maybe_unused]] const Document whole = Document::parse(text, look);
   return found;
 }
 
