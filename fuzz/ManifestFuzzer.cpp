@@ -171,7 +171,8 @@ bool isSound(const Manifest& manifest) {
 // The file is gone, as when a store was purged.
 void beginAgain(Manifest& manifest) {
   manifest.removeFiles();
-  if (manifest.open()) manifest->clear();
+  check(manifest.open(), "a manifest whose file is gone opens");
+  manifest->clear();
   manifest->load();
   check(recordsOf(manifest).empty(), "a manifest that begins again is empty");
   manifest->setItem({"key", "key", 1, false, 1, 1, nullptr});

@@ -187,17 +187,19 @@ class StoreUse {
   }
 
   void remove(const std::string& key) {
-    (void)finished(store_->removeItem(key));
+    const bool removed = finished(store_->removeItem(key))->failure.empty();
     notePurges();
-    expected_.erase(key);
+    if (expected_.erase(key) > 0 && removed) checkLeavesNoFile(key);
     check(finished(store_->fetch(key))->value == nullptr, "what was removed is a miss", key);
   }
 
   void touch(const std::string& key) { (void)finished(store_->updateLastAccessDate(key)); }
 
   void clear() {
-    runToTheEnd([this](auto onSuccess, auto onError) { store_->clear(onSuccess, onError); });
-    expected_.clear();
+    const bool failed = runToTheEnd([this](auto onSuccess, auto onError) { store_->clear(onSuccess, onError); });
+    for (const auto& [key, value] : std::exchange(expected_, {})) {
+      if (!failed && isStrict_) checkLeavesNoFile(key);
+    }
   }
 
   void prune(bool survival) {
@@ -290,6 +292,10 @@ class StoreUse {
     settle();
     check(successes + errors == 1, "a run of deletions ends once");
     return errors == 1;
+  }
+
+  void checkLeavesNoFile(const std::string& key) const {
+    check(options_.inlineData || !files_->pathExists(directory_.path + "/" + key), "what was removed has no file", key);
   }
 
   static bool isReserved(const std::string& key) {
