@@ -97,7 +97,7 @@ struct Ending {
 };
 
 template <class T> std::shared_ptr<Ending> watch(Future<T> future) {
-  const auto ending = std::make_shared<Ending>();
+  auto ending = std::make_shared<Ending>();
   future.then(nullptr, [ending](std::future<T>& result) {
     ++ending->completions;
     try {
