@@ -24,7 +24,7 @@
 #include "harness/Fuzzing.h"
 #include "harness/ManifestFile.h"
 #include "harness/Scratch.h"
-#include "support/ManualQueue.h"
+#include "host/testing/ManualQueue.h"
 #include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar::fuzz {

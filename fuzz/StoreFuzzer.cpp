@@ -29,7 +29,7 @@
 #include "harness/Fuzzing.h"
 #include "harness/Scratch.h"
 #include "harness/StoreDirectory.h"
-#include "support/ManualQueue.h"
+#include "host/testing/ManualQueue.h"
 #include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar::fuzz {

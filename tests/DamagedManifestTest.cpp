@@ -300,9 +300,8 @@ class DamagedManifests : public KeyValueStoreFixture {
   }
 
   void expectPruned() {
-    std::string ending;
-    cache_->pruneBackToNormal([&ending] { ending += "<done>"; },
-                              [&ending](const std::exception& error) { ending += error.what(); }, false);
+    ending.clear();
+    cache_->pruneBackToNormal(onSuccess(), onError(), false);
     settleAll();
     EXPECT_EQ(ending, "<done>");
     EXPECT_LE(lastSize_, kNormalSize);
