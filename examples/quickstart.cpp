@@ -4,9 +4,9 @@
 #include <sstream>
 
 // README: begin
-#include "Cellar.h"
-#include "host/Await.h"
-#include "host/Host.h"
+#include <cellar/Cellar.h>
+#include <cellar/host/Await.h>
+#include <cellar/host/Host.h>
 
 using namespace velmora::mobile::xplat::cellar;  // NOLINT: an example may
 
