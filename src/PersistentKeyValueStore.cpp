@@ -292,6 +292,7 @@ void PersistentKeyValueStore::writeInline(const std::string& key, const std::vec
 }
 
 void PersistentKeyValueStore::prepareWrite(const std::string& key) {
+  beginAnew();
   for (const auto& storedSince : clearsUnderWay_) {
     if (const auto keys = storedSince.lock()) keys->insert(key);
   }
@@ -366,6 +367,7 @@ void PersistentKeyValueStore::find(const std::vector<std::string>& keys, const L
 // The item's record; null for a miss, and when looking for it purged the store.
 std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(const std::string& key) {
   try {
+    beginAnew();
     return getManifest()->getItem(key);
   } catch (const ManifestCorruptedException& error) {
     purge(error);
@@ -415,7 +417,9 @@ bool PersistentKeyValueStore::readValue(std::shared_ptr<const DiskCacheItem> ite
   try {
     const auto manifest = getManifest();
     value = manifest->getInlineData(item->key);
-    return !value.empty() || manifest->getItem(item->key) != nullptr;
+    if (!value.empty()) return true;
+    const auto current = manifest->getItem(item->key);
+    return current != nullptr && current->size == 0;  // an empty value, not one that has vanished
   } catch (const ManifestCorruptedException& error) {
     purge(error);
     return false;
@@ -838,11 +842,19 @@ void PersistentKeyValueStore::handleCorruptedManifest(const LarderException& err
 void PersistentKeyValueStore::purge(const LarderException& error) {
   writesInFlight_->loseRecords();
   trashCollector_->collectPath(path);
+  isHalfPurged_ = true;
+  beginAnew();
+  LOG(ERROR) << "Store \"" << name_ << "\" purged due to corrupted manifest. " << error.what();
+}
+
+// The second half of a purge. On a full disk it can fail; the next operation then tries it again.
+void PersistentKeyValueStore::beginAnew() {
+  if (!isHalfPurged_) return;
   fileUtils_->createDirectory(path, true);
   const auto manifest = getManifest();
   manifest->clear();
   manifest->load();
-  LOG(ERROR) << "Store \"" << name_ << "\" purged due to corrupted manifest. " << error.what();
+  isHalfPurged_ = false;
 }
 
 void PersistentKeyValueStore::reportSize() {

@@ -228,6 +228,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void callOffWrites();
   std::vector<DiskCacheItem> takeAllBut(const KeySet& keep);
   void purge(const LarderException& error);
+  void beginAnew();
   void armStaleRemoval(long delaySeconds);
 
   // These run on the file queue.
@@ -267,11 +268,12 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   std::shared_ptr<AsyncExecutor> fileQueue_;
   std::shared_ptr<AsyncExecutor> workQueue_;
 
-  std::mutex mutex_;  // one operation on the manifest and its bookkeeping at a time; guards the four below
+  std::mutex mutex_;  // one operation on the manifest and its bookkeeping at a time; guards the five below
   long staleAge_;
   std::unique_ptr<AsyncTimer> staleRemovalTimer_;
   const std::unique_ptr<WritesInFlight> writesInFlight_;
   std::vector<std::weak_ptr<KeySet>> clearsUnderWay_;  // for each, the keys stored since it began
+  bool isHalfPurged_ = false;                          // its directory has gone to the trash, and no new one is there
 
   std::atomic<bool> invalidated_{false};  // set under the mutex
 

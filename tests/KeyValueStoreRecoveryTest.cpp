@@ -438,6 +438,31 @@ TEST_F(ADamagedManifest, ThatCannotEvenBeReplacedFailsTheOperationAndHealsLater)
   EXPECT_EQ(get("key"), "value");
 }
 
+TEST_F(ADamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextOperation) {
+  openWatched();
+  put("key", "value");
+  manifest->failNext(ManifestCall::SetItem, unwritable);
+  files->failNext(Operation::CreateDirectory, ENOSPC);
+  const Written written = watch(store->store("key", bytesOf("new")));
+  settle();
+  EXPECT_TRUE(isA<FileUtilsIoException>(written->failure)) << told(written);
+  EXPECT_FALSE(directory.exists("store"));
+
+  EXPECT_EQ(get("key"), "<miss>");
+  put("key", "newer");
+  EXPECT_EQ(get("key"), "newer");
+}
+
+TEST_F(ADamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextWrite) {
+  openWatched();
+  manifest->failNext(ManifestCall::SetItem, unwritable);
+  files->failNext(Operation::CreateDirectory, ENOSPC);
+  watch(store->store("key", bytesOf("value")));
+  settle();
+  put("key", "new");
+  EXPECT_EQ(get("key"), "new");
+}
+
 TEST_F(ADamagedManifest, WhoseDirectoryCannotBeCollectedIsEmptiedAllTheSame) {
   openWatched();
   put("key", "value");

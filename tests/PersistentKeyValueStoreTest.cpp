@@ -893,6 +893,13 @@ TEST_F(StoringInline, RemovedBetweenLookingUpAndReadingIsAMiss) {
   EXPECT_EQ(told(fetched), "<miss>");
 }
 
+TEST_F(StoringInline, WhoseBytesVanishedBehindTheStoreIsAMissAndNoEmptyValue) {
+  openWatched();
+  put("key", "value");
+  medium->change([](auto& rows) { rows.clear(); });
+  EXPECT_EQ(get("key"), "<miss>");
+}
+
 TEST_F(StoringInline, OverwrittenWhileItIsReadIsReadWhole) {
   openWatched();
   put("key", "old");

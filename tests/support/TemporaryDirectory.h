@@ -19,7 +19,8 @@ namespace velmora::mobile::xplat::cellar::test {
 // test.
 class TemporaryDirectory {
  public:
-  TemporaryDirectory() : path_(create()) {}
+  TemporaryDirectory() : TemporaryDirectory(testing::TempDir()) {}
+  explicit TemporaryDirectory(const std::string& parent) : path_(create(parent)) {}
   TemporaryDirectory(const TemporaryDirectory&) = delete;
   TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
   ~TemporaryDirectory() {
@@ -75,8 +76,8 @@ class TemporaryDirectory {
   }
 
  private:
-  static std::string create() {
-    std::string pattern = (std::filesystem::path(testing::TempDir()) / "cellar-XXXXXX").string();
+  static std::string create(const std::string& parent) {
+    std::string pattern = (std::filesystem::path(parent) / "cellar-XXXXXX").string();
     if (::mkdtemp(pattern.data()) == nullptr) throw std::system_error(errno, std::generic_category(), pattern);
     return pattern;
   }

@@ -1,0 +1,512 @@
+#include "faults/Life.h"
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <algorithm>
+#include <exception>
+#include <filesystem>
+#include <fstream>
+#include <utility>
+
+#include "AttributeStore.h"
+#include "Configuration.h"
+#include "DiskSizeCalculator.h"
+#include "LazyDispatcher.h"
+#include "PathLocations.h"
+#include "Store.h"
+#include "StoreManager.h"
+#include "StoreManagerFactory.h"
+#include "host/testing/RecordingAnalytics.h"
+
+namespace velmora::mobile::xplat::cellar::test {
+
+namespace {
+
+constexpr std::int64_t kSecond = 1'000'000'000;
+
+const char* const kConfiguration = R"({
+  "media": {
+    "max_size": "200B",
+    "prune_interval": "1 minutes",
+    "session_scoped": false,
+    "stores": {
+      "letters": {"type": "pkvs", "stale_age": "100 years"},
+      "settings": {"type": "pkvs", "inline_data": true, "stale_age": "100 years"},
+      "recent": {"type": "pkvs", "capacity": 3, "stale_age": "1 hours"},
+      "thumbs": {"type": "disk_cache", "lru_size_limit": "100B", "survival_size": "50B", "stale_age": "100 years"},
+      "web": {"type": "unmanaged", "is_cache": true, "max_size": "1KB"}
+    }
+  },
+  "inbox": {
+    "area": "documents",
+    "stores": {"notes": {"type": "pkvs", "stale_age": "100 years"}}
+  }
+})";
+
+const std::vector<std::string> kStores = {"letters", "settings", "recent", "thumbs", "notes"};
+
+std::string valueOf(const std::string& key, int version) {
+  std::string value = key + " " + std::to_string(version) + " ";
+  value.resize(30, static_cast<char>('a' + version % 26));
+  return value;
+}
+
+struct Locations final : PathLocations {
+  std::string root;
+  explicit Locations(std::string root_) : root(std::move(root_)) {}
+  std::string pathForArea(Area area, const std::string& /*sessionKey*/) override {
+    return root + (area == Area::Documents ? "/documents" : "/caches");
+  }
+};
+
+bool isPrefixOfOne(const std::string& text, const std::set<std::string>& values) {
+  return std::any_of(values.begin(), values.end(), [&](const std::string& v) { return v.rfind(text, 0) == 0; });
+}
+
+std::string oneAnswer(sqlite3* database, const char* question) {
+  std::string answer = "nothing";
+  const auto take = [](void* target, int, char** values, char**) {
+    *static_cast<std::string*>(target) = values[0] == nullptr ? "null" : values[0];
+    return 0;
+  };
+  if (sqlite3_exec(database, question, take, &answer, nullptr) != SQLITE_OK) answer = sqlite3_errmsg(database);
+  return answer;
+}
+
+}  // namespace
+
+// One run of the application.
+struct Life::Process {
+  std::shared_ptr<ManualQueueFactory> queues = std::make_shared<ManualQueueFactory>();
+  std::shared_ptr<ManualQueueFactory> trashQueues = std::make_shared<ManualQueueFactory>();
+  std::shared_ptr<EventLog> events = std::make_shared<EventLog>();
+  std::shared_ptr<RecordingTrashCollector> trash;
+  std::shared_ptr<DiskSizeCalculator> sizes;
+  std::shared_ptr<LazyDispatcher> lazyWork;
+  std::unique_ptr<StoreManagerFactory> sessionless;
+  std::unique_ptr<StoreManagerFactory> sessionScoped;
+  std::map<std::string, std::shared_ptr<StoreManager>> managers;
+  std::map<std::string, std::shared_ptr<PersistentKeyValueStore>> stores;
+  std::shared_ptr<UnmanagedStore> web;
+
+  Process(const std::string& root, const std::shared_ptr<FileUtils>& files) {
+    const auto reporter = recordingReporter(events);
+    trash = std::make_shared<RecordingTrashCollector>(root + "/trash", files, reporter, trashQueues);
+    const auto attributes = std::make_shared<AttributeStore>(files);
+    sizes = std::make_shared<DiskSizeCalculator>(files, attributes, reporter);
+    lazyWork = LazyDispatcher::createLazyDispatcher(queues, 10);
+    const auto configuration = std::make_shared<const Configuration>(kConfiguration);
+    const auto locations = std::make_shared<Locations>(root);
+    const auto names = std::make_shared<StoreDirectoryNameBuilderFactory>("250", "US", "en");
+    const auto factory = [&](bool servesSessionScoped) {
+      return std::make_unique<StoreManagerFactory>(servesSessionScoped, reporter, attributes, configuration, sizes,
+                                                   files, lazyWork, locations, names, queues, trash,
+                                                   [](const std::string& sessionKey) { return sessionKey; });
+    };
+    sessionless = factory(false);
+    sessionScoped = factory(true);
+  }
+
+  std::vector<std::shared_ptr<ManualExecutor>> executors() const {
+    auto all = queues->all();
+    for (const auto& executor : trashQueues->all()) all.push_back(executor);
+    return all;
+  }
+
+  // Whoever waits for a queue on this thread finds it running.
+  void runQueuesAtOnce(bool atOnce) const {
+    for (const auto& queue : executors()) {
+      queue->onDispatch = atOnce ? [raw = queue.get()] { raw->runAll(); } : std::function<void()>();
+    }
+  }
+};
+
+struct Life::Step {
+  const char* name;
+  void (Life::*run)();
+};
+
+const std::vector<Life::Step>& Life::script() {
+  static const std::vector<Step> steps = {
+      {"start", &Life::start},           {"fill", &Life::fill},
+      {"fetch", &Life::fetchSome},       {"overwrite", &Life::overwrite},
+      {"remove", &Life::remove},         {"evict", &Life::evict},
+      {"prune", &Life::prune},           {"measure", &Life::measure},
+      {"expire", &Life::expire},         {"clear", &Life::clear},
+      {"flush", &Life::flush},           {"empty the trash", &Life::emptyTrash},
+      {"survive", &Life::survive},       {"mark for the trash", &Life::markForTrash},
+      {"invalidate", &Life::invalidate}, {"restart", &Life::restart},
+      {"fetch all", &Life::fetchAll},    {"fill again", &Life::fillAgain},
+  };
+  return steps;
+}
+
+std::size_t Life::stepCount() { return script().size(); }
+
+Life::Life(const std::string& root, Hardship hardship) : root_(root), hardship_(hardship) {}
+
+Life::~Life() { end(); }
+
+void Life::step(std::size_t number) {
+  const Step& step = script().at(number);
+  const testing::ScopedTrace trace(__FILE__, __LINE__, step.name);
+  (this->*step.run)();
+  notePurges();
+}
+
+void Life::end() {
+  if (process_ == nullptr) return;
+  process_->lazyWork->willBeTriggeredExternally();
+  settle();
+  process_.reset();
+}
+
+// --- The script ---
+
+void Life::start() {
+  process_ = std::make_unique<Process>(root_, files);
+  purges_.clear();
+  mayThrow_ = true;
+  for (const auto& [manager, isSessionScoped] : {std::pair("media", false), std::pair("inbox", true)}) {
+    attempt([&, name = manager, scoped = isSessionScoped] {
+      StoreManagerFactory& factory = scoped ? *process_->sessionScoped : *process_->sessionless;
+      process_->managers[name] = factory.managerForIdentifier(name, scoped ? "alice" : "", true);
+    });
+    settle();
+  }
+  for (const std::string& name : kStores) {
+    const auto manager = process_->managers.find(name == "notes" ? "inbox" : "media");
+    if (manager == process_->managers.end() || manager->second == nullptr) continue;
+    attempt([&] {
+      if (auto opened = manager->second->getStore<PersistentKeyValueStore>(name)) process_->stores[name] = opened;
+    });
+    settle();
+  }
+  if (const auto media = process_->managers.find("media"); media != process_->managers.end()) {
+    attempt([&] { process_->web = media->second->getStore<UnmanagedStore>("web"); });
+    settle();
+  }
+  mayThrow_ = false;
+}
+
+void Life::restart() {
+  end();
+  start();
+}
+
+void Life::fill() {
+  for (const char* key : {"a", "b", "c"}) {
+    put("letters", key, 1);
+    put("settings", key, 1);
+    put("recent", key, 1);
+    put("thumbs", key, 1);
+  }
+  put("notes", "a", 1);
+}
+
+void Life::fetchSome() {
+  fetch("letters", "a");
+  fetch("letters", "unknown");
+  fetch("settings", "a");
+  fetch("thumbs", "a");
+}
+
+void Life::overwrite() {
+  put("letters", "b", 2);
+  put("settings", "b", 2);
+  put("thumbs", "b", 2);
+}
+
+void Life::remove() {
+  drop("letters", "c");
+  drop("settings", "c");
+  drop("letters", "unknown");
+}
+
+void Life::evict() {
+  mayGo("recent");
+  put("recent", "d", 1);
+}
+
+void Life::prune() {
+  for (const char* key : {"d", "e"}) {
+    mayGo("thumbs");
+    put("thumbs", key, 1);
+  }
+  if (!has("thumbs")) return;
+  attempt([&] { store("thumbs").pruneBackToNormal(nullptr, nullptr, false); });
+  settle();
+}
+
+void Life::measure() {
+  if (process_->web == nullptr) return;
+  std::ofstream(process_->web->path + "/page") << std::string(2000, 'x');
+  attempt([&] { process_->sizes->calculateDirectorySize(process_->web->path); });
+}
+
+void Life::expire() {
+  clock_.advance(7200);
+  const std::size_t before = faults();
+  mayGo("recent");
+  put("recent", "late", 1);
+  settle();
+  for (std::size_t i = 0; i < process_->queues->workQueueCount(); ++i) {
+    while (process_->queues->workQueue(i)->fireTimer(300 * kSecond)) settle();
+  }
+  notePurges();
+  if (!has("recent") || faults() > 0 || before > 0) return;
+  EXPECT_EQ(store("recent").getAllKeys(), std::vector<std::string>{"late"});
+}
+
+void Life::clear() {
+  if (!has("recent")) return;
+  bool isCleared = false;
+  attempt([&] { store("recent").clear([&] { isCleared = true; }, [&](const std::exception&) { ++complaints_; }); });
+  mayGo("recent");
+  settle();
+  notePurges();
+  if (isCleared && purges_["recent"] == 0) {
+    for (auto& [key, remembered] : memory_["recent"]) remembered.values.clear();
+  }
+  put("recent", "after", 1);
+}
+
+void Life::flush() {
+  for (std::size_t i = 0; i < process_->queues->workQueueCount(); ++i) {
+    process_->queues->workQueue(i)->fireTimer(120 * kSecond);
+  }
+  settle();
+}
+
+void Life::emptyTrash() {
+  settle();
+  process_->runQueuesAtOnce(true);
+  attempt([&] { process_->trash->emptyAllTrash(); });
+  process_->runQueuesAtOnce(false);
+}
+
+void Life::survive() {
+  clock_.advance(7200);
+  files->total = 1LL << 20;
+  mayGo("thumbs");
+  put("thumbs", "last", 1);
+  mayGo("thumbs");
+  settle();
+  files->total = 1LL << 40;
+}
+
+void Life::markForTrash() {
+  const auto media = process_->managers.find("media");
+  if (media == process_->managers.end()) return;
+  mayGo("thumbs");
+  attempt([&] { media->second->trashStoreOnStartup("thumbs"); });
+}
+
+void Life::invalidate() {
+  settle();
+  mayGo("notes");
+  process_->runQueuesAtOnce(true);
+  attempt([&] { process_->sessionScoped->invalidate(); });
+  process_->runQueuesAtOnce(false);
+  settle();
+  process_->stores.erase("notes");
+  process_->managers.erase("inbox");
+}
+
+void Life::fetchAll() {
+  for (const auto& [store, keys] : memory_) {
+    for (const auto& [key, remembered] : keys) fetch(store, key);
+  }
+}
+
+void Life::fillAgain() {
+  put("letters", "d", 3);
+  put("letters", "a", 3);
+  put("settings", "d", 3);
+  put("notes", "b", 3);
+  drop("letters", "b");
+}
+
+// --- What is done with a store ---
+
+void Life::put(const std::string& name, const std::string& key, int version) {
+  const std::string value = valueOf(name + "/" + key, version);
+  if (!has(name)) return;
+  const std::size_t purgesBefore = purges(name);
+  const Written written = watch(store(name).store(key, bytesOf(value)));
+  settle();
+  notePurges();
+  ASSERT_FALSE(written->isPending()) << name << " " << key;
+
+  Remembered& remembered = memory_[name][key];
+  remembered.everWritten.insert(value);
+  if (written->hasSucceeded() && purges(name) == purgesBefore) {
+    remembered.values = {value};
+    remembered.mayBeMissing = remembered.mayFail = remembered.mayBeTorn = false;
+    // A limit may take it at any time from here on.
+    if (name == "thumbs") remembered.mayBeMissing = true;
+    return;
+  }
+  if (!written->hasSucceeded()) ++complaints_;
+  remembered.values.insert(value);
+  remembered.mayBeMissing = true;
+  if (hardship_ != Hardship::OneFault) remembered.mayFail = remembered.mayBeTorn = true;
+}
+
+void Life::fetch(const std::string& name, const std::string& key) {
+  if (!has(name)) return;
+  const std::size_t faultsBefore = faults();
+  const Fetched fetched = watch(store(name).fetch(key));
+  settle();
+  notePurges();
+  ASSERT_FALSE(fetched->isPending()) << name << " " << key;
+  const std::string answer = told(fetched);
+  if (!fetched->hasSucceeded()) ++complaints_;
+  const bool isTrouble = answer == "<miss>" || !fetched->hasSucceeded();
+  if (isTrouble && faults() > faultsBefore) return;  // no value may be wrong for all that
+  expectAllIsAnswered(name, key, answer);
+}
+
+void Life::expectAllIsAnswered(const std::string& name, const std::string& key, const std::string& answer) {
+  const Remembered& remembered = memory_[name][key];
+  if (answer == "<miss>") {
+    EXPECT_TRUE(remembered.mayBeMissing) << name << " " << key << " is missing";
+  } else if (answer.rfind("<error>", 0) == 0) {
+    EXPECT_TRUE(remembered.mayFail) << name << " " << key << ": " << answer;
+  } else {
+    const bool isWhole = remembered.values.count(answer) > 0;
+    EXPECT_TRUE(isWhole || (remembered.mayBeTorn && isPrefixOfOne(answer, remembered.everWritten)))
+        << name << " " << key << " is '" << answer << "'";
+  }
+}
+
+void Life::drop(const std::string& name, const std::string& key) {
+  if (!has(name)) return;
+  const std::size_t purgesBefore = purges(name);
+  const Written removed = watch(store(name).removeItem(key));
+  settle();
+  notePurges();
+  ASSERT_FALSE(removed->isPending()) << name << " " << key;
+  Remembered& remembered = memory_[name][key];
+  remembered.mayBeMissing = true;
+  if (removed->hasSucceeded() && purges(name) == purgesBefore) {
+    remembered.values.clear();  // what was removed does not come back
+    remembered.mayFail = remembered.mayBeTorn = false;
+  } else if (!removed->hasSucceeded()) {
+    ++complaints_;
+  }
+}
+
+// --- Holding it to its promises ---
+
+void Life::verify() {
+  vfs.heal();
+  files->heal();
+  files->onCall = nullptr;
+  if (process_ != nullptr) {
+    const testing::ScopedTrace trace(__FILE__, __LINE__, "in the same process");
+    expectNewWorkSucceeds();
+    fetchAll();
+  }
+  const testing::ScopedTrace trace(__FILE__, __LINE__, "after a restart");
+  restart();
+  for (const std::string& name : kStores) EXPECT_TRUE(has(name)) << name;
+  EXPECT_NE(process_->web, nullptr);
+  fetchAll();
+  expectNewWorkSucceeds();
+  expectDatabasesAreSound();
+  fetchAll();
+}
+
+void Life::expectNewWorkSucceeds() {
+  ++freshVersion_;
+  for (const std::string& name : kStores) {
+    if (!has(name)) continue;
+    const std::string value = valueOf(name, freshVersion_);
+    if (name == "recent") mayGo(name);  // at its capacity
+    const Written written = watch(store(name).store("fresh", bytesOf(value)));
+    settle();
+    EXPECT_EQ(told(written), "<done>") << name;
+    Remembered& remembered = memory_[name]["fresh"];
+    remembered = {{value}, {value}, name == "thumbs", false, false};
+    const Fetched fetched = watch(store(name).fetch("fresh"));
+    settle();
+    if (name != "thumbs" || told(fetched) != "<miss>") {
+      EXPECT_EQ(told(fetched), value) << name;
+    }
+  }
+}
+
+void Life::expectDatabasesAreSound() {
+  if (hardship_ == Hardship::SilentLoss) return;  // SQLite could not know, and has gone on from what it read
+  for (const auto& [name, opened] : process_->stores) {
+    sqlite3* database = nullptr;
+    const std::string path = opened->path + "/manifest_v1.sqlite";
+    ASSERT_EQ(sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READWRITE, nullptr), SQLITE_OK) << path;
+    EXPECT_EQ(oneAnswer(database, "PRAGMA integrity_check"), "ok") << name;
+    EXPECT_EQ(oneAnswer(database, "SELECT ifnull(SUM(size), 0) FROM LarderManifest"),
+              std::to_string(opened->getManifest()->size()))
+        << name;
+    sqlite3_close(database);
+  }
+}
+
+bool Life::hasToldOfTrouble() const { return complaints_ > 0 || log_.errorCount() > 0; }
+
+bool Life::has(const std::string& name) const { return process_ != nullptr && process_->stores.count(name) > 0; }
+
+PersistentKeyValueStore& Life::store(const std::string& name) const { return *process_->stores.at(name); }
+
+// A purge hands the store's directory to the collector.
+std::size_t Life::purges(const std::string& name) const {
+  if (!has(name)) return 0;
+  const auto collected = process_->trash->collected();
+  return static_cast<std::size_t>(std::count(collected.begin(), collected.end(), store(name).path));
+}
+
+void Life::notePurges() {
+  for (const std::string& name : kStores) {
+    const std::size_t now = purges(name);
+    const bool isPurged = now != std::exchange(purges_[name], now) && has(name);
+    const bool isHarmed = isPurged || (hardship_ == Hardship::SilentLoss && faults() > 0);
+    if (isHarmed) mayGo(name);
+    if (!isHarmed || hardship_ == Hardship::OneFault) continue;
+    for (auto& [key, remembered] : memory_[name]) remembered.mayFail = true;
+  }
+}
+
+void Life::mayGo(const std::string& name) {
+  for (auto& [key, remembered] : memory_[name]) remembered.mayBeMissing = true;
+}
+
+// --- Running ---
+
+void Life::attempt(const std::function<void()>& work) {
+  try {
+    work();
+  } catch (const std::exception&) {
+    ++complaints_;
+  }
+}
+
+void Life::settle() {
+  for (bool ran = true; ran;) {
+    ran = false;
+    for (const auto& queue : process_->executors()) ran = runNext(*queue) || ran;
+  }
+}
+
+bool Life::runNext(ManualExecutor& queue) {
+  try {
+    return queue.runNext();
+  } catch (const LarderException& error) {
+    ++complaints_;
+    EXPECT_TRUE(mayThrow_) << "left its task: " << error.what();
+    return true;
+  }
+}
+
+std::size_t Life::faults() const { return vfs.failures() + files->failures(); }
+
+}  // namespace velmora::mobile::xplat::cellar::test
