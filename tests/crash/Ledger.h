@@ -1,0 +1,65 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <map>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "crash/Protocol.h"
+
+namespace velmora::mobile::xplat::cellar::crash {
+
+// What can be found under a key after a kill.
+enum class Outcome { Old, New, Partial, Error, Missing, Forbidden };
+
+// What the workers have told, and so what may be found: of each key the last state that was acknowledged, and
+// whatever was asked for after that.
+class Ledger {
+ public:
+  using Key = std::pair<std::size_t, std::uint32_t>;  // store and number
+  using Bytes = std::vector<unsigned char>;
+
+  void note(const Record& record);
+
+  // Judges what a fetch has answered: bytes, nothing, or an error. `isMiddle` tells whether an operation on the key was
+  // under way.
+  Outcome judge(const Key& key, const std::optional<Bytes>& found, bool isError, bool& isMiddle) const;
+
+  // From now on this is the state: what was found after the kill, or what was stored since.
+  void settle(const Key& key, std::optional<std::pair<std::uint32_t, std::uint32_t>> versionAndLength);
+
+  // Finds the version that the bytes are, for `settle`; nothing when they are no whole value.
+  std::optional<std::pair<std::uint32_t, std::uint32_t>> versionOf(const Key& key, const Bytes& found) const;
+
+  std::vector<Key> keys() const;
+  std::uint32_t lastVersion() const { return lastVersion_; }
+
+  std::size_t acknowledged = 0;
+  std::size_t failed = 0;
+
+ private:
+  struct State {
+    bool isThere = false;
+    std::uint32_t version = 0;
+    std::uint32_t length = 0;
+  };
+  struct Attempt {
+    State wanted;
+    bool isAcknowledged = false;
+  };
+  struct History {
+    State settled;
+    std::vector<Attempt> attempts;  // in the order in which they were called
+  };
+
+  // The states that may be found: the last acknowledged one and then what was wanted after it.
+  static std::vector<State> possible(const History& history);
+
+  std::map<Key, History> histories_;
+  std::uint32_t lastVersion_ = 0;
+};
+
+}  // namespace velmora::mobile::xplat::cellar::crash
