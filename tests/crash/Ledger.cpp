@@ -1,8 +1,22 @@
 #include "crash/Ledger.h"
 
 #include <algorithm>
+#include <cstdlib>
 
 namespace velmora::mobile::xplat::cellar::crash {
+
+namespace {
+
+// Whether the bytes say that they are the key's own, and are.
+bool isOlder(const Ledger::Key& key, const Ledger::Bytes& found) {
+  const std::string text(found.begin(), found.end());
+  const auto mark = text.find('#');
+  if (mark == std::string::npos || text.find(';') == std::string::npos) return false;
+  const auto version = static_cast<std::uint32_t>(std::strtoul(text.c_str() + mark + 1, nullptr, 10));
+  return found == valueOf(key.first, key.second, version, static_cast<std::uint32_t>(found.size()));
+}
+
+}  // namespace
 
 void Ledger::note(const Record& record) {
   if (record.kind == Record::Kind::Done) ++acknowledged;
@@ -53,7 +67,9 @@ Outcome Ledger::judge(const Key& key, const std::optional<Bytes>& found, bool is
     const bool isPrefix = found->size() <= whole.size() && std::equal(found->begin(), found->end(), whole.begin());
     if (isPrefix && isMiddle && i > 0) return Outcome::Partial;
   }
-  return Outcome::Forbidden;
+  const bool isBeingWritten =
+      std::any_of(states.begin() + 1, states.end(), [](const State& state) { return state.isThere; });
+  return isBeingWritten && isOlder(key, *found) ? Outcome::Older : Outcome::Forbidden;
 }
 
 std::optional<std::pair<std::uint32_t, std::uint32_t>> Ledger::versionOf(const Key& key, const Bytes& found) const {

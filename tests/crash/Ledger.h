@@ -12,8 +12,10 @@
 
 namespace velmora::mobile::xplat::cellar::crash {
 
-// What can be found under a key after a kill.
-enum class Outcome { Old, New, Partial, Error, Missing, Forbidden };
+// What can be found under a key after a kill. `Older`: a value of the key that had been removed or evicted, but whose
+// file an earlier kill had spared; the record of a first write stands before its file does.
+enum class Outcome { Old, New, Partial, Older, Error, Missing, Forbidden };
+constexpr std::size_t kOutcomes = 7;
 
 // What the workers have told, and so what may be found: of each key the last state that was acknowledged, and
 // whatever was asked for after that.

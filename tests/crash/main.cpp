@@ -144,7 +144,8 @@ class Killer {
 
 int conclude(const Killer& killer, std::uint64_t seed, double seconds) {
   const Findings& findings = killer.findings();
-  static constexpr std::array<const char*, 6> names = {"old", "new", "partly written", "error", "missing", "forbidden"};
+  static constexpr std::array<const char*, kOutcomes> names = {"old",   "new",     "partly written", "older",
+                                                               "error", "missing", "forbidden"};
   std::cout << "seed " << seed << ": " << killer.kills() << " kills in " << std::fixed << std::setprecision(1)
             << seconds << " s, " << static_cast<double>(killer.kills()) / seconds << " a second\n"
             << killer.acknowledged() << " operations acknowledged, " << killer.failed() << " failed\n"

@@ -255,7 +255,7 @@ void Life::expire() {
     while (process_->queues->workQueue(i)->fireTimer(300 * kSecond)) settle();
   }
   notePurges();
-  if (!has("recent") || faults() > 0 || before > 0) return;
+  if (!has("recent") || faults() > 0 || before > 0 || hardship_ != Hardship::OneFault) return;
   EXPECT_EQ(store("recent").getAllKeys(), std::vector<std::string>{"late"});
 }
 
@@ -364,7 +364,7 @@ void Life::fetch(const std::string& name, const std::string& key) {
   const std::string answer = told(fetched);
   if (!fetched->hasSucceeded()) ++complaints_;
   const bool isTrouble = answer == "<miss>" || !fetched->hasSucceeded();
-  if (isTrouble && faults() > faultsBefore) return;  // no value may be wrong for all that
+  if (isTrouble && (isInTrouble || faults() > faultsBefore)) return;  // no value may be wrong for all that
   expectAllIsAnswered(name, key, answer);
 }
 

@@ -58,6 +58,7 @@ class Life {
   // Whether anybody was told that something went wrong: a caller by an exception or a future, or the log.
   bool hasToldOfTrouble() const;
 
+  bool isInTrouble = false;  // by a fault that neither of the two below knows of
   FaultyVfs vfs;
   std::shared_ptr<DiskOfChosenSize> files = std::make_shared<DiskOfChosenSize>();
 
