@@ -119,6 +119,7 @@ void DiskSizeCalculator::setAnalytics(bool enabled) {
 DiskSizeCalculator::Stats DiskSizeCalculator::traverseDirectory(
     const std::string& path, const std::unordered_map<std::string, long>& directories,
     const std::unordered_set<std::string>& excluded) {
+  const bool isLink = fileUtils_->isSymLink(path);  // only a directory that was asked for by its name may be one
   if (!fileUtils_->isDirectory(path)) return {false, 0, 0, 0};
   if (excluded.count(fileUtils_->basename(path)) > 0) return {true, 0, 0, 0};
 
@@ -128,14 +129,16 @@ DiskSizeCalculator::Stats DiskSizeCalculator::traverseDirectory(
 
   const std::clock_t start = std::clock();
   Stats stats(false, 0.0, 0, 0);
-  for (const FileUtils::Info& entry : fileUtils_->listDirectory(path)) {
+  const auto entries = fileUtils_->listDirectory(path);
+  if (!isLink && fileUtils_->isSymLink(path)) return {false, 0, 0, 0};  // put there meanwhile
+  for (const FileUtils::Info& entry : entries) {
     if (excluded.count(fileUtils_->basename(entry.path)) > 0) continue;
     if (entry.type == FileUtils::Type::File) {
       stats.timeSpent += MIN_TIME_SPENT;
       add(stats.size, entry.size);
       add(stats.fileCount, 1);
       if (entry.size >= LARGE_FILE_SIZE) reportAnalytics(entry.path, Stats(false, 0.0, 1, entry.size));
-    } else if (entry.type == FileUtils::Type::Directory) {
+    } else if (entry.type == FileUtils::Type::Directory && !fileUtils_->isSymLink(entry.path)) {
       const Stats nested = traverseDirectory(entry.path, directories, excluded);
       stats.timeSpent += nested.timeSpent;
       add(stats.size, nested.size);

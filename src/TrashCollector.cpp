@@ -94,7 +94,11 @@ class TrashCollector::Trash {
     for (; listings < kMaxListings && running_; ++listings) {
       const auto entries = fileUtils_->listDirectory(path);
       if (entries.empty()) break;
-      for (const FileUtils::Info& entry : entries) recursiveDelete(entry);
+      for (const FileUtils::Info& entry : entries) {
+        // Whoever has put a link in the directory's place meanwhile would have us delete what lies behind it.
+        if (fileUtils_->isSymLink(path)) return true;
+        recursiveDelete(entry);
+      }
     }
     return listings > 0;
   }
@@ -151,6 +155,7 @@ bool TrashCollector::removeFilesWithFilter(const std::string& path,
     if (!fileUtils_->isSymLink(path) && fileUtils_->isDirectory(path)) {
       bool allRemoved = true;
       for (const FileUtils::Info& entry : fileUtils_->listDirectory(path)) {
+        if (fileUtils_->isSymLink(path)) break;  // put there meanwhile: it goes as a link
         allRemoved = removeFilesWithFilter(entry.path, filter) && allRemoved;
       }
       if (!allRemoved) return false;
@@ -184,7 +189,7 @@ std::string TrashCollector::freeTrashEntry() {
     char name[17];
     (void)std::snprintf(name, sizeof name, "%016" PRIx64, static_cast<std::uint64_t>(random_()));
     std::string entry = fileUtils_->combinePath(trashPath_, name);
-    if (!fileUtils_->pathExists(entry)) return entry;
+    if (!fileUtils_->pathExists(entry) && !fileUtils_->isSymLink(entry)) return entry;
   }
 }
 
