@@ -125,6 +125,15 @@ TEST_F(HostileKeys, WithASlashAddressFilesBelow) {
   EXPECT_FALSE(directory.exists("store/a/b"));
 }
 
+TEST_F(HostileKeys, WithTwoDotsReachOutsideTheStore) {
+  open();
+  directory.write("neighbour/secret", "value");
+  put("../neighbour/secret", "replaced");
+  EXPECT_EQ(directory.read("neighbour/secret"), "replaced");
+  EXPECT_EQ(drop("../neighbour/secret"), "<done>");
+  EXPECT_FALSE(directory.exists("neighbour/secret"));
+}
+
 TEST_F(HostileKeys, ThatAreTooLongForAFileNameFailAndTheLongestWorks) {
   open();
   const std::string longest(255, 'x');

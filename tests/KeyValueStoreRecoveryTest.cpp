@@ -690,6 +690,22 @@ TEST_F(AVanishedDirectory, FailsWritesAndReadsAndIsBackAfterARestart) {
   EXPECT_EQ(get("key"), "value");
 }
 
+// As a phone does that is short of space, while the application runs.
+TEST_F(AVanishedDirectory, EmptiedUnderneathTakesNewValuesButForgetsThemAtARestart) {
+  open();
+  put("key", "value");
+  for (const std::string& name : directory.names("store")) std::filesystem::remove(pathOf(name));
+  EXPECT_THAT(get("key"), testing::StartsWith("<error>"));
+  put("new", "value");
+  EXPECT_EQ(get("new"), "value");
+  reopen();
+  EXPECT_EQ(get("key"), "<miss>");
+  EXPECT_EQ(get("new"), "<miss>");
+  EXPECT_THAT(valueFiles(), ElementsAre("new"));  // a file without a record
+  put("new", "newer");
+  EXPECT_EQ(get("new"), "newer");
+}
+
 TEST_F(AVanishedDirectory, IsClearedAndExpiredWithoutAnError) {
   open();
   put("key", "value");
