@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstddef>
+#include <cstdlib>
 #include <filesystem>
 #include <functional>
 #include <iostream>
@@ -38,7 +39,7 @@ std::size_t openDescriptors() {
 struct Faults {
   std::string name;
   std::function<void(Life& life, std::size_t n)> plan;
-  std::size_t stride = 1;
+  std::size_t stride = 1;  // how many n it goes on by, to be done in seconds; CELLAR_EVERY_FAULT=1 leaves none out
   // Whether the n-th fault of that life must have been noticed by somebody; by nobody when absent.
   std::function<bool(Life& life, std::size_t n)> isDueToBeTold;
   Life::Hardship hardship = Life::Hardship::OneFault;
@@ -51,7 +52,8 @@ class FaultInjection : public testing::Test {
     const std::size_t descriptors = openDescriptors();
     std::size_t met = 0;
     std::size_t lives = 0;
-    for (std::size_t n = 1; !HasFailure(); n += faults.stride) {
+    const std::size_t stride = std::getenv("CELLAR_EVERY_FAULT") != nullptr ? 1 : faults.stride;
+    for (std::size_t n = 1; !HasFailure(); n += stride) {
       const testing::ScopedTrace trace(__FILE__, __LINE__, faults.name + ", n = " + std::to_string(n));
       const std::size_t metNow = live(faults, n);
       met += metNow;
@@ -80,9 +82,10 @@ class FaultInjection : public testing::Test {
     return met;
   }
 
-  void sweepFiles(const std::string& name, int errnoCode, bool tears) {
+  void sweepFiles(const std::string& name, int errnoCode, bool tears, std::size_t stride) {
     Faults faults;
     faults.name = name;
+    faults.stride = stride;
     faults.plan = [=](Life& life, std::size_t n) {
       life.files->failNth(n, errnoCode);
       life.files->tearFailingWrites(tears);
@@ -102,17 +105,17 @@ TEST_F(FaultInjection, TheLifeItselfMeetsNoTrouble) {
   EXPECT_EQ(live(none, 1), 0U);
 }
 
-TEST_F(FaultInjection, AFileOperationThatFailsOnce) { sweepFiles("file operation, EIO", EIO, false); }
+TEST_F(FaultInjection, AFileOperationThatFailsOnce) { sweepFiles("file operation, EIO", EIO, false, 1); }
 
 TEST_F(FaultInjection, AFileOperationThatFindsNoSpaceOnceAndWritesTorn) {
-  sweepFiles("file operation, ENOSPC, torn", ENOSPC, true);
+  sweepFiles("file operation, ENOSPC, torn", ENOSPC, true, 2);
 }
 
 // From the n-th file operation on the disk takes nothing more, from nobody.
 TEST_F(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
   Faults faults;
   faults.name = "a full disk from the n-th file operation on";
-  faults.stride = 3;
+  faults.stride = 7;
   faults.hardship = Life::Hardship::ManyFaults;
   faults.plan = [](Life& life, std::size_t n) {
     life.files->tearFailingWrites(true);
@@ -130,7 +133,7 @@ TEST_F(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
 TEST_F(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
   Faults faults;
   faults.name = "a dead disk from the n-th file operation on";
-  faults.stride = 3;
+  faults.stride = 7;
   faults.hardship = Life::Hardship::ManyFaults;
   faults.plan = [](Life& life, std::size_t n) {
     life.files->onCall = [&life, left = n](Operation, const std::string&) mutable {
@@ -179,8 +182,8 @@ INSTANTIATE_TEST_SUITE_P(
     testing::Values(DatabaseFault{"OpenCannot", VfsCall::Open, SQLITE_CANTOPEN, 1, false},
                     DatabaseFault{"ReadFails", VfsCall::Read, SQLITE_IOERR_READ, 1, false},
                     DatabaseFault{"ReadIsShort", VfsCall::Read, SQLITE_IOERR_SHORT_READ, 1, false},
-                    DatabaseFault{"WriteFails", VfsCall::Write, SQLITE_IOERR_WRITE, 3, false},
-                    DatabaseFault{"WriteFindsNoSpaceAndIsTorn", VfsCall::Write, SQLITE_FULL, 3, true},
+                    DatabaseFault{"WriteFails", VfsCall::Write, SQLITE_IOERR_WRITE, 7, false},
+                    DatabaseFault{"WriteFindsNoSpaceAndIsTorn", VfsCall::Write, SQLITE_FULL, 7, true},
                     DatabaseFault{"TruncateFails", VfsCall::Truncate, SQLITE_IOERR_TRUNCATE, 1, false},
                     DatabaseFault{"SyncFails", VfsCall::Sync, SQLITE_IOERR_FSYNC, 1, false},
                     DatabaseFault{"FileSizeFails", VfsCall::FileSize, SQLITE_IOERR_FSTAT, 1, false},
@@ -189,8 +192,8 @@ INSTANTIATE_TEST_SUITE_P(
                     DatabaseFault{"DeleteFails", VfsCall::Delete, SQLITE_IOERR_DELETE, 1, false},
                     DatabaseFault{"AccessFails", VfsCall::Access, SQLITE_IOERR_ACCESS, 1, false},
                     DatabaseFault{"MapSharedMemoryFails", VfsCall::MapSharedMemory, SQLITE_IOERR_SHMMAP, 1, false},
-                    DatabaseFault{"LockSharedMemoryIsBusy", VfsCall::LockSharedMemory, SQLITE_BUSY, 3, false},
-                    DatabaseFault{"LockSharedMemoryFails", VfsCall::LockSharedMemory, SQLITE_IOERR_SHMLOCK, 3, false}),
+                    DatabaseFault{"LockSharedMemoryIsBusy", VfsCall::LockSharedMemory, SQLITE_BUSY, 7, false},
+                    DatabaseFault{"LockSharedMemoryFails", VfsCall::LockSharedMemory, SQLITE_IOERR_SHMLOCK, 7, false}),
     [](const auto& fault) { return fault.param.name; });
 
 }  // namespace
