@@ -12,6 +12,7 @@
 #include <filesystem>
 #include <functional>
 #include <iostream>
+#include <ostream>
 #include <string>
 #include <utility>
 
@@ -161,6 +162,8 @@ struct DatabaseFault {
   std::size_t stride;
   bool tears;
 };
+
+void PrintTo(const DatabaseFault& fault, std::ostream* out) { *out << fault.name; }
 
 class DatabaseFaultInjection : public FaultInjection, public testing::WithParamInterface<DatabaseFault> {};
 

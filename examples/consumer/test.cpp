@@ -1,0 +1,41 @@
+// How an application tests what it does with Cellar: queues that the test runs, files that fail when it says so.
+#include <cellar/Cellar.h>
+#include <cellar/host/Await.h>
+#include <cellar/host/testing/FaultyFileUtils.h>
+#include <cellar/host/testing/ManualQueue.h>
+
+#include <cerrno>
+#include <iostream>
+#include <memory>
+#include <string>
+#include <utility>
+
+namespace cellar = velmora::mobile::xplat::cellar;
+
+namespace {
+
+bool aFullDiskIsToldToTheCaller(const std::string& directory) {
+  const auto files = std::make_shared<cellar::test::FaultyFileUtils>();
+  const auto queues = std::make_shared<cellar::test::ManualQueueFactory>();
+  const auto trash = std::make_shared<cellar::TrashCollector>(directory + "/trash", files, nullptr, queues);
+  const auto letters = cellar::PersistentKeyValueStore::createPersistentKeyValueStore(
+      directory + "/letters", directory + "/tmp", "letters", {}, 3600, false, queues, trash, nullptr, nullptr, files,
+      nullptr, 50);
+  files->failNext(cellar::test::Operation::WriteFile, ENOSPC);
+  cellar::Future<void> stored = letters->store("first", {'h', 'i'});
+  queues->runAll();
+  try {
+    cellar::host::await(std::move(stored));
+  } catch (const cellar::FileUtilsIoException& error) {
+    return error.code() == ENOSPC;
+  }
+  return false;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const bool isTold = argc == 2 && aFullDiskIsToldToTheCaller(argv[1]);
+  std::cout << (isTold ? "The full disk was told to the caller.\n" : "Nobody was told of the full disk.\n");
+  return isTold ? 0 : 1;
+}
