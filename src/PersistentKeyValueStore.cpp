@@ -171,42 +171,43 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
   dispatchWork({key}, write->promise, [write] {
     const auto self = write->store.lock();
     if (self == nullptr) return write->promise->setValue();
-    std::exception_ptr failure;
     try {
-      const std::lock_guard<std::mutex> lock(self->mutex_);
-      self->throwIfInvalid();
-      self->beginFileWrite(write);
+      {
+        const std::lock_guard<std::mutex> lock(self->mutex_);
+        self->throwIfInvalid();
+        self->beginFileWrite(*write);
+      }
+      if (write->inFlight == nullptr) return write->promise->setValue();  // the store was purged instead
+      // A queue that takes no task drops the write: its end takes the record away again.
+      self->fileQueue_->dispatch([write] {
+        if (const auto owner = write->store.lock()) {
+          owner->finishFileWrite(*write);
+        } else {
+          write->promise->setValue();
+        }
+      });
     } catch (...) {
-      failure = std::current_exception();
+      write->promise->setException(std::current_exception());
     }
-    if (failure != nullptr) return write->promise->setException(failure);
-    if (write->inFlight == nullptr) write->promise->setValue();  // the store was purged instead
   });
   return future;
 }
 
-// Puts a provisional record into the manifest and the write on the file queue; neither, if the store had to be purged.
-void PersistentKeyValueStore::beginFileWrite(const std::shared_ptr<FileWrite>& write) {
+// Puts a provisional record into the manifest; none, if the store had to be purged.
+void PersistentKeyValueStore::beginFileWrite(FileWrite& write) {
   try {
-    prepareWrite(write->key);
-    getManifest()->setItem(write->record(0));
+    prepareWrite(write.key);
+    getManifest()->setItem(write.record(0));
+    write.inFlight = writesInFlight_->begin(write.key);
   } catch (const ManifestPersistenceException& error) {
-    writesInFlight_->revoke(write->key);  // an earlier value must not take the place of this one
-    return purge(error);
+    writesInFlight_->revoke(write.key);  // an earlier value must not take the place of this one
+    purge(error);
   }
-  write->inFlight = writesInFlight_->begin(write->key);
-  // A queue that takes no task drops the write: its end takes the record away again.
-  fileQueue_->dispatch([write] {
-    if (const auto self = write->store.lock()) {
-      self->finishFileWrite(*write);
-    } else {
-      write->promise->setValue();
-    }
-  });
 }
 
 void PersistentKeyValueStore::finishFileWrite(const FileWrite& write) {
   settle(*write.promise, [&] {
+    throwIfClosed();
     if (startWriter(write) && recordWritten(write, runWriter(write))) return;
     deleteLeftoverFile(write.key);
   });
@@ -267,6 +268,7 @@ bool PersistentKeyValueStore::takeBack(const FileWrite& write) {
 }
 
 void PersistentKeyValueStore::deleteLeftoverFile(const std::string& key) {
+  if (isClosed_) return;
   try {
     const std::string filePath = getFilePath(key);
     if (fileUtils_->pathExists(filePath) && !fileUtils_->isDirectory(filePath)) fileUtils_->deleteFile(filePath);
@@ -343,12 +345,10 @@ void PersistentKeyValueStore::find(const std::vector<std::string>& keys, const L
     {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
-      for (auto key = keys.begin(); key != keys.end() && item == nullptr; ++key) item = lookUp(*key);
+      item = lookUp(keys);
     }
     if (!keys.empty()) reportAccess(item.get(), keys.front());
     if (item != nullptr) {
-      const std::lock_guard<std::mutex> lock(mutex_);
-      throwIfInvalid();  // nothing may get behind the barrier of an invalidation
       fileQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), item, loader, promise] {
         if (const auto self = weakThis.lock()) {
           self->load(item, loader, *promise);
@@ -364,21 +364,24 @@ void PersistentKeyValueStore::find(const std::vector<std::string>& keys, const L
   promise->setValue(nullptr);
 }
 
-// The item's record; null for a miss, and when looking for it purged the store.
-std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(const std::string& key) {
+// The record of the first key that has one; null for a miss, and when looking for it purged the store.
+std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(const std::vector<std::string>& keys) {
   try {
     beginAnew();
-    return getManifest()->getItem(key);
+    for (const std::string& key : keys) {
+      if (auto item = getManifest()->getItem(key)) return item;
+    }
   } catch (const ManifestCorruptedException& error) {
     purge(error);
-    return nullptr;
   }
+  return nullptr;
 }
 
 void PersistentKeyValueStore::load(const std::shared_ptr<const DiskCacheItem>& item, const Loader& loader,
                                    Promise<Fetched>& promise) {
   Fetched result;
   try {
+    throwIfClosed();
     auto fetched = std::make_unique<FetchResult>(FetchResult{item->key, {}, item->modificationDate});
     if (loader(item, getFilePath(item->filename), fetched->value)) {
       const std::lock_guard<std::mutex> lock(mutex_);
@@ -390,7 +393,7 @@ void PersistentKeyValueStore::load(const std::shared_ptr<const DiskCacheItem>& i
       result = std::move(fetched);
     }
   } catch (...) {
-    if (!hasLostItem(*item)) return promise.setException(std::current_exception());
+    if (isClosed_ || !hasLostItem(*item)) return promise.setException(std::current_exception());
   }
   promise.setValue(std::move(result));
 }
@@ -400,7 +403,7 @@ void PersistentKeyValueStore::load(const std::shared_ptr<const DiskCacheItem>& i
 bool PersistentKeyValueStore::hasLostItem(const DiskCacheItem& item) {
   try {
     const std::lock_guard<std::mutex> lock(mutex_);
-    if (lookUp(item.key) == nullptr) return true;
+    if (lookUp({item.key}) == nullptr) return true;
     return writesInFlight_->contains(item.key) && !fileUtils_->pathExists(getFilePath(item.filename));
   } catch (const std::exception&) {
     return false;
@@ -498,7 +501,7 @@ void PersistentKeyValueStore::remove(const std::string& key, const std::shared_p
     {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
-      auto item = lookUp(key);
+      auto item = lookUp({key});
       try {
         if (item != nullptr) getManifest()->removeItem(key);
       } catch (const ManifestCorruptedException& error) {
@@ -549,7 +552,7 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shar
   }
   if (storedSince->empty()) {
     auto items = getManifest()->pruneToSize(0, batchSize_);
-    if (!items.empty()) return items;
+    if (!items.empty() || getManifest()->count() == 0) return items;
   }
   return takeAllBut(*storedSince);
 }
@@ -673,11 +676,11 @@ void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<Di
 
 Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>& paths) {
   try {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    throwIfInvalid();  // nothing may get behind the barrier of an invalidation
+    throwIfInvalid();
     return dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), paths] {
       const auto self = weakThis.lock();
       if (self == nullptr) return;
+      self->throwIfClosed();
       for (const std::string& filePath : paths) {
         try {
           self->fileUtils_->deleteFile(filePath);
@@ -816,8 +819,11 @@ bool PersistentKeyValueStore::markInvalid(Future<void>& barrier) {
   invalidated_ = true;
   staleRemovalTimer_.reset();
   try {
-    barrier = dispatchTask<void>(fileQueue_, [] {});
+    barrier = dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>()] {
+      if (const auto self = weakThis.lock()) self->isClosed_ = true;
+    });
   } catch (...) {  // the file queue is shut down, so nothing is being written either
+    isClosed_ = true;
     Promise<void> done;
     barrier = done.getFuture();
     done.setValue();
@@ -832,6 +838,10 @@ void PersistentKeyValueStore::silenceManifest() {
 
 void PersistentKeyValueStore::throwIfInvalid() {
   if (invalidated_) throw InvalidatedException("Store has been invalidated.");
+}
+
+void PersistentKeyValueStore::throwIfClosed() {
+  if (isClosed_) throwIfInvalid();
 }
 
 void PersistentKeyValueStore::handleCorruptedManifest(const LarderException& error) {

@@ -219,11 +219,11 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   struct FileWrite;
 
   // These are called with the mutex held.
-  void beginFileWrite(const std::shared_ptr<FileWrite>& write);
+  void beginFileWrite(FileWrite& write);
   void writeInline(const std::string& key, const std::vector<unsigned char>& data,
                    std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
   void prepareWrite(const std::string& key);
-  std::unique_ptr<DiskCacheItem> lookUp(const std::string& key);
+  std::unique_ptr<DiskCacheItem> lookUp(const std::vector<std::string>& keys);
   std::vector<DiskCacheItem> takeForClear(const std::shared_ptr<KeySet>& storedSince, bool& begun);
   void callOffWrites();
   std::vector<DiskCacheItem> takeAllBut(const KeySet& keep);
@@ -250,6 +250,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   template <class T> void dispatchWork(const std::vector<std::string>& keys, const std::shared_ptr<Promise<T>>& promise,
                                        std::function<void()> task);
   void throwIfReserved(const std::string& key) const;
+  void throwIfClosed();
   bool markInvalid(Future<void>& barrier);
   void silenceManifest();
 
@@ -276,6 +277,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   bool isHalfPurged_ = false;                          // its directory has gone to the trash, and no new one is there
 
   std::atomic<bool> invalidated_{false};  // set under the mutex
+  // Set by the barrier of an invalidation, on the file queue: from then on the paths may be those of another store.
+  std::atomic<bool> isClosed_{false};
 
   std::mutex
       removalMutex_;  // taken before mutex_; held until a removal has deleted its file: invalidation waits for it

@@ -16,12 +16,12 @@ void Store::pruneBackToNormal(std::function<void()> /*onSuccess*/,
   throw std::logic_error("pruneBackToNormal not implemented or invalid call");
 }
 
-UnmanagedStore::UnmanagedStore(const std::string& path_, std::shared_ptr<const StoreDefinition> definition)
-    : Store(path_), definition_(std::move(definition)) {}
+UnmanagedStore::UnmanagedStore(const std::string& path_, std::shared_ptr<const StoreDefinition> definition_)
+    : Store(path_), definition(std::move(definition_)) {}
 
 UnmanagedStore::~UnmanagedStore() = default;
 
-std::uint32_t UnmanagedStore::getMaxSize() const { return definition_->maxSize; }
+std::uint32_t UnmanagedStore::getMaxSize() const { return definition->maxSize; }
 
 bool UnmanagedStore::isPrunable() { return false; }
 

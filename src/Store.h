@@ -53,8 +53,7 @@ class CELLAR_EXPORT UnmanagedStore : public Store {
 
   void invalidate() override;  // there is nothing to close: does nothing
 
- private:
-  const std::shared_ptr<const StoreDefinition> definition_;
+  const std::shared_ptr<const StoreDefinition> definition;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

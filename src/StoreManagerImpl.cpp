@@ -167,8 +167,10 @@ void StoreManagerImpl::onStoreSizeChanged(const std::string& identifier, unsigne
     item->currentSize = size;
   }
 
-  const std::lock_guard<std::mutex> lock(mutex_);
-  totalSize_ = size + (totalSize_ - oldSize);
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    totalSize_ = size + (totalSize_ - oldSize);
+  }
   if (maintenanceEnabled_) queue_->dispatch([self = shared_from_this()] { self->pruneStoresIfNecessary(); });
 }
 

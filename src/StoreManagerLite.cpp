@@ -19,7 +19,10 @@ StoreManagerLite::~StoreManagerLite() = default;
 std::shared_ptr<Store> StoreManagerLite::getStoreImpl(const std::string& identifier) {
   if (!isValid()) return nullptr;
   // Checked before the core makes a slot for the store: whoever asked for it again would wait there without end.
-  if (common_->getStoreDefinition(identifier)->isManaged) {
+  const auto definition = common_->getStoreDefinition(identifier);
+  const bool needsQueues = std::dynamic_pointer_cast<const PKVSDefinition>(definition) != nullptr ||
+                           std::dynamic_pointer_cast<const DiskCacheDefinition>(definition) != nullptr;
+  if (needsQueues) {
     throw std::logic_error("Store '" + identifier + "' needs a task queue factory, which a lite manager has not.");
   }
   bool created = false;

@@ -6,6 +6,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstddef>
+#include <deque>
 #include <filesystem>
 #include <functional>
 #include <future>
@@ -37,6 +38,37 @@ using test::Written;
 using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
+
+// File queues that keep their tasks until the test takes them, in any order.
+class AnyOrderQueues : public test::ManualQueueFactory {
+ public:
+  std::deque<std::function<void()>> tasks;
+
+  std::shared_ptr<AsyncExecutor> createQueue() override {
+    const auto queue = std::make_shared<Keeping>(tasks);
+    test::ManualQueueFactory::createQueue();  // the fixture asks for it
+    return queue;
+  }
+
+  void runLast() {
+    const auto task = std::move(tasks.back());
+    tasks.pop_back();
+    task();
+  }
+  void runAll() {
+    for (; !tasks.empty(); tasks.pop_front()) tasks.front()();
+  }
+
+ private:
+  class Keeping : public test::ManualExecutor {
+   public:
+    explicit Keeping(std::deque<std::function<void()>>& tasks) : tasks_(tasks) {}
+    void dispatch(std::function<void()> task) override { tasks_.push_back(std::move(task)); }
+
+   private:
+    std::deque<std::function<void()>>& tasks_;
+  };
+};
 
 class Invalidation : public KeyValueStoreFixture {
  protected:
@@ -77,6 +109,31 @@ TEST_F(Invalidation, BlocksUntilARemovalThatIsUnderWayHasDeletedItsFile) {
   };
   EXPECT_EQ(drop("key"), "<done>");
   EXPECT_FALSE(sawFile.get());
+}
+
+// An invalidation may come between a task's last look and its turn on the file queue; another store has the paths then.
+TEST_F(Invalidation, LeavesNothingToTasksThatComeAfterItsBarrier) {
+  openWatched();
+  put("key", "value");
+  const auto late = std::make_shared<AnyOrderQueues>();
+  queues = late;
+  openUnloaded();
+  settle();
+  const Fetched fetched = watch(store->fetch("key"));
+  const Written written = watch(store->store("key", bytesOf("newer")));
+  const Written fresh = watch(store->store("fresh", bytesOf("value")));
+  settle();
+  ASSERT_EQ(late->tasks.size(), 3U);
+  const Written barrier = watch(store->invalidateWithFuture());
+  late->runLast();
+  EXPECT_EQ(told(barrier), "<done>");
+  late->runAll();
+  EXPECT_EQ(told(fetched), "<error> " + kInvalid);
+  EXPECT_EQ(told(written), "<error> " + kInvalid);
+  EXPECT_EQ(told(fresh), "<error> " + kInvalid);
+  store.reset();
+  EXPECT_EQ(valueFile("key"), "value");
+  EXPECT_THAT(valueFiles(), ElementsAre("key"));
 }
 
 TEST_F(Invalidation, BetweenABatchAndItsFilesLeavesThemToWhoInvalidates) {

@@ -655,6 +655,17 @@ TEST_F(FetchingTheFirst, EndsTheSearchAsAMissWhenTheManifestIsDamaged) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
+TEST_F(FetchingTheFirst, PurgesOnceHoweverManyKeysThereAre) {
+  openWatched();
+  for (int i = 0; i < 3; ++i) manifest->failNext(ManifestCall::GetItem, corrupted);
+  const LogCapture log;
+  const Fetched fetched = watch(store->fetchFirst({"a", "b", "c"}, answering("x")));
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_THAT(errorLines(log), ElementsAre(purgeLine(corrupted)));
+  EXPECT_EQ(trash->collected().size(), 1U);
+}
+
 TEST_F(FetchingTheFirst, DoesNotGoOnToTheNextKeyWhenTheLoaderRefuses) {
   open();
   put("a", "1");
@@ -946,6 +957,25 @@ TEST_F(StoringInline, TakesAnyKey) {
 }
 
 // --- After invalidation ---
+
+// Not what a queue is meant to do, but no lock is held around what it is given.
+TEST_F(CreatingAStore, OnQueuesThatRunEverythingAtOnceWorks) {
+  for (const bool inlineData : {false, true}) {
+    options.inlineData = inlineData;
+    openUnloaded();
+    work().onDispatch = [&queue = work()] { queue.runAll(); };
+    file().onDispatch = [&queue = file()] { queue.runAll(); };
+    work().runAll();
+    EXPECT_EQ(told(watch(store->store("key", bytesOf("value")))), "<done>");
+    EXPECT_EQ(told(watch(store->fetch("key"))), "value");
+    EXPECT_EQ(told(watch(store->removeItem("key"))), "<done>");
+    EXPECT_EQ(told(watch(store->fetch("key"))), "<miss>");
+    EXPECT_EQ(told(watch(store->store("other", bytesOf("value")))), "<done>");
+    EXPECT_EQ(clear(), "<done>");
+    store->invalidate();
+    close();
+  }
+}
 
 TEST_F(CreatingAStore, AfterInvalidationEveryOperationIsRefused) {
   open();

@@ -117,6 +117,17 @@ TEST_F(StoreManagerImplTest, ConstructionThrowsWhatCreatingTheDirectoriesThrows)
   EXPECT_THROW(build(manager({})), FileUtilsIoException);
 }
 
+TEST_F(StoreManagerImplTest, AQueueThatRunsEverythingAtOnceFindsNoLockHeld) {
+  StoreManagerDefinition definition = manager({{"a", fake("a", {5})}, {"u", unmanaged("u")}});
+  definition.maxSize = 5;
+  build(definition, true);
+  queue()->onDispatch = [this] { queue()->runAll(); };
+  EXPECT_NE(getAny("u"), nullptr);
+  const auto store = get("a");
+  manager_->onStoreSizeChanged("a", 10);
+  EXPECT_EQ(store->pruneCount(), 1U);
+}
+
 TEST_F(StoreManagerImplTest, ForwardsToTheCommonCore) {
   const auto definition = unmanaged("u");
   build(manager({{"u", definition}}));

@@ -86,6 +86,12 @@ TEST_F(StoreManagerLiteTest, StoresGetNoServicesAndTheNullStrategy) {
   lite_->invalidate();
 }
 
+TEST_F(StoreManagerLiteTest, AHostsOwnKindOfManagedStoreIsCreated) {
+  build({{"a", fake("a", {0, true})}});
+  EXPECT_NE(lite_->getStoreImpl("a"), nullptr);
+  lite_->invalidate();
+}
+
 TEST_F(StoreManagerLiteTest, AnUnknownIdentifierThrowsEachTimeAndHangsNobody) {
   build({});
   EXPECT_EQ(thrownText([&] { lite_->getStoreImpl("x"); }), kUnknown);
