@@ -106,9 +106,9 @@ class Worker {
   }
 
   void operate(std::size_t thread, std::mt19937_64& random, std::uint64_t dice, const std::shared_ptr<Window>& window) {
-    const auto number = random() % kStores.size();
+    const auto number = static_cast<std::size_t>(random() % kStores.size());
     const StoreInfo& info = kStores.at(number);
-    const auto slot = random() % (info.keys / kThreads);
+    const auto slot = static_cast<std::size_t>(random() % (info.keys / kThreads));
     Record record{};
     record.kind = Record::Kind::Begun;
     record.store = static_cast<std::uint8_t>(number);

@@ -15,7 +15,9 @@ using Engine = std::mt19937_64;
 std::vector<std::size_t> shuffled(std::size_t count, Engine& engine) {
   std::vector<std::size_t> order(count);
   std::iota(order.begin(), order.end(), std::size_t{0});
-  for (std::size_t left = count; left > 1; --left) std::swap(order[left - 1], order[engine() % left]);
+  for (std::size_t left = count; left > 1; --left) {
+    std::swap(order[left - 1], order[static_cast<std::size_t>(engine() % left)]);
+  }
   return order;
 }
 
