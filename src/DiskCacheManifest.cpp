@@ -2,12 +2,12 @@
 
 #include <glog/logging.h>
 
-#include <algorithm>
 #include <ctime>
 #include <exception>
 #include <utility>
 
 #include "LarderException.h"
+#include "ManifestRecords.h"
 #include "SQLiteManifestPersistence.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -18,40 +18,6 @@ constexpr std::int64_t kFlushIntervalNanoseconds = 120'000'000'000;
 constexpr std::size_t kMaxPendingAccessDates = 512;
 
 std::int32_t now() { return static_cast<std::int32_t>(std::time(nullptr)); }
-
-// Yields items in the order of a comparator, one by one. A heap: taking the first few of many does not sort the rest,
-// and with a comparator that is no consistent order, which a host's may be, it still yields every item once. (The
-// standard algorithms are undefined then.)
-class ItemQueue {
- public:
-  ItemQueue(std::vector<const DiskCacheItem*> items, const Comparator& before)
-      : heap_(std::move(items)), before_(before) {
-    for (std::size_t i = heap_.size() / 2; i-- > 0;) siftDown(i);
-  }
-
-  bool empty() const { return heap_.empty(); }
-
-  const DiskCacheItem* first() const { return heap_.front(); }
-
-  void pop() {
-    std::swap(heap_.front(), heap_.back());
-    heap_.pop_back();
-    siftDown(0);
-  }
-
- private:
-  void siftDown(std::size_t parent) {
-    for (std::size_t child = 2 * parent + 1; child < heap_.size(); child = 2 * parent + 1) {
-      if (child + 1 < heap_.size() && before_(heap_[child + 1], heap_[child])) ++child;
-      if (!before_(heap_[child], heap_[parent])) return;
-      std::swap(heap_[child], heap_[parent]);
-      parent = child;
-    }
-  }
-
-  std::vector<const DiskCacheItem*> heap_;
-  const Comparator& before_;
-};
 
 }  // namespace
 
@@ -68,7 +34,9 @@ std::shared_ptr<DiskCacheManifest> DiskCacheManifest::createDiskCacheManifest(
 DiskCacheManifest::DiskCacheManifest(std::unique_ptr<ManifestPersistence> persistence,
                                      std::shared_ptr<AsyncExecutor> executor,
                                      std::shared_ptr<PruneStrategyBase> strategy)
-    : persistence_(std::move(persistence)), executor_(std::move(executor)), strategyOrder_(std::move(strategy)) {}
+    : persistence_(std::move(persistence)),
+      executor_(std::move(executor)),
+      records_(std::make_unique<ManifestRecords>(std::move(strategy))) {}
 
 DiskCacheManifest::~DiskCacheManifest() {
   try {
@@ -81,9 +49,8 @@ DiskCacheManifest::~DiskCacheManifest() {
 void DiskCacheManifest::clear() {
   const std::lock_guard<std::mutex> loadLock(loadMutex_);
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  items_.clear();
+  records_->clear();
   pendingAccessDates_.clear();
-  totalSize_ = 0;
   persistence_->clearItems();
   loaded_ = true;
 }
@@ -94,9 +61,10 @@ void DiskCacheManifest::load() {
     auto records = persistence_->getAllItems();
     const std::lock_guard<std::mutex> lock(itemsMutex_);
     if (!loaded_) {
-      items_.reserve(records.size());
+      records_->reserve(records.size());
       for (auto& record : records) {
-        if (items_.count(record->key) == 0) storeInMemory(std::move(record));
+        if (records_->find(record->key) == nullptr) records_->store(*record);
+        record.reset();  // so that the two forms of all records are never in memory together
       }
       loaded_ = true;
     }
@@ -115,27 +83,26 @@ void DiskCacheManifest::invalidate() {
 }
 
 void DiskCacheManifest::setItem(const DiskCacheItem& item) {
-  auto record = std::make_unique<DiskCacheItem>(item);
   const std::lock_guard<std::mutex> lock(itemsMutex_);
   persistence_->setItem(item);
   pendingAccessDates_.erase(item.key);
-  storeInMemory(std::move(record));
+  records_->store(item);
 }
 
 std::unique_ptr<DiskCacheItem> DiskCacheManifest::getItem(const std::string& key) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  const DiskCacheItem* item = findOrRead(key);
-  return item == nullptr ? nullptr : std::make_unique<DiskCacheItem>(*item);
+  const ManifestRecord* const record = findOrRead(key);
+  return record == nullptr ? nullptr : std::make_unique<DiskCacheItem>(record->item());
 }
 
 void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
   auto due = std::make_shared<AccessDates>();
   {
     const std::lock_guard<std::mutex> lock(itemsMutex_);
-    DiskCacheItem* item = findOrRead(key);
-    if (item == nullptr) return;
-    item->lastAccessDate = now();
-    pendingAccessDates_[key] = item->lastAccessDate;
+    if (findOrRead(key) == nullptr) return;
+    const std::int32_t date = now();
+    records_->setLastAccessDate(key, date);
+    pendingAccessDates_[key] = date;
     if (!loaded_ || pendingAccessDates_.size() <= kMaxPendingAccessDates) return;
     due->swap(pendingAccessDates_);
   }
@@ -152,16 +119,16 @@ void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
 
 std::optional<std::int32_t> DiskCacheManifest::getModificationDate(const std::string& key) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  const DiskCacheItem* item = findOrRead(key);
-  return item == nullptr ? std::nullopt : std::make_optional(item->modificationDate);
+  const ManifestRecord* const record = findOrRead(key);
+  return record == nullptr ? std::nullopt : std::make_optional(record->modificationDate);
 }
 
 void DiskCacheManifest::removeItem(const std::string& key) {
   const std::lock_guard<std::mutex> loadLock(loadMutex_);
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  const auto found = items_.find(key);
-  if (found != items_.end()) {
-    remove(found);
+  const ManifestRecord* const record = records_->find(key);
+  if (record != nullptr) {
+    remove(*record);
   } else if (!loaded_) {
     persistence_->removeItem(key);
   }
@@ -169,40 +136,40 @@ void DiskCacheManifest::removeItem(const std::string& key) {
 
 std::vector<unsigned char> DiskCacheManifest::getInlineData(const std::string& key) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  const auto found = items_.find(key);
-  const bool hasInlineData = found == items_.end() ? !loaded_ : found->second->hasInlineData;
+  const ManifestRecord* const record = records_->find(key);
+  const bool hasInlineData = record == nullptr ? !loaded_ : record->hasInlineData;
   return hasInlineData ? persistence_->getInlineData(key) : std::vector<unsigned char>();
 }
 
 void DiskCacheManifest::setInlineData(const std::string& key, const std::vector<unsigned char>& data) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
   persistence_->setInlineData(key, data);
-  if (DiskCacheItem* item = findOrRead(key)) item->hasInlineData = true;
+  if (findOrRead(key) != nullptr) records_->setHasInlineData(key, true);
 }
 
 void DiskCacheManifest::removeInlineData(const std::string& key) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
   persistence_->removeInlineData(key);
-  if (DiskCacheItem* item = findOrRead(key)) item->hasInlineData = false;
+  if (findOrRead(key) != nullptr) records_->setHasInlineData(key, false);
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneToSize(std::uint32_t size, std::uint32_t count) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  if (totalSize_ <= size) return {};
-  return prune(strategyOrder_, count, [&](const DiskCacheItem&) { return totalSize_ > size; });
+  if (!loaded_ || records_->totalSize() <= size) return {};
+  return prune(records_->byStrategy(), count, [&](const ManifestRecord&) { return records_->totalSize() > size; });
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneOldEntries(long date, std::uint32_t count) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  return prune(accessDateOrder_, count, [&](const DiskCacheItem& item) { return item.lastAccessDate < date; });
+  if (!loaded_) return {};
+  return prune(records_->leastRecentlyUsed(), count,
+               [&](const ManifestRecord& record) { return record.lastAccessDate < date; });
 }
 
 std::unique_ptr<DiskCacheItem> DiskCacheManifest::pruneOldestItem() {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  if (!loaded_ || items_.empty()) return nullptr;
-  return remove(std::min_element(items_.begin(), items_.end(), [](const auto& a, const auto& b) {
-    return a.second->lastAccessDate < b.second->lastAccessDate;
-  }));
+  const ManifestRecord* const oldest = loaded_ ? records_->leastRecentlyUsed()() : nullptr;
+  return oldest == nullptr ? nullptr : std::make_unique<DiskCacheItem>(remove(*oldest));
 }
 
 std::vector<std::string> DiskCacheManifest::getAllKeys() {
@@ -210,20 +177,17 @@ std::vector<std::string> DiskCacheManifest::getAllKeys() {
   if (!loaded_) {
     throw DiskCacheManifestException("Manifest hasn't been loaded from disk yet", "QZDiskCacheManifestErrorDomain", 0);
   }
-  std::vector<std::string> keys;
-  keys.reserve(items_.size());
-  for (const auto& item : items_) keys.push_back(item.first);
-  return keys;
+  return records_->keys();
 }
 
 std::uint32_t DiskCacheManifest::size() {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  return totalSize_;
+  return records_->totalSize();
 }
 
 std::uint32_t DiskCacheManifest::count() {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  return static_cast<std::uint32_t>(items_.size());
+  return static_cast<std::uint32_t>(records_->count());
 }
 
 bool DiskCacheManifest::isLoaded() {
@@ -232,45 +196,31 @@ bool DiskCacheManifest::isLoaded() {
 }
 
 // The record in memory, read into it first when the manifest is not loaded yet.
-DiskCacheItem* DiskCacheManifest::findOrRead(const std::string& key) {
-  const auto found = items_.find(key);
-  if (found != items_.end()) return found->second.get();
-  if (loaded_) return nullptr;
-  auto item = persistence_->getItem(key);
-  return item == nullptr ? nullptr : storeInMemory(std::move(item));
-}
-
-DiskCacheItem* DiskCacheManifest::storeInMemory(std::unique_ptr<DiskCacheItem> item) {
-  auto& slot = items_[item->key];
-  if (slot != nullptr) totalSize_ -= slot->size;
-  totalSize_ += item->size;
-  slot = std::move(item);
-  return slot.get();
+const ManifestRecord* DiskCacheManifest::findOrRead(const std::string& key) {
+  const ManifestRecord* const record = records_->find(key);
+  if (record != nullptr || loaded_) return record;
+  const auto item = persistence_->getItem(key);
+  return item == nullptr ? nullptr : records_->store(*item);
 }
 
 // The persistence first: when it fails, nothing has changed.
-std::unique_ptr<DiskCacheItem> DiskCacheManifest::remove(Items::iterator position) {
-  persistence_->removeItem(position->first);
-  auto item = std::move(position->second);
-  items_.erase(position);
-  pendingAccessDates_.erase(item->key);
-  totalSize_ -= item->size;
-  return item;
+DiskCacheItem DiskCacheManifest::remove(const ManifestRecord& record) {
+  const std::string key(record.key());
+  persistence_->removeItem(key);
+  pendingAccessDates_.erase(key);
+  return records_->remove(record);
 }
 
-// Removes items in the given order, at most `count`, up to the first that may not go.
+// Removes records as `next` yields them, at most `count`, up to the first that may not go.
 template <class MayGo>
-std::vector<DiskCacheItem> DiskCacheManifest::prune(const Comparator& order, std::uint32_t count, MayGo mayGo) {
+std::vector<DiskCacheItem> DiskCacheManifest::prune(const std::function<const ManifestRecord*()>& next,
+                                                    std::uint32_t count, MayGo mayGo) {
   std::vector<DiskCacheItem> removed;
-  if (!loaded_ || count == 0) return removed;
-  std::vector<const DiskCacheItem*> items;
-  items.reserve(items_.size());
-  for (const auto& item : items_) items.push_back(item.second.get());
-
-  for (ItemQueue queue(std::move(items), order); !queue.empty(); queue.pop()) {
-    if (removed.size() == count || !mayGo(*queue.first())) break;
+  while (removed.size() < count) {
+    const ManifestRecord* const record = next();
+    if (record == nullptr || !mayGo(*record)) break;
     try {
-      removed.push_back(std::move(*remove(items_.find(queue.first()->key))));
+      removed.push_back(remove(*record));
     } catch (const LarderException&) {
       if (removed.empty()) throw;
       break;  // the files of those that went must go too; the next call meets the failure at its first item
@@ -322,8 +272,8 @@ void DiskCacheManifest::commitAccessTimeUpdates(const AccessDates& dates) {
 
 bool DiskCacheManifest::isAccessDate(const std::string& key, std::int32_t date) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
-  const auto found = items_.find(key);
-  return found != items_.end() && found->second->lastAccessDate == date;
+  const ManifestRecord* const record = records_->find(key);
+  return record != nullptr && record->lastAccessDate == date;
 }
 
 }  // namespace velmora::mobile::xplat::cellar

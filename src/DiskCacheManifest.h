@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -17,6 +18,8 @@
 namespace velmora::mobile::xplat::cellar {
 
 class ExtendedMetadataFactory;
+class ManifestRecord;
+class ManifestRecords;
 
 // What a store knows of its items. A key without a record is never an error. Always held by shared pointers; any thread
 // may call.
@@ -127,14 +130,13 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   bool isLoaded() override;
 
  private:
-  using Items = std::unordered_map<std::string, std::unique_ptr<DiskCacheItem>>;
   using AccessDates = std::unordered_map<std::string, std::int32_t>;
 
   // These are called with the items mutex held.
-  DiskCacheItem* findOrRead(const std::string& key);
-  DiskCacheItem* storeInMemory(std::unique_ptr<DiskCacheItem> item);
-  std::unique_ptr<DiskCacheItem> remove(Items::iterator position);
-  template <class MayGo> std::vector<DiskCacheItem> prune(const Comparator& order, std::uint32_t count, MayGo mayGo);
+  const ManifestRecord* findOrRead(const std::string& key);
+  DiskCacheItem remove(const ManifestRecord& record);
+  template <class MayGo> std::vector<DiskCacheItem> prune(const std::function<const ManifestRecord*()>& next,
+                                                          std::uint32_t count, MayGo mayGo);
 
   void armFlushTimer();
   void flush();
@@ -143,13 +145,10 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
 
   const std::unique_ptr<ManifestPersistence> persistence_;
   const std::shared_ptr<AsyncExecutor> executor_;
-  const Comparator strategyOrder_;
-  const Comparator accessDateOrder_;
 
   std::mutex loadMutex_;   // keeps load, clear and removal apart; taken before itemsMutex_
   std::mutex itemsMutex_;  // guards the below
-  Items items_;
-  std::uint32_t totalSize_ = 0;
+  const std::unique_ptr<ManifestRecords> records_;
   bool loaded_ = false;
   bool invalidated_ = false;
   AccessDates pendingAccessDates_;

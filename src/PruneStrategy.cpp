@@ -5,6 +5,7 @@
 
 #include "Configuration.h"
 #include "DiskCacheItem.h"
+#include "VideoPruneDate.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -14,13 +15,6 @@ bool lessRecentlyUsed(const DiskCacheItem& a, const DiskCacheItem& b) { return a
 
 const VideoDownloadExtendedMetadata* videoMetadata(const DiskCacheItem& item) {
   return dynamic_cast<const VideoDownloadExtendedMetadata*>(item.extendedMetadata.get());
-}
-
-// Unsigned, because the host may choose a weight that leaves the range of a date: that wraps, and signed it would be
-// undefined.
-std::int32_t weightedDate(std::int32_t date, int priority) {
-  const auto weight = static_cast<std::uint32_t>(VideoDownloadPruneStrategy::priorityWeight);
-  return static_cast<std::int32_t>(static_cast<std::uint32_t>(date) + weight * static_cast<std::uint32_t>(priority));
 }
 
 }  // namespace
@@ -36,9 +30,17 @@ bool VideoDownloadPruneStrategy::compare(const DiskCacheItem* a, const DiskCache
   const auto* ofA = videoMetadata(*a);
   const auto* ofB = videoMetadata(*b);
   if (ofA == nullptr || ofB == nullptr) return lessRecentlyUsed(*a, *b);
-  const int priorityOfA = VideoDownloadExtendedMetadataToPriority(ofA->getExtendedMetadata(), ofA->getItemType());
-  const int priorityOfB = VideoDownloadExtendedMetadataToPriority(ofB->getExtendedMetadata(), ofB->getItemType());
-  return weightedDate(a->lastAccessDate, priorityOfA) < weightedDate(b->lastAccessDate, priorityOfB);
+  return videoPruneDate(a->lastAccessDate, *ofA) < videoPruneDate(b->lastAccessDate, *ofB);
+}
+
+// Unsigned, because the host may choose a weight that leaves the range of a date: that wraps, and signed it would be
+// undefined.
+std::int32_t videoPruneDate(std::int32_t lastAccessDate, const VideoDownloadExtendedMetadata& metadata) {
+  const int priority = VideoDownloadPruneStrategy().VideoDownloadExtendedMetadataToPriority(
+      metadata.getExtendedMetadata(), metadata.getItemType());
+  const auto weight = static_cast<std::uint32_t>(VideoDownloadPruneStrategy::priorityWeight);
+  return static_cast<std::int32_t>(static_cast<std::uint32_t>(lastAccessDate) +
+                                   weight * static_cast<std::uint32_t>(priority));
 }
 
 int VideoDownloadPruneStrategy::VideoDownloadExtendedMetadataToPriority(

@@ -1,0 +1,148 @@
+#include "ManifestRecords.h"
+
+#include <utility>
+
+#include "PruneStrategy.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+// Yields records in the order of a comparator, one by one. A heap: taking the first few of many does not sort the rest,
+// and with a comparator that is no consistent order, which a host's may be, it still yields every record once. (The
+// standard algorithms are undefined then.)
+class ComparedRecords {
+ public:
+  ComparedRecords(const ManifestRecordMap& records, std::shared_ptr<PruneStrategyBase> strategy)
+      : before_(std::move(strategy)) {
+    heap_.reserve(records.size());
+    for (const auto& [key, record] : records) heap_.push_back(record.get());
+    for (std::size_t i = heap_.size() / 2; i-- > 0;) siftDown(i);
+  }
+
+  const ManifestRecord* pop() {
+    if (heap_.empty()) return nullptr;
+    std::swap(heap_.front(), heap_.back());
+    const ManifestRecord* const first = heap_.back();
+    heap_.pop_back();
+    siftDown(0);
+    return first;
+  }
+
+ private:
+  bool isBefore(const ManifestRecord* a, const ManifestRecord* b) {
+    a->copyTo(first_);
+    b->copyTo(second_);
+    return before_(&first_, &second_);
+  }
+
+  void siftDown(std::size_t parent) {
+    for (std::size_t child = 2 * parent + 1; child < heap_.size(); child = 2 * parent + 1) {
+      if (child + 1 < heap_.size() && isBefore(heap_[child + 1], heap_[child])) ++child;
+      if (!isBefore(heap_[child], heap_[parent])) return;
+      std::swap(heap_[child], heap_[parent]);
+      parent = child;
+    }
+  }
+
+  const Comparator before_;
+  std::vector<const ManifestRecord*> heap_;
+  DiskCacheItem first_;  // what the comparator is shown; their strings keep their memory from one to the next
+  DiskCacheItem second_;
+};
+
+std::int32_t accessDateOf(const ManifestRecord& record) { return record.lastAccessDate; }
+
+template <class Strategy> bool isA(const std::shared_ptr<PruneStrategyBase>& strategy) {
+  return dynamic_cast<const Strategy*>(strategy.get()) != nullptr;
+}
+
+}  // namespace
+
+ManifestRecords::ManifestRecords(std::shared_ptr<PruneStrategyBase> strategy)
+    : strategy_(std::move(strategy)),
+      isVideoStrategy_(isA<VideoDownloadPruneStrategy>(strategy_)),
+      isOwnStrategy_(strategy_ != nullptr && !isVideoStrategy_ && !isA<LRUPruneStrategy>(strategy_)),
+      byAccessDate_(accessDateOf, &ManifestRecord::placeByAccessDate) {}
+
+std::vector<std::string> ManifestRecords::keys() const {
+  std::vector<std::string> keys;
+  keys.reserve(records_.size());
+  for (const auto& [key, record] : records_) keys.emplace_back(key);
+  return keys;
+}
+
+const ManifestRecord* ManifestRecords::find(const std::string& key) const {
+  const auto found = records_.find(key);
+  return found == records_.end() ? nullptr : found->second.get();
+}
+
+const ManifestRecord* ManifestRecords::store(const DiskCacheItem& item) {
+  auto record = ManifestRecord::create(item);
+  ManifestRecord& stored = *record;
+  const auto old = records_.find(item.key);
+  if (old == records_.end()) {
+    records_.emplace(stored.key(), std::move(record));
+  } else {
+    leaveOrders(*old->second);
+    auto place = records_.extract(old);
+    place.key() = stored.key();  // the old one dies with its record
+    place.mapped() = std::move(record);
+    records_.insert(std::move(place));
+  }
+  totalSize_ += stored.size;
+  byAccessDate_.added(stored);
+  if (isVideoStrategy_) byVideoPriority_.added(stored);
+  return &stored;
+}
+
+void ManifestRecords::setLastAccessDate(const std::string& key, std::int32_t date) {
+  ManifestRecord& record = *records_.at(key);
+  record.lastAccessDate = date;
+  byAccessDate_.changed(record);
+  if (isVideoStrategy_) byVideoPriority_.changed(record);
+}
+
+void ManifestRecords::setHasInlineData(const std::string& key, bool hasInlineData) {
+  records_.at(key)->hasInlineData = hasInlineData;
+}
+
+DiskCacheItem ManifestRecords::remove(const ManifestRecord& record) {
+  DiskCacheItem item = record.item();
+  leaveOrders(record);
+  records_.erase(records_.find(record.key()));
+  return item;
+}
+
+void ManifestRecords::leaveOrders(const ManifestRecord& record) {
+  totalSize_ -= record.size;
+  byAccessDate_.removed(record);
+  if (isVideoStrategy_) byVideoPriority_.removed(record);
+}
+
+void ManifestRecords::clear() {
+  byAccessDate_.clear();
+  byVideoPriority_.clear();
+  records_.clear();
+  totalSize_ = 0;
+}
+
+ManifestRecords::Next ManifestRecords::leastRecentlyUsed() {
+  return [this] { return byAccessDate_.first(records_); };
+}
+
+ManifestRecords::Next ManifestRecords::byStrategy() {
+  using Basis = VideoEvictionOrder::Basis;
+  const Basis basis = isVideoStrategy_ ? byVideoPriority_.basis(records_.size())
+                      : isOwnStrategy_ ? Basis::Comparison
+                                       : Basis::AccessDate;
+  if (basis == Basis::AccessDate) return leastRecentlyUsed();
+  if (basis == Basis::Comparison) return byComparison();
+  return [this] { return byVideoPriority_.first(records_); };
+}
+
+ManifestRecords::Next ManifestRecords::byComparison() const {
+  return [records = std::make_shared<ComparedRecords>(records_, strategy_)] { return records->pop(); };
+}
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,61 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "EvictionOrder.h"
+#include "VideoEvictionOrder.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class PruneStrategyBase;
+
+// The records of a manifest in memory, with the total of their sizes and the orders in which they are evicted. Guarded
+// by its manifest. Pointers to a record are good until it is replaced or removed; what changes one goes through here.
+class ManifestRecords {
+ public:
+  // Yields the record that is to go next; null when there are no more. Each is removed before the next is asked for.
+  using Next = std::function<const ManifestRecord*()>;
+
+  // Null: least recently used first.
+  explicit ManifestRecords(std::shared_ptr<PruneStrategyBase> strategy);
+
+  std::size_t count() const { return records_.size(); }
+  std::uint32_t totalSize() const { return totalSize_; }
+  std::vector<std::string> keys() const;
+
+  // Null when there is none.
+  const ManifestRecord* find(const std::string& key) const;
+
+  // Replaces the record of the key.
+  const ManifestRecord* store(const DiskCacheItem& item);
+
+  void setLastAccessDate(const std::string& key, std::int32_t date);
+  void setHasInlineData(const std::string& key, bool hasInlineData);
+
+  DiskCacheItem remove(const ManifestRecord& record);
+  void clear();
+  void reserve(std::size_t count) { records_.reserve(count); }
+
+  // Items of the same access date come in no order.
+  Next leastRecentlyUsed();
+  Next byStrategy();
+
+ private:
+  void leaveOrders(const ManifestRecord& record);
+  Next byComparison() const;
+
+  const std::shared_ptr<PruneStrategyBase> strategy_;
+  const bool isVideoStrategy_;
+  const bool isOwnStrategy_;  // of the host's own kind, which can only be asked
+  ManifestRecordMap records_;
+  EvictionOrder byAccessDate_;
+  VideoEvictionOrder byVideoPriority_;  // kept with the video strategy only
+  std::uint32_t totalSize_ = 0;
+};
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,37 @@
+#pragma once
+
+#include <cstddef>
+
+#include "EvictionOrder.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+// The order of eviction that the video strategy gives, kept like the one by access date. It is kept as dates, which
+// takes metadata with every record, or with none: the strategy compares an item that has some with one that has none by
+// their access dates, and what comes out of that is no order to keep.
+class VideoEvictionOrder {
+ public:
+  enum class Basis { AccessDate, Priority, Comparison };
+
+  // What to go by for the present records and tunables.
+  Basis basis(std::size_t recordCount) const;
+
+  // The first to go by priority.
+  const ManifestRecord* first(const ManifestRecordMap& records);
+
+  // As with EvictionOrder.
+  void added(ManifestRecord& record);
+  void changed(const ManifestRecord& record);
+  void removed(const ManifestRecord& record);
+  void clear();
+
+ private:
+  EvictionOrder order_ = {dateOf, &ManifestRecord::placeByPriority};
+  std::size_t recordsWithMetadata_ = 0;
+  int priorityWeight_ = 0;  // the host's tunables as they were when the order was built
+  int highPriorityVideoSecondCutoff_ = 0;
+
+  static std::int32_t dateOf(const ManifestRecord& record);
+};
+
+}  // namespace velmora::mobile::xplat::cellar
