@@ -53,28 +53,33 @@ class File {
   std::FILE* stream_;
 };
 
+// What size a directory claims to have differs from one file system to the next, and so does what fails with one.
+void throwIfDirectory(File& file) {
+  struct stat status {};
+  const bool isDirectory = ::fstat(::fileno(file.get()), &status) == 0 && S_ISDIR(status.st_mode);
+  if (isDirectory) throwSystemError("File read failed", EISDIR);
+}
+
+[[noreturn]] void throwReadError(File& file, const string& operation, int error) {
+  throwIfDirectory(file);
+  throwSystemError(operation, error);
+}
+
 std::size_t sizeOf(File& file) {
-  if (std::fseek(file.get(), 0, SEEK_END) != 0) throwSystemError("Could not seek to end of file", errno);
+  if (std::fseek(file.get(), 0, SEEK_END) != 0) throwReadError(file, "Could not seek to end of file", errno);
   const long size = std::ftell(file.get());
-  if (size == -1) throwSystemError("Could not determine size of file", errno);
-  if (std::fseek(file.get(), 0, SEEK_SET) != 0) throwSystemError("Could not seek to start of file", errno);
+  if (size == -1) throwReadError(file, "Could not determine size of file", errno);
+  if (std::fseek(file.get(), 0, SEEK_SET) != 0) throwReadError(file, "Could not seek to start of file", errno);
   return static_cast<std::size_t>(size);
 }
 
-std::vector<unsigned char> allocate(std::size_t size) {
+std::vector<unsigned char> allocateFor(File& file, std::size_t size) {
   try {
     return std::vector<unsigned char>(size);
   } catch (const std::bad_alloc&) {
   } catch (const std::length_error&) {
   }
-  throwSystemError("File read failed", ENOMEM);
-}
-
-// What size a directory claims to have differs from one file system to the next.
-void throwIfDirectory(File& file) {
-  struct stat status {};
-  const bool isDirectory = ::fstat(::fileno(file.get()), &status) == 0 && S_ISDIR(status.st_mode);
-  if (isDirectory) throwSystemError("File read failed", EISDIR);
+  throwReadError(file, "File read failed", ENOMEM);
 }
 
 // A directory stream that is closed on every way out.
@@ -147,11 +152,12 @@ string FileUtils::parentPath(const string& path) {
 
 std::vector<unsigned char> FileUtils::readFile(const string& path) {
   File file(path, "rb");
-  throwIfDirectory(file);
-  std::vector<unsigned char> data = allocate(sizeOf(file));
+  (void)std::setvbuf(file.get(), nullptr, _IONBF, 0);  // straight into the result
+  std::vector<unsigned char> data = allocateFor(file, sizeOf(file));
+  if (data.empty()) throwIfDirectory(file);
   errno = 0;
-  if (!data.empty() && std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
-    throwSystemError("File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
+  if (std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
+    throwReadError(file, "File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
   }
   file.close();
   return data;

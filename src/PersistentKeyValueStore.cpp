@@ -3,8 +3,10 @@
 #include <glog/logging.h>
 
 #include <algorithm>
+#include <array>
 #include <ctime>
 #include <stdexcept>
+#include <string_view>
 #include <utility>
 
 #include "AnalyticsEventReporter.h"
@@ -22,7 +24,6 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 const std::string kManifestName = "manifest_v1.sqlite";
-const std::string kManifestCompanions[] = {"-journal", "-wal", "-shm"};
 
 constexpr long kFirstStaleRemovalDelay = 300;  // seconds
 constexpr long kStaleRemovalInterval = 3600;   // seconds
@@ -30,6 +31,13 @@ constexpr std::uint64_t kNanosecondsPerSecond = 1'000'000'000;
 
 std::int64_t currentTime() { return static_cast<std::int64_t>(std::time(nullptr)); }
 std::int32_t currentDate() { return static_cast<std::int32_t>(currentTime()); }
+
+// What stands beside the values in a store with files. Made when it is needed: one name is another file's constant.
+const std::array<std::string, 5>& reservedNames() {
+  static const std::array<std::string, 5> names = {kManifestName, kManifestName + "-journal", kManifestName + "-wal",
+                                                   kManifestName + "-shm", AttributeStore::fileName};
+  return names;
+}
 
 // Fulfils the promise with what the operation does or throws. No lock may be held: an inline callback runs here.
 template <class Operation> void settle(Promise<void>& promise, Operation operation) {
@@ -73,6 +81,18 @@ struct PersistentKeyValueStore::FileWrite {
     const std::int32_t date = currentDate();
     return {key, key, size, false, date, date, extendedMetadata};
   }
+};
+
+// A fetch, on its way through the queues.
+struct PersistentKeyValueStore::Fetch {
+  const std::vector<std::string> keys;
+  const Loader loader;
+  const std::weak_ptr<PersistentKeyValueStore> store;
+  std::shared_ptr<const DiskCacheItem> item;  // once it is found
+  Promise<Fetched> promise;
+
+  Fetch(std::vector<std::string> keys_, Loader loader_, std::weak_ptr<PersistentKeyValueStore> store_)
+      : keys(std::move(keys_)), loader(std::move(loader_)), store(std::move(store_)) {}
 };
 
 std::shared_ptr<PersistentKeyValueStore> PersistentKeyValueStore::createPersistentKeyValueStore(
@@ -144,7 +164,7 @@ Future<void> PersistentKeyValueStore::store(const std::string& key, const std::v
   }
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork({key}, promise,
+  dispatchWork({key}, *promise,
                [weakThis = weak_from_this<PersistentKeyValueStore>(), key, value, extendedMetadata, promise] {
                  settle(*promise, [&] {
                    const auto self = weakThis.lock();
@@ -168,7 +188,7 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
     write->promise->setException(std::make_exception_ptr(unsupported));
     return future;
   }
-  dispatchWork({key}, write->promise, [write] {
+  dispatchWork({key}, *write->promise, [write] {
     const auto self = write->store.lock();
     if (self == nullptr) return write->promise->setValue();
     try {
@@ -325,43 +345,40 @@ Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValue
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetchFirst(
     const std::vector<std::string>& keys, Loader loader) {
-  const auto promise = std::make_shared<Promise<Fetched>>();
-  Future<Fetched> future = promise->getFuture();
-  dispatchWork(keys, promise,
-               [weakThis = weak_from_this<PersistentKeyValueStore>(), keys, loader = std::move(loader), promise] {
-                 if (const auto self = weakThis.lock()) {
-                   self->find(keys, loader, promise);
-                 } else {
-                   promise->setValue(nullptr);
-                 }
-               });
+  const auto fetch = std::make_shared<Fetch>(keys, std::move(loader), weak_from_this<PersistentKeyValueStore>());
+  Future<Fetched> future = fetch->promise.getFuture();
+  dispatchWork(keys, fetch->promise, [fetch] {
+    if (const auto self = fetch->store.lock()) {
+      self->find(fetch);
+    } else {
+      fetch->promise.setValue(nullptr);
+    }
+  });
   return future;
 }
 
-void PersistentKeyValueStore::find(const std::vector<std::string>& keys, const Loader& loader,
-                                   const std::shared_ptr<Promise<Fetched>>& promise) {
+void PersistentKeyValueStore::find(const std::shared_ptr<Fetch>& fetch) {
   try {
-    std::shared_ptr<const DiskCacheItem> item;
     {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
-      item = lookUp(keys);
+      fetch->item = lookUp(fetch->keys);
     }
-    if (!keys.empty()) reportAccess(item.get(), keys.front());
-    if (item != nullptr) {
-      fileQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), item, loader, promise] {
-        if (const auto self = weakThis.lock()) {
-          self->load(item, loader, *promise);
+    if (!fetch->keys.empty()) reportAccess(fetch->item.get(), fetch->keys.front());
+    if (fetch->item != nullptr) {
+      fileQueue_->dispatch([fetch] {
+        if (const auto self = fetch->store.lock()) {
+          self->load(*fetch);
         } else {
-          promise->setValue(nullptr);
+          fetch->promise.setValue(nullptr);
         }
       });
       return;
     }
   } catch (...) {
-    return promise->setException(std::current_exception());
+    return fetch->promise.setException(std::current_exception());
   }
-  promise->setValue(nullptr);
+  fetch->promise.setValue(nullptr);
 }
 
 // The record of the first key that has one; null for a miss, and when looking for it purged the store.
@@ -377,13 +394,13 @@ std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(const std::vector
   return nullptr;
 }
 
-void PersistentKeyValueStore::load(const std::shared_ptr<const DiskCacheItem>& item, const Loader& loader,
-                                   Promise<Fetched>& promise) {
+void PersistentKeyValueStore::load(Fetch& fetch) {
+  const auto& item = fetch.item;
   Fetched result;
   try {
     throwIfClosed();
     auto fetched = std::make_unique<FetchResult>(FetchResult{item->key, {}, item->modificationDate});
-    if (loader(item, getFilePath(item->filename), fetched->value)) {
+    if (fetch.loader(item, getFilePath(item->filename), fetched->value)) {
       const std::lock_guard<std::mutex> lock(mutex_);
       try {
         getManifest()->updateLastAccessDate(item->key);
@@ -393,9 +410,9 @@ void PersistentKeyValueStore::load(const std::shared_ptr<const DiskCacheItem>& i
       result = std::move(fetched);
     }
   } catch (...) {
-    if (isClosed_ || !hasLostItem(*item)) return promise.setException(std::current_exception());
+    if (isClosed_ || !hasLostItem(*item)) return fetch.promise.setException(std::current_exception());
   }
-  promise.setValue(std::move(result));
+  fetch.promise.setValue(std::move(result));
 }
 
 // Whether the store itself has taken the item away since it was looked up: removed it, or removed it and stored it
@@ -448,7 +465,7 @@ std::optional<std::int32_t> PersistentKeyValueStore::fetchModificationDate(const
 Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork({key}, promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+  dispatchWork({key}, *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
     settle(*promise, [&] {
       const auto self = weakThis.lock();
       if (self == nullptr) return;
@@ -483,7 +500,7 @@ void PersistentKeyValueStore::reportAccess(const DiskCacheItem* item, const std:
 Future<void> PersistentKeyValueStore::removeItem(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork({key}, promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+  dispatchWork({key}, *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
     if (const auto self = weakThis.lock()) {
       self->remove(key, promise);
     } else {
@@ -905,26 +922,25 @@ std::string PersistentKeyValueStore::getFilePath(const std::string& filename) {
 std::string PersistentKeyValueStore::getTemporaryDirectoryPath() { return temporaryDirectoryPath_; }
 
 // Hands the task over, or fails the promise with the reason why not.
-template <class T> void PersistentKeyValueStore::dispatchWork(const std::vector<std::string>& keys,
-                                                              const std::shared_ptr<Promise<T>>& promise,
+template <class T> void PersistentKeyValueStore::dispatchWork(const std::vector<std::string>& keys, Promise<T>& promise,
                                                               std::function<void()> task) {
   try {
     throwIfInvalid();
     for (const std::string& key : keys) throwIfReserved(key);
     workQueue_->dispatch(std::move(task));
   } catch (...) {
-    promise->setException(std::current_exception());
+    promise.setException(std::current_exception());
   }
 }
 
-// The store's own files stand beside the values.
 void PersistentKeyValueStore::throwIfReserved(const std::string& key) const {
   if (inlineData_) return;
   if (key.find('\0') != std::string::npos) throw std::invalid_argument("Key '" + key + "' holds a zero byte.");
-  const std::string name = key.substr(key.rfind('/') + 1);  // whatever the way there, it may lead back here
-  bool reserved = name == kManifestName || name == AttributeStore::fileName;
-  for (const std::string& companion : kManifestCompanions) reserved = reserved || name == kManifestName + companion;
-  if (reserved) throw std::invalid_argument("Key '" + key + "' is reserved.");
+  const std::string_view name = std::string_view(key).substr(key.rfind('/') + 1);  // whatever way leads there
+  const auto& reserved = reservedNames();
+  if (std::find(reserved.begin(), reserved.end(), name) != reserved.end()) {
+    throw std::invalid_argument("Key '" + key + "' is reserved.");
+  }
 }
 
 std::shared_ptr<Store> PKVSDefinition::createStore(

@@ -217,6 +217,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   using Fetched = std::unique_ptr<FetchResult>;
   using KeySet = std::unordered_set<std::string>;
   struct FileWrite;
+  struct Fetch;
 
   // These are called with the mutex held.
   void beginFileWrite(FileWrite& write);
@@ -237,18 +238,17 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   unsigned int runWriter(const FileWrite& write);
   bool recordWritten(const FileWrite& write, unsigned int size);
   bool takeBack(const FileWrite& write);
-  void load(const std::shared_ptr<const DiskCacheItem>& item, const Loader& loader, Promise<Fetched>& promise);
+  void load(Fetch& fetch);
   bool hasLostItem(const DiskCacheItem& item);
   void deleteLeftoverFile(const std::string& key);
 
   // These run on the work queue.
   void remove(const std::string& key, const std::shared_ptr<Promise<void>>& promise);
-  void find(const std::vector<std::string>& keys, const Loader& loader,
-            const std::shared_ptr<Promise<Fetched>>& promise);
+  void find(const std::shared_ptr<Fetch>& fetch);
   void reportAccess(const DiskCacheItem* item, const std::string& key);
 
-  template <class T> void dispatchWork(const std::vector<std::string>& keys, const std::shared_ptr<Promise<T>>& promise,
-                                       std::function<void()> task);
+  template <class T>
+  void dispatchWork(const std::vector<std::string>& keys, Promise<T>& promise, std::function<void()> task);
   void throwIfReserved(const std::string& key) const;
   void throwIfClosed();
   bool markInvalid(Future<void>& barrier);
