@@ -1,0 +1,34 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+
+#include "floors/SQLite.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+// The records of a store on disk, written by hand: the same table by the same statements, each prepared anew for each
+// operation, and nothing else.
+class ManifestFloor {
+ public:
+  explicit ManifestFloor(const std::string& directory);
+
+  void put(const std::string& key, std::size_t size, std::int32_t date);
+  void putValue(const std::string& key, const Bytes& value);  // of a record that is there
+  Bytes value(const std::string& key);
+  void remove(const std::string& key);
+
+  // Adds the first `count` items, each of so many bytes, in one transaction.
+  void fill(std::size_t count, std::size_t size);
+
+  Database& database() { return database_; }
+
+ private:
+  Database database_;
+};
+
+// The access date of an item of `fill`: later ones were used later, all of them long ago.
+std::int32_t dateOf(std::size_t number);
+
+}  // namespace velmora::mobile::xplat::cellar::bench

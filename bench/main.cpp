@@ -1,0 +1,74 @@
+// Measures the library beside the leanest loop that does the same, and beside what applications use instead.
+// `./dev bench` runs it.
+
+#include <CLI/CLI.hpp>
+#include <algorithm>
+#include <exception>
+#include <fstream>
+#include <iostream>
+#include <string>
+#include <vector>
+
+#include "support/Context.h"
+#include "support/Memory.h"
+#include "support/Stopwatch.h"
+#include "topics/Topics.h"
+
+namespace {
+
+using namespace velmora::mobile::xplat::cellar;  // NOLINT(google-build-using-namespace): a program's own file
+
+constexpr std::size_t kWarmedAtTheStart = std::size_t{1} << 30U;
+
+struct Arguments {
+  bool quick = false;
+  std::vector<std::string> places;
+  std::vector<std::string> topics;
+  std::string results;
+};
+
+bench::Place placeOf(const std::string& text) {
+  const auto colon = text.find(':');
+  return {text.substr(0, colon), text.substr(colon + 1)};
+}
+
+bool isWanted(const Arguments& arguments, const std::string& topic) {
+  const auto& wanted = arguments.topics;
+  return wanted.empty() || std::find(wanted.begin(), wanted.end(), topic) != wanted.end();
+}
+
+void run(const Arguments& arguments) {
+  bench::warmMemory(kWarmedAtTheStart);
+  bench::Report report;
+  bench::Context context{arguments.quick, {}, report};
+  for (const auto& place : arguments.places) context.places.push_back(placeOf(place));
+  if (arguments.quick) context.places.resize(1);
+  for (const auto& topic : bench::topics()) {
+    if (!isWanted(arguments, topic.name)) continue;
+    const bench::Stopwatch watch;
+    report.begin(topic.name, topic.title);
+    topic.measure(context);
+    std::cout << "\n" << topic.title << "\n\n" << bench::tableText(report.topics().back()) << std::flush;
+    std::cerr << topic.name << ": " << watch.microseconds() / 1e6 << " s\n";
+  }
+  std::ofstream(arguments.results) << report.json().dump(2) << "\n";
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Arguments arguments;
+  CLI::App app("Benchmarks of the library");
+  app.add_flag("--quick", arguments.quick, "Fewer and smaller measurements");
+  app.add_option("--place", arguments.places, "NAME:DIRECTORY to measure in")->required();
+  app.add_option("--results", arguments.results, "The file for the results, as JSON")->required();
+  app.add_option("--topic", arguments.topics, "Measure only this topic; may be repeated");
+  CLI11_PARSE(app, argc, argv);
+  try {
+    run(arguments);
+  } catch (const std::exception& error) {
+    std::cerr << "error: " << error.what() << "\n";
+    return 1;
+  }
+  return 0;
+}

@@ -1,0 +1,36 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "support/Values.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+// What applications use instead: values by key, on the caller's thread. Each is set up as its users would for data that
+// survives a killed process, without a sync for each write.
+class Rival {
+ public:
+  Rival() = default;
+  virtual ~Rival() = default;
+  Rival(const Rival&) = delete;
+  Rival& operator=(const Rival&) = delete;
+
+  virtual void put(const std::string& key, const Bytes& value) = 0;
+  virtual Bytes get(const std::string& key) = 0;  // throws when there is none
+};
+
+using OpenRival = std::function<std::unique_ptr<Rival>(const std::string& directory)>;
+
+std::unique_ptr<Rival> openLevelDB(const std::string& directory);
+std::unique_ptr<Rival> openLMDB(const std::string& directory);
+std::unique_ptr<Rival> openRocksDB(const std::string& directory);
+std::unique_ptr<Rival> openSQLite(const std::string& directory);
+
+// All of them, by the names that reports have.
+const std::vector<std::pair<std::string, OpenRival>>& rivals();
+
+}  // namespace velmora::mobile::xplat::cellar::bench

@@ -1,0 +1,44 @@
+#include <stdexcept>
+
+#include "floors/SQLite.h"
+#include "rivals/Rival.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+namespace {
+
+// Values as blobs in a table, by statements that are prepared once.
+class SQLiteBlobs : public Rival {
+ public:
+  explicit SQLiteBlobs(const std::string& directory) : database_(directory + "/blobs.sqlite") {
+    database_.exec(
+        "PRAGMA journal_mode = WAL;"
+        "PRAGMA synchronous = NORMAL;"
+        "CREATE TABLE IF NOT EXISTS Blobs (key TEXT PRIMARY KEY, value BLOB);");
+    put_ = std::make_unique<Statement>(database_, "INSERT OR REPLACE INTO Blobs (key, value) VALUES (?1, ?2);");
+    get_ = std::make_unique<Statement>(database_, "SELECT value FROM Blobs WHERE key = ?1;");
+  }
+
+  void put(const std::string& key, const Bytes& value) override {
+    put_->text(1, key).blob(2, value).next();
+    put_->reset();
+  }
+
+  Bytes get(const std::string& key) override {
+    if (!get_->text(1, key).next()) throw std::runtime_error("no value for " + key);
+    Bytes value = get_->blob(0);
+    get_->reset();
+    return value;
+  }
+
+ private:
+  Database database_;
+  std::unique_ptr<Statement> put_;
+  std::unique_ptr<Statement> get_;
+};
+
+}  // namespace
+
+std::unique_ptr<Rival> openSQLite(const std::string& directory) { return std::make_unique<SQLiteBlobs>(directory); }
+
+}  // namespace velmora::mobile::xplat::cellar::bench

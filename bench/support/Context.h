@@ -1,0 +1,20 @@
+#pragma once
+
+#include <vector>
+
+#include "support/Places.h"
+#include "support/Report.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+// What a topic needs to know.
+struct Context {
+  bool quick = false;
+  std::vector<Place> places{};
+  Report& report;
+
+  // A number of operations, items or repetitions; smaller in a quick run.
+  template <class Number> Number scaled(Number full, Number small) const { return quick ? small : full; }
+};
+
+}  // namespace velmora::mobile::xplat::cellar::bench

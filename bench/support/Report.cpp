@@ -1,0 +1,155 @@
+#include "support/Report.h"
+
+#include <algorithm>
+#include <cmath>
+#include <cstdio>
+#include <limits>
+#include <utility>
+
+#include "Table.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+namespace {
+
+constexpr const char* kFastest = "fastest rival";
+const std::vector<std::string> kContestants = {"ours", "floor", "LevelDB", "LMDB", "RocksDB", "SQLite"};
+
+std::string formatted(double value) {
+  char text[32];
+  const int digits = value >= 100 ? 0 : value >= 10 ? 1 : value >= 0.1 ? 2 : 3;
+  std::snprintf(text, sizeof(text), "%.*f", digits, value);
+  return text;
+}
+
+double comparedWith(const Row& row, const Goal& goal) {
+  if (goal.against != kFastest) return row.figures.at(goal.against);
+  double fastest = std::numeric_limits<double>::max();
+  for (const auto& [name, figure] : row.figures) {
+    if (name != "ours" && name != "floor") fastest = std::min(fastest, figure);
+  }
+  return fastest;
+}
+
+bool contains(const Report::Topic& topic, const std::string& contestant) {
+  return std::any_of(topic.rows.begin(), topic.rows.end(),
+                     [&](const Row& row) { return row.figures.count(contestant) > 0; });
+}
+
+std::string goalText(const Row& row, const Goal& goal) {
+  if (goal.against.empty()) return "<= " + formatted(goal.limit) + " " + row.unit;
+  return "<= " + formatted(goal.limit) + " " + goal.against;
+}
+
+using Cells = std::vector<std::string>;
+
+Cells titlesOf(const Report::Topic& topic) {
+  Cells titles = {"what", "where", "on", "unit"};
+  for (const auto& contestant : kContestants) {
+    if (contains(topic, contestant)) titles.push_back(contestant);
+  }
+  for (const char* title : {"ratio", "goal", "met"}) titles.emplace_back(title);
+  return titles;
+}
+
+Cells figureCells(const Report::Topic& topic, const Row& row) {
+  Cells cells;
+  for (const auto& contestant : kContestants) {
+    if (!contains(topic, contestant)) continue;
+    const auto figure = row.figures.find(contestant);
+    cells.push_back(figure == row.figures.end() ? "" : formatted(figure->second));
+  }
+  return cells;
+}
+
+Cells verdictCells(const Row& row, const Goal& goal) {
+  const std::string ratio = goal.against.empty() ? "" : formatted(ratioOf(row, goal));
+  return {ratio, goalText(row, goal), isMet(row, goal) ? "yes" : "no"};
+}
+
+// A row with several goals has a line for each, the figures only in the first.
+std::vector<Cells> linesOf(const Report::Topic& topic, const Row& row) {
+  const Cells figures = figureCells(topic, row);
+  Cells first = {row.what, row.where, row.cpus, row.unit};
+  first.insert(first.end(), figures.begin(), figures.end());
+  std::vector<Cells> lines;
+  for (const Goal& goal : row.goals) {
+    Cells line = lines.empty() ? first : Cells(first.size());
+    for (auto& cell : verdictCells(row, goal)) line.push_back(std::move(cell));
+    lines.push_back(std::move(line));
+  }
+  if (!lines.empty()) return lines;
+  const bool hasFloor = row.figures.count("floor") > 0;
+  first.push_back(hasFloor ? formatted(ratioOf(row, {"floor", 0})) : "");
+  first.resize(first.size() + 2);
+  return {first};
+}
+
+nlohmann::ordered_json jsonOf(const Row& row) {
+  nlohmann::ordered_json json = {
+      {"what", row.what}, {"where", row.where}, {"on", row.cpus}, {"unit", row.unit}, {"figures", row.figures}};
+  for (const Goal& goal : row.goals) {
+    json["goals"].push_back({{"against", goal.against},
+                             {"limit", goal.limit},
+                             {"ratio", goal.against.empty() ? row.figures.at("ours") : ratioOf(row, goal)},
+                             {"met", isMet(row, goal)}});
+  }
+  return json;
+}
+
+}  // namespace
+
+void Report::begin(const std::string& name, const std::string& title) { topics_.push_back({name, title, {}}); }
+
+void Report::add(Row row) { topics_.back().rows.push_back(std::move(row)); }
+
+void Report::add(Plot plot) { plots_.push_back(std::move(plot)); }
+
+nlohmann::ordered_json Report::json() const {
+  nlohmann::ordered_json json = nlohmann::ordered_json::object();
+  for (const Topic& topic : topics_) {
+    for (const Row& row : topic.rows) json[topic.name].push_back(jsonOf(row));
+  }
+  return json;
+}
+
+double ratioOf(const Row& row, const Goal& goal) { return row.figures.at("ours") / comparedWith(row, goal); }
+
+bool isMet(const Row& row, const Goal& goal) {
+  const double measured = goal.against.empty() ? row.figures.at("ours") : ratioOf(row, goal);
+  return measured <= goal.limit;
+}
+
+std::string tableText(const Report::Topic& topic) {
+  std::vector<tools::Table::Column> columns;
+  for (const auto& title : titlesOf(topic)) {
+    const bool isFigure = std::count(kContestants.begin(), kContestants.end(), title) > 0 || title == "ratio";
+    columns.push_back({title, isFigure ? tools::Table::Align::Right : tools::Table::Align::Left});
+  }
+  tools::Table table(columns);
+  for (const Row& row : topic.rows) {
+    for (Cells& line : linesOf(topic, row)) table.addRow(std::move(line));
+  }
+  return table.text();
+}
+
+std::string tableMarkdown(const Report::Topic& topic) {
+  const auto line = [](const Cells& cells) {
+    std::string text = "|";
+    for (const auto& cell : cells) text += " " + cell + " |";
+    return text + "\n";
+  };
+  const Cells titles = titlesOf(topic);
+  std::string text = line(titles) + "|";
+  for (const auto& title : titles) {
+    const bool isFigure = std::count(kContestants.begin(), kContestants.end(), title) > 0 || title == "ratio";
+    text += isFigure ? "---:|" : "---|";
+  }
+  text += "\n";
+  for (const Row& row : topic.rows) {
+    for (const Cells& cells : linesOf(topic, row)) text += line(cells);
+  }
+  return text;
+}
+
+}  // namespace velmora::mobile::xplat::cellar::bench

@@ -1,0 +1,71 @@
+#pragma once
+
+#include <map>
+#include <string>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+#include "support/Samples.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+// Ours is to be at most `limit` times that of `against`: "floor", the name of a rival, "fastest rival", or empty when
+// the limit is a figure of its own.
+struct Goal {
+  std::string against;
+  double limit;
+};
+
+// One comparison: what was measured where, and the figures of all who took part ("ours", "floor", rivals).
+struct Row {
+  std::string what;
+  std::string where;
+  std::string cpus;
+  std::string unit;
+  Figures figures;
+  std::vector<Goal> goals;
+};
+
+// Points of a plot: a line for each name, of x and y.
+struct Plot {
+  std::string name;  // of its file
+  std::string title;
+  std::string xLabel;
+  std::string yLabel;
+  bool logarithmicY = false;
+  std::map<std::string, std::vector<std::pair<double, double>>> lines{};
+};
+
+// What was measured, by topic.
+class Report {
+ public:
+  // What is added from now on belongs to this topic.
+  void begin(const std::string& name, const std::string& title);
+  void add(Row row);
+  void add(Plot plot);
+
+  struct Topic {
+    std::string name;
+    std::string title;
+    std::vector<Row> rows;
+  };
+  const std::vector<Topic>& topics() const { return topics_; }
+  const std::vector<Plot>& plots() const { return plots_; }
+
+  nlohmann::ordered_json json() const;
+
+ private:
+  std::vector<Topic> topics_;
+  std::vector<Plot> plots_;
+};
+
+// Ours over what the goal names.
+double ratioOf(const Row& row, const Goal& goal);
+bool isMet(const Row& row, const Goal& goal);
+
+// The rows of a topic, as a table for a terminal or in Markdown.
+std::string tableText(const Report::Topic& topic);
+std::string tableMarkdown(const Report::Topic& topic);
+
+}  // namespace velmora::mobile::xplat::cellar::bench

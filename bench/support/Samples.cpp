@@ -1,0 +1,38 @@
+#include "support/Samples.h"
+
+#include <algorithm>
+
+#include "support/Memory.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+namespace {
+
+constexpr std::size_t kLeastWarm = 4U << 20U;
+
+}  // namespace
+
+double quantile(std::vector<double> samples, double share) {
+  const double position = share * static_cast<double>(samples.size());
+  const auto index = std::min(static_cast<std::size_t>(position), samples.size() - 1);
+  std::nth_element(samples.begin(), samples.begin() + static_cast<std::ptrdiff_t>(index), samples.end());
+  return samples[index];
+}
+
+double median(std::vector<double> samples) { return quantile(std::move(samples), 0.5); }
+
+Figures interleaved(const Contestants& contestants, int repetitions, std::size_t bytes) {
+  std::map<std::string, std::vector<double>> samples;
+  for (int round = 0; round < repetitions; ++round) {
+    for (std::size_t turn = 0; turn < contestants.size(); ++turn) {
+      const auto& [name, measure] = contestants[(turn + static_cast<std::size_t>(round)) % contestants.size()];
+      warmMemory(kLeastWarm + 2 * bytes);
+      samples[name].push_back(measure());
+    }
+  }
+  Figures medians;
+  for (const auto& [name, values] : samples) medians[name] = median(values);
+  return medians;
+}
+
+}  // namespace velmora::mobile::xplat::cellar::bench

@@ -1,0 +1,25 @@
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <map>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+// The sample below which the share of all lies, 0.5 for the median. At least one sample.
+double quantile(std::vector<double> samples, double share);
+double median(std::vector<double> samples);
+
+// Who takes part in a comparison, by name, and what measures it once.
+using Contestants = std::vector<std::pair<std::string, std::function<double()>>>;
+using Figures = std::map<std::string, double>;
+
+// The median of so many measurements of each. They take turns, each round beginning with another one, so that whatever
+// else the machine does meets all of them. `bytes`: what a measurement writes and reads; so much memory is warmed
+// before.
+Figures interleaved(const Contestants& contestants, int repetitions, std::size_t bytes);
+
+}  // namespace velmora::mobile::xplat::cellar::bench

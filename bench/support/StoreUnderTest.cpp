@@ -1,0 +1,66 @@
+#include "support/StoreUnderTest.h"
+
+#include <chrono>
+#include <future>
+#include <stdexcept>
+
+#include <cellar/FileUtils.h>
+#include <cellar/PruneStrategy.h>
+#include <cellar/TrashCollector.h>
+#include <cellar/host/Await.h>
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+namespace {
+
+constexpr long kTenYears = 315'360'000;
+constexpr unsigned int kBatchSize = 50;  // as managers have it
+constexpr std::chrono::minutes kPatience(10);
+
+std::shared_ptr<DiskCache> createCache(const std::string& directory, const StoreOptions& options,
+                                       const std::shared_ptr<host::ThreadQueueFactory>& queues) {
+  const auto files = std::make_shared<FileUtils>();
+  const auto trash = std::make_shared<TrashCollector>(directory + "-trash", files, nullptr, nullptr);
+  const auto cache = std::make_shared<DiskCache>(
+      directory, directory + "-tmp", "bench", options.capacity, kTenYears, options.normalSize, options.normalSize,
+      options.inlineData, queues, nullptr, trash, std::make_shared<LRUPruneStrategy>(), options.reporter, nullptr,
+      files, [](unsigned int) {}, kBatchSize);
+  if (options.load) cache->loadManifest();
+  return cache;
+}
+
+}  // namespace
+
+StoreUnderTest::StoreUnderTest(const std::string& directory, const StoreOptions& options)
+    : queues_(std::make_shared<host::ThreadQueueFactory>()), cache_(createCache(directory, options, queues_)) {
+  settle();
+}
+
+StoreUnderTest::~StoreUnderTest() {
+  cache_.reset();
+  queues_->shutDown();
+}
+
+void StoreUnderTest::settle() {
+  if (!queues_->drain(kPatience)) throw std::runtime_error("the queues do not come to rest");
+}
+
+void StoreUnderTest::prune() {
+  std::promise<void> done;
+  cache_->pruneBackToNormal([&] { done.set_value(); },
+                            [&](const std::exception& error) {
+                              done.set_exception(std::make_exception_ptr(std::runtime_error(error.what())));
+                            },
+                            false);
+  done.get_future().get();
+}
+
+void StoreUnderTest::verify(std::size_t count, std::size_t size) {
+  for (std::size_t number = 0; number < count; ++number) {
+    const auto found = host::await(cache_->fetch(keyOf(number)));
+    if (found == nullptr) throw std::runtime_error("item " + std::to_string(number) + " is missing");
+    throwUnlessValue(found->value, size, number);
+  }
+}
+
+}  // namespace velmora::mobile::xplat::cellar::bench

@@ -1,0 +1,133 @@
+#include <cstddef>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "floors/FileFloor.h"
+#include "floors/ManifestFloor.h"
+#include "rivals/Rival.h"
+#include "support/Samples.h"
+#include "support/Stopwatch.h"
+#include "support/StoreUnderTest.h"
+#include "support/Window.h"
+#include "topics/Topics.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+namespace {
+
+constexpr std::size_t kOutstanding = 64;
+
+struct Case {
+  std::size_t size;
+  std::size_t count;
+  bool inlineData;
+  std::vector<Goal> outstandingGoals;
+  std::vector<Goal> singleGoals;
+};
+
+std::vector<Case> cases(const Context& context) {
+  return {
+      {200, context.scaled<std::size_t>(2000, 500), true, {{"floor", 1.1}}, {}},
+      {4 << 10, context.scaled<std::size_t>(2000, 500), false, {{"floor", 0.85}}, {{"floor", 1.5}}},
+      {64 << 10, context.scaled<std::size_t>(500, 150), false, {{"floor", 0.85}, {"LevelDB", 1}, {"SQLite", 1}}, {}},
+      {1 << 20, context.scaled<std::size_t>(60, 20), false, {{"LevelDB", 0.2}, {"SQLite", 0.2}}, {}},
+  };
+}
+
+double average(const Stopwatch& watch, std::size_t count) { return watch.microseconds() / static_cast<double>(count); }
+
+double measureOurs(const Place& place, bool pinned, const Case& what, std::size_t outstanding) {
+  const Scratch scratch(place);
+  const Pinned guard(pinned);
+  StoreUnderTest store(scratch / "store", {what.inlineData});
+  Bytes value = valueOf(what.size);
+  const Stopwatch watch;
+  Window window(outstanding);
+  for (std::size_t number = 0; number < what.count; ++number) {
+    stamp(value, number);
+    if (outstanding == 1) {
+      store->store(keyOf(number), value).get();
+    } else {
+      window.add(store->store(keyOf(number), value));
+    }
+  }
+  window.finish();
+  const double result = average(watch, what.count);
+  store.verify(what.count, what.size);
+  return result;
+}
+
+double measureFloor(const Place& place, bool pinned, const Case& what) {
+  const Scratch scratch(place);
+  const Pinned guard(pinned);
+  ManifestFloor manifest(scratch.path());
+  Bytes value = valueOf(what.size);
+  const Stopwatch watch;
+  for (std::size_t number = 0; number < what.count; ++number) {
+    stamp(value, number);
+    const std::string key = keyOf(number);
+    if (what.inlineData) {
+      manifest.put(key, what.size, dateOf(number));
+      manifest.putValue(key, value);
+    } else {
+      manifest.put(key, 0, dateOf(number));
+      writeFile(scratch / key, value);
+      manifest.put(key, what.size, dateOf(number));
+    }
+  }
+  const double result = average(watch, what.count);
+  for (std::size_t number = 0; number < what.count; ++number) {
+    const std::string key = keyOf(number);
+    throwUnlessValue(what.inlineData ? manifest.value(key) : readFile(scratch / key, what.size), what.size, number);
+  }
+  return result;
+}
+
+double measureRival(const Place& place, bool pinned, const Case& what, const OpenRival& open) {
+  const Scratch scratch(place);
+  const Pinned guard(pinned);
+  const std::unique_ptr<Rival> rival = open(scratch.path());
+  Bytes value = valueOf(what.size);
+  const Stopwatch watch;
+  for (std::size_t number = 0; number < what.count; ++number) {
+    stamp(value, number);
+    rival->put(keyOf(number), value);
+  }
+  const double result = average(watch, what.count);
+  for (std::size_t number = 0; number < what.count; ++number) {
+    throwUnlessValue(rival->get(keyOf(number)), what.size, number);
+  }
+  return result;
+}
+
+void measureCase(const Context& context, const Place& place, bool pinned, const Case& what) {
+  Contestants contestants = {
+      {"64", [&] { return measureOurs(place, pinned, what, kOutstanding); }},
+      {"1", [&] { return measureOurs(place, pinned, what, 1); }},
+      {"floor", [&] { return measureFloor(place, pinned, what); }},
+  };
+  for (const auto& [name, open] : rivals()) {
+    contestants.emplace_back(name, [&, open = open] { return measureRival(place, pinned, what, open); });
+  }
+  Figures figures = interleaved(contestants, context.scaled(7, 3), what.count * what.size);
+  const double outstanding = figures.extract("64").mapped();
+  const double single = figures.extract("1").mapped();
+  const std::string name = sizeName(what.size) + (what.inlineData ? " inline" : "");
+  figures["ours"] = outstanding;
+  context.report.add(Row{name + ", 64 outstanding", place.name, cpuName(pinned), "us", figures, what.outstandingGoals});
+  figures["ours"] = single;
+  context.report.add(Row{name + ", one at a time", place.name, cpuName(pinned), "us", figures, what.singleGoals});
+}
+
+}  // namespace
+
+void measureStores(const Context& context) {
+  for (const Case& what : cases(context)) {
+    for (const Place& place : context.places) {
+      for (const bool pinned : {false, true}) measureCase(context, place, pinned, what);
+    }
+  }
+}
+
+}  // namespace velmora::mobile::xplat::cellar::bench

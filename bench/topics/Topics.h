@@ -1,0 +1,23 @@
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "support/Context.h"
+
+namespace velmora::mobile::xplat::cellar::bench {
+
+// Each measures one thing and adds its rows to the report.
+void measureStores(const Context& context);
+void measureFetches(const Context& context);
+void measureCallers(const Context& context);
+
+struct TopicDefinition {
+  std::string name;
+  std::string title;
+  void (*measure)(const Context& context);
+};
+
+const std::vector<TopicDefinition>& topics();
+
+}  // namespace velmora::mobile::xplat::cellar::bench
