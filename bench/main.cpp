@@ -40,9 +40,11 @@ bool isWanted(const Arguments& arguments, const std::string& topic) {
 void run(const Arguments& arguments) {
   bench::warmMemory(kWarmedAtTheStart);
   bench::Report report;
-  bench::Context context{arguments.quick, {}, report};
-  for (const auto& place : arguments.places) context.places.push_back(placeOf(place));
-  if (arguments.quick) context.places.resize(1);
+  std::vector<bench::Place> places;
+  for (const auto& place : arguments.places) places.push_back(placeOf(place));
+  bench::Manifests manifests(places.back());
+  if (arguments.quick) places.resize(1);
+  const bench::Context context{arguments.quick, places, report, manifests};
   for (const auto& topic : bench::topics()) {
     if (!isWanted(arguments, topic.name)) continue;
     const bench::Stopwatch watch;

@@ -64,6 +64,7 @@ Bytes ManifestFloor::value(const std::string& key) {
 void ManifestFloor::remove(const std::string& key) { Statement(database_, kRemove).text(1, key).next(); }
 
 void ManifestFloor::fill(std::size_t count, std::size_t size) {
+  database_.exec("PRAGMA cache_size = -500000");  // in KiB: all of it
   database_.exec("BEGIN");
   {
     Statement statement(database_, kPut);

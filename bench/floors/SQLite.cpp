@@ -58,6 +58,13 @@ Bytes Statement::blob(int column) const {
   return {first, first + sqlite3_column_bytes(statement_, column)};
 }
 
+std::string Statement::text(int column) const {
+  const auto* const first = static_cast<const char*>(sqlite3_column_blob(statement_, column));
+  return {first, static_cast<std::size_t>(sqlite3_column_bytes(statement_, column))};
+}
+
+long long Statement::number(int column) const { return sqlite3_column_int64(statement_, column); }
+
 void Statement::reset() { check(sqlite3_reset(statement_)); }
 
 void Statement::check(int resultCode) const { throwUnlessSuccess(database_, resultCode); }

@@ -39,6 +39,8 @@ class Statement {
 
   bool next();  // whether there is a row
   Bytes blob(int column) const;
+  std::string text(int column) const;
+  long long number(int column) const;
   void reset();  // to be run again
 
  private:

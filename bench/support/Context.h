@@ -2,6 +2,7 @@
 
 #include <vector>
 
+#include "support/Fill.h"
 #include "support/Places.h"
 #include "support/Report.h"
 
@@ -12,6 +13,7 @@ struct Context {
   bool quick = false;
   std::vector<Place> places{};
   Report& report;
+  Manifests& manifests;
 
   // A number of operations, items or repetitions; smaller in a quick run.
   template <class Number> Number scaled(Number full, Number small) const { return quick ? small : full; }

@@ -13,7 +13,7 @@ namespace velmora::mobile::xplat::cellar::bench {
 namespace {
 
 constexpr const char* kFastest = "fastest rival";
-const std::vector<std::string> kContestants = {"ours", "floor", "LevelDB", "LMDB", "RocksDB", "SQLite"};
+const std::vector<std::string> kContestants = {"ours", "floor", "LevelDB", "LMDB", "RocksDB", "SQLite", "du", "rm -rf"};
 
 std::string formatted(double value) {
   char text[32];

@@ -9,6 +9,7 @@ namespace velmora::mobile::xplat::cellar::bench {
 namespace {
 
 constexpr std::size_t kLeastWarm = 4U << 20U;
+constexpr std::size_t kMostWarm = 256U << 20U;
 
 }  // namespace
 
@@ -26,7 +27,7 @@ Figures interleaved(const Contestants& contestants, int repetitions, std::size_t
   for (int round = 0; round < repetitions; ++round) {
     for (std::size_t turn = 0; turn < contestants.size(); ++turn) {
       const auto& [name, measure] = contestants[(turn + static_cast<std::size_t>(round)) % contestants.size()];
-      warmMemory(kLeastWarm + 2 * bytes);
+      warmMemory(std::min(kLeastWarm + 2 * bytes, kMostWarm));
       samples[name].push_back(measure());
     }
   }

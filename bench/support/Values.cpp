@@ -52,6 +52,12 @@ void throwUnlessValue(const Bytes& found, std::size_t size, std::size_t number) 
   if (found != expected) throw std::runtime_error("item " + std::to_string(number) + " is not what was stored");
 }
 
+std::string countName(std::size_t count) {
+  std::string text = std::to_string(count);
+  for (std::size_t rest = text.size(); rest > 3; rest -= 3) text.insert(rest - 3, ",");
+  return text;
+}
+
 std::string sizeName(std::size_t size) {
   if (size >= 1U << 20U) return std::to_string(size >> 20U) + " MiB";
   if (size >= 1U << 10U) return std::to_string(size >> 10U) + " KiB";

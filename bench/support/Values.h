@@ -20,6 +20,9 @@ void stamp(Bytes& value, std::size_t number);
 void throwUnlessStamped(const unsigned char* data, std::size_t found, std::size_t size, std::size_t number);
 void throwUnlessValue(const Bytes& found, std::size_t size, std::size_t number);
 
+// "100,000"
+std::string countName(std::size_t count);
+
 // "4 KiB"
 std::string sizeName(std::size_t size);
 

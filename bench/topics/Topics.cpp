@@ -7,6 +7,13 @@ const std::vector<TopicDefinition>& topics() {
       {"store", "Storing: microseconds for each of many new values", measureStores},
       {"fetch", "Fetching: microseconds for each of many values that are there", measureFetches},
       {"caller", "The caller's time: microseconds until a call returns", measureCallers},
+      {"prune", "Pruning: microseconds for each item that goes", measurePrunes},
+      {"capacity", "Writing to a store at its capacity: microseconds for each write", measureCapacity},
+      {"load", "Loading a manifest: time and memory for each item", measureLoading},
+      {"tree", "Measuring and freeing directories", measureTrees},
+      {"event", "Reporting: microseconds for each analytics event", measureEvents},
+      {"start", "Starting", measureStart},
+      {"space", "Space on disk for each byte stored", measureSpace},
   };
   return all;
 }

@@ -11,6 +11,13 @@ namespace velmora::mobile::xplat::cellar::bench {
 void measureStores(const Context& context);
 void measureFetches(const Context& context);
 void measureCallers(const Context& context);
+void measurePrunes(const Context& context);
+void measureCapacity(const Context& context);
+void measureLoading(const Context& context);
+void measureTrees(const Context& context);
+void measureEvents(const Context& context);
+void measureStart(const Context& context);
+void measureSpace(const Context& context);
 
 struct TopicDefinition {
   std::string name;
