@@ -132,7 +132,7 @@ DiskSizeCalculator::Stats DiskSizeCalculator::traverseDirectory(
   const auto entries = fileUtils_->listDirectory(path);
   if (!isLink && fileUtils_->isSymLink(path)) return {false, 0, 0, 0};  // put there meanwhile
   for (const FileUtils::Info& entry : entries) {
-    if (excluded.count(fileUtils_->basename(entry.path)) > 0) continue;
+    if (!excluded.empty() && excluded.count(fileUtils_->basename(entry.path)) > 0) continue;
     if (entry.type == FileUtils::Type::File) {
       stats.timeSpent += MIN_TIME_SPENT;
       add(stats.size, entry.size);
