@@ -28,8 +28,22 @@ const char* textOf(StoreManagerEvent::Type type) {
   throw std::invalid_argument("Bad Enum Value");
 }
 
-void log(XAnalytics& analytics, const std::string& eventName, const JsonValue& payload) {
-  const std::string text = payload.dump(-1, ' ', false, JsonValue::error_handler_t::replace);
+// The object of an event, member by member: given as one list, each would be built and copied twice.
+class Payload {
+ public:
+  template <class Value> Payload& with(const char* name, const Value& value) {
+    object_.emplace(name, value);
+    return *this;
+  }
+
+  const JsonValue& object() const { return object_; }
+
+ private:
+  JsonValue object_ = JsonValue::object();
+};
+
+void log(XAnalytics& analytics, const std::string& eventName, const Payload& payload) {
+  const std::string text = payload.object().dump(-1, ' ', false, JsonValue::error_handler_t::replace);
   analytics.logEvent(eventName, kCategory, text, std::to_string(std::time(nullptr)));
 }
 
@@ -92,35 +106,40 @@ AnalyticsEventReporter::~AnalyticsEventReporter() = default;
 
 void AnalyticsEventReporter::reportEvent(const StoreManagerEvent& event) const {
   log(*analytics_, kStoreManagerEventName,
-      {{"event_type", textOf(event.type)},
-       {"store_name", event.storeName},
-       {"current_size", event.currentSize},
-       {"max_size", event.maxSize}});
+      Payload()
+          .with("event_type", textOf(event.type))
+          .with("store_name", event.storeName)
+          .with("current_size", event.currentSize)
+          .with("max_size", event.maxSize));
 }
 
 void AnalyticsEventReporter::reportEvent(const PersistentKeyValueStoreEvent& event) const {
   log(*analytics_, kPersistentKeyValueStoreEventName,
-      {{"store_name", event.storeName},
-       {"key", event.key},
-       {"tag", event.hasTag ? event.tag : std::string()},
-       {"hit", static_cast<int>(event.hit)},
-       {"itemAge", event.age},
-       {"size", event.size}});
+      Payload()
+          .with("store_name", event.storeName)
+          .with("key", event.key)
+          .with("tag", event.hasTag ? event.tag : std::string())
+          .with("hit", static_cast<int>(event.hit))
+          .with("itemAge", event.age)
+          .with("size", event.size));
 }
 
 void AnalyticsEventReporter::reportEvent(const DiskSizeCalculatorEvent& event) const {
   log(*analytics_, kDiskSizeCalculatorEventName,
-      {{"directory_path", event.directoryPath},
-       {"size", event.size},
-       {"file_count", event.fileCount},
-       {"processing_time", event.processingTime},
-       {"disk_size", event.diskSize},
-       {"free_space", event.freeSpace}});
+      Payload()
+          .with("directory_path", event.directoryPath)
+          .with("size", event.size)
+          .with("file_count", event.fileCount)
+          .with("processing_time", event.processingTime)
+          .with("disk_size", event.diskSize)
+          .with("free_space", event.freeSpace));
 }
 
 void AnalyticsEventReporter::reportEvent(const TrashCollectorEvent& event) const {
   log(*analytics_, kTrashCollectorEventName,
-      {{"time_spent", static_cast<double>(event.timeSpent.count()) / 1000.0}, {"file_count", event.fileCount}});
+      Payload()
+          .with("time_spent", static_cast<double>(event.timeSpent.count()) / 1000.0)
+          .with("file_count", event.fileCount));
 }
 
 }  // namespace velmora::mobile::xplat::cellar
