@@ -17,6 +17,7 @@
 #include "LarderException.h"
 #include "LazyDispatcher.h"
 #include "ManifestPersistence.h"
+#include "ManifestSnapshot.h"
 #include "PathLocations.h"
 #include "PersistentKeyValueStore.h"
 #include "PruneStrategy.h"

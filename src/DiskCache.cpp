@@ -57,7 +57,7 @@ void DiskCache::pruneBackToNormal(std::function<void()> onSuccess, std::function
   const auto takeNextBatch = [weakThis = weak_from_this<DiskCache>(), target]() -> std::vector<DiskCacheItem> {
     const auto self = weakThis.lock();
     if (self == nullptr) return {};
-    return self->takeBatch(
+    return self->evictBatch(
         [&](DiskCacheManifestInterface& manifest) { return manifest.pruneToSize(target, self->batchSize()); });
   };
   deleteFilesInBatches(takeNextBatch, std::move(onSuccess), std::move(onError));

@@ -39,6 +39,10 @@ const std::array<std::string, 5>& reservedNames() {
   return names;
 }
 
+void count(std::atomic<std::uint64_t>& counter, std::uint64_t occurrences = 1) {
+  counter.fetch_add(occurrences, std::memory_order_relaxed);
+}
+
 // Fulfils the promise with what the operation does or throws. No lock may be held: an inline callback runs here.
 template <class Operation> void settle(Promise<void>& promise, Operation operation) {
   try {
@@ -262,6 +266,7 @@ bool PersistentKeyValueStore::recordWritten(const FileWrite& write, unsigned int
   try {
     if (!write.inFlight->hasRecord) removeOldestItemIfOverMaxCapacity();
     getManifest()->setItem(write.record(size));
+    count(stores_);
   } catch (const ManifestPersistenceException& error) {
     purge(error);
   }
@@ -306,6 +311,7 @@ void PersistentKeyValueStore::writeInline(const std::string& key, const std::vec
     const auto size = static_cast<std::uint32_t>(data.size());
     manifest->setItem({key, key, size, false, date, date, std::move(extendedMetadata)});
     manifest->setInlineData(key, data);
+    count(stores_);
   } catch (const ManifestPersistenceException& error) {
     writesInFlight_->revoke(key);
     purge(error);
@@ -364,7 +370,10 @@ void PersistentKeyValueStore::find(const std::shared_ptr<Fetch>& fetch) {
       throwIfInvalid();
       fetch->item = lookUp(fetch->keys);
     }
-    if (!fetch->keys.empty()) reportAccess(fetch->item.get(), fetch->keys.front());
+    if (!fetch->keys.empty()) {
+      count(fetch->item != nullptr ? hits_ : misses_);
+      reportAccess(fetch->item.get(), fetch->keys.front());
+    }
     if (fetch->item != nullptr) {
       fileQueue_->dispatch([fetch] {
         if (const auto self = fetch->store.lock()) {
@@ -612,7 +621,9 @@ void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
   const auto manifest = getManifest();
   if (!capacity_ || manifest->count() < *capacity_) return;
   const auto item = manifest->pruneOldestItem();
-  if (item == nullptr || item->hasInlineData) return;
+  if (item == nullptr) return;
+  count(evictions_);
+  if (item->hasInlineData) return;
   if (writesInFlight_->revoke(item->key)) return;
   const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), filename = item->filename] {
     const auto self = weakThis.lock();
@@ -645,6 +656,13 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeBatch(
   for (DiskCacheItem& item : items) {
     if (writesInFlight_->revoke(item.key)) item.filename.clear();  // its file is left to that write
   }
+  return items;
+}
+
+std::vector<DiskCacheItem> PersistentKeyValueStore::evictBatch(
+    const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune) {
+  auto items = takeBatch(prune);
+  count(evictions_, items.size());
   return items;
 }
 
@@ -782,7 +800,7 @@ void PersistentKeyValueStore::startStaleItemRemoval() {
                                cutoff]() -> std::vector<DiskCacheItem> {
     const auto self = weakThis.lock();
     if (self == nullptr) return {};
-    return self->takeBatch(
+    return self->evictBatch(
         [&](DiskCacheManifestInterface& manifest) { return manifest.pruneOldEntries(cutoff, self->batchSize_); });
   };
   try {
@@ -798,6 +816,11 @@ void PersistentKeyValueStore::overrideConfiguration(long staleAge) {
 }
 
 bool PersistentKeyValueStore::isPrunable() { return false; }
+
+PersistentKeyValueStore::OperationCounts PersistentKeyValueStore::operationCounts() const {
+  const auto read = [](const std::atomic<std::uint64_t>& counter) { return counter.load(std::memory_order_relaxed); };
+  return {read(hits_), read(misses_), read(stores_), read(evictions_)};
+}
 
 // --- Invalidation and recovery ---
 

@@ -73,6 +73,16 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
     long modificationDate;  // seconds since the Unix epoch
   };
 
+  // What a store has done since it was created, each number counted by itself: read while the store works they need not
+  // belong to one moment.
+  struct CELLAR_EXPORT OperationCounts {
+    std::uint64_t hits;    // fetches that found an item, whether its value could be read or not
+    std::uint64_t misses;  // fetches that found none; those without a key count as neither
+    std::uint64_t stores;  // values that were written, those that replaced another too
+    std::uint64_t
+        evictions;  // items that went for the capacity, in a prune or by expiry; not those of a clear or purge
+  };
+
   // Creates the store's directory, takes two queues from the factory and starts loading the manifest. `name` appears in
   // log lines and events. `capacity`: items, absent for no limit; checked before each write, which then evicts the one
   // item used least recently, also when it overwrites. `staleAge`: seconds without access after which an item expires;
@@ -194,6 +204,9 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Tells the size callback the total bytes of all items, on the work queue, if the manifest is loaded.
   void reportSize();
 
+  // Takes no lock and asks no queue: any thread, as often as it likes, after invalidation too.
+  OperationCounts operationCounts() const;
+
   // --- Parts ---
 
   // The manifest, created on first use. What creating it throws is thrown again by later calls that try anew; a
@@ -211,6 +224,10 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Takes a batch out of the manifest by `prune`, for `deleteFilesInBatches`. Locks the mutex; a corrupted manifest
   // purges the store and yields an empty batch.
   std::vector<DiskCacheItem> takeBatch(
+      const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune);
+
+  // The same, and counts the items as evicted.
+  std::vector<DiskCacheItem> evictBatch(
       const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune);
 
  private:
@@ -286,6 +303,12 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   std::mutex manifestMutex_;  // taken after mutex_; guards the creation of the manifest
   std::atomic<bool> manifestCreated_{false};
   std::shared_ptr<DiskCacheManifestInterface> manifest_;
+
+  // Relaxed: they are added to and read, and order nothing.
+  std::atomic<std::uint64_t> hits_{0};
+  std::atomic<std::uint64_t> misses_{0};
+  std::atomic<std::uint64_t> stores_{0};
+  std::atomic<std::uint64_t> evictions_{0};
 };
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -218,6 +218,15 @@ void SQLiteManifestPersistence::removeInlineData(const std::string& key) {
   });
 }
 
+void SQLiteManifestPersistence::setSize(const std::string& key, std::uint32_t size) {
+  perform([&] {
+    SQLiteStoreCursor cursor = store_->cursor("UPDATE LarderManifest SET size = ?2 WHERE key = ?1;");
+    cursor.bind<std::string>(1, key);
+    cursor.bind<unsigned long long>(2, size);
+    cursor.next();
+  });
+}
+
 std::unique_ptr<DiskCacheItem> SQLiteManifestPersistence::itemInRowOf(SQLiteStoreCursor& cursor) const {
   auto item = std::make_unique<DiskCacheItem>();
   item->key = cursor.get<std::string>(0);

@@ -19,6 +19,7 @@
 // every row. A table whose columns differ in name, type or order in any other way is foreign and is refused; columns
 // beyond these are left alone.
 
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -63,6 +64,9 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   std::vector<unsigned char> getInlineData(const std::string& key) const override;
   void setInlineData(const std::string& key, const std::vector<unsigned char>& data) override;
   void removeInlineData(const std::string& key) override;
+
+  // Corrects the size of a record that is there already; everything else of it stays, an inline value too.
+  void setSize(const std::string& key, std::uint32_t size);
 
  private:
   template <class Operation> auto perform(Operation operation) const;

@@ -1,0 +1,130 @@
+#include <gtest/gtest.h>
+
+#include <memory>
+#include <string>
+#include <tuple>
+
+#include "support/KeyValueStoreFixture.h"
+
+namespace velmora::mobile::xplat::cellar {
+namespace {
+
+using test::KeyValueStoreFixture;
+using test::told;
+using test::watch;
+
+class OperationCounts : public KeyValueStoreFixture {
+ protected:
+  // "hits misses stores evictions"
+  std::string counts() const {
+    const auto counts = store->operationCounts();
+    return std::to_string(counts.hits) + " " + std::to_string(counts.misses) + " " + std::to_string(counts.stores) +
+           " " + std::to_string(counts.evictions);
+  }
+};
+
+TEST_F(OperationCounts, BeginAtNothingWithEveryStart) {
+  open();
+  EXPECT_EQ(counts(), "0 0 0 0");
+  put("key", "value");
+  reopen();
+  EXPECT_EQ(counts(), "0 0 0 0");
+}
+
+TEST_F(OperationCounts, TellHitsFromMisses) {
+  open();
+  put("key", "value");
+  get("key");
+  get("key");
+  get("nothing");
+  EXPECT_EQ(counts(), "2 1 1 0");
+}
+
+TEST_F(OperationCounts, CountASearchForSeveralKeysOnceAndOneForNoneNotAtAll) {
+  open();
+  put("b", "value");
+  const auto found = watch(store->fetchFirst({"a", "b"}, answering("value")));
+  const auto missed = watch(store->fetchFirst({"c", "d"}, answering("value")));
+  const auto none = watch(store->fetchFirst({}, answering("value")));
+  settle();
+  EXPECT_EQ(told(none), "<miss>");
+  EXPECT_EQ(counts(), "1 1 1 0");
+}
+
+TEST_F(OperationCounts, CountAHitWhoseFileHasGone) {
+  open();
+  put("key", "value");
+  files->deleteFile(pathOf("key"));
+  get("key");
+  EXPECT_EQ(counts(), "1 0 1 0");
+}
+
+TEST_F(OperationCounts, CountWhatWasWrittenAndNotWhatFailed) {
+  for (const bool inlineData : {false, true}) {
+    options.inlineData = inlineData;
+    open();
+    put("key", "value");
+    put("key", "another");
+    EXPECT_EQ(counts(), "0 0 2 0") << inlineData;
+    close();
+  }
+  options.inlineData = false;
+  open();
+  const auto failed =
+      watch(store->store("other", nullptr, [](const std::string&) -> unsigned int { throw std::runtime_error("no"); }));
+  settle();
+  EXPECT_EQ(told(failed), "<error> no");
+  EXPECT_EQ(counts(), "0 0 0 0");
+}
+
+TEST_F(OperationCounts, CountWhatGoesForTheCapacity) {
+  for (const bool inlineData : {false, true}) {
+    options.inlineData = inlineData;
+    options.capacity = 3;
+    open();
+    putMany(5);
+    EXPECT_EQ(counts(), "0 0 5 2") << inlineData;
+    clear();
+    close();
+  }
+}
+
+TEST_F(OperationCounts, CountWhatExpires) {
+  open();
+  putMany(3);
+  clock.advance(1001);
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_EQ(counts(), "0 0 3 3");
+}
+
+TEST_F(OperationCounts, DoNotTakeARemovalOrAClearForAnEviction) {
+  open();
+  putMany(3);
+  drop("key0");
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_EQ(counts(), "0 0 3 0");
+}
+
+TEST_F(OperationCounts, CountWhatAPruneOfADiskCacheTakes) {
+  const auto cache =
+      DiskCache::createDiskCache(storePath(), directory.file("temporary"), "larder", {}, 1000, 20, 0, false, queues,
+                                 nullptr, trash, nullptr, reporter, nullptr, files, nullptr, 2);
+  for (const char* const key : {"a", "b", "c", "d", "e"}) cache->store(key, test::Bytes(10));
+  settle();
+  cache->pruneBackToNormal(onSuccess(), onError(), false);
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_EQ(cache->operationCounts().evictions, 3U);
+}
+
+TEST_F(OperationCounts, AreThereAfterInvalidation) {
+  open();
+  put("key", "value");
+  auto future = store->invalidateWithFuture();
+  settle();
+  EXPECT_EQ(counts(), "0 0 1 0");
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar
