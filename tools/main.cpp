@@ -9,6 +9,8 @@
 #include "Console.h"
 #include "InputError.h"
 #include "demo/Demo.h"
+#include "inspect/Inspect.h"
+#include "verify/Verify.h"
 
 namespace {
 
@@ -28,10 +30,12 @@ void keepLogOffTheTerminal(const char* program) {
 }
 
 void describe(CLI::App& app) {
-  app.description("Cellar manages an application's storage on a device. This program shows it at work.");
+  app.description(
+      "Cellar manages an application's storage on a device. This program shows it at work, and looks into directories\n"
+      "that it has filled.");
   app.footer(
-      "Example:\n  cellar demo ~/Pictures\n\nExit status: 0 when all checks passed, 1 when one failed, 2 for "
-      "usage and input errors.");
+      "Examples:\n  cellar demo ~/Pictures\n  cellar inspect /tmp/cellar-demo\n\nExit status: 0 when all is well, 1 "
+      "when something was found, 2 for usage and input errors.");
   app.set_version_flag("--version", kVersion);
   app.require_subcommand(1);
 }
@@ -63,7 +67,10 @@ int runProgram(int argc, char** argv) {
   demoOptions.directory = "/usr/share";
   app.name("cellar");
   describe(app);
-  addDemo(app, demoOptions);
+  int status = kPassed;
+  const CLI::App* const demo = addDemo(app, demoOptions);
+  tools::addInspectCommand(app, status);
+  tools::addVerifyCommand(app, status);
   try {
     app.parse(argc, argv);
   } catch (const CLI::Success& wish) {
@@ -75,6 +82,7 @@ int runProgram(int argc, char** argv) {
     }
     return report(std::string(error.what()) + " (see cellar --help)");
   }
+  if (!demo->parsed()) return status;
   tools::Console console = tools::Console::standardOutput();
   return tools::runDemo(demoOptions, console) ? kPassed : kFailed;
 }

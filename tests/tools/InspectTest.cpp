@@ -1,0 +1,267 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <nlohmann/json.hpp>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "Console.h"
+#include "inspect/Survey.h"
+#include "inspect/SurveyJson.h"
+#include "inspect/SurveyText.h"
+#include "storage/ConfiguredStores.h"
+#include "storage/Layout.h"
+#include "tools/StoredData.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+namespace {
+
+using test::StoredData;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using testing::Not;
+using testing::UnorderedElementsAre;
+
+constexpr std::int32_t kDay = 86400;
+const std::string kThumbs = "caches/_sessionlessStore/thumbs_250_v1";
+const std::string kDrafts = "documents/_store_alice/drafts_v1";
+const std::string kWeb = "caches/_sessionlessStore/web_250_v1";
+
+const char* const kConfiguration = R"({
+  "media": { "area": "caches", "session_scoped": false, "max_size": "1KB", "prune_interval": "1 hours", "stores": {
+    "thumbs": { "type": "disk_cache", "lru_size_limit": "100B", "survival_size": "50B", "stale_age": "30 days" },
+    "web": { "type": "unmanaged", "is_cache": true, "max_size": "400B" } } },
+  "user": { "area": "documents", "session_scoped": true, "stores": {
+    "drafts": { "type": "pkvs", "has_version": true, "inline_data": true, "capacity": 4, "stale_age": "1 years" } } }
+})";
+
+class Inspecting : public testing::Test {
+ protected:
+  void makeRoot() {
+    data_.putItem(kThumbs, "old", std::string(80, 'o'), 40 * kDay);
+    data_.putItem(kThumbs, "young", std::string(30, 'y'), 60);
+    data_.putItem(kThumbs, "middle", std::string(50, 'm'), 2 * kDay);
+    data_.putInline(kDrafts, "letter", "dear", 3600);
+    data_.putFile(kWeb + "/deep/page.html", std::string(200, 'h'));
+    std::filesystem::create_directories(data_.path("caches/_sessionlessStore/tmp"));
+  }
+
+  Survey look(const std::string& below = "") {
+    return makeSurvey(findLayout(data_.path(below)), configured_, 2, StoredData::kNow, [](std::uint64_t) {});
+  }
+
+  nlohmann::ordered_json json() { return surveyAsJson(look()); }
+
+  static const StoreSurvey& storeIn(const Survey& survey, const std::string& path) {
+    for (const ManagerSurvey& manager : survey.managers) {
+      for (const StoreSurvey& store : manager.stores) {
+        if (store.path == path) return store;
+      }
+    }
+    throw std::out_of_range(path);
+  }
+
+  void configure() { configured_ = ConfiguredStores(data_.directory().write("configuration.json", kConfiguration)); }
+
+  static std::vector<std::string> keysOf(const std::vector<ItemFigures>& items) {
+    std::vector<std::string> keys;
+    for (const ItemFigures& item : items) keys.push_back(item.key);
+    return keys;
+  }
+
+  // "path kind"
+  static std::vector<std::string> leftoversOf(const Survey& survey) {
+    std::vector<std::string> lines;
+    for (const Leftover& leftover : survey.leftovers) lines.push_back(leftover.path + " " + textOf(leftover.kind));
+    return lines;
+  }
+
+  std::string text() {
+    std::ostringstream stream;
+    Console console(stream, false, false);
+    printSurvey(look(), console);
+    return stream.str();
+  }
+
+  StoredData data_;
+  ConfiguredStores configured_;
+};
+
+TEST_F(Inspecting, ChangesNoByteAndNoDateOfAnything) {
+  makeRoot();
+  data_.killWhileWriting(kThumbs, "half-written");
+  data_.putFile(kWeb + "/_cellar_extended_attributes", "{\"qzDirectorySizeCalculationSize\":7}");
+  data_.makeReadingVisible();
+  configure();
+  const auto before = data_.trace();
+  EXPECT_EQ(storeIn(look(), kThumbs).items, 4U);
+  EXPECT_THAT(text(), HasSubstr("thumbs_250_v1"));
+  EXPECT_EQ(data_.trace(), before);
+}
+
+TEST_F(Inspecting, CountsItemsAndBytesAsRecordedHeldAndAllocated) {
+  makeRoot();
+  data_.putRecord(kThumbs, {"lost", "lost", 7, false, StoredData::kNow, StoredData::kNow, nullptr});
+  const Survey survey = look();
+  const StoreSurvey& thumbs = storeIn(survey, kThumbs);
+  EXPECT_EQ(thumbs.kind, StoreKind::Keyed);
+  EXPECT_EQ(thumbs.items, 4U);
+  EXPECT_EQ(thumbs.recordedBytes, 167U);
+  EXPECT_EQ(thumbs.files, 3U);
+  EXPECT_EQ(thumbs.fileBytes, 160U);
+  EXPECT_GT(thumbs.manifestBytes, 4096U);
+  EXPECT_GE(thumbs.allocatedBytes, thumbs.manifestBytes);
+  const StoreSurvey& drafts = storeIn(survey, kDrafts);
+  EXPECT_EQ(drafts.files, 0U);
+  EXPECT_EQ(drafts.inlineBytes, 4U);
+  EXPECT_EQ(drafts.recordedBytes, 4U);
+}
+
+TEST_F(Inspecting, MeasuresAnUnmanagedStoreAndReadsTheSizeThatWasKept) {
+  makeRoot();
+  EXPECT_EQ(storeIn(look(), kWeb).recordedBytes, std::nullopt);
+  data_.putFile(kWeb + "/_cellar_extended_attributes", "{\"qzDirectorySizeCalculationSize\":7}");
+  const Survey survey = look();
+  const StoreSurvey& web = storeIn(survey, kWeb);
+  EXPECT_EQ(web.kind, StoreKind::Unmanaged);
+  EXPECT_EQ(web.recordedBytes, 7U);
+  EXPECT_EQ(web.fileBytes, 200U);
+  EXPECT_EQ(web.items, 1U);
+  EXPECT_THAT(keysOf(web.largest), ElementsAre("deep/page.html"));
+}
+
+TEST_F(Inspecting, NamesTheLargestAndWhatGoesFirstUpToTop) {
+  makeRoot();
+  const Survey survey = look();
+  EXPECT_THAT(keysOf(storeIn(survey, kThumbs).largest), ElementsAre("old", "middle"));
+  EXPECT_THAT(keysOf(storeIn(survey, kThumbs).nextToGo), ElementsAre("old", "middle"));
+  EXPECT_EQ(storeIn(survey, kThumbs).itemsToPrune, std::nullopt);
+  EXPECT_EQ(storeIn(survey, kThumbs).oldestAccess, StoredData::kNow - 40 * kDay);
+  EXPECT_EQ(storeIn(survey, kThumbs).newestAccess, StoredData::kNow - 60);
+}
+
+TEST_F(Inspecting, KnowsLimitsAndWhatIsStaleFromTheConfiguration) {
+  makeRoot();
+  configure();
+  const Survey survey = look();
+  const StoreSurvey& thumbs = storeIn(survey, kThumbs);
+  EXPECT_EQ(thumbs.kind, StoreKind::DiskCache);
+  EXPECT_EQ(thumbs.identifier, "thumbs");
+  EXPECT_EQ(thumbs.limitBytes, 100U);
+  EXPECT_EQ(thumbs.survivalBytes, 50U);
+  EXPECT_EQ(thumbs.staleItems, 1U);
+  EXPECT_EQ(thumbs.staleBytes, 80U);
+  EXPECT_EQ(thumbs.itemsToPrune, 1U);  // 160 bytes, of which the oldest 80 bring it below 100
+  EXPECT_EQ(thumbs.bytesToPrune, 80U);
+  EXPECT_EQ(storeIn(survey, kDrafts).capacity, 4U);
+  EXPECT_EQ(storeIn(survey, kWeb).limitBytes, 400U);
+  EXPECT_EQ(survey.managers.at(0).name, "media");
+  EXPECT_EQ(survey.managers.at(0).limitBytes, 1024U);
+  EXPECT_EQ(survey.managers.at(0).countedBytes, 160U);
+  EXPECT_THAT(survey.leftovers, IsEmpty());
+}
+
+TEST_F(Inspecting, SaysHowFullThingsAre) {
+  makeRoot();
+  configure();
+  const auto document = json();
+  const auto& media = document["managers"][0];
+  EXPECT_EQ(media["fill"], 0.1563);
+  EXPECT_EQ(media["stores"][0]["fill"], 1.6);
+  EXPECT_EQ(media["stores"][1]["fill"], 0.5);
+  EXPECT_EQ(document["managers"][1]["stores"][0]["fill"], 0.25);
+}
+
+TEST_F(Inspecting, WithoutAConfigurationTakesTheLowerVersionOfANameForALeftover) {
+  data_.makeStore("caches/_sessionlessStore/thumbs_v9");
+  data_.makeStore("caches/_sessionlessStore/thumbs_v10");
+  data_.makeStore("caches/_sessionlessStore/other_v1");
+  EXPECT_THAT(leftoversOf(look()), ElementsAre("caches/_sessionlessStore/thumbs_v9 other_version"));
+}
+
+TEST_F(Inspecting, WithAConfigurationTakesOtherVersionsOlderTagsAndUnknownNamesForLeftovers) {
+  makeRoot();
+  configure();
+  data_.putItem("caches/_sessionlessStore/thumbs_249_v1", "older", "x", 50 * kDay);
+  data_.putItem("documents/_store_alice/drafts_v2", "another", "x");
+  data_.putFile("documents/_store_alice/forgotten/file", "x");
+  EXPECT_THAT(leftoversOf(look()), UnorderedElementsAre("caches/_sessionlessStore/thumbs_249_v1 other_version",
+                                                        "documents/_store_alice/drafts_v2 other_version",
+                                                        "documents/_store_alice/forgotten not_configured"));
+}
+
+TEST_F(Inspecting, TakesAllSessionsButTheOneUsedLastForLeftovers) {
+  makeRoot();
+  data_.putItem("documents/_store_bob/drafts_v1", "letter", "x", 9 * kDay);
+  EXPECT_THAT(leftoversOf(look()), ElementsAre("documents/_store_bob/drafts_v1 other_session"));
+}
+
+TEST_F(Inspecting, FindsTemporaryFilesTrashAndQuarantine) {
+  makeRoot();
+  EXPECT_THAT(leftoversOf(look()), IsEmpty());
+  data_.putFile("caches/_sessionlessStore/tmp/half", "12345");
+  data_.putFile("trash/0123/deep/file", "123");
+  data_.putFile("documents/_cellar_quarantine/_store_alice/drafts_v1/stray", "1");
+  const Survey survey = look();
+  EXPECT_THAT(leftoversOf(survey), UnorderedElementsAre("caches/_sessionlessStore/tmp temporary", "trash trash",
+                                                        "documents/_cellar_quarantine quarantine"));
+  const auto document = surveyAsJson(survey);
+  EXPECT_EQ(document["totals"]["leftover_bytes"], 9);
+  EXPECT_EQ(document["totals"]["stores"], 3);
+}
+
+TEST_F(Inspecting, SortsAgesAndSizesIntoBuckets) {
+  makeRoot();
+  const auto document = json();
+  std::vector<std::string> ages;
+  for (const auto& bucket : document["ages"]) {
+    if (bucket["items"] > 0) ages.push_back(bucket["label"].get<std::string>() + ": " + bucket["bytes"].dump());
+  }
+  // The page is as old as this test.
+  EXPECT_THAT(ages, ElementsAre("< 1 hour: 230", "< 1 day: 4", "< 1 week: 50", "< 90 days: 80"));
+  EXPECT_EQ(document["sizes"][0]["items"], 5);
+}
+
+TEST_F(Inspecting, GoesOnBesideADamagedManifest) {
+  makeRoot();
+  data_.putFile(kThumbs + "/manifest_v1.sqlite", std::string(5000, 'x'));
+  const Survey survey = look();
+  const StoreSurvey& thumbs = storeIn(survey, kThumbs);
+  EXPECT_THAT(thumbs.damages, Not(IsEmpty()));
+  EXPECT_EQ(thumbs.recordedBytes, std::nullopt);
+  EXPECT_EQ(thumbs.fileBytes, 160U);
+  EXPECT_EQ(storeIn(survey, kDrafts).items, 1U);
+  EXPECT_THAT(text(), HasSubstr("thumbs_250_v1: the manifest is damaged: "));
+}
+
+TEST_F(Inspecting, KeepsKeysOfAnyBytesInTheirPlace) {
+  data_.putItem(kThumbs, "line\nbreak\x1b[2J", "x");
+  EXPECT_THAT(text(), HasSubstr("line\\x0abreak\\x1b[2J"));
+  data_.putItem(kThumbs, "\xff\xfe", "x");
+  EXPECT_NO_THROW((void)json().dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace));
+}
+
+TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
+  makeRoot();
+  const auto document = json();
+  const auto keysOf = [](const nlohmann::ordered_json& object) {
+    std::string keys;
+    for (const auto& member : object.items()) keys += member.key() + " ";
+    return keys;
+  };
+  EXPECT_EQ(keysOf(document), "root depth inspected_at totals managers leftovers ages sizes ");
+  EXPECT_EQ(keysOf(document["totals"]),
+            "stores items held_bytes manifest_bytes allocated_bytes leftover_bytes leftover_allocated_bytes ");
+  EXPECT_EQ(keysOf(document["managers"][0]), "path directory name area session limit_bytes counted_bytes fill stores ");
+  EXPECT_EQ(keysOf(document["managers"][0]["stores"][0]),
+            "path directory identifier kind leftover damages items recorded_bytes files file_bytes inline_bytes "
+            "manifest_bytes allocated_bytes limit_bytes survival_bytes capacity stale_age fill oldest_access "
+            "newest_access stale_items stale_bytes items_to_prune bytes_to_prune next_to_go largest ages sizes ");
+  EXPECT_EQ(keysOf(document["managers"][0]["stores"][0]["largest"][0]), "key bytes last_access inline ");
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,29 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+
+#include "inspect/Survey.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+struct ConfiguredStore;
+struct StorePlace;
+
+// What of a store's surroundings its figures need.
+struct StoreContext {
+  std::string root;
+  std::string temporaryDirectory;  // for the copy of a manifest
+  std::size_t top;
+  std::int64_t now;
+  OnFile onFile;
+};
+
+// Looks at one store's directory.
+StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configured, const StoreContext& context);
+
+// Files of a tree that is no store.
+void measureTree(const std::string& path, Leftover& leftover, const OnFile& onFile);
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,109 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+class ConfiguredStores;
+struct Layout;
+
+// A part of the items, by age or by size.
+struct Bucket {
+  std::string label;
+  std::uint64_t items = 0;
+  std::uint64_t bytes = 0;
+};
+
+struct ItemFigures {
+  std::string key;  // of a store with keys; of an unmanaged one the path of the file
+  std::uint64_t bytes = 0;
+  std::int64_t lastAccess = 0;  // seconds since the Unix epoch
+  bool isInline = false;
+};
+
+enum class StoreKind { Unmanaged, Keyed, KeyValue, DiskCache };  // Keyed: one of the two after it, nothing says which
+
+enum class LeftoverKind { OtherVersion, OtherSession, NotConfigured, Temporary, Trash, Quarantine };
+
+// What one store's directory holds. Dates are of the last access for items with records, else of the last change.
+struct StoreSurvey {
+  std::string path;  // below the root
+  std::string name;  // of the directory
+  std::string identifier;
+  StoreKind kind = StoreKind::Unmanaged;
+  std::optional<LeftoverKind> leftover;
+  std::vector<std::string> damages;  // of the manifest: the figures below are of the files then
+
+  std::uint64_t items = 0;
+  std::optional<std::uint64_t> recordedBytes;  // by the records, or by the kept result of a measurement
+  std::uint64_t files = 0;                     // of values
+  std::uint64_t fileBytes = 0;
+  std::uint64_t inlineBytes = 0;
+  std::uint64_t manifestBytes = 0;  // with its companions
+  std::uint64_t allocatedBytes = 0;
+
+  std::optional<std::uint64_t> limitBytes;
+  std::optional<std::uint64_t> survivalBytes;
+  std::optional<std::uint64_t> capacity;  // items
+  std::optional<std::uint64_t> staleAge;  // seconds
+
+  std::optional<std::int64_t> oldestAccess;
+  std::optional<std::int64_t> newestAccess;
+  std::optional<std::uint64_t> staleItems;
+  std::optional<std::uint64_t> staleBytes;
+
+  std::vector<ItemFigures> largest;
+  std::vector<ItemFigures> nextToGo;          // in the order of a prune, of stores with keys
+  std::optional<std::uint64_t> itemsToPrune;  // of a disk cache with a limit: what a prune would take now
+  std::optional<std::uint64_t> bytesToPrune;
+
+  std::vector<Bucket> ages;
+  std::vector<Bucket> sizes;
+
+  std::uint64_t heldBytes() const { return fileBytes + inlineBytes; }  // of values
+};
+
+struct ManagerSurvey {
+  std::string path;  // below the root, ".." above a store that stands by itself
+  std::string directory;
+  std::string name;  // by the configuration
+  std::string area;
+  std::string session;
+  bool isSessionless = false;
+  std::optional<std::uint64_t> limitBytes;
+  std::uint64_t countedBytes = 0;  // of its stores with keys, which is what counts for the limit
+  std::vector<StoreSurvey> stores;
+};
+
+struct Leftover {
+  std::string path;  // below the root
+  LeftoverKind kind;
+  std::uint64_t files = 0;
+  std::uint64_t bytes = 0;
+  std::uint64_t allocatedBytes = 0;
+};
+
+struct Survey {
+  std::string root;
+  std::string depth;         // "root", "area", "manager", "store" or "empty"
+  std::int64_t inspectedAt;  // seconds since the Unix epoch
+  std::vector<ManagerSurvey> managers;
+  std::vector<Leftover> leftovers;
+};
+
+using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each file that is looked at
+
+// Looks at everything in the layout and changes none of it. `top`: how many of the largest items, and of the next to
+// go, are named for each store. Throws `InputError` for what cannot be read.
+Survey makeSurvey(const Layout& layout, const ConfiguredStores& configured, std::size_t top, std::int64_t now,
+                  const OnFile& onFile);
+
+const char* textOf(StoreKind kind);
+const char* textOf(LeftoverKind kind);
+
+}  // namespace velmora::mobile::xplat::cellar::tools

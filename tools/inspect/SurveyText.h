@@ -1,0 +1,12 @@
+#pragma once
+
+#include "inspect/Survey.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+class Console;
+
+// The survey for people.
+void printSurvey(const Survey& survey, Console& console);
+
+}  // namespace velmora::mobile::xplat::cellar::tools

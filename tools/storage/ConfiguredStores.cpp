@@ -1,0 +1,93 @@
+#include "storage/ConfiguredStores.h"
+
+#include <algorithm>
+#include <array>
+#include <exception>
+
+#include "InputError.h"
+#include "JsonValue.h"
+#include "TextFile.h"
+#include "storage/Layout.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+constexpr std::array<const char*, 3> kAreaNames = {"caches", "documents", "shared"};
+
+bool isDigit(char character) { return character >= '0' && character <= '9'; }
+
+// An area of another name is a host's own way to place things, and may be any of them.
+bool isArea(const std::string& directoryName, Area area) {
+  const auto found = std::find(kAreaNames.begin(), kAreaNames.end(), directoryName);
+  return found == kAreaNames.end() || found - kAreaNames.begin() == static_cast<int>(area);
+}
+
+// Whether the part of a name between the store's own and its version holds the locale and the version tag that belong
+// there: "_en_US", "_250", "_en_US_250".
+bool fits(const std::string& middle, const StoreDefinition& store) {
+  const auto parts = std::count(middle.begin(), middle.end(), '_');
+  const int needed = (store.localeSensitive ? 2 : 0) + (store.hasVersion ? 0 : 1);
+  if (needed == 0) return middle.empty();
+  return parts >= needed && middle.front() == '_';
+}
+
+bool fits(const VersionedName& name, const StoreDefinition& store) {
+  if (name.version.empty() || name.stem.compare(0, store.name.size(), store.name) != 0) return false;
+  return fits(name.stem.substr(store.name.size()), store);
+}
+
+std::vector<std::shared_ptr<const StoreManagerDefinition>> managersIn(const std::string& text) {
+  const Configuration configuration(text);
+  std::vector<std::shared_ptr<const StoreManagerDefinition>> managers;
+  const JsonValue document = JsonValue::parse(text);
+  for (const auto& member : document.items()) managers.push_back(configuration.getManager(member.key()));
+  return managers;
+}
+
+}  // namespace
+
+ConfiguredStores::ConfiguredStores(const std::string& file) {
+  const std::string text = readTextFile(file);
+  try {
+    managers_ = managersIn(text);
+  } catch (const std::exception& error) {
+    throw InputError("cannot use the configuration '" + file + "': " + error.what());
+  }
+}
+
+bool ConfiguredStores::isEmpty() const { return managers_.empty(); }
+
+std::vector<std::shared_ptr<const StoreManagerDefinition>> ConfiguredStores::managersOf(
+    const ManagerPlace& place) const {
+  std::vector<std::shared_ptr<const StoreManagerDefinition>> found;
+  for (const auto& manager : managers_) {
+    const bool isScope = place.name.empty() || manager->sessionScoped != place.isSessionless();
+    if (isScope && isArea(place.area, manager->area)) found.push_back(manager);
+  }
+  return found;
+}
+
+ConfiguredStore ConfiguredStores::find(const ManagerPlace& place, const std::string& directoryName) const {
+  const VersionedName name(directoryName);
+  ConfiguredStore found;
+  for (const auto& manager : managersOf(place)) {
+    for (const auto& [identifier, store] : manager->stores) {
+      if (!fits(name, *store)) continue;
+      if (found.definition != nullptr && found.definition->name.size() >= store->name.size()) continue;
+      found = {manager, identifier, store, name.version == std::to_string(store->version)};
+    }
+  }
+  return found;
+}
+
+VersionedName::VersionedName(const std::string& directoryName) : stem(directoryName) {
+  const auto mark = directoryName.rfind("_v");
+  if (mark == std::string::npos || mark + 2 == directoryName.size()) return;
+  const std::string digits = directoryName.substr(mark + 2);
+  if (!std::all_of(digits.begin(), digits.end(), isDigit)) return;
+  stem = directoryName.substr(0, mark);
+  version = digits;
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,50 @@
+#pragma once
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "Configuration.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+struct ManagerPlace;
+
+// Which definition a directory belongs to. Version tag and locale are the application's and stand in no document, so a
+// name matches whatever they are.
+struct ConfiguredStore {
+  std::shared_ptr<const StoreManagerDefinition> manager;
+  std::string identifier;  // empty: no store of that name is configured
+  std::shared_ptr<const StoreDefinition> definition;
+  bool hasItsVersion = false;  // the version in the name is the configured one
+};
+
+class ConfiguredStores {
+ public:
+  // Nothing is configured.
+  ConfiguredStores() = default;
+
+  // Reads the document. Throws `InputError`, naming the file, for one that cannot be read or used.
+  explicit ConfiguredStores(const std::string& file);
+
+  bool isEmpty() const;
+
+  // The managers that may keep their stores in that directory.
+  std::vector<std::shared_ptr<const StoreManagerDefinition>> managersOf(const ManagerPlace& place) const;
+
+  // Of several stores that fit, the one with the longest name.
+  ConfiguredStore find(const ManagerPlace& place, const std::string& directoryName) const;
+
+ private:
+  std::vector<std::shared_ptr<const StoreManagerDefinition>> managers_;
+};
+
+// "thumbs_250" and 2 for "thumbs_250_v2"; the whole name and nothing for one without a version.
+struct VersionedName {
+  std::string stem;
+  std::string version;
+
+  explicit VersionedName(const std::string& directoryName);
+};
+
+}  // namespace velmora::mobile::xplat::cellar::tools

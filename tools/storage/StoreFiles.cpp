@@ -1,0 +1,37 @@
+#include "storage/StoreFiles.h"
+
+#include <algorithm>
+#include <array>
+
+#include "AttributeStore.h"
+#include "ManifestSnapshot.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+constexpr std::array<const char*, 4> kSuffixes = {"", "-wal", "-shm", "-journal"};
+
+using OnEntry = std::function<void(const std::string& below, const Entry&)>;
+
+void walk(const std::string& directory, const std::string& prefix, const OnEntry& onEntry) {
+  for (const Entry& entry : listUntouched(directory)) {
+    onEntry(prefix + entry.name, entry);
+    if (entry.type == Entry::Type::Directory) walk(directory + "/" + entry.name, prefix + entry.name + "/", onEntry);
+  }
+}
+
+}  // namespace
+
+bool isManifestFile(const std::string& name) {
+  return std::any_of(kSuffixes.begin(), kSuffixes.end(),
+                     [&](const char* suffix) { return name == ManifestSnapshot::manifestName + suffix; });
+}
+
+bool isAttributesFile(const Entry& entry) {
+  return entry.type == Entry::Type::File && entry.name == AttributeStore::fileName;
+}
+
+void walkTree(const std::string& directory, const OnEntry& onEntry) { walk(directory, "", onEntry); }
+
+}  // namespace velmora::mobile::xplat::cellar::tools

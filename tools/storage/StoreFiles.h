@@ -1,0 +1,20 @@
+#pragma once
+
+#include <functional>
+#include <string>
+
+#include "storage/UntouchedFiles.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// Whether a file of that name (below the store's directory) is the manifest or one of SQLite's companions of it.
+bool isManifestFile(const std::string& name);
+
+// Whether it is where a directory's attributes are kept.
+bool isAttributesFile(const Entry& entry);
+
+// Every entry of a tree, a directory before what is in it, links not followed; each with its path below the tree.
+// Throws `FileUtilsIoException`.
+void walkTree(const std::string& directory, const std::function<void(const std::string& below, const Entry&)>& onEntry);
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,84 @@
+#include "verify/Verification.h"
+
+#include <exception>
+#include <filesystem>
+
+#include "InputError.h"
+#include "LarderException.h"
+#include "storage/Layout.h"
+#include "storage/Printable.h"
+#include "storage/TemporaryFolder.h"
+#include "verify/Quarantine.h"
+#include "verify/Repair.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+// Beside the managers' directories, or beside a store's that stands by itself.
+Quarantine quarantineFor(const Layout& layout, const ManagerPlace& manager) {
+  const bool standsByItself = layout.kind == Layout::Kind::Store && manager.name.empty();
+  return Quarantine(standsByItself ? manager.path : std::filesystem::path(manager.path).parent_path().string());
+}
+
+std::string reasonOf(const std::exception& error) {
+  if (const auto* own = dynamic_cast<const LarderException*>(&error)) return own->description();
+  return error.what();
+}
+
+class Verifier {
+ public:
+  Verifier(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine)
+      : layout_(layout), repair_(repair), onFile_(onFile), onLine_(onLine) {}
+
+  VerificationResult run() {
+    for (const ManagerPlace& manager : layout_.managers) {
+      for (const StorePlace& store : manager.stores) {
+        ++result_.stores;
+        settle(checkStore(store, temporary_.path(), onFile_), manager);
+        settle(checkAttributes(store.path), manager);
+      }
+    }
+    return result_;
+  }
+
+ private:
+  void settle(const Findings& findings, const ManagerPlace& manager) {
+    Repair repair(layout_.root, quarantineFor(layout_, manager));
+    for (const Finding& finding : findings) {
+      ++result_.findings;
+      std::string line = printable(relativeTo(layout_.root, finding.directory)) + ": " + describe(finding);
+      if (repair_) line += "; " + mend(repair, finding);
+      onLine_(line);
+    }
+  }
+
+  std::string mend(Repair& repair, const Finding& finding) {
+    try {
+      std::string done = repair.mend(finding);
+      ++result_.repaired;
+      return done;
+    } catch (const std::exception& error) {
+      return "NOT REPAIRED: " + printable(reasonOf(error));
+    }
+  }
+
+  const Layout& layout_;
+  const bool repair_;
+  const OnFile& onFile_;
+  const OnLine& onLine_;
+  const TemporaryFolder temporary_;
+  VerificationResult result_;
+};
+
+}  // namespace
+
+VerificationResult verify(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine) {
+  try {
+    return Verifier(layout, repair, onFile, onLine).run();
+  } catch (const LarderException& error) {
+    throw InputError(error.description());
+  }
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,73 @@
+#include "verify/Verify.h"
+
+#include <CLI/CLI.hpp>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Console.h"
+#include "Format.h"
+#include "storage/FileProgress.h"
+#include "storage/Layout.h"
+#include "verify/Verification.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+constexpr int kSound = 0;
+constexpr int kFound = 1;
+
+struct VerifyOptions {
+  std::string root;
+  bool repair = false;
+};
+
+std::string verdictOf(const VerificationResult& result, bool repair) {
+  const std::string stores = formatCount(result.stores, "store", "stores");
+  if (result.findings == 0) return "Nothing found in " + stores;
+  std::string verdict = formatCount(result.findings, "finding", "findings") + " in " + stores;
+  if (repair) verdict += ", " + formatCount(result.repaired) + " repaired";
+  return verdict;
+}
+
+int runVerify(const VerifyOptions& options) {
+  Console console = Console::standardOutput();
+  const Layout layout = findLayout(options.root);
+  auto progress = std::make_unique<FileProgress>(console, layout.root);
+  const VerificationResult result = verify(
+      layout, options.repair, [&progress](std::uint64_t bytes) { progress->advance(bytes); },
+      [&console](const std::string& line) {
+        if (console.isTerminal()) console.rewriteLine("");
+        console.raw(line + "\n");
+      });
+  progress.reset();
+  console.raw(verdictOf(result, options.repair) + "\n");
+  const std::uint64_t remaining = options.repair ? result.findings - result.repaired : result.findings;
+  return remaining == 0 ? kSound : kFound;
+}
+
+}  // namespace
+
+void addVerifyCommand(CLI::App& app, int& status) {
+  const auto options = std::make_shared<VerifyOptions>();
+  CLI::App* const verify = app.add_subcommand("verify", "Hold the records of stores against their files, and repair");
+  verify->add_option("ROOT", options->root, "The directory: a root with its areas, an area, a manager or a store")
+      ->required();
+  verify->add_flag("--repair", options->repair, "Mend what is found, without losing a value");
+  verify->footer(
+      "Each finding is one line: records without a file, files without a record, sizes that differ, what a write that\n"
+      "was interrupted left, damaged manifests, attributes that are not JSON. Without --repair nothing is changed.\n\n"
+      "--repair gives a record the size of its file, and removes a record without a value. A file without a record\n"
+      "goes to \"_cellar_quarantine\" beside the managers' directories, and so does a damaged manifest, with the "
+      "files\n"
+      "that nobody can tell apart any more: the store begins anew. Nothing is deleted but records.\n"
+      "Stop the application first: a store that is running is not to be repaired, and what it is just writing looks\n"
+      "like a finding.\n\n"
+      "Exit status: 0 when nothing was found or everything is repaired, 1 when something remains, 2 for usage and\n"
+      "input errors.\n\n"
+      "Example:\n  cellar verify /tmp/cellar-demo --repair");
+  verify->callback([options, &status] { status = runVerify(*options); });
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools
