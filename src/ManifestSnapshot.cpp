@@ -101,6 +101,13 @@ std::unordered_map<std::string, std::uint64_t> inlineSizesIn(const std::string& 
   return sizes;
 }
 
+// What SQLite says names the file, which is the copy: nobody else knows that.
+std::string withoutPath(std::string text, const std::string& path) {
+  const std::string place = " (" + path + ")";
+  const auto found = text.find(place);
+  return found == std::string::npos ? text : text.erase(found, place.size());
+}
+
 }  // namespace
 
 const std::string ManifestSnapshot::manifestName = "manifest_v1.sqlite";
@@ -149,7 +156,7 @@ std::vector<std::string> ManifestSnapshot::damages() const {
     while (cursor.next()) lines.push_back(cursor.get<std::string>(0));
     if (lines == std::vector<std::string>{"ok"}) lines.clear();
   } catch (const SQLiteStoreCorruptedException& error) {
-    lines.emplace_back(error.description());
+    lines.push_back(withoutPath(error.description(), path_));
   }
   if (!lines.empty()) return lines;
   try {
@@ -157,7 +164,7 @@ std::vector<std::string> ManifestSnapshot::damages() const {
   } catch (const ManifestPersistenceException& error) {
     const bool isForeign = dynamic_cast<const ManifestCorruptedException*>(&error) != nullptr;
     if (!isForeign && error.code() != kStatementDoesNotFit) throw;
-    lines.emplace_back(error.description());
+    lines.push_back(withoutPath(error.description(), path_));
   }
   return lines;
 }

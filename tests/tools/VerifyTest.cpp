@@ -197,8 +197,7 @@ TEST_F(Verifying, PutsADamagedManifestIntoTheQuarantineWithItsValues) {
   data_.putFile(kThumbs + "/manifest_v1.sqlite-shm", "index");
   data_.putFile(kThumbs + "/_cellar_extended_attributes", "{}");
   const auto found = findings();
-  ASSERT_EQ(found.size(), 1U);
-  EXPECT_THAT(found.front(), testing::StartsWith("damaged manifest: SQLite Error #26: file is not a database"));
+  EXPECT_THAT(found, ElementsAre("damaged manifest: SQLite Error #26: file is not a database"));
   EXPECT_THAT(repairs(), ElementsAre(testing::EndsWith("; moved to " + kQuarantined +
                                                        "/manifest_v1.sqlite, with 1 file of values")));
   EXPECT_EQ(contentOf(kQuarantined + "/a"), "value");

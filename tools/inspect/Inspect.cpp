@@ -1,12 +1,16 @@
 #include "inspect/Inspect.h"
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
 #include <ctime>
-#include <iostream>
+#include <filesystem>
 #include <memory>
 #include <string>
 
 #include "Console.h"
+#include "InputError.h"
+#include "TextFile.h"
+#include "inspect/Page.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"
@@ -25,7 +29,18 @@ struct InspectOptions {
   std::string configuration;
   std::size_t top = 5;
   bool json = false;
+  std::string page;
 };
+
+// Looking must not change what is looked at.
+void requireOutside(const std::string& root, const std::string& page) {
+  namespace fs = std::filesystem;
+  std::error_code error;
+  const fs::path outer = fs::canonical(root, error);
+  const fs::path inner = fs::weakly_canonical(page, error);
+  const bool isInside = std::mismatch(outer.begin(), outer.end(), inner.begin(), inner.end()).first == outer.end();
+  if (!error && isInside) throw InputError("cannot write the page '" + page + "': it would lie in ROOT");
+}
 
 Survey survey(const InspectOptions& options, Console& console) {
   const ConfiguredStores configured =
@@ -36,13 +51,23 @@ Survey survey(const InspectOptions& options, Console& console) {
                     [&progress](std::uint64_t bytes) { progress.advance(bytes); });
 }
 
+std::string textOf(const nlohmann::ordered_json& json) {
+  return json.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+}
+
 int runInspect(const InspectOptions& options) {
+  const bool hasPage = !options.page.empty();
+  if (hasPage) {
+    requirePage();
+    requireOutside(options.root, options.page);
+  }
   Console console = Console::standardOutput();
   const Survey result = survey(options, console);
+  const std::string json = textOf(surveyAsJson(result));
+  if (hasPage) writeTextFile(options.page, pageOf(json));
   if (options.json) {
-    std::cout << surveyAsJson(result).dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace)
-              << std::endl;
-  } else {
+    console.raw(json + "\n");
+  } else if (!hasPage) {
     printSurvey(result, console);
   }
   return kDone;
@@ -63,13 +88,17 @@ void addInspectCommand(CLI::App& app, int& status) {
       ->type_name("N")
       ->capture_default_str();
   inspect->add_flag("--json", options->json, "Print everything for machines");
+  inspect
+      ->add_option("--html", options->page, "Write a page with charts to this file, which needs nothing beside itself")
+      ->type_name("FILE");
   inspect->footer(
       "Nothing is changed: manifests are read from copies, no log is checkpointed, no access date moves.\n\n"
       "Held is what the values' files and the inline values take, recorded what the manifest says, on disk what the\n"
       "file system has set aside. Version tag and locale stand in no configuration: of several directories of one\n"
       "store the one used last is taken to be the present one. Video priorities are the application's, too: without\n"
       "them items go by their last use.\n\n"
-      "Example:\n  cellar inspect /tmp/cellar-demo --config media-app.json --top 3");
+      "Examples:\n  cellar inspect /tmp/cellar-demo --config media-app.json --top 3\n"
+      "  cellar inspect /tmp/cellar-demo --html storage.html");
   inspect->callback([options, &status] { status = runInspect(*options); });
 }
 

@@ -14,8 +14,8 @@ namespace {
 // The path itself, or the next one of its kind that is free: "sunrise.jpg.1".
 fs::path freePath(const fs::path& wanted) {
   fs::path path = wanted;
-  for (int number = 1; fs::exists(fs::symlink_status(path)); ++number)
-    path = wanted.string() + "." + std::to_string(number);
+  int number = 0;
+  while (fs::exists(fs::symlink_status(path))) path = wanted.string() + "." + std::to_string(++number);
   return path;
 }
 
