@@ -24,6 +24,17 @@ std::string formatSize(std::uint64_t bytes) {
   return withOneDecimal(size / (kilo * kilo * kilo), "GB");
 }
 
+std::string formatWholeSize(std::uint64_t bytes) {
+  std::uint64_t number = bytes;
+  std::size_t unit = 0;
+  static constexpr const char* units[] = {" B", " KB", " MB", " GB"};
+  while (unit < 3 && number != 0 && number % 1024 == 0) {
+    number /= 1024;
+    ++unit;
+  }
+  return std::to_string(number) + units[unit];
+}
+
 std::string formatCount(std::uint64_t count) {
   std::string text = std::to_string(count);
   for (std::size_t end = text.size(); end > 3; end -= 3) text.insert(end - 3, ",");
@@ -39,6 +50,26 @@ std::string formatTime(std::chrono::nanoseconds duration) {
   if (milliseconds < 10) return withOneDecimal(milliseconds, "ms");
   if (milliseconds < 1000) return std::to_string(static_cast<int>(milliseconds)) + " ms";
   return withOneDecimal(milliseconds / 1000, "s");
+}
+
+std::string formatDuration(std::uint64_t seconds) {
+  struct Unit {
+    std::uint64_t seconds;
+    const char* singular;
+    const char* plural;
+  };
+  static constexpr Unit units[] = {{std::uint64_t{365} * 86400, "year", "years"},
+                                   {86400, "day", "days"},
+                                   {3600, "hour", "hours"},
+                                   {60, "minute", "minutes"},
+                                   {1, "second", "seconds"}};
+  std::string text;
+  for (const Unit& unit : units) {
+    const std::uint64_t count = seconds / unit.seconds;
+    seconds %= unit.seconds;
+    if (count > 0) text += (text.empty() ? "" : " ") + formatCount(count, unit.singular, unit.plural);
+  }
+  return text.empty() ? "0 seconds" : text;
 }
 
 std::string formatFiles(const TreeSize& size) {

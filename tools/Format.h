@@ -11,6 +11,9 @@ namespace velmora::mobile::xplat::cellar::tools {
 // "850 B", "1.2 KB", "12.0 MB": powers of 1024, as in the configuration.
 std::string formatSize(std::uint64_t bytes);
 
+// "850 B", "1536 KB", "12 MB": in the largest unit of which it is a whole number
+std::string formatWholeSize(std::uint64_t bytes);
+
 // "20,000"
 std::string formatCount(std::uint64_t count);
 
@@ -19,6 +22,9 @@ std::string formatCount(std::uint64_t count, const std::string& singular, const 
 
 // "0.3 ms", "45 ms", "1.2 s"
 std::string formatTime(std::chrono::nanoseconds duration);
+
+// "50 years", "1 day 12 hours", "90 seconds": whole units, as in the configuration
+std::string formatDuration(std::uint64_t seconds);
 
 // "1 file, 850 B"
 std::string formatFiles(const TreeSize& size);

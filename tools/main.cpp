@@ -8,6 +8,7 @@
 
 #include "Console.h"
 #include "InputError.h"
+#include "check/Check.h"
 #include "demo/Demo.h"
 #include "inspect/Inspect.h"
 #include "verify/Verify.h"
@@ -36,6 +37,11 @@ void describe(CLI::App& app) {
   app.footer(
       "Examples:\n  cellar demo ~/Pictures\n  cellar inspect /tmp/cellar-demo\n\nExit status: 0 when all is well, 1 "
       "when something was found, 2 for usage and input errors.");
+      "Cellar manages an application's storage on a device. This program shows it at work, and helps with its\n"
+      "configuration.");
+  app.footer(
+      "Examples:\n  cellar demo ~/Pictures\n  cellar check storage.json\n\nExit status: 0 when all is well, 1 when "
+      "something was found, 2 for usage and input errors.");
   app.set_version_flag("--version", kVersion);
   app.require_subcommand(1);
 }
@@ -71,6 +77,7 @@ int runProgram(int argc, char** argv) {
   const CLI::App* const demo = addDemo(app, demoOptions);
   tools::addInspectCommand(app, status);
   tools::addVerifyCommand(app, status);
+  tools::addCheckCommand(app, status);
   try {
     app.parse(argc, argv);
   } catch (const CLI::Success& wish) {

@@ -1,0 +1,350 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <sstream>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+#include "Configuration.h"
+#include "Console.h"
+#include "check/CheckReport.h"
+#include "check/ConfigurationDocument.h"
+#include "check/Faults.h"
+#include "check/KnownKeys.h"
+#include "check/Understood.h"
+#include "check/Warnings.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+namespace {
+
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using Lines = std::vector<std::string>;
+
+Lines linesOf(const Findings& findings) {
+  Lines lines;
+  for (const Finding& finding : findings) lines.push_back(finding.pointer + ": " + finding.text);
+  return lines;
+}
+
+Lines warningsOf(const std::string& text, const NameTags& tags = {}) {
+  const ConfigurationDocument document = parseConfigurationDocument(text);
+  EXPECT_THAT(linesOf(findFaults(document)), IsEmpty());
+  return linesOf(findWarnings(document, understand(document, tags)));
+}
+
+// Of a manager with these members.
+Lines ofManager(const std::string& members) { return warningsOf(R"({"m": {)" + members + "}}"); }
+
+// Of a store with these members, in a manager that has room.
+Lines ofStore(const std::string& members) {
+  return warningsOf(R"({"m": {"max_size": "3GB", "stores": {"s": {)" + members + "}}}}");
+}
+
+Lines ofCache(const std::string& members) {
+  return ofStore(R"("type": "disk_cache", "lru_size_limit": "10MB")" + (members.empty() ? "" : ", " + members));
+}
+
+Lines faultsOf(const std::string& text) { return linesOf(findFaults(parseConfigurationDocument(text))); }
+
+// --- Unknown and ignored keys ---
+
+TEST(CheckWarnings, AMisspeltKeyIsNamedWithTheNearestKnownOne) {
+  EXPECT_THAT(ofManager(R"("max_sise": "1MB")"), ElementsAre("/m/max_sise: unknown key; did you mean 'max_size'?"));
+  EXPECT_THAT(ofManager(R"("maxSize": "1MB")"), ElementsAre("/m/maxSize: unknown key; did you mean 'max_size'?"));
+  EXPECT_THAT(ofCache(R"("prune_stratgey": "lru")"),
+              ElementsAre("/m/stores/s/prune_stratgey: unknown key; did you mean 'prune_strategy'?"));
+  EXPECT_THAT(ofCache(R"("colour": "red")"), ElementsAre("/m/stores/s/colour: unknown key"));
+  EXPECT_THAT(ofManager(R"("area": "shared", "session_scoped": false)"), IsEmpty());
+}
+
+TEST(CheckWarnings, AKeyAtTheWrongLevelIsSaidToBelongToTheOther) {
+  EXPECT_THAT(ofManager(R"("lru_size_limit": "1MB")"),
+              ElementsAre("/m/lru_size_limit: unknown key; it is one of stores"));
+  EXPECT_THAT(ofCache(R"("prune_interval": "1 hours")"),
+              ElementsAre("/m/stores/s/prune_interval: unknown key; it is one of managers"));
+}
+
+TEST(CheckWarnings, AKeyThatTheTypeIgnoresIsNamed) {
+  EXPECT_THAT(ofStore(R"("type": "unmanaged", "stale_age": "1 days")"),
+              ElementsAre("/m/stores/s/stale_age: stores of type unmanaged ignore this key"));
+  EXPECT_THAT(ofStore(R"("type": "pkvs", "lru_size_limit": "1MB")"),
+              ElementsAre("/m/stores/s/lru_size_limit: stores of type pkvs ignore this key"));
+  EXPECT_THAT(
+      ofCache(R"("max_size": "1MB")"),
+      ElementsAre("/m/stores/s/max_size: stores of type disk_cache ignore this key; their limit is 'lru_size_limit'"));
+  EXPECT_THAT(ofStore(R"("type": "pkvs", "stale_age": "1 days", "inline_data": true, "capacity": 3)"), IsEmpty());
+}
+
+TEST(CheckWarnings, AKeyThatIsGivenTwiceIsNamed) {
+  EXPECT_THAT(ofManager(R"("max_size": "1MB", "max_size": "2MB")"),
+              ElementsAre("/m/max_size: stands here more than once; only the last counts"));
+  EXPECT_THAT(ofCache(R"("version": 1, "capacity": [{"version": 1}], "version": 2)"),
+              ElementsAre(R"(/m/stores/s/capacity: [{"version":1}] is no integer: the store has no capacity limit)",
+                          "/m/stores/s/version: stands here more than once; only the last counts"));
+}
+
+TEST(CheckWarnings, StoresThatAreNoObjectAreNamed) {
+  EXPECT_THAT(ofManager(R"("stores": [])"), ElementsAre("/m/stores: is no object: there are no stores"));
+  EXPECT_THAT(ofManager(R"("stores": {})"), IsEmpty());
+}
+
+// --- Values ---
+
+TEST(CheckWarnings, ASizeThatWrappedIsNamedWithWhatItHasBecome) {
+  EXPECT_THAT(ofManager(R"("max_size": "4GB")"),
+              ElementsAre("/m/max_size: '4GB' does not fit into 32 bits and has become 0 B"));
+  EXPECT_THAT(ofManager(R"("max_size": "5GB")"),
+              ElementsAre("/m/max_size: '5GB' does not fit into 32 bits and has become 1.0 GB"));
+  EXPECT_THAT(ofManager(R"("max_size": "-1B")"),
+              ElementsAre("/m/max_size: '-1B' does not fit into 32 bits and has become 4.0 GB"));
+  EXPECT_THAT(ofManager(R"("max_size": "4294967295B")"), IsEmpty());
+  EXPECT_THAT(ofManager(R"("max_size": "4095MB")"), IsEmpty());
+  EXPECT_THAT(ofStore(R"("type": "unmanaged", "max_size": "4097MB")"),
+              ElementsAre("/m/stores/s/max_size: '4097MB' does not fit into 32 bits and has become 1.0 MB"));
+  EXPECT_THAT(ofStore(R"("type": "disk_cache", "lru_size_limit": "8193MB", "survival_size": "4097MB")"),
+              ElementsAre("/m/stores/s/lru_size_limit: '8193MB' does not fit into 32 bits and has become 1.0 MB",
+                          "/m/stores/s/survival_size: '4097MB' does not fit into 32 bits and has become 1.0 MB"));
+}
+
+TEST(CheckWarnings, ADurationThatWrappedIsNamedWithWhatItHasBecome) {
+  EXPECT_THAT(ofStore(R"("type": "pkvs", "stale_age": "137 years")"),
+              ElementsAre("/m/stores/s/stale_age: '137 years' does not fit into 32 bits and has become 294 days 17 "
+                          "hours 31 minutes 44 seconds"));
+  EXPECT_THAT(ofStore(R"("type": "pkvs", "stale_age": "136 years")"), IsEmpty());
+  EXPECT_THAT(ofManager(R"("prune_interval": "50000 days")"),
+              ElementsAre("/m/prune_interval: '50000 days' does not fit into 32 bits and has become 289 days 17 hours "
+                          "31 minutes 44 seconds"));
+}
+
+TEST(CheckWarnings, AVersionThatWrappedIsNamed) {
+  EXPECT_THAT(ofCache(R"("version": -1)"),
+              ElementsAre("/m/stores/s/version: -1 does not fit into 32 bits and has become 4294967295"));
+  EXPECT_THAT(ofCache(R"("version": 4294967296)"),
+              ElementsAre("/m/stores/s/version: 4294967296 does not fit into 32 bits and has become 0"));
+  EXPECT_THAT(ofCache(R"("version": 4294967295)"), IsEmpty());
+}
+
+TEST(CheckWarnings, TextBehindTheUnitIsNamed) {
+  EXPECT_THAT(ofManager(R"("max_size": "20 MB or so")"),
+              ElementsAre("/m/max_size: 'or so' behind the unit counts for nothing"));
+  EXPECT_THAT(ofManager(R"("max_size": " 20  MB ")"), IsEmpty());
+}
+
+TEST(CheckWarnings, ACapacityThatIsNoIntegerOrNegativeIsNamed) {
+  EXPECT_THAT(ofCache(R"("capacity": "100")"),
+              ElementsAre("/m/stores/s/capacity: \"100\" is no integer: the store has no capacity limit"));
+  EXPECT_THAT(ofCache(R"("capacity": 1.5)"),
+              ElementsAre("/m/stores/s/capacity: 1.5 is no integer: the store has no capacity limit"));
+  EXPECT_THAT(ofCache(R"("capacity": -1)"),
+              ElementsAre("/m/stores/s/capacity: -1 is negative: the store has no capacity limit"));
+  EXPECT_THAT(ofCache(R"("capacity": 100)"), IsEmpty());
+}
+
+// --- Limits ---
+
+TEST(CheckWarnings, ACacheWithoutALimitIsNamed) {
+  EXPECT_THAT(ofStore(R"("type": "disk_cache")"),
+              ElementsAre("/m/stores/s/lru_size_limit: is 0 B: each round of pruning empties the cache"));
+  EXPECT_THAT(ofStore(R"("type": "disk_cache", "lru_size_limit": "1B")"), IsEmpty());
+  EXPECT_THAT(ofStore(R"("type": "unmanaged", "is_cache": true)"),
+              ElementsAre("/m/stores/s/max_size: is 0 B: the cache is emptied whenever it is opened"));
+  EXPECT_THAT(ofStore(R"("type": "unmanaged")"), IsEmpty());
+  EXPECT_THAT(ofStore(R"("type": "unmanaged", "is_cache": true, "max_size": "1B")"), IsEmpty());
+}
+
+TEST(CheckWarnings, ASurvivalSizeAboveTheLimitIsNamed) {
+  EXPECT_THAT(ofCache(R"("survival_size": "11MB")"),
+              ElementsAre("/m/stores/s/survival_size: 11.0 MB is more than the limit of 10.0 MB: a device short of "
+                          "space would keep more"));
+  EXPECT_THAT(ofCache(R"("survival_size": "10MB")"), IsEmpty());
+}
+
+TEST(CheckWarnings, TheVideoStrategyWithoutItsMetadataIsNamed) {
+  EXPECT_THAT(ofCache(R"("prune_strategy": "video_download")"),
+              ElementsAre("/m/stores/s/prune_strategy: video_download without the metadata_factory of that name: after "
+                          "a restart no item has a priority"));
+  EXPECT_THAT(ofCache(R"("prune_strategy": "video_download", "metadata_factory": "video_download")"), IsEmpty());
+}
+
+TEST(CheckWarnings, CachesThatTogetherExceedTheirManagersLimitAreNamed) {
+  const std::string stores = R"("stores": {"a": {"type": "disk_cache", "lru_size_limit": "6MB"},
+      "b": {"type": "unmanaged", "is_cache": true, "max_size": "4MB"}, "c": {"type": "unmanaged", "max_size": "9MB"}})";
+  EXPECT_THAT(
+      ofManager(R"("max_size": "9MB", )" + stores),
+      ElementsAre("/m/max_size: its caches may together have 10.0 MB, more than the manager's limit of 9.0 MB"));
+  EXPECT_THAT(ofManager(R"("max_size": "10MB", )" + stores), IsEmpty());
+}
+
+TEST(CheckWarnings, AManagerThatNeverPrunesIsNamedIfItHasWhatNeedsPruning) {
+  EXPECT_THAT(
+      ofManager(R"("prune_interval": "0 hours", "stores": {"a": {"type": "disk_cache", "lru_size_limit": "6MB"}})"),
+      ElementsAre("/m/prune_interval: is 0: the manager never prunes, and its disk caches grow without end"));
+  EXPECT_THAT(ofManager(R"("prune_interval": "0 hours", "stores": {"a": {"type": "pkvs"}})"), IsEmpty());
+  EXPECT_THAT(
+      ofManager(R"("prune_interval": "1 minutes", "stores": {"a": {"type": "disk_cache", "lru_size_limit": "6MB"}})"),
+      IsEmpty());
+}
+
+// --- Names ---
+
+TEST(CheckWarnings, ANameThatCannotBeAFileNameIsNamed) {
+  EXPECT_THAT(ofCache(R"("name": "a/b")"),
+              ElementsAre("/m/stores/s/name: 'a/b' holds a '/' and reaches outside the manager's directory"));
+  EXPECT_THAT(ofCache(R"("name": "")"), ElementsAre("/m/stores/s/name: the name is empty"));
+  EXPECT_THAT(ofCache("\"name\": \"a\\u0000b\""),
+              ElementsAre("/m/stores/s/name: the name holds a zero byte, at which the system cuts it off"));
+  EXPECT_THAT(ofManager(R"("stores": {"a/b": {"type": "pkvs"}})"),
+              ElementsAre("/m/stores/a~1b: 'a/b' holds a '/' and reaches outside the manager's directory"));
+  const std::string longest(255 - 4, 'x');  // with "__v1" behind it
+  EXPECT_THAT(ofCache(R"("name": ")" + longest + "\""), IsEmpty());
+  EXPECT_THAT(ofCache(R"("name": "x)" + longest + "\""),
+              ElementsAre("/m/stores/s/name: the directory's name has 256 bytes, more than the 255 that file systems "
+                          "take"));
+}
+
+TEST(CheckWarnings, StoresOfOneManagerThatShareADirectoryAreNamed) {
+  EXPECT_THAT(ofManager(R"("stores": {"a": {"type": "pkvs"}, "b": {"type": "pkvs", "name": "a"}})"),
+              ElementsAre("/m/stores/b: shares its directory a__v1 with /m/stores/a"));
+  // Two spellings of one directory.
+  const std::string text =
+      R"({"m": {"stores": {"a_250": {"type": "pkvs", "has_version": true}, "a": {"type": "pkvs"}}}})";
+  NameTags tags;
+  tags.versionTag = "250";
+  EXPECT_THAT(warningsOf(text, tags), ElementsAre("/m/stores/a: shares its directory a_250_v1 with /m/stores/a_250"));
+  tags.versionTag = "251";
+  EXPECT_THAT(warningsOf(text, tags), IsEmpty());
+}
+
+TEST(CheckWarnings, StoresOfOneNameInSeveralPlacesAreNamed) {
+  EXPECT_THAT(ofManager(R"("stores": {"a": {"type": "pkvs"}, "b": {"type": "pkvs", "name": "a", "version": 2}})"),
+              ElementsAre("/m/stores/b: has the name 'a' of /m/stores/a: events and log lines, which carry names, "
+                          "cannot tell them apart"));
+  EXPECT_THAT(ofManager(R"("stores": {"a": {"type": "pkvs"}, "b": {"type": "pkvs", "name": "c"}})"), IsEmpty());
+}
+
+TEST(CheckWarnings, ManagersThatShareADirectoryAreNamed) {
+  EXPECT_THAT(warningsOf(R"({"m": {}, "n": {}})"),
+              ElementsAre("/n: shares its directory caches/_store_% with /m: each cleans up the other's stores"));
+  EXPECT_THAT(warningsOf(R"({"m": {}, "n": {"session_scoped": false}, "o": {"area": "shared"}})"), IsEmpty());
+}
+
+// --- What the library refuses ---
+
+TEST(CheckFaults, EachIsNamedWithItsPlaceInTheParsersWords) {
+  EXPECT_THAT(
+      faultsOf(R"({"m": {"max_size": "20mb", "area": 3, "session_scoped": 1, "stores": {"a": {"type": "disk"}, "b": {},
+                   "c": {"type": "pkvs", "stale_age": "1 hour"}, "d": 7}}, "n": 4})"),
+      ElementsAre("/m/area: type must be string, but is number", "/m/max_size: Invalid unit 'mb', use B, KB, MB or GB.",
+                  "/m/session_scoped: type must be boolean, but is number",
+                  "/m/stores/a/type: Invalid type 'disk', use unmanaged, pkvs or disk_cache.",
+                  "/m/stores/b: has no 'type', use unmanaged, pkvs or disk_cache",
+                  "/m/stores/c/stale_age: Invalid unit 'hour', use minutes, hours, days or years.",
+                  "/m/stores/d: a store must be an object", "/n: a manager must be an object"));
+}
+
+TEST(CheckFaults, IdentifiersThatAreMetTwiceAreNamedWithTheirPlace) {
+  EXPECT_THAT(faultsOf(R"({"m": {}, "m": {}})"), ElementsAre("/m: stands here twice"));
+  EXPECT_THAT(faultsOf(R"({"m": {"stores": {"s": {"type": "pkvs"}, "s": {"type": "pkvs"}}}})"),
+              ElementsAre("/m/stores/s: stands here twice"));
+  EXPECT_THAT(faultsOf(R"({"m": {"stores": {"s": {"type": "pkvs"}}}, "n": {"stores": {"s": {"type": "pkvs"}}}})"),
+              ElementsAre("/n/stores/s: another manager has a store of this identifier"));
+}
+
+TEST(CheckFaults, ADocumentThatIsNoObjectIsOne) {
+  EXPECT_THAT(faultsOf("[]"), ElementsAre(": is no object of managers"));
+  EXPECT_THAT(faultsOf("{}"), IsEmpty());
+}
+
+TEST(CheckFaults, AreThereExactlyWhenTheLibraryRefuses) {
+  for (const char* const text :
+       {"{}", R"({"m": {}})", R"({"m": {"max_size": "1.5MB"}})", R"({"m": {"stores": {"a": {"type": "pkvs"}}}})",
+        R"({"m": {"stores": {"a": {"type": "disk_cache", "metadata_factory": "x"}}}})",
+        R"({"m": {"max_size": "1.5MB", "max_size": "1MB"}})",
+        R"({"m": {"stores": {"a": {"type": "pkvs", "name": 1}}}})"}) {
+    bool refused = false;
+    try {
+      const Configuration configuration(text);
+    } catch (const std::exception&) {
+      refused = true;
+    }
+    EXPECT_EQ(!faultsOf(text).empty(), refused) << text;
+  }
+}
+
+// --- Known keys ---
+
+// A value of no type that any key takes: whoever reads the key complains.
+TEST(KnownKeys, AreThoseThatTheParserReads) {
+  const auto isRead = [](const std::string& document) { return !faultsOf(document).empty(); };
+  for (const std::string& key : keysOfManagers()) {
+    if (key == "stores") continue;  // lenient
+    EXPECT_TRUE(isRead(R"({"m": {")" + key + R"(": []}})")) << key;
+  }
+  for (const std::string& type : storeTypes()) {
+    for (const std::string& key : keysOfStores(type)) {
+      if (key == "type" || key == "capacity") continue;  // required; lenient
+      EXPECT_TRUE(isRead(R"({"m": {"stores": {"s": {"type": ")" + type + R"(", ")" + key + R"(": []}}}})")) << key;
+    }
+  }
+}
+
+TEST(KnownKeys, TheNearestIsNotFarOff) {
+  EXPECT_EQ(nearestKey("max_siz", keysOfManagers()), "max_size");
+  EXPECT_EQ(nearestKey("sessionScoped", keysOfManagers()), "session_scoped");
+  EXPECT_EQ(nearestKey("hello_world", keysOfManagers()), "");
+  EXPECT_EQ(nearestKey(std::string(1000, 'a'), keysOfManagers()), "");
+}
+
+// --- What was understood ---
+
+TEST(CheckReport, FillsInEveryDefault) {
+  CheckResult result;
+  result.file = "storage.json";
+  const ConfigurationDocument document =
+      parseConfigurationDocument(R"({"m": {"stores": {"c": {"type": "disk_cache"}, "k": {"type": "pkvs"},
+                                     "u": {"type": "unmanaged"}}}})");
+  result.understood = understand(document, {"250", "en", "US", "Alice"});
+  std::ostringstream out;
+  Console console(out, false, false);
+  printCheck(result, console);
+  EXPECT_EQ(out.str(), R"(
+m
+  caches/_store_%41lice, a session's; limit 20.0 MB, pruned at most every 1 hour
+  c: disk_cache in c_250_v1
+      pruned to 0 B, to 0 B when space is short; strategy null, metadata null
+      any number of items, stale after 50 years, a file for each value
+  k: pkvs in k_250_v1
+      any number of items, stale after 50 years, a file for each value
+  u: unmanaged in u_250_v1
+      no cache: never emptied
+
+
+storage.json: 1 manager, 3 stores, 0 warnings
+)");
+}
+
+TEST(CheckReport, ForMachinesHasBytesAndSeconds) {
+  CheckResult result;
+  const ConfigurationDocument document = parseConfigurationDocument(
+      R"({"m": {"area": "shared", "max_size": "1KB", "session_scoped": false, "prune_interval": "2 days",
+          "stores": {"s": {"type": "disk_cache", "lru_size_limit": "3KB", "capacity": 7, "locale_sensitive": true}}}})");
+  result.understood = understand(document, {"250", "en", "US", ""});
+  result.warnings = findWarnings(document, result.understood);
+  const OrderedJson json = checkAsJson(result);
+  const OrderedJson& manager = json.at("managers").at(0);
+  EXPECT_EQ(manager.at("directory"), "shared/_sessionlessStore");
+  EXPECT_EQ(manager.at("max_size"), 1024);
+  EXPECT_EQ(manager.at("prune_interval"), 172800);
+  EXPECT_EQ(manager.at("stores").at(0).at("lru_size_limit"), 3072);
+  EXPECT_EQ(manager.at("stores").at(0).at("capacity"), 7);
+  EXPECT_EQ(manager.at("stores").at(0).at("directory"), "s_en_US_250_v1");
+  EXPECT_EQ(json.at("warnings").at(0).at("kind"), "over_manager_limit");
+  EXPECT_EQ(json.at("warnings").at(0).at("path"), "/m/max_size");
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar::tools

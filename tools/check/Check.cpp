@@ -1,0 +1,101 @@
+#include "check/Check.h"
+
+#include <CLI/CLI.hpp>
+#include <iostream>
+#include <memory>
+#include <string>
+
+#include "Console.h"
+#include "InputError.h"
+#include "check/CheckReport.h"
+#include "check/ConfigurationDocument.h"
+#include "check/Faults.h"
+#include "check/Understood.h"
+#include "check/Warnings.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+constexpr int kClean = 0;
+constexpr int kWarnings = 1;
+constexpr int kErrors = 2;
+
+struct CheckOptions {
+  std::string file;
+  std::string versionTag;
+  std::string locale;
+  std::string session;
+  bool json = false;
+};
+
+// "en_US" and "en-US" have two parts, "en" has one.
+NameTags tagsOf(const CheckOptions& options) {
+  const std::size_t middle = options.locale.find_first_of("_-");
+  NameTags tags;
+  tags.versionTag = options.versionTag;
+  tags.localeFirstTag = options.locale.substr(0, middle);
+  tags.localeSecondTag = middle == std::string::npos ? "" : options.locale.substr(middle + 1);
+  tags.sessionKey = options.session;
+  for (const std::string& tag : {options.versionTag, options.locale}) {
+    if (tag.find('/') != std::string::npos) throw InputError("'" + tag + "' cannot be part of a file name");
+  }
+  return tags;
+}
+
+CheckResult check(const CheckOptions& options) {
+  const NameTags tags = tagsOf(options);
+  const ConfigurationDocument document = readConfigurationDocument(options.file);
+  CheckResult result;
+  result.file = options.file;
+  result.faults = findFaults(document);
+  if (!result.faults.empty()) return result;
+  result.understood = understand(document, tags);
+  result.warnings = findWarnings(document, result.understood);
+  return result;
+}
+
+void printFaults(const CheckResult& result) {
+  for (const Finding& fault : result.faults) {
+    const std::string place = fault.pointer.empty() ? "" : fault.pointer + ": ";
+    std::cerr << "cellar: " << result.file << ": " << place << fault.text << std::endl;
+  }
+}
+
+int runCheck(const CheckOptions& options) {
+  const CheckResult result = check(options);
+  printFaults(result);
+  if (options.json) {
+    std::cout << checkAsJson(result).dump(2, ' ', false, OrderedJson::error_handler_t::replace) << std::endl;
+  } else if (result.faults.empty()) {
+    Console console = Console::standardOutput();
+    printCheck(result, console);
+  }
+  if (!result.faults.empty()) return kErrors;
+  return result.warnings.empty() ? kClean : kWarnings;
+}
+
+}  // namespace
+
+void addCheckCommand(CLI::App& app, int& status) {
+  const auto options = std::make_shared<CheckOptions>();
+  CLI::App* const check = app.add_subcommand("check", "Say what a configuration means, and what it cannot mean");
+  check->add_option("CONFIG", options->file, "The configuration, a JSON document")->required()->type_name("FILE");
+  check->add_option("--version-tag", options->versionTag, "The host's version tag, for the names of directories")
+      ->type_name("TAG");
+  check->add_option("--locale", options->locale, "The host's locale, \"en_US\" say, for the names of directories")
+      ->type_name("LOCALE");
+  check->add_option("--session", options->session, "The key of a session, named as the host kit names it")
+      ->type_name("KEY");
+  check->add_flag("--json", options->json, "Print one JSON object for machines; sizes in bytes, durations in seconds");
+  check->footer(
+      "The document is read with the library's own parser. Printed is what that has understood: managers and\n"
+      "stores, every default filled in, and the directories that the tags lead to. Then a line for everything\n"
+      "that the library accepts though nobody means it: misspelt and ignored keys, sizes that wrapped, caches\n"
+      "without a limit, stores that share a directory, and more.\n\n"
+      "Example:\n  cellar check storage.json --version-tag 250 --locale en_US --session alice\n\n"
+      "Exit status: 0 without warnings, 1 with some, 2 when the library refuses the document.");
+  check->callback([options, &status] { status = runCheck(*options); });
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,162 @@
+#include "check/CheckReport.h"
+
+#include <optional>
+#include <vector>
+
+#include "Configuration.h"
+#include "Console.h"
+#include "Format.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+const char* strategyName(PruneStrategyIdentifier strategy) {
+  switch (strategy) {
+    case PruneStrategyIdentifier::LRU:
+      return "lru";
+    case PruneStrategyIdentifier::VideoDownload:
+      return "video_download";
+    case PruneStrategyIdentifier::Null:
+      break;
+  }
+  return "null";
+}
+
+const char* factoryName(ExtendedMetadataFactoryIdentifier factory) {
+  return factory == ExtendedMetadataFactoryIdentifier::VideoDownload ? "video_download" : "null";
+}
+
+std::string textOf(const std::optional<std::int64_t>& capacity) {
+  if (!capacity.has_value() || *capacity < 0) return "any number of items";
+  return "at most " + formatCount(static_cast<std::uint64_t>(*capacity), "item", "items");
+}
+
+std::string placeOfValues(bool inlineData) { return inlineData ? "values in the manifest" : "a file for each value"; }
+
+using Lines = std::vector<std::string>;
+
+Lines rulesOf(const PKVSDefinition& store) {
+  return {textOf(store.capacity) + ", stale after " + formatDuration(store.staleAge) + ", " +
+          placeOfValues(store.inlineData)};
+}
+
+Lines rulesOf(const DiskCacheDefinition& store) {
+  return {"pruned to " + formatSize(store.lruSizeLimit) + ", to " + formatSize(store.survivalSize) +
+              " when space is short; strategy " + strategyName(store.pruneStrategy) + ", metadata " +
+              factoryName(store.metadataFactory),
+          textOf(store.capacity) + ", stale after " + formatDuration(store.staleAge) + ", " +
+              placeOfValues(store.inlineData)};
+}
+
+Lines rulesOf(const StoreDefinition& store) {
+  switch (store.type) {
+    case StoreDefinition::Type::PKVS:
+      return rulesOf(static_cast<const PKVSDefinition&>(store));
+    case StoreDefinition::Type::DiskCache:
+      return rulesOf(static_cast<const DiskCacheDefinition&>(store));
+    case StoreDefinition::Type::Unmanaged:
+      break;
+  }
+  if (!store.isCache) return {"no cache: never emptied"};
+  return {"a cache, emptied when it is opened with more than " + formatSize(store.maxSize)};
+}
+
+void printManager(const UnderstoodManager& manager, Console& console) {
+  const StoreManagerDefinition& definition = *manager.definition;
+  console.heading(definition.name);
+  const std::string rounds = definition.pruneInterval == 0
+                                 ? "never pruned"
+                                 : "pruned at most every " + formatDuration(definition.pruneInterval);
+  console.line(manager.directory + (definition.sessionScoped ? ", a session's" : ", of no session") + "; limit " +
+               formatSize(definition.maxSize) + ", " + rounds);
+  if (manager.stores.empty()) console.line("no stores");
+  for (const UnderstoodStore& store : manager.stores) {
+    console.line(store.identifier + ": " + typeName(*store.definition) + " in " + store.directory);
+    for (const std::string& rule : rulesOf(*store.definition)) console.line("    " + rule);
+  }
+}
+
+std::size_t storesIn(const Understood& understood) {
+  std::size_t count = 0;
+  for (const UnderstoodManager& manager : understood) count += manager.stores.size();
+  return count;
+}
+
+OrderedJson asJson(const Findings& findings) {
+  OrderedJson list = OrderedJson::array();
+  for (const Finding& finding : findings) {
+    list.push_back({{"kind", finding.kind}, {"path", finding.pointer}, {"text", finding.text}});
+  }
+  return list;
+}
+
+OrderedJson asJson(const std::optional<std::int64_t>& capacity) {
+  return capacity.has_value() ? OrderedJson(*capacity) : OrderedJson();
+}
+
+OrderedJson asJson(const UnderstoodStore& store) {
+  const StoreDefinition& definition = *store.definition;
+  OrderedJson json = {{"identifier", store.identifier},
+                      {"name", definition.name},
+                      {"type", typeName(definition)},
+                      {"directory", store.directory},
+                      {"locale_sensitive", definition.localeSensitive},
+                      {"has_version", definition.hasVersion},
+                      {"version", definition.version}};
+  if (definition.type == StoreDefinition::Type::Unmanaged) {
+    json["is_cache"] = definition.isCache;
+    json["max_size"] = definition.maxSize;
+  } else if (definition.type == StoreDefinition::Type::PKVS) {
+    const auto& values = static_cast<const PKVSDefinition&>(definition);
+    json["inline_data"] = values.inlineData;
+    json["stale_age"] = values.staleAge;
+    json["capacity"] = asJson(values.capacity);
+  } else {
+    const auto& cache = static_cast<const DiskCacheDefinition&>(definition);
+    json["inline_data"] = cache.inlineData;
+    json["stale_age"] = cache.staleAge;
+    json["lru_size_limit"] = cache.lruSizeLimit;
+    json["survival_size"] = cache.survivalSize;
+    json["metadata_factory"] = factoryName(cache.metadataFactory);
+    json["prune_strategy"] = strategyName(cache.pruneStrategy);
+    json["capacity"] = asJson(cache.capacity);
+  }
+  return json;
+}
+
+OrderedJson asJson(const UnderstoodManager& manager) {
+  const StoreManagerDefinition& definition = *manager.definition;
+  OrderedJson stores = OrderedJson::array();
+  for (const UnderstoodStore& store : manager.stores) stores.push_back(asJson(store));
+  return {{"name", definition.name},
+          {"area", areaName(definition)},
+          {"directory", manager.directory},
+          {"max_size", definition.maxSize},
+          {"prune_interval", definition.pruneInterval},
+          {"session_scoped", definition.sessionScoped},
+          {"stores", std::move(stores)}};
+}
+
+}  // namespace
+
+void printCheck(const CheckResult& result, Console& console) {
+  for (const UnderstoodManager& manager : result.understood) printManager(manager, console);
+  console.raw("\n");
+  for (const Finding& warning : result.warnings) console.bad("warning: " + warning.pointer + ": " + warning.text);
+  const std::string counts = formatCount(result.understood.size(), "manager", "managers") + ", " +
+                             formatCount(storesIn(result.understood), "store", "stores") + ", ";
+  console.verdict(result.file + ": " + counts + formatCount(result.warnings.size(), "warning", "warnings"),
+                  result.warnings.empty());
+}
+
+OrderedJson checkAsJson(const CheckResult& result) {
+  OrderedJson managers = OrderedJson::array();
+  for (const UnderstoodManager& manager : result.understood) managers.push_back(asJson(manager));
+  return {{"file", result.file},
+          {"managers", std::move(managers)},
+          {"warnings", asJson(result.warnings)},
+          {"errors", asJson(result.faults)}};
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools

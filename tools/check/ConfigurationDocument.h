@@ -1,0 +1,28 @@
+#pragma once
+
+#include <nlohmann/json.hpp>
+#include <string>
+#include <vector>
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// Keeps members in the order of the document.
+using OrderedJson = nlohmann::ordered_json;
+
+// A configuration as its author wrote it, keys included that the library passes over.
+struct ConfigurationDocument {
+  std::string text;
+  OrderedJson root;                   // of names that are met twice, the last
+  std::vector<std::string> repeated;  // JSON pointers of those names
+};
+
+// Reads the file. Throws `InputError`, naming it, when it cannot be read or is not JSON.
+ConfigurationDocument readConfigurationDocument(const std::string& path);
+
+// The same from a text. Throws the JSON library's parse errors.
+ConfigurationDocument parseConfigurationDocument(const std::string& text);
+
+// The JSON pointer of a member of what `pointer` points at.
+std::string memberPointer(const std::string& pointer, const std::string& name);
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,17 @@
+#pragma once
+
+#include <string>
+#include <vector>
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// What is wrong with a configuration, and where.
+struct Finding {
+  std::string kind;     // one word for machines
+  std::string pointer;  // JSON pointer of the value, empty for the whole document
+  std::string text;
+};
+
+using Findings = std::vector<Finding>;
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,150 @@
+#include "check/Warnings.h"
+
+#include <cstdint>
+#include <map>
+#include <string>
+#include <utility>
+
+#include "Configuration.h"
+#include "Format.h"
+#include "check/KeyWarnings.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+constexpr std::size_t kLongestFileName = 255;  // bytes, of the file systems of phones
+
+void warnOfDiskCache(const UnderstoodStore& store, const DiskCacheDefinition& cache, Findings& findings) {
+  if (cache.lruSizeLimit == 0) {
+    findings.push_back({"no_limit", memberPointer(store.pointer, "lru_size_limit"),
+                        "is 0 B: each round of pruning empties the cache"});
+  }
+  if (cache.survivalSize > cache.lruSizeLimit) {
+    findings.push_back({"survival_size", memberPointer(store.pointer, "survival_size"),
+                        formatSize(cache.survivalSize) + " is more than the limit of " +
+                            formatSize(cache.lruSizeLimit) + ": a device short of space would keep more"});
+  }
+  if (cache.pruneStrategy == PruneStrategyIdentifier::VideoDownload &&
+      cache.metadataFactory != ExtendedMetadataFactoryIdentifier::VideoDownload) {
+    findings.push_back({"no_metadata", memberPointer(store.pointer, "prune_strategy"),
+                        "video_download without the metadata_factory of that name: after a restart no item has a "
+                        "priority"});
+  }
+}
+
+void warnOfLimits(const UnderstoodStore& store, Findings& findings) {
+  const StoreDefinition& definition = *store.definition;
+  if (definition.type == StoreDefinition::Type::DiskCache) {
+    warnOfDiskCache(store, static_cast<const DiskCacheDefinition&>(definition), findings);
+  }
+  if (definition.type == StoreDefinition::Type::Unmanaged && definition.isCache && definition.maxSize == 0) {
+    findings.push_back(
+        {"no_limit", memberPointer(store.pointer, "max_size"), "is 0 B: the cache is emptied whenever it is opened"});
+  }
+}
+
+void warnOfFileName(const UnderstoodStore& store, Findings& findings) {
+  const std::string& name = store.definition->name;
+  const std::string place = name == store.identifier ? store.pointer : memberPointer(store.pointer, "name");
+  if (name.find('/') != std::string::npos) {
+    findings.push_back({"file_name", place, "'" + name + "' holds a '/' and reaches outside the manager's directory"});
+  } else if (name.find('\0') != std::string::npos) {
+    findings.push_back({"file_name", place, "the name holds a zero byte, at which the system cuts it off"});
+  } else if (name.empty()) {
+    findings.push_back({"file_name", place, "the name is empty"});
+  } else if (store.directory.size() > kLongestFileName) {
+    findings.push_back({"file_name", place,
+                        "the directory's name has " + std::to_string(store.directory.size()) +
+                            " bytes, more than the " + std::to_string(kLongestFileName) + " that file systems take"});
+  }
+}
+
+// Caches within their limits may still be over their manager's, and then nothing is there to be pruned.
+void warnOfManagerLimit(const UnderstoodManager& manager, Findings& findings) {
+  std::uint64_t sum = 0;
+  for (const UnderstoodStore& store : manager.stores) {
+    if (store.definition->isCache) sum += store.definition->maxSize;
+  }
+  if (sum <= manager.definition->maxSize) return;
+  findings.push_back({"over_manager_limit", memberPointer(manager.pointer, "max_size"),
+                      "its caches may together have " + formatSize(sum) + ", more than the manager's limit of " +
+                          formatSize(manager.definition->maxSize)});
+}
+
+void warnOfPruning(const UnderstoodManager& manager, Findings& findings) {
+  if (manager.definition->pruneInterval != 0) return;
+  for (const UnderstoodStore& store : manager.stores) {
+    if (store.definition->type != StoreDefinition::Type::DiskCache) continue;
+    findings.push_back({"never_prunes", memberPointer(manager.pointer, "prune_interval"),
+                        "is 0: the manager never prunes, and its disk caches grow without end"});
+    return;
+  }
+}
+
+// Stores that stand in one directory take each other's files for their own; those of one name cannot be told apart in
+// events and log lines.
+class Namesakes {
+ public:
+  void lookAt(const UnderstoodManager& manager, Findings& findings) {
+    lookAtManagerDirectory(manager, findings);
+    for (const UnderstoodStore& store : manager.stores) lookAtStore(manager, store, findings);
+  }
+
+ private:
+  using FirstOf = std::map<std::string, std::string>;  // to its pointer
+
+  void lookAtManagerDirectory(const UnderstoodManager& manager, Findings& findings) {
+    const auto [first, isFirst] = managers_.emplace(manager.directory, manager.pointer);
+    if (isFirst) return;
+    findings.push_back({"shared_directory", manager.pointer,
+                        "shares its directory " + manager.directory + " with " + first->second +
+                            ": each cleans up the other's stores"});
+  }
+
+  void lookAtStore(const UnderstoodManager& manager, const UnderstoodStore& store, Findings& findings) {
+    const auto [place, isFirstThere] = stores_.emplace(manager.directory + "/" + store.directory, store.pointer);
+    const auto [namesake, isFirstOfName] = names_.emplace(store.definition->name, store.pointer);
+    if (!isFirstThere) {
+      findings.push_back(
+          {"shared_directory", store.pointer, "shares its directory " + store.directory + " with " + place->second});
+    } else if (!isFirstOfName) {
+      findings.push_back({"shared_name", store.pointer,
+                          "has the name '" + store.definition->name + "' of " + namesake->second +
+                              ": events and log lines, which carry names, cannot tell them apart"});
+    }
+  }
+
+  FirstOf managers_;
+  FirstOf stores_;
+  FirstOf names_;
+};
+
+void warnOfRepeatedKeys(const ConfigurationDocument& document, Findings& findings) {
+  for (const std::string& pointer : document.repeated) {
+    findings.push_back({"repeated_key", pointer, "stands here more than once; only the last counts"});
+  }
+}
+
+}  // namespace
+
+Findings findWarnings(const ConfigurationDocument& document, const Understood& understood) {
+  Findings findings;
+  Namesakes namesakes;
+  for (const UnderstoodManager& manager : understood) {
+    const OrderedJson& written = document.root.at(manager.definition->name);
+    warnOfManagerKeys(manager.pointer, written, findings);
+    warnOfManagerLimit(manager, findings);
+    warnOfPruning(manager, findings);
+    for (const UnderstoodStore& store : manager.stores) {
+      warnOfStoreKeys(store.pointer, written.at("stores").at(store.identifier), findings);
+      warnOfLimits(store, findings);
+      warnOfFileName(store, findings);
+    }
+    namesakes.lookAt(manager, findings);
+  }
+  warnOfRepeatedKeys(document, findings);
+  return findings;
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools
