@@ -12,6 +12,7 @@
 #include "demo/Demo.h"
 #include "inspect/Inspect.h"
 #include "verify/Verify.h"
+#include "tune/Tune.h"
 
 namespace {
 
@@ -38,10 +39,10 @@ void describe(CLI::App& app) {
       "Examples:\n  cellar demo ~/Pictures\n  cellar inspect /tmp/cellar-demo\n\nExit status: 0 when all is well, 1 "
       "when something was found, 2 for usage and input errors.");
       "Cellar manages an application's storage on a device. This program shows it at work, and helps with its\n"
-      "configuration.");
+      "configuration and its limits.");
   app.footer(
-      "Examples:\n  cellar demo ~/Pictures\n  cellar check storage.json\n\nExit status: 0 when all is well, 1 when "
-      "something was found, 2 for usage and input errors.");
+      "Examples:\n  cellar demo ~/Pictures\n  cellar check storage.json\n  cellar tune analytics.jsonl --store "
+      "thumbs\n\nExit status: 0 when all is well, 1 when something was found, 2 for usage and input errors.");
   app.set_version_flag("--version", kVersion);
   app.require_subcommand(1);
 }
@@ -78,6 +79,7 @@ int runProgram(int argc, char** argv) {
   tools::addInspectCommand(app, status);
   tools::addVerifyCommand(app, status);
   tools::addCheckCommand(app, status);
+  tools::addTuneCommand(app, status);
   try {
     app.parse(argc, argv);
   } catch (const CLI::Success& wish) {

@@ -1,0 +1,185 @@
+#include "tune/Tuning.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <nlohmann/json.hpp>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "Console.h"
+#include "tune/Trace.h"
+#include "tune/TunePlot.h"
+#include "tune/TuneReport.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+namespace {
+
+using testing::HasSubstr;
+using testing::Not;
+
+constexpr std::int64_t kMegabyte = 1024 * 1024;
+
+class TuningTest : public testing::Test {
+ protected:
+  // Items of a megabyte, asked for in turn, round after round.
+  void askInTurn(int items, int rounds) {
+    for (int round = 0; round < rounds; ++round) {
+      for (int item = 0; item < items; ++item) ask("item" + std::to_string(item), kMegabyte);
+    }
+  }
+
+  void ask(const std::string& key, std::int64_t size) {
+    Access access;
+    access.size = size;
+    access.date = date++;
+    trace.append(key, access);
+  }
+
+  Tuning tuned(std::int64_t present = 0) const {
+    return tune(trace, present, 0.01, [] {});
+  }
+
+  std::string printed(std::int64_t present = 0) const {
+    std::ostringstream out;
+    Console console(out, false, false);
+    TuneReport report;
+    report.source = "events";
+    report.store = "thumbs";
+    report.tuning = tuned(present);
+    printTuning(report, console);
+    return out.str();
+  }
+
+  Trace trace;
+  std::int64_t date = 0;
+};
+
+TEST_F(TuningTest, ItemsAskedForInTurnAreFoundByALimitThatHoldsAllOrByNone) {
+  askInTurn(10, 11);
+  const Tuning tuning = tuned();
+  EXPECT_EQ(tuning.requests, 110U);
+  EXPECT_EQ(tuning.keys, 10U);
+  EXPECT_EQ(tuning.everything, 10 * kMegabyte);
+  for (const TunedLimit& limit : tuning.limits) {
+    EXPECT_EQ(limit.lru.hits, limit.lru.limit >= 10 * kMegabyte ? 100U : 0U) << limit.lru.limit;
+  }
+  ASSERT_NE(enoughLimit(tuning), nullptr);
+  EXPECT_EQ(enoughLimit(tuning)->lru.limit, 10 * kMegabyte);
+  EXPECT_EQ(presentLimit(tuning), nullptr);
+}
+
+TEST_F(TuningTest, ThePresentLimitIsListedExactlyWhateverItIs) {
+  askInTurn(10, 11);
+  const Tuning tooSmall = tuned(10 * kMegabyte - 1);
+  EXPECT_EQ(presentLimit(tooSmall)->lru.hits, 0U);
+  const Tuning enough = tuned(10 * kMegabyte);
+  EXPECT_EQ(presentLimit(enough)->lru.hits, 100U);
+  EXPECT_EQ(presentLimit(enough), enoughLimit(enough));
+}
+
+TEST_F(TuningTest, ListsLimitsFromNextToNothingToAllThereIs) {
+  askInTurn(10, 11);
+  const Tuning tuning = tuned();
+  EXPECT_EQ(tuning.limits.front().lru.hits, 0U);
+  EXPECT_EQ(tuning.limits.back().lru.limit, 16 * kMegabyte);
+  EXPECT_EQ(tuning.limits.back().lru.hits, 100U);
+  for (std::size_t i = 1; i < tuning.limits.size(); ++i) {
+    EXPECT_LT(tuning.limits[i - 1].lru.limit, tuning.limits[i].lru.limit);
+  }
+}
+
+TEST_F(TuningTest, EnoughIsRoundedUpToAUnitThatAConfigurationCanHave) {
+  for (int i = 0; i < 2; ++i) ask("odd", 70 * kMegabyte + 12345);
+  for (int i = 0; i < 2; ++i) ask("odd", 70 * kMegabyte + 12345);
+  EXPECT_EQ(enoughLimit(tuned())->lru.limit, 71 * kMegabyte);
+}
+
+TEST_F(TuningTest, SaysWhatThePresentLimitCosts) {
+  askInTurn(10, 11);
+  EXPECT_THAT(
+      printed(5 * kMegabyte),
+      HasSubstr("\nThe present limit of 5 MB finds 0.00 %: 100 more misses (90.91 % of the requests) than 10 MB "
+                "would have.\n"));
+  EXPECT_THAT(printed(100 * kMegabyte),
+              HasSubstr("\nThe present limit of 100 MB finds 90.91 %: 0 fewer misses (0.00 % of the requests) than 10 "
+                        "MB, for 90.0 MB more space.\n"));
+  EXPECT_THAT(printed(10 * kMegabyte), HasSubstr("\nThe present limit of 10 MB finds 90.91 %.\n"));
+  EXPECT_THAT(printed(), Not(HasSubstr("present limit")));
+}
+
+TEST_F(TuningTest, NamesTheRuleThatItsAdviceFollows) {
+  askInTurn(10, 11);
+  EXPECT_THAT(printed(), HasSubstr("10 MB is enough: from there on, doubling the limit always turns less than 1.00 % "
+                                   "of the requests into hits."));
+}
+
+TEST_F(TuningTest, WithoutASecondRequestNoLimitHelps) {
+  askInTurn(3, 1);
+  EXPECT_EQ(enoughLimit(tuned()), nullptr);
+  EXPECT_THAT(printed(), HasSubstr("No limit would have found anything"));
+}
+
+TEST_F(TuningTest, ItemsOfNoBytesAreFoundByAnyLimit) {
+  for (int i = 0; i < 3; ++i) ask("empty", 0);
+  const Tuning tuning = tuned();
+  ASSERT_FALSE(tuning.limits.empty());
+  EXPECT_EQ(tuning.limits.front().lru.hits, 2U);
+}
+
+TEST_F(TuningTest, ALimitBeyondTheLibrarysOwnIsMarked) {
+  for (int i = 0; i < 5; ++i) ask("film", std::int64_t{5} << 30);
+  EXPECT_THAT(printed(), HasSubstr("(The library's own limits end below 4 GB.)"));
+}
+
+TEST_F(TuningTest, TheVideoStrategyIsPlayedWhereItemsCarryWhatItNeeds) {
+  EXPECT_THAT(printed(), Not(HasSubstr("video strategy")));
+  askInTurn(4, 3);
+  EXPECT_FALSE(tuned().limits.back().videoHits.has_value());
+  Access access;
+  access.size = kMegabyte;
+  access.itemType = 1;
+  access.date = date;
+  trace.append("item0", access);
+  EXPECT_THAT(tuned().limits.back().videoHits, testing::Optional(9U));
+  EXPECT_THAT(printed(), HasSubstr("video strategy"));
+}
+
+TEST_F(TuningTest, TheReportForMachinesHasTheSameFigures) {
+  askInTurn(10, 11);
+  TuneReport report;
+  report.source = "events";
+  report.reportedHits = 42;
+  report.tuning = tuned(5 * kMegabyte);
+  const nlohmann::ordered_json json = tuningAsJson(report);
+  EXPECT_EQ(json.at("requests"), 110);
+  EXPECT_EQ(json.at("reported_hits"), 42);
+  EXPECT_EQ(json.at("enough").at("limit"), 10 * kMegabyte);
+  EXPECT_EQ(json.at("enough").at("hits"), 100);
+  EXPECT_EQ(json.at("present").at("hits"), 0);
+  EXPECT_EQ(json.at("limits").size(), report.tuning.limits.size());
+}
+
+TEST_F(TuningTest, ThePlotMarksBothLimitsAndEscapesTheStoresName) {
+  askInTurn(10, 11);
+  TuneReport report;
+  report.store = "<a & b>";
+  report.tuning = tuned(5 * kMegabyte);
+  const std::string svg = tuningAsSvg(report);
+  EXPECT_EQ(svg.rfind("<svg xmlns=", 0), 0U);
+  EXPECT_THAT(svg, HasSubstr("&lt;a &amp; b&gt;"));
+  EXPECT_THAT(svg, HasSubstr("present: 5 MB, 0.0 %"));
+  EXPECT_THAT(svg, HasSubstr("enough: 10 MB, 90.9 %"));
+  EXPECT_THAT(svg, Not(HasSubstr("nan")));
+}
+
+TEST_F(TuningTest, EvenNothingCanBePlotted) {
+  TuneReport report;
+  report.tuning = tuned();
+  EXPECT_THAT(tuningAsSvg(report), Not(HasSubstr("nan")));
+}
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,35 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <string>
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+class Console;
+
+// How far something has come that may take longer than a moment: a bar on a terminal, from the second second on, and
+// nothing anywhere else.
+class Meter {
+ public:
+  Meter(Console& console, std::string what);
+
+  // Leaves no half-drawn bar behind.
+  ~Meter();
+  Meter(const Meter&) = delete;
+  Meter& operator=(const Meter&) = delete;
+
+  // Cheap enough for every item of millions. `whole` is 0 when it is not known: then the parts are counted.
+  void advanceTo(std::uint64_t part, std::uint64_t whole);
+
+ private:
+  void draw(std::uint64_t part, std::uint64_t whole);
+
+  Console& console_;
+  const std::string what_;
+  std::chrono::steady_clock::time_point nextDrawing_;
+  std::uint32_t calls_ = 0;
+  bool isDrawn_ = false;
+};
+
+}  // namespace velmora::mobile::xplat::cellar::tools

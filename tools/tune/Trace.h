@@ -1,0 +1,64 @@
+#pragma once
+
+#include <cstdint>
+#include <cstdio>
+#include <functional>
+#include <memory>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "tune/Access.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// The accesses to one cache, in order. They are kept in a temporary file, which has no name and goes with the trace, so
+// that memory is needed for the keys only.
+class Trace {
+ public:
+  Trace();
+  Trace(const Trace&) = delete;
+  Trace& operator=(const Trace&) = delete;
+  ~Trace();
+
+  // Appends an access; its `key` is filled in here. Throws `InputError` when there is no room for it.
+  void append(const std::string& key, Access access);
+
+  // For a key whose accesses say that it was found, without a size: if none of them ever tells one, it is 0.
+  void mayBeEmpty(const std::string& key);
+
+  // Bytes of an item whose size no access tells; without it, the mean of all others.
+  void assumeSize(std::int64_t bytes) { assumedSize_ = bytes; }
+
+  // Calls `visit` with each access, every size filled in: where an access does not tell it, as the last access of the
+  // key before it does, or else the first one after it. Throws `InputError` when the file cannot be read again.
+  void replay(const std::function<void(const Access&)>& visit) const;
+
+  std::uint64_t accesses() const { return accesses_; }
+  std::uint64_t keys() const { return firstSizes_.size(); }
+  std::uint64_t keysOfUnknownSize() const;
+  std::int64_t assumedSize() const;  // bytes
+  std::int64_t seconds() const;      // between the first and the last date
+  bool hasMetadata() const { return hasMetadata_; }
+
+ private:
+  struct CloseFile {
+    void operator()(std::FILE* file) const;
+  };
+
+  std::uint32_t numberOf(const std::string& key);
+  std::vector<std::int64_t> startingSizes() const;
+
+  std::unique_ptr<std::FILE, CloseFile> file_;
+  std::unordered_map<std::string, std::uint32_t> numbers_;
+  std::vector<std::int64_t> firstSizes_;  // by key; the first that is told
+  std::vector<bool> mayBeEmpty_;          // by key
+  std::uint64_t accesses_ = 0;
+  std::int64_t bytes_ = 0;
+  std::int64_t assumedSize_ = Access::kUnknownSize;
+  std::int64_t firstDate_ = 0;
+  std::int64_t lastDate_ = 0;
+  bool hasMetadata_ = false;
+};
+
+}  // namespace velmora::mobile::xplat::cellar::tools

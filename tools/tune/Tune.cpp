@@ -1,0 +1,216 @@
+#include "tune/Tune.h"
+
+#include <CLI/CLI.hpp>
+#include <cstdint>
+#include <iostream>
+#include <memory>
+#include <string>
+
+#include "Configuration.h"
+#include "Console.h"
+#include "Format.h"
+#include "InputError.h"
+#include "Meter.h"
+#include "PruneStrategy.h"
+#include "TextFile.h"
+#include "check/ConfigurationDocument.h"
+#include "check/Faults.h"
+#include "check/Understood.h"
+#include "tune/CsvReader.h"
+#include "tune/EventReader.h"
+#include "tune/LineReader.h"
+#include "tune/Trace.h"
+#include "tune/TunePlot.h"
+#include "tune/TuneReport.h"
+#include "tune/Tuning.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+constexpr double kPercent = 100;
+
+struct TuneOptions {
+  std::string events;
+  std::string store;
+  std::int64_t limit = 0;
+  std::string configuration;
+  double worth = 1;  // percent
+  std::int64_t unknownSize = -1;
+  std::string svg;
+  bool json = false;
+  bool csv = false;
+  CsvColumns columns;
+  int priorityWeight = 0;
+  int earlySeconds = 0;
+};
+
+// The disk cache of that identifier or, since events carry names, of that name.
+std::int64_t configuredLimit(const std::string& file, const std::string& store) {
+  const ConfigurationDocument document = readConfigurationDocument(file);
+  const Findings faults = findFaults(document);
+  if (!faults.empty()) throw InputError(file + ": " + faults.front().pointer + ": " + faults.front().text);
+  for (const UnderstoodManager& manager : understand(document, {})) {
+    for (const UnderstoodStore& candidate : manager.stores) {
+      if (candidate.identifier != store && candidate.definition->name != store) continue;
+      if (candidate.definition->type != StoreDefinition::Type::DiskCache) {
+        throw InputError(file + ": store '" + store + "' is no disk cache and has no size limit");
+      }
+      if (candidate.definition->maxSize == 0) throw InputError(file + ": the limit of store '" + store + "' is 0");
+      return candidate.definition->maxSize;
+    }
+  }
+  throw InputError(file + ": there is no store '" + store + "'");
+}
+
+std::string listOf(const EventCounts& counts) {
+  std::string list;
+  for (const auto& [store, accesses] : counts.accessesOfStores) {
+    list += (list.empty() ? "" : ", ") + store + " (" + formatCount(accesses) + ")";
+  }
+  return list;
+}
+
+// Fills in what the events tell beside the accesses themselves.
+void readReportedEvents(const TuneOptions& options, LineReader& lines, Trace& trace, TuneReport& report,
+                        const std::function<void()>& onLine) {
+  const EventCounts counts = readEvents(lines, options.store, trace, onLine);
+  const std::size_t stores = counts.accessesOfStores.size();
+  if (stores == 0) throw InputError("no line of " + lines.name() + " is an access event of the host kit's sink");
+  if (trace.accesses() == 0) {
+    throw InputError(lines.name() + " has no accesses to store '" + options.store + "', but to: " + listOf(counts));
+  }
+  if (options.store.empty() && stores > 1) {
+    throw InputError(lines.name() + " has accesses to several stores, choose one with --store: " + listOf(counts));
+  }
+  report.store = options.store.empty() ? counts.accessesOfStores.begin()->first : options.store;
+  report.reportedHits = counts.hits;
+  report.damagedLines = counts.damagedLines;
+}
+
+void readTrace(const TuneOptions& options, Console& console, Trace& trace, TuneReport& report) {
+  LineReader lines(options.events);
+  Meter meter(console, "reading " + lines.name());
+  const auto onLine = [&] {
+    const bool isKnown = lines.bytesInAll() > 0;
+    meter.advanceTo(isKnown ? lines.bytesRead() : lines.lineNumber(), lines.bytesInAll());
+  };
+  report.source = lines.name();
+  report.store = options.store;
+  if (options.csv) {
+    readCsv(lines, options.columns, trace, onLine);
+    if (trace.accesses() == 0) throw InputError(lines.name() + " has no rows");
+  } else {
+    readReportedEvents(options, lines, trace, report, onLine);
+  }
+}
+
+Tuning tuneTrace(const TuneOptions& options, const Trace& trace, std::int64_t present, Console& console) {
+  Meter meter(console, "playing the accesses");
+  std::uint64_t done = 0;
+  const std::uint64_t rounds = trace.hasMetadata() ? 2 : 1;
+  return tune(trace, present, options.worth / kPercent, [&] { meter.advanceTo(++done, rounds * trace.accesses()); });
+}
+
+void runTune(const TuneOptions& options) {
+  if (!options.configuration.empty() && options.store.empty()) {
+    throw InputError("--config needs --store, to know whose limit to take");
+  }
+  const std::int64_t present =
+      options.configuration.empty() ? options.limit : configuredLimit(options.configuration, options.store);
+  VideoDownloadPruneStrategy::priorityWeight = options.priorityWeight;
+  VideoDownloadPruneStrategy::highPriorityVideoSecondCutoff = options.earlySeconds;
+
+  Console console = Console::standardOutput();
+  TuneReport report;
+  Trace trace;
+  if (options.unknownSize >= 0) trace.assumeSize(options.unknownSize);
+  readTrace(options, console, trace, report);
+  report.tuning = tuneTrace(options, trace, present, console);
+  if (!options.svg.empty()) writeTextFile(options.svg, tuningAsSvg(report));
+  if (options.json) {
+    std::cout << tuningAsJson(report).dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace)
+              << std::endl;
+  } else {
+    printTuning(report, console);
+  }
+}
+
+void addCsvOptions(CLI::App& tune, TuneOptions& options) {
+  CLI::Option* const csv =
+      tune.add_flag("--csv", options.csv, "EVENTS is a table with a line of titles, parted by commas");
+  const auto column = [&](const char* name, std::string& target, const char* help) {
+    return tune.add_option(name, target, help)->type_name("COLUMN")->needs(csv);
+  };
+  csv->needs(column("--key", options.columns.key, "The column of the keys"));
+  csv->needs(column("--size", options.columns.size, "The column of the sizes, in bytes; empty where not known"));
+  column("--time", options.columns.time, "The column of the times, in seconds");
+  CLI::Option* const op =
+      column("--op", options.columns.op, "The column of the operations; all are fetches but these:");
+  tune.add_option("--store-op", options.columns.stores, "An operation that stores. May be given several times")
+      ->type_name("OP")
+      ->needs(op);
+  tune.add_option("--remove-op", options.columns.removes, "An operation that removes. May be given several times")
+      ->type_name("OP")
+      ->needs(op);
+}
+
+void addVideoOptions(CLI::App& tune, TuneOptions& options) {
+  CLI::Option* const csv = tune.get_option("--csv");
+  const char* const group = "Video strategy";
+  const auto grouped = [&](CLI::Option* option, const char* type) {
+    return option->type_name(type)->needs(csv)->group(group);
+  };
+  grouped(tune.add_option("--chunk-second", options.columns.chunkSecond, "The column of the seconds of the video"),
+          "COLUMN");
+  grouped(tune.add_option("--item-type", options.columns.itemType, "The column of the item types"), "COLUMN");
+  grouped(tune.add_option("--priority-weight", options.priorityWeight, "Seconds that a high priority is worth"),
+          "SECONDS");
+  grouped(tune.add_option("--early-seconds", options.earlySeconds, "Up to which second a chunk has high priority"),
+          "SECONDS");
+}
+
+}  // namespace
+
+void addTuneCommand(CLI::App& app, int& status) {
+  const auto options = std::make_shared<TuneOptions>();
+  CLI::App* const tune =
+      app.add_subcommand("tune", "Find a cache's limit from the accesses that an application logged");
+  tune->add_option("EVENTS", options->events, "What the host kit's sink has written, JSON lines; - for standard input")
+      ->required()
+      ->type_name("FILE");
+  tune->add_option("--store", options->store, "The store's name; not needed when the events are of one store only")
+      ->type_name("NAME");
+  CLI::Option* const limit = tune->add_option("--limit", options->limit, "The present limit: 52428800, 50MB")
+                                 ->transform(CLI::AsSizeValue(false).description(""))
+                                 ->check(CLI::Validator(CLI::PositiveNumber).description(""))
+                                 ->type_name("SIZE");
+  tune->add_option("--config", options->configuration, "Take the present limit of the store from this configuration")
+      ->type_name("FILE")
+      ->excludes(limit);
+  tune->add_option("--worth", options->worth, "Percent of the requests that doubling a limit has to turn into hits")
+      ->check(CLI::Range(0.001, 100.0).description(""))
+      ->capture_default_str()
+      ->type_name("PERCENT");
+  tune->add_option("--unknown-size", options->unknownSize,
+                   "Bytes of items that were never found; without it, the mean of the others")
+      ->check(CLI::Range(std::int64_t{0}, std::int64_t{0xffffffff}).description(""))
+      ->type_name("BYTES");
+  tune->add_option("--svg", options->svg, "Draw the hit rate over the limit into this file")->type_name("FILE");
+  tune->add_flag("--json", options->json, "Print one JSON object for machines");
+  addCsvOptions(*tune, *options);
+  addVideoOptions(*tune, *options);
+  tune->footer(
+      "For every size limit: how many requests a cache would have found that gives up what was used least\n"
+      "recently, as soon as it is over its limit. docs/tuning.md says what the figures mean and what they leave "
+      "out.\n\n"
+      "Examples:\n"
+      "  cellar tune analytics.jsonl --store thumbs --config storage.json --svg thumbs.svg\n"
+      "  zcat trace.csv.gz | cellar tune - --csv --key lbn --size size --op op --store-op 2a");
+  tune->callback([options, &status] {
+    runTune(*options);
+    status = 0;
+  });
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,0 +1,151 @@
+#include "tune/TuneReport.h"
+
+#include <array>
+#include <cstdio>
+#include <limits>
+#include <vector>
+
+#include "Console.h"
+#include "Format.h"
+#include "Table.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+double rate(std::uint64_t part, std::uint64_t whole) {
+  return whole == 0 ? 0 : static_cast<double>(part) / static_cast<double>(whole);
+}
+
+std::string percent(double rate) {
+  std::array<char, 32> text{};
+  (void)std::snprintf(text.data(), text.size(), "%.2f %%", rate * 100);
+  return text.data();
+}
+
+std::string bytes(std::int64_t size) { return formatSize(static_cast<std::uint64_t>(size)); }
+
+std::string wholeBytes(std::int64_t size) { return formatWholeSize(static_cast<std::uint64_t>(size)); }
+
+std::string noteOn(const TunedLimit& limit) {
+  if (limit.isPresent && limit.isEnough) return "present, and enough";
+  if (limit.isPresent) return "present";
+  return limit.isEnough ? "enough" : "";
+}
+
+bool hasVideo(const Tuning& tuning) { return !tuning.limits.empty() && tuning.limits.front().videoHits.has_value(); }
+
+std::string tableOf(const Tuning& tuning) {
+  std::vector<Table::Column> columns = {{"limit", Table::Align::Right},
+                                        {"hit rate", Table::Align::Right},
+                                        {"of bytes", Table::Align::Right},
+                                        {"hits", Table::Align::Right},
+                                        {"misses", Table::Align::Right}};
+  if (hasVideo(tuning)) columns.push_back({"video strategy", Table::Align::Right});
+  columns.push_back({"", Table::Align::Left});
+  Table table(columns);
+  for (const TunedLimit& limit : tuning.limits) {
+    std::vector<std::string> cells = {wholeBytes(limit.lru.limit), percent(rate(limit.lru.hits, tuning.requests)),
+                                      percent(rate(limit.lru.hitBytes, tuning.requestedBytes)),
+                                      formatCount(limit.lru.hits), formatCount(tuning.requests - limit.lru.hits)};
+    if (limit.videoHits) cells.push_back(percent(rate(*limit.videoHits, tuning.requests)));
+    cells.push_back(noteOn(limit));
+    table.addRow(std::move(cells));
+  }
+  return table.text();
+}
+
+void printSource(const TuneReport& report, Console& console) {
+  const Tuning& tuning = report.tuning;
+  console.line(formatCount(tuning.requests, "request", "requests") + " of " + formatCount(tuning.keys, "key", "keys") +
+               (tuning.seconds > 0 ? " in " + formatDuration(static_cast<std::uint64_t>(tuning.seconds)) : "") +
+               "; all items together have at most " + bytes(tuning.everything));
+  if (report.reportedHits) {
+    console.line("the running cache reported " + percent(rate(*report.reportedHits, tuning.requests)) + " hits");
+  }
+  if (tuning.keysOfUnknownSize > 0) {
+    console.line(formatCount(tuning.keysOfUnknownSize, "key was", "keys were") +
+                 " never found, so that nothing tells a size: taken to have " + bytes(tuning.assumedSize) + " each");
+  }
+  if (report.damagedLines > 0) {
+    console.line(formatCount(report.damagedLines, "line is", "lines are") + " no JSON and not counted");
+  }
+}
+
+// With the rule that it follows from.
+std::string adviceOf(const Tuning& tuning) {
+  const TunedLimit* const enough = enoughLimit(tuning);
+  if (enough == nullptr) return "No limit would have found anything: no item is asked for twice.";
+  const bool fits = enough->lru.limit <= std::numeric_limits<std::uint32_t>::max();
+  return wholeBytes(enough->lru.limit) + " is enough: from there on, doubling the limit always turns less than " +
+         percent(tuning.worth) + " of the requests into hits." +
+         (fits ? "" : " (The library's own limits end below 4 GB.)");
+}
+
+std::string costOf(const Tuning& tuning, const TunedLimit& present) {
+  const std::string has = "The present limit of " + wholeBytes(present.lru.limit) + " finds " +
+                          percent(rate(present.lru.hits, tuning.requests));
+  const TunedLimit* const enough = enoughLimit(tuning);
+  if (enough == nullptr || enough == &present) return has + ".";
+  const std::string other = wholeBytes(enough->lru.limit);
+  const auto misses = [&](std::uint64_t count, const char* comparative) {
+    return formatCount(count) + comparative + (count == 1 ? "miss" : "misses") + " (" +
+           percent(rate(count, tuning.requests)) + " of the requests)";
+  };
+  if (enough->lru.limit > present.lru.limit) {
+    return has + ": " + misses(enough->lru.hits - present.lru.hits, " more ") + " than " + other + " would have.";
+  }
+  return has + ": " + misses(present.lru.hits - enough->lru.hits, " fewer ") + " than " + other + ", for " +
+         bytes(present.lru.limit - enough->lru.limit) + " more space.";
+}
+
+Json asJson(const Tuning& tuning, const TunedLimit& limit) {
+  Json json = {{"limit", limit.lru.limit},
+               {"hits", limit.lru.hits},
+               {"hit_rate", rate(limit.lru.hits, tuning.requests)},
+               {"hit_bytes", limit.lru.hitBytes},
+               {"byte_hit_rate", rate(limit.lru.hitBytes, tuning.requestedBytes)}};
+  if (limit.videoHits) json["video_hits"] = *limit.videoHits;
+  return json;
+}
+
+Json asJson(const Tuning& tuning, const TunedLimit* limit) {
+  return limit == nullptr ? Json() : asJson(tuning, *limit);
+}
+
+}  // namespace
+
+void printTuning(const TuneReport& report, Console& console) {
+  const Tuning& tuning = report.tuning;
+  console.heading(report.store.empty() ? report.source : report.store + ", from " + report.source);
+  printSource(report, console);
+  console.raw("\n" + tableOf(tuning));
+  console.verdict(adviceOf(tuning), true);
+  if (const TunedLimit* const present = presentLimit(tuning)) console.raw(costOf(tuning, *present) + "\n");
+}
+
+Json tuningAsJson(const TuneReport& report) {
+  const Tuning& tuning = report.tuning;
+  Json limits = Json::array();
+  for (const TunedLimit& limit : tuning.limits) limits.push_back(asJson(tuning, limit));
+  Json json = {{"source", report.source},
+               {"store", report.store},
+               {"requests", tuning.requests},
+               {"requested_bytes", tuning.requestedBytes},
+               {"keys", tuning.keys},
+               {"keys_of_unknown_size", tuning.keysOfUnknownSize},
+               {"assumed_size", tuning.assumedSize},
+               {"seconds", tuning.seconds},
+               {"largest_total", tuning.everything},
+               {"worth", tuning.worth},
+               {"limits", std::move(limits)},
+               {"enough", asJson(tuning, enoughLimit(tuning))},
+               {"present", asJson(tuning, presentLimit(tuning))},
+               {"damaged_lines", report.damagedLines}};
+  if (report.reportedHits) json["reported_hits"] = *report.reportedHits;
+  return json;
+}
+
+}  // namespace velmora::mobile::xplat::cellar::tools

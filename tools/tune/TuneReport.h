@@ -1,0 +1,25 @@
+#pragma once
+
+#include <cstdint>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <string>
+
+#include "tune/Tuning.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+class Console;
+
+struct TuneReport {
+  std::string source;                         // what was read
+  std::string store;                          // may be empty
+  std::optional<std::uint64_t> reportedHits;  // by the running cache, where the source tells
+  std::uint64_t damagedLines = 0;
+  Tuning tuning;
+};
+
+void printTuning(const TuneReport& report, Console& console);
+nlohmann::ordered_json tuningAsJson(const TuneReport& report);
+
+}  // namespace velmora::mobile::xplat::cellar::tools

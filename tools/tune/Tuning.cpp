@@ -1,0 +1,138 @@
+#include "tune/Tuning.h"
+
+#include <algorithm>
+
+#include "tune/Access.h"
+#include "tune/StackDistances.h"
+#include "tune/Trace.h"
+#include "tune/VideoCaches.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+namespace {
+
+constexpr int kMostOctaves = 16;       // listed
+constexpr int kPointsOfAnOctave = 32;  // plotted
+
+std::int64_t powerOfTwoFrom(std::int64_t bytes) {
+  std::int64_t power = 1;
+  while (power < bytes) power *= 2;
+  return power;
+}
+
+// To whole units that a configuration can have, where that adds but little.
+std::int64_t roundedUp(std::int64_t limit) {
+  for (const std::int64_t unit : {std::int64_t{1} << 20, std::int64_t{1} << 10}) {
+    if (limit >= 64 * unit) return (limit + unit - 1) / unit * unit;
+  }
+  return limit;
+}
+
+// Where listing begins: one doubling below the first limit that finds a hundredth of what can be found.
+std::int64_t firstLimit(const HitCurve& curve, std::int64_t last) {
+  std::int64_t first = last;
+  const std::uint64_t most = curve.most().hits;
+  for (int octave = 0; octave < kMostOctaves && first > 1; ++octave) {
+    if (curve.at(first).hits * 100 <= most) break;
+    first /= 2;
+  }
+  return first;
+}
+
+std::vector<std::int64_t> limitsToList(const HitCurve& curve, std::int64_t everything, std::int64_t present,
+                                       std::int64_t enough) {
+  const std::int64_t last = powerOfTwoFrom(everything);
+  std::vector<std::int64_t> limits = {present, enough};
+  for (std::int64_t limit = firstLimit(curve, last); limit <= last; limit *= 2) {
+    limits.push_back(limit);
+    const bool hasMiddle = limit % 2 == 0 && limit < last;
+    if (hasMiddle) limits.push_back(limit / 2 * 3);
+  }
+  std::sort(limits.begin(), limits.end());
+  limits.erase(std::unique(limits.begin(), limits.end()), limits.end());
+  limits.erase(limits.begin(), std::upper_bound(limits.begin(), limits.end(), 0));
+  return limits;
+}
+
+std::vector<HitCurve::Point> pointsToPlot(const HitCurve& curve, std::int64_t first, std::int64_t last) {
+  std::vector<HitCurve::Point> points;
+  for (std::int64_t octave = first; octave <= last; octave *= 2) {
+    std::int64_t latest = 0;
+    for (int i = 0; i < kPointsOfAnOctave; ++i) {
+      const std::int64_t limit = octave + octave * i / kPointsOfAnOctave;
+      if (limit > latest && limit <= last) points.push_back(curve.at(limit));
+      latest = limit;
+    }
+  }
+  return points;
+}
+
+struct Played {
+  HitCurve curve;
+  std::int64_t everything = 0;
+};
+
+Played playLeastRecentlyUsed(const Trace& trace, std::int64_t present, const std::function<void()>& onAccess) {
+  Played played{HitCurve(present)};
+  StackDistances distances;
+  trace.replay([&](const Access& access) {
+    if (access.kind == AccessKind::Remove) {
+      distances.remove(access.key);
+    } else {
+      const auto least = distances.use(access.key, access.size);
+      if (access.kind == AccessKind::Fetch && least) played.curve.addHit(*least, access.size);
+      if (access.kind == AccessKind::Fetch && !least) played.curve.addMiss(access.size);
+    }
+    onAccess();
+  });
+  played.everything = distances.peak();
+  return played;
+}
+
+void playVideoStrategy(const Trace& trace, std::vector<TunedLimit>& limits, const std::function<void()>& onAccess) {
+  std::vector<std::int64_t> bytes;
+  bytes.reserve(limits.size());
+  for (const TunedLimit& limit : limits) bytes.push_back(limit.lru.limit);
+  VideoCaches caches(bytes);
+  trace.replay([&](const Access& access) {
+    caches.access(access);
+    onAccess();
+  });
+  const auto results = caches.results();
+  for (std::size_t i = 0; i < limits.size(); ++i) limits[i].videoHits = results[i].hits;
+}
+
+const TunedLimit* first(const Tuning& tuning, bool TunedLimit::*mark) {
+  const auto found =
+      std::find_if(tuning.limits.begin(), tuning.limits.end(), [&](const TunedLimit& limit) { return limit.*mark; });
+  return found == tuning.limits.end() ? nullptr : &*found;
+}
+
+}  // namespace
+
+Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::function<void()>& onAccess) {
+  const Played played = playLeastRecentlyUsed(trace, present, onAccess);
+  const HitCurve& curve = played.curve;
+  const std::int64_t enough = roundedUp(curve.enough(worth).limit);
+  Tuning tuning;
+  tuning.requests = curve.requests();
+  tuning.requestedBytes = curve.requestedBytes();
+  tuning.keys = trace.keys();
+  tuning.keysOfUnknownSize = trace.keysOfUnknownSize();
+  tuning.assumedSize = trace.assumedSize();
+  tuning.seconds = trace.seconds();
+  tuning.everything = played.everything;
+  tuning.worth = worth;
+  for (const std::int64_t limit : limitsToList(curve, played.everything, present, enough)) {
+    tuning.limits.push_back({curve.at(limit), std::nullopt, limit == present, limit == enough});
+  }
+  if (trace.hasMetadata()) playVideoStrategy(trace, tuning.limits, onAccess);
+  const std::int64_t last = powerOfTwoFrom(played.everything);
+  tuning.curve = pointsToPlot(curve, firstLimit(curve, last), last);
+  return tuning;
+}
+
+const TunedLimit* presentLimit(const Tuning& tuning) { return first(tuning, &TunedLimit::isPresent); }
+const TunedLimit* enoughLimit(const Tuning& tuning) { return first(tuning, &TunedLimit::isEnough); }
+
+}  // namespace velmora::mobile::xplat::cellar::tools
