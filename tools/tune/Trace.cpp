@@ -79,8 +79,8 @@ std::int64_t Trace::seconds() const { return std::max<std::int64_t>(0, lastDate_
 std::uint32_t Trace::numberOf(const std::string& key) {
   const auto [found, isNew] = numbers_.emplace(key, static_cast<std::uint32_t>(firstSizes_.size()));
   if (isNew) {
-    if (firstSizes_.size() >= std::numeric_limits<std::uint32_t>::max() / 4)
-      throw InputError("there are too many keys");
+    constexpr std::size_t mostKeys = std::numeric_limits<std::uint32_t>::max() / 4;
+    if (firstSizes_.size() >= mostKeys) throw InputError("there are too many keys");
     firstSizes_.push_back(Access::kUnknownSize);
     mayBeEmpty_.push_back(false);
   }

@@ -45,22 +45,27 @@ struct TuneOptions {
   int earlySeconds = 0;
 };
 
-// The disk cache of that identifier or, since events carry names, of that name.
-std::int64_t configuredLimit(const std::string& file, const std::string& store) {
+// The store of that identifier or, since events carry names, of that name.
+std::shared_ptr<const StoreDefinition> findStore(const Understood& understood, const std::string& store) {
+  for (const UnderstoodManager& manager : understood) {
+    for (const UnderstoodStore& candidate : manager.stores) {
+      if (candidate.identifier == store || candidate.definition->name == store) return candidate.definition;
+    }
+  }
+  return nullptr;
+}
+
+std::int64_t configuredLimit(const std::string& file, const std::string& name) {
   const ConfigurationDocument document = readConfigurationDocument(file);
   const Findings faults = findFaults(document);
   if (!faults.empty()) throw InputError(file + ": " + faults.front().pointer + ": " + faults.front().text);
-  for (const UnderstoodManager& manager : understand(document, {})) {
-    for (const UnderstoodStore& candidate : manager.stores) {
-      if (candidate.identifier != store && candidate.definition->name != store) continue;
-      if (candidate.definition->type != StoreDefinition::Type::DiskCache) {
-        throw InputError(file + ": store '" + store + "' is no disk cache and has no size limit");
-      }
-      if (candidate.definition->maxSize == 0) throw InputError(file + ": the limit of store '" + store + "' is 0");
-      return candidate.definition->maxSize;
-    }
+  const auto store = findStore(understand(document, {}), name);
+  if (store == nullptr) throw InputError(file + ": there is no store '" + name + "'");
+  if (store->type != StoreDefinition::Type::DiskCache) {
+    throw InputError(file + ": store '" + name + "' is no disk cache and has no size limit");
   }
-  throw InputError(file + ": there is no store '" + store + "'");
+  if (store->maxSize == 0) throw InputError(file + ": the limit of store '" + name + "' is 0");
+  return store->maxSize;
 }
 
 std::string listOf(const EventCounts& counts) {

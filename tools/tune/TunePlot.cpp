@@ -129,7 +129,8 @@ class Plot {
       line("rule", x(limit), kTop, x(limit), kHeight - kBottom);
       text("soft", "middle", x(limit), kHeight - kBottom + 20, formatWholeSize(static_cast<std::uint64_t>(limit)));
     }
-    text("soft", "end", kWidth - kRight, kHeight - 12, "size limit, doubling from rule to rule");
+    text("soft", "end", kWidth - kRight, kHeight - 12,
+         "size limit, each rule " + std::to_string(1 << step) + " times the one before");
   }
 
   void drawCurves() {
