@@ -60,7 +60,7 @@ std::string tableOf(const Tuning& tuning) {
 void printSource(const TuneReport& report, Console& console) {
   const Tuning& tuning = report.tuning;
   console.line(formatCount(tuning.requests, "request", "requests") + " of " + formatCount(tuning.keys, "key", "keys") +
-               (tuning.seconds > 0 ? " in " + formatDuration(static_cast<std::uint64_t>(tuning.seconds)) : "") +
+               (tuning.seconds >= 60 ? " in " + formatDuration(static_cast<std::uint64_t>(tuning.seconds)) : "") +
                "; all items together have at most " + bytes(tuning.everything));
   if (report.reportedHits) {
     console.line("the running cache reported " + percent(rate(*report.reportedHits, tuning.requests)) + " hits");
