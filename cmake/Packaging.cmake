@@ -35,6 +35,9 @@ if(CELLAR_BUILD_TOOLS)
   file(RELATIVE_PATH libraries_from_tools /prefix/${CMAKE_INSTALL_BINDIR} /prefix/${CMAKE_INSTALL_LIBDIR})
   set_target_properties(cellar_tool PROPERTIES INSTALL_RPATH $ORIGIN/${libraries_from_tools})
   install(TARGETS cellar_tool RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR} COMPONENT tools)
+  install(FILES docs/cellar.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1 COMPONENT tools)
+  install(FILES packaging/cellar.bash DESTINATION ${CMAKE_INSTALL_DATADIR}/bash-completion/completions RENAME cellar
+    COMPONENT tools)
 endif()
 
 set(CPACK_PACKAGE_VENDOR "The authors of Cellar")
