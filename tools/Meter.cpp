@@ -11,14 +11,13 @@ namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
 constexpr std::size_t kBarWidth = 30;
-constexpr std::chrono::milliseconds kPatience(1000);
 constexpr std::chrono::milliseconds kDrawingInterval(100);
 constexpr std::uint32_t kCallsBetweenLooksAtTheClock = 1024;
 
 }  // namespace
 
-Meter::Meter(Console& console, std::string what)
-    : console_(console), what_(std::move(what)), nextDrawing_(std::chrono::steady_clock::now() + kPatience) {}
+Meter::Meter(Console& console, std::string what, std::chrono::milliseconds patience)
+    : console_(console), what_(std::move(what)), nextDrawing_(std::chrono::steady_clock::now() + patience) {}
 
 Meter::~Meter() {
   if (isDrawn_) console_.rewriteLine("");

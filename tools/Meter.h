@@ -8,11 +8,11 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 class Console;
 
-// How far something has come that may take longer than a moment: a bar on a terminal, from the second second on, and
+// How far something has come that may take longer than a moment: a bar on a terminal, once patience is over, and
 // nothing anywhere else.
 class Meter {
  public:
-  Meter(Console& console, std::string what);
+  Meter(Console& console, std::string what, std::chrono::milliseconds patience = std::chrono::seconds(1));
 
   // Leaves no half-drawn bar behind.
   ~Meter();

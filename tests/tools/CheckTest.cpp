@@ -9,6 +9,7 @@
 
 #include "Configuration.h"
 #include "Console.h"
+#include "InputError.h"
 #include "check/CheckReport.h"
 #include "check/ConfigurationDocument.h"
 #include "check/Faults.h"
@@ -257,6 +258,16 @@ TEST(CheckFaults, IdentifiersThatAreMetTwiceAreNamedWithTheirPlace) {
 TEST(CheckFaults, ADocumentThatIsNoObjectIsOne) {
   EXPECT_THAT(faultsOf("[]"), ElementsAre(": is no object of managers"));
   EXPECT_THAT(faultsOf("{}"), IsEmpty());
+}
+
+TEST(CheckFaults, ADocumentOfAbsurdDepthIsRefusedBeforeAnythingIsDoneWithIt) {
+  const auto nested = [](std::size_t depth) {
+    return R"({"m": {"stores": {"s": {"type": "pkvs", "capacity": )" + std::string(depth, '[') +
+           std::string(depth, ']') + "}}}}";
+  };
+  EXPECT_THAT(faultsOf(nested(196)), IsEmpty());
+  EXPECT_THROW(faultsOf(nested(197)), InputError);
+  EXPECT_THROW(faultsOf(nested(1'000'000)), InputError);
 }
 
 TEST(CheckFaults, AreThereExactlyWhenTheLibraryRefuses) {

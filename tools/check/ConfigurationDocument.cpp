@@ -1,6 +1,7 @@
 #include "check/ConfigurationDocument.h"
 
 #include <cstddef>
+#include <exception>
 #include <set>
 #include <utility>
 
@@ -19,6 +20,7 @@ class RepeatedNames {
       case OrderedJson::parse_event_t::object_start:
       case OrderedJson::parse_event_t::array_start:
         open_.emplace_back();
+        if (open_.size() > kTooDeep) throw InputError("is nested too deeply for a configuration");
         break;
       case OrderedJson::parse_event_t::object_end:
       case OrderedJson::parse_event_t::array_end:
@@ -35,7 +37,8 @@ class RepeatedNames {
   std::vector<std::string> take() { return std::move(pointers_); }
 
  private:
-  static constexpr std::size_t kDeepest = 4;  // document, manager, "stores", store
+  static constexpr std::size_t kDeepest = 4;    // document, manager, "stores", store
+  static constexpr std::size_t kTooDeep = 200;  // values are copied and shown, which takes stack for each level
 
   struct Names {
     std::set<std::string> met;
@@ -60,7 +63,7 @@ ConfigurationDocument readConfigurationDocument(const std::string& path) {
   const std::string text = readTextFile(path);
   try {
     return parseConfigurationDocument(text);
-  } catch (const OrderedJson::exception& error) {
+  } catch (const std::exception& error) {
     throw InputError(path + ": " + error.what());
   }
 }

@@ -16,10 +16,10 @@ struct ConfigurationDocument {
   std::vector<std::string> repeated;  // JSON pointers of those names
 };
 
-// Reads the file. Throws `InputError`, naming it, when it cannot be read or is not JSON.
+// Reads the file. Throws `InputError`, naming it, when it cannot be read, is not JSON or is nested beyond all reason.
 ConfigurationDocument readConfigurationDocument(const std::string& path);
 
-// The same from a text. Throws the JSON library's parse errors.
+// The same from a text. Throws the JSON library's parse errors, and `InputError` for the nesting.
 ConfigurationDocument parseConfigurationDocument(const std::string& text);
 
 // The JSON pointer of a member of what `pointer` points at.
