@@ -11,8 +11,8 @@
 #include "check/Check.h"
 #include "demo/Demo.h"
 #include "inspect/Inspect.h"
-#include "verify/Verify.h"
 #include "tune/Tune.h"
+#include "verify/Verify.h"
 
 namespace {
 
@@ -33,16 +33,14 @@ void keepLogOffTheTerminal(const char* program) {
 
 void describe(CLI::App& app) {
   app.description(
-      "Cellar manages an application's storage on a device. This program shows it at work, and looks into directories\n"
-      "that it has filled.");
+      "Cellar manages an application's storage on a device. This program shows it at work, looks into directories "
+      "that\n"
+      "it has filled, and helps with its configuration and its limits.");
   app.footer(
-      "Examples:\n  cellar demo ~/Pictures\n  cellar inspect /tmp/cellar-demo\n\nExit status: 0 when all is well, 1 "
-      "when something was found, 2 for usage and input errors.");
-      "Cellar manages an application's storage on a device. This program shows it at work, and helps with its\n"
-      "configuration and its limits.");
-  app.footer(
-      "Examples:\n  cellar demo ~/Pictures\n  cellar check storage.json\n  cellar tune analytics.jsonl --store "
-      "thumbs\n\nExit status: 0 when all is well, 1 when something was found, 2 for usage and input errors.");
+      "Examples:\n  cellar demo ~/Pictures\n  cellar check storage.json\n  cellar inspect /tmp/cellar-demo\n  cellar "
+      "tune "
+      "analytics.jsonl --store thumbs\n\nExit status: 0 when all is well, 1 when something was found, 2 for usage and "
+      "input errors.");
   app.set_version_flag("--version", kVersion);
   app.require_subcommand(1);
 }
