@@ -92,6 +92,17 @@ TEST_F(TraceReadersTest, AccessesAreReadAsTheReporterAndTheSinkWriteThem) {
   EXPECT_THAT(linesOf(trace), ElementsAre("fetch 0 30", "fetch 0 30", "fetch 1 40"));
 }
 
+TEST_F(TraceReadersTest, AHitThatIsTheFirstAccessToItsKeyIsCountedAsWhatWasStoredUnseen) {
+  hit("s", "a", 10);
+  hit("s", "a", 10);
+  miss("s", "b");
+  hit("s", "b", 10);
+  hit("s", "c", 10);
+  const EventCounts counts = readLines();
+  EXPECT_EQ(counts.hits, 4U);
+  EXPECT_EQ(counts.firstHits, 2U);
+}
+
 TEST_F(TraceReadersTest, AMissHasTheSizeLastSeenOrElseTheOneSeenNext) {
   miss("s", "a");
   hit("s", "a", 30);

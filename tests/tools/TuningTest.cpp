@@ -110,6 +110,24 @@ TEST_F(TuningTest, SaysWhatThePresentLimitCosts) {
   EXPECT_THAT(printed(), Not(HasSubstr("present limit")));
 }
 
+TEST_F(TuningTest, SaysHowManyReportedHitsItCannotSee) {
+  askInTurn(10, 11);
+  TuneReport report;
+  report.tuning = tuned();
+  report.reportedHits = 110;
+  const auto print = [&] {
+    std::ostringstream out;
+    Console console(out, false, false);
+    printTuning(report, console);
+    return out.str();
+  };
+  EXPECT_THAT(print(), HasSubstr("reported 100.00 % hits\n\n"));
+  report.reportedFirstHits = 10;
+  EXPECT_THAT(print(),
+              HasSubstr("reported 100.00 % hits\n  10 of these were the first request of a key that was stored "
+                        "unseen; they count as misses below\n"));
+}
+
 TEST_F(TuningTest, NamesTheRuleThatItsAdviceFollows) {
   askInTurn(10, 11);
   EXPECT_THAT(printed(), HasSubstr("10 MB is enough: from there on, doubling the limit always turns less than 1.00 % "

@@ -73,8 +73,11 @@ EventCounts readEvents(LineReader& lines, const std::string& store, Trace& trace
     if (!access) continue;
     ++counts.accessesOfStores[access->store];
     if (!store.empty() && access->store != store) continue;
-    if (access->isHit) ++counts.hits;
+    const std::uint64_t keys = trace.keys();
     append(*access, trace);
+    if (!access->isHit) continue;
+    ++counts.hits;
+    if (trace.keys() > keys) ++counts.firstHits;
   }
   return counts;
 }

@@ -14,6 +14,7 @@ class Trace;
 struct EventCounts {
   std::map<std::string, std::uint64_t> accessesOfStores;  // all stores that the lines name
   std::uint64_t hits = 0;                                 // of the store chosen, as they were reported
+  std::uint64_t firstHits = 0;                            // those among them that are the first access to their key
   std::uint64_t damagedLines = 0;                         // passed over
 };
 

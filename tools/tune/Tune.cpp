@@ -90,6 +90,7 @@ void readReportedEvents(const TuneOptions& options, LineReader& lines, Trace& tr
   }
   report.store = options.store.empty() ? counts.accessesOfStores.begin()->first : options.store;
   report.reportedHits = counts.hits;
+  report.reportedFirstHits = counts.firstHits;
   report.damagedLines = counts.damagedLines;
 }
 

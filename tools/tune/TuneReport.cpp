@@ -64,6 +64,10 @@ void printSource(const TuneReport& report, Console& console) {
                "; all items together have at most " + bytes(tuning.everything));
   if (report.reportedHits) {
     console.line("the running cache reported " + percent(rate(*report.reportedHits, tuning.requests)) + " hits");
+    if (report.reportedFirstHits > 0) {
+      console.line(formatCount(report.reportedFirstHits) +
+                   " of these were the first request of a key that was stored unseen; they count as misses below");
+    }
   }
   if (tuning.keysOfUnknownSize > 0) {
     console.line(formatCount(tuning.keysOfUnknownSize, "key was", "keys were") +
@@ -144,7 +148,10 @@ Json tuningAsJson(const TuneReport& report) {
                {"enough", asJson(tuning, enoughLimit(tuning))},
                {"present", asJson(tuning, presentLimit(tuning))},
                {"damaged_lines", report.damagedLines}};
-  if (report.reportedHits) json["reported_hits"] = *report.reportedHits;
+  if (report.reportedHits) {
+    json["reported_hits"] = *report.reportedHits;
+    json["reported_first_hits"] = report.reportedFirstHits;
+  }
   return json;
 }
 

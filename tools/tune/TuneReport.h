@@ -15,6 +15,7 @@ struct TuneReport {
   std::string source;                         // what was read
   std::string store;                          // may be empty
   std::optional<std::uint64_t> reportedHits;  // by the running cache, where the source tells
+  std::uint64_t reportedFirstHits = 0;        // the first access to their key: of what was stored unseen
   std::uint64_t damagedLines = 0;
   Tuning tuning;
 };
