@@ -46,13 +46,16 @@ std::optional<Bytes> readIfThere(FileUtils& fileUtils, const std::string& path) 
   }
 }
 
+// An empty log has an empty header: one that has begun since is another.
+Bytes headerOf(const Bytes& log) {
+  return {log.begin(), log.begin() + static_cast<std::ptrdiff_t>(std::min(log.size(), kLogHeaderSize))};
+}
+
 // Whether the log was only written on between two readings. Then whatever a checkpoint has moved into the manifest
 // meanwhile still stands in the later reading, too, and manifest and log go together.
 bool isSameLog(const std::optional<Bytes>& earlier, const std::optional<Bytes>& later) {
   if (!earlier || !later) return !earlier && !later;
-  const std::size_t header = std::min(earlier->size(), kLogHeaderSize);
-  return earlier->size() <= later->size() &&
-         std::equal(earlier->begin(), earlier->begin() + static_cast<std::ptrdiff_t>(header), later->begin());
+  return earlier->size() <= later->size() && headerOf(*earlier) == headerOf(*later);
 }
 
 Files readConsistently(FileUtils& fileUtils, const std::string& path) {

@@ -262,6 +262,20 @@ TEST_F(ManifestSnapshotTest, IsTakenAgainWhenACheckpointCameInBetween) {
   EXPECT_THAT(snapshot.damages(), IsEmpty());
 }
 
+TEST_F(ManifestSnapshotTest, IsTakenAgainWhenAnEmptyLogHasBegunMeanwhile) {
+  const auto manifest = openManifest();
+  run("PRAGMA wal_checkpoint(TRUNCATE);");
+  ASSERT_EQ(directory_.read("store/manifest_v1.sqlite-wal"), "");
+  const auto files = std::make_shared<InterruptedFileUtils>();
+  int readings = 0;
+  files->onRead = [&](const std::string& path) {
+    if (!isLog(path) && ++readings == 1) manifest->setItem({"key", "key", 7, false, 10, 20, nullptr});
+  };
+  const ManifestSnapshot snapshot(directory_.file("store"), directory_.file("temporary"), files);
+  EXPECT_EQ(readings, 2);
+  EXPECT_EQ(snapshot.records(nullptr).size(), 1U);
+}
+
 TEST_F(ManifestSnapshotTest, GivesUpOnAManifestThatNeverStandsStill) {
   const auto manifest = openManifest();
   manifest->setItem({"key", "key", 7, false, 10, 20, nullptr});

@@ -45,6 +45,7 @@ Json asJson(const StoreSurvey& store) {
   json["files"] = store.files;
   json["file_bytes"] = store.fileBytes;
   json["inline_bytes"] = store.inlineBytes;
+  json["held_bytes"] = store.heldBytes();
   json["manifest_bytes"] = store.manifestBytes;
   json["allocated_bytes"] = store.allocatedBytes;
   json["limit_bytes"] = orNull(store.limitBytes);

@@ -59,7 +59,7 @@ async function checkFigures(tab) {
     if (key !== "leftover_bytes") assert.ok(named.has("totals." + key), "no figure for " + key);
   }
   survey.managers.forEach((manager, m) => manager.stores.forEach((store, s) => {
-    for (const key of ["items", "allocated_bytes"]) assert.ok(named.has(`managers.${m}.stores.${s}.${key}`), store.path);
+    for (const key of ["items", "held_bytes", "allocated_bytes"]) assert.ok(named.has(`managers.${m}.stores.${s}.${key}`), store.path);
   }));
   return figures.length;
 }

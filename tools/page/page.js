@@ -76,8 +76,7 @@ function storeFigures(store, at) {
   const add = (title, path, text) => list.append(make("dt", { textContent: title }), figure("dd", at + path, text));
   add("Items", "items", formatCount(store.items));
   if (store.recorded_bytes !== null) add("Recorded", "recorded_bytes", formatSize(store.recorded_bytes));
-  add("Held", store.file_bytes || !store.inline_bytes ? "file_bytes" : "inline_bytes",
-    formatSize(store.file_bytes || store.inline_bytes));
+  add("Held", "held_bytes", formatSize(store.held_bytes));
   add("On disk", "allocated_bytes", formatSize(store.allocated_bytes));
   if (store.oldest_access !== null) add("Oldest use", "oldest_access", formatAge(store.oldest_access));
   if (store.newest_access !== null) add("Last use", "newest_access", formatAge(store.newest_access));
