@@ -11,12 +11,13 @@
 
 #include "support/Context.h"
 #include "support/Memory.h"
+#include "support/Recording.h"
 #include "support/Stopwatch.h"
 #include "topics/Topics.h"
 
 namespace {
 
-using namespace velmora::mobile::xplat::cellar;  // NOLINT(google-build-using-namespace): a program's own file
+namespace bench = velmora::mobile::xplat::cellar::bench;
 
 constexpr std::size_t kWarmedAtTheStart = std::size_t{1} << 30U;
 
@@ -25,6 +26,8 @@ struct Arguments {
   std::vector<std::string> places;
   std::vector<std::string> topics;
   std::string results;
+  std::string document;
+  std::string plots;
 };
 
 bench::Place placeOf(const std::string& text) {
@@ -35,6 +38,13 @@ bench::Place placeOf(const std::string& text) {
 bool isWanted(const Arguments& arguments, const std::string& topic) {
   const auto& wanted = arguments.topics;
   return wanted.empty() || std::find(wanted.begin(), wanted.end(), topic) != wanted.end();
+}
+
+// After each topic, so that one that fails or is interrupted takes nothing along.
+void record(const Arguments& arguments, const bench::Report& report) {
+  std::ofstream(arguments.results) << report.json().dump(2) << "\n";
+  if (!arguments.plots.empty()) bench::writePlotScripts(report, arguments.plots);
+  if (!arguments.document.empty()) bench::recordTables(report, arguments.document);
 }
 
 void run(const Arguments& arguments) {
@@ -52,8 +62,8 @@ void run(const Arguments& arguments) {
     topic.measure(context);
     std::cout << "\n" << topic.title << "\n\n" << bench::tableText(report.topics().back()) << std::flush;
     std::cerr << topic.name << ": " << watch.microseconds() / 1e6 << " s\n";
+    record(arguments, report);
   }
-  std::ofstream(arguments.results) << report.json().dump(2) << "\n";
 }
 
 }  // namespace
@@ -64,6 +74,8 @@ int main(int argc, char** argv) {
   app.add_flag("--quick", arguments.quick, "Fewer and smaller measurements");
   app.add_option("--place", arguments.places, "NAME:DIRECTORY to measure in")->required();
   app.add_option("--results", arguments.results, "The file for the results, as JSON")->required();
+  app.add_option("--plots", arguments.plots, "A directory for gnuplot scripts");
+  app.add_option("--document", arguments.document, "The document that takes the tables over");
   app.add_option("--topic", arguments.topics, "Measure only this topic; may be repeated");
   CLI11_PARSE(app, argc, argv);
   try {

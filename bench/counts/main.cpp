@@ -12,7 +12,7 @@
 #include "counts/Comparison.h"
 #include "counts/Scenario.h"
 
-using namespace velmora::mobile::xplat::cellar;  // NOLINT(google-build-using-namespace): a program's own file
+namespace bench = velmora::mobile::xplat::cellar::bench;
 
 // Counting begins and ends with this function, which is known by its name.
 extern "C" __attribute__((noinline, visibility("default"))) void cellar_counted_section(bench::Scenario* scenario) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <vector>
 
 #include "support/Fill.h"
@@ -14,6 +15,11 @@ struct Context {
   std::vector<Place> places{};
   Report& report;
   Manifests& manifests;
+
+  // Whether threads are kept on one processor: both, but for large values in a quick run.
+  std::vector<bool> pinnings(std::size_t size) const {
+    return quick && size > std::size_t{4096} ? std::vector<bool>{false} : std::vector<bool>{false, true};
+  }
 
   // A number of operations, items or repetitions; smaller in a quick run.
   template <class Number> Number scaled(Number full, Number small) const { return quick ? small : full; }

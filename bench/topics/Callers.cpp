@@ -23,6 +23,7 @@ namespace {
 // Each value is written several times, so that the space stays bounded.
 constexpr std::size_t kKeys = 64;
 
+constexpr std::size_t kPlottedSize = 4 << 10;
 constexpr double kMedian = 0.5;
 constexpr double kTail = 0.999;
 
@@ -131,6 +132,18 @@ void report(const Context& context, const std::string& what, const Place& place,
   context.report.add(Row{what + name, place.name, cpuName(pinned), "us", figures, goals});
 }
 
+// How many calls of a hundred, a thousand and so on took longer than what.
+Plot distributionOf(const std::map<std::string, Taken>& all, const std::string& size) {
+  Plot plot{"latency", "The caller's time for a store of " + size, "one call of so many takes longer", "microseconds",
+            true};
+  for (const auto& [contestant, taken] : all) {
+    for (const double calls : {2, 5, 10, 20, 50, 100, 200, 500, 1000, 2000}) {
+      plot.lines[contestant].emplace_back(calls, quantile(taken.puts, 1 - 1 / calls));
+    }
+  }
+  return plot;
+}
+
 void measureCase(const Context& context, const Place& place, bool pinned, const Case& what) {
   const Pinned guard(pinned);
   std::vector<std::pair<std::string, std::unique_ptr<Contestant>>> contestants;
@@ -139,7 +152,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
     contestants.emplace_back(name, std::make_unique<RivalCaller>(place, open));
   }
   std::map<std::string, Taken> taken;
-  for (int turn = 0; turn < context.scaled(10, 3); ++turn) {
+  for (int turn = 0; turn < context.scaled(7, 3); ++turn) {
     for (auto& [name, contestant] : contestants) {
       warmMemory(kKeys * what.size);
       takeTurn(*contestant, what, taken[name]);
@@ -151,6 +164,8 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   report(context, "store, " + size, place, pinned, taken, &Taken::puts, kTail, tailGoals);
   report(context, "fetch, " + size, place, pinned, taken, &Taken::gets, kMedian, {});
   report(context, "fetch, " + size, place, pinned, taken, &Taken::gets, kTail, tailGoals);
+  const bool isPlotted = what.size == kPlottedSize && !pinned && place.name == context.places.front().name;
+  if (isPlotted) context.report.add(distributionOf(taken, size));
 }
 
 // What a store of 1 MiB asks for: the copy that the call makes, if there is no other.
@@ -176,7 +191,9 @@ void countCopies(const Context& context, const Place& place) {
 void measureCallers(const Context& context) {
   for (const Case& what : cases(context)) {
     for (const Place& place : context.places) {
-      for (const bool pinned : {false, true}) measureCase(context, place, pinned, what);
+      // The largest take the rivals too long for a second place.
+      if (what.size >= 1U << 20U && place.name != context.places.front().name) continue;
+      for (const bool pinned : context.pinnings(what.size)) measureCase(context, place, pinned, what);
     }
   }
   countCopies(context, context.places.back());

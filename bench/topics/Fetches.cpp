@@ -154,7 +154,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
     contestants.emplace_back(name,
                              [rival = std::make_shared<RivalFetches>(place, what, open)] { return rival->measure(); });
   }
-  Figures figures = interleaved(contestants, context.scaled(7, 3), what.size * kOutstanding);
+  Figures figures = interleaved(contestants, context.scaled(5, 3), what.size * kOutstanding);
   const double outstanding = figures.extract("64").mapped();
   const double single = figures.extract("1").mapped();
   figures["ours"] = outstanding;
@@ -169,7 +169,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
 void measureFetches(const Context& context) {
   for (const Case& what : cases(context)) {
     for (const Place& place : context.places) {
-      for (const bool pinned : {false, true}) measureCase(context, place, pinned, what);
+      for (const bool pinned : context.pinnings(what.size)) measureCase(context, place, pinned, what);
     }
   }
 }

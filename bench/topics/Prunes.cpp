@@ -95,7 +95,7 @@ void measureGrowth(const Context& context, const Place& place) {
   const Figures growth = {{"ours", last["ours"] / first["ours"]}, {"floor", last["floor"] / first["floor"]}};
   const std::string name = "growth from " + countName(few) + " to " + countName(many) + " items";
   context.report.add(Row{name, place.name, cpuName(false), "times", growth, {{"", 1.1}}});
-  context.report.add(plot);
+  if (place.name == context.places.front().name) context.report.add(plot);
 }
 
 }  // namespace

@@ -110,7 +110,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   for (const auto& [name, open] : rivals()) {
     contestants.emplace_back(name, [&, open = open] { return measureRival(place, pinned, what, open); });
   }
-  Figures figures = interleaved(contestants, context.scaled(7, 3), what.count * what.size);
+  Figures figures = interleaved(contestants, context.scaled(5, 3), what.count * what.size);
   const double outstanding = figures.extract("64").mapped();
   const double single = figures.extract("1").mapped();
   const std::string name = sizeName(what.size) + (what.inlineData ? " inline" : "");
@@ -125,7 +125,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
 void measureStores(const Context& context) {
   for (const Case& what : cases(context)) {
     for (const Place& place : context.places) {
-      for (const bool pinned : {false, true}) measureCase(context, place, pinned, what);
+      for (const bool pinned : context.pinnings(what.size)) measureCase(context, place, pinned, what);
     }
   }
 }
