@@ -25,9 +25,9 @@ using testing::HasSubstr;
 using testing::IsEmpty;
 using Lines = std::vector<std::string>;
 
-Lines linesOf(const Findings& findings) {
+Lines linesOf(const Remarks& findings) {
   Lines lines;
-  for (const Finding& finding : findings) lines.push_back(finding.pointer + ": " + finding.text);
+  for (const Remark& finding : findings) lines.push_back(finding.pointer + ": " + finding.text);
   return lines;
 }
 

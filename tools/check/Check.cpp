@@ -56,7 +56,7 @@ CheckResult check(const CheckOptions& options) {
 }
 
 void printFaults(const CheckResult& result) {
-  for (const Finding& fault : result.faults) {
+  for (const Remark& fault : result.faults) {
     const std::string place = fault.pointer.empty() ? "" : fault.pointer + ": ";
     std::cerr << "cellar: " << result.file << ": " << place << fault.text << std::endl;
   }

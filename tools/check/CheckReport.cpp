@@ -83,9 +83,9 @@ std::size_t storesIn(const Understood& understood) {
   return count;
 }
 
-OrderedJson asJson(const Findings& findings) {
+OrderedJson asJson(const Remarks& findings) {
   OrderedJson list = OrderedJson::array();
-  for (const Finding& finding : findings) {
+  for (const Remark& finding : findings) {
     list.push_back({{"kind", finding.kind}, {"path", finding.pointer}, {"text", finding.text}});
   }
   return list;
@@ -143,7 +143,7 @@ OrderedJson asJson(const UnderstoodManager& manager) {
 void printCheck(const CheckResult& result, Console& console) {
   for (const UnderstoodManager& manager : result.understood) printManager(manager, console);
   console.raw("\n");
-  for (const Finding& warning : result.warnings) console.bad("warning: " + warning.pointer + ": " + warning.text);
+  for (const Remark& warning : result.warnings) console.bad("warning: " + warning.pointer + ": " + warning.text);
   const std::string counts = formatCount(result.understood.size(), "manager", "managers") + ", " +
                              formatCount(storesIn(result.understood), "store", "stores") + ", ";
   console.verdict(result.file + ": " + counts + formatCount(result.warnings.size(), "warning", "warnings"),

@@ -3,7 +3,7 @@
 #include <string>
 
 #include "check/ConfigurationDocument.h"
-#include "check/Findings.h"
+#include "check/Remarks.h"
 #include "check/Understood.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -14,8 +14,8 @@ class Console;
 struct CheckResult {
   std::string file;
   Understood understood;  // empty when there are faults
-  Findings faults;
-  Findings warnings;
+  Remarks faults;
+  Remarks warnings;
 };
 
 void printCheck(const CheckResult& result, Console& console);

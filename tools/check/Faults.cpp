@@ -33,7 +33,7 @@ std::string refusalOf(const OrderedJson& document) {
 // Each value is put before the parser alone, in the smallest document that can hold it.
 class FaultFinder {
  public:
-  Findings find(const OrderedJson& root) {
+  Remarks find(const OrderedJson& root) {
     if (!root.is_object()) {
       add("", "is no object of managers");
       return findings_;
@@ -86,7 +86,7 @@ class FaultFinder {
 
   static OrderedJson around(const OrderedJson& store) { return {{"m", {{"stores", {{"s", store}}}}}}; }
 
-  Findings findings_;
+  Remarks findings_;
 };
 
 // A manager's name, or a store's identifier, which may not be met twice.
@@ -96,8 +96,8 @@ bool namesADefinition(const std::string& pointer) {
 }
 
 // Where an identifier stands in the document for the second time.
-Findings findRepeatedIdentifiers(const ConfigurationDocument& document) {
-  Findings findings;
+Remarks findRepeatedIdentifiers(const ConfigurationDocument& document) {
+  Remarks findings;
   for (const std::string& pointer : document.repeated) {
     if (!namesADefinition(pointer)) continue;
     findings.push_back({kKind, pointer, "stands here twice"});
@@ -121,7 +121,7 @@ Findings findRepeatedIdentifiers(const ConfigurationDocument& document) {
 
 }  // namespace
 
-Findings findFaults(const ConfigurationDocument& document) {
+Remarks findFaults(const ConfigurationDocument& document) {
   std::string refusal;
   try {
     const Configuration configuration(document.text);
@@ -129,8 +129,8 @@ Findings findFaults(const ConfigurationDocument& document) {
   } catch (const std::exception& error) {
     refusal = error.what();
   }
-  Findings findings = FaultFinder().find(document.root);
-  const Findings repeated = findRepeatedIdentifiers(document);
+  Remarks findings = FaultFinder().find(document.root);
+  const Remarks repeated = findRepeatedIdentifiers(document);
   findings.insert(findings.end(), repeated.begin(), repeated.end());
   if (findings.empty()) findings.push_back({kKind, "", refusal});
   return findings;

@@ -50,7 +50,7 @@ std::string inHumanUnits(std::uint32_t value, Measure measure) {
 }
 
 void warnOfQuantity(const std::string& pointer, const OrderedJson& object, const char* key, Measure measure,
-                    Findings& findings) {
+                    Remarks& findings) {
   const auto member = object.find(key);
   if (member == object.end()) return;
   const std::string text = member->get<std::string>();
@@ -69,7 +69,7 @@ void warnOfQuantity(const std::string& pointer, const OrderedJson& object, const
 }
 
 void warnOfUnknownKey(const std::string& place, const std::string& key, const std::vector<std::string>& known,
-                      const std::string& otherwise, Findings& findings) {
+                      const std::string& otherwise, Remarks& findings) {
   const std::string nearest = nearestKey(key, known);
   const std::string hint = nearest.empty() ? otherwise : "; did you mean '" + nearest + "'?";
   findings.push_back({"unknown_key", place, "unknown key" + hint});
@@ -85,7 +85,7 @@ std::vector<std::string> keysOfAnyStore() {
   return keys;
 }
 
-void warnOfStoreKey(const std::string& pointer, const std::string& type, const std::string& key, Findings& findings) {
+void warnOfStoreKey(const std::string& pointer, const std::string& type, const std::string& key, Remarks& findings) {
   const std::vector<std::string>& known = keysOfStores(type);
   if (contains(known, key)) return;
   const std::string place = memberPointer(pointer, key);
@@ -100,7 +100,7 @@ void warnOfStoreKey(const std::string& pointer, const std::string& type, const s
   }
 }
 
-void warnOfVersion(const std::string& pointer, const OrderedJson& store, Findings& findings) {
+void warnOfVersion(const std::string& pointer, const OrderedJson& store, Remarks& findings) {
   const auto version = store.find("version");
   if (version == store.end()) return;
   const auto written = version->get<std::int64_t>();
@@ -112,7 +112,7 @@ void warnOfVersion(const std::string& pointer, const OrderedJson& store, Finding
                       version->dump() + " does not fit into 32 bits and has become " + std::to_string(wrapped)});
 }
 
-void warnOfCapacity(const std::string& pointer, const OrderedJson& store, Findings& findings) {
+void warnOfCapacity(const std::string& pointer, const OrderedJson& store, Remarks& findings) {
   const auto capacity = store.find("capacity");
   if (capacity == store.end()) return;
   const std::string place = memberPointer(pointer, "capacity");
@@ -125,7 +125,7 @@ void warnOfCapacity(const std::string& pointer, const OrderedJson& store, Findin
 
 }  // namespace
 
-void warnOfManagerKeys(const std::string& pointer, const OrderedJson& manager, Findings& findings) {
+void warnOfManagerKeys(const std::string& pointer, const OrderedJson& manager, Remarks& findings) {
   for (const auto& [key, value] : manager.items()) {
     if (contains(keysOfManagers(), key)) continue;
     const bool isStores = contains(keysOfAnyStore(), key);
@@ -140,7 +140,7 @@ void warnOfManagerKeys(const std::string& pointer, const OrderedJson& manager, F
   }
 }
 
-void warnOfStoreKeys(const std::string& pointer, const OrderedJson& store, Findings& findings) {
+void warnOfStoreKeys(const std::string& pointer, const OrderedJson& store, Remarks& findings) {
   const std::string type = store.at("type").get<std::string>();
   for (const auto& [key, value] : store.items()) warnOfStoreKey(pointer, type, key, findings);
   warnOfVersion(pointer, store, findings);

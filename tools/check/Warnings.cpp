@@ -15,7 +15,7 @@ namespace {
 
 constexpr std::size_t kLongestFileName = 255;  // bytes, of the file systems of phones
 
-void warnOfDiskCache(const UnderstoodStore& store, const DiskCacheDefinition& cache, Findings& findings) {
+void warnOfDiskCache(const UnderstoodStore& store, const DiskCacheDefinition& cache, Remarks& findings) {
   if (cache.lruSizeLimit == 0) {
     findings.push_back({"no_limit", memberPointer(store.pointer, "lru_size_limit"),
                         "is 0 B: each round of pruning empties the cache"});
@@ -33,7 +33,7 @@ void warnOfDiskCache(const UnderstoodStore& store, const DiskCacheDefinition& ca
   }
 }
 
-void warnOfLimits(const UnderstoodStore& store, Findings& findings) {
+void warnOfLimits(const UnderstoodStore& store, Remarks& findings) {
   const StoreDefinition& definition = *store.definition;
   if (definition.type == StoreDefinition::Type::DiskCache) {
     warnOfDiskCache(store, static_cast<const DiskCacheDefinition&>(definition), findings);
@@ -44,7 +44,7 @@ void warnOfLimits(const UnderstoodStore& store, Findings& findings) {
   }
 }
 
-void warnOfFileName(const UnderstoodStore& store, Findings& findings) {
+void warnOfFileName(const UnderstoodStore& store, Remarks& findings) {
   const std::string& name = store.definition->name;
   const std::string place = name == store.identifier ? store.pointer : memberPointer(store.pointer, "name");
   if (name.find('/') != std::string::npos) {
@@ -61,7 +61,7 @@ void warnOfFileName(const UnderstoodStore& store, Findings& findings) {
 }
 
 // Caches within their limits may still be over their manager's, and then nothing is there to be pruned.
-void warnOfManagerLimit(const UnderstoodManager& manager, Findings& findings) {
+void warnOfManagerLimit(const UnderstoodManager& manager, Remarks& findings) {
   std::uint64_t sum = 0;
   for (const UnderstoodStore& store : manager.stores) {
     if (store.definition->isCache) sum += store.definition->maxSize;
@@ -72,7 +72,7 @@ void warnOfManagerLimit(const UnderstoodManager& manager, Findings& findings) {
                           formatSize(manager.definition->maxSize)});
 }
 
-void warnOfPruning(const UnderstoodManager& manager, Findings& findings) {
+void warnOfPruning(const UnderstoodManager& manager, Remarks& findings) {
   if (manager.definition->pruneInterval != 0) return;
   for (const UnderstoodStore& store : manager.stores) {
     if (store.definition->type != StoreDefinition::Type::DiskCache) continue;
@@ -86,7 +86,7 @@ void warnOfPruning(const UnderstoodManager& manager, Findings& findings) {
 // events and log lines.
 class Namesakes {
  public:
-  void lookAt(const UnderstoodManager& manager, Findings& findings) {
+  void lookAt(const UnderstoodManager& manager, Remarks& findings) {
     lookAtManagerDirectory(manager, findings);
     for (const UnderstoodStore& store : manager.stores) lookAtStore(manager, store, findings);
   }
@@ -94,7 +94,7 @@ class Namesakes {
  private:
   using FirstOf = std::map<std::string, std::string>;  // to its pointer
 
-  void lookAtManagerDirectory(const UnderstoodManager& manager, Findings& findings) {
+  void lookAtManagerDirectory(const UnderstoodManager& manager, Remarks& findings) {
     const auto [first, isFirst] = managers_.emplace(manager.directory, manager.pointer);
     if (isFirst) return;
     findings.push_back({"shared_directory", manager.pointer,
@@ -102,7 +102,7 @@ class Namesakes {
                             ": each cleans up the other's stores"});
   }
 
-  void lookAtStore(const UnderstoodManager& manager, const UnderstoodStore& store, Findings& findings) {
+  void lookAtStore(const UnderstoodManager& manager, const UnderstoodStore& store, Remarks& findings) {
     const auto [place, isFirstThere] = stores_.emplace(manager.directory + "/" + store.directory, store.pointer);
     const auto [namesake, isFirstOfName] = names_.emplace(store.definition->name, store.pointer);
     if (!isFirstThere) {
@@ -120,7 +120,7 @@ class Namesakes {
   FirstOf names_;
 };
 
-void warnOfRepeatedKeys(const ConfigurationDocument& document, Findings& findings) {
+void warnOfRepeatedKeys(const ConfigurationDocument& document, Remarks& findings) {
   for (const std::string& pointer : document.repeated) {
     findings.push_back({"repeated_key", pointer, "stands here more than once; only the last counts"});
   }
@@ -128,8 +128,8 @@ void warnOfRepeatedKeys(const ConfigurationDocument& document, Findings& finding
 
 }  // namespace
 
-Findings findWarnings(const ConfigurationDocument& document, const Understood& understood) {
-  Findings findings;
+Remarks findWarnings(const ConfigurationDocument& document, const Understood& understood) {
+  Remarks findings;
   Namesakes namesakes;
   for (const UnderstoodManager& manager : understood) {
     const OrderedJson& written = document.root.at(manager.definition->name);

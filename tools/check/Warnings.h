@@ -1,12 +1,12 @@
 #pragma once
 
 #include "check/ConfigurationDocument.h"
-#include "check/Findings.h"
+#include "check/Remarks.h"
 #include "check/Understood.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
 // What the library accepts without a word though nobody can mean it, in the order of the document.
-Findings findWarnings(const ConfigurationDocument& document, const Understood& understood);
+Remarks findWarnings(const ConfigurationDocument& document, const Understood& understood);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -57,7 +57,7 @@ std::shared_ptr<const StoreDefinition> findStore(const Understood& understood, c
 
 std::int64_t configuredLimit(const std::string& file, const std::string& name) {
   const ConfigurationDocument document = readConfigurationDocument(file);
-  const Findings faults = findFaults(document);
+  const Remarks faults = findFaults(document);
   if (!faults.empty()) throw InputError(file + ": " + faults.front().pointer + ": " + faults.front().text);
   const auto store = findStore(understand(document, {}), name);
   if (store == nullptr) throw InputError(file + ": there is no store '" + name + "'");

@@ -6,12 +6,12 @@
 namespace velmora::mobile::xplat::cellar::tools {
 
 // What is wrong with a configuration, and where.
-struct Finding {
+struct Remark {
   std::string kind;     // one word for machines
   std::string pointer;  // JSON pointer of the value, empty for the whole document
   std::string text;
 };
 
-using Findings = std::vector<Finding>;
+using Remarks = std::vector<Remark>;
 
 }  // namespace velmora::mobile::xplat::cellar::tools
