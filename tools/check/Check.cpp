@@ -12,6 +12,7 @@
 #include "check/Faults.h"
 #include "check/Understood.h"
 #include "check/Warnings.h"
+#include "storage/Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -58,7 +59,7 @@ CheckResult check(const CheckOptions& options) {
 void printFaults(const CheckResult& result) {
   for (const Remark& fault : result.faults) {
     const std::string place = fault.pointer.empty() ? "" : fault.pointer + ": ";
-    std::cerr << "cellar: " << result.file << ": " << place << fault.text << std::endl;
+    std::cerr << "cellar: " << result.file << ": " << printable(place + fault.text) << std::endl;
   }
 }
 

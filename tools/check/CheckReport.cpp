@@ -6,6 +6,7 @@
 #include "Configuration.h"
 #include "Console.h"
 #include "Format.h"
+#include "storage/Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -64,15 +65,15 @@ Lines rulesOf(const StoreDefinition& store) {
 
 void printManager(const UnderstoodManager& manager, Console& console) {
   const StoreManagerDefinition& definition = *manager.definition;
-  console.heading(definition.name);
+  console.heading(printable(definition.name));
   const std::string rounds = definition.pruneInterval == 0
                                  ? "never pruned"
                                  : "pruned at most every " + formatDuration(definition.pruneInterval);
-  console.line(manager.directory + (definition.sessionScoped ? ", a session's" : ", of no session") + "; limit " +
-               formatSize(definition.maxSize) + ", " + rounds);
+  console.line(printable(manager.directory) + (definition.sessionScoped ? ", a session's" : ", of no session") +
+               "; limit " + formatSize(definition.maxSize) + ", " + rounds);
   if (manager.stores.empty()) console.line("no stores");
   for (const UnderstoodStore& store : manager.stores) {
-    console.line(store.identifier + ": " + typeName(*store.definition) + " in " + store.directory);
+    console.line(printable(store.identifier + ": " + typeName(*store.definition) + " in " + store.directory));
     for (const std::string& rule : rulesOf(*store.definition)) console.line("    " + rule);
   }
 }
@@ -143,7 +144,8 @@ OrderedJson asJson(const UnderstoodManager& manager) {
 void printCheck(const CheckResult& result, Console& console) {
   for (const UnderstoodManager& manager : result.understood) printManager(manager, console);
   console.raw("\n");
-  for (const Remark& warning : result.warnings) console.bad("warning: " + warning.pointer + ": " + warning.text);
+  for (const Remark& warning : result.warnings)
+    console.bad(printable("warning: " + warning.pointer + ": " + warning.text));
   const std::string counts = formatCount(result.understood.size(), "manager", "managers") + ", " +
                              formatCount(storesIn(result.understood), "store", "stores") + ", ";
   console.verdict(result.file + ": " + counts + formatCount(result.warnings.size(), "warning", "warnings"),
