@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstddef>
 #include <cstdint>
+#include <ctime>
 #include <map>
 #include <memory>
 #include <random>
@@ -117,7 +118,7 @@ class EvictionOrder : public testing::TestWithParam<Case> {
   }
   void moveClock() {
     now_ += static_cast<int>(upTo(40)) - 10;
-    clock_.set(now_);
+    clock_.set(static_cast<std::time_t>(now_));
   }
 
   std::uint32_t total() const {
