@@ -20,6 +20,7 @@
 #include "tune/EventReader.h"
 #include "tune/LineReader.h"
 #include "tune/Trace.h"
+#include "tune/TunePage.h"
 #include "tune/TunePlot.h"
 #include "tune/TuneReport.h"
 #include "tune/Tuning.h"
@@ -38,6 +39,7 @@ struct TuneOptions {
   double worth = 1;  // percent
   std::int64_t unknownSize = -1;
   std::string svg;
+  std::string html;
   bool json = false;
   bool csv = false;
   CsvColumns columns;
@@ -134,6 +136,7 @@ void runTune(const TuneOptions& options) {
   readTrace(options, console, trace, report);
   report.tuning = tuneTrace(options, trace, present, console);
   if (!options.svg.empty()) writeTextFile(options.svg, tuningAsSvg(report));
+  if (!options.html.empty()) writeTextFile(options.html, tuningAsPage(report));
   if (options.json) {
     std::cout << tuningAsJson(report).dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace)
               << std::endl;
@@ -203,6 +206,8 @@ void addTuneCommand(CLI::App& app, int& status) {
       ->check(CLI::Range(std::int64_t{0}, std::int64_t{0xffffffff}).description(""))
       ->type_name("BYTES");
   tune->add_option("--svg", options->svg, "Draw the hit rate over the limit into this file")->type_name("FILE");
+  tune->add_option("--html", options->html, "Write the report with the drawing into this file, as one page")
+      ->type_name("FILE");
   tune->add_flag("--json", options->json, "Print one JSON object for machines");
   addCsvOptions(*tune, *options);
   addVideoOptions(*tune, *options);

@@ -7,6 +7,7 @@
 #include <cstdio>
 
 #include "Format.h"
+#include "Markup.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -37,26 +38,6 @@ std::string number(double value) {
   std::array<char, 32> text{};
   (void)std::snprintf(text.data(), text.size(), "%.1f", value);
   return text.data();
-}
-
-std::string escaped(const std::string& text) {
-  std::string result;
-  for (const char character : text) {
-    switch (character) {
-      case '&':
-        result += "&amp;";
-        break;
-      case '<':
-        result += "&lt;";
-        break;
-      case '>':
-        result += "&gt;";
-        break;
-      default:
-        result += static_cast<unsigned char>(character) < 0x20 ? ' ' : character;  // which XML has no signs for
-    }
-  }
-  return result;
 }
 
 double share(std::uint64_t part, std::uint64_t whole) {
@@ -96,7 +77,7 @@ class Plot {
   }
   void text(const char* kind, const char* anchor, double left, double base, const std::string& content) {
     svg_ += std::string("<text class=\"") + kind + "\" text-anchor=\"" + anchor + "\" x=\"" + number(left) + "\" y=\"" +
-            number(base) + "\">" + escaped(content) + "</text>\n";
+            number(base) + "\">" + escapedMarkup(content) + "</text>\n";
   }
 
   void drawTitle() {

@@ -7,7 +7,6 @@
 
 #include "Console.h"
 #include "Format.h"
-#include "Table.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -37,7 +36,7 @@ std::string noteOn(const TunedLimit& limit) {
 
 bool hasVideo(const Tuning& tuning) { return !tuning.limits.empty() && tuning.limits.front().videoHits.has_value(); }
 
-std::string tableOf(const Tuning& tuning) {
+std::vector<Table::Column> columnsOf(const Tuning& tuning) {
   std::vector<Table::Column> columns = {{"limit", Table::Align::Right},
                                         {"hit rate", Table::Align::Right},
                                         {"of bytes", Table::Align::Right},
@@ -45,37 +44,40 @@ std::string tableOf(const Tuning& tuning) {
                                         {"misses", Table::Align::Right}};
   if (hasVideo(tuning)) columns.push_back({"video strategy", Table::Align::Right});
   columns.push_back({"", Table::Align::Left});
-  Table table(columns);
-  for (const TunedLimit& limit : tuning.limits) {
-    std::vector<std::string> cells = {wholeBytes(limit.lru.limit), percent(rate(limit.lru.hits, tuning.requests)),
-                                      percent(rate(limit.lru.hitBytes, tuning.requestedBytes)),
-                                      formatCount(limit.lru.hits), formatCount(tuning.requests - limit.lru.hits)};
-    if (limit.videoHits) cells.push_back(percent(rate(*limit.videoHits, tuning.requests)));
-    cells.push_back(noteOn(limit));
-    table.addRow(std::move(cells));
-  }
-  return table.text();
+  return columns;
 }
 
-void printSource(const TuneReport& report, Console& console) {
+std::vector<std::string> rowOf(const Tuning& tuning, const TunedLimit& limit) {
+  std::vector<std::string> cells = {wholeBytes(limit.lru.limit), percent(rate(limit.lru.hits, tuning.requests)),
+                                    percent(rate(limit.lru.hitBytes, tuning.requestedBytes)),
+                                    formatCount(limit.lru.hits), formatCount(tuning.requests - limit.lru.hits)};
+  if (limit.videoHits) cells.push_back(percent(rate(*limit.videoHits, tuning.requests)));
+  cells.push_back(noteOn(limit));
+  return cells;
+}
+
+std::vector<std::string> notesOn(const TuneReport& report) {
   const Tuning& tuning = report.tuning;
-  console.line(formatCount(tuning.requests, "request", "requests") + " of " + formatCount(tuning.keys, "key", "keys") +
-               (tuning.seconds >= 60 ? " in " + formatDuration(static_cast<std::uint64_t>(tuning.seconds)) : "") +
-               "; all items together have at most " + bytes(tuning.everything));
+  std::vector<std::string> notes;
+  notes.push_back(formatCount(tuning.requests, "request", "requests") + " of " +
+                  formatCount(tuning.keys, "key", "keys") +
+                  (tuning.seconds >= 60 ? " in " + formatDuration(static_cast<std::uint64_t>(tuning.seconds)) : "") +
+                  "; all items together have at most " + bytes(tuning.everything));
   if (report.reportedHits) {
-    console.line("the running cache reported " + percent(rate(*report.reportedHits, tuning.requests)) + " hits");
+    notes.push_back("the running cache reported " + percent(rate(*report.reportedHits, tuning.requests)) + " hits");
     if (report.reportedFirstHits > 0) {
-      console.line(formatCount(report.reportedFirstHits) +
-                   " of these were the first request of a key that was stored unseen; they count as misses below");
+      notes.push_back(formatCount(report.reportedFirstHits) +
+                      " of these were the first request of a key that was stored unseen; they count as misses below");
     }
   }
   if (tuning.keysOfUnknownSize > 0) {
-    console.line(formatCount(tuning.keysOfUnknownSize, "key was", "keys were") +
-                 " never found, so that nothing tells a size: taken to have " + bytes(tuning.assumedSize) + " each");
+    notes.push_back(formatCount(tuning.keysOfUnknownSize, "key was", "keys were") +
+                    " never found, so that nothing tells a size: taken to have " + bytes(tuning.assumedSize) + " each");
   }
   if (report.damagedLines > 0) {
-    console.line(formatCount(report.damagedLines, "line is", "lines are") + " no JSON and not counted");
+    notes.push_back(formatCount(report.damagedLines, "line is", "lines are") + " no JSON and not counted");
   }
+  return notes;
 }
 
 // With the rule that it follows from.
@@ -121,13 +123,27 @@ Json asJson(const Tuning& tuning, const TunedLimit* limit) {
 
 }  // namespace
 
-void printTuning(const TuneReport& report, Console& console) {
+TuneTexts textsOf(const TuneReport& report) {
   const Tuning& tuning = report.tuning;
-  console.heading(report.store.empty() ? report.source : report.store + ", from " + report.source);
-  printSource(report, console);
-  console.raw("\n" + tableOf(tuning));
-  console.verdict(adviceOf(tuning), true);
-  if (const TunedLimit* const present = presentLimit(tuning)) console.raw(costOf(tuning, *present) + "\n");
+  TuneTexts texts;
+  texts.title = report.store.empty() ? report.source : report.store + ", from " + report.source;
+  texts.notes = notesOn(report);
+  texts.columns = columnsOf(tuning);
+  for (const TunedLimit& limit : tuning.limits) texts.rows.push_back(rowOf(tuning, limit));
+  texts.advice = adviceOf(tuning);
+  if (const TunedLimit* const present = presentLimit(tuning)) texts.cost = costOf(tuning, *present);
+  return texts;
+}
+
+void printTuning(const TuneReport& report, Console& console) {
+  const TuneTexts texts = textsOf(report);
+  console.heading(texts.title);
+  for (const std::string& note : texts.notes) console.line(note);
+  Table table(texts.columns);
+  for (const auto& row : texts.rows) table.addRow(row);
+  console.raw("\n" + table.text());
+  console.verdict(texts.advice, true);
+  if (!texts.cost.empty()) console.raw(texts.cost + "\n");
 }
 
 Json tuningAsJson(const TuneReport& report) {

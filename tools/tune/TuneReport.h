@@ -4,7 +4,9 @@
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
+#include <vector>
 
+#include "Table.h"
 #include "tune/Tuning.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -20,6 +22,17 @@ struct TuneReport {
   Tuning tuning;
 };
 
+// The report in words, for a terminal or a page.
+struct TuneTexts {
+  std::string title;
+  std::vector<std::string> notes;
+  std::vector<Table::Column> columns;
+  std::vector<std::vector<std::string>> rows;
+  std::string advice;
+  std::string cost;  // of the present limit; empty without one
+};
+
+TuneTexts textsOf(const TuneReport& report);
 void printTuning(const TuneReport& report, Console& console);
 nlohmann::ordered_json tuningAsJson(const TuneReport& report);
 

@@ -1,0 +1,12 @@
+#pragma once
+
+#include <string>
+
+#include "tune/TuneReport.h"
+
+namespace velmora::mobile::xplat::cellar::tools {
+
+// The report as one page that needs nothing else: the curve, what it advises and the table.
+std::string tuningAsPage(const TuneReport& report);
+
+}  // namespace velmora::mobile::xplat::cellar::tools
