@@ -22,6 +22,7 @@
 
 #if defined(__linux__)
 #include <pthread.h>
+#include <sched.h>
 #endif
 
 namespace velmora::mobile::xplat::cellar::host {
@@ -86,31 +87,30 @@ void enterThread(const Group& group, const std::string& name) {
 #endif
 }
 
-// Tells the processor that this is a loop that waits. The thread keeps it: one that gives way to others may be away for
-// much longer than it has to wait.
-void relax() {
-#if defined(__x86_64__) || defined(__i386__)
-  __builtin_ia32_pause();
-#elif defined(__aarch64__) || (defined(__arm__) && __ARM_ARCH >= 7)
-  __asm__ __volatile__("yield");
+// The machine may have more than this thread may use.
+unsigned int processorsOfThisThread() {
+#if defined(__linux__)
+  cpu_set_t processors;
+  if (sched_getaffinity(0, sizeof(processors), &processors) == 0) {
+    return static_cast<unsigned int>(CPU_COUNT(&processors));
+  }
 #endif
+  return std::thread::hardware_concurrency();
 }
 
 // How long a queue's thread stays awake for the next task when it has nothing to do. To wake a thread takes some ten
 // microseconds, longer than many a task, so where one task follows the other it pays to look out for the next for a
 // moment. Adaptive, to spare the battery: a sleep that was over so soon that it was not worth falling asleep makes the
-// thread look out from then on, and looking out in vain ends that. With one processor nothing can come while one looks.
+// thread look out from then on, and looking out in vain, or being kept away meanwhile, ends that. With one processor
+// nothing can come while one looks.
 class Patience {
  public:
   void lookOutFor(const std::atomic<bool>& news) {
     if (!isAwake_) return;
     const Clock::time_point end = Clock::now() + kMoment;
-    while (!news.load(std::memory_order_acquire)) {
-      if (Clock::now() >= end) {
-        isAwake_ = false;
-        return;
-      }
-      relax();
+    while (isAwake_ && !news.load(std::memory_order_acquire)) {
+      std::this_thread::yield();  // others may need the processor to have news
+      isAwake_ = Clock::now() < end;
     }
   }
 
@@ -119,7 +119,7 @@ class Patience {
  private:
   static constexpr std::chrono::microseconds kMoment{50};
 
-  const bool hasOtherProcessors_ = std::thread::hardware_concurrency() > 1;
+  const bool hasOtherProcessors_ = processorsOfThisThread() > 1;
   bool isAwake_ = false;
 };
 

@@ -6,6 +6,7 @@
 #include <ctime>
 #include <map>
 #include <memory>
+#include <ostream>
 #include <random>
 #include <string>
 #include <utility>
@@ -59,6 +60,8 @@ struct Case {
   Metadata metadata;
   bool tunablesChange;
 };
+
+void PrintTo(const Case& what, std::ostream* out) { *out << what.name; }
 
 std::shared_ptr<PruneStrategyBase> make(Strategy strategy) {
   switch (strategy) {
