@@ -53,7 +53,10 @@ class File {
   std::FILE* stream_;
 };
 
-// What size a directory claims to have differs from one file system to the next, and so does what fails with one.
+// What size a directory claims to have differs from one file system to the next: none, that of its entries, or one that
+// nothing could be allocated for.
+constexpr std::size_t kMayBeADirectory = std::size_t{1} << 30;
+
 void throwIfDirectory(File& file) {
   struct stat status {};
   const bool isDirectory = ::fstat(::fileno(file.get()), &status) == 0 && S_ISDIR(status.st_mode);
@@ -153,10 +156,11 @@ string FileUtils::parentPath(const string& path) {
 std::vector<unsigned char> FileUtils::readFile(const string& path) {
   File file(path, "rb");
   (void)std::setvbuf(file.get(), nullptr, _IONBF, 0);  // straight into the result
-  std::vector<unsigned char> data = allocateFor(file, sizeOf(file));
-  if (data.empty()) throwIfDirectory(file);
+  const std::size_t size = sizeOf(file);
+  if (size == 0 || size >= kMayBeADirectory) throwIfDirectory(file);
+  std::vector<unsigned char> data = allocateFor(file, size);
   errno = 0;
-  if (std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
+  if (!data.empty() && std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
     throwReadError(file, "File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
   }
   file.close();
