@@ -158,8 +158,9 @@ class Queue {
     enterThread(*group_, name_);
     Patience patience;
     for (std::deque<Task> tasks; takeAll(tasks, patience);) {
-      for (; !tasks.empty(); tasks.pop_front()) {
-        runLogged(std::exchange(tasks.front(), nullptr));
+      while (!tasks.empty()) {
+        runLogged(tasks.front());
+        tasks.pop_front();  // what the task holds goes before it counts as ended
         group_->taskEnds();
       }
     }
@@ -186,7 +187,7 @@ class Queue {
     return !tasks.empty();
   }
 
-  void runLogged(Task task) const {
+  void runLogged(const Task& task) const {
     try {
       task();
     } catch (const std::exception& exception) {

@@ -9,7 +9,7 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-using ManifestRecordMap = std::unordered_map<std::string_view, std::unique_ptr<ManifestRecord>>;
+using ManifestRecordMap = std::unordered_map<std::string_view, ManifestRecord::Owner>;
 
 // Which of many records has the earliest date, by whatever gives records their date, kept as they come, change and go,
 // so that the next one to evict is found without a look at the others.

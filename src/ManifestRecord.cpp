@@ -6,18 +6,15 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-void* ManifestRecord::operator new(std::size_t size, std::uint32_t keyLength) {
-  return ::operator new(size + keyLength);
+void ManifestRecord::Deleter::operator()(ManifestRecord* record) const {
+  record->~ManifestRecord();
+  ::operator delete(record);
 }
 
-void ManifestRecord::operator delete(void* memory, std::uint32_t /*keyLength*/) { ::operator delete(memory); }
-
-void ManifestRecord::operator delete(void* memory) { ::operator delete(memory); }
-
-std::unique_ptr<ManifestRecord> ManifestRecord::create(const DiskCacheItem& item) {
+ManifestRecord::Owner ManifestRecord::create(const DiskCacheItem& item) {
   if (item.key.size() > std::numeric_limits<std::uint32_t>::max()) throw std::length_error("The key is too long.");
   const auto keyLength = static_cast<std::uint32_t>(item.key.size());
-  std::unique_ptr<ManifestRecord> record(new (keyLength) ManifestRecord(keyLength));
+  Owner record(new (::operator new(sizeof(ManifestRecord) + keyLength)) ManifestRecord(keyLength));
   item.key.copy(reinterpret_cast<char*>(record.get() + 1), keyLength);
   if (item.filename != item.key) record->filename_ = std::make_unique<const std::string>(item.filename);
   record->size = item.size;

@@ -13,12 +13,15 @@ namespace velmora::mobile::xplat::cellar {
 // bytes of the key behind the object, and without the file's name where that is the key, as it nearly always is.
 class ManifestRecord {
  public:
-  static std::unique_ptr<ManifestRecord> create(const DiskCacheItem& item);
+  // Gives the memory back without the size of the class, so that the key's bytes go with it.
+  struct Deleter {
+    void operator()(ManifestRecord* record) const;
+  };
+  using Owner = std::unique_ptr<ManifestRecord, Deleter>;
+
+  static Owner create(const DiskCacheItem& item);
   ManifestRecord(const ManifestRecord&) = delete;
   ManifestRecord& operator=(const ManifestRecord&) = delete;
-
-  // Not the size of the class, so that the key's bytes go with it.
-  static void operator delete(void* memory);
 
   std::string_view key() const { return {reinterpret_cast<const char*>(this + 1), keyLength_}; }
 
@@ -35,9 +38,8 @@ class ManifestRecord {
   std::uint32_t placeByPriority = 0;
 
  private:
-  explicit ManifestRecord(std::uint32_t keyLength) : keyLength_(keyLength) {}
-  static void* operator new(std::size_t size, std::uint32_t keyLength);
-  static void operator delete(void* memory, std::uint32_t keyLength);
+  explicit ManifestRecord(std::uint32_t keyLength) noexcept : keyLength_(keyLength) {}
+  ~ManifestRecord() = default;
 
   const std::uint32_t keyLength_;
   std::unique_ptr<const std::string> filename_;  // null: the same as the key

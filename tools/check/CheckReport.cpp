@@ -144,8 +144,9 @@ OrderedJson asJson(const UnderstoodManager& manager) {
 void printCheck(const CheckResult& result, Console& console) {
   for (const UnderstoodManager& manager : result.understood) printManager(manager, console);
   console.raw("\n");
-  for (const Remark& warning : result.warnings)
+  for (const Remark& warning : result.warnings) {
     console.bad(printable("warning: " + warning.pointer + ": " + warning.text));
+  }
   const std::string counts = formatCount(result.understood.size(), "manager", "managers") + ", " +
                              formatCount(storesIn(result.understood), "store", "stores") + ", ";
   console.verdict(result.file + ": " + counts + formatCount(result.warnings.size(), "warning", "warnings"),
