@@ -29,6 +29,8 @@ constexpr long kFirstStaleRemovalDelay = 300;  // seconds
 constexpr long kStaleRemovalInterval = 3600;   // seconds
 constexpr std::uint64_t kNanosecondsPerSecond = 1'000'000'000;
 
+constexpr std::size_t kMaxWritesAtOnce = 32;  // whose records are written under one lock
+
 std::int64_t currentTime() { return static_cast<std::int64_t>(std::time(nullptr)); }
 std::int32_t currentDate() { return static_cast<std::int32_t>(currentTime()); }
 
@@ -58,12 +60,23 @@ template <class Operation> void settle(Promise<void>& promise, Operation operati
 
 // A write of a file, on its way through the queues.
 struct PersistentKeyValueStore::FileWrite {
+  enum class Outcome : std::uint8_t { Open, Written, Revoked, Failed };
+
   std::string key;
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
   Writer writer;
   std::weak_ptr<PersistentKeyValueStore> store;
   std::shared_ptr<Promise<void>> promise = std::make_shared<Promise<void>>();
   std::shared_ptr<WritesInFlight::Write> inFlight;  // once its record stands in the manifest
+
+  std::atomic<bool> isTaken{false};  // by a task of the file queue: its own, or that of an earlier write
+  Outcome outcome = Outcome::Open;
+  unsigned int size = 0;
+  std::optional<std::uint32_t> total;  // of all items with this one, to report
+  std::exception_ptr failure;
+
+  std::mutex nextMutex;           // taken last; guards the one below
+  std::weak_ptr<FileWrite> next;  // the write of the store whose task stands right behind on the file queue
 
   FileWrite(const std::string& key_, std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata_, Writer writer_,
             std::weak_ptr<PersistentKeyValueStore> store_)
@@ -81,10 +94,23 @@ struct PersistentKeyValueStore::FileWrite {
     if (owner != nullptr && !owner->takeBack(*this)) owner->deleteLeftoverFile(key);
   }
 
-  DiskCacheItem record(std::uint32_t size) const {
+  DiskCacheItem record() const {
     const std::int32_t date = currentDate();
     return {key, key, size, false, date, date, extendedMetadata};
   }
+
+  // The next write for the task that has taken these. Null when there is none, another task has it, or its key is one
+  // of theirs, for which each write has to be over before the next begins.
+  static std::shared_ptr<FileWrite> takeNext(const std::vector<std::shared_ptr<FileWrite>>& taken) {
+    const std::lock_guard<std::mutex> lock(taken.back()->nextMutex);
+    auto write = taken.back()->next.lock();
+    if (write == nullptr) return nullptr;
+    const auto hasItsKey = [&](const std::shared_ptr<FileWrite>& other) { return other->key == write->key; };
+    if (std::any_of(taken.begin(), taken.end(), hasItsKey)) return nullptr;
+    return write->isTaken.exchange(true) ? nullptr : write;
+  }
+
+  void deliver() { failure == nullptr ? promise->setValue() : promise->setException(failure); }
 };
 
 // A fetch, on its way through the queues.
@@ -199,13 +225,14 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
       {
         const std::lock_guard<std::mutex> lock(self->mutex_);
         self->throwIfInvalid();
-        self->beginFileWrite(*write);
+        self->beginFileWrite(write);
       }
       if (write->inFlight == nullptr) return write->promise->setValue();  // the store was purged instead
       // A queue that takes no task drops the write: its end takes the record away again.
       self->fileQueue_->dispatch([write] {
+        if (write->isTaken.exchange(true)) return;
         if (const auto owner = write->store.lock()) {
-          owner->finishFileWrite(*write);
+          owner->finishFileWrites(write);
         } else {
           write->promise->setValue();
         }
@@ -218,34 +245,60 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
 }
 
 // Puts a provisional record into the manifest; none, if the store had to be purged.
-void PersistentKeyValueStore::beginFileWrite(FileWrite& write) {
+void PersistentKeyValueStore::beginFileWrite(const std::shared_ptr<FileWrite>& write) {
   try {
-    prepareWrite(write.key);
-    getManifest()->setItem(write.record(0));
-    write.inFlight = writesInFlight_->begin(write.key);
+    prepareWrite(write->key);
+    getManifest()->setItem(write->record());
+    write->inFlight = writesInFlight_->begin(write->key);
   } catch (const ManifestPersistenceException& error) {
-    writesInFlight_->revoke(write.key);  // an earlier value must not take the place of this one
-    purge(error);
+    writesInFlight_->revoke(write->key);  // an earlier value must not take the place of this one
+    return purge(error);
+  }
+  if (const auto last = lastFileWrite_.lock()) {
+    const std::lock_guard<std::mutex> lock(last->nextMutex);
+    last->next = write;
+  }
+  lastFileWrite_ = write;
+}
+
+// Writes a file, and then its record. To wait for the manifest would cost two switches between threads for each write:
+// while others are busy with it, the files of the next writes are written instead, and then all their records at once.
+void PersistentKeyValueStore::finishFileWrites(const std::shared_ptr<FileWrite>& first) {
+  std::vector<std::shared_ptr<FileWrite>> writes = {first};
+  writeFile(*first);
+  std::unique_lock<std::mutex> lock(mutex_, std::try_to_lock);
+  if (!lock.owns_lock()) {
+    writes.reserve(kMaxWritesAtOnce);
+    while (writes.size() < kMaxWritesAtOnce) {
+      auto write = FileWrite::takeNext(writes);
+      if (write == nullptr) break;
+      writeFile(*write);
+      writes.push_back(std::move(write));
+    }
+    lock.lock();
+  }
+  for (const auto& write : writes) recordWritten(*write);
+  for (const auto& write : writes) reportTotal(*write);  // together, so that the work queue's thread is woken once
+  lock.unlock();
+  for (const auto& write : writes) {
+    if (write->outcome == FileWrite::Outcome::Revoked) deleteLeftoverFile(write->key);
+    write->deliver();
   }
 }
 
-void PersistentKeyValueStore::finishFileWrite(const FileWrite& write) {
-  settle(*write.promise, [&] {
+void PersistentKeyValueStore::writeFile(FileWrite& write) {
+  try {
     throwIfClosed();
-    if (startWriter(write) && recordWritten(write, runWriter(write))) return;
-    deleteLeftoverFile(write.key);
-  });
-}
-
-// False when the write was revoked before it began.
-bool PersistentKeyValueStore::startWriter(const FileWrite& write) {
-  const std::lock_guard<std::mutex> lock(mutex_);
-  if (write.inFlight->isRevoked) {
-    writesInFlight_->end(write.inFlight);
-    return false;
+    if (writesInFlight_->start(*write.inFlight)) {
+      write.size = runWriter(write);
+      write.outcome = FileWrite::Outcome::Written;
+    } else {
+      write.outcome = FileWrite::Outcome::Revoked;
+    }
+  } catch (...) {
+    write.failure = std::current_exception();
+    write.outcome = FileWrite::Outcome::Failed;
   }
-  write.inFlight->isRunning = true;
-  return true;
 }
 
 unsigned int PersistentKeyValueStore::runWriter(const FileWrite& write) {
@@ -258,20 +311,32 @@ unsigned int PersistentKeyValueStore::runWriter(const FileWrite& write) {
   }
 }
 
-// False when the write was revoked while it ran.
-bool PersistentKeyValueStore::recordWritten(const FileWrite& write, unsigned int size) {
-  const std::lock_guard<std::mutex> lock(mutex_);
+void PersistentKeyValueStore::recordWritten(FileWrite& write) {
+  if (write.outcome == FileWrite::Outcome::Failed) return;
   writesInFlight_->end(write.inFlight);
-  if (write.inFlight->isRevoked) return false;
+  if (write.inFlight->isRevoked) write.outcome = FileWrite::Outcome::Revoked;
+  if (write.outcome == FileWrite::Outcome::Revoked) return;
   try {
-    if (!write.inFlight->hasRecord) removeOldestItemIfOverMaxCapacity();
-    getManifest()->setItem(write.record(size));
-    count(stores_);
-  } catch (const ManifestPersistenceException& error) {
-    purge(error);
+    try {
+      if (!write.inFlight->hasRecord) removeOldestItemIfOverMaxCapacity();
+      getManifest()->setItem(write.record());
+      count(stores_);
+    } catch (const ManifestPersistenceException& error) {
+      purge(error);
+    }
+    write.total = totalToReport();
+  } catch (...) {
+    write.failure = std::current_exception();
   }
-  reportSize();
-  return true;
+}
+
+void PersistentKeyValueStore::reportTotal(FileWrite& write) {
+  if (!write.total) return;
+  try {
+    dispatchReport(*write.total);
+  } catch (...) {
+    write.failure = std::current_exception();
+  }
 }
 
 // Takes the record of a write that failed or was dropped away again. True when another write of the key is on its way,
@@ -369,6 +434,7 @@ void PersistentKeyValueStore::find(const std::shared_ptr<Fetch>& fetch) {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
       fetch->item = lookUp(fetch->keys);
+      if (fetch->item != nullptr) lastFileWrite_.reset();
     }
     if (!fetch->keys.empty()) {
       count(fetch->item != nullptr ? hits_ : misses_);
@@ -537,6 +603,7 @@ void PersistentKeyValueStore::remove(const std::string& key, const std::shared_p
       if (item != nullptr && !item->hasInlineData) filename = item->filename;
       // A write that is on its way deletes what it finds; the removal is done when the file queue has got past it.
       if (writesInFlight_->revoke(key)) {
+        lastFileWrite_.reset();
         fileQueue_->dispatch([promise] { promise->setValue(); });
         leftToWrite = true;
         return;
@@ -591,10 +658,10 @@ void PersistentKeyValueStore::callOffWrites() {
     if (!manifest->isLoaded()) manifest->load();
     for (const auto& write : writes) {
       manifest->removeItem(write->key);
-      write->isRevoked = true;
+      writesInFlight_->revoke(*write);
     }
   } catch (const ManifestCorruptedException&) {
-    for (const auto& write : writes) write->isRevoked = true;  // the purge takes their records
+    for (const auto& write : writes) writesInFlight_->revoke(*write);  // the purge takes their records
     throw;
   }
 }
@@ -634,6 +701,7 @@ void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
       LOG(ERROR) << "Failed to remove the oldest item " << error.what();
     }
   };
+  lastFileWrite_.reset();
   try {
     fileQueue_->dispatch(deleteIt);
   } catch (...) {
@@ -646,6 +714,7 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeBatch(
     const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune) {
   const std::lock_guard<std::mutex> lock(mutex_);
   throwIfInvalid();
+  lastFileWrite_.reset();
   std::vector<DiskCacheItem> items;
   try {
     items = prune(*getManifest());
@@ -858,6 +927,7 @@ bool PersistentKeyValueStore::markInvalid(Future<void>& barrier) {
   if (invalidated_) return false;
   invalidated_ = true;
   staleRemovalTimer_.reset();
+  lastFileWrite_.reset();
   try {
     barrier = dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>()] {
       if (const auto self = weakThis.lock()) self->isClosed_ = true;
@@ -890,10 +960,12 @@ void PersistentKeyValueStore::handleCorruptedManifest(const LarderException& err
 }
 
 void PersistentKeyValueStore::purge(const LarderException& error) {
-  writesInFlight_->loseRecords();
-  trashCollector_->collectPath(path);
-  isHalfPurged_ = true;
-  beginAnew();
+  {
+    const auto noWriteStarts = writesInFlight_->loseRecords();
+    trashCollector_->collectPath(path);
+    isHalfPurged_ = true;
+    beginAnew();
+  }
   LOG(ERROR) << "Store \"" << name_ << "\" purged due to corrupted manifest. " << error.what();
 }
 
@@ -908,11 +980,18 @@ void PersistentKeyValueStore::beginAnew() {
 }
 
 void PersistentKeyValueStore::reportSize() {
-  if (!sizeChangedCallback_) return;
+  if (const auto total = totalToReport()) dispatchReport(*total);
+}
+
+std::optional<std::uint32_t> PersistentKeyValueStore::totalToReport() {
+  if (!sizeChangedCallback_) return std::nullopt;
   const auto manifest = getManifest();
-  if (!manifest->isLoaded()) return;
-  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), size = manifest->size()] {
-    if (const auto self = weakThis.lock()) self->sizeChangedCallback_(size);
+  return manifest->isLoaded() ? std::make_optional(manifest->size()) : std::nullopt;
+}
+
+void PersistentKeyValueStore::dispatchReport(std::uint32_t total) {
+  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), total] {
+    if (const auto self = weakThis.lock()) self->sizeChangedCallback_(total);
   });
 }
 

@@ -237,7 +237,9 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   struct Fetch;
 
   // These are called with the mutex held.
-  void beginFileWrite(FileWrite& write);
+  void beginFileWrite(const std::shared_ptr<FileWrite>& write);
+  void recordWritten(FileWrite& write);
+  void reportTotal(FileWrite& write);
   void writeInline(const std::string& key, const std::vector<unsigned char>& data,
                    std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
   void prepareWrite(const std::string& key);
@@ -250,10 +252,9 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void armStaleRemoval(long delaySeconds);
 
   // These run on the file queue.
-  void finishFileWrite(const FileWrite& write);
-  bool startWriter(const FileWrite& write);
+  void finishFileWrites(const std::shared_ptr<FileWrite>& first);
+  void writeFile(FileWrite& write);
   unsigned int runWriter(const FileWrite& write);
-  bool recordWritten(const FileWrite& write, unsigned int size);
   bool takeBack(const FileWrite& write);
   void load(Fetch& fetch);
   bool hasLostItem(const DiskCacheItem& item);
@@ -268,6 +269,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void dispatchWork(const std::vector<std::string>& keys, Promise<T>& promise, std::function<void()> task);
   void throwIfReserved(const std::string& key) const;
   void throwIfClosed();
+  std::optional<std::uint32_t> totalToReport();
+  void dispatchReport(std::uint32_t total);
   bool markInvalid(Future<void>& barrier);
   void silenceManifest();
 
@@ -286,10 +289,11 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   std::shared_ptr<AsyncExecutor> fileQueue_;
   std::shared_ptr<AsyncExecutor> workQueue_;
 
-  std::mutex mutex_;  // one operation on the manifest and its bookkeeping at a time; guards the five below
+  std::mutex mutex_;  // one operation on the manifest and its bookkeeping at a time; guards the six below
   long staleAge_;
   std::unique_ptr<AsyncTimer> staleRemovalTimer_;
   const std::unique_ptr<WritesInFlight> writesInFlight_;
+  std::weak_ptr<FileWrite> lastFileWrite_;             // null once another task of the store stands behind it
   std::vector<std::weak_ptr<KeySet>> clearsUnderWay_;  // for each, the keys stored since it began
   bool isHalfPurged_ = false;                          // its directory has gone to the trash, and no new one is there
 
