@@ -77,9 +77,13 @@ class Group {
 // The group that this thread works for. Its threads keep a group alive, so no other can come to have its address.
 thread_local const Group* currentGroup = nullptr;
 
+// Work in the background must not be in the way of those who ask for it: as a batch thread it does not take the
+// processor from another thread at the moment that wakes it. Not vital, so no matter if the system refuses.
 void enterThread(const Group& group, const std::string& name) {
   currentGroup = &group;
 #if defined(__linux__)
+  const sched_param noPriority{};
+  (void)pthread_setschedparam(pthread_self(), SCHED_BATCH, &noPriority);
   constexpr std::size_t longest = 15;  // bytes that the system has room for
   pthread_setname_np(pthread_self(), name.substr(0, longest).c_str());
 #else
@@ -98,11 +102,12 @@ unsigned int processorsOfThisThread() {
   return std::thread::hardware_concurrency();
 }
 
-// How long a queue's thread stays awake for the next task when it has nothing to do. To wake a thread takes some ten
-// microseconds, longer than many a task, so where one task follows the other it pays to look out for the next for a
-// moment. Adaptive, to spare the battery: a sleep that was over so soon that it was not worth falling asleep makes the
-// thread look out from then on, and looking out in vain, or being kept away meanwhile, ends that. With one processor
-// nothing can come while one looks.
+// How long a queue's thread stays awake for the next task when it has nothing to do. To wake a thread takes some tens
+// of microseconds, longer than many a task, so where one task follows the other it pays to look out for the next for a
+// moment: longer than a small file and its record take, because in a chain of queues each waits for the other.
+// Adaptive, to spare the battery: a sleep that was over so soon that it was not worth falling asleep makes the thread
+// look out from then on, and looking out in vain, or being kept away meanwhile, ends that. With one processor nothing
+// can come while one looks.
 class Patience {
  public:
   void lookOutFor(const std::atomic<bool>& news) {
@@ -117,7 +122,7 @@ class Patience {
   void hasSlept(Clock::duration duration) { isAwake_ = hasOtherProcessors_ && duration < kMoment; }
 
  private:
-  static constexpr std::chrono::microseconds kMoment{50};
+  static constexpr std::chrono::microseconds kMoment{200};
 
   const bool hasOtherProcessors_ = processorsOfThisThread() > 1;
   bool isAwake_ = false;

@@ -17,6 +17,9 @@ namespace velmora::mobile::xplat::cellar::host {
 // its thread; letting go never waits, so a task may drop its own queue. Queues may outlive the factory: they are closed
 // then.
 //
+// A thread that has nothing to do sleeps; where tasks follow each other closely it looks out for the next one for up to
+// 200 microseconds first. On Linux the threads are batch threads: waking one never takes the processor from who did.
+//
 // Timers: they fire once, on their queue, however they were armed; a delay of 0 or less is due at once, one that is
 // longer than the clock can say never comes. Companions are ignored. When the handle's destructor returns, the task
 // either runs already (or has run) or never will, and in the latter case what it captured is gone; a running task is

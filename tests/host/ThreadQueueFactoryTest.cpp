@@ -22,6 +22,7 @@
 
 #if defined(__linux__)
 #include <pthread.h>
+#include <sched.h>
 #endif
 
 namespace velmora::mobile::xplat::cellar::host {
@@ -160,6 +161,14 @@ TEST_F(ThreadQueueFactoryTest, ThreadsAreNamedAfterTheirRoleAndNumber) {
     finish(queue);
   }
   EXPECT_EQ(names, (std::vector<std::string>{"cellar-file-1", "cellar-work-1", "cellar-file-2"}));
+}
+
+TEST_F(ThreadQueueFactoryTest, ThreadsDoNotTakeTheProcessorFromThoseThatWakeThem) {
+  int policy = -1;
+  const auto queue = factory->createWorkQueue();
+  queue->dispatch([&] { policy = sched_getscheduler(0); });
+  finish(*queue);
+  EXPECT_EQ(policy, SCHED_BATCH);
 }
 #endif
 
