@@ -1,6 +1,5 @@
 #include "ManifestRecord.h"
 
-#include <limits>
 #include <new>
 #include <stdexcept>
 
@@ -12,7 +11,7 @@ void ManifestRecord::Deleter::operator()(ManifestRecord* record) const {
 }
 
 ManifestRecord::Owner ManifestRecord::create(const DiskCacheItem& item) {
-  if (item.key.size() > std::numeric_limits<std::uint32_t>::max()) throw std::length_error("The key is too long.");
+  if (item.key.size() > kLongestKey) throw std::length_error("The key is too long.");
   const auto keyLength = static_cast<std::uint32_t>(item.key.size());
   Owner record(new (::operator new(sizeof(ManifestRecord) + keyLength)) ManifestRecord(keyLength));
   item.key.copy(reinterpret_cast<char*>(record.get() + 1), keyLength);

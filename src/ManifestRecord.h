@@ -19,6 +19,9 @@ class ManifestRecord {
   };
   using Owner = std::unique_ptr<ManifestRecord, Deleter>;
 
+  static constexpr std::uint32_t kLongestKey = (1U << 31U) - 1;  // bytes
+
+  // Throws `std::length_error` for a key that is longer.
   static Owner create(const DiskCacheItem& item);
   ManifestRecord(const ManifestRecord&) = delete;
   ManifestRecord& operator=(const ManifestRecord&) = delete;
@@ -31,17 +34,22 @@ class ManifestRecord {
   std::uint32_t size = 0;
   std::int32_t modificationDate = 0;
   std::int32_t lastAccessDate = 0;
-  bool hasInlineData = false;
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
 
   std::uint32_t placeByAccessDate = 0;  // kept by the two orders of eviction
   std::uint32_t placeByPriority = 0;
 
  private:
-  explicit ManifestRecord(std::uint32_t keyLength) noexcept : keyLength_(keyLength) {}
+  const std::uint32_t keyLength_ : 31;
+
+ public:
+  bool hasInlineData : 1;  // beside the length, where it takes no room of its own
+
+ private:
+  explicit ManifestRecord(std::uint32_t keyLength) noexcept
+      : keyLength_(keyLength & kLongestKey), hasInlineData(false) {}
   ~ManifestRecord() = default;
 
-  const std::uint32_t keyLength_;
   std::unique_ptr<const std::string> filename_;  // null: the same as the key
 };
 

@@ -1,8 +1,11 @@
 #include <unistd.h>
 
 #include <cstddef>
+#include <map>
 #include <stdexcept>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include <cellar/DiskCacheManifest.h>
 
@@ -20,44 +23,61 @@ namespace {
 
 constexpr std::size_t kSize = Manifests::kItemSize;
 
+// The first write after a start finds the items unordered and the database out of memory. It is a figure of its own;
+// these go before the others.
+constexpr std::size_t kFirstWrites = 20;
+
+struct Taken {
+  double first = 0;  // microseconds
+  double each = 0;
+};
+
+template <class Write> Taken timeWrites(std::size_t items, std::size_t writes, Write write) {
+  Bytes value = valueOf(kSize);
+  const auto timeOf = [&](std::size_t begin, std::size_t end) {
+    const Stopwatch watch;
+    for (std::size_t number = begin; number < end; ++number) {
+      stamp(value, items + number);
+      write(number, value);
+    }
+    return watch.microseconds() / static_cast<double>(end - begin);
+  };
+  Taken taken;
+  taken.first = timeOf(0, 1);
+  timeOf(1, kFirstWrites);
+  taken.each = timeOf(kFirstWrites, kFirstWrites + writes);
+  return taken;
+}
+
 // Each write makes one of the first items go, so these have files.
-double measureOurs(const Context& context, const Place& place, std::size_t items, std::size_t writes) {
+Taken measureOurs(const Context& context, const Place& place, std::size_t items, std::size_t writes) {
   const Scratch scratch(place);
   const std::string directory = scratch / "store";
   context.manifests.copyTo(directory, items);
-  fillFiles(directory, writes);
+  fillFiles(directory, kFirstWrites + writes);
   StoreOptions options;
   options.capacity = items;
   StoreUnderTest store(directory, options);
-  Bytes value = valueOf(kSize);
-  const Stopwatch watch;
-  for (std::size_t number = items; number < items + writes; ++number) {
-    stamp(value, number);
-    store->store(keyOf(number), value).get();
-  }
-  const double result = watch.microseconds() / static_cast<double>(writes);
+  const Taken taken = timeWrites(
+      items, writes, [&](std::size_t number, const Bytes& value) { store->store(keyOf(items + number), value).get(); });
   if (store->getManifest()->count() != items) throw std::runtime_error("the store is not at its capacity");
-  return result;
+  return taken;
 }
 
-double measureFloor(const Context& context, const Place& place, std::size_t items, std::size_t writes) {
+Taken measureFloor(const Context& context, const Place& place, std::size_t items, std::size_t writes) {
   const Scratch scratch(place);
   context.manifests.copyTo(scratch.path(), items);
-  fillFiles(scratch.path(), writes);
+  fillFiles(scratch.path(), kFirstWrites + writes);
   ManifestFloor manifest(scratch.path());
-  Bytes value = valueOf(kSize);
-  const Stopwatch watch;
-  for (std::size_t number = 0; number < writes; ++number) {
+  return timeWrites(items, writes, [&](std::size_t number, const Bytes& value) {
     const std::string oldest = keyOf(number);
     manifest.remove(oldest);
     if (::unlink((scratch / oldest).c_str()) != 0) throw std::runtime_error("no file for " + oldest);
     const std::string key = keyOf(items + number);
-    stamp(value, items + number);
     manifest.put(key, 0, dateOf(items + number));
     writeFile(scratch / key, value);
     manifest.put(key, kSize, dateOf(items + number));
-  }
-  return watch.microseconds() / static_cast<double>(writes);
+  });
 }
 
 }  // namespace
@@ -68,17 +88,27 @@ void measureCapacity(const Context& context) {
   const std::size_t writes = context.scaled<std::size_t>(300, 100);
   const Place& place = context.places.front();
   Plot plot{"capacity", "A write to a full store", "items in the store", "microseconds"};
-  Figures first;
+  Figures ofFew;
   Figures last;
   for (std::size_t items = few; items <= many; items *= 10) {
-    last = interleaved({{"ours", [&] { return measureOurs(context, place, items, writes); }},
-                        {"floor", [&] { return measureFloor(context, place, items, writes); }}},
-                       context.scaled(3, 1), writes * kSize);
-    if (items == few) first = last;
+    std::map<std::string, std::vector<double>> firsts;
+    const auto contestant = [&](const std::string& name, auto measure) -> Contestants::value_type {
+      return {name, [&, name, measure] {
+                const Taken taken = measure(context, place, items, writes);
+                firsts[name].push_back(taken.first);
+                return taken.each;
+              }};
+    };
+    last = interleaved({contestant("ours", measureOurs), contestant("floor", measureFloor)}, context.scaled(3, 1),
+                       writes * kSize);
+    if (items == few) ofFew = last;
     for (const auto& [name, figure] : last) plot.lines[name].emplace_back(static_cast<double>(items), figure);
     context.report.add(Row{countName(items) + " items", place.name, cpuName(false), "us a write", last, {}});
+    const Figures first = {{"ours", median(firsts["ours"])}, {"floor", median(firsts["floor"])}};
+    context.report.add(
+        Row{countName(items) + " items, the first after a start", place.name, cpuName(false), "us", first, {}});
   }
-  const Figures growth = {{"ours", last["ours"] / first["ours"]}, {"floor", last["floor"] / first["floor"]}};
+  const Figures growth = {{"ours", last["ours"] / ofFew["ours"]}, {"floor", last["floor"] / ofFew["floor"]}};
   const std::string name = "growth from " + countName(few) + " to " + countName(many) + " items";
   context.report.add(Row{name, place.name, cpuName(false), "times", growth, {{"", 1.15}}});
   context.report.add(plot);
