@@ -96,7 +96,7 @@ std::unique_ptr<DiskCacheItem> DiskCacheManifest::getItem(const std::string& key
 }
 
 void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
-  auto due = std::make_shared<AccessDates>();
+  std::shared_ptr<AccessDates> due;
   {
     const std::lock_guard<std::mutex> lock(itemsMutex_);
     if (findOrRead(key) == nullptr) return;
@@ -104,6 +104,7 @@ void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
     records_->setLastAccessDate(key, date);
     pendingAccessDates_[key] = date;
     if (!loaded_ || pendingAccessDates_.size() <= kMaxPendingAccessDates) return;
+    due = std::make_shared<AccessDates>();
     due->swap(pendingAccessDates_);
   }
   try {

@@ -85,6 +85,11 @@ std::vector<unsigned char> allocateFor(File& file, std::size_t size) {
   throwReadError(file, "File read failed", ENOMEM);
 }
 
+bool isConcatenation(std::string_view whole, std::string_view first, std::string_view second) {
+  return whole.size() == first.size() + second.size() && whole.substr(0, first.size()) == first &&
+         whole.substr(first.size()) == second;
+}
+
 // A directory stream that is closed on every way out.
 class DirectoryStream {
  public:
@@ -94,6 +99,8 @@ class DirectoryStream {
   ~DirectoryStream() { (void)::closedir(stream_); }
   DirectoryStream(const DirectoryStream&) = delete;
   DirectoryStream& operator=(const DirectoryStream&) = delete;
+
+  int descriptor() const { return ::dirfd(stream_); }
 
   // The next entry other than "." and "..", or null at the end.
   const dirent* next() {
@@ -245,11 +252,16 @@ std::vector<string> FileUtils::listDirectories(const string& path) {
 std::vector<FileUtils::Info> FileUtils::listDirectory(const string& path) {
   std::vector<Info> entries;
   DirectoryStream directory(::opendir(path.c_str()));
+  const string inDirectory = FileUtils::combinePath(path, "");
   while (const dirent* entry = directory.next()) {
     const string entryPath = combinePath(path, entry->d_name);
     if (entry->d_type == DT_REG) {
+      // By its name alone, for which the system need not walk the whole path; unless a subclass names it otherwise.
+      const bool isNamedAsItLies = isConcatenation(entryPath, inDirectory, entry->d_name);
       struct stat status {};
-      if (::stat(entryPath.c_str(), &status) == 0) entries.emplace_back(entryPath, status.st_size, Type::File);
+      const int result = isNamedAsItLies ? ::fstatat(directory.descriptor(), entry->d_name, &status, 0)
+                                         : ::stat(entryPath.c_str(), &status);
+      if (result == 0) entries.emplace_back(entryPath, status.st_size, Type::File);
     } else if (entry->d_type == DT_LNK) {
       entries.emplace_back(entryPath, 0, Type::SymLink);
     } else if (entry->d_type == DT_DIR) {
