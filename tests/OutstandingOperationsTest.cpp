@@ -1,10 +1,11 @@
-// What thousands of outstanding operations cost in memory, and that all of it is given back. A program of its own,
-// because it counts every allocation.
+// What thousands of outstanding operations and of items cost in memory, and that all of it is given back. A program of
+// its own, because it counts every allocation.
 
 #include <gtest/gtest.h>
 
 #include <atomic>
 #include <cstddef>
+#include <cstdint>
 #include <cstdlib>
 #include <iostream>
 #include <memory>
@@ -13,32 +14,44 @@
 #include <utility>
 #include <vector>
 
+#include "DiskCacheManifest.h"
 #include "FileUtils.h"
 #include "PersistentKeyValueStore.h"
 #include "TrashCollector.h"
 #include "host/Await.h"
 #include "host/testing/ManualQueue.h"
+#include "support/FaultyManifest.h"
 #include "support/TemporaryDirectory.h"
 
 namespace {
 
-std::atomic<std::size_t> bytesInUse{0};
+std::atomic<std::size_t> bytesInUse{0};        // as they were asked for
+std::atomic<std::size_t> bytesOfAllocator{0};  // as a usual allocator gives them out
 
 // The size stands in front of the block.
 constexpr std::size_t kHeader = alignof(std::max_align_t);
+
+// A word before the block says its size, and blocks begin at every second word.
+constexpr std::size_t roundedUp(std::size_t size) {
+  constexpr std::size_t word = sizeof(std::size_t);
+  return (size + word + 2 * word - 1) / (2 * word) * (2 * word);
+}
 
 void* allocate(std::size_t size) {
   void* const block = std::malloc(size + kHeader);
   if (block == nullptr) throw std::bad_alloc();
   *static_cast<std::size_t*>(block) = size;
   bytesInUse += size;
+  bytesOfAllocator += roundedUp(size);
   return static_cast<char*>(block) + kHeader;
 }
 
 void release(void* pointer) {
   if (pointer == nullptr) return;
   void* const block = static_cast<char*>(pointer) - kHeader;
-  bytesInUse -= *static_cast<std::size_t*>(block);
+  const std::size_t size = *static_cast<std::size_t*>(block);
+  bytesInUse -= size;
+  bytesOfAllocator -= roundedUp(size);
   std::free(block);
 }
 
@@ -125,6 +138,34 @@ TEST_F(OutstandingOperations, OfAStoreThatGoesWithItsQueueFullAreGivenBack) {
     EXPECT_TRUE(another.names("store").empty());
   }
   EXPECT_LT(bytesInUse, before + 64 * 1024);
+}
+
+// Of an item with a key of 24 characters, when a manifest is loaded and when its items have been put in order.
+TEST(ItemsInMemory, AreSmall) {
+  constexpr std::size_t items = 10'000;
+  constexpr std::size_t longest = 24;
+  constexpr std::size_t most = sizeof(void*) == 4 ? 110 : 200;
+  const auto medium = std::make_shared<test::MemoryMedium>();
+  medium->change([](auto& rows) {
+    for (std::size_t number = 0; number < items; ++number) {
+      std::string key = std::to_string(number);
+      key.insert(0, longest - key.size(), '0');
+      rows[key] = {{key, key, 1, false, 1000, static_cast<std::int32_t>(number), nullptr}, {}};
+    }
+  });
+  DiskCacheManifest manifest(std::make_unique<test::MemoryPersistence>(medium),
+                             std::make_shared<test::ManualExecutor>(), nullptr);
+  const std::size_t before = bytesOfAllocator;
+  manifest.load();
+  const std::size_t loaded = bytesOfAllocator;
+  ASSERT_NE(manifest.pruneOldestItem(), nullptr);
+  const std::size_t ordered = bytesOfAllocator;
+  ASSERT_EQ(manifest.count(), items - 1);
+  std::cout << "an item: " << (loaded - before) / items << " bytes loaded, " << (ordered - before) / items
+            << " bytes in order\n";
+  EXPECT_GT(loaded, before + items * longest);
+  EXPECT_LE(loaded - before, items * most);
+  EXPECT_LE(ordered - before, items * most + 1024);
 }
 
 }  // namespace
