@@ -65,6 +65,7 @@ struct PersistentKeyValueStore::FileWrite {
   std::string key;
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
   Writer writer;
+  const bool mayRunEarly;  // before the writes in front of it are over
   std::weak_ptr<PersistentKeyValueStore> store;
   std::shared_ptr<Promise<void>> promise = std::make_shared<Promise<void>>();
   std::shared_ptr<WritesInFlight::Write> inFlight;  // once its record stands in the manifest
@@ -79,10 +80,11 @@ struct PersistentKeyValueStore::FileWrite {
   std::weak_ptr<FileWrite> next;  // the write of the store whose task stands right behind on the file queue
 
   FileWrite(const std::string& key_, std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata_, Writer writer_,
-            std::weak_ptr<PersistentKeyValueStore> store_)
+            bool mayRunEarly_, std::weak_ptr<PersistentKeyValueStore> store_)
       : key(key_),
         extendedMetadata(std::move(extendedMetadata_)),
         writer(std::move(writer_)),
+        mayRunEarly(mayRunEarly_),
         store(std::move(store_)) {}
   FileWrite(const FileWrite&) = delete;
   FileWrite& operator=(const FileWrite&) = delete;
@@ -99,12 +101,12 @@ struct PersistentKeyValueStore::FileWrite {
     return {key, key, size, false, date, date, extendedMetadata};
   }
 
-  // The next write for the task that has taken these. Null when there is none, another task has it, or its key is one
-  // of theirs, for which each write has to be over before the next begins.
+  // The next write for the task that has taken these. Null when there is none, another task has it, it may not run
+  // early, or its key is one of theirs, for which each write has to be over before the next begins.
   static std::shared_ptr<FileWrite> takeNext(const std::vector<std::shared_ptr<FileWrite>>& taken) {
     const std::lock_guard<std::mutex> lock(taken.back()->nextMutex);
     auto write = taken.back()->next.lock();
-    if (write == nullptr) return nullptr;
+    if (write == nullptr || !write->mayRunEarly) return nullptr;
     const auto hasItsKey = [&](const std::shared_ptr<FileWrite>& other) { return other->key == write->key; };
     if (std::any_of(taken.begin(), taken.end(), hasItsKey)) return nullptr;
     return write->isTaken.exchange(true) ? nullptr : write;
@@ -187,10 +189,12 @@ Future<void> PersistentKeyValueStore::store(const std::string& key, const std::v
                                             std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata) {
   const auto value = std::make_shared<const std::vector<unsigned char>>(data);
   if (!inlineData_) {
-    return store(key, std::move(extendedMetadata), [fileUtils = fileUtils_, value](const std::string& filePath) {
+    const auto writeValue = [fileUtils = fileUtils_, value](const std::string& filePath) {
       fileUtils->writeFile(filePath, *value);
       return static_cast<unsigned int>(value->size());
-    });
+    };
+    return storeFile(std::make_shared<FileWrite>(key, std::move(extendedMetadata), writeValue, true,
+                                                 weak_from_this<PersistentKeyValueStore>()));
   }
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
@@ -210,15 +214,21 @@ Future<void> PersistentKeyValueStore::store(const std::string& key, const std::v
 Future<void> PersistentKeyValueStore::store(const std::string& key,
                                             std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
                                             Writer writer) {
-  const auto write = std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer),
-                                                 weak_from_this<PersistentKeyValueStore>());
-  Future<void> future = write->promise->getFuture();
   if (inlineData_ && !invalidated_) {
+    Promise<void> promise;
+    Future<void> future = promise.getFuture();
     const std::runtime_error unsupported("Write callback not supported by inline store.");
-    write->promise->setException(std::make_exception_ptr(unsupported));
+    promise.setException(std::make_exception_ptr(unsupported));
     return future;
   }
-  dispatchWork({key}, *write->promise, [write] {
+  // A host's writer may take its time, or wait for an earlier store.
+  return storeFile(std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer), false,
+                                               weak_from_this<PersistentKeyValueStore>()));
+}
+
+Future<void> PersistentKeyValueStore::storeFile(const std::shared_ptr<FileWrite>& write) {
+  Future<void> future = write->promise->getFuture();
+  dispatchWork({write->key}, *write->promise, [write] {
     const auto self = write->store.lock();
     if (self == nullptr) return write->promise->setValue();
     try {
@@ -238,7 +248,7 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
         }
       });
     } catch (...) {
-      write->promise->setException(std::current_exception());
+      if (!write->isTaken.exchange(true)) write->promise->setException(std::current_exception());
     }
   });
   return future;

@@ -265,6 +265,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void find(const std::shared_ptr<Fetch>& fetch);
   void reportAccess(const DiskCacheItem* item, const std::string& key);
 
+  Future<void> storeFile(const std::shared_ptr<FileWrite>& write);
   template <class T>
   void dispatchWork(const std::vector<std::string>& keys, Promise<T>& promise, std::function<void()> task);
   void throwIfReserved(const std::string& key) const;
