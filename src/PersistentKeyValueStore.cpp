@@ -29,7 +29,9 @@ constexpr long kFirstStaleRemovalDelay = 300;  // seconds
 constexpr long kStaleRemovalInterval = 3600;   // seconds
 constexpr std::uint64_t kNanosecondsPerSecond = 1'000'000'000;
 
-constexpr std::size_t kMaxWritesAtOnce = 32;  // whose records are written under one lock
+// How far the files of writes may get ahead of their records: the first of them waits for the last.
+constexpr std::size_t kMaxWritesAtOnce = 32;
+constexpr std::uint64_t kMaxBytesAtOnce = 1 << 20;
 
 std::int64_t currentTime() { return static_cast<std::int64_t>(std::time(nullptr)); }
 std::int32_t currentDate() { return static_cast<std::int32_t>(currentTime()); }
@@ -89,7 +91,8 @@ struct PersistentKeyValueStore::FileWrite {
   FileWrite(const FileWrite&) = delete;
   FileWrite& operator=(const FileWrite&) = delete;
 
-  // A queue may drop the write without running it. Another write of the key may be at the file just now.
+  // A queue may drop the write without running it. Another write of the key may be at the file just now. Takes the
+  // store's mutex, so that nobody may let go of a write who holds it.
   ~FileWrite() {
     if (inFlight == nullptr || inFlight->isOver) return;
     const auto owner = store.lock();
@@ -101,11 +104,20 @@ struct PersistentKeyValueStore::FileWrite {
     return {key, key, size, false, date, date, extendedMetadata};
   }
 
+  std::shared_ptr<FileWrite> getNext() {
+    const std::lock_guard<std::mutex> lock(nextMutex);
+    return next.lock();
+  }
+
+  void setNext(const std::shared_ptr<FileWrite>& write) {
+    const std::lock_guard<std::mutex> lock(nextMutex);
+    next = write;
+  }
+
   // The next write for the task that has taken these. Null when there is none, another task has it, it may not run
   // early, or its key is one of theirs, for which each write has to be over before the next begins.
   static std::shared_ptr<FileWrite> takeNext(const std::vector<std::shared_ptr<FileWrite>>& taken) {
-    const std::lock_guard<std::mutex> lock(taken.back()->nextMutex);
-    auto write = taken.back()->next.lock();
+    auto write = taken.back()->getNext();
     if (write == nullptr || !write->mayRunEarly) return nullptr;
     const auto hasItsKey = [&](const std::shared_ptr<FileWrite>& other) { return other->key == write->key; };
     if (std::any_of(taken.begin(), taken.end(), hasItsKey)) return nullptr;
@@ -232,10 +244,11 @@ Future<void> PersistentKeyValueStore::storeFile(const std::shared_ptr<FileWrite>
     const auto self = write->store.lock();
     if (self == nullptr) return write->promise->setValue();
     try {
+      std::shared_ptr<FileWrite> last;
       {
         const std::lock_guard<std::mutex> lock(self->mutex_);
         self->throwIfInvalid();
-        self->beginFileWrite(write);
+        last = self->beginFileWrite(write);
       }
       if (write->inFlight == nullptr) return write->promise->setValue();  // the store was purged instead
       // A queue that takes no task drops the write: its end takes the record away again.
@@ -248,27 +261,30 @@ Future<void> PersistentKeyValueStore::storeFile(const std::shared_ptr<FileWrite>
         }
       });
     } catch (...) {
+      // The task of an earlier write may have it by now, though the queue has refused its own.
       if (!write->isTaken.exchange(true)) write->promise->setException(std::current_exception());
     }
   });
   return future;
 }
 
-// Puts a provisional record into the manifest; none, if the store had to be purged.
-void PersistentKeyValueStore::beginFileWrite(const std::shared_ptr<FileWrite>& write) {
+// Puts a provisional record into the manifest; none, if the store had to be purged. Answers the write before, which the
+// caller may be the last to hold, to let go of it without the mutex.
+std::shared_ptr<PersistentKeyValueStore::FileWrite> PersistentKeyValueStore::beginFileWrite(
+    const std::shared_ptr<FileWrite>& write) {
   try {
     prepareWrite(write->key);
     getManifest()->setItem(write->record());
     write->inFlight = writesInFlight_->begin(write->key);
   } catch (const ManifestPersistenceException& error) {
     writesInFlight_->revoke(write->key);  // an earlier value must not take the place of this one
-    return purge(error);
+    purge(error);
+    return nullptr;
   }
-  if (const auto last = lastFileWrite_.lock()) {
-    const std::lock_guard<std::mutex> lock(last->nextMutex);
-    last->next = write;
-  }
+  auto last = lastFileWrite_.lock();
+  if (last != nullptr) last->setNext(write);
   lastFileWrite_ = write;
+  return last;
 }
 
 // Writes a file, and then its record. To wait for the manifest would cost two switches between threads for each write:
@@ -279,10 +295,12 @@ void PersistentKeyValueStore::finishFileWrites(const std::shared_ptr<FileWrite>&
   std::unique_lock<std::mutex> lock(mutex_, std::try_to_lock);
   if (!lock.owns_lock()) {
     writes.reserve(kMaxWritesAtOnce);
-    while (writes.size() < kMaxWritesAtOnce) {
+    std::uint64_t bytes = first->size;
+    while (writes.size() < kMaxWritesAtOnce && bytes < kMaxBytesAtOnce) {
       auto write = FileWrite::takeNext(writes);
       if (write == nullptr) break;
       writeFile(*write);
+      bytes += write->size;
       writes.push_back(std::move(write));
     }
     lock.lock();
@@ -290,10 +308,16 @@ void PersistentKeyValueStore::finishFileWrites(const std::shared_ptr<FileWrite>&
   for (const auto& write : writes) recordWritten(*write);
   for (const auto& write : writes) reportTotal(*write);  // together, so that the work queue's thread is woken once
   lock.unlock();
+  std::exception_ptr failure;  // of a callback: the executor's affair, but not the other writes'
   for (const auto& write : writes) {
     if (write->outcome == FileWrite::Outcome::Revoked) deleteLeftoverFile(write->key);
-    write->deliver();
+    try {
+      write->deliver();
+    } catch (...) {
+      failure = std::current_exception();
+    }
   }
+  if (failure != nullptr) std::rethrow_exception(failure);
 }
 
 void PersistentKeyValueStore::writeFile(FileWrite& write) {
@@ -724,7 +748,6 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeBatch(
     const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune) {
   const std::lock_guard<std::mutex> lock(mutex_);
   throwIfInvalid();
-  lastFileWrite_.reset();
   std::vector<DiskCacheItem> items;
   try {
     items = prune(*getManifest());
@@ -791,7 +814,7 @@ void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<Di
 Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>& paths) {
   try {
     throwIfInvalid();
-    return dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), paths] {
+    auto deleted = dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), paths] {
       const auto self = weakThis.lock();
       if (self == nullptr) return;
       self->throwIfClosed();
@@ -803,6 +826,9 @@ Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>
         }
       }
     });
+    const std::lock_guard<std::mutex> lock(mutex_);  // not before: a queue may run the task at once
+    lastFileWrite_.reset();
+    return deleted;
   } catch (...) {
     Promise<void> failed;
     failed.setException(std::current_exception());

@@ -56,7 +56,8 @@ class WritesInFlight;
 // itself cannot be written, the store is purged.
 class CELLAR_EXPORT PersistentKeyValueStore : public Store {
  public:
-  // Creates the file at `path` and returns its size in bytes. Called on the file queue.
+  // Creates the file at `path` and returns its size in bytes. Called on the file queue, when all earlier writes are
+  // over.
   using Writer = std::function<unsigned int(const std::string& path)>;
 
   // The value in the file at `path`. Called on the file queue.
@@ -237,7 +238,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   struct Fetch;
 
   // These are called with the mutex held.
-  void beginFileWrite(const std::shared_ptr<FileWrite>& write);
+  std::shared_ptr<FileWrite> beginFileWrite(const std::shared_ptr<FileWrite>& write);
   void recordWritten(FileWrite& write);
   void reportTotal(FileWrite& write);
   void writeInline(const std::string& key, const std::vector<unsigned char>& data,

@@ -86,13 +86,24 @@ TEST(WritesInFlight, RevokesAllOfAKeyAndNoOther) {
   EXPECT_FALSE(writes.revoke("unknown"));
 }
 
+TEST(WritesInFlight, StartUnlessTheyAreRevoked) {
+  WritesInFlight writes;
+  const auto write = writes.begin("key");
+  const auto revoked = writes.begin("revoked");
+  writes.revoke(*revoked);
+  EXPECT_TRUE(writes.start(*write));
+  EXPECT_TRUE(write->isRunning);
+  EXPECT_FALSE(writes.start(*revoked));
+  EXPECT_FALSE(revoked->isRunning);
+}
+
 TEST(WritesInFlight, ThatLoseTheirRecordsAreRevokedIfTheyRunAndGoOnWithoutOtherwise) {
   WritesInFlight writes;
   const auto running = writes.begin("running");
-  running->isRunning = true;
+  EXPECT_TRUE(writes.start(*running));
   const auto waiting = writes.begin("waiting");
   EXPECT_TRUE(waiting->hasRecord);
-  writes.loseRecords();
+  EXPECT_TRUE(writes.loseRecords().owns_lock());  // so that no other starts meanwhile
   EXPECT_TRUE(running->isRevoked);
   EXPECT_FALSE(waiting->isRevoked);
   EXPECT_FALSE(waiting->hasRecord);

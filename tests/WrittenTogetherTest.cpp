@@ -5,9 +5,12 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstddef>
+#include <exception>
 #include <functional>
+#include <future>
 #include <map>
 #include <memory>
 #include <string>
@@ -27,6 +30,7 @@ using test::KeyValueStoreFixture;
 using test::Latch;
 using test::ManifestCall;
 using test::Operation;
+using test::runOnThreads;
 using test::told;
 using test::watch;
 using test::Written;
@@ -59,7 +63,8 @@ class WrittenTogether : public KeyValueStoreFixture {
   // meanwhile, or the test stands still.
   Written write(const std::string& key) { return watch(store->store(key, bytesOf(key))); }
 
-  // All of the work, and then the file queue's first task, at whose time another thread is in the manifest.
+  // All of the work, and then the file queue's first task, at whose time another thread is in the manifest. An
+  // exception that leaves the task is thrown again in the end.
   void runFirstOfFiles() {
     work().runAll();
     settings.clear();
@@ -67,9 +72,15 @@ class WrittenTogether : public KeyValueStoreFixture {
     const Written busy = watch(store->updateLastAccessDate("busy"));
     std::thread other([this] { work().runNext(); });
     isBusy.wait();
-    file().runNext();
+    std::exception_ptr failure;
+    try {
+      file().runNext();
+    } catch (...) {
+      failure = std::current_exception();
+    }
     other.join();
     EXPECT_EQ(told(busy), "<done>");
+    if (failure != nullptr) std::rethrow_exception(failure);
   }
 
   std::vector<std::string> written;   // the keys whose files have been written
@@ -119,6 +130,18 @@ TEST_F(WrittenTogether, NotMoreThanThirtyTwo) {
   EXPECT_EQ(written.size(), 40U);
   EXPECT_EQ(store->getAllKeys().size(), 40U);
   EXPECT_EQ(sizes.size(), 40U);
+}
+
+TEST_F(WrittenTogether, NoMoreAfterAMebibyte) {
+  const Written one = watch(store->store("one", nullptr, writing("one", (1 << 20) - 3)));
+  const Written two = write("two");
+  const Written three = write("three");
+  runFirstOfFiles();
+  EXPECT_EQ(told(one), "<done>");
+  EXPECT_EQ(told(two), "<done>");
+  EXPECT_EQ(told(three), "<pending>");
+  settle();
+  EXPECT_EQ(told(three), "<done>");
 }
 
 TEST_F(WrittenTogether, NotTwoOfOneKey) {
@@ -189,6 +212,45 @@ TEST_F(WrittenTogether, NotPastTheDeletionOfStaleFiles) {
   EXPECT_EQ(get("key"), "key");
 }
 
+TEST_F(WrittenTogether, NotPastADeletionThatSomebodyElseProvides) {
+  put("key", "old");
+  write("one");
+  write("two");
+  work().runAll();
+  bool isTaken = false;
+  const auto takeOnce = [&]() -> std::vector<DiskCacheItem> {
+    if (std::exchange(isTaken, true)) return {};
+    const auto item = manifest->getItem("key");
+    manifest->removeItem("key");
+    return {*item};
+  };
+  store->deleteFilesInBatches(takeOnce, onSuccess(), onError());
+  EXPECT_TRUE(work().runNext());
+  const Written anew = write("key");
+  runFirstOfFiles();
+  EXPECT_THAT(written, ElementsAre("one", "two"));
+  EXPECT_EQ(told(anew), "<pending>");
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_EQ(get("key"), "key");
+}
+
+TEST_F(WrittenTogether, NotPastTheDeletionOfABatch) {
+  put("key", "old");
+  write("one");
+  write("two");
+  work().runAll();
+  const Written deleted = watch(store->deleteBatch({pathOf("key")}));
+  const Written anew = write("key");
+  runFirstOfFiles();
+  EXPECT_THAT(written, ElementsAre("one", "two"));
+  EXPECT_EQ(told(deleted), "<pending>");
+  EXPECT_EQ(told(anew), "<pending>");
+  settle();
+  EXPECT_EQ(told(deleted), "<done>");
+  EXPECT_EQ(get("key"), "key");
+}
+
 TEST_F(WrittenTogether, NotPastAnEviction) {
   close();
   options.capacity = 3;
@@ -234,6 +296,26 @@ TEST_F(WrittenTogether, AFileThatCannotBeWrittenFailsAlone) {
   files->failPath(Operation::WriteFile, pathOf("key"), ENOSPC);
   runFirstOfFiles();
   EXPECT_NE(failed->failure, nullptr);
+  EXPECT_EQ(told(last), "<done>");
+  settle();
+  EXPECT_EQ(contents(), (Contents{{"one", "one"}, {"two", "two"}, {"last", "last"}}));
+  EXPECT_THAT(valueFiles(), ElementsAre("last", "one", "two"));
+}
+
+TEST_F(WrittenTogether, ACallbackThatThrowsHarmsNoOther) {
+  store->store("one", bytesOf("one")).then(nullptr, [](std::future<void>&) {
+    throw std::runtime_error("The callback gave up.");
+  });
+  const Written two = write("two");
+  const Written called = write("key");
+  const Written last = write("last");
+  onWrite = [&](const std::string& key) {
+    if (key == "key") watch(store->removeItem("key"));
+    if (key == "last") work().runNext();
+  };
+  EXPECT_THROW(runFirstOfFiles(), std::runtime_error);
+  EXPECT_EQ(told(two), "<done>");
+  EXPECT_EQ(told(called), "<done>");
   EXPECT_EQ(told(last), "<done>");
   settle();
   EXPECT_EQ(contents(), (Contents{{"one", "one"}, {"two", "two"}, {"last", "last"}}));
@@ -309,6 +391,38 @@ TEST_F(WrittenTogether, AQueueMayDropTheTasksThatHaveNothingLeftToDo) {
   EXPECT_EQ(contents(), (Contents{{"one", "one"}, {"two", "two"}}));
 }
 
+// The file queue refuses the task of a write that an earlier one's task has begun, and ended, meanwhile.
+TEST_F(WrittenTogether, AWriteThatIsDoneStaysDoneThoughItsOwnTaskIsRefused) {
+  Latch isAtTwo(1);
+  Latch threeIsBegun(1);
+  write("one");
+  write("two");
+  onWrite = [&](const std::string& key) {
+    if (key != "two") return;
+    isAtTwo.countDown();
+    threeIsBegun.wait();
+  };
+  work().runAll();
+  watch(store->updateLastAccessDate("busy"));
+  std::thread other([this] { work().runNext(); });
+  isBusy.wait();
+  std::thread writer([this] { file().runNext(); });
+  isAtTwo.wait();
+  other.join();
+  const Written three = write("three");
+  file().onDispatch = [&] {
+    threeIsBegun.countDown();
+    writer.join();
+    file().dropAll();
+    throw std::runtime_error("The queue takes no tasks.");
+  };
+  EXPECT_NO_THROW(work().runNext());
+  file().onDispatch = nullptr;
+  EXPECT_THAT(written, ElementsAre("one", "two", "three"));
+  EXPECT_EQ(told(three), "<done>");
+  EXPECT_EQ(contents(), (Contents{{"one", "one"}, {"two", "two"}, {"three", "three"}}));
+}
+
 TEST_F(WrittenTogether, TheNextWriteMayHaveBeenDropped) {
   write("one");
   write("two");
@@ -321,6 +435,28 @@ TEST_F(WrittenTogether, TheNextWriteMayHaveBeenDropped) {
   write("two");
   runFirstOfFiles();
   EXPECT_EQ(contents(), (Contents{{"one", "one"}, {"two", "two"}}));
+}
+
+// Whoever lets go of a write last takes it back, and that may be who begins the next one just now.
+TEST_F(WrittenTogether, AWriteMayBeDroppedWhileTheNextBegins) {
+  std::atomic<bool> begins{false};
+  manifest->onCall = [&](ManifestCall, const std::string& text) { begins = begins || text == "setItem two 0"; };
+  for (int round = 0; round < 1000; ++round) {
+    const Written dropped = write("one");
+    work().runAll();
+    const Written next = write("two");
+    begins = false;
+    runOnThreads(2, [&](std::size_t thread) {
+      if (thread == 0) return static_cast<void>(work().runAll());
+      while (!begins) std::this_thread::yield();
+      for (int i = 0; i < round; ++i) begins = true;  // a little later each time
+      file().dropAll();
+    });
+    file().dropAll();
+    EXPECT_EQ(dropped->completions, 1);
+    EXPECT_EQ(next->completions, 1);
+  }
+  EXPECT_THAT(contents(), IsEmpty());
 }
 
 }  // namespace
