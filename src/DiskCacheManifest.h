@@ -116,10 +116,11 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   // Removes items in the strategy's order until the total is at most `size`, but no more than `count`.
   std::vector<DiskCacheItem> pruneToSize(std::uint32_t size, std::uint32_t count) override;
 
-  // Removes items last used strictly before `date`, oldest first, but no more than `count`.
+  // Removes items last used strictly before `date`, oldest first, but no more than `count`. Of items that were last used
+  // in the same second, those first that were stored first.
   std::vector<DiskCacheItem> pruneOldEntries(long date, std::uint32_t count) override;
 
-  // Removes the item that was used least recently; null when there is none.
+  // Removes the item that was used least recently, as above; null when there is none.
   std::unique_ptr<DiskCacheItem> pruneOldestItem() override;
 
   // Throws `DiskCacheManifestException` before the manifest is loaded.

@@ -13,7 +13,7 @@ namespace {
 // standard algorithms are undefined then.)
 class ComparedRecords {
  public:
-  ComparedRecords(const ManifestRecordMap& records, std::shared_ptr<PruneStrategyBase> strategy)
+  template <class Map> ComparedRecords(const Map& records, std::shared_ptr<PruneStrategyBase> strategy)
       : before_(std::move(strategy)) {
     heap_.reserve(records.size());
     for (const auto& [key, record] : records) heap_.push_back(record.get());
@@ -78,6 +78,8 @@ const ManifestRecord* ManifestRecords::find(const std::string& key) const {
 }
 
 const ManifestRecord* ManifestRecords::store(const DiskCacheItem& item) {
+  byAccessDate_.reserveOneMore();
+  if (isVideoStrategy_) byVideoPriority_.reserveOneMore();
   auto record = ManifestRecord::create(item);
   ManifestRecord& stored = *record;
   const auto old = records_.find(item.key);
@@ -127,8 +129,14 @@ void ManifestRecords::clear() {
   totalSize_ = 0;
 }
 
+void ManifestRecords::reserve(std::size_t count) {
+  records_.reserve(count);
+  byAccessDate_.reserve(count);
+  if (isVideoStrategy_) byVideoPriority_.reserve(count);
+}
+
 ManifestRecords::Next ManifestRecords::leastRecentlyUsed() {
-  return [this] { return byAccessDate_.first(records_); };
+  return [this] { return byAccessDate_.first(); };
 }
 
 ManifestRecords::Next ManifestRecords::byStrategy() {
@@ -138,7 +146,7 @@ ManifestRecords::Next ManifestRecords::byStrategy() {
                                        : Basis::AccessDate;
   if (basis == Basis::AccessDate) return leastRecentlyUsed();
   if (basis == Basis::Comparison) return byComparison();
-  return [this] { return byVideoPriority_.first(records_); };
+  return [this] { return byVideoPriority_.first(); };
 }
 
 ManifestRecords::Next ManifestRecords::byComparison() const {

@@ -5,6 +5,8 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "EvictionOrder.h"
@@ -39,20 +41,22 @@ class ManifestRecords {
 
   DiskCacheItem remove(const ManifestRecord& record);
   void clear();
-  void reserve(std::size_t count) { records_.reserve(count); }
+  void reserve(std::size_t count);
 
-  // Items of the same access date come in no order.
+  // Of the same access date, those first that have been there longest.
   Next leastRecentlyUsed();
   Next byStrategy();
 
  private:
+  using Map = std::unordered_map<std::string_view, ManifestRecord::Owner>;
+
   void leaveOrders(const ManifestRecord& record);
   Next byComparison() const;
 
   const std::shared_ptr<PruneStrategyBase> strategy_;
   const bool isVideoStrategy_;
   const bool isOwnStrategy_;  // of the host's own kind, which can only be asked
-  ManifestRecordMap records_;
+  Map records_;
   EvictionOrder byAccessDate_;
   VideoEvictionOrder byVideoPriority_;  // kept with the video strategy only
   std::uint32_t totalSize_ = 0;

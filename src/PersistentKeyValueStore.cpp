@@ -60,6 +60,20 @@ template <class Operation> void settle(Promise<void>& promise, Operation operati
 
 }  // namespace
 
+// One key or several, where they lie.
+class PersistentKeyValueStore::Keys {
+ public:
+  explicit Keys(const std::string& key) : first_(&key), count_(1) {}
+  explicit Keys(const std::vector<std::string>& keys) : first_(keys.data()), count_(keys.size()) {}
+
+  const std::string* begin() const { return first_; }
+  const std::string* end() const { return first_ + count_; }
+
+ private:
+  const std::string* first_;
+  std::size_t count_;
+};
+
 // A write of a file, on its way through the queues.
 struct PersistentKeyValueStore::FileWrite {
   enum class Outcome : std::uint8_t { Open, Written, Revoked, Failed };
@@ -210,7 +224,7 @@ Future<void> PersistentKeyValueStore::store(const std::string& key, const std::v
   }
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork({key}, *promise,
+  dispatchWork(Keys(key), *promise,
                [weakThis = weak_from_this<PersistentKeyValueStore>(), key, value, extendedMetadata, promise] {
                  settle(*promise, [&] {
                    const auto self = weakThis.lock();
@@ -240,7 +254,7 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
 
 Future<void> PersistentKeyValueStore::storeFile(const std::shared_ptr<FileWrite>& write) {
   Future<void> future = write->promise->getFuture();
-  dispatchWork({write->key}, *write->promise, [write] {
+  dispatchWork(Keys(write->key), *write->promise, [write] {
     const auto self = write->store.lock();
     if (self == nullptr) return write->promise->setValue();
     try {
@@ -445,14 +459,20 @@ Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValue
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetch(const std::string& key,
                                                                                              Loader loader) {
-  return fetchFirst({key}, std::move(loader));
+  return fetchFirstOf(std::vector<std::string>(1, key), std::move(loader));
 }
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetchFirst(
     const std::vector<std::string>& keys, Loader loader) {
-  const auto fetch = std::make_shared<Fetch>(keys, std::move(loader), weak_from_this<PersistentKeyValueStore>());
+  return fetchFirstOf(keys, std::move(loader));
+}
+
+Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetchFirstOf(
+    std::vector<std::string> keys, Loader loader) {
+  const auto fetch =
+      std::make_shared<Fetch>(std::move(keys), std::move(loader), weak_from_this<PersistentKeyValueStore>());
   Future<Fetched> future = fetch->promise.getFuture();
-  dispatchWork(keys, fetch->promise, [fetch] {
+  dispatchWork(Keys(fetch->keys), fetch->promise, [fetch] {
     if (const auto self = fetch->store.lock()) {
       self->find(fetch);
     } else {
@@ -464,12 +484,14 @@ Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValue
 
 void PersistentKeyValueStore::find(const std::shared_ptr<Fetch>& fetch) {
   try {
+    std::unique_ptr<DiskCacheItem> found;
     {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
-      fetch->item = lookUp(fetch->keys);
-      if (fetch->item != nullptr) lastFileWrite_.reset();
+      found = lookUp(Keys(fetch->keys));
+      if (found != nullptr) lastFileWrite_.reset();
     }
+    fetch->item = std::move(found);
     if (!fetch->keys.empty()) {
       count(fetch->item != nullptr ? hits_ : misses_);
       reportAccess(fetch->item.get(), fetch->keys.front());
@@ -491,7 +513,7 @@ void PersistentKeyValueStore::find(const std::shared_ptr<Fetch>& fetch) {
 }
 
 // The record of the first key that has one; null for a miss, and when looking for it purged the store.
-std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(const std::vector<std::string>& keys) {
+std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(Keys keys) {
   try {
     beginAnew();
     for (const std::string& key : keys) {
@@ -529,7 +551,7 @@ void PersistentKeyValueStore::load(Fetch& fetch) {
 bool PersistentKeyValueStore::hasLostItem(const DiskCacheItem& item) {
   try {
     const std::lock_guard<std::mutex> lock(mutex_);
-    if (lookUp({item.key}) == nullptr) return true;
+    if (lookUp(Keys(item.key)) == nullptr) return true;
     return writesInFlight_->contains(item.key) && !fileUtils_->pathExists(getFilePath(item.filename));
   } catch (const std::exception&) {
     return false;
@@ -574,7 +596,7 @@ std::optional<std::int32_t> PersistentKeyValueStore::fetchModificationDate(const
 Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork({key}, *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
     settle(*promise, [&] {
       const auto self = weakThis.lock();
       if (self == nullptr) return;
@@ -609,7 +631,7 @@ void PersistentKeyValueStore::reportAccess(const DiskCacheItem* item, const std:
 Future<void> PersistentKeyValueStore::removeItem(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork({key}, *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
     if (const auto self = weakThis.lock()) {
       self->remove(key, promise);
     } else {
@@ -627,7 +649,7 @@ void PersistentKeyValueStore::remove(const std::string& key, const std::shared_p
     {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
-      auto item = lookUp({key});
+      auto item = lookUp(Keys(key));
       try {
         if (item != nullptr) getManifest()->removeItem(key);
       } catch (const ManifestCorruptedException& error) {
@@ -1060,8 +1082,8 @@ std::string PersistentKeyValueStore::getFilePath(const std::string& filename) {
 std::string PersistentKeyValueStore::getTemporaryDirectoryPath() { return temporaryDirectoryPath_; }
 
 // Hands the task over, or fails the promise with the reason why not.
-template <class T> void PersistentKeyValueStore::dispatchWork(const std::vector<std::string>& keys, Promise<T>& promise,
-                                                              std::function<void()> task) {
+template <class T>
+void PersistentKeyValueStore::dispatchWork(Keys keys, Promise<T>& promise, std::function<void()> task) {
   try {
     throwIfInvalid();
     for (const std::string& key : keys) throwIfReserved(key);

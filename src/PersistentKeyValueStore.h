@@ -234,6 +234,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
  private:
   using Fetched = std::unique_ptr<FetchResult>;
   using KeySet = std::unordered_set<std::string>;
+  class Keys;
   struct FileWrite;
   struct Fetch;
 
@@ -244,7 +245,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void writeInline(const std::string& key, const std::vector<unsigned char>& data,
                    std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
   void prepareWrite(const std::string& key);
-  std::unique_ptr<DiskCacheItem> lookUp(const std::vector<std::string>& keys);
+  std::unique_ptr<DiskCacheItem> lookUp(Keys keys);
   std::vector<DiskCacheItem> takeForClear(const std::shared_ptr<KeySet>& storedSince, bool& begun);
   void callOffWrites();
   std::vector<DiskCacheItem> takeAllBut(const KeySet& keep);
@@ -267,8 +268,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void reportAccess(const DiskCacheItem* item, const std::string& key);
 
   Future<void> storeFile(const std::shared_ptr<FileWrite>& write);
-  template <class T>
-  void dispatchWork(const std::vector<std::string>& keys, Promise<T>& promise, std::function<void()> task);
+  Future<Fetched> fetchFirstOf(std::vector<std::string> keys, Loader loader);
+  template <class T> void dispatchWork(Keys keys, Promise<T>& promise, std::function<void()> task);
   void throwIfReserved(const std::string& key) const;
   void throwIfClosed();
   std::optional<std::uint32_t> totalToReport();

@@ -1,5 +1,7 @@
 #include "VideoEvictionOrder.h"
 
+#include <utility>
+
 #include "PruneStrategy.h"
 #include "VideoPruneDate.h"
 
@@ -18,21 +20,22 @@ VideoEvictionOrder::Basis VideoEvictionOrder::basis(std::size_t recordCount) con
   return recordsWithMetadata_ == recordCount ? Basis::Priority : Basis::Comparison;
 }
 
-const ManifestRecord* VideoEvictionOrder::first(const ManifestRecordMap& records) {
-  const int weight = VideoDownloadPruneStrategy::priorityWeight;
-  const int cutoff = VideoDownloadPruneStrategy::highPriorityVideoSecondCutoff;
-  if (weight != priorityWeight_ || cutoff != highPriorityVideoSecondCutoff_) order_.clear();
-  priorityWeight_ = weight;
-  highPriorityVideoSecondCutoff_ = cutoff;
-  return order_.first(records);
+const ManifestRecord* VideoEvictionOrder::first() {
+  watchTunables();
+  if (std::exchange(isOutdated_, false)) order_.allChanged();
+  return order_.first();
 }
 
 void VideoEvictionOrder::added(ManifestRecord& record) {
+  watchTunables();
   if (hasVideoMetadata(record)) ++recordsWithMetadata_;
   order_.added(record);
 }
 
-void VideoEvictionOrder::changed(const ManifestRecord& record) { order_.changed(record); }
+void VideoEvictionOrder::changed(const ManifestRecord& record) {
+  watchTunables();
+  order_.changed(record);
+}
 
 void VideoEvictionOrder::removed(const ManifestRecord& record) {
   if (hasVideoMetadata(record)) --recordsWithMetadata_;
@@ -42,6 +45,14 @@ void VideoEvictionOrder::removed(const ManifestRecord& record) {
 void VideoEvictionOrder::clear() {
   recordsWithMetadata_ = 0;
   order_.clear();
+}
+
+void VideoEvictionOrder::watchTunables() {
+  const int weight = VideoDownloadPruneStrategy::priorityWeight;
+  const int cutoff = VideoDownloadPruneStrategy::highPriorityVideoSecondCutoff;
+  if (weight != priorityWeight_ || cutoff != highPriorityVideoSecondCutoff_) isOutdated_ = true;
+  priorityWeight_ = weight;
+  highPriorityVideoSecondCutoff_ = cutoff;
 }
 
 std::int32_t VideoEvictionOrder::dateOf(const ManifestRecord& record) {

@@ -17,9 +17,11 @@ class VideoEvictionOrder {
   Basis basis(std::size_t recordCount) const;
 
   // The first to go by priority.
-  const ManifestRecord* first(const ManifestRecordMap& records);
+  const ManifestRecord* first();
 
   // As with EvictionOrder.
+  void reserve(std::size_t count) { order_.reserve(count); }
+  void reserveOneMore() { order_.reserveOneMore(); }
   void added(ManifestRecord& record);
   void changed(const ManifestRecord& record);
   void removed(const ManifestRecord& record);
@@ -28,9 +30,11 @@ class VideoEvictionOrder {
  private:
   EvictionOrder order_ = {dateOf, &ManifestRecord::placeByPriority};
   std::size_t recordsWithMetadata_ = 0;
-  int priorityWeight_ = 0;  // the host's tunables as they were when the order was built
+  int priorityWeight_ = 0;  // the host's tunables as they were last seen
   int highPriorityVideoSecondCutoff_ = 0;
+  bool isOutdated_ = false;  // they have changed since some record was put in its place
 
+  void watchTunables();
   static std::int32_t dateOf(const ManifestRecord& record);
 };
 

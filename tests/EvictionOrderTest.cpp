@@ -229,6 +229,48 @@ TEST_P(EvictionOrder, StartsAgainWhenTheManifestIsCleared) {
   EXPECT_EQ(manifest_->count(), items_.size());
 }
 
+// A second is long: all of a burst may come within one.
+TEST(EvictionOrderOfOneSecond, IsThatInWhichTheItemsCame) {
+  DiskCacheManifest manifest(std::make_unique<NoPersistence>(), std::make_shared<ManualExecutor>(), nullptr);
+  manifest.load();
+  const auto store = [&](int number) {
+    const std::string key = std::to_string(number);
+    manifest.setItem({key, key, 1, false, 1000, 1000, nullptr});
+  };
+  for (int number = 0; number < 100; ++number) store(number);
+  store(50);  // comes anew
+  manifest.removeItem("70");
+  std::vector<std::string> expected;
+  for (int number = 0; number < 100; ++number) {
+    if (number != 50 && number != 70) expected.push_back(std::to_string(number));
+  }
+  expected.emplace_back("50");
+  std::vector<std::string> gone = {manifest.pruneOldestItem()->key};
+  for (const auto& item : manifest.pruneOldEntries(1001, 20)) gone.push_back(item.key);
+  for (const auto& item : manifest.pruneToSize(0, 1000)) gone.push_back(item.key);
+  EXPECT_EQ(gone, expected);
+}
+
+// What comes while the tunables are others is in its place for those; it has to leave it when they come back.
+TEST(EvictionOrderByPriority, FollowsTunablesThatWereOthersForAWhile) {
+  const auto set = [](int weight) { VideoDownloadPruneStrategy::priorityWeight = weight; };
+  DiskCacheManifest manifest(std::make_unique<NoPersistence>(), std::make_shared<ManualExecutor>(),
+                             make(Strategy::Video));
+  manifest.load();
+  const auto metadata = std::make_shared<VideoDownloadExtendedMetadata>(0, VideoDownloadExtendedMetadata::ItemType(1));
+  const auto store = [&](const std::string& key, std::int32_t date) {
+    manifest.setItem({key, key, 1, false, date, date, metadata});
+  };
+  set(100);
+  for (int number = 0; number < 50; ++number) store("early " + std::to_string(number), 1000 + number);
+  EXPECT_EQ(manifest.pruneToSize(49, 1).at(0).key, "early 0");
+  set(1'000'000);
+  store("earliest", 10);
+  set(100);
+  EXPECT_EQ(manifest.pruneToSize(49, 1).at(0).key, "earliest");
+  set(0);
+}
+
 INSTANTIATE_TEST_SUITE_P(Orders, EvictionOrder,
                          testing::Values(Case{"None", Strategy::None, Metadata::None, false},
                                          Case{"LeastRecentlyUsed", Strategy::LeastRecentlyUsed, Metadata::Video, true},
