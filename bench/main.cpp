@@ -20,6 +20,7 @@ namespace {
 namespace bench = velmora::mobile::xplat::cellar::bench;
 
 constexpr std::size_t kWarmedAtTheStart = std::size_t{1} << 30U;
+constexpr std::size_t kKept = std::size_t{1} << 28U;
 
 struct Arguments {
   bool quick = false;
@@ -49,6 +50,7 @@ void record(const Arguments& arguments, const bench::Report& report) {
 
 void run(const Arguments& arguments) {
   bench::warmMemory(kWarmedAtTheStart);
+  bench::keepMemory(kKept);
   bench::Report report;
   std::vector<bench::Place> places;
   for (const auto& place : arguments.places) places.push_back(placeOf(place));

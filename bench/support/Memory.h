@@ -8,11 +8,22 @@ namespace velmora::mobile::xplat::cellar::bench {
 // host, and whoever is first to touch it again would pay milliseconds for each MiB.
 void warmMemory(std::size_t bytes);
 
-// What operator new has given out in this process.
-struct Allocations {
-  std::size_t large;  // times that 256 KiB or more were asked for, since the start
-  std::size_t bytes;  // in use now, what the allocator rounds up included
+// Lets this process keep what it frees, this much of it touched beforehand. The C library would give a value of 1 MiB
+// back to the system with each free, and fetch it again page by page with the next; the allocators of phones keep it
+// for a while.
+void keepMemory(std::size_t bytes);
+
+// What operator new gives out in this process while there is one of these. Not while time is taken: every thread counts
+// at one place.
+class CountedAllocations {
+ public:
+  CountedAllocations();
+  ~CountedAllocations();
+  CountedAllocations(const CountedAllocations&) = delete;
+  CountedAllocations& operator=(const CountedAllocations&) = delete;
+
+  std::size_t large() const;     // times that 256 KiB or more were asked for
+  std::ptrdiff_t bytes() const;  // given out and not given back, what the allocator rounds up included
 };
-Allocations allocations();
 
 }  // namespace velmora::mobile::xplat::cellar::bench

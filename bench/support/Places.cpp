@@ -1,12 +1,17 @@
 #include "support/Places.h"
 
+#include <fcntl.h>
 #include <pthread.h>
 #include <sched.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
 #include <filesystem>
 #include <system_error>
+
+#include "floors/FileFloor.h"
+#include "support/Values.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -41,13 +46,30 @@ void runOn(const cpu_set_t& processors) {
 
 }  // namespace
 
+void settle(const std::string& path) {
+  const int directory = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  const bool isSettled = directory != -1 && ::syncfs(directory) == 0;
+  const int error = errno;
+  if (directory != -1) (void)::close(directory);
+  if (!isSettled) throw std::system_error(error, std::generic_category(), path);
+}
+
 Scratch::Scratch(const Place& place) : path_(place.directory + "/bench-XXXXXX") {
+  settle(place.directory);
   if (::mkdtemp(path_.data()) == nullptr) throw std::system_error(errno, std::generic_category(), path_);
 }
 
 Scratch::~Scratch() {
   std::error_code ignored;
   std::filesystem::remove_all(path_, ignored);
+}
+
+void warmFiles(const Place& place, std::size_t bytes) {
+  const Scratch scratch(place);
+  const Bytes value = valueOf(1U << 20U);
+  for (std::size_t written = 0; written < bytes; written += value.size()) {
+    writeFile(scratch / std::to_string(written), value);
+  }
 }
 
 Pinned::Pinned(bool pinned) : pinned_(pinned) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <string>
 
 namespace velmora::mobile::xplat::cellar::bench {
@@ -10,7 +11,10 @@ struct Place {
   std::string directory;
 };
 
-// An empty directory that goes away with everything in it.
+// Writes out what the file system of `path` still holds in memory, so that what comes next does not wait for it.
+void settle(const std::string& path);
+
+// An empty directory on a settled file system, which goes away with everything in it.
 class Scratch {
  public:
   explicit Scratch(const Place& place);
@@ -24,6 +28,10 @@ class Scratch {
  private:
   std::string path_;
 };
+
+// Writes files of so many bytes in all and deletes them again, for the reason that `warmMemory` has: the system takes
+// the memory for files from other places.
+void warmFiles(const Place& place, std::size_t bytes);
 
 // Keeps this thread, and every thread that it starts meanwhile, on one processor.
 class Pinned {

@@ -22,12 +22,14 @@ double quantile(std::vector<double> samples, double share) {
 
 double median(std::vector<double> samples) { return quantile(std::move(samples), 0.5); }
 
-Figures interleaved(const Contestants& contestants, int repetitions, std::size_t bytes) {
+Figures interleaved(const Place& place, const Contestants& contestants, int repetitions, std::size_t bytes) {
   std::map<std::string, std::vector<double>> samples;
   for (int round = 0; round < repetitions; ++round) {
     for (std::size_t turn = 0; turn < contestants.size(); ++turn) {
       const auto& [name, measure] = contestants[(turn + static_cast<std::size_t>(round)) % contestants.size()];
-      warmMemory(std::min(kLeastWarm + 2 * bytes, kMostWarm));
+      const std::size_t warm = std::min(kLeastWarm + 2 * bytes, kMostWarm);
+      warmMemory(warm);
+      warmFiles(place, warm);
       samples[name].push_back(measure());
     }
   }

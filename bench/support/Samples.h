@@ -7,6 +7,8 @@
 #include <utility>
 #include <vector>
 
+#include "support/Places.h"
+
 namespace velmora::mobile::xplat::cellar::bench {
 
 // The sample below which the share of all lies, 0.5 for the median. At least one sample.
@@ -18,8 +20,8 @@ using Contestants = std::vector<std::pair<std::string, std::function<double()>>>
 using Figures = std::map<std::string, double>;
 
 // The median of so many measurements of each. They take turns, each round beginning with another one, so that whatever
-// else the machine does meets all of them. `bytes`: what a measurement writes and reads; so much memory is warmed
-// before.
-Figures interleaved(const Contestants& contestants, int repetitions, std::size_t bytes);
+// else the machine does meets all of them. `bytes`: what a measurement writes to the place and reads; so much memory is
+// warmed before.
+Figures interleaved(const Place& place, const Contestants& contestants, int repetitions, std::size_t bytes);
 
 }  // namespace velmora::mobile::xplat::cellar::bench

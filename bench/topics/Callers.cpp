@@ -155,6 +155,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   for (int turn = 0; turn < context.scaled(7, 3); ++turn) {
     for (auto& [name, contestant] : contestants) {
       warmMemory(kKeys * what.size);
+      warmFiles(place, kKeys * what.size);
       takeTurn(*contestant, what, taken[name]);
     }
   }
@@ -175,13 +176,13 @@ void countCopies(const Context& context, const Place& place) {
   const Scratch scratch(place);
   StoreUnderTest store(scratch / "store");
   Bytes value = valueOf(size);
-  const std::size_t before = allocations().large;
+  const CountedAllocations allocations;
   for (std::size_t number = 0; number < stores; ++number) {
     stamp(value, number);
     store->store(keyOf(number), value).get();
   }
   store.settle();
-  const double copies = static_cast<double>(allocations().large - before) / stores;
+  const double copies = static_cast<double>(allocations.large()) / stores;
   store.verify(stores, size);
   context.report.add(Row{"copies of the bytes of a store", "memory", "", "copies", {{"ours", copies}}, {{"", 1}}});
 }

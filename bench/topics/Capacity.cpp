@@ -58,6 +58,7 @@ Taken measureOurs(const Context& context, const Place& place, std::size_t items,
   StoreOptions options;
   options.capacity = items;
   StoreUnderTest store(directory, options);
+  settle(directory);
   const Taken taken = timeWrites(
       items, writes, [&](std::size_t number, const Bytes& value) { store->store(keyOf(items + number), value).get(); });
   if (store->getManifest()->count() != items) throw std::runtime_error("the store is not at its capacity");
@@ -69,6 +70,7 @@ Taken measureFloor(const Context& context, const Place& place, std::size_t items
   context.manifests.copyTo(scratch.path(), items);
   fillFiles(scratch.path(), kFirstWrites + writes);
   ManifestFloor manifest(scratch.path());
+  settle(scratch.path());
   return timeWrites(items, writes, [&](std::size_t number, const Bytes& value) {
     const std::string oldest = keyOf(number);
     manifest.remove(oldest);
@@ -99,8 +101,8 @@ void measureCapacity(const Context& context) {
                 return taken.each;
               }};
     };
-    last = interleaved({contestant("ours", measureOurs), contestant("floor", measureFloor)}, context.scaled(3, 1),
-                       writes * kSize);
+    last = interleaved(place, {contestant("ours", measureOurs), contestant("floor", measureFloor)},
+                       context.scaled(3, 1), writes * kSize);
     if (items == few) ofFew = last;
     for (const auto& [name, figure] : last) plot.lines[name].emplace_back(static_cast<double>(items), figure);
     context.report.add(Row{countName(items) + " items", place.name, cpuName(false), "us a write", last, {}});

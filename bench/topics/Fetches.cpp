@@ -154,7 +154,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
     contestants.emplace_back(name,
                              [rival = std::make_shared<RivalFetches>(place, what, open)] { return rival->measure(); });
   }
-  Figures figures = interleaved(contestants, context.scaled(5, 3), what.size * kOutstanding);
+  Figures figures = interleaved(place, contestants, context.scaled(5, 3), what.size * kOutstanding);
   const double outstanding = figures.extract("64").mapped();
   const double single = figures.extract("1").mapped();
   figures["ours"] = outstanding;

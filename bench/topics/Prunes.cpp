@@ -40,6 +40,7 @@ double measureOurs(const Context& context, const Place& place, const Case& what)
   StoreOptions options;
   options.normalSize = static_cast<std::uint32_t>((what.items - what.pruned) * Manifests::kItemSize);
   StoreUnderTest store(directory, options);
+  settle(directory);
   const Stopwatch watch;
   store.prune();
   const double result = watch.microseconds() / static_cast<double>(what.pruned);
@@ -53,6 +54,7 @@ double measureFloor(const Context& context, const Place& place, const Case& what
   context.manifests.copyTo(scratch.path(), what.items);
   fillFiles(scratch.path(), what.files);
   ManifestFloor manifest(scratch.path());
+  settle(scratch.path());
   const Stopwatch watch;
   for (std::size_t number = 0; number < what.pruned; ++number) {
     const std::string key = keyOf(number);
@@ -65,7 +67,8 @@ double measureFloor(const Context& context, const Place& place, const Case& what
 }
 
 Figures measureCase(const Context& context, const Place& place, const Case& what, int repetitions) {
-  return interleaved({{"ours", [&] { return measureOurs(context, place, what); }},
+  return interleaved(place,
+                     {{"ours", [&] { return measureOurs(context, place, what); }},
                       {"floor", [&] { return measureFloor(context, place, what); }}},
                      repetitions, what.files * 4096);
 }

@@ -110,7 +110,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   for (const auto& [name, open] : rivals()) {
     contestants.emplace_back(name, [&, open = open] { return measureRival(place, pinned, what, open); });
   }
-  Figures figures = interleaved(contestants, context.scaled(5, 3), what.count * what.size);
+  Figures figures = interleaved(place, contestants, context.scaled(5, 3), what.count * what.size);
   const double outstanding = figures.extract("64").mapped();
   const double single = figures.extract("1").mapped();
   const std::string name = sizeName(what.size) + (what.inlineData ? " inline" : "");

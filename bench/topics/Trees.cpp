@@ -1,10 +1,12 @@
 #include <fcntl.h>
 #include <spawn.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstddef>
+#include <cstdio>
 #include <filesystem>
 #include <memory>
 #include <stdexcept>
@@ -106,8 +108,8 @@ void measureSizes(const Context& context, const Place& place) {
   MeasuredTree tree(place, files);
   MeasuredTree small(place, files / 100);
   const std::string name = countName(files) + " files in " + countName(directoriesFor(files)) + " directories";
-  const Figures figures =
-      interleaved({{"ours", [&] { return tree.fresh(); }}, {"du", [&] { return tree.du(); }}}, context.scaled(5, 3), 0);
+  const Figures figures = interleaved(
+      place, {{"ours", [&] { return tree.fresh(); }}, {"du", [&] { return tree.du(); }}}, context.scaled(5, 3), 0);
   context.report.add(Row{"measuring " + name, place.name, cpuName(false), "us a file", figures, {{"du", 1.3}}});
   const double kept = tree.kept();
   const double keptOfSmall = small.kept();
@@ -126,27 +128,38 @@ std::shared_ptr<TrashCollector> collectorFor(const std::string& trash,
 }
 
 // The call alone; the background pass that follows it is waited for outside the time taken.
-double collecting(const Place& place, std::size_t files) {
-  const Scratch scratch(place);
+double collecting(const Scratch& scratch, std::size_t files) {
   const auto queues = std::make_shared<host::ThreadQueueFactory>();
   const auto collector = collectorFor(scratch / "trash", queues);
-  std::vector<double> samples;
-  for (int i = 0; i < 11; ++i) {
-    const std::string tree = scratch / "tree";
-    fillTree(tree, files, directoriesFor(files));
-    const Stopwatch watch;
-    const bool isCollected = collector->collectPath(tree);
-    samples.push_back(watch.microseconds());
-    if (!isCollected || std::filesystem::exists(tree)) throw std::runtime_error("the tree was not collected");
-    collector->emptyAllTrash();
-  }
+  const std::string tree = scratch / "tree";
+  fillTree(tree, files, directoriesFor(files));
+  const Stopwatch watch;
+  const bool isCollected = collector->collectPath(tree);
+  const double taken = watch.microseconds();
+  if (!isCollected || std::filesystem::exists(tree)) throw std::runtime_error("the tree was not collected");
+  collector->emptyAllTrash();
   queues->shutDown();
-  return median(samples);
+  return taken;
+}
+
+// A directory made and a tree moved into it.
+double moving(const Scratch& scratch, std::size_t files) {
+  constexpr mode_t mode = 0775;
+  const std::string tree = scratch / "tree";
+  const std::string trash = scratch / "trash";
+  fillTree(tree, files, directoriesFor(files));
+  const Stopwatch watch;
+  const bool isMoved = ::mkdir(trash.c_str(), mode) == 0 && std::rename(tree.c_str(), (trash + "/0").c_str()) == 0;
+  const double taken = watch.microseconds();
+  if (!isMoved) throw std::runtime_error("the tree was not moved");
+  std::filesystem::remove_all(trash);
+  return taken;
 }
 
 double emptying(const Place& place, std::size_t files) {
   const Scratch scratch(place);
   fillTree(scratch / "trash/tree", files, directoriesFor(files));
+  settle(scratch.path());
   const auto collector = collectorFor(scratch / "trash", nullptr);
   const Stopwatch watch;
   collector->emptyAllTrash();
@@ -158,21 +171,23 @@ double emptying(const Place& place, std::size_t files) {
 double removing(const Place& place, std::size_t files) {
   const Scratch scratch(place);
   fillTree(scratch / "trash/tree", files, directoriesFor(files));
+  settle(scratch.path());
   return timeOf({"rm", "-rf", scratch / "trash"}) / static_cast<double>(files);
 }
 
 void measureTrash(const Context& context, const Place& place) {
   const std::size_t files = context.scaled<std::size_t>(100'000, 10'000);
   for (const std::size_t count : {files / 1000, files / 10}) {
-    context.report.add(Row{"collectPath of " + countName(count) + " files",
-                           place.name,
-                           cpuName(false),
-                           "us",
-                           {{"ours", collecting(place, count)}},
-                           {{"", 50}}});
+    const Scratch scratch(place);
+    const Figures figures = interleaved(
+        place,
+        {{"ours", [&] { return collecting(scratch, count); }}, {"floor", [&] { return moving(scratch, count); }}},
+        context.scaled(11, 5), 0);
+    const std::string name = "collectPath of " + countName(count) + " files";
+    context.report.add(Row{name, place.name, cpuName(false), "us", figures, {{"", 50}}});
   }
   const Figures figures = interleaved(
-      {{"ours", [&] { return emptying(place, files); }}, {"rm -rf", [&] { return removing(place, files); }}},
+      place, {{"ours", [&] { return emptying(place, files); }}, {"rm -rf", [&] { return removing(place, files); }}},
       context.scaled(3, 3), 0);
   context.report.add(Row{
       "emptying " + countName(files) + " files", place.name, cpuName(false), "us a file", figures, {{"rm -rf", 1.1}}});
