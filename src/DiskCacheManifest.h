@@ -116,8 +116,8 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   // Removes items in the strategy's order until the total is at most `size`, but no more than `count`.
   std::vector<DiskCacheItem> pruneToSize(std::uint32_t size, std::uint32_t count) override;
 
-  // Removes items last used strictly before `date`, oldest first, but no more than `count`. Of items that were last used
-  // in the same second, those first that were stored first.
+  // Removes items last used strictly before `date`, oldest first, but no more than `count`. Of items stored in the same
+  // second and not used since, those first that were stored first.
   std::vector<DiskCacheItem> pruneOldEntries(long date, std::uint32_t count) override;
 
   // Removes the item that was used least recently, as above; null when there is none.

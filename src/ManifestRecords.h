@@ -43,7 +43,7 @@ class ManifestRecords {
   void clear();
   void reserve(std::size_t count);
 
-  // Of the same access date, those first that have been there longest.
+  // Of those stored with the same access date and not used since, those first that were stored first.
   Next leastRecentlyUsed();
   Next byStrategy();
 
