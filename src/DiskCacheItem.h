@@ -42,7 +42,7 @@ struct CELLAR_EXPORT DiskCacheItem {
   bool hasInlineData = false;                          // the value lies in the manifest instead of a file
   std::int32_t modificationDate = 0;                   // seconds since the Unix epoch
   std::int32_t lastAccessDate = 0;                     // seconds since the Unix epoch
-  std::shared_ptr<ExtendedMetadata> extendedMetadata;  // may be empty
+  std::shared_ptr<ExtendedMetadata> extendedMetadata;  // may be empty; not to be changed once a store has the item
 };
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -218,11 +218,11 @@ std::vector<DiskCacheItem> DiskCacheManifest::prune(const std::function<const Ma
                                                     std::uint32_t count, MayGo mayGo) {
   std::vector<DiskCacheItem> removed;
   while (removed.size() < count) {
-    const ManifestRecord* const record = next();
-    if (record == nullptr || !mayGo(*record)) break;
     try {
+      const ManifestRecord* const record = next();  // by a strategy that may be the host's
+      if (record == nullptr || !mayGo(*record)) break;
       removed.push_back(remove(*record));
-    } catch (const LarderException&) {
+    } catch (...) {
       if (removed.empty()) throw;
       break;  // the files of those that went must go too; the next call meets the failure at its first item
     }

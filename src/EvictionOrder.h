@@ -9,7 +9,8 @@
 namespace velmora::mobile::xplat::cellar {
 
 // Which of many records has the earliest date, by whatever gives records their date, kept as they come, change and go,
-// so that the next one to evict is found without a look at the others. Of the same date, whoever was put there first goes first.
+// so that the next one to evict is found without a look at the others. Of the same date, whoever was put there first
+// goes first.
 //
 // A heap of the dates that the records had when they were last put in their place. Use makes a record's date later, and
 // happens far more often than eviction: that changes nothing here, until the record comes to the front and is put back
@@ -38,7 +39,7 @@ class EvictionOrder {
   void allChanged();
 
   // Forgets all records.
-  void clear() { heap_ = {}; }
+  void clear() { std::vector<Entry>().swap(heap_); }
 
  private:
   struct Entry {

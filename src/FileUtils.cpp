@@ -135,6 +135,9 @@ std::size_t lastComponentEnd(const string& path) {
   return end;
 }
 
+// A slash at the end would make the system follow a link.
+string withoutSlashes(const string& path) { return path.substr(0, lastComponentEnd(path) + 1); }
+
 }  // namespace
 
 FileUtils::Info::Info(const string& path_, long long size_, Type type_) : path(path_), size(size_), type(type_) {}
@@ -187,7 +190,7 @@ void FileUtils::deleteFile(const string& path) {
 }
 
 void FileUtils::recursiverDirectoryDelete(const string& path) {
-  if (isSymLink(path)) return deleteFile(path);
+  if (isSymLink(path)) return deleteFile(withoutSlashes(path));
   DirectoryStream directory(openUnlessLink(path));
   while (const dirent* entry = directory.next()) {
     const string entryPath = combinePath(path, entry->d_name);
@@ -273,10 +276,8 @@ std::vector<FileUtils::Info> FileUtils::listDirectory(const string& path) {
 
 bool FileUtils::isSymLink(const string& path) {
   if (path.empty()) return false;
-  // A slash at the end would make the system follow the link.
-  const string withoutSlashes = path.substr(0, lastComponentEnd(path) + 1);
   struct stat status {};
-  return ::lstat(withoutSlashes.c_str(), &status) == 0 && S_ISLNK(status.st_mode);
+  return ::lstat(withoutSlashes(path).c_str(), &status) == 0 && S_ISLNK(status.st_mode);
 }
 
 }  // namespace velmora::mobile::xplat::cellar

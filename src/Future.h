@@ -60,12 +60,15 @@ template <class T> struct SharedFutureState {
     executor.dispatch([owned = std::move(state)] { owned->invokeCallback(); });
   }
 
+  // Takes down, whichever way the value was asked for, whether it has left.
+  struct Note {
+    SharedFutureState& state;
+    ~Note() { state.taken = !state.future.valid(); }
+  };
+
  private:
   void invokeCallback() {
-    struct Note {
-      SharedFutureState& state;
-      ~Note() { state.taken = !state.future.valid(); }
-    } const note{*this};
+    const Note note{*this};
     callback(future);
   }
 };
@@ -93,7 +96,7 @@ template <class T> class Future {
     const std::lock_guard<std::mutex> lock(state->mutex);
     state->throwIfTaken();
     if (state->callback) throw FutureError(FutureError::Code::FetchWithCallback);
-    state->taken = true;
+    const typename detail::SharedFutureState<T>::Note note{*state};
     state->future.get();
   }
 

@@ -1000,8 +1000,24 @@ bool PersistentKeyValueStore::markInvalid(Future<void>& barrier) {
 }
 
 void PersistentKeyValueStore::silenceManifest() {
+  takeBackLateWrites();
   const std::lock_guard<std::mutex> lock(manifestMutex_);
   if (manifest_ != nullptr) manifest_->invalidate();
+}
+
+// Those whose task has come to the file queue behind the barrier, and will not write any more. Where an older value has
+// a file, its record stays with it, as after a kill.
+void PersistentKeyValueStore::takeBackLateWrites() {
+  try {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    for (const auto& write : writesInFlight_->all()) {
+      const std::string filePath = getFilePath(write->key);
+      const bool hasFile = fileUtils_->pathExists(filePath) && !fileUtils_->isDirectory(filePath);
+      if (!hasFile && !write->isRevoked) getManifest()->removeItem(write->key);
+    }
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Could not remove the record of an unfinished write: " << error.what();
+  }
 }
 
 void PersistentKeyValueStore::throwIfInvalid() {

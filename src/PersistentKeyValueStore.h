@@ -39,7 +39,7 @@ class WritesInFlight;
 // work queue and files on the file queue, both the host's and serial. `getAllKeys`, `fetchModificationDate`,
 // `getManifest` and `invalidate` work on the caller's thread. Operations on one key take effect in the order in which
 // they were called, but an inline value that is replaced while a fetch waits is delivered in its new form. A store that
-// has gone leaves what it had not begun undone.
+// has gone leaves what it had not begun undone; an overwrite whose file had not been begun takes the older value along.
 //
 // Errors travel in the futures: `InvalidatedException` after invalidation, `FileUtilsIoException` for files, what a
 // writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (one that ends in
@@ -276,6 +276,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void dispatchReport(std::uint32_t total);
   bool markInvalid(Future<void>& barrier);
   void silenceManifest();
+  void takeBackLateWrites();
 
   const std::string name_;
   const std::optional<std::uint64_t> capacity_;

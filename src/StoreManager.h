@@ -24,7 +24,7 @@ namespace detail {
 
 // The host's handle on one manager: a directory of stores that are kept within their limits. Obtained from a
 // `StoreManagerFactory`. Any thread may call. Letting the last handle go loses no data and stops no write that is under
-// way, but ends the manager's maintenance: a store that is still held works on, without being measured or pruned.
+// way: a store that is still held works on, and is measured and pruned.
 class CELLAR_EXPORT StoreManager {
  public:
   // Builds the manager and starts it. With `runMaintenance` it is cleansed first if that is forced or necessary, and

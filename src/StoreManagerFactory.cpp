@@ -3,6 +3,7 @@
 #include <glog/logging.h>
 
 #include <exception>
+#include <stdexcept>
 #include <utility>
 
 #include "Configuration.h"
@@ -67,7 +68,9 @@ std::shared_ptr<StoreManager> StoreManagerFactory::managerForStoreIdentifier(con
                                                                              bool runMaintenance) {
   std::string managerName;
   try {
-    managerName = configuration_->getStore(storeIdentifier)->managerName;
+    const auto definition = configuration_->getStore(storeIdentifier);
+    if (definition == nullptr) throw std::logic_error("Store '" + storeIdentifier + "' has no definition.");
+    managerName = definition->managerName;
   } catch (const std::exception& error) {
     LOG(ERROR) << error.what();
     return nullptr;

@@ -97,7 +97,8 @@ std::string StoreManagerImpl::getStorePath(std::shared_ptr<const StoreDefinition
 
 void StoreManagerImpl::invalidate() {
   common_.invalidate();
-  const std::lock_guard<std::mutex> lock(cleanupMutex_);  // no clean-up is under way any more when this returns
+  const std::lock_guard<std::recursive_mutex> lock(
+      cleanupMutex_);  // no clean-up is under way any more when this returns
 }
 
 void StoreManagerImpl::close() { common_.close(); }
@@ -119,7 +120,7 @@ void StoreManagerImpl::cleanseIfNecessary(bool force) {
 void StoreManagerImpl::startCleanup() {
   queue_->dispatch([self = shared_from_this()] {
     // One that comes late would take the next session's directories for stale.
-    const std::lock_guard<std::mutex> lock(self->cleanupMutex_);
+    const std::lock_guard<std::recursive_mutex> lock(self->cleanupMutex_);
     if (!self->isValid()) return;
     self->cleanupOldStores();
     self->cleanupParentDirectory();
@@ -128,7 +129,7 @@ void StoreManagerImpl::startCleanup() {
 
 void StoreManagerImpl::startCalculatingUnmanagedStoresSize() {
   for (const auto& [identifier, definition] : common_.definition().stores) {
-    if (definition->isManaged) continue;
+    if (definition == nullptr || definition->isManaged) continue;
     const std::string path = getStorePath(definition);
     if (fileUtils_->pathExists(path)) diskSizeCalculator_->addDirectory(path, DiskSizeCalculator::STALE_INTERVAL);
   }
@@ -192,10 +193,11 @@ std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() 
   std::vector<PruneRequest> requests;
   for (const auto& [identifier, item] : common_.copyStoreMap()) {
     const std::lock_guard<std::mutex> itemLock(item->mutex);
-    if (item->store == nullptr || !item->store->isPrunable() || item->isPruning) continue;
+    const auto store = item->getStore();
+    if (store == nullptr || !store->isPrunable() || item->isPruning) continue;
     if (item->currentSize <= item->maxSize && !survivalMode) continue;
     item->isPruning = true;
-    requests.push_back({identifier, item->store, item->name, item->currentSize, item->maxSize, survivalMode});
+    requests.push_back({identifier, store, item->name, item->currentSize, item->maxSize, survivalMode});
   }
   pruneInProgress_ = !requests.empty();
   return requests;

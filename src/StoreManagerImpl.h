@@ -112,7 +112,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   std::time_t lastPruneTime_ = 0;
   bool pruneInProgress_ = false;
 
-  std::mutex cleanupMutex_;  // held by a clean-up in the background
+  std::recursive_mutex cleanupMutex_;  // held by a clean-up in the background, which may lead to an invalidation
 
   const bool maintenanceEnabled_;
   const std::shared_ptr<AnalyticsEventReporter> analyticsReporter_;

@@ -68,8 +68,8 @@ std::shared_ptr<Store> StoreManagerImplCommon::getStore(const std::string& ident
     const std::shared_ptr<Item> item = slot;
     lock.unlock();
     std::unique_lock<std::mutex> itemLock(item->mutex);
-    item->condition.wait(itemLock, [&item] { return item->store != nullptr || item->isAbandoned; });
-    return item->store;
+    item->condition.wait(itemLock, [&item] { return item->getStore() != nullptr || item->isAbandoned; });
+    return item->getStore();
   }
   slot = std::make_shared<Item>();
   const std::shared_ptr<Item> item = slot;
@@ -126,8 +126,9 @@ std::shared_ptr<Store> StoreManagerImplCommon::createStore(const std::string& id
   }
   item->condition.notify_all();
 
-  // Whoever invalidated the manager meanwhile could not see this store.
+  // Whoever invalidated or closed the manager meanwhile could not see this store.
   if (!isValid()) invalidateNewStore(*store);
+  if (isClosed()) leaveToOthers(*item);
   return store;
 }
 
@@ -158,7 +159,9 @@ void StoreManagerImplCommon::cleanupOldStores() {
   try {
     if (!fileUtils_->pathExists(managerPath_)) return;
     std::vector<std::string> keep;
-    for (const auto& [identifier, store] : definition_.stores) keep.push_back(nameBuilder_->buildStoreName(*store));
+    for (const auto& [identifier, store] : definition_.stores) {
+      if (store != nullptr) keep.push_back(nameBuilder_->buildStoreName(*store));
+    }
     keep.push_back(TemporaryDirectoryName);
     trashDirectories(managerPath_, fileUtils_->listDirectories(managerPath_), keep);
   } catch (const LarderException& error) {
@@ -195,7 +198,7 @@ void StoreManagerImplCommon::invalidate() {
   std::vector<std::shared_ptr<Store>> stores;
   for (const auto& [identifier, item] : slots) {
     const std::lock_guard<std::mutex> lock(item->mutex);
-    if (item->store != nullptr) stores.push_back(item->store);
+    if (auto store = item->getStore()) stores.push_back(std::move(store));
   }
   // Waiting for a store under a lock would hang when its queue needs that lock to get on.
   for (const auto& store : stores) {
@@ -209,10 +212,27 @@ void StoreManagerImplCommon::invalidate() {
 }
 
 void StoreManagerImplCommon::close() {
-  StoreMap slots;  // destroyed without the lock: a store's last owner may be here
+  StoreMap slots;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    closed_ = true;
+    slots = stores_;
+  }
+  for (const auto& [identifier, item] : slots) leaveToOthers(*item);
+}
+
+// Answers the store, whose last owner may be here, to be let go of without the lock.
+std::shared_ptr<Store> StoreManagerImplCommon::leaveToOthers(Item& item) {
+  const std::lock_guard<std::mutex> lock(item.mutex);
+  if (item.store == nullptr) return nullptr;
+  item.storeOfOthers = item.store;
+  item.isAbandoned = true;
+  return std::exchange(item.store, nullptr);
+}
+
+bool StoreManagerImplCommon::isClosed() {
   const std::lock_guard<std::mutex> lock(mutex_);
-  closed_ = true;
-  slots.swap(stores_);
+  return closed_;
 }
 
 bool StoreManagerImplCommon::isValid() {

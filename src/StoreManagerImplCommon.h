@@ -34,15 +34,19 @@ class CELLAR_EXPORT StoreManagerImplCommon {
 
   // The slot of one store, shared by the store map and everybody who waits for the store.
   struct CELLAR_EXPORT Item {
-    std::shared_ptr<Store> store;       // empty until the store has been created
-    std::uint32_t currentSize = 0;      // bytes that the store reported last
-    std::uint32_t maxSize = 0;          // bytes, the definition's
-    std::string name;                   // the definition's
-    bool isPruning = false;             // a prune of the store is under way
-    bool sizeReported = false;          // its first size has been reported
-    bool isAbandoned = false;           // creating the store failed while the manager was being invalidated
-    std::mutex mutex;                   // guards all of the above
-    std::condition_variable condition;  // signalled when `store` has been set, or the item abandoned
+    std::shared_ptr<Store> store;        // empty until the store has been created, and once the manager is closed
+    std::weak_ptr<Store> storeOfOthers;  // in a closed manager: the store, while somebody else holds it
+    std::uint32_t currentSize = 0;       // bytes that the store reported last
+    std::uint32_t maxSize = 0;           // bytes, the definition's
+    std::string name;                    // the definition's
+    bool isPruning = false;              // a prune of the store is under way
+    bool sizeReported = false;           // its first size has been reported
+    bool isAbandoned = false;            // nobody need wait: creating failed beside an invalidation, or it is closed
+    std::mutex mutex;                    // guards all of the above; held by the caller of the below
+    std::condition_variable condition;   // signalled when `store` has been set, or the item abandoned
+
+    // The store, if it has been created and is still there.
+    std::shared_ptr<Store> getStore() const { return store != nullptr ? store : storeOfOthers.lock(); }
   };
 
   // Moves a temporary directory that an earlier run left behind to the trash and creates a fresh one, with the manager
@@ -106,8 +110,9 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   // have finished what they were writing, so it must not be called on one of their queues. A second call does nothing.
   void invalidate();
 
-  // Lets go of all stores and hands out no more, without touching their data: the manager's handle has gone. A store's
-  // size callback keeps the manager, so the two would keep each other for ever.
+  // Leaves all stores to whoever else holds them and hands out no more, without touching their data: the manager's
+  // handle has gone. A store's size callback keeps the manager, so the two would keep each other for ever. What is held
+  // is measured and pruned as before.
   void close();
 
   bool isValid();
@@ -122,6 +127,8 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   using StoreMap = std::unordered_map<std::string, std::shared_ptr<Item>>;
 
   static void abandon(Item& item);
+  static std::shared_ptr<Store> leaveToOthers(Item& item);
+  bool isClosed();
   bool isMarkedForTrashing(const std::string& storePath);
 
   const StoreManagerDefinition definition_;
@@ -135,7 +142,7 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   const std::string temporaryDirectoryPath_;
 
   std::mutex mutex_;  // guards the three below
-  StoreMap stores_;   // by identifier; emptied by invalidation and closing, which part manager and stores
+  StoreMap stores_;   // by identifier; emptied by invalidation, which parts manager and stores
   bool invalid_ = false;
   bool closed_ = false;
 };

@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <ctime>
 #include <exception>
+#include <thread>
 
 #include "AnalyticsEventReporter.h"
 #include "FileUtils.h"
@@ -33,22 +34,37 @@ class TrashCollector::Trash {
  public:
   Trash(const std::string& path, const std::shared_ptr<FileUtils>& fileUtils) : path_(path), fileUtils_(fileUtils) {}
 
-  // One pass: until the trash is gone or the pass is interrupted. Never throws for a failed file operation.
+  // One pass: until the trash is gone or the pass is interrupted. Never throws for a failed file operation. Called from
+  // within a pass, by a file layer that collects something on a queue that runs tasks at once, it leaves that to the
+  // pass.
   void collect() {
+    if (passThread_ == std::this_thread::get_id()) return;
     const std::lock_guard<std::mutex> lock(passMutex_);
+    passThread_ = std::this_thread::get_id();
     try {
-      while (running_ && fileUtils_->pathExists(path_) && deleteTrash()) {
+      bool wasEmpty = true;
+      while (running_ && fileUtils_->pathExists(path_) && deleteTrash(wasEmpty)) {
       }
     } catch (const std::exception& error) {
       LOG(ERROR) << "Cannot collect trash. " << error.what();
     }
+    passThread_ = std::thread::id();
   }
 
-  // Moves a path to its entry in the trash. No pass takes the trash directory away under it, but another process may.
+  // Moves a path to its entry in the trash. No pass takes the trash directory away under it, but another process may:
+  // nothing else is worth another try.
   void moveIn(const std::string& path, const std::string& entry) {
-    const std::lock_guard<std::recursive_mutex> lock(moveMutex_);
-    fileUtils_->createDirectory(path_, true);
-    fileUtils_->rename(path, entry);
+    const Move move(*this);
+    for (int attempt = 1;; ++attempt) {
+      try {
+        makeDirectory();
+        fileUtils_->rename(path, entry);
+        break;
+      } catch (const FileUtilsIoException& error) {
+        const bool pathIsThere = fileUtils_->pathExists(path) || fileUtils_->isSymLink(path);
+        if (error.code() != ENOENT || !pathIsThere || attempt == kMaxMoves) throw;
+      }
+    }
     ++moves_;
   }
 
@@ -64,14 +80,41 @@ class TrashCollector::Trash {
   std::uint32_t deletedCount() const { return deletedCount_; }
 
  private:
-  // False when the rest is left to the pass that follows upon somebody's `moveIn`.
-  bool deleteTrash() {
+  // While there is one, the trash directory stays.
+  class Move {
+   public:
+    explicit Move(Trash& trash) : trash_(trash) {
+      const std::lock_guard<std::recursive_mutex> lock(trash_.moveMutex_);
+      ++trash_.movesUnderWay_;
+    }
+    ~Move() { --trash_.movesUnderWay_; }
+    Move(const Move&) = delete;
+    Move& operator=(const Move&) = delete;
+
+   private:
+    Trash& trash_;
+  };
+
+  // One that goes at the moment when it is looked at seems to be a file in the way.
+  void makeDirectory() {
+    try {
+      fileUtils_->createDirectory(path_, true);
+    } catch (const FileUtilsIoException& error) {
+      const bool mayHaveGone = error.code() == EEXIST || error.code() == 0;
+      if (!mayHaveGone || (fileUtils_->pathExists(path_) && !fileUtils_->isDirectory(path_))) throw;
+      fileUtils_->createDirectory(path_, true);
+    }
+  }
+
+  // False when the rest is left to the pass that follows upon somebody's `moveIn`. `wasEmpty`: nothing has been found
+  // in the trash so far.
+  bool deleteTrash(bool& wasEmpty) {
     const unsigned int moves = moves_;
     const bool isDirectory = !fileUtils_->isSymLink(path_) && fileUtils_->isDirectory(path_);
-    const bool wasEmpty = isDirectory && !deleteContents(path_);
+    if (!isDirectory || deleteContents(path_)) wasEmpty = false;
     if (!running_) return false;
-    const std::unique_lock<std::recursive_mutex> lock(moveMutex_, std::try_to_lock);
-    if (!lock.owns_lock()) return false;
+    const std::lock_guard<std::recursive_mutex> lock(moveMutex_);
+    if (movesUnderWay_ > 0) return false;
     if (moves != moves_) return true;
     // The directory itself counts with what it held: emptying an empty trash deletes nothing worth telling.
     if (!wasEmpty) ++deletedCount_;
@@ -105,9 +148,11 @@ class TrashCollector::Trash {
 
   const std::string path_;
   const std::shared_ptr<FileUtils> fileUtils_;
-  std::mutex passMutex_;            // held by a pass: two at once would take each other's files away
-  std::recursive_mutex moveMutex_;  // held while a path is moved in, and while the directory goes; recursive because a
-                                    // substituted file layer may run a pass in the middle of a move
+  std::mutex passMutex_;  // held by a pass: two at once would take each other's files away
+  std::atomic<std::thread::id> passThread_{};
+  std::recursive_mutex moveMutex_;  // held where a move begins, and while the directory goes; recursive because a
+                                    // substituted file layer may collect something then
+  std::atomic<unsigned int> movesUnderWay_{0};
   std::atomic<unsigned int> moves_{0};
   std::atomic<bool> running_{true};
   std::atomic<std::uint32_t> deletedCount_{0};
@@ -129,7 +174,7 @@ bool TrashCollector::collectPath(const std::string& path) {
       fileUtils_->recursiverDirectoryDelete(path);
       return true;
     }
-    moveToTrash(path);
+    trash_->moveIn(path, freeTrashEntry());
     queue_->dispatch([weakTrash = std::weak_ptr<Trash>(trash_)] {
       if (const auto trash = weakTrash.lock()) trash->collect();
     });
@@ -166,20 +211,6 @@ bool TrashCollector::removeFilesWithFilter(const std::string& path,
   } catch (const std::exception& error) {
     LOG(ERROR) << "Cannot collect path. " << error.what();
     return false;
-  }
-}
-
-void TrashCollector::moveToTrash(const std::string& path) {
-  const std::string entry = freeTrashEntry();
-  for (int move = 1;; ++move) {
-    try {
-      return trash_->moveIn(path, entry);
-    } catch (const FileUtilsIoException& error) {
-      // Somebody may have removed the trash directory at any moment in between. Nothing else is worth another try.
-      const bool mayHaveGone = error.code() == ENOENT || error.code() == EEXIST || error.code() == 0;
-      const bool pathIsThere = fileUtils_->pathExists(path) || fileUtils_->isSymLink(path);
-      if (!mayHaveGone || !pathIsThere || move == kMaxMoves) throw;
-    }
   }
 }
 

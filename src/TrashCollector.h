@@ -51,7 +51,6 @@ class CELLAR_EXPORT TrashCollector {
  private:
   class Trash;
 
-  void moveToTrash(const std::string& path);
   std::string freeTrashEntry();
   void drainQueue();
 

@@ -8,6 +8,7 @@
 #include <memory>
 #include <ostream>
 #include <random>
+#include <stdexcept>
 #include <string>
 #include <utility>
 #include <vector>
@@ -249,6 +250,38 @@ TEST(EvictionOrderOfOneSecond, IsThatInWhichTheItemsCame) {
   for (const auto& item : manifest.pruneOldEntries(1001, 20)) gone.push_back(item.key);
   for (const auto& item : manifest.pruneToSize(0, 1000)) gone.push_back(item.key);
   EXPECT_EQ(gone, expected);
+}
+
+// The files of those that went have to go too.
+TEST(EvictionOrderOfAHost, ThatThrowsMidwayYieldsWhatHasGone) {
+  class Tired final : public PruneStrategyBase {
+   public:
+    explicit Tired(int& left) : left_(left) {}
+    bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override {
+      if (left_-- == 0) throw std::runtime_error("of the strategy");
+      return a->key < b->key;
+    }
+
+   private:
+    int& left_;
+  };
+  int left = 1000;
+  DiskCacheManifest manifest(std::make_unique<NoPersistence>(), std::make_shared<ManualExecutor>(),
+                             std::make_shared<Tired>(left));
+  manifest.load();
+  for (const char* key : {"a", "b", "c", "d", "e", "f", "g", "h"})
+    manifest.setItem({key, key, 1, false, 1, 1, nullptr});
+  std::size_t gone = 0;
+  for (int compares = 0; gone == 0; ++compares) {
+    left = compares;
+    try {
+      gone = manifest.pruneToSize(0, 100).size();
+    } catch (const std::runtime_error&) {
+      EXPECT_EQ(manifest.count(), 8U);
+    }
+  }
+  EXPECT_LT(gone, 8U);
+  EXPECT_EQ(manifest.count(), 8U - gone);
 }
 
 // What comes while the tunables are others is in its place for those; it has to leave it when they come back.

@@ -700,6 +700,22 @@ TEST_F(FutureTest, OfTwoCopiesThatGetAtOnceOneHasTheValueAndTheOtherAFutureError
   }
 }
 
+TEST_F(FutureTest, IsNotTakenBeforeTheValueHasCome) {
+  std::promise<void> promise;
+  const auto state = std::make_shared<detail::SharedFutureState<void>>();
+  state->future = promise.get_future();
+  Future<void> future(state);
+  std::thread waiting([copy = future]() mutable { copy.get(); });
+  while (state->mutex.try_lock()) {  // until it waits
+    state->mutex.unlock();
+    std::this_thread::yield();
+  }
+  EXPECT_NO_THROW(future.throwIfInvalid());
+  promise.set_value();
+  waiting.join();
+  EXPECT_THROW(future.throwIfInvalid(), FutureError);
+}
+
 TEST_F(FutureTest, OfTwoCopiesThatSetACallbackAtOnceOneWins) {
   for (int i = 0; i < kRaces; ++i) {
     Promise<Value> promise;

@@ -13,6 +13,7 @@
 #include <memory>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "DiskCacheManifest.h"
@@ -378,6 +379,63 @@ TEST_F(Invalidation, FromWithinAWriterLetsThatWriteFinish) {
   EXPECT_EQ(told(written), "<done>");
   EXPECT_EQ(told(barrier), "<done>");
   EXPECT_EQ(medium->rows().at("key").item.size, 5U);
+}
+
+// A file queue on which something else gets in between a write's record and its task.
+class InterruptedQueue final : public AsyncExecutor {
+ public:
+  std::function<void()> beforeDispatch;
+  const std::shared_ptr<test::ManualExecutor> queue = std::make_shared<test::ManualExecutor>();
+
+  void dispatch(std::function<void()> task) override {
+    if (const auto interrupt = std::exchange(beforeDispatch, nullptr)) interrupt();
+    queue->dispatch(std::move(task));
+  }
+  std::unique_ptr<AsyncTimer> dispatchAfter(std::int64_t delay, std::function<void()> task,
+                                            std::function<void()> companion) override {
+    return queue->dispatchAfter(delay, std::move(task), std::move(companion));
+  }
+  std::unique_ptr<AsyncTimer> scheduleAfter(std::int64_t delay, std::function<void()> task,
+                                            std::function<void()> companion) override {
+    return queue->scheduleAfter(delay, std::move(task), std::move(companion));
+  }
+};
+
+class InterruptedQueues final : public TaskQueueFactory {
+ public:
+  const std::shared_ptr<InterruptedQueue> file = std::make_shared<InterruptedQueue>();
+  const std::shared_ptr<test::ManualExecutor> work = std::make_shared<test::ManualExecutor>();
+
+  std::shared_ptr<AsyncExecutor> createQueue() override { return file; }
+  std::shared_ptr<AsyncExecutor> createWorkQueue() override { return work; }
+};
+
+TEST_F(Invalidation, BetweenARecordAndItsFileLeavesNoRecordWithoutAFile) {
+  open();
+  put("old", "value");
+  close();
+  for (const std::string key : {"fresh", "old"}) {
+    InterruptedQueues between;
+    const auto interrupted = PersistentKeyValueStore::createPersistentKeyValueStore(
+        storePath(), directory.file("temporary"), "larder", std::nullopt, 1000, false,
+        std::shared_ptr<TaskQueueFactory>(&between, [](TaskQueueFactory*) {}), trash, nullptr, nullptr, files, nullptr,
+        50);
+    between.work->runAll();
+    const Written written = watch(interrupted->store(key, bytesOf("newer")));
+    between.file->beforeDispatch = [&] {
+      std::thread other([&] { interrupted->invalidate(); });
+      while (between.file->queue->pending() == 0) std::this_thread::yield();
+      between.file->queue->runAll();
+      other.join();
+    };
+    between.work->runAll();
+    between.file->queue->runAll();
+    EXPECT_THAT(told(written), testing::HasSubstr("Store has been invalidated."));
+  }
+  open();
+  EXPECT_EQ(get("fresh"), "<miss>");
+  EXPECT_EQ(get("old"), "value");
+  EXPECT_EQ(rowsOnDisk().size(), 1U);
 }
 
 TEST_F(Invalidation, RacesWithOperationsOfManyThreads) {

@@ -600,7 +600,8 @@ TEST_F(StoreManagerImplCommonTest, ClosingLetsTheStoresGoAndHandsOutNoMoreButDis
   EXPECT_EQ(get("a", created), nullptr);
   EXPECT_EQ(get("b", created), nullptr);
   EXPECT_FALSE(created);
-  EXPECT_TRUE(common_->copyStoreMap().empty());
+  EXPECT_EQ(common_->getExistingStore("a")->getStore(), nullptr);
+  EXPECT_EQ(common_->getExistingStore("b")->getStore(), held);
   EXPECT_TRUE(trash->collected().empty());
   EXPECT_TRUE(directory.exists(inManager("a_250_v1")));
 }

@@ -859,16 +859,19 @@ TEST_F(StoreManagerImplTest, InvalidatingBreaksTheCircleOfManagerAndStore) {
   EXPECT_TRUE(kept.expired());
 }
 
-TEST_F(StoreManagerImplTest, ClosingBreaksTheCircleTooAndEndsMaintenance) {
+TEST_F(StoreManagerImplTest, ClosingBreaksTheCircleTooAndMaintainsWhatIsHeld) {
   build(manager({{"a", fake("a")}}));
   auto store = get("a");
   const std::weak_ptr<StoreManagerImpl> kept = manager_;
   manager_->close();
-  store->reportSize(100);
-  EXPECT_EQ(queue()->pending(), 0U);
-  EXPECT_TRUE(reported().empty());
   EXPECT_EQ(getAny("a"), nullptr);
+  const auto managersQueue = queue();
   manager_.reset();
+  store->reportSize(1000);
+  EXPECT_EQ(managersQueue->pending(), 1U);
+  settle();
+  EXPECT_EQ(store->pruneCount(), 1U);
+  EXPECT_FALSE(kept.expired());
   store.reset();
   EXPECT_TRUE(kept.expired());
 }

@@ -192,10 +192,28 @@ TEST_F(StoreManagerTest, LettingTheLastHandleGoFreesTheStoresWithoutInvalidating
   manager_.reset();
   EXPECT_TRUE(released.expired());
   EXPECT_EQ(held->invalidations(), 0U);
-  held->reportSize(1000);  // works on, without being measured or pruned
+  held->reportSize(1000);
   queues->queue(0)->runAll();
-  EXPECT_EQ(held->pruneCount(), 0U);
+  EXPECT_EQ(held->pruneCount(), 1U);
   EXPECT_TRUE(directory.exists("area/_store_1/a_250_v1"));
+}
+
+TEST_F(StoreManagerTest, AnUnmanagedStoreIsCountedThoughTheHandleHasGone) {
+  build({{"u", unmanaged("u")}});
+  const auto store = manager_->getStoreImpl("u", PruneStrategyIdentifier::Null);
+  const std::size_t before = events->events().size();
+  manager_.reset();
+  queues->queue(0)->runAll();
+  EXPECT_GT(events->events().size(), before);
+}
+
+TEST_F(StoreManagerTest, ADefinitionThatIsNoneIsNoStore) {
+  directory.makeDirectory("area/_store_1/old_1_v1");
+  build({{"none", nullptr}, {"a", fake("a")}});
+  queues->queue(0)->runAll();
+  EXPECT_EQ(trash->collected(), Texts{managerPath() + "/old_1_v1"});
+  EXPECT_EQ(manager_->getStoreImpl("none", PruneStrategyIdentifier::Null), nullptr);
+  EXPECT_NE(manager_->getStore<FakeStore>("a"), nullptr);
 }
 
 TEST_F(StoreManagerTest, LettingTheHandleGoStopsNothingThatIsUnderWayAndLosesNoData) {

@@ -108,6 +108,60 @@ class TrashCollectorTest : public testing::Test {
   test::LogCapture log_;
 };
 
+// Collecting from within a pass, by a file layer that does so, on a queue that runs tasks at once.
+
+TEST_F(TrashCollectorTest, APassTakesAlongWhatIsCollectedInTheMiddleOfIt) {
+  const string first = makeTree("first");
+  const string second = makeTree("second");
+  const auto queue = queues_->queue(0);
+  queue->onDispatch = [raw = queue.get()] { raw->runAll(); };
+  bool isSecond = false;
+  files_->onCall = [&](Operation operation, const string&) {
+    if (operation != Operation::DeleteFile || std::exchange(isSecond, true)) return;
+    EXPECT_TRUE(collector_->collectPath(second));
+  };
+  EXPECT_TRUE(collector_->collectPath(first));
+  EXPECT_TRUE(isSecond);
+  EXPECT_FALSE(directory_.exists("cache/trash"));
+  EXPECT_FALSE(directory_.exists("second"));
+  files_->onCall = nullptr;
+  queue->onDispatch = nullptr;
+}
+
+TEST_F(TrashCollectorTest, WhatComesWhileTheTrashIsEmptiedCountsAndSoDoesTheTrash) {
+  collector_->collectPath(directory_.write("one", "1"));
+  const string two = directory_.write("two", "2");
+  bool isTwo = false;
+  files_->onCall = [&](Operation operation, const string&) {
+    if (operation != Operation::DeleteFile || std::exchange(isTwo, true)) return;
+    EXPECT_TRUE(collector_->collectPath(two));
+  };
+  queues_->queue(0)->runAll();
+  EXPECT_TRUE(isTwo);
+  collector_->collectPath(directory_.write("three", "3"));
+  isTwo = false;
+  directory_.write("two", "2");
+  empty();
+  files_->onCall = nullptr;
+  EXPECT_FALSE(directory_.exists("cache/trash"));
+  EXPECT_EQ(reportedCount(), 3U);
+}
+
+TEST_F(TrashCollectorTest, TwoThreadsMoveAtTheSameTime) {
+  const string one = makeTree("one");
+  const string two = makeTree("two");
+  test::Latch both(2);
+  files_->onCall = [&](Operation operation, const string&) {
+    if (operation != Operation::Rename) return;
+    both.countDown();
+    both.wait();
+  };
+  std::thread other([&] { EXPECT_TRUE(collector_->collectPath(one)); });
+  EXPECT_TRUE(collector_->collectPath(two));
+  other.join();
+  files_->onCall = nullptr;
+}
+
 // Collecting
 
 TEST_F(TrashCollectorTest, ObtainsOneFileQueueAndNoOther) {

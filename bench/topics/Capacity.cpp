@@ -23,7 +23,8 @@ namespace {
 
 constexpr std::size_t kSize = Manifests::kItemSize;
 
-// The first write after a start finds the database out of memory. It is a figure of its own; these go before the others.
+// The first write after a start finds the database out of memory. It is a figure of its own; these go before the
+// others.
 constexpr std::size_t kFirstWrites = 20;
 
 struct Taken {
