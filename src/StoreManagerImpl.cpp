@@ -97,8 +97,8 @@ std::string StoreManagerImpl::getStorePath(std::shared_ptr<const StoreDefinition
 
 void StoreManagerImpl::invalidate() {
   common_.invalidate();
-  const std::lock_guard<std::recursive_mutex> lock(
-      cleanupMutex_);  // no clean-up is under way any more when this returns
+  // No other thread's clean-up is under way any more when this returns.
+  const std::lock_guard<std::recursive_mutex> lock(cleanupMutex_);
 }
 
 void StoreManagerImpl::close() { common_.close(); }
@@ -184,6 +184,7 @@ void StoreManagerImpl::pruneStoresIfNecessary() {
 std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() {
   const std::lock_guard<std::mutex> lock(mutex_);
   const StoreManagerDefinition& definition = common_.definition();
+  if (pruneInProgress_) noteIfRoundIsOver();  // a store that has gone in the middle of its prune tells nobody
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
   const auto nextPruneTime = static_cast<std::int64_t>(lastPruneTime_) + definition.pruneInterval;
   if (lastPruneTime_ != 0 && static_cast<std::int64_t>(std::time(nullptr)) < nextPruneTime) return {};
@@ -242,10 +243,15 @@ void StoreManagerImpl::onStorePruneBackToNormalComplete(const std::string& ident
 void StoreManagerImpl::checkPruneCompletion() {
   // Looking and noting under one lock: of two stores that finish at once, the later to note has seen both.
   const std::lock_guard<std::mutex> lock(mutex_);
+  noteIfRoundIsOver();
+}
+
+// Called with the mutex held.
+void StoreManagerImpl::noteIfRoundIsOver() {
   bool anyIsPruning = false;
   for (const auto& [identifier, item] : common_.copyStoreMap()) {
     const std::lock_guard<std::mutex> itemLock(item->mutex);
-    anyIsPruning = anyIsPruning || item->isPruning;
+    anyIsPruning = anyIsPruning || (item->isPruning && item->getStore() != nullptr);
   }
   pruneInProgress_ = anyIsPruning;
   if (!anyIsPruning) lastPruneTime_ = std::time(nullptr);

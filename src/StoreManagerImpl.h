@@ -105,6 +105,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   void createAllStores();
   std::vector<PruneRequest> beginPruneRound();
   bool isInSurvivalMode();
+  void noteIfRoundIsOver();
   void startPruning(const PruneRequest& request);
 
   std::mutex mutex_;  // guards the three below

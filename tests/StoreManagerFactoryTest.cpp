@@ -63,7 +63,7 @@ class FakeLocations : public PathLocations {
 };
 
 // A host's own source of definitions, which answers with nothing for some names.
-class HostConfiguration final : public Configuration {
+class HostConfiguration : public Configuration {
  public:
   HostConfiguration() : Configuration(std::unordered_map<string, std::shared_ptr<const StoreManagerDefinition>>()) {}
   std::shared_ptr<const StoreDefinition> getStore(const string& /*identifier*/) const override {
@@ -341,6 +341,17 @@ TEST_F(StoreManagerFactoryTest, AnUnknownStoreGivesNothingAndOneErrorLineEachTim
   const string line = ConfigurationException("Store 'x' not found.").what();
   EXPECT_EQ(log_.messages(), (Texts{line, line}));
   EXPECT_EQ(log_.errorCount(), 2U);
+}
+
+TEST_F(StoreManagerFactoryTest, AStoreOfAHostsConfigurationThatHasNoDefinitionIsLogged) {
+  class WithoutDefinitions final : public HostConfiguration {
+   public:
+    std::shared_ptr<const StoreDefinition> getStore(const string& /*identifier*/) const override { return nullptr; }
+  };
+  configuration_ = std::make_shared<WithoutDefinitions>();
+  build();
+  EXPECT_EQ(factory_->managerForStoreIdentifier("x"), nullptr);
+  EXPECT_EQ(log_.messages(), Texts{"Store 'x' has no definition."});
 }
 
 TEST_F(StoreManagerFactoryTest, WhateverLookingForTheStoreThrowsIsLogged) {

@@ -876,6 +876,38 @@ TEST_F(StoreManagerImplTest, ClosingBreaksTheCircleTooAndMaintainsWhatIsHeld) {
   EXPECT_TRUE(kept.expired());
 }
 
+TEST_F(StoreManagerImplTest, AStoreThatGoesInTheMiddleOfItsPruneDoesNotHoldUpTheOthers) {
+  build(manager({{"a", fake("a")}, {"b", fake("b")}}));
+  auto a = get("a");
+  const auto b = get("b");
+  const auto managersQueue = queue();
+  manager_->close();
+  manager_.reset();
+  a->reportSize(1000);
+  managersQueue->runAll();
+  ASSERT_EQ(a->pruneCount(), 1U);
+  b->reportSize(1000);
+  managersQueue->runAll();
+  EXPECT_EQ(b->pruneCount(), 0U);  // one round at a time
+  a.reset();
+  b->reportSize(1001);
+  managersQueue->runAll();  // the round is over
+  clock_.advance(1'000'000);
+  b->reportSize(1002);
+  managersQueue->runAll();
+  EXPECT_EQ(b->pruneCount(), 1U);
+}
+
+TEST_F(StoreManagerImplTest, InvalidatingFromWithinTheCleanUpDoesNotWaitForItself) {
+  build(manager({}));
+  directory.makeDirectory("area/_store_1/old_1_v1");
+  trash->onCollect = [&](const string&) { manager_->invalidate(); };
+  manager_->startCleanup();
+  settle();
+  trash->onCollect = nullptr;
+  EXPECT_FALSE(manager_->isValid());
+}
+
 TEST_F(StoreManagerImplTest, AMeasuredSizeKeepsTheManagerAliveUntilItIsCounted) {
   build(manager({{"u", unmanaged("u", 100)}}));
   getAny("u");

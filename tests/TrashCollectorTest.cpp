@@ -353,6 +353,18 @@ TEST_F(TrashCollectorTest, AMissingPathIsNotTriedAgain) {
   EXPECT_EQ(files_->calls(Operation::Rename), 1U);
 }
 
+TEST_F(TrashCollectorTest, ARenameThatFailsThoughTheTrashIsThereIsNotTriedAgain) {
+  for (const int code : {EIO, EEXIST, EACCES}) {
+    const string path = makeTree("tree");
+    const std::size_t before = files_->calls(Operation::Rename);
+    files_->failNext(Operation::Rename, code);
+    EXPECT_FALSE(collector_->collectPath(path)) << code;
+    EXPECT_EQ(files_->calls(Operation::Rename), before + 1) << code;
+    EXPECT_TRUE(directory_.exists("tree/one"));
+  }
+  EXPECT_EQ(log_.errorCount(), 3U);
+}
+
 TEST_F(TrashCollectorTest, ATrashDirectoryThatAnotherThreadCreatesInBetweenIsUsed) {
   class CreatedInBetween : public FileUtils {
    public:
