@@ -3,6 +3,8 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <fstream>
+#include <ios>
 #include <utility>
 
 #include "ExtendedMetadata.h"
@@ -11,6 +13,9 @@
 namespace velmora::mobile::xplat::cellar {
 
 namespace {
+
+// SQLite's number for writing through a connection that it could open for reading only.
+constexpr int kReadOnly = 8;
 
 constexpr const char* tableName = "LarderManifest";
 
@@ -107,16 +112,40 @@ template <class Operation> auto SQLiteManifestPersistence::perform(Operation ope
   using Result = decltype(operation());
   const std::lock_guard<std::mutex> lock(mutex_);
   if (invalidated_) return Result();
-  return translatingExceptions(std::move(operation));
+  return translatingExceptions([&] {
+    if (isReadOnly_) reopen();
+    try {
+      return operation();
+    } catch (const SQLiteStoreException& exception) {
+      if (exception.code() == kReadOnly) handleReadOnly(exception);
+      throw;
+    }
+  });
+}
+
+// Either the file could not be opened for writing when it was opened, or it says itself that it must never be written:
+// its format's version for writers, a byte of its header, is not one that there is.
+void SQLiteManifestPersistence::handleReadOnly(const SQLiteStoreException& exception) const {
+  constexpr std::streamoff kWriterVersionOffset = 18;
+  constexpr int kLatestWriterVersion = 2;
+  constexpr int kFoundByOurselves = -1;
+  std::ifstream file(path_, std::ios::binary);
+  if (file.seekg(kWriterVersionOffset) && file.get() > kLatestWriterVersion) {
+    throw SQLiteStoreCorruptedException(exception.description(), kFoundByOurselves);
+  }
+  isReadOnly_ = true;
+}
+
+// The old connection takes SQLite's companion files along when it closes, so the new one must not have made its own by
+// then: it is opened before, because opening can fail, but used only afterwards.
+void SQLiteManifestPersistence::reopen() const {
+  store_ = openStore();
+  initializeDatabase(*store_);
+  isReadOnly_ = false;
 }
 
 void SQLiteManifestPersistence::clearItems() {
-  perform([this] {
-    // The old connection takes SQLite's companion files along when it closes, so the new one must not have made its own
-    // by then: it is opened before, because opening can fail, but used only afterwards.
-    store_ = openStore();
-    initializeDatabase(*store_);
-  });
+  perform([this] { reopen(); });
 }
 
 void SQLiteManifestPersistence::setItem(const DiskCacheItem& item) {

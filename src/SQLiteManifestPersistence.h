@@ -32,6 +32,8 @@
 
 namespace velmora::mobile::xplat::cellar {
 
+class SQLiteStoreException;
+
 class ExtendedMetadataFactory;
 
 // The manifest in an SQLite database. What an operation has written survives the death of the process; a power failure
@@ -72,13 +74,17 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   template <class Operation> auto perform(Operation operation) const;
 
   std::unique_ptr<SQLiteStore> openStore() const;
+  void reopen() const;
+  void handleReadOnly(const SQLiteStoreException& exception) const;
   std::unique_ptr<DiskCacheItem> itemInRowOf(SQLiteStoreCursor& cursor) const;
   std::vector<std::unique_ptr<DiskCacheItem>> itemsOf(SQLiteStoreCursor& cursor) const;
 
   const std::string path_;
-  mutable std::mutex mutex_;  // held by every operation from its beginning to its end; guards the two below
+  mutable std::mutex mutex_;  // held by every operation from its beginning to its end; guards the three below
   bool invalidated_ = false;
-  std::unique_ptr<SQLiteStore> store_;  // null once invalidated
+  mutable std::unique_ptr<SQLiteStore> store_;  // null once invalidated
+  // SQLite opens what may not be written just now for reading only; the next operation opens it again.
+  mutable bool isReadOnly_ = false;
   const std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory_;
   const SQLiteStoreFactory storeFactory_;
 };
