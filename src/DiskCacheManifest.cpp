@@ -23,6 +23,12 @@ std::int32_t now() { return static_cast<std::int32_t>(std::time(nullptr)); }
 
 DiskCacheManifestInterface::~DiskCacheManifestInterface() = default;
 
+std::optional<ReplacedItem> DiskCacheManifestInterface::replaceItem(const DiskCacheItem& item,
+                                                                    bool /*withInlineData*/) {
+  setItem(item);
+  return std::nullopt;
+}
+
 std::shared_ptr<DiskCacheManifest> DiskCacheManifest::createDiskCacheManifest(
     const std::string& path, std::shared_ptr<AsyncExecutor> executor, std::shared_ptr<ExtendedMetadataFactory> factory,
     std::shared_ptr<PruneStrategyBase> strategy) {
@@ -84,9 +90,34 @@ void DiskCacheManifest::invalidate() {
 
 void DiskCacheManifest::setItem(const DiskCacheItem& item) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
+  set(item);
+}
+
+std::optional<ReplacedItem> DiskCacheManifest::replaceItem(const DiskCacheItem& item, bool withInlineData) {
+  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  auto replaced = whatIsReplaced(item.key, withInlineData);
+  set(item);
+  return replaced;
+}
+
+void DiskCacheManifest::set(const DiskCacheItem& item) {
   persistence_->setItem(item);
   pendingAccessDates_.erase(item.key);
   records_->store(item);
+}
+
+std::optional<ReplacedItem> DiskCacheManifest::whatIsReplaced(const std::string& key, bool withInlineData) {
+  try {
+    const ManifestRecord* const record = findOrRead(key);
+    if (record == nullptr) return ReplacedItem();
+    ReplacedItem replaced{std::make_unique<DiskCacheItem>(record->item()), {}};
+    if (withInlineData && record->hasInlineData) replaced.inlineData = persistence_->getInlineData(key);
+    return replaced;
+  } catch (const ManifestCorruptedException&) {
+    throw;
+  } catch (const ManifestPersistenceException&) {
+    return std::nullopt;  // not being able to read must not keep the item from being written
+  }
 }
 
 std::unique_ptr<DiskCacheItem> DiskCacheManifest::getItem(const std::string& key) {

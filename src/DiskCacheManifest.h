@@ -21,6 +21,12 @@ class ExtendedMetadataFactory;
 class ManifestRecord;
 class ManifestRecords;
 
+// The record that another one has replaced, null if there was none, and its inline value if that was asked for.
+struct CELLAR_EXPORT ReplacedItem {
+  std::unique_ptr<DiskCacheItem> item;
+  std::vector<unsigned char> inlineData;
+};
+
 // What a store knows of its items. A key without a record is never an error. Always held by shared pointers; any thread
 // may call.
 class CELLAR_EXPORT DiskCacheManifestInterface : public std::enable_shared_from_this<DiskCacheManifestInterface> {
@@ -45,6 +51,10 @@ class CELLAR_EXPORT DiskCacheManifestInterface : public std::enable_shared_from_
   virtual std::uint32_t size() = 0;
   virtual std::uint32_t count() = 0;
   virtual bool isLoaded() = 0;
+
+  // As `setItem`, and returns what it has replaced; empty when the manifest does not tell, as here. A store then takes
+  // what lies in the key's place for its value when it has to take a write back.
+  virtual std::optional<ReplacedItem> replaceItem(const DiskCacheItem& item, bool withInlineData);
 
   // A weak pointer to this manifest as a T; empty when it is not owned by a shared pointer, or no T.
   template <class T> std::weak_ptr<T> weak_from_this() { return std::dynamic_pointer_cast<T>(weak_from_this().lock()); }
@@ -126,6 +136,9 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   // Throws `DiskCacheManifestException` before the manifest is loaded.
   std::vector<std::string> getAllKeys() override;
 
+  // Does not tell when the record has to be read from disk and cannot be read.
+  std::optional<ReplacedItem> replaceItem(const DiskCacheItem& item, bool withInlineData) override;
+
   std::uint32_t size() override;   // total bytes of the items in memory
   std::uint32_t count() override;  // number of items in memory
   bool isLoaded() override;
@@ -134,6 +147,8 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   using AccessDates = std::unordered_map<std::string, std::int32_t>;
 
   // These are called with the items mutex held.
+  void set(const DiskCacheItem& item);
+  std::optional<ReplacedItem> whatIsReplaced(const std::string& key, bool withInlineData);
   const ManifestRecord* findOrRead(const std::string& key);
   DiskCacheItem remove(const ManifestRecord& record);
   template <class MayGo> std::vector<DiskCacheItem> prune(const std::function<const ManifestRecord*()>& next,

@@ -29,6 +29,9 @@ constexpr long kFirstStaleRemovalDelay = 300;  // seconds
 constexpr long kStaleRemovalInterval = 3600;   // seconds
 constexpr std::uint64_t kNanosecondsPerSecond = 1'000'000'000;
 
+// The code of a write to a manifest that could be opened for reading only.
+constexpr int kReadOnlyManifest = 8;
+
 // How far the files of writes may get ahead of their records: the first of them waits for the last.
 constexpr std::size_t kMaxWritesAtOnce = 32;
 constexpr std::uint64_t kMaxBytesAtOnce = 1 << 20;
@@ -43,8 +46,21 @@ const std::array<std::string, 5>& reservedNames() {
   return names;
 }
 
+bool isReserved(const std::string& filename) {
+  const std::string_view name = std::string_view(filename).substr(filename.rfind('/') + 1);  // whatever way leads there
+  const auto& reserved = reservedNames();
+  return std::find(reserved.begin(), reserved.end(), name) != reserved.end();
+}
+
 void count(std::atomic<std::uint64_t>& counter, std::uint64_t occurrences = 1) {
   counter.fetch_add(occurrences, std::memory_order_relaxed);
+}
+
+// Whether the file cannot become a manifest that works, however often it is opened: it is damaged, or holds a table of
+// another program's that the manifest's own statements do not fit.
+bool isNotAManifest(const ManifestPersistenceException& error) {
+  constexpr int kStatementDoesNotFit = 1;
+  return dynamic_cast<const ManifestCorruptedException*>(&error) != nullptr || error.code() == kStatementDoesNotFit;
 }
 
 // Fulfils the promise with what the operation does or throws. No lock may be held: an inline callback runs here.
@@ -76,7 +92,8 @@ class PersistentKeyValueStore::Keys {
 
 // A write of a file, on its way through the queues.
 struct PersistentKeyValueStore::FileWrite {
-  enum class Outcome : std::uint8_t { Open, Written, Revoked, Failed };
+  // Discarded: what the writer wrote has to be deleted. Failed: it is deleted, or was never written.
+  enum class Outcome : std::uint8_t { Open, Written, Discarded, Failed };
 
   std::string key;
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
@@ -105,12 +122,11 @@ struct PersistentKeyValueStore::FileWrite {
   FileWrite(const FileWrite&) = delete;
   FileWrite& operator=(const FileWrite&) = delete;
 
-  // A queue may drop the write without running it. Another write of the key may be at the file just now. Takes the
-  // store's mutex, so that nobody may let go of a write who holds it.
+  // A queue may drop the write without running it. Takes the store's mutex, so a write must not be released by who
+  // holds it.
   ~FileWrite() {
-    if (inFlight == nullptr || inFlight->isOver) return;
-    const auto owner = store.lock();
-    if (owner != nullptr && !owner->takeBack(*this)) owner->deleteLeftoverFile(key);
+    if (inFlight == nullptr || outcome == Outcome::Written || outcome == Outcome::Discarded) return;
+    if (const auto owner = store.lock()) owner->rollBack(*this);
   }
 
   DiskCacheItem record() const {
@@ -139,6 +155,13 @@ struct PersistentKeyValueStore::FileWrite {
   }
 
   void deliver() { failure == nullptr ? promise->setValue() : promise->setException(failure); }
+};
+
+// A clear that is under way.
+struct PersistentKeyValueStore::Clear {
+  bool hasBegun = false;
+  std::unordered_set<std::string> storedSince;         // keys that it leaves alone
+  std::optional<std::vector<std::string>> keysLeft{};  // to be looked at, once pruning does not get on
 };
 
 // A fetch, on its way through the queues.
@@ -197,17 +220,7 @@ PersistentKeyValueStore::PersistentKeyValueStore(
   workQueue_ = taskQueueFactory->createWorkQueue();
 }
 
-// Writes that have not begun will not begin any more: their records must not stay behind without a file.
-PersistentKeyValueStore::~PersistentKeyValueStore() {
-  for (const auto& write : writesInFlight_->all()) {
-    try {
-      if (!write->isRevoked) manifest_->removeItem(write->key);
-    } catch (const std::exception& error) {
-      LOG(ERROR) << "Could not remove the record of an unfinished write: " << error.what();
-    }
-    deleteLeftoverFile(write->key);
-  }
-}
+PersistentKeyValueStore::~PersistentKeyValueStore() { restoreRecords(); }
 
 // --- Storing ---
 
@@ -226,13 +239,11 @@ Future<void> PersistentKeyValueStore::store(const std::string& key, const std::v
   Future<void> future = promise->getFuture();
   dispatchWork(Keys(key), *promise,
                [weakThis = weak_from_this<PersistentKeyValueStore>(), key, value, extendedMetadata, promise] {
-                 settle(*promise, [&] {
-                   const auto self = weakThis.lock();
-                   if (self == nullptr) return;
-                   const std::lock_guard<std::mutex> lock(self->mutex_);
-                   self->throwIfInvalid();
-                   self->writeInline(key, *value, extendedMetadata);
-                 });
+                 if (const auto self = weakThis.lock()) {
+                   self->storeInline(key, *value, extendedMetadata, promise);
+                 } else {
+                   promise->setValue();
+                 }
                });
   return future;
 }
@@ -282,19 +293,21 @@ Future<void> PersistentKeyValueStore::storeFile(const std::shared_ptr<FileWrite>
   return future;
 }
 
-// Puts a provisional record into the manifest; none, if the store had to be purged. Answers the write before, which the
-// caller may be the last to hold, to let go of it without the mutex.
+// Puts a provisional record into the manifest; none, if the store had to be purged. Returns the write before, which the
+// caller may be the last to hold, to release it without the mutex.
 std::shared_ptr<PersistentKeyValueStore::FileWrite> PersistentKeyValueStore::beginFileWrite(
     const std::shared_ptr<FileWrite>& write) {
-  try {
-    prepareWrite(write->key);
-    getManifest()->setItem(write->record());
-    write->inFlight = writesInFlight_->begin(write->key);
-  } catch (const ManifestPersistenceException& error) {
+  const bool isDueToBeCleared = noteStored(write->key);
+  std::optional<ReplacedItem> replaced;
+  const auto setRecord = [&] { replaced = getManifest()->replaceItem(write->record(), true); };
+  if (!prepareWrite() || !purgingIfUnwritable(setRecord)) {
     writesInFlight_->revoke(write->key);  // an earlier value must not take the place of this one
-    purge(error);
     return nullptr;
   }
+  auto settled = replaced ? SettledValue{std::move(replaced->item), std::move(replaced->inlineData)}
+                          : SettledValue{nullptr, {}, true};
+  if (isDueToBeCleared && !settled.isPlainMiss()) settled = SettledValue::lost();
+  write->inFlight = writesInFlight_->begin(write->key, std::move(settled));
   auto last = lastFileWrite_.lock();
   if (last != nullptr) last->setNext(write);
   lastFileWrite_ = write;
@@ -324,7 +337,7 @@ void PersistentKeyValueStore::finishFileWrites(const std::shared_ptr<FileWrite>&
   lock.unlock();
   std::exception_ptr failure;  // of a callback: the executor's affair, but not the other writes'
   for (const auto& write : writes) {
-    if (write->outcome == FileWrite::Outcome::Revoked) deleteLeftoverFile(write->key);
+    if (write->outcome == FileWrite::Outcome::Discarded) deleteLeftoverFile(write->key);
     try {
       write->deliver();
     } catch (...) {
@@ -341,7 +354,7 @@ void PersistentKeyValueStore::writeFile(FileWrite& write) {
       write.size = runWriter(write);
       write.outcome = FileWrite::Outcome::Written;
     } else {
-      write.outcome = FileWrite::Outcome::Revoked;
+      write.outcome = FileWrite::Outcome::Discarded;
     }
   } catch (...) {
     write.failure = std::current_exception();
@@ -353,7 +366,11 @@ unsigned int PersistentKeyValueStore::runWriter(const FileWrite& write) {
   try {
     return write.writer(getFilePath(write.key));
   } catch (...) {
-    takeBack(write);
+    {
+      const std::lock_guard<std::mutex> lock(mutex_);
+      writesInFlight_->settle(write.key, SettledValue::lost());
+    }
+    rollBack(write);
     deleteLeftoverFile(write.key);
     throw;
   }
@@ -361,20 +378,34 @@ unsigned int PersistentKeyValueStore::runWriter(const FileWrite& write) {
 
 void PersistentKeyValueStore::recordWritten(FileWrite& write) {
   if (write.outcome == FileWrite::Outcome::Failed) return;
-  writesInFlight_->end(write.inFlight);
-  if (write.inFlight->isRevoked) write.outcome = FileWrite::Outcome::Revoked;
-  if (write.outcome == FileWrite::Outcome::Revoked) return;
+  const bool othersAreInFlight = writesInFlight_->end(write.inFlight);
+  if (write.inFlight->isRevoked) write.outcome = FileWrite::Outcome::Discarded;
+  if (write.outcome == FileWrite::Outcome::Discarded) return;
   try {
-    try {
+    const DiskCacheItem record = write.record();
+    const auto setRecord = [&] {
       if (!write.inFlight->hasRecord) removeOldestItemIfOverMaxCapacity();
-      getManifest()->setItem(write.record());
+      getManifest()->setItem(record);
       count(stores_);
-    } catch (const ManifestPersistenceException& error) {
-      purge(error);
+    };
+    if (purgingIfUnwritable(setRecord) && othersAreInFlight) {
+      writesInFlight_->settle(write.key, {std::make_unique<DiskCacheItem>(record)});
     }
     write.total = totalToReport();
   } catch (...) {
     write.failure = std::current_exception();
+    write.outcome = FileWrite::Outcome::Discarded;
+    discardRecord(write.key, othersAreInFlight);
+  }
+}
+
+// Takes back the provisional record of a write whose final one could not be written.
+void PersistentKeyValueStore::discardRecord(const std::string& key, bool othersAreInFlight) {
+  if (othersAreInFlight) return writesInFlight_->settle(key, SettledValue::lost());
+  try {
+    restoreRecord(key, SettledValue::lost());
+  } catch (const std::exception& error) {
+    logLostRecord(key, error);
   }
 }
 
@@ -387,57 +418,131 @@ void PersistentKeyValueStore::reportTotal(FileWrite& write) {
   }
 }
 
-// Takes the record of a write that failed or was dropped away again. True when another write of the key is on its way,
-// whose record it is by now.
-bool PersistentKeyValueStore::takeBack(const FileWrite& write) {
+// Ends a write that has failed or was dropped. When no other write of its key is in flight, the key goes back to what
+// it has without them.
+void PersistentKeyValueStore::rollBack(const FileWrite& write) {
+  bool hasStrayFile = false;
   try {
     const std::lock_guard<std::mutex> lock(mutex_);
-    writesInFlight_->end(write.inFlight);
-    if (writesInFlight_->contains(write.key)) return true;
-    try {
-      if (!write.inFlight->isRevoked) getManifest()->removeItem(write.key);
-    } catch (const ManifestCorruptedException& error) {
-      purge(error);
-    }
+    const auto settled = writesInFlight_->drop(write.inFlight);
+    if (!settled) return;
+    hasStrayFile = settled->hasStrayFile;
+    purgingIfDamaged([&] { restoreRecord(write.key, *settled); });
   } catch (const std::exception& error) {
-    LOG(ERROR) << "Could not remove the record of a failed write: " << error.what();
+    logLostRecord(write.key, error);
   }
-  return false;
+  if (hasStrayFile) deleteLeftoverFile(write.key);
+}
+
+// Called with the mutex held, or by the destructor.
+void PersistentKeyValueStore::restoreRecord(const std::string& key, const SettledValue& settled) {
+  const auto manifest = getManifest();
+  if (settled.isUnknown && hasFile(key)) return;
+  if (settled.record == nullptr) return manifest->removeItem(key);
+  manifest->setItem(*settled.record);
+  if (settled.record->hasInlineData) manifest->setInlineData(key, settled.inlineData);
+}
+
+// The same for every write in flight, none of which will start any more. Purges nothing: the directory may be that of
+// another store by now.
+void PersistentKeyValueStore::restoreRecords() {
+  for (const auto& [key, settled] : writesInFlight_->dropAll()) {
+    try {
+      restoreRecord(key, settled);
+    } catch (const std::exception& error) {
+      logLostRecord(key, error);
+    }
+    if (settled.hasStrayFile) deleteLeftoverFile(key);
+  }
+}
+
+void PersistentKeyValueStore::logLostRecord(const std::string& key, const std::exception& error) const {
+  LOG(ERROR) << "Store \"" << name_ << "\" could not restore the record of \"" << key << "\": " << error.what();
+}
+
+bool PersistentKeyValueStore::hasFile(const std::string& key) {
+  const std::string filePath = getFilePath(key);
+  return fileUtils_->pathExists(filePath) && !fileUtils_->isDirectory(filePath);
 }
 
 void PersistentKeyValueStore::deleteLeftoverFile(const std::string& key) {
   if (isClosed_) return;
   try {
-    const std::string filePath = getFilePath(key);
-    if (fileUtils_->pathExists(filePath) && !fileUtils_->isDirectory(filePath)) fileUtils_->deleteFile(filePath);
+    if (hasFile(key)) fileUtils_->deleteFile(getFilePath(key));
   } catch (const std::exception& error) {
-    LOG(ERROR) << "Could not remove the file of an unfinished write: " << error.what();
+    LOG(ERROR) << "Store \"" << name_ << "\" could not delete the file of an unfinished write of \"" << key
+               << "\": " << error.what();
   }
 }
 
-void PersistentKeyValueStore::writeInline(const std::string& key, const std::vector<unsigned char>& data,
-                                          std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata) {
+void PersistentKeyValueStore::storeInline(const std::string& key, const std::vector<unsigned char>& data,
+                                          std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
+                                          const std::shared_ptr<Promise<void>>& promise) {
+  std::optional<std::string> replacedFile;
   try {
-    prepareWrite(key);
+    const std::lock_guard<std::mutex> lock(mutex_);
+    throwIfInvalid();
+    replacedFile = writeInline(key, data, std::move(extendedMetadata));
+  } catch (...) {
+    return promise->setException(std::current_exception());
+  }
+  if (replacedFile) {
+    deleteReplacedFile(*replacedFile, promise);
+  } else {
+    promise->setValue();
+  }
+}
+
+// The path of the file that held the value so far, if one did.
+std::optional<std::string> PersistentKeyValueStore::writeInline(
+    const std::string& key, const std::vector<unsigned char>& data,
+    std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata) {
+  std::optional<ReplacedItem> replaced;
+  const auto write = [&] {
     const auto manifest = getManifest();
     const std::int32_t date = currentDate();
     const auto size = static_cast<std::uint32_t>(data.size());
-    manifest->setItem({key, key, size, false, date, date, std::move(extendedMetadata)});
+    replaced = manifest->replaceItem({key, key, size, false, date, date, std::move(extendedMetadata)}, false);
     manifest->setInlineData(key, data);
     count(stores_);
-  } catch (const ManifestPersistenceException& error) {
-    writesInFlight_->revoke(key);
-    purge(error);
-  }
+  };
+  noteStored(key);
+  const bool isWritten = prepareWrite() && purgingIfUnwritable(write);
+  if (!isWritten) writesInFlight_->revoke(key);
   reportSize();
+  const bool hasReplaced = isWritten && replaced && replaced->item != nullptr;
+  return hasReplaced ? fileOf(*replaced->item) : std::nullopt;
 }
 
-void PersistentKeyValueStore::prepareWrite(const std::string& key) {
-  beginAnew();
-  for (const auto& storedSince : clearsUnderWay_) {
-    if (const auto keys = storedSince.lock()) keys->insert(key);
+// On the file queue, behind the fetches that wait for the file. The promise waits too: as long as the file is there, a
+// kill in the middle of the next write of the key could bring its value back.
+void PersistentKeyValueStore::deleteReplacedFile(const std::string& filePath,
+                                                 const std::shared_ptr<Promise<void>>& promise) {
+  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), filePath, promise] {
+    if (const auto self = weakThis.lock()) self->deleteFiles({filePath});
+    promise->setValue();
+  };
+  try {
+    fileQueue_->dispatch(deleteIt);
+  } catch (...) {
+    deleteIt();
   }
-  if (capacity_) removeOldestItemIfOverMaxCapacity();
+}
+
+// Keeps the clears that are under way from the key. Whether one of them would have taken its present value yet.
+bool PersistentKeyValueStore::noteStored(const std::string& key) {
+  bool isDueToBeCleared = false;
+  for (const auto& clear : clearsUnderWay_) {
+    if (const auto state = clear.lock()) isDueToBeCleared = state->storedSince.insert(key).second || isDueToBeCleared;
+  }
+  return isDueToBeCleared;
+}
+
+// Makes room for a write. False when the store was purged instead.
+bool PersistentKeyValueStore::prepareWrite() {
+  getManifest();  // one that cannot be opened now fails this operation, and purges nothing
+  beginAnew();
+  return !capacity_ || purgingIfUnwritable([&] { removeOldestItemIfOverMaxCapacity(); });
 }
 
 // --- Fetching ---
@@ -514,15 +619,12 @@ void PersistentKeyValueStore::find(const std::shared_ptr<Fetch>& fetch) {
 
 // The record of the first key that has one; null for a miss, and when looking for it purged the store.
 std::unique_ptr<DiskCacheItem> PersistentKeyValueStore::lookUp(Keys keys) {
-  try {
+  std::unique_ptr<DiskCacheItem> item;
+  purgingIfDamaged([&] {
     beginAnew();
-    for (const std::string& key : keys) {
-      if (auto item = getManifest()->getItem(key)) return item;
-    }
-  } catch (const ManifestCorruptedException& error) {
-    purge(error);
-  }
-  return nullptr;
+    for (auto key = keys.begin(); key != keys.end() && item == nullptr; ++key) item = getManifest()->getItem(*key);
+  });
+  return item;
 }
 
 void PersistentKeyValueStore::load(Fetch& fetch) {
@@ -533,11 +635,7 @@ void PersistentKeyValueStore::load(Fetch& fetch) {
     auto fetched = std::make_unique<FetchResult>(FetchResult{item->key, {}, item->modificationDate});
     if (fetch.loader(item, getFilePath(item->filename), fetched->value)) {
       const std::lock_guard<std::mutex> lock(mutex_);
-      try {
-        getManifest()->updateLastAccessDate(item->key);
-      } catch (const ManifestCorruptedException& error) {
-        purge(error);
-      }
+      purgingIfDamaged([&] { getManifest()->updateLastAccessDate(item->key); });
       result = std::move(fetched);
     }
   } catch (...) {
@@ -565,16 +663,16 @@ bool PersistentKeyValueStore::readValue(std::shared_ptr<const DiskCacheItem> ite
     return true;
   }
   const std::lock_guard<std::mutex> lock(mutex_);  // record and value are written one after the other
-  try {
+  bool isThere = false;
+  purgingIfDamaged([&] {
     const auto manifest = getManifest();
     value = manifest->getInlineData(item->key);
-    if (!value.empty()) return true;
+    isThere = !value.empty();
+    if (isThere) return;
     const auto current = manifest->getItem(item->key);
-    return current != nullptr && current->size == 0;  // an empty value, not one that has vanished
-  } catch (const ManifestCorruptedException& error) {
-    purge(error);
-    return false;
-  }
+    isThere = current != nullptr && current->size == 0;  // an empty value, not one that has vanished
+  });
+  return isThere;
 }
 
 std::vector<std::string> PersistentKeyValueStore::getAllKeys() {
@@ -583,14 +681,15 @@ std::vector<std::string> PersistentKeyValueStore::getAllKeys() {
 }
 
 std::optional<std::int32_t> PersistentKeyValueStore::fetchModificationDate(const std::string& key) {
-  throwIfInvalid();
   throwIfReserved(key);
-  try {
-    return getManifest()->getModificationDate(key);
-  } catch (const ManifestCorruptedException& error) {
-    handleCorruptedManifest(error);
-    return std::nullopt;
-  }
+  const std::lock_guard<std::mutex> lock(mutex_);  // no purge and no invalidation comes in between
+  throwIfInvalid();
+  std::optional<std::int32_t> date;
+  purgingIfDamaged([&] {
+    beginAnew();
+    date = getManifest()->getModificationDate(key);
+  });
+  return date;
 }
 
 Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& key) {
@@ -606,11 +705,7 @@ Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& ke
             PersistentKeyValueStoreEventBuilder(PersistentKeyValueStoreEvent::Hit::Found, self->name_, key).get());
       }
       const std::lock_guard<std::mutex> lock(self->mutex_);
-      try {
-        self->getManifest()->updateLastAccessDate(key);
-      } catch (const ManifestCorruptedException& error) {
-        self->purge(error);
-      }
+      self->purgingIfDamaged([&] { self->getManifest()->updateLastAccessDate(key); });
     });
   });
   return future;
@@ -645,18 +740,13 @@ void PersistentKeyValueStore::remove(const std::string& key, const std::shared_p
   bool leftToWrite = false;
   const auto removeAll = [&] {
     const std::lock_guard<std::mutex> removal(removalMutex_);
-    std::string filename;
+    std::optional<std::string> filePath;
     {
       const std::lock_guard<std::mutex> lock(mutex_);
       throwIfInvalid();
-      auto item = lookUp(Keys(key));
-      try {
-        if (item != nullptr) getManifest()->removeItem(key);
-      } catch (const ManifestCorruptedException& error) {
-        purge(error);
-        item = nullptr;
-      }
-      if (item != nullptr && !item->hasInlineData) filename = item->filename;
+      const auto item = lookUp(Keys(key));
+      const bool isRemoved = item != nullptr && purgingIfDamaged([&] { getManifest()->removeItem(key); });
+      if (isRemoved) filePath = fileOf(*item);
       // A write that is on its way deletes what it finds; the removal is done when the file queue has got past it.
       if (writesInFlight_->revoke(key)) {
         lastFileWrite_.reset();
@@ -665,7 +755,7 @@ void PersistentKeyValueStore::remove(const std::string& key, const std::shared_p
         return;
       }
     }
-    if (!filename.empty()) fileUtils_->deleteFile(getFilePath(filename));
+    if (filePath) fileUtils_->deleteFile(*filePath);
   };
   try {
     removeAll();
@@ -677,63 +767,73 @@ void PersistentKeyValueStore::remove(const std::string& key, const std::shared_p
 
 void PersistentKeyValueStore::clear(std::function<void()> onSuccess,
                                     std::function<void(const std::exception&)> onError) {
-  const auto storedSince = std::make_shared<KeySet>();
-  const auto takeNextBatch = [weakThis = weak_from_this<PersistentKeyValueStore>(), storedSince,
-                              begun = std::make_shared<bool>(false)]() -> std::vector<DiskCacheItem> {
+  const auto takeNextBatch = [weakThis = weak_from_this<PersistentKeyValueStore>(),
+                              clear = std::make_shared<Clear>()]() -> std::vector<DiskCacheItem> {
     const auto self = weakThis.lock();
     if (self == nullptr) return {};
-    return self->takeBatch([&](DiskCacheManifestInterface&) { return self->takeForClear(storedSince, *begun); });
+    return self->takeBatch([&](DiskCacheManifestInterface&) { return self->takeForClear(clear); });
   };
   deleteFilesInBatches(takeNextBatch, std::move(onSuccess), std::move(onError));
 }
 
-// The next items to go. Pruning to nothing leaves items of no size, and would take what has been stored since the clear
-// began.
-std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shared_ptr<KeySet>& storedSince,
-                                                                 bool& begun) {
-  if (!begun) {
-    const auto hasEnded = [](const std::weak_ptr<KeySet>& keys) { return keys.expired(); };
+// The next items to be deleted. Pruning to nothing leaves items of no size, and would take what has been stored since
+// the clear began.
+std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shared_ptr<Clear>& clear) {
+  if (!clear->hasBegun) {
+    const auto hasEnded = [](const std::weak_ptr<Clear>& other) { return other.expired(); };
     clearsUnderWay_.erase(std::remove_if(clearsUnderWay_.begin(), clearsUnderWay_.end(), hasEnded),
                           clearsUnderWay_.end());
-    clearsUnderWay_.push_back(storedSince);
-    begun = true;
-    callOffWrites();
+    clearsUnderWay_.push_back(clear);
+    clear->hasBegun = true;
+    auto items = cancelWrites();
+    for (DiskCacheItem& item : takeNext(*clear)) items.push_back(std::move(item));
+    return items;
   }
-  if (storedSince->empty()) {
+  return takeNext(*clear);
+}
+
+std::vector<DiskCacheItem> PersistentKeyValueStore::takeNext(Clear& clear) {
+  if (clear.storedSince.empty() && !clear.keysLeft) {
     auto items = getManifest()->pruneToSize(0, batchSize_);
     if (!items.empty() || getManifest()->count() == 0) return items;
   }
-  return takeAllBut(*storedSince);
+  return takeAllBut(clear);
 }
 
-// Not in their turn like other items: a write that is called off must not leave its record to a later batch.
-void PersistentKeyValueStore::callOffWrites() {
-  const auto writes = writesInFlight_->all();
+// Not in their turn like other items: a write that is cancelled must not leave its record to a later batch. Returns
+// items without a file, so that the file queue has passed these writes before the next batch.
+std::vector<DiskCacheItem> PersistentKeyValueStore::cancelWrites() {
+  std::vector<DiskCacheItem> cancelled;
+  const auto keys = writesInFlight_->keys();
   const auto manifest = getManifest();
   try {
     if (!manifest->isLoaded()) manifest->load();
-    for (const auto& write : writes) {
-      manifest->removeItem(write->key);
-      writesInFlight_->revoke(*write);
+    for (const std::string& key : keys) {
+      manifest->removeItem(key);
+      writesInFlight_->revoke(key);
+      cancelled.emplace_back(key, std::string(), 0, false, 0, 0, nullptr);
     }
   } catch (const ManifestCorruptedException&) {
-    for (const auto& write : writes) writesInFlight_->revoke(*write);  // the purge takes their records
+    for (const std::string& key : keys) writesInFlight_->revoke(key);  // the purge takes their records
     throw;
   }
+  return cancelled;
 }
 
-std::vector<DiskCacheItem> PersistentKeyValueStore::takeAllBut(const KeySet& keep) {
+// What is stored from here on is in `storedSince`, so one look at all keys is enough.
+std::vector<DiskCacheItem> PersistentKeyValueStore::takeAllBut(Clear& clear) {
   std::vector<DiskCacheItem> items;
   const auto manifest = getManifest();
-  for (const std::string& key : manifest->getAllKeys()) {
-    if (items.size() == batchSize_) break;
-    const auto item = keep.count(key) > 0 ? nullptr : manifest->getItem(key);
+  if (!clear.keysLeft) clear.keysLeft = manifest->getAllKeys();
+  for (auto& keys = *clear.keysLeft; !keys.empty() && items.size() < batchSize_; keys.pop_back()) {
+    const std::string& key = keys.back();
+    const auto item = clear.storedSince.count(key) > 0 ? nullptr : manifest->getItem(key);
     if (item == nullptr) continue;
     try {
       manifest->removeItem(key);
     } catch (const ManifestPersistenceException&) {
       if (items.empty()) throw;
-      break;  // the files of those that went must go too
+      break;  // the files of those that are removed must be deleted too
     }
     items.push_back(*item);
   }
@@ -746,13 +846,13 @@ void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
   const auto item = manifest->pruneOldestItem();
   if (item == nullptr) return;
   count(evictions_);
-  if (item->hasInlineData) return;
-  if (writesInFlight_->revoke(item->key)) return;
-  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), filename = item->filename] {
+  const auto filePath = fileOf(*item);
+  if (!filePath || writesInFlight_->revoke(item->key)) return;
+  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), path = *filePath] {
     const auto self = weakThis.lock();
     if (self == nullptr) return;
     try {
-      self->fileUtils_->deleteFile(self->getFilePath(filename));
+      self->fileUtils_->deleteFile(path);
     } catch (const LarderException& error) {
       LOG(ERROR) << "Failed to remove the oldest item " << error.what();
     }
@@ -771,12 +871,7 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeBatch(
   const std::lock_guard<std::mutex> lock(mutex_);
   throwIfInvalid();
   std::vector<DiskCacheItem> items;
-  try {
-    items = prune(*getManifest());
-  } catch (const ManifestCorruptedException& error) {
-    purge(error);
-    return {};
-  }
+  if (!purgingIfDamaged([&] { items = prune(*getManifest()); })) return {};
   for (DiskCacheItem& item : items) {
     if (writesInFlight_->revoke(item.key)) item.filename.clear();  // its file is left to that write
   }
@@ -793,9 +888,10 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::evictBatch(
 void PersistentKeyValueStore::deleteFilesInBatches(std::function<const std::vector<DiskCacheItem>()> provider,
                                                    std::function<void()> onSuccess,
                                                    std::function<void(const std::exception&)> onError) {
-  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), provider = std::move(provider),
+  const auto holdingToken = [token = deletionsToken_, provider = std::move(provider)] { return provider(); };
+  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), holdingToken,
                         onSuccess = std::move(onSuccess), onError = std::move(onError)] {
-    if (const auto self = weakThis.lock()) self->deleteNextBatch(provider, onSuccess, onError);
+    if (const auto self = weakThis.lock()) self->deleteNextBatch(holdingToken, onSuccess, onError);
   });
 }
 
@@ -812,7 +908,7 @@ void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<Di
     } else {
       std::vector<std::string> paths;
       for (const DiskCacheItem& item : batch) {
-        if (!item.hasInlineData && !item.filename.empty()) paths.push_back(getFilePath(item.filename));
+        if (auto filePath = fileOf(item)) paths.push_back(std::move(*filePath));
       }
       deleteBatch(paths).then(workQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), provider, onSuccess,
                                            onError](std::future<void>& deleted) {
@@ -840,13 +936,7 @@ Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>
       const auto self = weakThis.lock();
       if (self == nullptr) return;
       self->throwIfClosed();
-      for (const std::string& filePath : paths) {
-        try {
-          self->fileUtils_->deleteFile(filePath);
-        } catch (const LarderException& error) {
-          LOG(ERROR) << "Failed to delete file at \"" << filePath << "\" " << error.what();
-        }
-      }
+      self->deleteFiles(paths);
     });
     const std::lock_guard<std::mutex> lock(mutex_);  // not before: a queue may run the task at once
     lastFileWrite_.reset();
@@ -856,6 +946,23 @@ Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>
     failed.setException(std::current_exception());
     return failed.getFuture();
   }
+}
+
+void PersistentKeyValueStore::deleteFiles(const std::vector<std::string>& paths) {
+  for (const std::string& filePath : paths) {
+    try {
+      fileUtils_->deleteFile(filePath);
+    } catch (const LarderException& error) {
+      LOG(ERROR) << "Failed to delete file at \"" << filePath << "\" " << error.what();
+    }
+  }
+}
+
+// Where the item's value is; empty when it is not in a file of its own. A record may have any name, an inline store
+// takes any key, and what is not a value must not be deleted as one.
+std::optional<std::string> PersistentKeyValueStore::fileOf(const DiskCacheItem& item) {
+  if (item.hasInlineData || item.filename.empty() || isReserved(item.filename)) return std::nullopt;
+  return getFilePath(item.filename);
 }
 
 // --- Expiry ---
@@ -869,11 +976,7 @@ void PersistentKeyValueStore::loadManifest() {
     // Armed whatever happens: a load that fails for a passing reason is tried again then.
     std::exception_ptr failure;
     try {
-      try {
-        self->getManifest()->load();
-      } catch (const ManifestCorruptedException& error) {
-        self->purge(error);
-      }
+      self->purgingIfDamaged([&] { self->getManifest()->load(); });
     } catch (...) {
       failure = std::current_exception();
     }
@@ -909,11 +1012,9 @@ void PersistentKeyValueStore::startStaleItemRemoval() {
   try {
     const std::lock_guard<std::mutex> lock(mutex_);
     if (invalidated_) return;
-    try {
+    purgingIfDamaged([&] {
       if (!getManifest()->isLoaded()) getManifest()->load();
-    } catch (const ManifestCorruptedException& error) {
-      purge(error);
-    }
+    });
     reportSize();
     const std::int64_t now = currentTime();
     cutoff = staleAge_ > now
@@ -960,7 +1061,7 @@ void PersistentKeyValueStore::invalidate() {
     // The file queue is shut down, so nothing is being written either.
   }
   { const std::lock_guard<std::mutex> removal(removalMutex_); }
-  silenceManifest();
+  closeManifest();
 }
 
 Future<void> PersistentKeyValueStore::invalidateWithFuture() {
@@ -975,8 +1076,24 @@ void PersistentKeyValueStore::invalidateSoon() {
   Future<void> barrier;
   if (!markInvalid(barrier)) return;
   barrier.then(nullptr, [weakThis = weak_from_this<PersistentKeyValueStore>()](std::future<void>&) {
-    if (const auto self = weakThis.lock()) self->silenceManifest();
+    if (const auto self = weakThis.lock()) self->closeManifest();
   });
+}
+
+void PersistentKeyValueStore::keepUntilIdle() { passQueues(weak_from_this<PersistentKeyValueStore>().lock()); }
+
+// What the work queue has taken so far has put its tasks on the file queue when the first of these runs.
+void PersistentKeyValueStore::passQueues(const std::shared_ptr<PersistentKeyValueStore>& self) {
+  const auto passFileQueue = [self] {
+    self->fileQueue_->dispatch([self] {
+      if (self->deletionsToken_.use_count() > 1) passQueues(self);
+    });
+  };
+  try {
+    self->workQueue_->dispatch(passFileQueue);
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Store \"" << self->name_ << "\" cannot finish what it has accepted: " << error.what();
+  }
 }
 
 // False when the store is invalid already.
@@ -999,25 +1116,15 @@ bool PersistentKeyValueStore::markInvalid(Future<void>& barrier) {
   return true;
 }
 
-void PersistentKeyValueStore::silenceManifest() {
-  takeBackLateWrites();
+void PersistentKeyValueStore::closeManifest() {
+  {
+    // Writes whose task has come to the file queue behind the barrier will not start any more.
+    const std::lock_guard<std::mutex> lock(mutex_);
+    isClosed_ = true;
+    restoreRecords();
+  }
   const std::lock_guard<std::mutex> lock(manifestMutex_);
   if (manifest_ != nullptr) manifest_->invalidate();
-}
-
-// Those whose task has come to the file queue behind the barrier, and will not write any more. Where an older value has
-// a file, its record stays with it, as after a kill.
-void PersistentKeyValueStore::takeBackLateWrites() {
-  try {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    for (const auto& write : writesInFlight_->all()) {
-      const std::string filePath = getFilePath(write->key);
-      const bool hasFile = fileUtils_->pathExists(filePath) && !fileUtils_->isDirectory(filePath);
-      if (!hasFile && !write->isRevoked) getManifest()->removeItem(write->key);
-    }
-  } catch (const std::exception& error) {
-    LOG(ERROR) << "Could not remove the record of an unfinished write: " << error.what();
-  }
 }
 
 void PersistentKeyValueStore::throwIfInvalid() {
@@ -1030,16 +1137,50 @@ void PersistentKeyValueStore::throwIfClosed() {
 
 void PersistentKeyValueStore::handleCorruptedManifest(const LarderException& error) {
   const std::lock_guard<std::mutex> lock(mutex_);
-  purge(error);
+  throwIfInvalid();
+  if (!purge(error)) throw LarderException(error.description(), error.domain(), error.code());
 }
 
-void PersistentKeyValueStore::purge(const LarderException& error) {
+// Runs what uses the manifest. A damaged one purges the store: false then. Throws what else goes wrong, and the damage
+// itself when the store cannot be purged.
+template <class Operation> bool PersistentKeyValueStore::purgingIfDamaged(Operation operation) {
+  try {
+    operation();
+    return true;
+  } catch (const ManifestCorruptedException& error) {
+    if (!purge(error)) throw;
+    return false;
+  }
+}
+
+// The same for what writes a value's record: a manifest that cannot be written purges too, unless it is only that it
+// could not be opened for writing, which is true for the moment.
+template <class Operation> bool PersistentKeyValueStore::purgingIfUnwritable(Operation operation) {
+  try {
+    operation();
+    return true;
+  } catch (const ManifestPersistenceException& error) {
+    if (error.code() == kReadOnlyManifest || !purge(error)) throw;
+    return false;
+  }
+}
+
+// False, and nothing has changed, when the directory cannot be collected: what the old manifest says would be back at
+// the next start.
+bool PersistentKeyValueStore::purge(const LarderException& error) {
+  throwIfClosed();
   {
-    const auto noWriteStarts = writesInFlight_->loseRecords();
-    trashCollector_->collectPath(path);
+    const auto startsAreHeld = writesInFlight_->holdStarts();
+    if (!trashCollector_->collectPath(path) && fileUtils_->pathExists(manifestPath_)) return false;
+    writesInFlight_->loseRecords(startsAreHeld);
     isHalfPurged_ = true;
     beginAnew();
   }
+  logPurge(error);
+  return true;
+}
+
+void PersistentKeyValueStore::logPurge(const LarderException& error) const {
   LOG(ERROR) << "Store \"" << name_ << "\" purged due to corrupted manifest. " << error.what();
 }
 
@@ -1081,10 +1222,12 @@ std::shared_ptr<DiskCacheManifestInterface> PersistentKeyValueStore::getManifest
     };
     try {
       manifest_ = create();
-    } catch (const ManifestCorruptedException&) {
+    } catch (const ManifestPersistenceException& error) {
+      if (!isNotAManifest(error)) throw;
       trashCollector_->collectPath(path);
       fileUtils_->createDirectory(path, true);
       manifest_ = create();
+      logPurge(error);
     }
   }
   manifestCreated_ = true;
@@ -1112,11 +1255,7 @@ void PersistentKeyValueStore::dispatchWork(Keys keys, Promise<T>& promise, std::
 void PersistentKeyValueStore::throwIfReserved(const std::string& key) const {
   if (inlineData_) return;
   if (key.find('\0') != std::string::npos) throw std::invalid_argument("Key '" + key + "' holds a zero byte.");
-  const std::string_view name = std::string_view(key).substr(key.rfind('/') + 1);  // whatever way leads there
-  const auto& reserved = reservedNames();
-  if (std::find(reserved.begin(), reserved.end(), name) != reserved.end()) {
-    throw std::invalid_argument("Key '" + key + "' is reserved.");
-  }
+  if (isReserved(key)) throw std::invalid_argument("Key '" + key + "' is reserved.");
 }
 
 std::shared_ptr<Store> PKVSDefinition::createStore(

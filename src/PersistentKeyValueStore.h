@@ -27,6 +27,7 @@ class LarderException;
 class PruneStrategyBase;
 class TrashCollector;
 class WritesInFlight;
+struct SettledValue;
 
 // Values by key, in a directory of their own: one file for each, or inside the manifest ("inline", for small ones).
 // Found again after a restart, expired when they have not been used for long, limited in number if configured.
@@ -39,7 +40,8 @@ class WritesInFlight;
 // work queue and files on the file queue, both the host's and serial. `getAllKeys`, `fetchModificationDate`,
 // `getManifest` and `invalidate` work on the caller's thread. Operations on one key take effect in the order in which
 // they were called, but an inline value that is replaced while a fetch waits is delivered in its new form. A store that
-// has gone leaves what it had not begun undone; an overwrite whose file had not been begun takes the older value along.
+// is destroyed leaves undone what it has not started: the key keeps what it had. (A manager that is released lets its
+// stores finish first.)
 //
 // Errors travel in the futures: `InvalidatedException` after invalidation, `FileUtilsIoException` for files, what a
 // writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (one that ends in
@@ -166,7 +168,11 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   Future<void> invalidateWithFuture();
 
   // Invalidates without waiting, on any thread; the manifest is closed when the file queue has got so far.
-  void invalidateSoon();
+  void invalidateSoon() override;
+
+  // Passes both queues until no deletion in batches is under way either. The store is then released by the last of
+  // these tasks, or when a queue drops it. Nothing is kept when the work queue takes no tasks.
+  void keepUntilIdle() override;
 
   // Throws `InvalidatedException` "Store has been invalidated." once that is so.
   void throwIfInvalid();
@@ -233,23 +239,30 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
 
  private:
   using Fetched = std::unique_ptr<FetchResult>;
-  using KeySet = std::unordered_set<std::string>;
   class Keys;
   struct FileWrite;
+  struct Clear;
   struct Fetch;
 
   // These are called with the mutex held.
   std::shared_ptr<FileWrite> beginFileWrite(const std::shared_ptr<FileWrite>& write);
   void recordWritten(FileWrite& write);
   void reportTotal(FileWrite& write);
-  void writeInline(const std::string& key, const std::vector<unsigned char>& data,
-                   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
-  void prepareWrite(const std::string& key);
+  std::optional<std::string> writeInline(const std::string& key, const std::vector<unsigned char>& data,
+                                         std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
+  bool noteStored(const std::string& key);
+  bool prepareWrite();
+  void restoreRecord(const std::string& key, const SettledValue& settled);
+  void restoreRecords();
+  void discardRecord(const std::string& key, bool othersAreInFlight);
   std::unique_ptr<DiskCacheItem> lookUp(Keys keys);
-  std::vector<DiskCacheItem> takeForClear(const std::shared_ptr<KeySet>& storedSince, bool& begun);
-  void callOffWrites();
-  std::vector<DiskCacheItem> takeAllBut(const KeySet& keep);
-  void purge(const LarderException& error);
+  std::vector<DiskCacheItem> takeForClear(const std::shared_ptr<Clear>& clear);
+  std::vector<DiskCacheItem> takeNext(Clear& clear);
+  std::vector<DiskCacheItem> cancelWrites();
+  std::vector<DiskCacheItem> takeAllBut(Clear& clear);
+  template <class Operation> bool purgingIfDamaged(Operation operation);
+  template <class Operation> bool purgingIfUnwritable(Operation operation);
+  bool purge(const LarderException& error);
   void beginAnew();
   void armStaleRemoval(long delaySeconds);
 
@@ -257,16 +270,21 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void finishFileWrites(const std::shared_ptr<FileWrite>& first);
   void writeFile(FileWrite& write);
   unsigned int runWriter(const FileWrite& write);
-  bool takeBack(const FileWrite& write);
+  void rollBack(const FileWrite& write);
   void load(Fetch& fetch);
   bool hasLostItem(const DiskCacheItem& item);
   void deleteLeftoverFile(const std::string& key);
 
   // These run on the work queue.
+  void storeInline(const std::string& key, const std::vector<unsigned char>& data,
+                   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
+                   const std::shared_ptr<Promise<void>>& promise);
+  void deleteReplacedFile(const std::string& filePath, const std::shared_ptr<Promise<void>>& promise);
   void remove(const std::string& key, const std::shared_ptr<Promise<void>>& promise);
   void find(const std::shared_ptr<Fetch>& fetch);
   void reportAccess(const DiskCacheItem* item, const std::string& key);
 
+  static void passQueues(const std::shared_ptr<PersistentKeyValueStore>& self);
   Future<void> storeFile(const std::shared_ptr<FileWrite>& write);
   Future<Fetched> fetchFirstOf(std::vector<std::string> keys, Loader loader);
   template <class T> void dispatchWork(Keys keys, Promise<T>& promise, std::function<void()> task);
@@ -275,8 +293,12 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   std::optional<std::uint32_t> totalToReport();
   void dispatchReport(std::uint32_t total);
   bool markInvalid(Future<void>& barrier);
-  void silenceManifest();
-  void takeBackLateWrites();
+  void closeManifest();
+  bool hasFile(const std::string& key);
+  void deleteFiles(const std::vector<std::string>& paths);
+  std::optional<std::string> fileOf(const DiskCacheItem& item);
+  void logPurge(const LarderException& error) const;
+  void logLostRecord(const std::string& key, const std::exception& error) const;
 
   const std::string name_;
   const std::optional<std::uint64_t> capacity_;
@@ -297,9 +319,9 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   long staleAge_;
   std::unique_ptr<AsyncTimer> staleRemovalTimer_;
   const std::unique_ptr<WritesInFlight> writesInFlight_;
-  std::weak_ptr<FileWrite> lastFileWrite_;             // null once another task of the store stands behind it
-  std::vector<std::weak_ptr<KeySet>> clearsUnderWay_;  // for each, the keys stored since it began
-  bool isHalfPurged_ = false;                          // its directory has gone to the trash, and no new one is there
+  std::weak_ptr<FileWrite> lastFileWrite_;  // null once another task of the store stands behind it
+  std::vector<std::weak_ptr<Clear>> clearsUnderWay_;
+  bool isHalfPurged_ = false;  // its directory has gone to the trash, and no new one is there
 
   std::atomic<bool> invalidated_{false};  // set under the mutex
   // Set by the barrier of an invalidation, on the file queue: from then on the paths may be those of another store.
@@ -307,6 +329,9 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
 
   std::mutex
       removalMutex_;  // taken before mutex_; held until a removal has deleted its file: invalidation waits for it
+
+  const std::shared_ptr<const char> deletionsToken_ =
+      std::make_shared<const char>();  // each deletion in batches holds it
 
   std::mutex manifestMutex_;  // taken after mutex_; guards the creation of the manifest
   std::atomic<bool> manifestCreated_{false};

@@ -16,6 +16,10 @@ void Store::pruneBackToNormal(std::function<void()> /*onSuccess*/,
   throw std::logic_error("pruneBackToNormal not implemented or invalid call");
 }
 
+void Store::invalidateSoon() { invalidate(); }
+
+void Store::keepUntilIdle() {}
+
 UnmanagedStore::UnmanagedStore(const std::string& path_, std::shared_ptr<const StoreDefinition> definition_)
     : Store(path_), definition(std::move(definition_)) {}
 

@@ -32,6 +32,13 @@ class CELLAR_EXPORT Store : public std::enable_shared_from_this<Store> {
   virtual void pruneBackToNormal(std::function<void()> onSuccess, std::function<void(const std::exception&)> onError,
                                  bool survivalMode);
 
+  // Invalidates without waiting for what is under way. By default the same as `invalidate`.
+  virtual void invalidateSoon();
+
+  // Keeps the store alive until the operations that it has accepted so far are finished on its queues. Does not wait.
+  // By default does nothing.
+  virtual void keepUntilIdle();
+
   // A weak pointer to this store as a T; empty when it is not owned by a shared pointer, or no T.
   template <class T> std::weak_ptr<T> weak_from_this() { return std::dynamic_pointer_cast<T>(weak_from_this().lock()); }
   using std::enable_shared_from_this<Store>::weak_from_this;

@@ -218,18 +218,6 @@ TEST_F(AGoneStore, LeavesNoProvisionalRecordOfAWriteThatHasNotBegun) {
   EXPECT_FALSE(called);
 }
 
-TEST_F(AGoneStore, LeavesNeitherRecordNorFileOfAnOverwriteThatHasNotBegun) {
-  open();
-  put("key", "old");
-  const Written written = watch(store->store("key", bytesOf("new")));
-  ASSERT_TRUE(work().runNext());
-  store.reset();
-  settle();
-  EXPECT_EQ(told(written), "<done>");
-  EXPECT_THAT(rowsOnDisk(), IsEmpty());
-  EXPECT_THAT(valueFiles(), IsEmpty());
-}
-
 TEST_F(AGoneStore, AnswersAFetchThatWaitsForItsFileWithNothing) {
   open();
   put("key", "value");

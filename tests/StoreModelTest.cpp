@@ -233,6 +233,9 @@ class CorruptibleManifest final : public DiskCacheManifestInterface {
   std::uint32_t size() override { return real()->size(); }
   std::uint32_t count() override { return real()->count(); }
   bool isLoaded() override { return real()->isLoaded(); }
+  std::optional<ReplacedItem> replaceItem(const DiskCacheItem& item, bool withInlineData) override {
+    return checked().replaceItem(item, withInlineData);
+  }
 
  private:
   const std::shared_ptr<DiskCacheManifest>& real() {

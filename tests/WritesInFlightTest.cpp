@@ -51,7 +51,7 @@ using Contents = std::map<std::string, std::string>;
 TEST(WritesInFlight, KnowsAWriteFromItsBeginningToItsEnd) {
   WritesInFlight writes;
   EXPECT_FALSE(writes.contains("key"));
-  const auto write = writes.begin("key");
+  const auto write = writes.begin("key", {});
   EXPECT_EQ(write->key, "key");
   EXPECT_FALSE(write->isRunning);
   EXPECT_FALSE(write->isRevoked);
@@ -59,26 +59,27 @@ TEST(WritesInFlight, KnowsAWriteFromItsBeginningToItsEnd) {
   EXPECT_FALSE(writes.contains("other"));
   writes.end(write);
   EXPECT_FALSE(writes.contains("key"));
-  EXPECT_THAT(writes.all(), IsEmpty());
+  EXPECT_THAT(writes.keys(), IsEmpty());
 }
 
 TEST(WritesInFlight, EndsOneOfSeveralOfAKeyAndNoneTwice) {
   WritesInFlight writes;
-  const auto first = writes.begin("key");
-  const auto second = writes.begin("key");
+  const auto first = writes.begin("key", {});
+  const auto second = writes.begin("key", {});
   EXPECT_FALSE(first->isOver);
-  writes.end(first);
-  writes.end(first);
+  EXPECT_TRUE(writes.end(first));
+  EXPECT_FALSE(writes.end(first));
   EXPECT_TRUE(first->isOver);
-  EXPECT_THAT(writes.all(), ElementsAre(second));
+  EXPECT_THAT(writes.keys(), ElementsAre("key"));
+  EXPECT_FALSE(second->isOver);
   EXPECT_TRUE(writes.contains("key"));
 }
 
 TEST(WritesInFlight, RevokesAllOfAKeyAndNoOther) {
   WritesInFlight writes;
-  const auto first = writes.begin("key");
-  const auto second = writes.begin("key");
-  const auto other = writes.begin("other");
+  const auto first = writes.begin("key", {});
+  const auto second = writes.begin("key", {});
+  const auto other = writes.begin("other", {});
   EXPECT_TRUE(writes.revoke("key"));
   EXPECT_TRUE(first->isRevoked);
   EXPECT_TRUE(second->isRevoked);
@@ -88,9 +89,9 @@ TEST(WritesInFlight, RevokesAllOfAKeyAndNoOther) {
 
 TEST(WritesInFlight, StartUnlessTheyAreRevoked) {
   WritesInFlight writes;
-  const auto write = writes.begin("key");
-  const auto revoked = writes.begin("revoked");
-  writes.revoke(*revoked);
+  const auto write = writes.begin("key", {});
+  const auto revoked = writes.begin("revoked", {});
+  writes.revoke("revoked");
   EXPECT_TRUE(writes.start(*write));
   EXPECT_TRUE(write->isRunning);
   EXPECT_FALSE(writes.start(*revoked));
@@ -99,11 +100,11 @@ TEST(WritesInFlight, StartUnlessTheyAreRevoked) {
 
 TEST(WritesInFlight, ThatLoseTheirRecordsAreRevokedIfTheyRunAndGoOnWithoutOtherwise) {
   WritesInFlight writes;
-  const auto running = writes.begin("running");
+  const auto running = writes.begin("running", {});
   EXPECT_TRUE(writes.start(*running));
-  const auto waiting = writes.begin("waiting");
+  const auto waiting = writes.begin("waiting", {});
   EXPECT_TRUE(waiting->hasRecord);
-  EXPECT_TRUE(writes.loseRecords().owns_lock());  // so that no other starts meanwhile
+  writes.loseRecords(writes.holdStarts());
   EXPECT_TRUE(running->isRevoked);
   EXPECT_FALSE(waiting->isRevoked);
   EXPECT_FALSE(waiting->hasRecord);

@@ -218,6 +218,10 @@ class FaultyManifest final : public DiskCacheManifestInterface {
   std::uint32_t size() override { return real_->size(); }
   std::uint32_t count() override { return real_->count(); }
   bool isLoaded() override { return real_->isLoaded(); }
+  std::optional<ReplacedItem> replaceItem(const DiskCacheItem& item, bool withInlineData) override {
+    enter(ManifestCall::SetItem, "setItem " + item.key + " " + std::to_string(item.size));
+    return real_->replaceItem(item, withInlineData);
+  }
 
  private:
   void enter(ManifestCall call, const std::string& text) {
