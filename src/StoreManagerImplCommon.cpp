@@ -11,25 +11,11 @@
 #include "FileUtils.h"
 #include "JsonValue.h"
 #include "LarderException.h"
-#include "PersistentKeyValueStore.h"
 #include "Store.h"
 #include "StoreDirectoryNameBuilder.h"
 #include "TrashCollector.h"
 
 namespace velmora::mobile::xplat::cellar {
-
-namespace {
-
-// Without waiting: this thread may be the one that the store's queues run on, and there is nothing yet to wait for.
-void invalidateNewStore(Store& store) {
-  if (auto* keyValueStore = dynamic_cast<PersistentKeyValueStore*>(&store)) {
-    keyValueStore->invalidateSoon();
-  } else {
-    store.invalidate();
-  }
-}
-
-}  // namespace
 
 const std::string StoreManagerImplCommon::TemporaryDirectoryName = "tmp";
 const std::string StoreManagerImplCommon::TrashOnStartupKey = "trash_on_start_up";
@@ -126,8 +112,9 @@ std::shared_ptr<Store> StoreManagerImplCommon::createStore(const std::string& id
   }
   item->condition.notify_all();
 
-  // Whoever invalidated or closed the manager meanwhile could not see this store.
-  if (!isValid()) invalidateNewStore(*store);
+  // Whoever invalidated or closed the manager meanwhile could not see this store. Without waiting: this thread may be
+  // the one that the store's queues run on, and there is nothing yet to wait for.
+  if (!isValid()) store->invalidateSoon();
   if (isClosed()) leaveToOthers(*item);
   return store;
 }
@@ -218,7 +205,9 @@ void StoreManagerImplCommon::close() {
     closed_ = true;
     slots = stores_;
   }
-  for (const auto& [identifier, item] : slots) leaveToOthers(*item);
+  for (const auto& [identifier, item] : slots) {
+    if (const auto store = leaveToOthers(*item)) store->keepUntilIdle();
+  }
 }
 
 // Answers the store, whose last owner may be here, to be let go of without the lock.

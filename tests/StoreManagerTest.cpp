@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <future>
 #include <memory>
 #include <optional>
 #include <stdexcept>
@@ -262,6 +263,101 @@ TEST_F(StoreManagerTest, StoresThatKeepValuesAreFreedWithTheManager) {
   invalidate();
   EXPECT_TRUE(kept.expired());
   EXPECT_FALSE(directory.exists("area/_store_1"));
+}
+
+class StoreManagerRelease : public StoreManagerTest {
+ protected:
+  using Value = std::vector<unsigned char>;
+
+  std::shared_ptr<PersistentKeyValueStore> openStore() {
+    build({{"kv", std::make_shared<PKVSDefinition>("kv", "media", false, false, 1U, std::nullopt, false, 1000U)}});
+    auto store = manager_->getStore<PersistentKeyValueStore>("kv");
+    queues->runAll();
+    return store;
+  }
+
+  // What a fresh manager finds.
+  std::string storedAfterRestart(const std::string& key) {
+    const auto store = openStore();
+    std::string found = "<pending>";
+    store->fetch(key).then(nullptr, [&](std::future<std::unique_ptr<PersistentKeyValueStore::FetchResult>>& result) {
+      const auto value = result.get();
+      found = value == nullptr ? "<miss>" : std::string(value->value.begin(), value->value.end());
+    });
+    queues->runAll();
+    return found;
+  }
+
+  bool hasFile(const std::string& key) const { return directory.exists("area/_store_1/kv_250_v1/" + key); }
+};
+
+TEST_F(StoreManagerRelease, FinishesWhatItsStoresHaveAcceptedBeforeTheyAreDestroyed) {
+  auto store = openStore();
+  const std::weak_ptr<Store> released = store;
+  int written = 0;
+  for (int i = 0; i < 100; ++i) {
+    store->store("key" + std::to_string(i), Value{'v'}).then(nullptr, [&](std::future<void>& result) {
+      result.get();
+      ++written;
+    });
+  }
+  store.reset();
+  manager_.reset();
+  EXPECT_FALSE(released.expired());
+  queues->runAll();
+  EXPECT_TRUE(released.expired());
+  EXPECT_EQ(written, 100);
+  for (int i = 0; i < 100; ++i) EXPECT_TRUE(hasFile("key" + std::to_string(i))) << i;
+  EXPECT_EQ(storedAfterRestart("key99"), "v");
+}
+
+TEST_F(StoreManagerRelease, FinishesAClearOfManyBatches) {
+  auto store = openStore();
+  for (int i = 0; i < 120; ++i) store->store("key" + std::to_string(i), Value{'v'});
+  queues->runAll();
+  bool isCleared = false;
+  store->clear([&] { isCleared = true; }, nullptr);
+  const std::weak_ptr<Store> released = store;
+  store.reset();
+  manager_.reset();
+  queues->runAll();
+  EXPECT_TRUE(isCleared);
+  EXPECT_TRUE(released.expired());
+  EXPECT_FALSE(hasFile("key0"));
+  EXPECT_FALSE(hasFile("key119"));
+}
+
+TEST_F(StoreManagerRelease, DeletesNothingWhenTheQueuesNeverRunAgain) {
+  auto store = openStore();
+  store->store("key", Value{'o', 'l', 'd'});
+  queues->runAll();
+  store->store("key", Value{'n', 'e', 'w'});
+  queues->workQueue(queues->workQueueCount() - 1)->runNext();
+  store.reset();
+  manager_.reset();
+  for (const auto& queue : queues->all()) queue->dropAll();
+  EXPECT_EQ(storedAfterRestart("key"), "old");
+}
+
+TEST_F(StoreManagerRelease, LeavesAStoreToWhoHoldsItAndFinishesToo) {
+  const auto store = openStore();
+  store->store("key", Value{'v'});
+  manager_.reset();
+  queues->runAll();
+  EXPECT_EQ(store->getAllKeys(), Texts{"key"});
+  EXPECT_EQ(store.use_count(), 1);
+}
+
+TEST_F(StoreManagerRelease, OfAQueueThatTakesNoTasksReleasesTheStoreAndSaysSo) {
+  auto store = openStore();
+  const std::weak_ptr<Store> released = store;
+  store.reset();
+  for (const auto& queue : queues->all()) queue->throwOnDispatch(true);
+  manager_.reset();
+  EXPECT_TRUE(released.expired());
+  EXPECT_NE(log_.lines().size(), 0U);
+  EXPECT_EQ(log_.lines().back().message, "Store \"kv\" cannot finish what it has accepted: The queue takes no tasks.");
+  for (const auto& queue : queues->all()) queue->throwOnDispatch(false);
 }
 
 // Typed access
