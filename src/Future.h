@@ -8,6 +8,7 @@
 #include <mutex>
 #include <optional>
 #include <stdexcept>
+#include <thread>
 #include <type_traits>
 #include <utility>
 
@@ -39,18 +40,20 @@ namespace detail {
 
 // What a promise and the copies of its future share. Lives as long as any of them, or a delivery that is still queued.
 template <class T> struct SharedFutureState {
-  std::mutex mutex;  // guards all but `taken`; held while an inline callback runs
+  std::mutex mutex;  // guards all but the atomics; held while an inline callback runs
   std::future<T> future;
   std::function<void(std::future<T>&)> callback;
   std::shared_ptr<AsyncExecutor> executor;
   bool fulfilled = false;
 
-  // Whether the value has left `future`. A callback on an executor takes it without the mutex, so nobody else may ask
-  // `future` itself.
+  // Whether the value has left `future`. A callback on an executor takes it without the mutex, so only the thread that
+  // runs the callback may ask `future` itself meanwhile; other threads hear of it when the callback returns.
   std::atomic<bool> taken{false};
+  std::atomic<std::thread::id> taker{};
 
   void throwIfTaken() const {
-    if (taken) throw FutureError(FutureError::Code::ValueAlreadyFetched);
+    const bool isTaker = taker.load() == std::this_thread::get_id();
+    if (isTaker ? !future.valid() : taken.load()) throw FutureError(FutureError::Code::ValueAlreadyFetched);
   }
 
   // Called with the mutex held, once: when the value and the callback are both there.
@@ -60,15 +63,24 @@ template <class T> struct SharedFutureState {
     executor.dispatch([owned = std::move(state)] { owned->invokeCallback(); });
   }
 
-  // Takes down, whichever way the value was asked for, whether it has left.
-  struct Note {
-    SharedFutureState& state;
-    ~Note() { state.taken = !state.future.valid(); }
+  // Held while this thread may take the value; records afterwards, however that ended, whether it did.
+  class Taking {
+   public:
+    explicit Taking(SharedFutureState& state) : state_(state) { state_.taker = std::this_thread::get_id(); }
+    ~Taking() {
+      state_.taken = !state_.future.valid();
+      state_.taker = std::thread::id();
+    }
+    Taking(const Taking&) = delete;
+    Taking& operator=(const Taking&) = delete;
+
+   private:
+    SharedFutureState& state_;
   };
 
  private:
   void invokeCallback() {
-    const Note note{*this};
+    const Taking taking(*this);
     callback(future);
   }
 };
@@ -82,7 +94,8 @@ template <class T> class Future {
   Future() = default;
   explicit Future(std::shared_ptr<detail::SharedFutureState<T>> state) : state_(std::move(state)) {}
 
-  // Throws when the future is empty or its value has been taken.
+  // Throws when the future is empty or its value has been taken. A callback that has taken the value finds so at once,
+  // with this and the other operations; other threads do when that callback has returned.
   void throwIfInvalid() const {
     if (state_ == nullptr) throw FutureError(FutureError::Code::InvalidSharedState);
     state_->throwIfTaken();
@@ -96,14 +109,14 @@ template <class T> class Future {
     const std::lock_guard<std::mutex> lock(state->mutex);
     state->throwIfTaken();
     if (state->callback) throw FutureError(FutureError::Code::FetchWithCallback);
-    const typename detail::SharedFutureState<T>::Note note{*state};
+    const typename detail::SharedFutureState<T>::Taking taking(*state);
     state->future.get();
   }
 
   // Calls `callback` once, with the standard future that holds the value or exception: on `executor`, or with a null
   // executor inline, on the thread that fulfils the promise or on this one when that has happened already. An inline
-  // callback runs under the future's lock: it must not use this future or a copy. What it throws reaches whoever ran
-  // it.
+  // callback runs under the future's lock: it must not call `get` or `then` of this future or a copy. What it throws
+  // reaches whoever ran it.
   void then(std::shared_ptr<AsyncExecutor> executor, std::function<void(std::future<T>&)>&& callback) {
     throwIfInvalid();
     const auto state = state_;  // the callback may destroy this future

@@ -8,11 +8,13 @@
 #include <stdexcept>
 #include <string>
 #include <thread>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -26,14 +28,16 @@ constexpr int kRaces = 300;
 
 std::exception_ptr failure(const string& text) { return std::make_exception_ptr(std::runtime_error(text)); }
 
-// The code and text that a misuse is answered with.
+const std::pair<Code, string> kNone{static_cast<Code>(0), "no FutureError"};
+
+// The code and text that a misuse is answered with; `kNone` for an operation that is none.
 template <class Operation> std::pair<Code, string> misuse(Operation operation) {
   try {
     operation();
   } catch (const FutureError& error) {
     return {error.code(), error.what()};
   }
-  return {static_cast<Code>(0), "no FutureError"};
+  return kNone;
 }
 
 const std::pair<Code, string> kInvalid{Code::InvalidSharedState, "Shared state is invalid"};
@@ -389,6 +393,90 @@ TEST_F(FutureTest, ACallbackOnAnExecutorRunsWithoutTheLock) {
   promise.setValue();
   queue_->runAll();
   EXPECT_EQ(answers, (std::vector<std::pair<Code, string>>{kFetchWithCallback, kCallbackAlreadySet}));
+}
+
+// What each operation of `copy` is answered with, `throwIfInvalid` first.
+template <class T> std::vector<std::pair<Code, string>> misusesOf(Future<T>& copy) {
+  std::vector<std::pair<Code, string>> answers;
+  answers.push_back(misuse([&] { copy.throwIfInvalid(); }));
+  answers.push_back(misuse([&] { copy.then(nullptr, [](auto&) { FAIL(); }); }));
+  if constexpr (std::is_void_v<T>) answers.push_back(misuse([&] { copy.get(); }));
+  return answers;
+}
+
+const std::vector<std::pair<Code, string>> kThreeTimesAlreadyFetched(3, kAlreadyFetched);
+
+TEST_F(FutureTest, InACallbackOnAnExecutorEveryOperationOfACopySaysThatTheValueIsGoneOnceItIsTaken) {
+  Promise<void> promise;
+  Future<void> future = promise.getFuture();
+  Future<void> copy = future;
+  std::vector<std::pair<Code, string>> before;
+  std::vector<std::pair<Code, string>> after;
+  future.then(queue_, [&](std::future<void>& value) {
+    before = misusesOf(copy);
+    value.get();
+    after = misusesOf(copy);
+  });
+  promise.setValue();
+  queue_->runAll();
+  EXPECT_EQ(before, (std::vector<std::pair<Code, string>>{kNone, kCallbackAlreadySet, kFetchWithCallback}));
+  EXPECT_EQ(after, kThreeTimesAlreadyFetched);
+  EXPECT_EQ(misusesOf(copy), kThreeTimesAlreadyFetched);
+}
+
+TEST_F(FutureTest, AStoredExceptionThatIsRethrownInACallbackOnAnExecutorIsGoneAtOnceToo) {
+  Promise<void> promise;
+  Future<void> future = promise.getFuture();
+  Future<void> copy = future;
+  std::vector<std::pair<Code, string>> answers;
+  future.then(queue_, [&](std::future<void>& value) {
+    EXPECT_THROW(value.get(), std::runtime_error);
+    answers = misusesOf(copy);
+  });
+  promise.setException(failure("no luck"));
+  queue_->runAll();
+  EXPECT_EQ(answers, kThreeTimesAlreadyFetched);
+}
+
+TEST_F(FutureTest, AValueThatIsMovedOutOfACallbackOnAnExecutorIsGoneAtOnceToo) {
+  Promise<Value> promise;
+  Future<Value> future = promise.getFuture();
+  Future<Value> copy = future;
+  std::future<Value> moved;
+  std::vector<std::pair<Code, string>> answers;
+  future.then(queue_, [&](std::future<Value>& value) {
+    moved = std::move(value);
+    answers = misusesOf(copy);
+  });
+  promise.setValue(std::make_unique<int>(8));
+  queue_->runAll();
+  EXPECT_EQ(answers, (std::vector<std::pair<Code, string>>(2, kAlreadyFetched)));
+  EXPECT_EQ(*moved.get(), 8);
+}
+
+TEST_F(FutureTest, InAnInlineCallbackTheValueIsGoneOnceItIsTaken) {
+  const test::Watchdog watchdog(60);  // the callback runs under the lock that `get` and `then` take
+  Promise<void> promise;
+  Future<void> future = promise.getFuture();
+  Future<void> copy = future;
+  std::vector<std::pair<Code, string>> answers;
+  future.then(nullptr, [&](std::future<void>& value) {
+    EXPECT_NO_THROW(copy.throwIfInvalid());
+    value.get();
+    answers = misusesOf(copy);
+  });
+  promise.setValue();
+  EXPECT_EQ(answers, kThreeTimesAlreadyFetched);
+}
+
+TEST_F(FutureTest, InACallbackThatLeavesTheValueTheFutureIsValidBeforeAndAfterTheCallback) {
+  Promise<Value> promise;
+  Future<Value> future = promise.getFuture();
+  future.then(queue_, [&](std::future<Value>&) { EXPECT_NO_THROW(future.throwIfInvalid()); });
+  promise.setValue(std::make_unique<int>(1));
+  std::thread([&] { queue_->runAll(); }).join();
+  EXPECT_NO_THROW(future.throwIfInvalid());
+  std::thread([&] { EXPECT_EQ(misuse([&] { future.then(nullptr, [](auto&) {}); }), kCallbackAlreadySet); }).join();
 }
 
 TEST_F(FutureTest, AnInlineCallbackMayUseOtherFutures) {
@@ -793,15 +881,19 @@ TEST_F(FutureTest, AFutureMayBeUsedWhileItsCallbackTakesTheValueOnAnotherThread)
   for (int i = 0; i < kRaces; ++i) {
     Promise<Value> promise;
     Future<Value> future = promise.getFuture();
-    future.then(queue_, [](std::future<Value>& value) { EXPECT_EQ(*value.get(), 3); });
+    future.then(queue_, [&](std::future<Value>& value) {
+      EXPECT_EQ(*value.get(), 3);
+      EXPECT_EQ(misusesOf(future), (std::vector<std::pair<Code, string>>(2, kAlreadyFetched)));
+    });
     promise.setValue(std::make_unique<int>(3));
     test::runOnThreads(2, [&](std::size_t thread) {
       if (thread == 0) {
         queue_->runAll();
         return;
       }
-      const auto answer = misuse([&] { future.then(nullptr, [](auto&) { FAIL(); }); });
-      EXPECT_TRUE(answer == kCallbackAlreadySet || answer == kAlreadyFetched) << answer.second;
+      const auto answers = misusesOf(future);
+      EXPECT_TRUE(answers[0] == kNone || answers[0] == kAlreadyFetched) << answers[0].second;
+      EXPECT_TRUE(answers[1] == kCallbackAlreadySet || answers[1] == kAlreadyFetched) << answers[1].second;
     });
   }
 }
