@@ -14,7 +14,7 @@ namespace velmora::mobile::xplat::cellar {
 struct CELLAR_EXPORT DiskCacheItem {
   // What a host attaches to an item beyond the fields below. The manifest keeps it as bytes that only its own type
   // understands, and a prune strategy may read it. Objects are made with std::make_shared of their concrete type, which
-  // is what destroys them: nobody can delete one through this base. Derive with `final`, so that this stays so.
+  // is what destroys them: none is ever deleted through a base.
   class CELLAR_EXPORT ExtendedMetadata {
    public:
     // The bytes to keep. Called under the manifest's lock: it must not call the store again.

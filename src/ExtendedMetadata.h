@@ -46,8 +46,8 @@ template <std::size_t N> std::array<std::string, N> binaryToValueString(const st
 }
 
 // Makes the metadata objects of one store, so that the manifest can bring stored bytes back to life. Any thread may
-// call. Objects are made with std::make_shared of their concrete type, which is what destroys them. Derive with
-// `final`, so that this stays so, and add `using ExtendedMetadataFactory::getExtendedMetadata;`, or the second
+// call. Objects are made with std::make_shared of their concrete type, which is what destroys them: no factory is ever
+// deleted through a base. Add `using ExtendedMetadataFactory::getExtendedMetadata;` to a derived class, or the second
 // operation is hidden.
 class CELLAR_EXPORT ExtendedMetadataFactory {
  public:
@@ -64,8 +64,9 @@ class CELLAR_EXPORT ExtendedMetadataFactory {
   ~ExtendedMetadataFactory() = default;
 };
 
-// Which part of a video an item holds, for VideoDownloadPruneStrategy.
-class CELLAR_EXPORT VideoDownloadExtendedMetadata final : public DiskCacheItem::ExtendedMetadata {
+// Which part of a video an item holds, for VideoDownloadPruneStrategy. An object of a derived class counts as video
+// metadata there, by the second and type that it holds here; it is never deleted through this base either.
+class CELLAR_EXPORT VideoDownloadExtendedMetadata : public DiskCacheItem::ExtendedMetadata {
  public:
   // Stored on disk as their numbers. The types 1, 2 and 3 always have high priority and need no names here; every
   // number outside 0 to 3 has low priority.
@@ -93,7 +94,7 @@ class CELLAR_EXPORT VideoDownloadExtendedMetadata final : public DiskCacheItem::
   ItemType itemType_;
 };
 
-class CELLAR_EXPORT VideoDownloadExtendedMetadataFactory final : public ExtendedMetadataFactory {
+class CELLAR_EXPORT VideoDownloadExtendedMetadataFactory : public ExtendedMetadataFactory {
  public:
   using ExtendedMetadataFactory::getExtendedMetadata;
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> getExtendedMetadata() const override;

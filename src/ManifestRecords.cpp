@@ -1,5 +1,6 @@
 #include "ManifestRecords.h"
 
+#include <typeinfo>
 #include <utility>
 
 #include "PruneStrategy.h"
@@ -53,16 +54,17 @@ class ComparedRecords {
 
 std::int32_t accessDateOf(const ManifestRecord& record) { return record.lastAccessDate; }
 
-template <class Strategy> bool isA(const std::shared_ptr<PruneStrategyBase>& strategy) {
-  return dynamic_cast<const Strategy*>(strategy.get()) != nullptr;
+// Exactly: a class that derives from one of ours may compare in its own way.
+template <class Strategy> bool isExactly(const PruneStrategyBase* strategy) {
+  return strategy != nullptr && typeid(*strategy) == typeid(Strategy);
 }
 
 }  // namespace
 
 ManifestRecords::ManifestRecords(std::shared_ptr<PruneStrategyBase> strategy)
     : strategy_(std::move(strategy)),
-      isVideoStrategy_(isA<VideoDownloadPruneStrategy>(strategy_)),
-      isOwnStrategy_(strategy_ != nullptr && !isVideoStrategy_ && !isA<LRUPruneStrategy>(strategy_)),
+      isVideoStrategy_(isExactly<VideoDownloadPruneStrategy>(strategy_.get())),
+      isOwnStrategy_(strategy_ != nullptr && !isVideoStrategy_ && !isExactly<LRUPruneStrategy>(strategy_.get())),
       byAccessDate_(accessDateOf, &ManifestRecord::placeByAccessDate) {}
 
 std::vector<std::string> ManifestRecords::keys() const {

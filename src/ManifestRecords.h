@@ -55,7 +55,7 @@ class ManifestRecords {
 
   const std::shared_ptr<PruneStrategyBase> strategy_;
   const bool isVideoStrategy_;
-  const bool isOwnStrategy_;  // of the host's own kind, which can only be asked
+  const bool isOwnStrategy_;  // a host's own class, derived from ours or not, which can only be asked
   Map records_;
   EvictionOrder byAccessDate_;
   VideoEvictionOrder byVideoPriority_;  // kept with the video strategy only

@@ -12,7 +12,7 @@ enum class PruneStrategyIdentifier : int;
 
 // Says which of two items of a disk cache goes first when room is needed. Implementations keep no state that changes,
 // or guard it: any thread may compare. Objects are made with std::make_shared of their concrete type, which is what
-// destroys them: nobody can delete one through this base. Derive with `final`, so that this stays so.
+// destroys them: none is ever deleted through a base.
 class CELLAR_EXPORT PruneStrategyBase {
  public:
   // True when `a` is to be pruned before `b`. Should be a strict weak order; where it is not, the order of pruning is
@@ -27,15 +27,16 @@ class CELLAR_EXPORT PruneStrategyBase {
 };
 
 // Least recently used first. Items of the same access date are not ordered.
-class CELLAR_EXPORT LRUPruneStrategy final : public PruneStrategyBase {
+class CELLAR_EXPORT LRUPruneStrategy : public PruneStrategyBase {
  public:
   bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override;
 };
 
 // Least recently used first, except that a high-priority item counts as if it had been used `priorityWeight` seconds
-// later than it was. Two items are compared by their dates alone when either carries no VideoDownloadExtendedMetadata.
-// Sums beyond 32 bits wrap.
-class CELLAR_EXPORT VideoDownloadPruneStrategy final : public PruneStrategyBase {
+// later than it was. Two items are compared by their dates alone when either carries no VideoDownloadExtendedMetadata,
+// nor a class derived from it. Sums beyond 32 bits wrap. A class derived from this one is asked to compare; this class
+// itself is not, so that pruning does not look at every item.
+class CELLAR_EXPORT VideoDownloadPruneStrategy : public PruneStrategyBase {
  public:
   static constexpr int lowPriority = 0;
   static constexpr int highPriority = 1;

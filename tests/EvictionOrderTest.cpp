@@ -45,15 +45,32 @@ class NoPersistence final : public ManifestPersistence {
   void removeInlineData(const std::string&) override {}
 };
 
+bool isLarger(const DiskCacheItem* a, const DiskCacheItem* b) {
+  return a->size != b->size ? a->size > b->size : a->filename < b->filename;
+}
+
+// A host's order, on top of nothing or in place of the one that it derives from.
 class LargestFirst final : public PruneStrategyBase {
  public:
-  bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override {
-    return a->size != b->size ? a->size > b->size : a->filename < b->filename;
-  }
+  bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override { return isLarger(a, b); }
+};
+class LargestInsteadOfOldestFirst : public LRUPruneStrategy {
+ public:
+  bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override { return isLarger(a, b); }
+};
+class LargestInsteadOfUnimportantFirst : public VideoDownloadPruneStrategy {
+ public:
+  bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override { return isLarger(a, b); }
+};
+class VideoByAnotherName : public VideoDownloadPruneStrategy {};
+
+class HostsVideoMetadata : public VideoDownloadExtendedMetadata {
+ public:
+  using VideoDownloadExtendedMetadata::VideoDownloadExtendedMetadata;
 };
 
-enum class Strategy { None, LeastRecentlyUsed, Video, OfAHost };
-enum class Metadata { None, Video, Mixed };
+enum class Strategy { None, LeastRecentlyUsed, Video, OfAHost, OfAHostFromLRU, OfAHostFromVideo, VideoByAnotherName };
+enum class Metadata { None, Video, Mixed, OfAHostFromVideo };
 
 struct Case {
   std::string name;
@@ -72,6 +89,12 @@ std::shared_ptr<PruneStrategyBase> make(Strategy strategy) {
       return std::make_shared<VideoDownloadPruneStrategy>();
     case Strategy::OfAHost:
       return std::make_shared<LargestFirst>();
+    case Strategy::OfAHostFromLRU:
+      return std::make_shared<LargestInsteadOfOldestFirst>();
+    case Strategy::OfAHostFromVideo:
+      return std::make_shared<LargestInsteadOfUnimportantFirst>();
+    case Strategy::VideoByAnotherName:
+      return std::make_shared<VideoByAnotherName>();
     case Strategy::None:
       break;
   }
@@ -100,8 +123,10 @@ class EvictionOrder : public testing::TestWithParam<Case> {
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> anyMetadata() {
     const Metadata kind = GetParam().metadata;
     if (kind == Metadata::None || (kind == Metadata::Mixed && upTo(30) == 0)) return nullptr;
-    return std::make_shared<VideoDownloadExtendedMetadata>(
-        static_cast<int>(upTo(20)), static_cast<VideoDownloadExtendedMetadata::ItemType>(upTo(4)));
+    const auto chunkSecond = static_cast<int>(upTo(20));
+    const auto type = static_cast<VideoDownloadExtendedMetadata::ItemType>(upTo(4));
+    if (kind == Metadata::OfAHostFromVideo) return std::make_shared<HostsVideoMetadata>(chunkSecond, type);
+    return std::make_shared<VideoDownloadExtendedMetadata>(chunkSecond, type);
   }
 
   void store() {
@@ -304,15 +329,20 @@ TEST(EvictionOrderByPriority, FollowsTunablesThatWereOthersForAWhile) {
   set(0);
 }
 
-INSTANTIATE_TEST_SUITE_P(Orders, EvictionOrder,
-                         testing::Values(Case{"None", Strategy::None, Metadata::None, false},
-                                         Case{"LeastRecentlyUsed", Strategy::LeastRecentlyUsed, Metadata::Video, true},
-                                         Case{"Video", Strategy::Video, Metadata::Video, false},
-                                         Case{"VideoWithChangingTunables", Strategy::Video, Metadata::Video, true},
-                                         Case{"VideoWithoutMetadata", Strategy::Video, Metadata::None, true},
-                                         Case{"VideoWithMixedMetadata", Strategy::Video, Metadata::Mixed, true},
-                                         Case{"OfAHost", Strategy::OfAHost, Metadata::Mixed, true}),
-                         [](const testing::TestParamInfo<Case>& test) { return test.param.name; });
+INSTANTIATE_TEST_SUITE_P(
+    Orders, EvictionOrder,
+    testing::Values(Case{"None", Strategy::None, Metadata::None, false},
+                    Case{"LeastRecentlyUsed", Strategy::LeastRecentlyUsed, Metadata::Video, true},
+                    Case{"Video", Strategy::Video, Metadata::Video, false},
+                    Case{"VideoWithChangingTunables", Strategy::Video, Metadata::Video, true},
+                    Case{"VideoWithoutMetadata", Strategy::Video, Metadata::None, true},
+                    Case{"VideoWithMixedMetadata", Strategy::Video, Metadata::Mixed, true},
+                    Case{"OfAHost", Strategy::OfAHost, Metadata::Mixed, true},
+                    Case{"OfAHostFromLRU", Strategy::OfAHostFromLRU, Metadata::None, true},
+                    Case{"OfAHostFromVideo", Strategy::OfAHostFromVideo, Metadata::Video, true},
+                    Case{"VideoByAnotherName", Strategy::VideoByAnotherName, Metadata::Video, true},
+                    Case{"VideoWithMetadataOfAHost", Strategy::Video, Metadata::OfAHostFromVideo, true}),
+    [](const testing::TestParamInfo<Case>& test) { return test.param.name; });
 
 }  // namespace
 }  // namespace velmora::mobile::xplat::cellar

@@ -8,6 +8,7 @@
 #include <memory>
 #include <string>
 #include <type_traits>
+#include <utility>
 #include <vector>
 
 #include "Configuration.h"
@@ -180,6 +181,46 @@ TEST(VideoDownloadExtendedMetadataFactory, MakesADefaultObjectInPlaceOfNone) {
   const auto made = factory.getExtendedMetadata(nullptr);
   ASSERT_NE(made, nullptr);
   EXPECT_EQ(text(made->serialize()), "{chunkSecond:1000000}{itemType:0}");
+}
+
+// A host's chunks that know their resolution too, in a third record.
+class ChunkWithResolution : public VideoDownloadExtendedMetadata {
+ public:
+  ChunkWithResolution() = default;
+  ChunkWithResolution(int chunkSecond, std::string resolution)
+      : VideoDownloadExtendedMetadata(chunkSecond, ItemType::VideoChunk), resolution_(std::move(resolution)) {}
+
+  std::vector<unsigned char> serialize() const override {
+    auto bytes = VideoDownloadExtendedMetadata::serialize();
+    pushKeyValueIntoBinary("resolution", resolution_, bytes);
+    return bytes;
+  }
+  void deserialize(const std::vector<unsigned char>& bytes) override {
+    VideoDownloadExtendedMetadata::deserialize(bytes);
+    resolution_ = binaryToValueString<3>(bytes)[2];
+  }
+  std::string resolution() const { return resolution_; }
+
+ private:
+  std::string resolution_;
+};
+
+TEST(VideoDownloadExtendedMetadata, MayBeDerivedFromTogetherWithItsFactory) {
+  class Factory : public VideoDownloadExtendedMetadataFactory {
+   public:
+    using VideoDownloadExtendedMetadataFactory::getExtendedMetadata;
+    std::shared_ptr<DiskCacheItem::ExtendedMetadata> getExtendedMetadata() const override {
+      return std::make_shared<ChunkWithResolution>();
+    }
+  };
+  const std::shared_ptr<ExtendedMetadataFactory> factory = std::make_shared<Factory>();
+  const auto metadata = factory->getExtendedMetadata(nullptr);
+  metadata->deserialize(ChunkWithResolution(12, "720p").serialize());
+  const auto chunk = std::dynamic_pointer_cast<ChunkWithResolution>(metadata);
+  ASSERT_NE(chunk, nullptr);
+  EXPECT_EQ(chunk->getExtendedMetadata(), 12);
+  EXPECT_EQ(chunk->resolution(), "720p");
+  EXPECT_EQ(text(chunk->serialize()), "{chunkSecond:12}{itemType:0}{resolution:720p}");
 }
 
 TEST(ExtendedMetadataFactory, CannotBeDeletedThroughItsBase) {

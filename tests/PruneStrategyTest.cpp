@@ -28,6 +28,11 @@ class ForeignMetadata final : public DiskCacheItem::ExtendedMetadata {
   void deserialize(const std::vector<unsigned char>& /*bytes*/) override {}
 };
 
+class HostsVideoMetadata : public VideoDownloadExtendedMetadata {
+ public:
+  using VideoDownloadExtendedMetadata::VideoDownloadExtendedMetadata;
+};
+
 // Prunes the largest key first, so that its order is told from that of the dates.
 class LargestKeyFirst final : public PruneStrategyBase {
  public:
@@ -174,6 +179,14 @@ TEST_F(VideoDownloadPruneStrategyTest, AnItemWithoutVideoMetadataIsComparedByDat
   }
 }
 
+TEST_F(VideoDownloadPruneStrategyTest, AClassDerivedFromTheVideoMetadataCountsAsVideoMetadata) {
+  tune(100, 10);
+  const DiskCacheItem early = usedAt(1000, std::make_shared<HostsVideoMetadata>(5, ItemType::VideoChunk));
+  const DiskCacheItem late = chunkUsedAt(1099, 500);
+  EXPECT_TRUE(before(strategy, late, early));
+  EXPECT_FALSE(before(strategy, early, late));
+}
+
 TEST_F(VideoDownloadPruneStrategyTest, ANegativeWeightPrunesHighPriorityEarlier) {
   tune(-100, 10);
   EXPECT_TRUE(before(strategy, chunkUsedAt(1099, 5), chunkUsedAt(1000, 500)));
@@ -194,6 +207,29 @@ TEST_F(VideoDownloadPruneStrategyTest, SumsBeyondTheRangeOfADateWrap) {
 TEST(PruneStrategyBase, CannotBeDeletedThroughItsBase) {
   EXPECT_FALSE(std::is_destructible_v<PruneStrategyBase>);
   EXPECT_FALSE(std::has_virtual_destructor_v<PruneStrategyBase>);
+}
+
+TEST(PruneStrategyBase, ItsStrategiesMayBeDerivedFrom) {
+  class OldestLast : public LRUPruneStrategy {
+   public:
+    bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override {
+      return LRUPruneStrategy::compare(b, a);
+    }
+  };
+  class VideoOldestLast : public VideoDownloadPruneStrategy {
+   public:
+    bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override {
+      return VideoDownloadPruneStrategy::compare(b, a);
+    }
+  };
+  const DiskCacheItem older = usedAt(1);
+  const DiskCacheItem newer = usedAt(2);
+  const std::vector<std::shared_ptr<PruneStrategyBase>> strategies = {std::make_shared<OldestLast>(),
+                                                                      std::make_shared<VideoOldestLast>()};
+  for (const auto& strategy : strategies) {
+    EXPECT_TRUE(Comparator(strategy)(&newer, &older));
+    EXPECT_FALSE(Comparator(strategy)(&older, &newer));
+  }
 }
 
 TEST(PruneStrategyFactory, MakesTheStrategyOfAnIdentifier) {
