@@ -4,6 +4,7 @@
 
 #include <ctime>
 #include <exception>
+#include <iterator>
 #include <utility>
 
 #include "LarderException.h"
@@ -46,9 +47,9 @@ DiskCacheManifest::DiskCacheManifest(std::unique_ptr<ManifestPersistence> persis
 
 DiskCacheManifest::~DiskCacheManifest() {
   try {
-    commitAccessTimeUpdates(pendingAccessDates_);
-  } catch (const std::exception& error) {
-    LOG(ERROR) << "Could not write access dates: " << error.what();
+    flush();
+  } catch (...) {
+    LOG(ERROR) << "Could not write access dates as the manifest was destroyed.";
   }
 }
 
@@ -58,6 +59,7 @@ void DiskCacheManifest::clear() {
   records_->clear();
   pendingAccessDates_.clear();
   persistence_->clearItems();
+  hasFlushFailed_ = false;
   loaded_ = true;
 }
 
@@ -134,17 +136,19 @@ void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
     const std::int32_t date = now();
     records_->setLastAccessDate(key, date);
     pendingAccessDates_[key] = date;
-    if (!loaded_ || pendingAccessDates_.size() <= kMaxPendingAccessDates) return;
+    if (!isFlushDue()) return;
     due = std::make_shared<AccessDates>();
     due->swap(pendingAccessDates_);
+    queuedAccessDates_ = due;
   }
   try {
     executor_->dispatch([weakThis = weak_from_this<DiskCacheManifest>(), due] {
-      if (const auto self = weakThis.lock()) self->commitAccessTimeUpdates(*due);
+      if (const auto self = weakThis.lock()) self->runQueuedFlush(*due);
     });
   } catch (...) {
     const std::lock_guard<std::mutex> lock(itemsMutex_);
-    pendingAccessDates_.insert(due->begin(), due->end());  // those used again meanwhile stay as they are
+    pendingAccessDates_.merge(*due);  // those used again meanwhile stay as they are
+    due->clear();
     throw;
   }
 }
@@ -284,26 +288,53 @@ void DiskCacheManifest::flush() {
   commitAccessTimeUpdates(dates);
 }
 
-// Dates of items that have been used or set again meanwhile, or have gone, are not written; those that cannot be
-// written now wait for the next time.
-void DiskCacheManifest::commitAccessTimeUpdates(const AccessDates& dates) {
-  auto next = dates.begin();
-  try {
-    for (; next != dates.end(); ++next) {
-      if (isAccessDate(next->first, next->second)) persistence_->updateLastAccessDate(next->first, next->second);
-    }
-  } catch (const LarderException& error) {
-    LOG(ERROR) << "Could not write access dates: " << error.what();
-    for (; next != dates.end(); ++next) {
-      if (!isAccessDate(next->first, next->second)) continue;
-      const std::lock_guard<std::mutex> lock(itemsMutex_);
-      pendingAccessDates_.insert(*next);
-    }
+// Enough dates for a flush of their own, and neither a queued flush nor the timer is to come first.
+bool DiskCacheManifest::isFlushDue() const {
+  if (!loaded_ || hasFlushFailed_ || pendingAccessDates_.size() <= kMaxPendingAccessDates) return false;
+  const auto queued = queuedAccessDates_.lock();
+  return queued == nullptr || queued->empty();
+}
+
+void DiskCacheManifest::runQueuedFlush(AccessDates& queued) {
+  AccessDates dates;
+  {
+    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    dates.swap(queued);
   }
+  commitAccessTimeUpdates(dates);
+  {
+    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    if (!isFlushDue()) return;
+    dates.swap(pendingAccessDates_);  // what has come together while the flush was queued
+  }
+  commitAccessTimeUpdates(dates);
+}
+
+// Dates of items that have been used or set again meanwhile, or were removed, are not written. Those that cannot be
+// written now wait for the timer.
+void DiskCacheManifest::commitAccessTimeUpdates(AccessDates& dates) {
+  try {
+    for (; !dates.empty(); dates.erase(dates.begin())) {
+      const auto& [key, date] = *dates.begin();
+      if (isAccessDate(key, date)) persistence_->updateLastAccessDate(key, date);
+    }
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Could not write access dates: " << error.what();
+  }
+  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  hasFlushFailed_ = !dates.empty();
+  for (auto left = dates.begin(); left != dates.end();) {
+    left = hasAccessDate(left->first, left->second) ? std::next(left) : dates.erase(left);
+  }
+  pendingAccessDates_.merge(dates);
 }
 
 bool DiskCacheManifest::isAccessDate(const std::string& key, std::int32_t date) {
   const std::lock_guard<std::mutex> lock(itemsMutex_);
+  return hasAccessDate(key, date);
+}
+
+bool DiskCacheManifest::hasAccessDate(const std::string& key, std::int32_t date) const {
   const ManifestRecord* const record = records_->find(key);
   return record != nullptr && record->lastAccessDate == date;
 }

@@ -63,7 +63,8 @@ class CELLAR_EXPORT DiskCacheManifestInterface : public std::enable_shared_from_
 
 // Every item's record in memory, with the total of their sizes, and written through to a persistence at once. Access
 // dates are the exception: they change with every read, so they wait in memory and are written every 120 seconds, when
-// more than 512 of them have come together, and at destruction. A killed process loses what waits; items then look less
+// more than 512 of them have come together, and at destruction. After a write of dates that failed, which is one error
+// line in the log, all wait for the next 120 seconds to pass. A killed process loses what waits; items then look less
 // recently used than they were.
 //
 // Before it is loaded, single records are read from the persistence as they are asked for, and prunes do nothing. What
@@ -151,12 +152,15 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   std::optional<ReplacedItem> whatIsReplaced(const std::string& key, bool withInlineData);
   const ManifestRecord* findOrRead(const std::string& key);
   DiskCacheItem remove(const ManifestRecord& record);
+  bool hasAccessDate(const std::string& key, std::int32_t date) const;
+  bool isFlushDue() const;
   template <class MayGo> std::vector<DiskCacheItem> prune(const std::function<const ManifestRecord*()>& next,
                                                           std::uint32_t count, MayGo mayGo);
 
   void armFlushTimer();
   void flush();
-  void commitAccessTimeUpdates(const AccessDates& dates);
+  void runQueuedFlush(AccessDates& queued);
+  void commitAccessTimeUpdates(AccessDates& dates);
   bool isAccessDate(const std::string& key, std::int32_t date);
 
   const std::unique_ptr<ManifestPersistence> persistence_;
@@ -168,6 +172,8 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   bool loaded_ = false;
   bool invalidated_ = false;
   AccessDates pendingAccessDates_;
+  std::weak_ptr<AccessDates> queuedAccessDates_;  // those of the flush on the executor; empty once it runs
+  bool hasFlushFailed_ = false;                   // then pending dates wait for the timer
   std::unique_ptr<AsyncTimer> flushTimer_;
 };
 

@@ -13,6 +13,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <new>
 #include <optional>
 #include <random>
 #include <set>
@@ -1037,6 +1038,174 @@ TEST_F(DiskCacheManifestTest, FailedDatesOfAnItemThatHasGoneAreForgotten) {
   EXPECT_THAT(medium_->calls("updateLastAccessDate"), ElementsAre("1"));
 }
 
+// --- A flush that fails, or has not run yet, is not multiplied ---
+
+class DiskCacheManifestFlush : public DiskCacheManifestTest {
+ protected:
+  void SetUp() override {
+    createLoaded();
+    fill(kItems);
+    medium_->forgetCalls();
+  }
+  void useAll() { use(kItems); }
+  std::size_t written() const { return medium_->calls("updateLastAccessDate").size(); }
+
+  // As many as the next use of another item sends off.
+  static constexpr int kItems = 2 * 513;
+
+  TestClock clock_{5000};
+};
+
+TEST_F(DiskCacheManifestFlush, ThatFailedIsNotTriedAgainByFetches) {
+  medium_->fail("updateLastAccessDate");
+  const LogCapture log;
+  use(513);
+  executor_->runAll();
+  EXPECT_EQ(written(), 1U);  // tried, in vain
+  EXPECT_EQ(log.errorCount(), 1U);
+
+  for (int i = 0; i < 10; ++i) {
+    useAll();
+    EXPECT_EQ(executor_->pending(), 0U);
+  }
+  EXPECT_EQ(written(), 1U);
+  EXPECT_EQ(log.errorCount(), 1U);
+}
+
+TEST_F(DiskCacheManifestFlush, ThatFailedIsTriedAgainByTheTimerWithOneLineEachTime) {
+  medium_->fail("updateLastAccessDate");
+  const LogCapture log;
+  use(513);
+  executor_->runAll();
+  for (std::size_t failures = 2; failures < 5; ++failures) {
+    ASSERT_TRUE(fireTimer());
+    useAll();
+    EXPECT_EQ(executor_->pending(), 0U);
+    EXPECT_EQ(written(), failures);
+    EXPECT_EQ(log.errorCount(), failures);
+  }
+}
+
+TEST_F(DiskCacheManifestFlush, ThatFailedOnTheTimerIsNotTriedAgainByFetchesEither) {
+  medium_->fail("updateLastAccessDate");
+  use(512);
+  ASSERT_TRUE(fireTimer());
+  EXPECT_EQ(written(), 1U);
+  useAll();
+  EXPECT_EQ(executor_->pending(), 0U);
+}
+
+TEST_F(DiskCacheManifestFlush, ThatFailedKeepsTheNewestDateOfEachItem) {
+  medium_->fail("updateLastAccessDate", 100);
+  use(513);
+  executor_->runAll();
+  clock_.set(6000);
+  for (int i = 0; i < 3; ++i) use(600);
+  medium_->heal();
+  medium_->forgetCalls();
+  ASSERT_TRUE(fireTimer());
+  EXPECT_EQ(written(), 600U);
+  for (int i = 0; i < 600; ++i) EXPECT_EQ(medium_->accessDate(std::to_string(i)), 6000);
+}
+
+TEST_F(DiskCacheManifestFlush, ThatSucceedsOnTheTimerEndsTheWaiting) {
+  medium_->fail("updateLastAccessDate");
+  use(513);
+  executor_->runAll();
+  medium_->heal();
+  ASSERT_TRUE(fireTimer());
+
+  use(512);
+  EXPECT_EQ(executor_->pending(), 0U);
+  manifest_->updateLastAccessDate("512");
+  EXPECT_EQ(executor_->pending(), 1U);
+}
+
+TEST_F(DiskCacheManifestFlush, ThatFailedWaitsNoLongerOnceTheManifestBeginsAnew) {
+  medium_->fail("updateLastAccessDate");
+  use(513);
+  executor_->runAll();
+  medium_->heal();
+  manifest_->clear();
+  fill(513);
+  use(513);
+  EXPECT_EQ(executor_->pending(), 1U);
+}
+
+TEST_F(DiskCacheManifestFlush, WithADateThatAnyExceptionKeepsFromBeingWrittenWaitsForTheTimerToo) {
+  medium_->onCall = [](const std::string&, const std::string&) { throw std::bad_alloc(); };
+  const LogCapture log;
+  use(513);
+  EXPECT_NO_THROW(executor_->runAll());
+  useAll();
+  EXPECT_EQ(executor_->pending(), 0U);
+  EXPECT_NO_THROW(fireTimer());
+  EXPECT_THAT(executor_->armedDelays(), ElementsAre(kFlushInterval));
+  EXPECT_EQ(log.errorCount(), 2U);
+
+  medium_->onCall = nullptr;
+  medium_->forgetCalls();
+  ASSERT_TRUE(fireTimer());
+  EXPECT_EQ(written(), static_cast<std::size_t>(kItems));
+}
+
+TEST_F(DiskCacheManifestFlush, ThatHasNotRunYetIsTheOnlyOne) {
+  for (int i = 0; i < 3; ++i) {
+    useAll();
+    EXPECT_EQ(executor_->pending(), 1U);
+  }
+  EXPECT_EQ(written(), 0U);
+
+  EXPECT_EQ(executor_->runAll(), 1U);  // the first 513, and then all others
+  for (int i = 0; i < kItems; ++i) EXPECT_EQ(medium_->accessDate(std::to_string(i)), 5000) << i;
+  medium_->forgetCalls();
+  ASSERT_TRUE(fireTimer());
+  EXPECT_EQ(written(), 0U);
+}
+
+TEST_F(DiskCacheManifestFlush, LeavesFiveHundredAndTwelveThatCameWhileItWasQueuedToTheTimer) {
+  use(513);
+  for (int i = 513; i < 513 + 512; ++i) manifest_->updateLastAccessDate(std::to_string(i));
+  EXPECT_EQ(executor_->runAll(), 1U);
+  EXPECT_EQ(written(), 513U);
+  ASSERT_TRUE(fireTimer());
+  EXPECT_EQ(written(), 513U + 512U);
+}
+
+TEST_F(DiskCacheManifestFlush, ThatFailsLeavesWhatCameWhileItWasQueuedToTheTimer) {
+  useAll();
+  medium_->fail("updateLastAccessDate");
+  const LogCapture log;
+  EXPECT_EQ(executor_->runAll(), 1U);
+  EXPECT_EQ(log.errorCount(), 1U);
+
+  medium_->heal();
+  medium_->forgetCalls();
+  ASSERT_TRUE(fireTimer());
+  EXPECT_EQ(written(), static_cast<std::size_t>(kItems));
+}
+
+TEST_F(DiskCacheManifestFlush, ThatTheExecutorDropsDoesNotHoldUpTheNext) {
+  use(513);
+  executor_->dropAll();
+  use(512);
+  EXPECT_EQ(executor_->pending(), 0U);
+  manifest_->updateLastAccessDate("512");
+  EXPECT_EQ(executor_->pending(), 1U);
+  EXPECT_EQ(executor_->runAll(), 1U);
+  EXPECT_EQ(written(), 513U);
+}
+
+TEST_F(DiskCacheManifestFlush, ThatWasQueuedBeforeTheTimersFailedMayStillSucceedAndEndTheWaiting) {
+  useAll();
+  ASSERT_EQ(executor_->pending(), 1U);
+  medium_->fail("updateLastAccessDate");
+  ASSERT_TRUE(fireTimer());
+  medium_->heal();
+  EXPECT_EQ(executor_->runAll(), 1U);
+  for (int i = 0; i < kItems; ++i) EXPECT_EQ(medium_->accessDate(std::to_string(i)), 5000) << i;
+}
+
 // --- What becomes of waiting dates ---
 
 class WaitingDates : public DiskCacheManifestTest {
@@ -1160,6 +1329,19 @@ class LateExecutor final : public AsyncExecutor {
   }
   std::vector<std::function<void()>> tasks;
 };
+
+TEST_F(DiskCacheManifestFlush, ThatHasRunIsOverAlsoWhereTheExecutorKeepsItsTask) {
+  const auto late = std::make_shared<LateExecutor>();
+  auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<FakePersistence>(medium_), late, nullptr);
+  manifest->load();
+  ASSERT_THAT(late->tasks, SizeIs(1));  // the timer's
+  for (std::size_t flushes = 1; flushes < 4; ++flushes) {
+    for (int i = 0; i < 513; ++i) manifest->updateLastAccessDate(std::to_string(i));
+    ASSERT_THAT(late->tasks, SizeIs(1 + flushes));
+    late->tasks.back()();
+    EXPECT_EQ(written(), 513U * flushes);
+  }
+}
 
 TEST_F(DiskCacheManifestTest, ATimerTaskThatOutlivesTheManifestDoesNothing) {
   const auto late = std::make_shared<LateExecutor>();
