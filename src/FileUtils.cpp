@@ -22,6 +22,7 @@ namespace {
 
 using std::string;
 
+constexpr mode_t kFileMode = 0666;
 constexpr mode_t kDirectoryMode = 0775;
 constexpr mode_t kDirectoryBit = 0040000;
 
@@ -30,12 +31,18 @@ constexpr mode_t kDirectoryBit = 0040000;
   throw FileUtilsIoException(error, operation + (operation.empty() || reason.empty() ? "" : ": ") + reason);
 }
 
+// Opens a file for stdio without ever waiting: for the other end of a fifo, say.
+int openDescriptor(const string& path, int flags) {
+  const int descriptor = ::open(path.c_str(), flags | O_NONBLOCK | O_CLOEXEC, kFileMode);
+  if (descriptor == -1) throwSystemError("Could not open file", errno);
+  return descriptor;
+}
+
 // A stdio stream that is closed on every way out.
 class File {
  public:
-  File(const string& path, const char* mode) : stream_(std::fopen(path.c_str(), mode)) {
-    if (stream_ == nullptr) throwSystemError("Could not open file", errno);
-  }
+  static File forReading(const string& path) { return {openDescriptor(path, O_RDONLY), "rb"}; }
+  static File forWriting(const string& path) { return {openDescriptor(path, O_WRONLY | O_CREAT | O_TRUNC), "wb"}; }
   ~File() {
     if (stream_ != nullptr) (void)std::fclose(stream_);
   }
@@ -44,45 +51,50 @@ class File {
 
   std::FILE* get() { return stream_; }
 
+  struct stat status() {
+    struct stat status {};
+    if (::fstat(::fileno(stream_), &status) != 0) throwSystemError("Could not open file", errno);
+    return status;
+  }
+
   // Closing may be what writes the last bytes, so it can fail for want of space.
   void close() {
     if (std::fclose(std::exchange(stream_, nullptr)) != 0) throwSystemError("Could not close file", errno);
   }
 
  private:
+  File(int descriptor, const char* mode) : stream_(::fdopen(descriptor, mode)) {
+    if (stream_ != nullptr) return;
+    const int error = errno;
+    (void)::close(descriptor);
+    throwSystemError("Could not open file", error);
+  }
+
   std::FILE* stream_;
 };
 
-// What size a directory claims to have differs from one file system to the next: none, that of its entries, or one that
-// nothing could be allocated for.
-constexpr std::size_t kMayBeADirectory = std::size_t{1} << 30;
-
-void throwIfDirectory(File& file) {
-  struct stat status {};
-  const bool isDirectory = ::fstat(::fileno(file.get()), &status) == 0 && S_ISDIR(status.st_mode);
-  if (isDirectory) throwSystemError("File read failed", EISDIR);
-}
-
-[[noreturn]] void throwReadError(File& file, const string& operation, int error) {
-  throwIfDirectory(file);
-  throwSystemError(operation, error);
+// What size a directory or a device claims to have differs from one file system to the next.
+void throwUnlessRegular(File& file) {
+  const auto status = file.status();
+  if (S_ISDIR(status.st_mode)) throwSystemError("File read failed", EISDIR);
+  if (!S_ISREG(status.st_mode)) throwSystemError("Could not seek to end of file", ESPIPE);
 }
 
 std::size_t sizeOf(File& file) {
-  if (std::fseek(file.get(), 0, SEEK_END) != 0) throwReadError(file, "Could not seek to end of file", errno);
+  if (std::fseek(file.get(), 0, SEEK_END) != 0) throwSystemError("Could not seek to end of file", errno);
   const long size = std::ftell(file.get());
-  if (size == -1) throwReadError(file, "Could not determine size of file", errno);
-  if (std::fseek(file.get(), 0, SEEK_SET) != 0) throwReadError(file, "Could not seek to start of file", errno);
+  if (size == -1) throwSystemError("Could not determine size of file", errno);
+  if (std::fseek(file.get(), 0, SEEK_SET) != 0) throwSystemError("Could not seek to start of file", errno);
   return static_cast<std::size_t>(size);
 }
 
-std::vector<unsigned char> allocateFor(File& file, std::size_t size) {
+std::vector<unsigned char> allocate(std::size_t size) {
   try {
     return std::vector<unsigned char>(size);
   } catch (const std::bad_alloc&) {
   } catch (const std::length_error&) {
   }
-  throwReadError(file, "File read failed", ENOMEM);
+  throwSystemError("File read failed", ENOMEM);
 }
 
 bool isConcatenation(std::string_view whole, std::string_view first, std::string_view second) {
@@ -164,21 +176,21 @@ string FileUtils::parentPath(const string& path) {
 }
 
 std::vector<unsigned char> FileUtils::readFile(const string& path) {
-  File file(path, "rb");
+  File file = File::forReading(path);
+  throwUnlessRegular(file);
   (void)std::setvbuf(file.get(), nullptr, _IONBF, 0);  // straight into the result
-  const std::size_t size = sizeOf(file);
-  if (size == 0 || size >= kMayBeADirectory) throwIfDirectory(file);
-  std::vector<unsigned char> data = allocateFor(file, size);
+  std::vector<unsigned char> data = allocate(sizeOf(file));
   errno = 0;
   if (!data.empty() && std::fread(data.data(), 1, data.size(), file.get()) != data.size()) {
-    throwReadError(file, "File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
+    throwSystemError("File read failed", errno != 0 ? errno : EIO);  // the file has become shorter meanwhile
   }
   file.close();
   return data;
 }
 
 void FileUtils::writeFile(const string& path, const std::vector<unsigned char>& data) {
-  File file(path, "wb");
+  File file = File::forWriting(path);
+  if (S_ISFIFO(file.status().st_mode)) throwSystemError("Could not open file", ENXIO);  // as when nobody reads it
   if (!data.empty() && std::fwrite(data.data(), 1, data.size(), file.get()) != data.size()) {
     throwSystemError("File write failed", errno);
   }

@@ -45,10 +45,11 @@ class CELLAR_EXPORT FileUtils {
   // What stands before the last component's slash: "/a" for "/a/b". Empty for "/a", "a" and "".
   virtual std::string parentPath(const std::string& path);
 
-  // The bytes of the file. Throws for whatever cannot be read to its end as a file, a directory among them.
+  // The bytes of a regular file. Throws for everything else (a directory, a fifo, a device) and waits for nobody.
   virtual std::vector<unsigned char> readFile(const std::string& path);
 
-  // Creates or replaces the file. Neither atomic nor synced: a crash or a full disk midway leaves a part of it.
+  // Creates or replaces the file. Neither atomic nor synced: a crash or a full disk midway leaves a part of it. Throws
+  // for a fifo, whether somebody reads from it or not.
   virtual void writeFile(const std::string& path, const std::vector<unsigned char>& data);
 
   // Removes a file, a link (never its target) or an empty directory. Throws when there is none.

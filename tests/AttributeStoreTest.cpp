@@ -1,6 +1,7 @@
 #include "AttributeStore.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <filesystem>
@@ -14,6 +15,7 @@
 #include "host/testing/FaultyFileUtils.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -150,6 +152,21 @@ TEST_F(AttributeStoreTest, ADirectoryInThePlaceOfTheFileIsAFailureOfAccess) {
   store_.set(directory_.path(), {{"key", 1}});
   EXPECT_EQ(log_.messages().back(),
             "Could not set attributes: " + ioFailure(EISDIR, "Could not open file: Is a directory"));
+}
+
+TEST_F(AttributeStoreTest, AFifoInThePlaceOfTheFileIsAFailureOfAccessAndHoldsNobodyUp) {
+  const test::Watchdog watchdog(10);
+  ASSERT_EQ(mkfifo(directory_.file(kFileName).c_str(), 0600), 0);
+  EXPECT_EQ(store_.get(directory_.path()), JsonValue::object());
+  EXPECT_EQ(log_.messages().back(),
+            "Could not get attributes: " + ioFailure(ESPIPE, "Could not seek to end of file: Illegal seek"));
+  store_.set(directory_.path(), {{"key", 1}});
+  EXPECT_EQ(log_.messages().back(),
+            "Could not set attributes: " + ioFailure(ENXIO, "Could not open file: No such device or address"));
+  EXPECT_EQ(log_.errorCount(), 2U);
+  store_.remove(directory_.path());
+  store_.set(directory_.path(), {{"key", 1}});
+  EXPECT_EQ(store_.get(directory_.path()), (JsonValue{{"key", 1}}));
 }
 
 TEST_F(AttributeStoreTest, AFailedWriteIsLoggedAndTheNextSetSucceeds) {

@@ -27,6 +27,7 @@
 #include "host/testing/FaultyFileUtils.h"
 #include "support/Barrier.h"
 #include "support/TemporaryDirectory.h"
+#include "support/Watchdog.h"
 
 namespace {
 
@@ -362,10 +363,26 @@ TEST_F(FileUtilsTest, AFileThatCannotSeekToItsEndIsReported) {
 }
 
 TEST_F(FileUtilsTest, APipeCannotBeReadAsAFile) {
+  const test::Watchdog watchdog(10);
   const string path = makeFifo("fifo");
-  const int writer = open(path.c_str(), O_RDWR | O_CLOEXEC);  // without it, opening the pipe would wait for ever
+  expectSystemFailure([&] { files_.readFile(path); }, ESPIPE, "Could not seek to end of file");
+  expectSystemFailure([&] { files_.readFile(link("link", "fifo")); }, ESPIPE, "Could not seek to end of file");
+  const int writer = open(path.c_str(), O_RDWR | O_CLOEXEC);
+  ASSERT_EQ(write(writer, "x", 1), 1);
   expectSystemFailure([&] { files_.readFile(path); }, ESPIPE, "Could not seek to end of file");
   close(writer);
+}
+
+TEST_F(FileUtilsTest, APipeCannotBeWrittenAsAFile) {
+  const test::Watchdog watchdog(10);
+  const string path = makeFifo("fifo");
+  expectSystemFailure([&] { files_.writeFile(path, bytes("x")); }, ENXIO, "Could not open file");
+  expectSystemFailure([&] { files_.writeFile(link("link", "fifo"), {}); }, ENXIO, "Could not open file");
+  const int reader = open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+  expectSystemFailure([&] { files_.writeFile(path, bytes("x")); }, ENXIO, "Could not open file");
+  char byte = 0;
+  EXPECT_EQ(read(reader, &byte, 1), 0) << "what was not stored has been passed on";
+  close(reader);
 }
 
 TEST_F(FileUtilsTest, AFileWhoseSizeCannotBeToldIsReported) {
@@ -423,8 +440,14 @@ TEST_F(FileUtilsTest, ReadingADirectoryIsAnIoFailureOnEveryFileSystem) {
   EXPECT_EQ(openDescriptors(), before);
 }
 
-TEST_F(FileUtilsTest, ReadingADeviceEitherGivesBytesOrIsAnIoFailure) {
-  for (const char* path : {"/dev/null", "/dev/zero", "/dev/full", "/proc/self/mem", "/proc/self/status"}) {
+TEST_F(FileUtilsTest, ADeviceCannotBeReadAsAFile) {
+  for (const char* path : {"/dev/null", "/dev/zero", "/dev/full"}) {
+    expectSystemFailure([&] { files_.readFile(path); }, ESPIPE, "Could not seek to end of file");
+  }
+}
+
+TEST_F(FileUtilsTest, AFileWithoutASizeOfItsOwnGivesBytesOrIsAnIoFailure) {
+  for (const char* path : {"/proc/self/mem", "/proc/self/status"}) {
     try {
       EXPECT_LT(files_.readFile(path).size(), 1U << 20U) << path;
     } catch (const FileUtilsIoException& exception) {

@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -26,6 +27,7 @@
 #include "LarderException.h"
 #include "StoreDefaults.h"
 #include "support/KeyValueStoreFixture.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -262,6 +264,17 @@ TEST_F(StoringAValue, CopiesTheBytesAtTheCall) {
   settle();
   EXPECT_EQ(told(written), "<done>");
   EXPECT_EQ(get("key"), "value");
+}
+
+TEST_F(StoringAValue, WhereAFifoLiesFailsAndLeavesAMiss) {
+  const test::Watchdog watchdog(10);
+  open();
+  ASSERT_EQ(mkfifo(pathOf("key").c_str(), 0600), 0);
+  const Written written = watch(store->store("key", bytesOf("value")));
+  settle();
+  EXPECT_TRUE(isA<FileUtilsIoException>(written->failure)) << told(written);
+  EXPECT_THAT(told(written), testing::HasSubstr("Could not open file: No such device or address"));
+  EXPECT_EQ(get("key"), "<miss>");
 }
 
 TEST_F(StoringAValue, OverwritesTheFileInPlaceAndReplacesTheRow) {
@@ -502,6 +515,18 @@ TEST_F(FetchingAValue, WhoseFileVanishedBehindTheStoreIsTheErrorOfReading) {
   EXPECT_TRUE(isA<FileUtilsIoException>(fetched->failure)) << told(fetched);
   EXPECT_THAT(told(fetched), testing::HasSubstr("Could not open file"));
   EXPECT_THAT(store->getAllKeys(), ElementsAre("key"));
+}
+
+TEST_F(FetchingAValue, WhoseFileIsAFifoIsTheErrorOfReadingUntilTheKeyIsRemoved) {
+  const test::Watchdog watchdog(10);
+  open();
+  put("key", "value");
+  std::filesystem::remove(pathOf("key"));
+  ASSERT_EQ(mkfifo(pathOf("key").c_str(), 0600), 0);
+  EXPECT_THAT(get("key"), testing::HasSubstr("Could not seek to end of file: Illegal seek"));
+  EXPECT_EQ(drop("key"), "<done>");
+  put("key", "other");
+  EXPECT_EQ(get("key"), "other");
 }
 
 TEST_F(FetchingAValue, WhoseFileIsTakenByALaterRemovalIsAMiss) {

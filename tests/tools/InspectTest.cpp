@@ -1,5 +1,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <filesystem>
 #include <nlohmann/json.hpp>
@@ -8,11 +9,13 @@
 #include <vector>
 
 #include "Console.h"
+#include "InputError.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"
 #include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
+#include "support/Watchdog.h"
 #include "tools/StoredData.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -235,6 +238,22 @@ TEST_F(Inspecting, GoesOnBesideADamagedManifest) {
   EXPECT_EQ(thumbs.fileBytes, 160U);
   EXPECT_EQ(storeIn(survey, kDrafts).items, 1U);
   EXPECT_THAT(text(), HasSubstr("thumbs_250_v1: the manifest is damaged: "));
+}
+
+TEST_F(Inspecting, WaitsForNoFifoInThePlaceOfAttributesOrALog) {
+  const test::Watchdog watchdog(20);
+  makeRoot();
+  ASSERT_EQ(mkfifo(data_.path(kWeb + "/_cellar_extended_attributes").c_str(), 0600), 0);
+  EXPECT_EQ(storeIn(look(), kWeb).recordedBytes, std::nullopt);
+  const std::string log = data_.path(kThumbs + "/manifest_v1.sqlite-wal");
+  std::filesystem::remove(log);
+  ASSERT_EQ(mkfifo(log.c_str(), 0600), 0);
+  try {
+    look();
+    FAIL();
+  } catch (const InputError& error) {
+    EXPECT_EQ(error.what(), "cannot read '" + log + "': not a regular file");
+  }
 }
 
 TEST_F(Inspecting, KeepsKeysOfAnyBytesInTheirPlace) {

@@ -30,9 +30,10 @@ int openUntouched(const std::string& path, int flags) {
   return file >= 0 || errno != EPERM ? file : open(path.c_str(), flags | O_RDONLY | O_CLOEXEC);
 }
 
+// Opens without waiting for the other end of a fifo.
 class Descriptor {
  public:
-  explicit Descriptor(const std::string& path) : file_(openUntouched(path, 0)) {
+  explicit Descriptor(const std::string& path) : file_(openUntouched(path, O_NONBLOCK)) {
     if (file_ < 0) fail(path);
   }
   ~Descriptor() { close(file_); }
@@ -40,6 +41,11 @@ class Descriptor {
   Descriptor& operator=(const Descriptor&) = delete;
 
   int get() const { return file_; }
+
+  bool isRegularFile() const {
+    struct stat status = {};
+    return fstat(file_, &status) == 0 && S_ISREG(status.st_mode);
+  }
 
  private:
   const int file_;
@@ -92,6 +98,7 @@ std::uint64_t allocatedBy(const std::string& path) {
 
 std::vector<unsigned char> UntouchedFiles::readFile(const std::string& path) {
   const Descriptor file(path);
+  if (!file.isRegularFile()) throw FileUtilsIoException(EINVAL, "cannot read '" + path + "': not a regular file");
   std::vector<unsigned char> bytes;
   constexpr std::size_t step = std::size_t{1} << 16U;
   for (std::size_t size = 0;;) {
