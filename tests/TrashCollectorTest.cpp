@@ -23,27 +23,19 @@
 #include <vector>
 
 #include "host/testing/FaultyFileUtils.h"
-#include "host/testing/ManualQueue.h"
-#include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
-#include "support/LogCapture.h"
-#include "support/TemporaryDirectory.h"
+#include "support/TrashFixture.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using std::string;
 using test::FaultyFileUtils;
-using test::LoggedEvent;
-using test::ManualQueueFactory;
+using test::ioFailure;
 using test::Operation;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::UnorderedElementsAre;
-
-string ioFailure(int code, const string& text) {
-  return "domain: QZLarderIoErrorErrorDomain; code: " + std::to_string(code) + "; description: " + text + " .";
-}
 
 string hexadecimal(std::uint64_t number) {
   char text[17];
@@ -53,60 +45,7 @@ string hexadecimal(std::uint64_t number) {
 
 bool acceptAll(const string&) { return true; }
 
-class TrashCollectorTest : public testing::Test {
- protected:
-  std::shared_ptr<TrashCollector> makeCollector(const std::shared_ptr<FileUtils>& files) {
-    return std::make_shared<TrashCollector>(trashPath(), files, test::recordingReporter(events_), queues_);
-  }
-
-  std::shared_ptr<TrashCollector> makeCollectorWithoutQueue() {
-    return std::make_shared<TrashCollector>(trashPath(), files_, test::recordingReporter(events_), nullptr);
-  }
-
-  string trashPath() const { return directory_.file("cache/trash"); }
-
-  // The names in the trash; none when there is no trash directory.
-  std::vector<string> trashed() const {
-    return directory_.exists("cache/trash") ? directory_.names("cache/trash") : std::vector<string>();
-  }
-
-  // A directory that holds two files.
-  string makeTree(const string& name) const {
-    directory_.write(name + "/one", "1");
-    directory_.write(name + "/two", "2");
-    return directory_.file(name);
-  }
-
-  string link(const string& name, const string& target) const {
-    std::filesystem::create_directories(std::filesystem::path(directory_.file(name)).parent_path());
-    std::filesystem::create_symlink(target, directory_.file(name));
-    return directory_.file(name);
-  }
-
-  // Empties the trash while the collector's queue runs what it is given, as a queue with a thread of its own would.
-  void empty() {
-    const auto queue = queues_->queue(0);
-    queue->onDispatch = [raw = queue.get()] { raw->runAll(); };
-    collector_->emptyAllTrash();
-    queue->onDispatch = nullptr;
-  }
-
-  JsonValue onlyEvent() const {
-    const std::vector<LoggedEvent> all = events_->events();
-    if (all.size() != 1) throw std::runtime_error("expected one event, got " + std::to_string(all.size()));
-    EXPECT_EQ(all[0].name, "qztrash_collector");
-    return all[0].json();
-  }
-
-  std::uint64_t reportedCount() const { return onlyEvent().at("file_count").get<std::uint64_t>(); }
-
-  test::TemporaryDirectory directory_;
-  std::shared_ptr<FaultyFileUtils> files_ = std::make_shared<FaultyFileUtils>();
-  std::shared_ptr<test::EventLog> events_ = std::make_shared<test::EventLog>();
-  std::shared_ptr<ManualQueueFactory> queues_ = std::make_shared<ManualQueueFactory>();
-  std::shared_ptr<TrashCollector> collector_ = makeCollector(files_);
-  test::LogCapture log_;
-};
+class TrashCollectorTest : public test::TrashFixture {};
 
 // Collecting from within a pass, by a file layer that does so, on a queue that runs tasks at once.
 
