@@ -22,6 +22,7 @@
 #include "TrashCollector.h"
 #include "host/DirectoryPathLocations.h"
 #include "host/FileNames.h"
+#include "host/RootLock.h"
 #include "host/ThreadQueueFactory.h"
 
 namespace velmora::mobile::xplat::cellar::host {
@@ -46,9 +47,11 @@ std::shared_ptr<const Configuration> readConfiguration(const std::string& json) 
   return configuration;
 }
 
-std::string checkedRoot(std::string root) {
-  if (root.empty()) throw std::invalid_argument("A host needs a root directory.");
-  return root;
+std::unique_ptr<const RootLock> lockRoot(const HostOptions& options, FileUtils& fileUtils) {
+  if (options.root.empty()) throw std::invalid_argument("A host needs a root directory.");
+  if (!options.lockRoot) return nullptr;
+  fileUtils.createDirectory(options.root, true);
+  return std::make_unique<const RootLock>(options.root);
 }
 
 std::string nameOfSession(const std::string& sessionKey) {
@@ -117,7 +120,8 @@ class Host::Ending {
 Host::Host(HostOptions options)
     : configuration_(readConfiguration(options.configuration)),
       fileUtils_(options.fileUtils ? options.fileUtils : std::make_shared<FileUtils>()),
-      locations_(std::make_shared<DirectoryPathLocations>(checkedRoot(options.root))),
+      rootLock_(lockRoot(options, *fileUtils_)),
+      locations_(std::make_shared<DirectoryPathLocations>(options.root)),
       nameBuilders_(std::make_shared<StoreDirectoryNameBuilderFactory>(options.versionTag, options.localeSecondTag,
                                                                        options.localeFirstTag)),
       sessionTagMapper_(options.sessionTagMapper ? options.sessionTagMapper : nameOfSession),

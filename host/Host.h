@@ -30,6 +30,7 @@ struct PathLocations;
 
 namespace host {
 
+class RootLock;
 class ThreadQueueFactory;
 
 // What a host is built from. The first two are required.
@@ -54,6 +55,10 @@ struct HostOptions {
 
   std::shared_ptr<FileUtils> fileUtils;                // null: the real file system
   std::shared_ptr<TaskQueueFactory> taskQueueFactory;  // null: threads of the host's own
+
+  // Whether the host keeps its root to itself for as long as it lives, by a `RootLock`. Without the lock it is up to
+  // you that no other host uses the root meanwhile, in this process or another: they would lose each other's values.
+  bool lockRoot = true;
 };
 
 // Everything that an application needs to use the library, built in one go:
@@ -64,7 +69,8 @@ struct HostOptions {
 //   auto letters = host.store<PersistentKeyValueStore>("letters", "session-42");
 //   host.logOut();
 //
-// Under the root: "caches", "documents", "shared" (the areas) and "trash". Any thread may call.
+// Under the root: "caches", "documents", "shared" (the areas), "trash" and the lock file "_cellar_lock". One host at a
+// time may use a root, in all processes together. Any thread may call.
 //
 // Sessions: one at a time. The first request that gives a session key opens that session, a request without one for a
 // session-scoped manager opens the session "", and requests without a key mean the open one. Asking for another session
@@ -72,14 +78,17 @@ struct HostOptions {
 // without session scope ignore keys.
 //
 // Destroying the host loses no data: work that waits for the lazy delay is dropped, what is queued is finished, then
-// the host's own threads end. Managers and stores that are still held do no work from then on: their futures are broken
-// promises. Queues that came with the options are not waited for. The destructor may run on one of the host's own
-// queues, and then waits for nothing.
+// the host's own threads end, and another host may use the root. Managers and stores that are still held do no work
+// from then on: their futures are broken promises. Queues that came with the options are not waited for: have them done
+// before another host uses the root. The destructor may run on one of the host's own queues, and then waits for
+// nothing.
 class CELLAR_EXPORT Host : public session::Invalidatable {
  public:
   // Throws what `Configuration` throws; `ConfigurationException` when two managers of one area are both session scoped
   // or both not (they would have one directory and clean up each other's stores); `std::invalid_argument` when the root
-  // is empty. Touches no disk: directories are created with the managers.
+  // is empty; `FileUtilsIoException` when the root cannot be created or locked, at once and with the owner's process id
+  // when another host uses it (code `EWOULDBLOCK`). Creates the root and its lock file; all other directories are
+  // created with the managers. Without `lockRoot` it touches no disk.
   explicit Host(HostOptions options);
   Host(const std::string& configuration, const std::string& root);
   ~Host() override;
@@ -143,6 +152,7 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
 
   const std::shared_ptr<const Configuration> configuration_;
   const std::shared_ptr<FileUtils> fileUtils_;
+  const std::unique_ptr<const RootLock> rootLock_;  // null when it is not wanted; released after all that follows
   const std::shared_ptr<PathLocations> locations_;
   const std::shared_ptr<StoreDirectoryNameBuilderFactory> nameBuilders_;
   const std::function<std::string(const std::string&)> sessionTagMapper_;

@@ -1,6 +1,7 @@
 #include "host/Host.h"
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
@@ -100,9 +101,19 @@ class HostTest : public testing::Test {
     return "no error";
   }
 
-  static std::string descriptionOfStarting(const std::string& configuration) {
+  // The code of the file error that asking for it ends in; -1 for none.
+  template <class Request> static int codeOf(const Request& request) {
     try {
-      const Host host(configuration, "/nowhere");
+      request();
+    } catch (const FileUtilsIoException& error) {
+      return error.code();
+    }
+    return -1;
+  }
+
+  std::string descriptionOfStarting(const std::string& configuration) const {
+    try {
+      const Host host(configuration, directory.path());
     } catch (const LarderException& error) {
       return error.description();
     }
@@ -127,9 +138,69 @@ TEST_F(HostTest, TagsArePartOfTheNamesOfStores) {
   EXPECT_EQ(host->store<UnmanagedStore>("pages")->path, directory.file("caches/_sessionlessStore/pages_en_US_v3"));
 }
 
-TEST_F(HostTest, StartingTouchesNoDisk) {
-  const auto host = start();
+TEST_F(HostTest, StartingCreatesTheRootWithItsLockAndNothingElse) {
+  HostOptions fresh = options();
+  fresh.root = directory.file("data/storage");
+  const Host host(std::move(fresh));
+  EXPECT_EQ(directory.names("data/storage"), std::vector<std::string>{"_cellar_lock"});
+}
+
+TEST_F(HostTest, StartingWithoutTheLockTouchesNoDisk) {
+  HostOptions unlocked = options();
+  unlocked.lockRoot = false;
+  const Host host(std::move(unlocked));
   EXPECT_TRUE(directory.names().empty());
+}
+
+TEST_F(HostTest, ARootThatCannotBeCreatedThrows) {
+  directory.write("file", "not a directory");
+  HostOptions impossible = options();
+  impossible.root = directory.file("file/storage");
+  EXPECT_EQ(codeOf([&] { Host host(std::move(impossible)); }), 0);
+}
+
+// One host at a time
+
+TEST_F(HostTest, ASecondHostOnTheSameRootIsRefusedAndToldTheRootAndTheProcess) {
+  const auto host = start();
+  const std::string refusal = errorOf<FileUtilsIoException>([&] { start(); });
+  EXPECT_NE(refusal.find("Root '" + directory.path() + "' is in use by process " + std::to_string(::getpid()) + "."),
+            std::string::npos)
+      << refusal;
+  EXPECT_TRUE(host->manager("media")->isValid());
+}
+
+TEST_F(HostTest, AHostThatIsGoneLeavesItsRootToTheNext) {
+  auto host = start();
+  const auto held = host->store<UnmanagedStore>("thumbs");
+  host.reset();
+  host = start();
+  EXPECT_TRUE(host->manager("media")->isValid());
+}
+
+TEST_F(HostTest, AHostWhoseConfigurationIsRefusedLeavesItsRootToTheNext) {
+  EXPECT_THROW(Host("{", directory.path()), JsonValue::parse_error);
+  EXPECT_THROW(Host(R"({"a": {}, "b": {}})", directory.path()), ConfigurationException);
+  EXPECT_TRUE(start()->manager("media")->isValid());
+}
+
+TEST_F(HostTest, HostsWithoutTheLockMayShareARoot) {
+  HostOptions unlocked = options();
+  unlocked.lockRoot = false;
+  const Host other(std::move(unlocked));
+  const auto host = start();
+  EXPECT_TRUE(host->manager("media")->isValid());
+}
+
+TEST_F(HostTest, OfManyHostsThatAreOpenedAtOnceOneGetsTheRootAndTheOthersLearnWhose) {
+  const std::string owner = "is in use by process " + std::to_string(::getpid()) + ".";
+  std::vector<std::unique_ptr<Host>> hosts(8);
+  std::atomic<int> refused{0};
+  runOnThreads(hosts.size(), [&](std::size_t i) {
+    const std::string refusal = errorOf<FileUtilsIoException>([&] { hosts[i] = start(); });
+    if (refusal.find(owner) != std::string::npos) ++refused;
+  });
+  EXPECT_EQ(refused, 7);
 }
 
 TEST_F(HostTest, EveryRequestGetsTheSameManagerAndTheSameStore) {
@@ -667,6 +738,7 @@ TEST_F(HostTest, WorkThatIsStuckIsLeftBehindAfterThePatience) {
   EXPECT_EQ(log.messages(),
             std::vector<std::string>{"Host is destroyed while its queues are at work, their threads are left behind."});
   EXPECT_FALSE(over->isOpen());
+  EXPECT_TRUE(start()->manager("media")->isValid());  // they do not keep the root
   gate->countDown();
   over->wait();
 }

@@ -106,6 +106,12 @@ TEST_F(LayoutTest, OfSomethingElseIsAnInputErrorThatSaysWhy) {
             "ROOT '" + data_.path("pictures/2023/sunrise.jpg") + "' is not a directory");
 }
 
+TEST_F(LayoutTest, OfARootInWhichNothingWasAskedForHasNothing) {
+  data_.putFile("_cellar_lock", "");
+  EXPECT_THAT(found(), IsEmpty());
+  EXPECT_EQ(layout_.kind, Layout::Kind::Root);
+}
+
 TEST_F(LayoutTest, FollowsNoLinksBelowTheRoot) {
   data_.makeStore("caches/_sessionlessStore/thumbs_v1");
   std::filesystem::create_directory_symlink(data_.path("caches/_sessionlessStore/thumbs_v1"),

@@ -9,6 +9,7 @@
 #include "LarderException.h"
 #include "ManifestSnapshot.h"
 #include "StoreManagerImplCommon.h"
+#include "host/RootLock.h"
 #include "storage/UntouchedFiles.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -119,8 +120,14 @@ class Finder {
     }
   }
 
+  // A host that was opened and asked for nothing has left its lock file only.
+  static bool holdsLock(const std::string& root) {
+    std::error_code ignored;
+    return fs::is_regular_file(fs::symlink_status(in(root, host::RootLock::fileName), ignored));
+  }
+
   void findAreas(const std::string& root) {
-    bool isRoot = false;
+    bool isRoot = holdsLock(root);
     for (const std::string& name : directoriesIn(root)) {
       const std::string path = in(root, name);
       if (name == kTrash) {

@@ -1,0 +1,120 @@
+#include "host/RootLock.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <chrono>
+#include <csignal>
+#include <cstdlib>
+#include <system_error>
+#include <thread>
+
+#include "LarderException.h"
+
+namespace velmora::mobile::xplat::cellar::host {
+
+namespace {
+
+constexpr mode_t kMode = 0664;  // less the umask
+
+// An owner writes its process id right after it has the lock: whoever comes in between looks again, this often.
+constexpr int kLooks = 20;
+constexpr std::chrono::milliseconds kBetweenLooks(1);
+
+[[noreturn]] void fail(const std::string& path, int code, const std::string& reason) {
+  throw FileUtilsIoException(code, "Could not lock \"" + path + "\": " + reason);
+}
+
+[[noreturn]] void failWithErrno(const std::string& path) {
+  const int error = errno;
+  fail(path, error, std::generic_category().message(error));
+}
+
+std::string inDirectory(const std::string& directory, const std::string& name) {
+  return directory.empty() || directory.back() == '/' ? directory + name : directory + "/" + name;
+}
+
+}  // namespace
+
+// The lock file, open.
+class RootLock::File {
+ public:
+  explicit File(const std::string& path) : path_(path), descriptor_(open(path)) {}
+  ~File() { (void)::close(descriptor_); }
+  File(const File&) = delete;
+  File& operator=(const File&) = delete;
+
+  void requireRegular() const {
+    struct stat status {};
+    if (::fstat(descriptor_, &status) != 0) failWithErrno(path_);
+    if (!S_ISREG(status.st_mode)) fail(path_, 0, "not a regular file");
+  }
+
+  // False when somebody else has the lock.
+  bool tryLock() const {
+    while (::flock(descriptor_, LOCK_EX | LOCK_NB) != 0) {
+      if (errno == EWOULDBLOCK) return false;
+      if (errno != EINTR) failWithErrno(path_);
+    }
+    return true;
+  }
+
+  // For all who share the open file: closing it would not do while a child has it, too.
+  void unlock() const { (void)::flock(descriptor_, LOCK_UN); }
+
+  // 0 when none is written, or one that has ended without taking its number along.
+  pid_t livingOwner() const {
+    std::array<char, 32> text{};
+    if (::pread(descriptor_, text.data(), text.size() - 1, 0) <= 0) return 0;
+    const auto owner = static_cast<pid_t>(std::strtol(text.data(), nullptr, 10));
+    const bool isAlive = owner > 0 && (::kill(owner, 0) == 0 || errno != ESRCH);
+    return isAlive ? owner : 0;
+  }
+
+  // Read by those who are refused only, so it does not matter if it fails, on a full disk for example.
+  void writeOwner(const std::string& text) const {
+    if (::ftruncate(descriptor_, 0) != 0) return;
+    (void)!::pwrite(descriptor_, text.data(), text.size(), 0);
+  }
+
+ private:
+  // Does not block, whatever has that name: a fifo is opened at both ends, and a link is refused.
+  static int open(const std::string& path) {
+    constexpr int flags = O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY;
+    const int descriptor = ::open(path.c_str(), flags, kMode);
+    if (descriptor < 0) failWithErrno(path);
+    return descriptor;
+  }
+
+  const std::string path_;
+  const int descriptor_;
+};
+
+const std::string RootLock::fileName = "_cellar_lock";
+
+RootLock::RootLock(const std::string& root)
+    : owner_(::getpid()), file_(std::make_unique<const File>(inDirectory(root, fileName))) {
+  file_->requireRegular();
+  for (int look = 1; !file_->tryLock(); ++look) {
+    const pid_t owner = file_->livingOwner();
+    if (owner == 0 && look < kLooks) {
+      std::this_thread::sleep_for(kBetweenLooks);
+      continue;
+    }
+    const std::string who = owner == 0 ? "another process" : "process " + std::to_string(owner);
+    throw FileUtilsIoException(EWOULDBLOCK, "Root '" + root + "' is in use by " + who + ".");
+  }
+  file_->writeOwner(std::to_string(owner_) + "\n");
+}
+
+RootLock::~RootLock() {
+  if (::getpid() != owner_) return;
+  file_->writeOwner("");
+  file_->unlock();
+}
+
+}  // namespace velmora::mobile::xplat::cellar::host
