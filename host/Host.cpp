@@ -2,9 +2,6 @@
 
 #include <glog/logging.h>
 
-#include <algorithm>
-#include <exception>
-#include <future>
 #include <map>
 #include <stdexcept>
 #include <utility>
@@ -76,7 +73,11 @@ HostOptions plainOptions(const std::string& configuration, const std::string& ro
 // on a store's queue that waited here would be waited for by the end of that store.
 class Host::Request {
  public:
-  Request(Host& host, Scope& scope) : host_(host), scope_(scope) {
+  // Throws for a name that the configuration does not have.
+  Request(Host& host, const std::string& managerName)
+      : definition(host.configuration_->getManager(managerName)),
+        host_(host),
+        scope_(definition->sessionScoped ? host.sessionScoped_ : host.sessionless_) {
     const std::lock_guard<std::mutex> lock(host_.mutex_);
     if (scope_.isEnding) throw InvalidatedException("The managers are being invalidated.");
     ++scope_.requests;
@@ -88,6 +89,13 @@ class Host::Request {
   }
   Request(const Request&) = delete;
   Request& operator=(const Request&) = delete;
+
+  Slot& slot() const {
+    const std::lock_guard<std::mutex> lock(host_.mutex_);
+    return scope_.managers[definition->name];
+  }
+
+  const std::shared_ptr<const StoreManagerDefinition> definition;
 
  private:
   Host& host_;
@@ -135,9 +143,7 @@ Host::Host(HostOptions options)
       attributes_(std::make_shared<AttributeStore>(fileUtils_)),
       sizes_(std::make_shared<DiskSizeCalculator>(fileUtils_, attributes_, analytics_)),
       lazyWork_(LazyDispatcher::createLazyDispatcher(taskQueueFactory_, options.lazyDelaySeconds)),
-      measuringQueue_(taskQueueFactory_->createWorkQueue()),
-      sessionScoped_{createFactory(true)},
-      sessionless_{createFactory(false)} {
+      measuringQueue_(taskQueueFactory_->createWorkQueue()) {
   sizes_->exclude(AttributeStore::fileName);
   sizes_->setAnalytics(analytics_ != nullptr);
 }
@@ -155,18 +161,8 @@ Host::~Host() {
   }
 }
 
-std::shared_ptr<StoreManagerFactory> Host::createFactory(bool servesSessionScoped) const {
-  return std::make_shared<StoreManagerFactory>(servesSessionScoped, analytics_, attributes_, configuration_, sizes_,
-                                               fileUtils_, lazyWork_, locations_, nameBuilders_, taskQueueFactory_,
-                                               trash_, sessionTagMapper_);
-}
-
 std::shared_ptr<StoreManager> Host::manager(const std::string& name, const std::optional<std::string>& sessionKey) {
-  const bool isSessionScoped = configuration_->getManager(name)->sessionScoped;
-  Scope& scope = isSessionScoped ? sessionScoped_ : sessionless_;
-  const Request request(*this, scope);
-  const std::string session = isSessionScoped ? openSession(sessionKey) : "";
-  return remember(scope.factory->managerForIdentifier(name, session, runMaintenance_), scope);
+  return managerIn(Request(*this, name), sessionKey);
 }
 
 std::shared_ptr<StoreManager> Host::managerOfStore(const std::string& storeIdentifier,
@@ -174,25 +170,45 @@ std::shared_ptr<StoreManager> Host::managerOfStore(const std::string& storeIdent
   return manager(configuration_->getStore(storeIdentifier)->managerName, sessionKey);
 }
 
+std::shared_ptr<Store> Host::getStore(const std::string& identifier, const std::optional<std::string>& sessionKey) {
+  const Request request(*this, configuration_->getStore(identifier)->managerName);
+  auto store = managerIn(request, sessionKey)->getStoreImpl(identifier, PruneStrategyIdentifier::Null);
+  if (store == nullptr) throw InvalidatedException("The manager of store '" + identifier + "' has been invalidated.");
+  return store;
+}
+
+std::shared_ptr<StoreManager> Host::managerIn(const Request& request, const std::optional<std::string>& sessionKey) {
+  const std::string session = request.definition->sessionScoped ? openSession(sessionKey) : "";
+  Slot& slot = request.slot();
+  const std::lock_guard<std::mutex> lock(slot.mutex);
+  if (slot.manager == nullptr) slot.manager = build(*request.definition, session);
+  return slot.manager;
+}
+
+// By a factory of its own: one that has failed to build a manager never builds it again.
+std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definition, const std::string& sessionKey) {
+  StoreManagerFactory factory(definition.sessionScoped, analytics_, attributes_, configuration_, sizes_, fileUtils_,
+                              lazyWork_, locations_, nameBuilders_, taskQueueFactory_, trash_, sessionTagMapper_);
+  auto manager = factory.managerForIdentifier(definition.name, sessionKey, runMaintenance_);
+  manager->retryFailedCreations();
+  // It has registered the directories of its unmanaged stores; measuring them is nobody else's task.
+  lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
+  return manager;
+}
+
 std::string Host::openSession(const std::optional<std::string>& sessionKey) {
-  const std::lock_guard<std::mutex> lock(mutex_);
-  if (!openSession_) openSession_ = sessionKey.value_or("");
+  std::unique_lock<std::mutex> lock(mutex_);
+  if (!openSession_) {
+    const std::string key = sessionKey.value_or("");
+    lock.unlock();
+    (void)sessionTagMapper_(key);  // throws for a key that cannot name a directory: it opens no session
+    lock.lock();
+    if (!openSession_) openSession_ = key;
+  }
   if (sessionKey && *sessionKey != *openSession_) {
     throw std::logic_error("Another session is open, log out before you ask for a new one.");
   }
   return *openSession_;
-}
-
-std::shared_ptr<StoreManager> Host::remember(std::shared_ptr<StoreManager> manager, Scope& scope) {
-  {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    auto& known = scope.handedOut;
-    if (std::find(known.begin(), known.end(), manager) != known.end()) return manager;
-    known.push_back(manager);
-  }
-  // A new manager has registered the directories of its unmanaged stores; measuring them is nobody else's task.
-  lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
-  return manager;
 }
 
 void Host::logOut() {
@@ -213,18 +229,12 @@ void Host::invalidate() {
   invalidateAll(sessionless_);
 }
 
+// Called while the scope is ending, so that nobody else uses its managers. One that throws is left to the next attempt.
 void Host::invalidateAll(Scope& scope) {
-  std::vector<std::shared_ptr<StoreManager>> managers;
-  {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    managers.swap(scope.handedOut);
+  for (auto& [name, slot] : scope.managers) {
+    if (slot.manager != nullptr) slot.manager->invalidate();
+    slot.manager = nullptr;
   }
-  try {
-    scope.factory->invalidate();
-  } catch (const std::future_error&) {
-    // A manager that could not be built stopped the factory on its way; its first caller knows why.
-  }
-  for (const auto& manager : managers) manager->invalidate();
 }
 
 void Host::trashSessionDirectories(const std::string& sessionKey) {

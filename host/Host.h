@@ -3,6 +3,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -24,9 +25,9 @@ class DiskSizeCalculator;
 class FileUtils;
 class LazyDispatcher;
 class StoreDirectoryNameBuilderFactory;
-class StoreManagerFactory;
 class TrashCollector;
 struct PathLocations;
+struct StoreManagerDefinition;
 
 namespace host {
 
@@ -96,8 +97,10 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   Host& operator=(const Host&) = delete;
 
   // The manager of that name, built on first request; never empty. Throws `ConfigurationException` when there is none,
-  // `std::logic_error` when another session is open, `InvalidatedException` while its scope is being ended, and what
-  // building it throws; when that has failed, later requests throw `std::future_error` until `logOut` or `invalidate`.
+  // `std::logic_error` when another session is open, `InvalidatedException` while its scope is being ended, what the
+  // mapper throws for a session's key, and what building the manager throws. A manager that could not be built is built
+  // by the next request, and nothing is discarded for it. Its stores, too, are created again after a failure
+  // (`StoreManager::retryFailedCreations`).
   std::shared_ptr<StoreManager> manager(const std::string& name,
                                         const std::optional<std::string>& sessionKey = std::nullopt);
 
@@ -105,13 +108,14 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   std::shared_ptr<StoreManager> managerOfStore(const std::string& storeIdentifier,
                                                const std::optional<std::string>& sessionKey = std::nullopt);
 
-  // The store of that identifier, of whichever manager, pruned in the order that its definition names. Throws as
-  // `manager`, what creating the store throws (later callers then wait without end), and `std::logic_error` when it is
-  // no `StoreType`. Empty only when the session ends at that moment.
+  // The store of that identifier, of whichever manager, pruned in the order that its definition names; never empty.
+  // Throws as `manager`, what creating the store throws, `std::logic_error` when it is not a `StoreType`, and
+  // `InvalidatedException` when you have invalidated its manager yourself. A store that could not be created, here or
+  // in the background, is created by the next request: nobody waits for it without end.
   template <class StoreType>
   std::shared_ptr<StoreType> store(const std::string& storeIdentifier,
                                    const std::optional<std::string>& sessionKey = std::nullopt) {
-    return managerOfStore(storeIdentifier, sessionKey)->template getStore<StoreType>(storeIdentifier);
+    return detail::storeAs<StoreType>(storeIdentifier, getStore(storeIdentifier, sessionKey));
   }
 
   // Ends the open session: its managers and stores become invalid and its directories go to the trash, those of
@@ -134,20 +138,25 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<LazyDispatcher>& lazyWork() const { return lazyWork_; }
 
  private:
-  // The managers of one scope, and who is asking for them. All but the factory is guarded by the mutex.
+  // One manager, null until it has been built.
+  struct Slot {
+    std::mutex mutex;  // guards the manager, and is held while it is built
+    std::shared_ptr<StoreManager> manager;
+  };
+  // The managers of one scope by name, and who is asking for them. All is guarded by the mutex of the host.
   struct Scope {
-    const std::shared_ptr<StoreManagerFactory> factory;
-    std::vector<std::shared_ptr<StoreManager>> handedOut{};
-    std::size_t requests = 0;  // under way
-    bool isEnding = false;     // and lets no further request in
+    std::map<std::string, Slot> managers{};  // grows only
+    std::size_t requests = 0;                // under way
+    bool isEnding = false;                   // and lets no further request in
   };
   class Request;
   class Ending;
 
-  std::shared_ptr<StoreManagerFactory> createFactory(bool servesSessionScoped) const;
+  std::shared_ptr<Store> getStore(const std::string& identifier, const std::optional<std::string>& sessionKey);
+  std::shared_ptr<StoreManager> managerIn(const Request& request, const std::optional<std::string>& sessionKey);
+  std::shared_ptr<StoreManager> build(const StoreManagerDefinition& definition, const std::string& sessionKey);
   std::string openSession(const std::optional<std::string>& sessionKey);
-  std::shared_ptr<StoreManager> remember(std::shared_ptr<StoreManager> manager, Scope& scope);
-  void invalidateAll(Scope& scope);
+  static void invalidateAll(Scope& scope);
   void trashSessionDirectories(const std::string& sessionKey);
 
   const std::shared_ptr<const Configuration> configuration_;

@@ -62,6 +62,8 @@ void StoreManager::invalidate() { impl_->invalidate(); }
 
 bool StoreManager::isValid() { return impl_->isValid(); }
 
+void StoreManager::retryFailedCreations() { impl_->retryFailedCreations(); }
+
 bool StoreManager::forceCleanseOnInit() {
   const std::lock_guard<std::mutex> lock(forceCleanseMutex);
   return forceCleanseAtStart;

@@ -20,7 +20,15 @@ class StoreManagerImpl;
 namespace detail {
 [[noreturn]] CELLAR_EXPORT void throwStoreTypeMismatch(const std::string& identifier, const std::type_info& wanted,
                                                        const Store& store);
+
+// The store, which may be null, as a store of that type. Throws `std::logic_error` for one of another type.
+template <class StoreType>
+std::shared_ptr<StoreType> storeAs(const std::string& identifier, const std::shared_ptr<Store>& store) {
+  auto typed = std::dynamic_pointer_cast<StoreType>(store);
+  if (store != nullptr && typed == nullptr) throwStoreTypeMismatch(identifier, typeid(StoreType), *store);
+  return typed;
 }
+}  // namespace detail
 
 // The host's handle on one manager: a directory of stores that are kept within their limits. Obtained from a
 // `StoreManagerFactory`. Any thread may call. Letting the last handle go loses no data and stops no write that is under
@@ -47,7 +55,7 @@ class CELLAR_EXPORT StoreManager {
   // The store of that identifier, created by the first call; concurrent callers wait for it. `strategy` counts only in
   // the call that creates a disk cache; `Null` takes what its definition names. Empty for an identifier that the
   // manager does not have (one error line) and once the manager is invalid. Throws what creating the store throws;
-  // later callers of that identifier then wait without end.
+  // later callers of that identifier then wait without end, unless `retryFailedCreations` was called.
   std::shared_ptr<Store> getStoreImpl(const std::string& identifier, PruneStrategyIdentifier strategy);
 
   // The same, as a store of that type. Empty only where `getStoreImpl` is; a store of another type throws
@@ -55,10 +63,7 @@ class CELLAR_EXPORT StoreManager {
   template <class StoreType>
   std::shared_ptr<StoreType> getStore(const std::string& identifier,
                                       PruneStrategyIdentifier strategy = PruneStrategyIdentifier::Null) {
-    const std::shared_ptr<Store> store = getStoreImpl(identifier, strategy);
-    auto typed = std::dynamic_pointer_cast<StoreType>(store);
-    if (store != nullptr && typed == nullptr) detail::throwStoreTypeMismatch(identifier, typeid(StoreType), *store);
-    return typed;
+    return detail::storeAs<StoreType>(identifier, getStoreImpl(identifier, strategy));
   }
 
   // A directory of the manager's for short-lived files: emptied whenever the manager is built.
@@ -73,6 +78,10 @@ class CELLAR_EXPORT StoreManager {
   void invalidate();
 
   bool isValid();
+
+  // From now on a store whose creation has failed, on request or in the background, is created again by the next
+  // request for it, and nobody waits for it without end.
+  void retryFailedCreations();
 
   // Whether managers built from now on discard their directories as they start. One flag for the process, off at first
   // and never reset by the library.

@@ -83,6 +83,8 @@ void StoreManagerImpl::measureNewUnmanagedStore(const std::string& identifier,
   });
 }
 
+void StoreManagerImpl::retryFailedCreations() { common_.retryFailedCreations(); }
+
 std::string StoreManagerImpl::getTemporaryDirectory() { return common_.getTemporaryDirectory(); }
 
 void StoreManagerImpl::trashStoreOnStartup(const std::string& identifier) { common_.trashStoreOnStartup(identifier); }

@@ -56,6 +56,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   std::shared_ptr<Store> getStoreImpl(const std::string& identifier, PruneStrategyIdentifier strategy);
 
   // As the common core's.
+  void retryFailedCreations();
   std::string getTemporaryDirectory();
   void trashStoreOnStartup(const std::string& identifier);
   void cleanupOldStores();

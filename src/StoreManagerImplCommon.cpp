@@ -50,25 +50,40 @@ std::shared_ptr<Store> StoreManagerImplCommon::getStore(const std::string& ident
   std::unique_lock<std::mutex> lock(mutex_);
   if (invalid_ || closed_) return nullptr;
   std::shared_ptr<Item>& slot = stores_[identifier];
-  if (slot != nullptr) {
-    const std::shared_ptr<Item> item = slot;
-    lock.unlock();
-    std::unique_lock<std::mutex> itemLock(item->mutex);
-    item->condition.wait(itemLock, [&item] { return item->getStore() != nullptr || item->isAbandoned; });
-    return item->getStore();
-  }
-  slot = std::make_shared<Item>();
+  const bool isNew = slot == nullptr;
+  if (isNew) slot = std::make_shared<Item>();
   const std::shared_ptr<Item> item = slot;
+  const bool retries = retriesFailedCreations_;
   lock.unlock();
+  if (!isNew) {
+    std::unique_lock<std::mutex> itemLock(item->mutex);
+    const auto mayBeCreated = [&] { return retries && item->hasFailed; };
+    item->condition.wait(itemLock, [&] { return item->getStore() != nullptr || item->isAbandoned || mayBeCreated(); });
+    if (!mayBeCreated()) return item->getStore();
+    item->hasFailed = false;  // this caller creates it now, and the others wait again
+  }
 
   created = true;
   try {
     return createStore(identifier, item, std::move(taskQueueFactory), std::move(trashCollector),
                        std::move(analyticsReporter), std::move(sizeChangedCallback), pruneStrategy);
   } catch (...) {
-    if (!isValid()) abandon(*item);
+    isValid() ? noteFailure(*item) : abandon(*item);
     throw;
   }
+}
+
+void StoreManagerImplCommon::retryFailedCreations() {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  retriesFailedCreations_ = true;
+}
+
+void StoreManagerImplCommon::noteFailure(Item& item) {
+  {
+    const std::lock_guard<std::mutex> lock(item.mutex);
+    item.hasFailed = item.getStore() == nullptr;
+  }
+  item.condition.notify_all();
 }
 
 // The directory has gone from under the creator. Whoever waits for the store gets what later callers get: none.

@@ -42,8 +42,9 @@ class CELLAR_EXPORT StoreManagerImplCommon {
     bool isPruning = false;              // a prune of the store is under way
     bool sizeReported = false;           // its first size has been reported
     bool isAbandoned = false;            // nobody need wait: creating failed beside an invalidation, or it is closed
+    bool hasFailed = false;              // the last attempt to create the store
     std::mutex mutex;                    // guards all of the above; held by the caller of the below
-    std::condition_variable condition;   // signalled when `store` has been set, or the item abandoned
+    std::condition_variable condition;   // signalled when `store` has been set, creating failed, or it is abandoned
 
     // The store, if it has been created and is still there.
     std::shared_ptr<Store> getStore() const { return store != nullptr ? store : storeOfOthers.lock(); }
@@ -61,12 +62,16 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   // The store of that identifier, created by the first caller while the others wait; `created` is set to true only in
   // the call that created it. Empty once the manager is invalid. What creating throws reaches the first caller, and
   // then later callers of that identifier wait without end (there is deliberately no timeout) unless the manager was
-  // being invalidated: they get an empty pointer then.
+  // being invalidated (they get an empty pointer then) or `retryFailedCreations` was called before.
   std::shared_ptr<Store> getStore(const std::string& identifier, std::shared_ptr<TaskQueueFactory> taskQueueFactory,
                                   std::shared_ptr<TrashCollector> trashCollector,
                                   std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
                                   std::function<void(unsigned int)> sizeChangedCallback,
                                   PruneStrategyIdentifier pruneStrategy, bool& created);
+
+  // From now on nobody waits for a store whose creation has failed: the next caller of `getStore`, or the next of those
+  // who wait already, creates it again.
+  void retryFailedCreations();
 
   // The slot of that identifier; empty when nobody has asked for the store or the manager is invalid.
   std::shared_ptr<Item> getExistingStore(const std::string& identifier);
@@ -127,6 +132,7 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   using StoreMap = std::unordered_map<std::string, std::shared_ptr<Item>>;
 
   static void abandon(Item& item);
+  static void noteFailure(Item& item);
   static std::shared_ptr<Store> leaveToOthers(Item& item);
   bool isClosed();
   bool isMarkedForTrashing(const std::string& storePath);
@@ -141,10 +147,11 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   const std::string managerPath_;
   const std::string temporaryDirectoryPath_;
 
-  std::mutex mutex_;  // guards the three below
+  std::mutex mutex_;  // guards the four below
   StoreMap stores_;   // by identifier; emptied by invalidation, which parts manager and stores
   bool invalid_ = false;
   bool closed_ = false;
+  bool retriesFailedCreations_ = false;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -289,6 +289,91 @@ TEST_F(StoreManagerImplCommonTest, AFailedCreationLeavesAnEmptySlotInWhichLaterC
   EXPECT_EQ(waitersStore, published);
 }
 
+TEST_F(StoreManagerImplCommonTest, AManagerThatRetriesCreatesWhatHasFailedOnTheNextRequest) {
+  int attempts = 0;
+  stores->onCreate = [&](const string&, const auto&) {
+    if (++attempts <= 2) throw FileUtilsIoException(EIO, "no luck");
+  };
+  build({{"a", fake("a")}});
+  bool created = false;
+  EXPECT_THROW(get("a", created), FileUtilsIoException);
+  common_->retryFailedCreations();  // what has failed before counts, too
+  created = false;
+  EXPECT_THROW(get("a", created), FileUtilsIoException);
+  EXPECT_TRUE(created);
+  created = false;
+  const auto store = get("a", created);
+  EXPECT_NE(store, nullptr);
+  EXPECT_TRUE(created);
+  created = false;
+  EXPECT_EQ(get("a", created), store);
+  EXPECT_FALSE(created);
+  EXPECT_EQ(attempts, 3);
+}
+
+TEST_F(StoreManagerImplCommonTest, AManagerThatRetriesThrowsForAnUnknownIdentifierEachTime) {
+  build({});
+  common_->retryFailedCreations();
+  for (int i = 0; i < 2; ++i) EXPECT_THROW(get("b"), std::logic_error);
+}
+
+TEST_F(StoreManagerImplCommonTest, OfThoseWhoWaitForACreationThatFailsOneTriesAgainAndTheOthersGetItsStore) {
+  Latch creating(1);
+  Latch release(1);
+  std::atomic<int> attempts{0};
+  stores->onCreate = [&](const string&, const auto&) {
+    if (++attempts > 1) return;
+    creating.countDown();
+    release.wait();
+    throw FileUtilsIoException(EIO, "no luck");
+  };
+  build({{"a", fake("a")}});
+  common_->retryFailedCreations();
+  bool failed = false;
+  std::thread creator([&] {
+    try {
+      get("a");
+    } catch (const FileUtilsIoException&) {
+      failed = true;
+    }
+  });
+  creating.wait();
+  const auto item = common_->getExistingStore("a");
+  std::vector<std::shared_ptr<Store>> waitersStores(3);
+  std::vector<std::thread> waiters;
+  for (auto& waitersStore : waitersStores) {
+    const long holders = item.use_count();
+    waiters.emplace_back([&] { waitersStore = get("a"); });
+    waitForAnotherHolder(item, holders);
+  }
+  release.countDown();
+  creator.join();
+  for (std::thread& waiter : waiters) waiter.join();
+  EXPECT_TRUE(failed);
+  EXPECT_EQ(attempts, 2);
+  ASSERT_NE(waitersStores[0], nullptr);
+  for (const auto& waitersStore : waitersStores) EXPECT_EQ(waitersStore, waitersStores[0]);
+}
+
+TEST_F(StoreManagerImplCommonTest, ACallerThatWaitsWithoutEndGetsTheStoreThatALaterOneCreates) {
+  std::atomic<int> attempts{0};
+  stores->onCreate = [&](const string&, const auto&) {
+    if (++attempts == 1) throw FileUtilsIoException(EIO, "no luck");
+  };
+  build({{"a", fake("a")}});
+  EXPECT_THROW(get("a"), FileUtilsIoException);
+  const auto item = common_->getExistingStore("a");
+  const long holders = item.use_count();
+  std::shared_ptr<Store> waitersStore;
+  std::thread waiter([&] { waitersStore = get("a"); });
+  waitForAnotherHolder(item, holders);
+  common_->retryFailedCreations();
+  const auto store = get("a");
+  waiter.join();
+  EXPECT_NE(store, nullptr);
+  EXPECT_EQ(waitersStore, store);
+}
+
 TEST_F(StoreManagerImplCommonTest, WhatTheDefinitionThrowsReachesTheCreator) {
   stores->onCreate = [](const string& name, const auto&) {
     if (name == "io") throw FileUtilsIoException(EIO, "no luck");

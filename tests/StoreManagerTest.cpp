@@ -383,6 +383,17 @@ TEST_F(StoreManagerTest, TypedAccessAsAnotherTypeNamesTheStoreAndBothTypes) {
   EXPECT_NE(manager_->getStore<UnmanagedStore>("id"), nullptr);
 }
 
+TEST_F(StoreManagerTest, AStoreWhoseCreationFailedIsCreatedAgainWhereThatIsWanted) {
+  build({{"a", fake("a")}});
+  manager_->retryFailedCreations();
+  files->failPath(Operation::CreateDirectory, managerPath() + "/a_250_v1", ENOSPC);
+  for (int i = 0; i < 2; ++i) {
+    EXPECT_THROW(manager_->getStoreImpl("a", PruneStrategyIdentifier::Null), FileUtilsIoException);
+  }
+  files->heal();
+  EXPECT_NE(manager_->getStoreImpl("a", PruneStrategyIdentifier::Null), nullptr);
+}
+
 TEST_F(StoreManagerTest, TypedAccessIsEmptyWhereTheUntypedOneIs) {
   build({{"u", unmanaged("u")}});
   EXPECT_EQ(manager_->getStore<UnmanagedStore>("x"), nullptr);

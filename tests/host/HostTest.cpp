@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <chrono>
@@ -36,6 +37,7 @@
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 namespace {
@@ -47,8 +49,10 @@ using test::LogCapture;
 using test::ManualQueueFactory;
 using test::runOnThreads;
 using test::TemporaryDirectory;
+using test::Watchdog;
 
 constexpr std::chrono::hours kLongPatience(1);
+constexpr unsigned int kLongEnough = 60;  // seconds, for whatever does not hang
 constexpr long kHourInSeconds = 3600;
 
 const char* const kConfiguration = R"({
@@ -101,6 +105,13 @@ class HostTest : public testing::Test {
     return "no error";
   }
 
+  HostOptions optionsWith(std::shared_ptr<FileUtils> files, std::shared_ptr<TaskQueueFactory> queues = nullptr) const {
+    HostOptions faulty = options();
+    faulty.fileUtils = std::move(files);
+    faulty.taskQueueFactory = std::move(queues);
+    return faulty;
+  }
+
   // The code of the file error that asking for it ends in; -1 for none.
   template <class Request> static int codeOf(const Request& request) {
     try {
@@ -121,6 +132,7 @@ class HostTest : public testing::Test {
   }
 
   const TemporaryDirectory directory;
+  const std::string pathOfThumbs = directory.file("caches/_sessionlessStore/thumbs_250_v1");
 };
 
 // Getting started
@@ -275,17 +287,152 @@ TEST_F(HostTest, ManagersThatWouldShareADirectoryAreRefused) {
   EXPECT_EQ(descriptionOfStarting(R"({"a": {}, "b": {"session_scoped": false}, "c": {"area": "shared"}})"), "no error");
 }
 
-TEST_F(HostTest, AFailureToBuildAManagerReachesTheCallerAndLogOutMakesRoomForAnotherTry) {
-  auto files = std::make_shared<FaultyFileUtils>();
-  HostOptions faulty = options();
-  faulty.fileUtils = files;
-  Host host(std::move(faulty));
-  files->failAlways(FaultyFileUtils::Operation::CreateDirectory, ENOSPC);
-  EXPECT_THROW(host.manager("inbox"), FileUtilsIoException);
+// Creation that fails
+
+TEST_F(HostTest, AStoreThatCouldNotBeCreatedIsCreatedByTheNextRequest) {
+  const Watchdog watchdog(kLongEnough);
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  files->failPath(FaultyFileUtils::Operation::CreateDirectory, pathOfThumbs, ENOSPC);
+  for (int i = 0; i < 2; ++i) EXPECT_EQ(codeOf([&] { host.store<Store>("thumbs"); }), ENOSPC);
   files->heal();
-  EXPECT_THROW(host.manager("inbox"), std::future_error);
-  host.logOut();
-  EXPECT_TRUE(host.manager("inbox")->isValid());
+  const auto thumbs = host.store<UnmanagedStore>("thumbs");
+  EXPECT_TRUE(directory.exists("caches/_sessionlessStore/thumbs_250_v1"));
+  EXPECT_EQ(host.manager("media")->getStore<UnmanagedStore>("thumbs"), thumbs);
+}
+
+TEST_F(HostTest, AStoreWithAFileInItsPlaceIsCreatedOnceTheFileIsGone) {
+  const Watchdog watchdog(kLongEnough);
+  const auto host = start();
+  const std::string file = directory.write("caches/_sessionlessStore/thumbs_250_v1", "not a directory");
+  for (int i = 0; i < 2; ++i) EXPECT_EQ(codeOf([&] { host->store<Store>("thumbs"); }), 0);
+  std::filesystem::remove(file);
+  EXPECT_EQ(host->store<UnmanagedStore>("thumbs")->path, file);
+}
+
+TEST_F(HostTest, AStoreWhoseCreationInTheBackgroundFailedUnnoticedIsCreatedOnRequest) {
+  const Watchdog watchdog(kLongEnough);
+  const LogCapture log;
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files, queues));
+  host.manager("media");
+  files->failPath(FaultyFileUtils::Operation::CreateDirectory, pathOfThumbs, EIO);
+  host.lazyWork()->dispatchNow();
+  queues->runAll();
+  EXPECT_TRUE(log.contains("Could not initialize store thumbs: "));
+  EXPECT_EQ(codeOf([&] { host.store<Store>("thumbs"); }), EIO);
+  files->heal();
+  EXPECT_NE(host.store<UnmanagedStore>("thumbs"), nullptr);
+}
+
+TEST_F(HostTest, TheBackgroundDoesNotWaitForAStoreThatFailedOnRequest) {
+  const Watchdog watchdog(kLongEnough);
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files, queues));
+  files->failPath(FaultyFileUtils::Operation::CreateDirectory, pathOfThumbs, EIO);
+  EXPECT_EQ(codeOf([&] { host.store<Store>("thumbs"); }), EIO);
+  files->heal();
+  host.lazyWork()->dispatchNow();
+  queues->runAll();
+  EXPECT_TRUE(directory.exists("caches/_sessionlessStore/thumbs_250_v1"));
+  EXPECT_TRUE(directory.exists("caches/_sessionlessStore/pages_en_US_v3"));
+}
+
+TEST_F(HostTest, OfManyThatAskForAStoreThatCannotBeCreatedEachGetsTheError) {
+  const Watchdog watchdog(kLongEnough);
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  host.manager("media");
+  files->failPath(FaultyFileUtils::Operation::CreateDirectory, pathOfThumbs, EIO);
+  std::atomic<int> failed{0};
+  runOnThreads(8, [&] {
+    if (codeOf([&] { host.store<Store>("thumbs"); }) == EIO) ++failed;
+  });
+  EXPECT_EQ(failed, 8);
+}
+
+TEST_F(HostTest, OfManyThatAskForAStoreOneMeetsThePassingErrorAndTheOthersGetTheStore) {
+  const Watchdog watchdog(kLongEnough);
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  host.manager("media");
+  files->failNext(FaultyFileUtils::Operation::CreateDirectory, EIO);
+  std::vector<std::shared_ptr<Store>> stores(8);
+  runOnThreads(8, [&](std::size_t i) {
+    try {
+      stores[i] = host.store<Store>("thumbs");
+    } catch (const FileUtilsIoException&) {
+    }
+  });
+  const auto thumbs = host.store<Store>("thumbs");
+  EXPECT_EQ(std::count(stores.begin(), stores.end(), thumbs), 7);
+}
+
+TEST_F(HostTest, AManagerThatCouldNotBeBuiltIsBuiltByTheNextRequestAndNothingIsDiscarded) {
+  start()->store<UnmanagedStore>("letters", "alice");
+  directory.write("caches/_store_alice/letters_v1/letter", "kept");
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  files->failAlways(FaultyFileUtils::Operation::CreateDirectory, ENOSPC);
+  for (int i = 0; i < 2; ++i) EXPECT_EQ(codeOf([&] { host.manager("inbox", "alice"); }), ENOSPC);
+  files->heal();
+  const auto inbox = host.manager("inbox", "alice");
+  EXPECT_TRUE(inbox->isValid());
+  EXPECT_EQ(host.manager("inbox"), inbox);
+  EXPECT_EQ(directory.read("caches/_store_alice/letters_v1/letter"), "kept");
+}
+
+TEST_F(HostTest, OfManyThatAskForAManagerThatCannotBeBuiltEachGetsTheError) {
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  files->failAlways(FaultyFileUtils::Operation::CreateDirectory, ENOSPC);
+  std::atomic<int> failed{0};
+  runOnThreads(8, [&] {
+    if (codeOf([&] { host.manager("media"); }) == ENOSPC) ++failed;
+  });
+  EXPECT_EQ(failed, 8);
+}
+
+TEST_F(HostTest, AKeyThatCannotNameADirectoryOpensNoSession) {
+  const auto host = start();
+  EXPECT_THROW(host->manager("inbox", std::string(300, 'x')), std::length_error);
+  EXPECT_TRUE(host->manager("inbox", "alice")->isValid());
+}
+
+TEST_F(HostTest, AfterARequestForAnUnknownNameLogOutAndInvalidateComplete) {
+  const Watchdog watchdog(kLongEnough);
+  const auto host = start();
+  const auto inbox = host->manager("inbox", "alice");
+  const auto media = host->manager("media");
+  EXPECT_THROW(host->manager("music"), ConfigurationException);
+  EXPECT_THROW(host->store<Store>("songs"), ConfigurationException);
+  host->logOut();
+  EXPECT_FALSE(inbox->isValid());
+  host->invalidate();
+  EXPECT_FALSE(media->isValid());
+}
+
+TEST_F(HostTest, AStoreIsNeverEmptyNotEvenThatOfAManagerThatSomebodyHasInvalidated) {
+  const auto host = start();
+  host->manager("media")->invalidate();
+  EXPECT_EQ(errorOf<InvalidatedException>([&] { host->store<Store>("thumbs"); }),
+            InvalidatedException("The manager of store 'thumbs' has been invalidated.").what());
+  host->invalidate();
+  EXPECT_NE(host->store<Store>("thumbs"), nullptr);
+}
+
+TEST_F(HostTest, AMapperIsAskedForTheNameOfTheSessionThatOpensAndForNoOther) {
+  HostOptions mapped = options();
+  mapped.sessionTagMapper = [](const std::string& key) {
+    if (key.empty()) throw std::invalid_argument("no key");
+    return "of-" + key;
+  };
+  Host host(std::move(mapped));
+  EXPECT_THROW(host.manager("inbox"), std::invalid_argument);
+  host.manager("inbox", "alice");
+  EXPECT_EQ(host.store<UnmanagedStore>("files")->path, directory.file("documents/_store_of-alice/files_v1"));
 }
 
 // Sessions
