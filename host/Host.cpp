@@ -60,6 +60,10 @@ std::shared_ptr<AnalyticsEventReporter> reporterFor(std::unique_ptr<XAnalytics> 
   return std::make_shared<AnalyticsEventReporter>(std::move(sink));
 }
 
+void refuseOnQueueThread(const std::string& operation) {
+  ThreadQueueFactory::refuseOnQueueThread(operation, "Use a thread of your own instead.");
+}
+
 HostOptions plainOptions(const std::string& configuration, const std::string& root) {
   HostOptions options;
   options.configuration = configuration;
@@ -212,6 +216,7 @@ std::string Host::openSession(const std::optional<std::string>& sessionKey) {
 }
 
 void Host::logOut() {
+  refuseOnQueueThread("Host::logOut");
   const Ending ending(*this, sessionScoped_);
   std::optional<std::string> session;
   {
@@ -224,6 +229,7 @@ void Host::logOut() {
 }
 
 void Host::invalidate() {
+  refuseOnQueueThread("Host::invalidate");
   logOut();
   const Ending ending(*this, sessionless_);
   invalidateAll(sessionless_);

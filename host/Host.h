@@ -121,7 +121,8 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   // Ends the open session: its managers and stores become invalid and its directories go to the trash, those of
   // managers that nobody has asked for included. The next request may open another session. Stores finish what they are
   // writing meanwhile, and requests for session-scoped managers are refused: must not be called on one of the stores'
-  // queues, nor in a callback that runs there. Not an error: no session is open.
+  // queues, nor in a callback that runs there. On the host kit's own threads it throws `std::logic_error`. Not an
+  // error: no session is open.
   void logOut();
 
   // Ends the open session and discards the data of the other managers that were asked for, too. As `logOut` otherwise.

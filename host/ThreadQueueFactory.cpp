@@ -14,6 +14,7 @@
 #include <map>
 #include <mutex>
 #include <optional>
+#include <stdexcept>
 #include <string>
 #include <thread>
 #include <unordered_map>
@@ -475,6 +476,11 @@ ThreadQueueFactory::~ThreadQueueFactory() {
 std::shared_ptr<AsyncExecutor> ThreadQueueFactory::createQueue() { return threads_->createQueue("file"); }
 
 std::shared_ptr<AsyncExecutor> ThreadQueueFactory::createWorkQueue() { return threads_->createQueue("work"); }
+
+void ThreadQueueFactory::refuseOnQueueThread(const std::string& operation, const std::string& advice) {
+  if (currentGroup == nullptr) return;
+  throw std::logic_error(operation + " may wait for itself on a thread of the host kit's queues. " + advice);
+}
 
 bool ThreadQueueFactory::drain(std::chrono::milliseconds patience) { return threads_->drain(patience); }
 

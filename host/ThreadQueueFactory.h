@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <memory>
+#include <string>
 
 #include <cellar/Export.h>
 #include <cellar/executor/TaskQueueFactory.h>
@@ -45,6 +46,10 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   // `std::system_error` when the system gives no thread.
   std::shared_ptr<AsyncExecutor> createQueue() override;
   std::shared_ptr<AsyncExecutor> createWorkQueue() override;
+
+  // Throws `std::logic_error` on a thread of whichever factory: what `operation` waits for may have to be done there.
+  // The text names the operation and ends with the advice.
+  static void refuseOnQueueThread(const std::string& operation, const std::string& advice);
 
   // Waits until no queue has anything to run, what tasks hand on to other queues included; false when that has not come
   // about after `patience`. Armed timers do not count. Tells nothing about what other threads dispatch meanwhile.

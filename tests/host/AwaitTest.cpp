@@ -119,6 +119,41 @@ TEST(Await, RefusesAFutureThatHasACallback) {
   EXPECT_EQ(codeOfAwaiting(future), FutureError::Code::CallbackAlreadySet);
 }
 
+TEST(Await, IsRefusedOnAThreadOfTheKitAndLeavesTheFutureAlone) {
+  ThreadQueueFactory queues;
+  const auto queue = queues.createQueue();
+  Promise<void> promise;
+  const Future<void> future = promise.getFuture();
+  std::string refusal;
+  dispatchTask<void>(queue, [&] {
+    try {
+      await(future);
+    } catch (const std::logic_error& error) {
+      refusal = error.what();
+    }
+  }).get();
+  EXPECT_EQ(refusal, "await may wait for itself on a thread of the host kit's queues. Use Future::then instead.");
+  promise.setValue();
+  await(future);
+}
+
+TEST(Await, IsRefusedOnAThreadOfTheKitAlsoWhenTheValueIsThere) {
+  ThreadQueueFactory queues;
+  Promise<void> promise;
+  const Future<void> future = promise.getFuture();
+  promise.setValue();
+  EXPECT_THROW(dispatchTask<void>(queues.createQueue(), [&] { await(future); }).get(), std::logic_error);
+  await(future);
+}
+
+TEST(Await, IsRefusedOnAThreadOfAnotherFactoryToo) {
+  ThreadQueueFactory queues;
+  ThreadQueueFactory others;
+  const auto other = others.createQueue();
+  const auto work = [&] { await(dispatchTask<void>(other, [] {})); };
+  EXPECT_THROW(dispatchTask<void>(queues.createQueue(), work).get(), std::logic_error);
+}
+
 TEST(Await, ManyThreadsMayAwaitTheirOwnResults) {
   ThreadQueueFactory queues;
   const auto queue = queues.createWorkQueue();

@@ -746,6 +746,35 @@ TEST_F(HostTest, AStoreThatIsHeldAfterTheHostFailsItsFutures) {
   EXPECT_THROW(await(covers->store("sunrise", {1})), std::future_error);
 }
 
+// Waiting would be for ever: what is awaited runs on the queue that waits.
+TEST_F(HostTest, AwaitingInACallbackOfTheSameStoreIsRefused) {
+  const Watchdog watchdog(kLongEnough);
+  Host host(kConfigurationOfValues, directory.path());
+  const auto letters = host.store<PersistentKeyValueStore>("letters");
+  std::promise<std::string> refusal;
+  letters->store("first", {1}).then(nullptr, [&](std::future<void>&) {
+    refusal.set_value(errorOf<std::logic_error>([&] { await(letters->fetch("first")); }));
+  });
+  EXPECT_EQ(refusal.get_future().get(),
+            "await may wait for itself on a thread of the host kit's queues. Use Future::then instead.");
+  EXPECT_NE(await(letters->fetch("first")), nullptr);
+}
+
+TEST_F(HostTest, EndingASessionInACallbackOfItsStoreIsRefusedAndChangesNothing) {
+  const Watchdog watchdog(kLongEnough);
+  Host host(kConfigurationOfValues, directory.path());
+  const auto letters = host.store<PersistentKeyValueStore>("letters");
+  std::promise<std::vector<std::string>> refusals;
+  letters->store("first", {1}).then(nullptr, [&](std::future<void>&) {
+    refusals.set_value(
+        {errorOf<std::logic_error>([&] { host.logOut(); }), errorOf<std::logic_error>([&] { host.invalidate(); })});
+  });
+  const std::string rest =
+      " may wait for itself on a thread of the host kit's queues. Use a thread of your own instead.";
+  EXPECT_EQ(refusals.get_future().get(), (std::vector<std::string>{"Host::logOut" + rest, "Host::invalidate" + rest}));
+  EXPECT_NE(await(letters->fetch("first")), nullptr);
+}
+
 // Lazy work
 
 TEST_F(HostTest, LazyWorkCreatesTheStoresThatNobodyAskedFor) {
