@@ -1,4 +1,4 @@
-# 32-bit ARM on Linux, with the distribution's cross compiler and a sysroot that .ci/arm-sysroot fills with the packages of
+# 32-bit ARM on Linux, with the distribution's cross compiler and a sysroot that scripts/arm-sysroot fills with the packages of
 # that architecture. Programs of the target run under the user-mode emulator, so that tests run like any others.
 set(CMAKE_SYSTEM_NAME Linux)
 set(CMAKE_SYSTEM_PROCESSOR armv7)
