@@ -63,7 +63,7 @@ trap 'exit 143' TERM
 # ---- packages -----------------------------------------------------------------------------------------------------------
 
 build_packages=(g++ cmake ninja-build ccache git libsqlite3-dev libgoogle-glog-dev nlohmann-json3-dev
-  libgtest-dev libgmock-dev libcli11-dev)
+  libgtest-dev libgmock-dev libcli11-dev libjs-chart.js)
 
 # Prints those of the named packages that are not installed.
 missing_packages() {
@@ -104,32 +104,8 @@ need() {
 
 # The cross compiler, and the libraries for 32-bit ARM that it links. Quick and offline when they are there.
 need_arm() {
-  need g++-arm-linux-gnueabihf qemu-user-static cmake ninja-build ccache git
+  need g++-arm-linux-gnueabihf qemu-user-static cmake ninja-build ccache git libjs-chart.js
   logged arm-sysroot bash scripts/arm-sysroot build/arm-sysroot || die "the libraries for 32-bit ARM could not be fetched"
-}
-
-# What the page of `cellar inspect --html` is made with, from the npm registry: fetch_page [NPM_OPTION...]. Quick and offline
-# when it is there.
-fetch_page() {
-  local place=build/page
-  # The stamp is written last, so that a fetch that was cut off does not count.
-  cmp -s tools/page/package-lock.json "$place/fetched" && [[ "$*" == *--omit=dev* || -e $place/node_modules/playwright-core ]] &&
-    return
-  command -v npm >/dev/null || need nodejs npm
-  command -v npm >/dev/null || return 1
-  say "Fetching what the page of cellar inspect --html is made with"
-  mkdir -p "$place"
-  rm -f "$place/fetched"
-  cp tools/page/package.json tools/page/package-lock.json tools/page/.npmrc "$place"
-  logged page-fetch npm ci --prefix "$place" --cache "$place/cache" "$@" || return 1
-  cp tools/page/package-lock.json "$place/fetched"
-}
-
-# For commands that build tests or packages: without it they go on, unless CELLAR_REQUIRE_PAGE says otherwise.
-want_page() {
-  fetch_page --omit=dev && return
-  [[ -z ${CELLAR_REQUIRE_PAGE:-} ]] || die "the page of cellar inspect --html cannot be built"
-  say "Going on without the page of cellar inspect --html; its test is skipped"
 }
 
 # ---- building and testing -----------------------------------------------------------------------------------------------

@@ -10,10 +10,10 @@
 #include "Console.h"
 #include "InputError.h"
 #include "TextFile.h"
-#include "inspect/Page.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"
+#include "page/Page.h"
 #include "storage/ConfiguredStores.h"
 #include "storage/FileProgress.h"
 #include "storage/Layout.h"
@@ -57,14 +57,11 @@ std::string textOf(const nlohmann::ordered_json& json) {
 
 int runInspect(const InspectOptions& options) {
   const bool hasPage = !options.page.empty();
-  if (hasPage) {
-    requirePage();
-    requireOutside(options.root, options.page);
-  }
+  if (hasPage) requireOutside(options.root, options.page);
   Console console = Console::standardOutput();
   const Survey result = survey(options, console);
   const std::string json = textOf(surveyAsJson(result));
-  if (hasPage) writeTextFile(options.page, pageOf(json));
+  if (hasPage) writeTextFile(options.page, pageOf(kInspectPage, json));
   if (options.json) {
     console.raw(json + "\n");
   } else if (!hasPage) {

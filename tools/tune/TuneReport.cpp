@@ -14,13 +14,9 @@ namespace {
 
 using Json = nlohmann::ordered_json;
 
-double rate(std::uint64_t part, std::uint64_t whole) {
-  return whole == 0 ? 0 : static_cast<double>(part) / static_cast<double>(whole);
-}
-
-std::string percent(double rate) {
+std::string percent(double part) {
   std::array<char, 32> text{};
-  (void)std::snprintf(text.data(), text.size(), "%.2f %%", rate * 100);
+  (void)std::snprintf(text.data(), text.size(), "%.2f %%", part * 100);
   return text.data();
 }
 
@@ -48,10 +44,10 @@ std::vector<Table::Column> columnsOf(const Tuning& tuning) {
 }
 
 std::vector<std::string> rowOf(const Tuning& tuning, const TunedLimit& limit) {
-  std::vector<std::string> cells = {wholeBytes(limit.lru.limit), percent(rate(limit.lru.hits, tuning.requests)),
-                                    percent(rate(limit.lru.hitBytes, tuning.requestedBytes)),
+  std::vector<std::string> cells = {wholeBytes(limit.lru.limit), percent(share(limit.lru.hits, tuning.requests)),
+                                    percent(share(limit.lru.hitBytes, tuning.requestedBytes)),
                                     formatCount(limit.lru.hits), formatCount(tuning.requests - limit.lru.hits)};
-  if (limit.videoHits) cells.push_back(percent(rate(*limit.videoHits, tuning.requests)));
+  if (limit.videoHits) cells.push_back(percent(share(*limit.videoHits, tuning.requests)));
   cells.push_back(noteOn(limit));
   return cells;
 }
@@ -64,7 +60,7 @@ std::vector<std::string> notesOn(const TuneReport& report) {
                   (tuning.seconds >= 60 ? " in " + formatDuration(static_cast<std::uint64_t>(tuning.seconds)) : "") +
                   "; all items together have at most " + bytes(tuning.everything));
   if (report.reportedHits) {
-    notes.push_back("the running cache reported " + percent(rate(*report.reportedHits, tuning.requests)) + " hits");
+    notes.push_back("the running cache reported " + percent(share(*report.reportedHits, tuning.requests)) + " hits");
     if (report.reportedFirstHits > 0) {
       notes.push_back(formatCount(report.reportedFirstHits) +
                       " of these were the first request of a key that was stored unseen; they count as misses below");
@@ -92,13 +88,13 @@ std::string adviceOf(const Tuning& tuning) {
 
 std::string costOf(const Tuning& tuning, const TunedLimit& present) {
   const std::string has = "The present limit of " + wholeBytes(present.lru.limit) + " finds " +
-                          percent(rate(present.lru.hits, tuning.requests));
+                          percent(share(present.lru.hits, tuning.requests));
   const TunedLimit* const enough = enoughLimit(tuning);
   if (enough == nullptr || enough == &present) return has + ".";
   const std::string other = wholeBytes(enough->lru.limit);
   const auto misses = [&](std::uint64_t count, const char* comparative) {
     return formatCount(count) + comparative + (count == 1 ? "miss" : "misses") + " (" +
-           percent(rate(count, tuning.requests)) + " of the requests)";
+           percent(share(count, tuning.requests)) + " of the requests)";
   };
   if (enough->lru.limit > present.lru.limit) {
     return has + ": " + misses(enough->lru.hits - present.lru.hits, " more ") + " than " + other + " would have.";
@@ -110,9 +106,9 @@ std::string costOf(const Tuning& tuning, const TunedLimit& present) {
 Json asJson(const Tuning& tuning, const TunedLimit& limit) {
   Json json = {{"limit", limit.lru.limit},
                {"hits", limit.lru.hits},
-               {"hit_rate", rate(limit.lru.hits, tuning.requests)},
+               {"hit_rate", share(limit.lru.hits, tuning.requests)},
                {"hit_bytes", limit.lru.hitBytes},
-               {"byte_hit_rate", rate(limit.lru.hitBytes, tuning.requestedBytes)}};
+               {"byte_hit_rate", share(limit.lru.hitBytes, tuning.requestedBytes)}};
   if (limit.videoHits) json["video_hits"] = *limit.videoHits;
   return json;
 }

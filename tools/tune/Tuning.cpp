@@ -135,4 +135,8 @@ Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::f
 const TunedLimit* presentLimit(const Tuning& tuning) { return first(tuning, &TunedLimit::isPresent); }
 const TunedLimit* enoughLimit(const Tuning& tuning) { return first(tuning, &TunedLimit::isEnough); }
 
+double share(std::uint64_t part, std::uint64_t whole) {
+  return whole == 0 ? 0 : static_cast<double>(part) / static_cast<double>(whole);
+}
+
 }  // namespace velmora::mobile::xplat::cellar::tools

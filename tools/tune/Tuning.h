@@ -42,4 +42,7 @@ Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::f
 const TunedLimit* presentLimit(const Tuning& tuning);
 const TunedLimit* enoughLimit(const Tuning& tuning);
 
+// From 0 to 1; of nothing, 0.
+double share(std::uint64_t part, std::uint64_t whole);
+
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,7 +1,6 @@
-"use strict";
 // Fills the page from the survey that stands in it. Each figure carries the way to it in the document in `data-figure`.
 
-const survey = JSON.parse(document.getElementById("survey").textContent);
+const survey = shown;
 
 // ---- words ------------------------------------------------------------------------------------------------------------
 
@@ -11,22 +10,7 @@ const leftoverKinds = {
   temporary: "temporary files", trash: "trash", quarantine: "quarantine",
 };
 
-function formatSize(bytes) {
-  if (bytes === null) return "–";
-  if (bytes < 1024) return bytes + " B";
-  let value = bytes;
-  let unit = "B";
-  for (const next of ["KB", "MB", "GB"]) {
-    if (value < 1024) break;
-    value /= 1024;
-    unit = next;
-  }
-  return value.toFixed(1) + " " + unit;
-}
-
-const formatCount = (count) => (count === null ? "–" : String(count).replace(/\B(?=(\d{3})+$)/g, ","));
 const formatFill = (fill) => (fill === null ? "–" : Math.round(fill * 100) + " %");
-const counted = (count, singular, plural) => formatCount(count) + " " + (count === 1 ? singular : plural);
 
 function formatAge(date) {
   if (date === null) return "–";
@@ -39,15 +23,6 @@ function formatAge(date) {
 }
 
 // ---- pieces -----------------------------------------------------------------------------------------------------------
-
-function make(name, properties = {}, ...children) {
-  const element = document.createElement(name);
-  for (const [key, value] of Object.entries(properties)) {
-    key === "figure" ? (element.dataset.figure = value) : (element[key] = value);
-  }
-  element.append(...children);
-  return element;
-}
 
 const figure = (name, path, text, properties = {}) => make(name, { ...properties, figure: path, textContent: text });
 
@@ -180,8 +155,6 @@ function bytesByStore() {
   return shown;
 }
 
-const colour = (name) => getComputedStyle(document.documentElement).getPropertyValue("--" + name).trim();
-
 // Sizes are counted in powers of two, and their axis stands at such places.
 function sizeStep(values) {
   const fifth = Math.max(1, ...values) / 5;
@@ -195,36 +168,29 @@ function inTwoLines(value) {
 }
 
 function chart(id, horizontal, labels, values, colours, format, tooltip) {
-  const grid = { color: colour("line") };
-  const measured = { beginAtZero: true, grid, border: { display: false }, 
-    ticks: { color: colour("quiet"), maxTicksLimit: 8, callback: format, ...(format === sizeTick ? { stepSize: sizeStep(values) } : { precision: 0 }) } };
-  const named = { grid: { display: false }, border: { color: colour("line") }, 
+  const measured = { beginAtZero: true, grid: { color: colour("line"), drawBorder: false },
+    ticks: { color: colour("quiet"), maxTicksLimit: 8, maxRotation: 0, callback: format, ...(format === sizeTick ? { stepSize: sizeStep(values) } : { precision: 0 }) } };
+  const named = { grid: { display: false, borderColor: colour("line") },
     ticks: { color: colour("quiet"), autoSkip: false, maxRotation: 0, ...(horizontal ? {} : { callback: inTwoLines }) } };
   return new Chart(document.getElementById(id), {
     type: "bar",
     data: { labels, datasets: [{ data: values.map((value) => value || null), backgroundColor: colours, borderRadius: 5, maxBarThickness: 34, minBarLength: 2 }] },
     options: {
       indexAxis: horizontal ? "y" : "x",
-      animation: false,
-      maintainAspectRatio: false,
-      font: { family: "system-ui, sans-serif" },
       plugins: { legend: { display: false }, tooltip: { displayColors: false, callbacks: { label: (context) => tooltip(context.dataIndex) } } },
       scales: horizontal ? { x: measured, y: named } : { x: named, y: measured },
     },
   });
 }
 
-function sizeTick(value) { return value % 1 === 0 ? formatSize(value).replace(".0 ", " ") : ""; }
+function sizeTick(value) { return value % 1 === 0 ? formatWholeSize(value) : ""; }
 function countTick(value) { return value % 1 === 0 ? formatCount(value) : ""; }
 
-let charts = [];
-
 function drawCharts() {
-  for (const old of charts) old.destroy();
   const stores = bytesByStore();
   document.getElementById("stores-frame").style.height = Math.max(8, 3.5 + stores.length * 2.25) + "rem";
   const detail = (bucket) => counted(bucket.items, "item", "items") + ", " + formatSize(bucket.bytes);
-  charts = [
+  return [
     chart("stores", true, stores.map((store) => store.label), stores.map((store) => store.bytes),
       stores.map((store) => colour(store.leftover ? "alarm" : "accent")), sizeTick, (index) => formatSize(stores[index].bytes)),
     chart("ages", false, survey.ages.map((bucket) => bucket.label), survey.ages.map((bucket) => bucket.bytes), colour("third"),
@@ -238,5 +204,4 @@ fillHeader();
 fillTiles();
 fillManagers();
 fillLeftovers();
-drawCharts();
-matchMedia("(prefers-color-scheme: dark)").addEventListener("change", drawCharts);
+keepDrawn(drawCharts);
