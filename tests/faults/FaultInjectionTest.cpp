@@ -3,7 +3,6 @@
 
 #include <gtest/gtest.h>
 #include <sqlite3.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -12,6 +11,7 @@
 #include <filesystem>
 #include <functional>
 #include <iostream>
+#include <map>
 #include <ostream>
 #include <string>
 #include <utility>
@@ -24,12 +24,6 @@ namespace velmora::mobile::xplat::cellar::test {
 namespace {
 
 constexpr unsigned int kPatience = 60;  // seconds for one life
-
-// Thousands of lives: in memory where the machine has a place for that.
-std::string quickPlace() {
-  const char* const memory = "/dev/shm";
-  return ::access(memory, W_OK | X_OK) == 0 ? memory : testing::TempDir();
-}
 
 std::size_t openDescriptors() {
   const std::filesystem::directory_iterator descriptors("/proc/self/fd");
@@ -46,6 +40,16 @@ struct Faults {
   Life::Hardship hardship = Life::Hardship::OneFault;
 };
 
+// The lives that met a fault in one and the same statement or file operation.
+struct Place {
+  std::size_t lives = 0;
+  std::size_t livesWithDiscards = 0;  // that had a store discarded
+};
+using Places = std::map<std::string, Place>;
+
+// A statement that changes the manifest, by its first word.
+bool isWrite(const std::string& place) { return place == "INSERT" || place == "UPDATE" || place == "DELETE"; }
+
 class FaultInjection : public testing::Test {
  protected:
   // Lives one life after the other, with the n-th call failing in the n-th, until one meets no fault.
@@ -53,10 +57,11 @@ class FaultInjection : public testing::Test {
     const std::size_t descriptors = openDescriptors();
     std::size_t met = 0;
     std::size_t lives = 0;
+    Places places;
     const std::size_t stride = std::getenv("CELLAR_EVERY_FAULT") != nullptr ? 1 : faults.stride;
     for (std::size_t n = 1; !HasFailure(); n += stride) {
       const testing::ScopedTrace trace(__FILE__, __LINE__, faults.name + ", n = " + std::to_string(n));
-      const std::size_t metNow = live(faults, n);
+      const std::size_t metNow = live(faults, n, places);
       met += metNow;
       ++lives;
       if (metNow == 0) break;
@@ -65,10 +70,28 @@ class FaultInjection : public testing::Test {
     EXPECT_EQ(openDescriptors(), descriptors);
     std::cout << faults.name << ": " << met << " faults in " << lives << " lives\n";
     RecordProperty("faults", std::to_string(met));
+    if (faults.hardship != Life::Hardship::ManyFaults) lookAt(places, faults.hardship);
+  }
+
+  // Only where the manifest is written may one fault cost a store; or where SQLite was shown damage.
+  static void lookAt(const Places& places, Life::Hardship hardship) {
+    for (const auto& [name, place] : places) {
+      std::cout << "  in " << name << ": " << place.livesWithDiscards << " of " << place.lives
+                << " lives had a store discarded\n";
+      if (isWrite(name) || hardship == Life::Hardship::SilentLoss) continue;
+      EXPECT_EQ(place.livesWithDiscards, 0U) << name;
+    }
+  }
+
+  // Where the one fault of a life was met: the name of the file operation, or the first word of the statement.
+  static std::string placeOf(const Life& life, std::size_t n) {
+    const bool isFile = life.files->failures() > 0;
+    const std::string text = isFile ? life.files->trace().at(n - 1) : life.vfs.statementOfLastFailure();
+    return text.empty() ? "no statement" : text.substr(0, text.find(' '));
   }
 
   // The number of faults met.
-  static std::size_t live(const Faults& faults, std::size_t n) {
+  static std::size_t live(const Faults& faults, std::size_t n, Places& places) {
     const Watchdog watchdog(kPatience);
     const TemporaryDirectory directory(quickPlace());
     Life life(directory.path(), faults.hardship);
@@ -80,6 +103,11 @@ class FaultInjection : public testing::Test {
     EXPECT_TRUE(met > 0 || !life.hasToldOfTrouble());
     if (!HasFailure()) life.verify();
     life.end();
+    if (met == 1) {
+      Place& place = places[placeOf(life, n)];
+      ++place.lives;
+      if (life.discards() > 0) ++place.livesWithDiscards;
+    }
     return met;
   }
 
@@ -103,7 +131,8 @@ class FaultInjection : public testing::Test {
 TEST_F(FaultInjection, TheLifeItselfMeetsNoTrouble) {
   Faults none;
   none.plan = [](Life&, std::size_t) {};
-  EXPECT_EQ(live(none, 1), 0U);
+  Places places;
+  EXPECT_EQ(live(none, 1, places), 0U);
 }
 
 TEST_F(FaultInjection, AFileOperationThatFailsOnce) { sweepFiles("file operation, EIO", EIO, false, 1); }
@@ -150,6 +179,47 @@ TEST_F(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
             std::pair(VfsCall::Sync, SQLITE_IOERR_FSYNC), std::pair(VfsCall::Open, SQLITE_CANTOPEN)}) {
         life.vfs.failFromNth(call, 1, code);
       }
+    };
+  };
+  sweep(faults);
+}
+
+// No manifest can be opened from one step on, for one step or for several, as when descriptors or rights are missing.
+TEST_F(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
+  const std::size_t last = Life::stepCount() - 1;
+  std::size_t met = 0;
+  for (std::size_t first = 0; first <= last && !HasFailure(); ++first) {
+    for (const std::size_t length : {std::size_t{1}, std::size_t{2}, std::size_t{3}}) {
+      const testing::ScopedTrace trace(__FILE__, __LINE__,
+                                       std::to_string(length) + " from step " + std::to_string(first));
+      const Watchdog watchdog(kPatience);
+      const TemporaryDirectory directory(quickPlace());
+      Life life(directory.path(), Life::Hardship::ManifestClosed);
+      for (std::size_t step = 0; step <= last && !HasFailure(); ++step) {
+        if (step == first) life.vfs.failFromNth(VfsCall::Open, 1, SQLITE_CANTOPEN);
+        life.step(step);
+        if (step + 1 == first + length) life.vfs.heal();
+      }
+      if (!HasFailure()) life.verify();
+      EXPECT_EQ(life.discards(), 0U);
+      met += life.vfs.failures();
+    }
+  }
+  EXPECT_GT(met, 0U);
+  std::cout << "manifests that cannot be opened for a while: " << met << " faults\n";
+}
+
+// What a purge leaves when it cannot take the old manifest away must not undo what is acknowledged after it.
+TEST_F(FaultInjection, AManifestThatCannotBeWrittenBesideATrashThatTakesNothing) {
+  Faults faults;
+  faults.name = "no writing and no collecting from the n-th file operation on";
+  faults.stride = 7;
+  faults.hardship = Life::Hardship::ManyFaults;
+  faults.plan = [](Life& life, std::size_t n) {
+    life.files->onCall = [&life, left = n](Operation, const std::string&) mutable {
+      if (left == 0 || --left > 0) return;
+      life.files->failAlways(Operation::Rename, EIO);
+      life.vfs.failFromNth(VfsCall::Write, 1, SQLITE_FULL);
     };
   };
   sweep(faults);

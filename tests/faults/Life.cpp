@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <sqlite3.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <exception>
@@ -46,6 +47,9 @@ const char* const kConfiguration = R"({
 
 const std::vector<std::string> kStores = {"letters", "settings", "recent", "thumbs", "notes"};
 
+// How the line begins that tells of a purge.
+std::string lineOf(const std::string& store) { return "Store \"" + store + "\""; }
+
 std::string valueOf(const std::string& key, int version) {
   std::string value = key + " " + std::to_string(version) + " ";
   value.resize(30, static_cast<char>('a' + version % 26));
@@ -88,6 +92,7 @@ struct Life::Process {
   std::unique_ptr<StoreManagerFactory> sessionScoped;
   std::map<std::string, std::shared_ptr<StoreManager>> managers;
   std::map<std::string, std::shared_ptr<PersistentKeyValueStore>> stores;
+  std::map<std::string, std::string> paths;  // of all stores that were ever opened
   std::shared_ptr<UnmanagedStore> web;
 
   Process(const std::string& root, const std::shared_ptr<FileUtils>& files) {
@@ -114,12 +119,32 @@ struct Life::Process {
     return all;
   }
 
+  // What the application holds; the queues stay.
+  void letGo() {
+    lazyWork->willBeTriggeredExternally();
+    web.reset();
+    stores.clear();
+    managers.clear();
+    sessionScoped.reset();
+    sessionless.reset();
+  }
+
   // Whoever waits for a queue on this thread finds it running.
   void runQueuesAtOnce(bool atOnce) const {
     for (const auto& queue : executors()) {
       queue->onDispatch = atOnce ? [raw = queue.get()] { raw->runAll(); } : std::function<void()>();
     }
   }
+};
+
+// A write that has been asked for.
+struct Life::Asked {
+  std::string store;
+  std::string key;
+  std::string value;
+  Written written;
+  std::size_t purgesBefore;
+  std::size_t faultsBefore;
 };
 
 struct Life::Step {
@@ -129,15 +154,26 @@ struct Life::Step {
 
 const std::vector<Life::Step>& Life::script() {
   static const std::vector<Step> steps = {
-      {"start", &Life::start},           {"fill", &Life::fill},
-      {"fetch", &Life::fetchSome},       {"overwrite", &Life::overwrite},
-      {"remove", &Life::remove},         {"evict", &Life::evict},
-      {"prune", &Life::prune},           {"measure", &Life::measure},
-      {"expire", &Life::expire},         {"clear", &Life::clear},
-      {"flush", &Life::flush},           {"empty the trash", &Life::emptyTrash},
-      {"survive", &Life::survive},       {"mark for the trash", &Life::markForTrash},
-      {"invalidate", &Life::invalidate}, {"restart", &Life::restart},
-      {"fetch all", &Life::fetchAll},    {"fill again", &Life::fillAgain},
+      {"start", &Life::start},
+      {"fill", &Life::fill},
+      {"fetch", &Life::fetchSome},
+      {"overwrite", &Life::overwrite},
+      {"remove", &Life::remove},
+      {"evict", &Life::evict},
+      {"prune", &Life::prune},
+      {"measure", &Life::measure},
+      {"expire", &Life::expire},
+      {"clear", &Life::clear},
+      {"flush", &Life::flush},
+      {"empty the trash", &Life::emptyTrash},
+      {"survive", &Life::survive},
+      {"mark for the trash", &Life::markForTrash},
+      {"invalidate", &Life::invalidate},
+      {"restart", &Life::restart},
+      {"fetch all", &Life::fetchAll},
+      {"fill again", &Life::fillAgain},
+      {"close in the middle", &Life::closeInTheMiddle},
+      {"let go in the middle", &Life::letGoInTheMiddle},
   };
   return steps;
 }
@@ -153,6 +189,7 @@ void Life::step(std::size_t number) {
   const testing::ScopedTrace trace(__FILE__, __LINE__, step.name);
   (this->*step.run)();
   notePurges();
+  if (hardship_ != Hardship::ManyFaults) expectEachPurgeIsTold();
 }
 
 void Life::end() {
@@ -162,11 +199,17 @@ void Life::end() {
   process_.reset();
 }
 
+std::string quickPlace() {
+  const char* const memory = "/dev/shm";
+  return ::access(memory, W_OK | X_OK) == 0 ? memory : testing::TempDir();
+}
+
 // --- The script ---
 
 void Life::start() {
   process_ = std::make_unique<Process>(root_, files);
   purges_.clear();
+  for (const std::string& name : kStores) linesBeforeStart_[name] = purgeLines(lineOf(name));
   mayThrow_ = true;
   for (const auto& [manager, isSessionScoped] : {std::pair("media", false), std::pair("inbox", true)}) {
     attempt([&, name = manager, scoped = isSessionScoped] {
@@ -179,7 +222,10 @@ void Life::start() {
     const auto manager = process_->managers.find(name == "notes" ? "inbox" : "media");
     if (manager == process_->managers.end() || manager->second == nullptr) continue;
     attempt([&] {
-      if (auto opened = manager->second->getStore<PersistentKeyValueStore>(name)) process_->stores[name] = opened;
+      const auto opened = manager->second->getStore<PersistentKeyValueStore>(name);
+      if (opened == nullptr) return;
+      process_->stores[name] = opened;
+      process_->paths[name] = opened->path;
     });
     settle();
   }
@@ -255,7 +301,7 @@ void Life::expire() {
     while (process_->queues->workQueue(i)->fireTimer(300 * kSecond)) settle();
   }
   notePurges();
-  if (!has("recent") || faults() > 0 || before > 0 || hardship_ != Hardship::OneFault) return;
+  if (!has("recent") || isInTrouble || faults() > 0 || before > 0 || hardship_ != Hardship::OneFault) return;
   EXPECT_EQ(store("recent").getAllKeys(), std::vector<std::string>{"late"});
 }
 
@@ -328,30 +374,87 @@ void Life::fillAgain() {
   drop("letters", "b");
 }
 
+// The process ends while writes wait for the file queue. What has not begun by then has not happened.
+void Life::closeInTheMiddle() {
+  const std::vector<Asked> asked = askForMany(4);
+  for (std::size_t i = 0; i < process_->queues->workQueueCount(); ++i) runAll(*process_->queues->workQueue(i));
+  for (std::size_t i = 0; i < process_->queues->queueCount(); ++i) runNext(*process_->queues->queue(i));
+  std::vector<Asked> notBegun;
+  for (const Asked& write : asked) {
+    write.written->isPending() ? notBegun.push_back(write) : take(write);
+  }
+  process_->letGo();
+  for (const auto& queue : process_->executors()) queue->dropAll();
+  notePurges();
+  process_.reset();
+  for (const Asked& write : notBegun) forget(write);
+  start();
+  for (const Asked& write : asked) fetch(write.store, write.key);
+}
+
+// Nobody holds a manager or a store any more while writes wait, but the queues run on: what was accepted is done.
+void Life::letGoInTheMiddle() {
+  const std::vector<Asked> asked = askForMany(5);
+  process_->letGo();
+  settle();
+  for (const Asked& write : asked) take(write);
+  process_.reset();
+  start();
+  for (const Asked& write : asked) fetch(write.store, write.key);
+}
+
 // --- What is done with a store ---
 
 void Life::put(const std::string& name, const std::string& key, int version) {
-  const std::string value = valueOf(name + "/" + key, version);
   if (!has(name)) return;
-  const std::size_t purgesBefore = purges(name);
-  const Written written = watch(store(name).store(key, bytesOf(value)));
+  const Asked asked = ask(name, key, version);
   settle();
-  notePurges();
-  ASSERT_FALSE(written->isPending()) << name << " " << key;
+  take(asked);
+}
 
-  Remembered& remembered = memory_[name][key];
-  remembered.everWritten.insert(value);
-  if (written->hasSucceeded() && purges(name) == purgesBefore) {
-    remembered.values = {value};
+Life::Asked Life::ask(const std::string& name, const std::string& key, int version) {
+  const std::string value = valueOf(name + "/" + key, version);
+  return {name, key, value, watch(store(name).store(key, bytesOf(value))), purges(name), faults()};
+}
+
+// Overwrites, and a first write or two.
+std::vector<Life::Asked> Life::askForMany(int version) {
+  std::vector<Asked> asked;
+  for (const char* key : {"a", "b", "d"}) {
+    for (const char* name : {"letters", "settings", "notes"}) {
+      if (has(name)) asked.push_back(ask(name, key, version));
+    }
+  }
+  return asked;
+}
+
+// What follows from the answer.
+void Life::take(const Asked& asked) {
+  const std::string& name = asked.store;
+  notePurges();
+  ASSERT_FALSE(asked.written->isPending()) << name << " " << asked.key;
+
+  Remembered& remembered = memory_[name][asked.key];
+  remembered.everWritten.insert(asked.value);
+  if (asked.written->hasSucceeded() && purges(name) == asked.purgesBefore) {
+    remembered.values = {asked.value};
     remembered.mayBeMissing = remembered.mayFail = remembered.mayBeTorn = false;
     // A limit may take it at any time from here on.
     if (name == "thumbs") remembered.mayBeMissing = true;
     return;
   }
-  if (!written->hasSucceeded()) ++complaints_;
-  remembered.values.insert(value);
+  if (!asked.written->hasSucceeded()) ++complaints_;
+  if (hardship_ == Hardship::ManifestClosed) return;
+  remembered.values.insert(asked.value);
   remembered.mayBeMissing = true;
   if (hardship_ != Hardship::OneFault) remembered.mayFail = remembered.mayBeTorn = true;
+}
+
+// What follows when the process ends before the writer is called: nothing, unless a fault was in the way of that.
+void Life::forget(const Asked& asked) {
+  Remembered& remembered = memory_[asked.store][asked.key];
+  remembered.everWritten.insert(asked.value);
+  if (isInTrouble || faults() > asked.faultsBefore) remembered.mayBeMissing = remembered.mayFail = true;
 }
 
 void Life::fetch(const std::string& name, const std::string& key) {
@@ -452,7 +555,16 @@ void Life::expectDatabasesAreSound() {
   }
 }
 
+void Life::expectEachPurgeIsTold() const {
+  for (const std::string& name : kStores) {
+    if (name == "thumbs") continue;  // goes to the trash for its mark, too
+    EXPECT_EQ(purges(name), purgeLines(lineOf(name)) - linesBeforeStart_.at(name)) << name;
+  }
+}
+
 bool Life::hasToldOfTrouble() const { return complaints_ > 0 || log_.errorCount() > 0; }
+
+std::size_t Life::discards() const { return purgeLines(""); }
 
 bool Life::has(const std::string& name) const { return process_ != nullptr && process_->stores.count(name) > 0; }
 
@@ -460,15 +572,24 @@ PersistentKeyValueStore& Life::store(const std::string& name) const { return *pr
 
 // A purge hands the store's directory to the collector.
 std::size_t Life::purges(const std::string& name) const {
-  if (!has(name)) return 0;
+  const auto path = process_->paths.find(name);
+  if (path == process_->paths.end()) return 0;
   const auto collected = process_->trash->collected();
-  return static_cast<std::size_t>(std::count(collected.begin(), collected.end(), store(name).path));
+  return static_cast<std::size_t>(std::count(collected.begin(), collected.end(), path->second));
+}
+
+std::size_t Life::purgeLines(const std::string& beginning) const {
+  const auto lines = log_.messages();
+  return static_cast<std::size_t>(std::count_if(lines.begin(), lines.end(), [&](const std::string& line) {
+    return line.rfind(beginning, 0) == 0 && line.find(" purged due to corrupted manifest. ") != std::string::npos;
+  }));
 }
 
 void Life::notePurges() {
+  if (process_ == nullptr) return;
   for (const std::string& name : kStores) {
     const std::size_t now = purges(name);
-    const bool isPurged = now != std::exchange(purges_[name], now) && has(name);
+    const bool isPurged = now != std::exchange(purges_[name], now);
     const bool isHarmed = isPurged || (hardship_ == Hardship::SilentLoss && faults() > 0);
     if (isHarmed) mayGo(name);
     if (!isHarmed || hardship_ == Hardship::OneFault) continue;
@@ -495,6 +616,10 @@ void Life::settle() {
     ran = false;
     for (const auto& queue : process_->executors()) ran = runNext(*queue) || ran;
   }
+}
+
+void Life::runAll(ManualExecutor& queue) {
+  while (runNext(queue)) continue;
 }
 
 bool Life::runNext(ManualExecutor& queue) {

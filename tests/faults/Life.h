@@ -26,6 +26,9 @@ struct Remembered {
   bool mayBeTorn = false;
 };
 
+// Where thousands of lives can be lived: in memory, where the machine has a place for that.
+std::string quickPlace();
+
 // A scripted life of an application's storage, from its configuration to its end and back, on queues that run when the
 // script says so. It remembers what it was promised, and holds the stores to it: each step, each fetch in it and
 // `verify` are test assertions. Files and databases may be made to fail meanwhile.
@@ -33,8 +36,9 @@ class Life {
  public:
   enum class Hardship {
     OneFault,
-    ManyFaults,  // so that what a failure has left cannot always be taken away
-    SilentLoss,  // the database is cut short under SQLite: values may vanish without a word, but none may be wrong
+    ManyFaults,      // so that what a failure has left cannot always be taken away
+    ManifestClosed,  // it cannot be opened for a while: a write that fails has changed nothing
+    SilentLoss,      // the database is cut short under SQLite: values may vanish without a word, but none may be wrong
   };
 
   // Under `root`.
@@ -57,6 +61,9 @@ class Life {
 
   // Whether anybody was told that something went wrong: a caller by an exception or a future, or the log.
   bool hasToldOfTrouble() const;
+
+  // How many times so far a store has been discarded for its manifest.
+  std::size_t discards() const;
 
   bool isInTrouble = false;  // by a fault that neither of the two below knows of
   FaultyVfs vfs;
@@ -87,22 +94,33 @@ class Life {
   void invalidate();
   void fetchAll();
   void fillAgain();
+  void closeInTheMiddle();
+  void letGoInTheMiddle();
+
+  struct Asked;
 
   void put(const std::string& store, const std::string& key, int version);
+  Asked ask(const std::string& store, const std::string& key, int version);
+  std::vector<Asked> askForMany(int version);
+  void take(const Asked& asked);
+  void forget(const Asked& asked);
   void fetch(const std::string& store, const std::string& key);
   void drop(const std::string& store, const std::string& key);
   void expectNewWorkSucceeds();
   void expectDatabasesAreSound();
+  void expectEachPurgeIsTold() const;
   void expectAllIsAnswered(const std::string& store, const std::string& key, const std::string& answer);
 
   bool has(const std::string& store) const;
   PersistentKeyValueStore& store(const std::string& name) const;
   std::size_t purges(const std::string& store) const;
+  std::size_t purgeLines(const std::string& beginning) const;
   void notePurges();
   void mayGo(const std::string& store);
   void attempt(const std::function<void()>& work);
   void settle();
   bool runNext(ManualExecutor& queue);
+  void runAll(ManualExecutor& queue);
   std::size_t faults() const;
 
   const std::string root_;
@@ -110,10 +128,11 @@ class Life {
   TestClock clock_{2'000'000'000};
   ShortPauses pauses_;
   LogCapture log_;
-  std::map<std::string, Keys> memory_;  // by store
-  std::map<std::string, std::size_t> purges_;
-  std::size_t complaints_ = 0;  // exceptions and failed futures
-  bool mayThrow_ = false;       // a manifest is being loaded: its task passes on what is not damage
+  std::map<std::string, Keys> memory_;                   // by store
+  std::map<std::string, std::size_t> purges_;            // of this process, by store
+  std::map<std::string, std::size_t> linesBeforeStart_;  // that told of a purge, by store
+  std::size_t complaints_ = 0;                           // exceptions and failed futures
+  bool mayThrow_ = false;  // a manifest is being loaded: its task passes on what is not damage
   int freshVersion_ = 100;
   std::unique_ptr<Process> process_;
 };

@@ -30,6 +30,7 @@ class Faults {
     if (plan.callsToFailure == 0 || --plan.callsToFailure > 0) return std::nullopt;
     if (plan.goesOn) plan.callsToFailure = 1;
     ++failures_;
+    statementOfLastFailure_ = statement_;
     return plan.code;
   }
 
@@ -48,7 +49,14 @@ class Faults {
     plans_.fill({});
     calls_.fill(0);
     failures_ = 0;
+    statement_.clear();
+    statementOfLastFailure_.clear();
     tears_ = false;
+  }
+
+  void runs(const std::string& statement) {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    statement_ = statement;
   }
 
   void tearFailingWrites(bool tears) {
@@ -66,6 +74,11 @@ class Faults {
     return failures_;
   }
 
+  std::string statementOfLastFailure() {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    return statementOfLastFailure_;
+  }
+
   std::size_t calls(VfsCall call) {
     const std::lock_guard<std::mutex> lock(mutex_);
     return calls_[static_cast<std::size_t>(call)];
@@ -76,10 +89,27 @@ class Faults {
   std::array<Plan, kVfsCallKinds> plans_;
   std::array<std::size_t, kVfsCallKinds> calls_{};
   std::size_t failures_ = 0;
+  std::string statement_;  // that is running, "" for none
+  std::string statementOfLastFailure_;
   bool tears_ = false;
 };
 
 Faults faults;
+
+int noteStatement(unsigned int event, void* /*context*/, void* statement, void* /*detail*/) {
+  const char* const sql = event == SQLITE_TRACE_STMT ? sqlite3_sql(static_cast<sqlite3_stmt*>(statement)) : nullptr;
+  faults.runs(sql == nullptr ? "" : sql);
+  return 0;
+}
+
+// Called for every connection that is opened.
+int watchStatements(sqlite3* database, const char** /*message*/, const struct sqlite3_api_routines* /*api*/) {
+  return sqlite3_trace_v2(database, SQLITE_TRACE_STMT | SQLITE_TRACE_PROFILE, noteStatement, nullptr);
+}
+
+auto asExtension() {
+  return reinterpret_cast<void (*)()>(watchStatements);
+}  // NOLINT(*-reinterpret-cast): SQLite's way
 
 // What SQLite knows as the file; the real one's lies behind it in the same block.
 struct File {
@@ -234,9 +264,11 @@ FaultyVfs::FaultyVfs() : registration_(std::make_unique<Registration>()) {
   vfs.xAccess = accessFile;
   vfs.xFullPathname = fullPathname;
   if (sqlite3_vfs_register(&vfs, 1) != SQLITE_OK) throw std::runtime_error("SQLite takes no other file layer.");
+  (void)sqlite3_auto_extension(asExtension());
 }
 
 FaultyVfs::~FaultyVfs() {
+  (void)sqlite3_cancel_auto_extension(asExtension());
   (void)sqlite3_vfs_unregister(&registration_->vfs);
   (void)sqlite3_vfs_register(registration_->system, 1);
 }
@@ -250,6 +282,8 @@ void FaultyVfs::tearFailingWrites(bool tears) { faults.tearFailingWrites(tears);
 void FaultyVfs::heal() { faults.heal(); }
 
 std::size_t FaultyVfs::failures() const { return faults.failures(); }
+
+std::string FaultyVfs::statementOfLastFailure() const { return faults.statementOfLastFailure(); }
 
 std::size_t FaultyVfs::calls(VfsCall call) const { return faults.calls(call); }
 

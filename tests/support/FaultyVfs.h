@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <memory>
+#include <string>
 
 namespace velmora::mobile::xplat::cellar::test {
 
@@ -22,7 +23,8 @@ enum class VfsCall {
 constexpr std::size_t kVfsCallKinds = 11;
 
 // While it lives, SQLite does all its file access in this process through it: the real one, with chosen calls failing.
-// Connections that were opened meanwhile must be closed before it goes. One at a time. Thread-safe.
+// Connections that were opened meanwhile must be closed before it goes. One at a time. Thread-safe, though which
+// statement met a failure is only known where one thread alone uses SQLite.
 //
 // Syncing waits for no disk: no test outlives a power cut. A failing call has done nothing, with two exceptions: a read
 // that fails with SQLITE_IOERR_SHORT_READ has read the first half and filled up with zeros, as SQLite demands, and a
@@ -48,6 +50,9 @@ class FaultyVfs {
 
   // How many calls have been made to fail so far.
   std::size_t failures() const;
+
+  // The statement that was running when the latest of them failed; "" between statements, as in opening and closing.
+  std::string statementOfLastFailure() const;
 
   // How many calls of a kind there were, failed ones included.
   std::size_t calls(VfsCall call) const;

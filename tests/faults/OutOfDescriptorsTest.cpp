@@ -1,0 +1,61 @@
+// The scripted life in a process that has no descriptor left for a while.
+
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+
+#include <cstddef>
+#include <string>
+
+#include "faults/Life.h"
+#include "support/TemporaryDirectory.h"
+#include "support/Watchdog.h"
+
+namespace velmora::mobile::xplat::cellar::test {
+namespace {
+
+// While it lives, this process can open nothing. What is open stays open.
+class NoDescriptors {
+ public:
+  NoDescriptors() {
+    EXPECT_EQ(::getrlimit(RLIMIT_NOFILE, &before_), 0);
+    const rlimit none = {0, before_.rlim_max};
+    EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  }
+  NoDescriptors(const NoDescriptors&) = delete;
+  NoDescriptors& operator=(const NoDescriptors&) = delete;
+  ~NoDescriptors() { EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &before_), 0); }
+
+ private:
+  rlimit before_{};
+};
+
+// None before each step in turn, for as many steps.
+void liveWithoutDescriptors(std::size_t length) {
+  for (std::size_t first = 0; first < Life::stepCount() && !testing::Test::HasFailure(); ++first) {
+    const testing::ScopedTrace trace(__FILE__, __LINE__, "none from step " + std::to_string(first));
+    const Watchdog watchdog(60);
+    const TemporaryDirectory directory(quickPlace());
+    Life life(directory.path(), Life::Hardship::OneFault);
+    for (std::size_t step = 0; step < Life::stepCount() && !testing::Test::HasFailure(); ++step) {
+      life.isInTrouble = step >= first && step < first + length;
+      if (life.isInTrouble) {
+        const NoDescriptors none;
+        life.step(step);
+      } else {
+        life.step(step);
+      }
+    }
+    life.isInTrouble = false;
+    if (!testing::Test::HasFailure()) life.verify();
+    EXPECT_EQ(life.discards(), 0U);
+  }
+}
+
+TEST(OutOfDescriptors, ForAnyStepCostsNoStore) { liveWithoutDescriptors(1); }
+
+TEST(OutOfDescriptors, ForAnyThreeStepsCostsNoStore) { liveWithoutDescriptors(3); }
+
+TEST(OutOfDescriptors, FromAnyStepToTheEndCostsNoStore) { liveWithoutDescriptors(Life::stepCount()); }
+
+}  // namespace
+}  // namespace velmora::mobile::xplat::cellar::test
