@@ -57,6 +57,7 @@ using ItemType = VideoDownloadExtendedMetadata::ItemType;
 constexpr std::int64_t kSecond = 1'000'000'000;
 constexpr std::time_t kStart = 1'700'000'000;
 const std::string kManifestName = "manifest_v1.sqlite";
+const std::string kRefusal = "The queue takes no tasks.";
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || defined(__arm__)
 constexpr unsigned int kDefaultRuns = 40;  // each takes ten times as long there
@@ -524,6 +525,14 @@ class SettledSequence {
     open();
   }
 
+  // Access dates are written at the end, as they are by `close`.
+  void restartWithoutWaiting() {
+    session_->drop();
+    session_->drain();
+    session_.reset();
+    open();
+  }
+
   void step() {
     const std::string key = script_.key();
     switch (script_.below(19)) {
@@ -534,7 +543,7 @@ class SettledSequence {
       case 4:
         return storeValue(key);
       case 5:
-        return storeWithFailingWriter(key);
+        return script_.oneIn(2) ? storeWithFailingWriter(key) : storeInVain(key);
       case 6:
       case 7:
         return fetch(key);
@@ -596,6 +605,23 @@ class SettledSequence {
     EXPECT_TRUE(outcome->failedWith<WriterFailed>()) << outcome->what();
     evictForOne();
     items_.erase(key);
+  }
+
+  // Writes whose writer is never called: the file queue refuses or drops its task, or the store goes before.
+  void storeInVain(const std::string& key) {
+    if (setup_.inlineData || (setup_.capacity && items_.size() >= *setup_.capacity)) return;
+    const unsigned int kind = script_.below(3);
+    script_.say("store " + key + " in vain, in way " + std::to_string(kind));
+    ManualExecutor& files = session_->queue(Session::kFileQueue);
+    files.throwOnDispatch(kind == 0);
+    const auto first = watch(session_->store->store(key, script_.value(), metadata(0)));
+    const auto second = watch(session_->store->store(key, script_.value(), metadata(0)));
+    session_->queue(Session::kWorkQueue).runAll();
+    files.throwOnDispatch(false);
+    if (kind == 1) files.dropAll();
+    if (kind == 2) restartWithoutWaiting();
+    EXPECT_TRUE(first->isDone && second->isDone);
+    EXPECT_TRUE(kind == 2 || (first->error != nullptr && second->error != nullptr));
   }
 
   void fetch(const std::string& key) {
@@ -889,13 +915,21 @@ class InterleavedSequence {
   }
 
  private:
-  // What has been asked of one key. Each call makes the next state; `settled` of them have taken effect for certain.
+  // What has been asked of one key. Each call makes the next state, and they take effect in that order.
   struct History {
     std::vector<std::optional<Bytes>> states{std::nullopt};
-    unsigned int removals = 0;  // calls that take the key away
-    unsigned int underWay = 0;  // calls that have not completed
+    std::size_t acknowledged = 0;  // the latest state that has taken effect for certain
+    unsigned int removals = 0;     // calls that take the key away
+    unsigned int underWay = 0;     // calls that have not completed
 
     const std::optional<Bytes>& last() const { return states.back(); }
+    std::size_t lastState() const { return states.size() - 1; }
+
+    // Whether it may be in that state when what is under way may have begun or not.
+    bool mayBe(const std::optional<Bytes>& state) const {
+      const auto earliest = states.begin() + static_cast<std::ptrdiff_t>(acknowledged);
+      return std::find(earliest, states.end(), state) != states.end();
+    }
   };
 
   void open() {
@@ -942,7 +976,7 @@ class InterleavedSequence {
         return clear();
       default:
         if (isCorrupted_ && script_.oneIn(2)) return corrupt();
-        return fetchFirst();
+        return script_.oneIn(4) ? failFileQueue() : fetchFirst();
     }
   }
 
@@ -954,13 +988,29 @@ class InterleavedSequence {
     if (!value) ++history.removals;
   }
 
-  OnDone completing(const std::string& call, const std::string& key) {
+  // A store that is going answers without having done anything.
+  void acknowledge(const std::string& key, std::size_t state) {
+    if (isEnding_) return;
+    std::size_t& acknowledged = histories_[key].acknowledged;
+    acknowledged = std::max(acknowledged, state);
+  }
+
+  // Calls may fail when their store is going, or when the file queue has not done its part.
+  bool mayFail(const Outcome& outcome) const {
+    return isEnding_ || (hasFailedQueue_ && (outcome.failedWith<std::future_error>() || outcome.what() == kRefusal));
+  }
+
+  // Follows a call on the key. What changes it has made the latest state.
+  OnDone completing(const std::string& call, const std::string& key,
+                    std::function<bool(const Outcome&)> mayEndThus = nullptr) {
     ++histories_[key].underWay;
     ++underWay_;
-    return [this, call, key](const Outcome& outcome) {
+    return [this, call, key, state = histories_[key].lastState(), mayEndThus](const Outcome& outcome) {
       --histories_[key].underWay;
       --underWay_;
-      EXPECT_TRUE(outcome.error == nullptr || isEnding_) << call << " " << key << ": " << outcome.what();
+      const bool isFine = outcome.error == nullptr || (mayEndThus && mayEndThus(outcome));
+      EXPECT_TRUE(isFine || mayFail(outcome)) << call << " " << key << ": " << outcome.what();
+      if (isFine && call != "use") acknowledge(key, state);
     };
   }
 
@@ -978,33 +1028,23 @@ class InterleavedSequence {
     script_.say("store " + key + " with a writer that fails");
     isLossy_ = isLossy_ || setup_.capacity.has_value();
     becomes(key, std::nullopt);
-    ++histories_[key].underWay;
-    ++underWay_;
     const auto writer = [files = session_->files](const std::string& path) -> unsigned int {
       files->writeFile(path, {'h', 'a', 'l', 'f'});
       throw WriterFailed();
     };
-    watch(session_->store->store(key, nullptr, writer), [this, key](const Outcome& outcome) {
-      --histories_[key].underWay;
-      --underWay_;
-      // A write that was revoked before it began has not failed.
-      EXPECT_TRUE(outcome.error == nullptr || outcome.failedWith<WriterFailed>() || isEnding_) << outcome.what();
-    });
+    // One that was revoked before it began has not failed.
+    const auto isTheWriters = [](const Outcome& outcome) { return outcome.failedWith<WriterFailed>(); };
+    watch(session_->store->store(key, nullptr, writer), completing("store in vain", key, isTheWriters));
   }
 
   void remove(const std::string& key) {
     script_.say("remove " + key);
     becomes(key, std::nullopt);
-    ++histories_[key].underWay;
-    ++underWay_;
-    watch(session_->store->removeItem(key), [this, key](const Outcome& outcome) {
-      --histories_[key].underWay;
-      --underWay_;
-      // A purge on the other queue may take the file away just before the removal does.
-      const bool mayMissItsFile = wasCorrupted_ && outcome.failedWith<FileUtilsIoException>();
-      EXPECT_TRUE(outcome.error == nullptr || mayMissItsFile || isEnding_)
-          << "remove " << key << ": " << outcome.what();
-    });
+    // A purge on the other queue may take the file away just before the removal does.
+    const auto missesItsFile = [this](const Outcome& outcome) {
+      return wasCorrupted_ && outcome.failedWith<FileUtilsIoException>();
+    };
+    watch(session_->store->removeItem(key), completing("remove", key, missesItsFile));
   }
 
   void use(const std::string& key) {
@@ -1020,7 +1060,7 @@ class InterleavedSequence {
     ++underWay_;
     watch(session_->store->fetch(key), [=](const Outcome& outcome) {
       --underWay_;
-      if (isEnding_) return;
+      if (isEnding_ || hasFailedQueue_) return;
       EXPECT_EQ(outcome.error, nullptr) << "fetch " << key << ": " << outcome.what();
       expectSeen(outcome, key, state, removals, isBeingCleared);
     });
@@ -1067,7 +1107,7 @@ class InterleavedSequence {
     };
     watch(session_->store->fetchFirst(keys, loader), [=](const Outcome& outcome) {
       --underWay_;
-      if (isEnding_ || isLossy_ || isBeingCleared) return;
+      if (isEnding_ || isLossy_ || isBeingCleared || hasFailedQueue_) return;
       EXPECT_EQ(outcome.error, nullptr) << outcome.what();
       if (expected.empty()) {
         EXPECT_EQ(outcome.result, nullptr);
@@ -1079,8 +1119,37 @@ class InterleavedSequence {
 
   void clear() {
     script_.say("clear");
-    for (auto& history : histories_) becomes(history.first, std::nullopt);
-    start([&](auto onSuccess, auto onError) { session_->store->clear(onSuccess, onError); });
+    std::map<std::string, std::size_t> cleared;
+    for (auto& [key, history] : histories_) {
+      becomes(key, std::nullopt);
+      cleared[key] = history.lastState();
+    }
+    start([&](auto onSuccess, auto onError) { session_->store->clear(onSuccess, onError); },
+          [this, cleared] { expectCleared(cleared); });
+  }
+
+  void expectCleared(const std::map<std::string, std::size_t>& cleared) {
+    for (const auto& [key, state] : cleared) {
+      acknowledge(key, state);
+      const bool isStoredSince = histories_[key].lastState() > state;
+      const bool hasFile = !setup_.inlineData && fs::exists(storePath() + "/" + key);
+      EXPECT_TRUE(isEnding_ || isStoredSince || mayLeaveFiles_ || !hasFile) << key << " is cleared, its file is there";
+    }
+  }
+
+  // What waits for the file queue never runs, or what is asked of it now is refused.
+  void failFileQueue() {
+    hasFailedQueue_ = true;
+    mayLeaveFiles_ = true;
+    ManualExecutor& files = session_->queue(Session::kFileQueue);
+    if (script_.oneIn(2)) {
+      script_.say("the file queue drops what waits");
+      return files.dropAll();
+    }
+    script_.say("the file queue refuses for a while");
+    files.throwOnDispatch(true);
+    pump(1 + script_.below(3));
+    files.throwOnDispatch(false);
   }
 
   void prune() {
@@ -1107,13 +1176,17 @@ class InterleavedSequence {
   }
 
   // Exactly one of the callbacks is called, and it is the first; none, when the store goes meanwhile.
-  template <class Start> void start(Start startNow) {
+  template <class Start> void start(Start startNow, std::function<void()> onSuccess = nullptr) {
     ++deletionsUnderWay_;
-    startNow([this] { --deletionsUnderWay_; },
-             [this](const std::exception& error) {
-               --deletionsUnderWay_;
-               if (!isEnding_) ADD_FAILURE() << error.what();
-             });
+    startNow(
+        [this, onSuccess] {
+          --deletionsUnderWay_;
+          if (onSuccess) onSuccess();
+        },
+        [this](const std::exception& error) {
+          --deletionsUnderWay_;
+          if (!isEnding_ && !hasFailedQueue_) ADD_FAILURE() << error.what();
+        });
   }
 
   // --- Ends ---
@@ -1144,41 +1217,49 @@ class InterleavedSequence {
       session_->drop();
     }
     EXPECT_EQ(underWay_, 0U) << "calls that never completed";
-    const bool mayLeaveFiles = kind == 1 || kind == 2;  // whose deletion was waiting
+    mayLeaveFiles_ = mayLeaveFiles_ || kind == 1 || kind == 2;  // whose deletion was waiting
     session_.reset();
     isEnding_ = false;
     deletionsUnderWay_ = 0;
-    takeOver(mayLeaveFiles);
+    takeOver();
     open();
     session_->drain();
     verify();
   }
 
-  // After an end in the middle each key is in one of the states it has been asked to take since the last rest.
-  void takeOver(bool mayLeaveFiles) {
+  // After an end in the middle each key is in one of the states that it has been asked to take since the last that was
+  // acknowledged.
+  void takeOver() {
     const auto rows = ManifestOnDisk(storePath()).rows();
     const auto files = valueFiles(storePath());
     for (const auto& [key, row] : rows) {
       ASSERT_TRUE(setup_.inlineData || files.count(key) > 0) << "record without a file: " << key;
-      const Bytes value = setup_.inlineData ? row.inlineData : files.at(key);
-      const auto& states = histories_[key].states;
-      EXPECT_TRUE(std::find(states.begin(), states.end(), std::make_optional(value)) != states.end())
-          << key << " holds what was never stored, or long gone: " << std::string(value.begin(), value.end());
-      EXPECT_EQ(row.size, value.size()) << key;
+      EXPECT_EQ(row.size, (setup_.inlineData ? row.inlineData : files.at(key)).size()) << key;
     }
     for (const auto& file : files) {
       if (rows.count(file.first) > 0) continue;
-      EXPECT_TRUE(mayLeaveFiles) << "file without a record: " << file.first;
+      EXPECT_TRUE(mayLeaveFiles_) << "file without a record: " << file.first;
       fs::remove(storePath() + "/" + file.first);
     }
     for (auto& [key, history] : histories_) {
       const auto row = rows.find(key);
-      history = History();
-      if (row != rows.end()) {
-        history.states.back() = setup_.inlineData ? row->second.inlineData : files.at(key);
-      }
+      std::optional<Bytes> state;
+      if (row != rows.end()) state = setup_.inlineData ? row->second.inlineData : files.at(key);
+      expectPossible(key, state);
+      rest(history, state);
     }
-    isLossy_ = false;
+    isLossy_ = hasFailedQueue_ = mayLeaveFiles_ = false;
+  }
+
+  void expectPossible(const std::string& key, const std::optional<Bytes>& state) {
+    const bool isPossible = histories_[key].mayBe(state) || (!state && isLossy_);
+    EXPECT_TRUE(isPossible) << key << " holds what was never stored or is long gone: "
+                            << (state ? std::string(state->begin(), state->end()) : "nothing");
+  }
+
+  static void rest(History& history, const std::optional<Bytes>& state) {
+    history = History();
+    history.states.back() = state;
   }
 
   // Runs everything, compares, and takes what has been lost where something may be lost for the new beginning.
@@ -1187,15 +1268,15 @@ class InterleavedSequence {
     EXPECT_EQ(underWay_, 0U) << "calls that never completed";
     EXPECT_EQ(deletionsUnderWay_, 0U) << "a clear or prune that called nobody back";
     verify();
-    const auto keys = session_->store->getAllKeys();
-    const std::set<std::string> present(keys.begin(), keys.end());
+    const auto rows = ManifestOnDisk(storePath()).rows();
+    const auto files = valueFiles(storePath());
     for (auto& [key, history] : histories_) {
-      auto last = history.last();
-      if (present.count(key) == 0) last.reset();
-      history = History();
-      history.states.back() = last;
+      const auto row = rows.find(key);
+      std::optional<Bytes> state;
+      if (row != rows.end()) state = setup_.inlineData ? row->second.inlineData : files.at(key);
+      rest(history, state);
     }
-    isLossy_ = false;
+    isLossy_ = hasFailedQueue_ = false;
   }
 
   // All is done: files, records on disk and records in memory say the same, and it is what the calls asked for.
@@ -1220,18 +1301,25 @@ class InterleavedSequence {
       ASSERT_TRUE(setup_.inlineData || files.count(key) > 0) << "record without a file: " << key;
       const Bytes& value = setup_.inlineData ? row.inlineData : files.at(key);
       EXPECT_EQ(row.size, value.size()) << key;
-      const std::optional<Bytes>& expected = histories_[key].last();
-      ASSERT_TRUE(expected) << key << " came back";
-      EXPECT_EQ(value, *expected) << key;
+      expectAtRest(key, value);
     }
-    for (const auto& file : files) EXPECT_EQ(rows.count(file.first), 1U) << "file without a record: " << file.first;
-    for (const auto& [key, history] : histories_) {
-      EXPECT_TRUE(!history.last() || isLossy_ || rows.count(key) > 0) << key << " is lost";
+    for (const auto& file : files) {
+      EXPECT_TRUE(rows.count(file.first) == 1 || mayLeaveFiles_) << "file without a record: " << file.first;
+    }
+    for (const auto& history : histories_) {
+      if (rows.count(history.first) == 0) expectAtRest(history.first, std::nullopt);
     }
     EXPECT_EQ(manifest->size(), total);
     if (setup_.capacity && !wasCorrupted_) {
       EXPECT_LE(manifest->count(), *setup_.capacity);
     }
+  }
+
+  // The last call has decided, unless the file queue has not done its part in that.
+  void expectAtRest(const std::string& key, const std::optional<Bytes>& state) {
+    if (hasFailedQueue_) return expectPossible(key, state);
+    EXPECT_TRUE(state == histories_[key].last() || (!state && isLossy_))
+        << key << (state ? " came back or is not the last" : " is lost");
   }
 
   // The files as they are at this moment, seen by the next process.
@@ -1247,7 +1335,7 @@ class InterleavedSequence {
         const auto outcome = watch(next.store->fetch(key));
         next.drain();
         EXPECT_TRUE(outcome->isDone);
-        if (history.underWay > 0 || deletionsUnderWay_ > 0) continue;  // old, new or a part
+        if (history.underWay > 0 || deletionsUnderWay_ > 0 || hasFailedQueue_) continue;  // old, new or a part
         expectLeft(*outcome, key, history);
       }
     }
@@ -1275,9 +1363,11 @@ class InterleavedSequence {
   std::map<std::string, History> histories_;
   unsigned int underWay_ = 0;
   unsigned int deletionsUnderWay_ = 0;
-  bool isLossy_ = false;       // since the last rest something may have taken any item away
-  bool wasCorrupted_ = false;  // writes that were queued beside a purge may have gone past the capacity
-  bool isEnding_ = false;      // calls may fail now
+  bool isLossy_ = false;         // since the last rest something may have taken any item away
+  bool wasCorrupted_ = false;    // writes that were queued beside a purge may have gone past the capacity
+  bool hasFailedQueue_ = false;  // since the last rest some calls have not been carried out
+  bool mayLeaveFiles_ = false;   // since the last beginning a deletion may have been dropped
+  bool isEnding_ = false;        // calls may fail now
   std::unique_ptr<Session> session_;
 };
 

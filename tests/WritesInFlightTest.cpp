@@ -383,7 +383,7 @@ class MemoryFiles final : public FileUtils {
 
 // What a script's letters mean: A and B store a value under "a" and "b"; F fails to store one under "a" halfway; a and
 // b remove; g and h fetch "a" and "b"; C clears; P prunes to two bytes, which is one value; I invalidates; X lets go of
-// the store.
+// the store; D makes the file queue drop what waits, R makes it refuse what comes from then on.
 struct Scenario {
   std::string script;
   Contents before;
@@ -401,6 +401,10 @@ class Performance {
                                         nullptr, manifest, files_, nullptr, 50);
     clock.set(KeyValueStoreFixture::kStart);
     for (const auto& item : scenario.before) store_->store(item.first, bytesOf(item.second));
+    for (const char* key : {"a", "b"}) {
+      const auto item = scenario.before.find(key);
+      states_[key].push_back(item == scenario.before.end() ? std::nullopt : std::make_optional(item->second));
+    }
     queues_->runAll();
     clock.advance(1);
   }
@@ -416,12 +420,12 @@ class Performance {
   void check() const {
     for (const Written& written : written_) EXPECT_EQ(written->completions, 1);
     for (const Written& written : mustSucceed_) {
-      EXPECT_TRUE(written->hasSucceeded() || isInvalidated_) << told(written);
+      EXPECT_TRUE(written->hasSucceeded() || mayBeCutShort()) << told(written);
     }
     for (const Expectation& expectation : fetched_) {
       const std::string seen = told(expectation.fetched);
       const bool asExpected = seen == expectation.value || (seen == "<miss>" && mayBeMissed(expectation));
-      EXPECT_TRUE(asExpected || isInvalidated_ || store_ == nullptr) << seen << " instead of " << expectation.value;
+      EXPECT_TRUE(asExpected || mayBeCutShort()) << seen << " instead of " << expectation.value;
       EXPECT_FALSE(expectation.fetched->isPending());
     }
     EXPECT_LE(ends_, clearsAndPrunes_);
@@ -448,7 +452,7 @@ class Performance {
       case 'B':
         return put("b", value);
       case 'F':
-        model_.erase("a");
+        becomes("a", std::nullopt);
         return written_.push_back(watch(store_->store("a", nullptr, [this](const std::string& path) -> unsigned int {
           files_->writeFile(path, bytesOf("half"));
           throw std::runtime_error("The writer gave up.");
@@ -462,30 +466,82 @@ class Performance {
       case 'h':
         return fetch("b");
       case 'C':
-        model_.clear();
-        ++clearsAndPrunes_;
-        return store_->clear([this] { ++ends_; }, [this](const std::exception&) { ++ends_; });
+        return clear();
       case 'P':
         ++clearsAndPrunes_;
         return store_->pruneBackToNormal([this] { ++ends_; }, [this](const std::exception&) { ++ends_; }, false);
       case 'I':
         isInvalidated_ = true;
         return written_.push_back(watch(store_->invalidateWithFuture()));
+      case 'D':
+        hasFailedQueue_ = true;
+        file().dropAll();
+        return;
+      case 'R':
+        hasFailedQueue_ = true;
+        return file().throwOnDispatch(true);
       default:
         return store_.reset();
     }
   }
 
+  // The next state of a key.
+  void becomes(const std::string& key, const std::optional<std::string>& value) {
+    states_[key].push_back(value);
+    value ? static_cast<void>(model_[key] = *value) : static_cast<void>(model_.erase(key));
+  }
+
+  // A store that has gone answers without having done anything.
+  void acknowledge(const std::string& key, std::size_t state) {
+    if (store_ != nullptr) acknowledged_[key] = std::max(acknowledged_[key], state);
+  }
+
+  // Calls that change a key to its latest state.
+  void follow(const std::string& key, Future<void> future) {
+    auto outcome = std::make_shared<test::Outcome<test::Done>>();
+    future.then(nullptr, [this, outcome, key, state = states_[key].size() - 1](std::future<void>& result) {
+      ++outcome->completions;
+      try {
+        result.get();
+        acknowledge(key, state);
+      } catch (...) {
+        outcome->failure = std::current_exception();
+      }
+    });
+    mustSucceed_.push_back(outcome);
+    written_.push_back(outcome);
+  }
+
   void put(const std::string& key, const std::string& value) {
-    model_[key] = value;
-    mustSucceed_.push_back(watch(store_->store(key, bytesOf(value))));
-    written_.push_back(mustSucceed_.back());
+    becomes(key, value);
+    follow(key, store_->store(key, bytesOf(value)));
   }
 
   void remove(const std::string& key) {
-    model_.erase(key);
-    mustSucceed_.push_back(watch(store_->removeItem(key)));
-    written_.push_back(mustSucceed_.back());
+    becomes(key, std::nullopt);
+    follow(key, store_->removeItem(key));
+  }
+
+  void clear() {
+    ++clearsAndPrunes_;
+    std::map<std::string, std::size_t> cleared;
+    for (const char* key : {"a", "b"}) {
+      becomes(key, std::nullopt);
+      cleared[key] = states_[key].size() - 1;
+    }
+    store_->clear(
+        [this, cleared] {
+          ++ends_;
+          for (const auto& [key, state] : cleared) expectCleared(key, state);
+        },
+        [this](const std::exception&) { ++ends_; });
+  }
+
+  void expectCleared(const std::string& key, std::size_t state) {
+    acknowledge(key, state);
+    const bool isStoredSince = states_[key].size() - 1 > state;
+    const bool hasFile = files_->pathExists("store/" + key);
+    EXPECT_TRUE(isStoredSince || hasFailedQueue_ || store_ == nullptr || !hasFile) << key << " has a file still";
   }
 
   void fetch(const std::string& key) {
@@ -503,15 +559,35 @@ class Performance {
   // Whether it depends on the order which items go.
   bool isSelective() const { return scenario_.capacity || scenario_.script.find('P') != std::string::npos; }
 
+  // Whether operations may have ended without being carried out.
+  bool mayBeCutShort() const { return isInvalidated_ || hasFailedQueue_ || store_ == nullptr; }
+
+  // Each key is in one of its states since the last that was acknowledged.
+  void checkStates(const Contents& values) const {
+    if (isSelective()) return;
+    for (const auto& [key, states] : states_) {
+      const auto value = values.find(key);
+      const auto found = value == values.end() ? std::nullopt : std::make_optional(value->second);
+      const auto acknowledged = acknowledged_.find(key);
+      const std::size_t first = acknowledged == acknowledged_.end() ? 0 : acknowledged->second;
+      const auto earliest = states.begin() + static_cast<std::ptrdiff_t>(first);
+      const bool isPossible = std::find(earliest, states.end(), found) != states.end();
+      EXPECT_TRUE(isPossible) << key << " is " << found.value_or("missing");
+    }
+  }
+
   void checkDisk() const {
     Contents files;
     for (const auto& file : files_->files) files[file.first.substr(std::string("store/").size())] = file.second;
+    Contents values;
     const auto rows = medium_->rows();
     for (const auto& row : rows) {
       ASSERT_EQ(files.count(row.first), 1U) << "a record without a file: " << row.first;
       EXPECT_EQ(row.second.item.size, files[row.first].size()) << row.first;
+      values[row.first] = files[row.first];
     }
-    if (store_ == nullptr) return;  // deletions that had not begun will not begin any more
+    checkStates(values);
+    if (store_ == nullptr || hasFailedQueue_) return;  // deletions that had not begun will not begin any more
     for (const auto& file : files) ASSERT_EQ(rows.count(file.first), 1U) << "a file without a record: " << file.first;
     if (isInvalidated_) return;
     for (const auto& file : files) {
@@ -529,8 +605,11 @@ class Performance {
 
   const Scenario& scenario_;
   Contents model_;  // what the calls so far leave behind, one after the other
+  std::map<std::string, std::vector<std::optional<std::string>>> states_;  // of each key, in the order of the calls
+  std::map<std::string, std::size_t> acknowledged_;                        // the latest of them that was
   std::size_t next_ = 0;
   bool isInvalidated_ = false;
+  bool hasFailedQueue_ = false;
   int clearsAndPrunes_ = 0;
   int ends_ = 0;
   std::vector<Written> written_;
@@ -622,6 +701,18 @@ TEST_F(InEveryOrder, LongerScriptsLeaveWhatTheySay) {
 TEST_F(InEveryOrder, AStoreThatGoesLeavesNoRecordWithoutAFile) {
   performAll(scripts("ABFaCP", 2), {none, oldA, oldB}, std::nullopt, "X");
   performAll(scripts("AB", 2), {none, oldB}, 1, "X");
+}
+
+TEST_F(InEveryOrder, AFileQueueThatDropsWhatWaitsLosesNoOlderValue) {
+  performAll(scripts("ABFaCP", 2), {none, oldA, oldB}, std::nullopt, "D");
+  performAll({"AADg", "ADA", "ADa", "AaDA", "AFDA", "FADA", "ACDA", "ADX", "DAX"}, {oldA});
+  performAll(scripts("AB", 2), {none, oldB}, 1, "D");
+}
+
+TEST_F(InEveryOrder, AFileQueueThatRefusesLosesNoOlderValue) {
+  performAll(scripts("ABFaCP", 2), {none, oldA, oldB}, std::nullopt, "R");
+  performAll({"RA", "RAg", "ARA", "RAA", "ARa", "FRA", "ARC", "ARX"}, {none, oldA});
+  performAll(scripts("AB", 2), {none, oldB}, 1, "R");
 }
 
 TEST_F(InEveryOrder, AnInvalidatedStoreLeavesNoHalves) {
