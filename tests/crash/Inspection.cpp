@@ -67,28 +67,41 @@ ManifestFacts factsOf(const fs::path& manifest, const fs::path& place) {
 
 std::map<std::string, ManifestFacts> factsOfAll(const std::string& root) {
   std::map<std::string, ManifestFacts> facts;
-  const fs::path area = fs::path(root) / "caches";
-  if (!fs::exists(area)) return facts;
-  for (const auto& entry : fs::recursive_directory_iterator(area)) {
-    if (entry.path().filename() != kManifest) continue;
-    facts[entry.path().parent_path().string()] = factsOf(entry.path(), fs::path(root) / "copy.sqlite");
+  for (const char* area : {"caches", "documents"}) {
+    if (!fs::exists(fs::path(root) / area)) continue;
+    for (const auto& entry : fs::recursive_directory_iterator(fs::path(root) / area)) {
+      if (entry.path().filename() != kManifest) continue;
+      facts[entry.path().parent_path().string()] = factsOf(entry.path(), fs::path(root) / "copy.sqlite");
+    }
   }
   return facts;
 }
 
+// A value in short: its length, and whose and which version it says that it is.
+std::string sayingOf(const Ledger::Bytes& value) {
+  const auto end = std::find(value.begin(), value.end(), ';');
+  return std::to_string(value.size()) + " bytes, \"" + std::string(value.begin(), end) + "\"";
+}
+
 class Inspector {
  public:
-  Inspector(const std::string& root, Ledger& ledger, Findings& findings)
-      : facts_(factsOfAll(root)), ledger_(ledger), findings_(findings), host_(kConfiguration, root) {}
+  Inspector(const std::string& root, Ending ending, Ledger& ledger, Findings& findings)
+      : facts_(factsOfAll(root)),
+        ending_(ending),
+        ledger_(ledger),
+        findings_(findings),
+        orphansBefore_(std::exchange(findings.orphans, {})),
+        host_(kConfiguration, root) {}
 
   void run() {
     for (const auto& [path, facts] : facts_) {
       if (facts.integrity != "ok") blame(path + " is damaged: " + facts.integrity);
     }
     for (std::size_t number = 0; number < kStores.size(); ++number) {
-      stores_.push_back(host_.store<PersistentKeyValueStore>(kStores.at(number).identifier));
+      stores_.push_back(host_.store<PersistentKeyValueStore>(kStores.at(number).identifier, kSession));
       checkSize(number);
     }
+    for (std::size_t number = 0; number < kStores.size(); ++number) checkFiles(number);
     for (const Ledger::Key& key : ledger_.keys()) checkKey(key);
     for (std::size_t number = 0; number < kStores.size(); ++number) {
       checkNames(number);
@@ -98,7 +111,7 @@ class Inspector {
   }
 
  private:
-  void blame(const std::string& fault) { findings_.faults.push_back(fault); }
+  void blame(const std::string& fault) { findings_.faults.push_back(nameOf(ending_) + (", " + fault)); }
 
   void checkSize(std::size_t number) {
     PersistentKeyValueStore& store = *stores_[number];
@@ -121,20 +134,24 @@ class Inspector {
       error = exception.what();
     }
     bool isMiddle = false;
-    const Outcome outcome = ledger_.judge(key, found, isError, isMiddle);
+    const Outcome outcome = judge(key, found, isError, isMiddle);
     count(outcome, isMiddle);
     if (outcome == Outcome::Forbidden) {
-      const std::string what = isError ? error : found ? std::to_string(found->size()) + " bytes" : "missing";
-      blame(std::string(kStores.at(key.first).identifier) + " " + keyName(key.second) + ": " + what +
-            (found
-                 ? " beginning with " +
-                       std::string(found->begin(), found->begin() + std::min<std::ptrdiff_t>(
-                                                                        40, static_cast<std::ptrdiff_t>(found->size())))
-                 : ""));
+      blame(std::string(kStores.at(key.first).identifier) + " " + keyName(key.second) + ": " +
+            (isError ? error
+             : found ? sayingOf(*found)
+                     : "missing"));
     }
     const auto version = found ? ledger_.versionOf(key, *found) : std::nullopt;
     if ((found || isError) && !version) remove(key);
     ledger_.settle(key, version);
+  }
+
+  // A process that has ended by itself has left nothing half done.
+  Outcome judge(const Ledger::Key& key, const std::optional<Ledger::Bytes>& found, bool isError, bool& isMiddle) const {
+    const Outcome outcome = ledger_.judge(key, found, isError, isMiddle);
+    const bool isHalf = outcome == Outcome::Partial || outcome == Outcome::Older || outcome == Outcome::Error;
+    return isHalf && ending_ != Ending::Killed ? Outcome::Forbidden : outcome;
   }
 
   void count(Outcome outcome, bool isMiddle) {
@@ -157,20 +174,35 @@ class Inspector {
     if (host::await(stores_[key.first]->fetch(name)) != nullptr) blame(name + " cannot be removed");
   }
 
-  // No key that nobody has stored, and what files there are beside the records'.
+  std::set<std::string> recordedKeys(std::size_t number) {
+    const auto keys = stores_[number]->getAllKeys();
+    return {keys.begin(), keys.end()};
+  }
+
+  // What files there are beside the records'. An acknowledged clear has left none.
+  void checkFiles(std::size_t number) {
+    const std::set<std::string> recorded = recordedKeys(number);
+    std::set<std::string> cleared;
+    for (const Ledger::Key& key : ledger_.keys()) {
+      if (key.first == number && ledger_.isCleared(key)) cleared.insert(keyName(key.second));
+    }
+    for (const auto& entry : fs::directory_iterator(stores_[number]->path)) {
+      const std::string name = entry.path().filename().string();
+      if (name.rfind("key", 0) != 0 || recorded.count(name) > 0) continue;
+      const std::string path = entry.path().string();
+      findings_.orphans.insert(path);
+      if (cleared.count(name) > 0 && orphansBefore_.count(path) == 0) blame(path + " has been cleared and is there");
+    }
+  }
+
+  // No key that nobody has stored.
   void checkNames(std::size_t number) {
     std::set<std::string> known;
     for (const Ledger::Key& key : ledger_.keys()) {
       if (key.first == number) known.insert(keyName(key.second));
     }
-    std::set<std::string> recorded;
-    for (const std::string& name : stores_[number]->getAllKeys()) {
-      recorded.insert(name);
+    for (const std::string& name : recordedKeys(number)) {
       if (known.count(name) == 0) blame("nobody has stored " + name);
-    }
-    for (const auto& entry : fs::directory_iterator(stores_[number]->path)) {
-      const std::string name = entry.path().filename().string();
-      if (name.rfind("key", 0) == 0 && recorded.count(name) == 0) ++findings_.orphans;
     }
   }
 
@@ -187,20 +219,35 @@ class Inspector {
 
   const test::LogCapture log_;
   const std::map<std::string, ManifestFacts> facts_;
+  const Ending ending_;
   Ledger& ledger_;
   Findings& findings_;
+  const std::set<std::string> orphansBefore_;
   host::Host host_;
   std::vector<std::shared_ptr<PersistentKeyValueStore>> stores_;
 };
 
 }  // namespace
 
-void inspect(const std::string& root, Ledger& ledger, Findings& findings) {
+void inspect(const std::string& root, Ending ending, Ledger& ledger, Findings& findings) {
   try {
-    Inspector(root, ledger, findings).run();
+    Inspector(root, ending, ledger, findings).run();
   } catch (const std::exception& error) {
     findings.faults.push_back(std::string("the restart fails: ") + error.what());
   }
 }
 
+void intrude(const std::string& root, pid_t owner, Findings& findings) {
+  try {
+    const host::Host second(kConfiguration, root);
+    findings.faults.emplace_back("a second host was let in while another process had the root");
+  } catch (const std::exception& error) {
+    const std::string text = error.what();
+    const bool saysWho = text.find(root) != std::string::npos && text.find(std::to_string(owner)) != std::string::npos;
+    if (!saysWho) findings.faults.push_back("a second host is not told who has the root: " + text);
+    ++findings.hostsRefused;
+  }
+}
+
+void endSession(const std::string&, Ledger&, Findings&) {}  // TMP
 }  // namespace velmora::mobile::xplat::cellar::crash

@@ -21,28 +21,58 @@ bool isOlder(const Ledger::Key& key, const Ledger::Bytes& found) {
 void Ledger::note(const Record& record) {
   if (record.kind == Record::Kind::Done) ++acknowledged;
   if (record.kind == Record::Kind::Failed) ++failed;
+  if (record.kind == Record::Kind::Dropped) ++dropped;
   if (record.kind == Record::Kind::Ready || record.operation == Record::Operation::Fetch) return;
 
-  const State wanted{record.operation == Record::Operation::Store, record.version, record.length};
   lastVersion_ = std::max(lastVersion_, record.version);
+  if (record.operation == Record::Operation::Clear) return noteClear(record);
+  const State wanted{record.operation == Record::Operation::Store, record.version, record.length};
   auto& attempts = histories_[{record.store, record.key}].attempts;
-  if (record.kind == Record::Kind::Begun) return attempts.push_back({wanted, false});
-  if (record.kind == Record::Kind::Failed) return;  // whatever it has left
+  if (record.kind == Record::Kind::Begun) return attempts.push_back({wanted});
+  if (record.kind == Record::Kind::Dropped) return;
   for (Attempt& attempt : attempts) {
-    const bool isIt =
-        !attempt.isAcknowledged && attempt.wanted.isThere == wanted.isThere && attempt.wanted.version == wanted.version;
+    const bool isIt = !attempt.isAcknowledged && !attempt.hasFailed && attempt.wanted.isThere == wanted.isThere &&
+                      attempt.wanted.version == wanted.version;
     if (!isIt) continue;
-    attempt.isAcknowledged = true;
+    (record.kind == Record::Kind::Done ? attempt.isAcknowledged : attempt.hasFailed) = true;
     return;
   }
 }
 
+// What was acknowledged before a clear was asked for is gone when that is done. What was under way may be or not.
+void Ledger::noteClear(const Record& record) {
+  if (record.kind == Record::Kind::Begun) {
+    Met& met = clears_[record.version];
+    for (const auto& [key, history] : histories_) {
+      if (key.first != record.store) continue;
+      const auto& attempts = history.attempts;
+      const auto last = std::find_if(attempts.rbegin(), attempts.rend(),
+                                     [](const Attempt& attempt) { return attempt.isAcknowledged; });
+      met[key] = static_cast<std::size_t>(attempts.rend() - last);
+    }
+  } else if (record.kind == Record::Kind::Done) {
+    for (const auto& [key, count] : clears_[record.version]) {
+      auto& cleared = histories_[key].cleared;
+      cleared = std::max(cleared.value_or(0), count);
+    }
+  }
+}
+
+bool Ledger::isCleared(const Key& key) const {
+  const auto history = histories_.find(key);
+  return history != histories_.end() && history->second.cleared == history->second.attempts.size();
+}
+
 std::vector<Ledger::State> Ledger::possible(const History& history) {
   std::vector<State> states = {history.settled};
-  for (const Attempt& attempt : history.attempts) {
+  for (std::size_t i = 0; i <= history.attempts.size(); ++i) {
+    if (history.cleared == i) states = {State{}};
+    if (i == history.attempts.size()) break;
+    const Attempt& attempt = history.attempts[i];
     // Operations on a key take effect in order: this one has, and so have those before it.
     if (attempt.isAcknowledged) states.clear();
     states.push_back(attempt.wanted);
+    if (attempt.hasFailed) states.push_back({});
   }
   return states;
 }
@@ -85,8 +115,7 @@ std::optional<std::pair<std::uint32_t, std::uint32_t>> Ledger::versionOf(const K
 
 void Ledger::settle(const Key& key, std::optional<std::pair<std::uint32_t, std::uint32_t>> versionAndLength) {
   History& history = histories_[key];
-  history.attempts.clear();
-  history.settled = {};
+  history = {};
   if (!versionAndLength) return;
   history.settled = {true, versionAndLength->first, versionAndLength->second};
   lastVersion_ = std::max(lastVersion_, versionAndLength->first);

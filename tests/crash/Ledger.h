@@ -30,6 +30,9 @@ class Ledger {
   // under way.
   Outcome judge(const Key& key, const std::optional<Bytes>& found, bool isError, bool& isMiddle) const;
 
+  // Whether a clear that was acknowledged has taken the key, and nobody has asked for anything with it since.
+  bool isCleared(const Key& key) const;
+
   // From now on this is the state: what was found after the kill, or what was stored since.
   void settle(const Key& key, std::optional<std::pair<std::uint32_t, std::uint32_t>> versionAndLength);
 
@@ -41,6 +44,7 @@ class Ledger {
 
   std::size_t acknowledged = 0;
   std::size_t failed = 0;
+  std::size_t dropped = 0;
 
  private:
   struct State {
@@ -51,16 +55,22 @@ class Ledger {
   struct Attempt {
     State wanted;
     bool isAcknowledged = false;
+    bool hasFailed = false;  // and may have taken what was there
   };
   struct History {
     State settled;
-    std::vector<Attempt> attempts;  // in the order in which they were called
+    std::vector<Attempt> attempts;       // in the order in which they were called
+    std::optional<std::size_t> cleared;  // so many of them a clear has certainly met, and undone
   };
+  using Met = std::map<Key, std::size_t>;  // how many attempts a clear meets for certain
 
   // The states that may be found: the last acknowledged one and then what was wanted after it.
   static std::vector<State> possible(const History& history);
 
+  void noteClear(const Record& record);
+
   std::map<Key, History> histories_;
+  std::map<std::uint32_t, Met> clears_;  // under way, by number
   std::uint32_t lastVersion_ = 0;
 };
 

@@ -18,8 +18,18 @@ const char* const kConfiguration = R"({
       "chunks": {"type": "disk_cache", "lru_size_limit": "10KB", "inline_data": true, "stale_age": "10 years",
                  "metadata_factory": "video_download", "prune_strategy": "video_download"}
     }
+  },
+  "inbox": {
+    "area": "documents",
+    "stores": {"drafts": {"type": "pkvs", "stale_age": "10 years"}}
   }
 })";
+
+const char* nameOf(Ending ending) {
+  static constexpr std::array<const char*, 6> names = {"killed",         "closed at rest",   "closed while busy",
+                                                       "closed at once", "queues shut down", "let go"};
+  return names.at(static_cast<std::size_t>(ending));
+}
 
 std::string keyName(std::uint32_t key) { return "key" + std::to_string(key); }
 

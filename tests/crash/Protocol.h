@@ -16,18 +16,36 @@ struct StoreInfo {
   bool isInline;
   bool keepsAll;  // nothing but a removal takes a value away
 };
-constexpr std::array<StoreInfo, 5> kStores = {{{"letters", 40, 20000, false, true},
+constexpr std::array<StoreInfo, 6> kStores = {{{"letters", 40, 20000, false, true},
                                                {"settings", 40, 1500, true, true},
                                                {"recent", 60, 8000, false, false},
                                                {"thumbs", 60, 8000, false, false},
-                                               {"chunks", 60, 1500, true, false}}};
+                                               {"chunks", 60, 1500, true, false},
+                                               {"drafts", 30, 5000, false, true}}};
+constexpr std::size_t kRecent = 2;  // is cleared now and then
+constexpr std::size_t kDrafts = 5;  // of the session
+constexpr const char* kSession = "alice";
 
 extern const char* const kConfiguration;
 
+// How the worker is to end.
+enum class Ending : std::uint8_t {
+  Killed,
+  AtRest,     // nobody asks for anything any more: the host finishes what is queued
+  Busy,       // the host is destroyed while threads go on asking, and has a second for it
+  Impatient,  // the same, at once
+  ShutDown,   // the application's own queues are shut down, then the host is destroyed, while threads go on asking
+  LetGo,      // the host and all stores are released, and the application's own queues finish what is queued
+};
+
+// Whether each operation that was asked for is carried out.
+constexpr bool finishesAll(Ending ending) { return ending == Ending::AtRest || ending == Ending::LetGo; }
+
 // What the worker tells through the pipe, in whole records: before it asks for an operation and when that is done.
+// `Dropped`: its promise was broken, so that it has not begun. A clear has no key, and its number for a version.
 struct Record {
-  enum class Kind : std::uint8_t { Ready, Begun, Done, Failed };
-  enum class Operation : std::uint8_t { Store, Remove, Fetch };
+  enum class Kind : std::uint8_t { Ready, Begun, Done, Failed, Dropped };
+  enum class Operation : std::uint8_t { Store, Remove, Fetch, Clear };
 
   Kind kind;
   Operation operation;
@@ -37,6 +55,8 @@ struct Record {
   std::uint32_t version;  // counts up by key over all workers
   std::uint32_t length;   // of the value
 };
+
+const char* nameOf(Ending ending);
 
 std::string keyName(std::uint32_t key);
 

@@ -1,16 +1,21 @@
 #include "crash/Worker.h"
 
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <condition_variable>
 #include <cstdlib>
+#include <exception>
 #include <fstream>
 #include <future>
 #include <memory>
 #include <mutex>
 #include <random>
+#include <stdexcept>
+#include <string>
 #include <thread>
 #include <utility>
 #include <vector>
@@ -18,22 +23,23 @@
 #include "DiskCache.h"
 #include "FileUtils.h"
 #include "TrashCollector.h"
-#include "crash/Protocol.h"
 #include "host/Host.h"
+#include "host/ThreadQueueFactory.h"
 
 namespace velmora::mobile::xplat::cellar::crash {
 
 namespace {
 
 constexpr std::size_t kThreads = 3;
-constexpr int kMaxOutstanding = 8;  // for each thread
 
 // Lets a thread have a few operations on their way, and no more.
 class Window {
  public:
+  explicit Window(int most) : most_(most) {}
+
   void enter() {
     std::unique_lock<std::mutex> lock(mutex_);
-    room_.wait(lock, [this] { return outstanding_ < kMaxOutstanding; });
+    changed_.wait(lock, [this] { return outstanding_ < most_; });
     ++outstanding_;
   }
   void leave() {
@@ -41,12 +47,17 @@ class Window {
       const std::lock_guard<std::mutex> lock(mutex_);
       --outstanding_;
     }
-    room_.notify_one();
+    changed_.notify_all();
+  }
+  void waitUntilEmpty() {
+    std::unique_lock<std::mutex> lock(mutex_);
+    changed_.wait(lock, [this] { return outstanding_ == 0; });
   }
 
  private:
+  const int most_;
   std::mutex mutex_;  // guards the number
-  std::condition_variable room_;
+  std::condition_variable changed_;
   int outstanding_ = 0;
 };
 
@@ -60,27 +71,71 @@ PersistentKeyValueStore::Writer pieceByPiece(std::vector<unsigned char> value) {
                               value.begin() + static_cast<std::ptrdiff_t>(std::min(done + kPiece, value.size())));
       file << piece << std::flush;
     }
+    if (!file) throw std::runtime_error("The file cannot be written.");
     return static_cast<unsigned int>(value.size());
   };
 }
 
+bool hasOwnQueues(Ending ending) { return ending == Ending::ShutDown || ending == Ending::LetGo; }
+
+std::unique_ptr<host::Host> startHost(const Task& task, std::shared_ptr<TaskQueueFactory> queues) {
+  host::HostOptions options;
+  options.configuration = kConfiguration;
+  options.root = task.root;
+  options.taskQueueFactory = std::move(queues);
+  if (task.ending == Ending::Busy) options.shutDownPatience = std::chrono::seconds(1);
+  if (task.ending == Ending::Impatient) options.shutDownPatience = std::chrono::seconds(0);
+  return std::make_unique<host::Host>(std::move(options));
+}
+
 class Worker {
  public:
-  Worker(const std::string& root, std::uint32_t firstVersion, int pipe)
-      : root_(root), host_(kConfiguration, root), pipe_(pipe), version_(firstVersion) {
-    for (const StoreInfo& info : kStores) stores_.push_back(host_.store<PersistentKeyValueStore>(info.identifier));
+  explicit Worker(const Task& task)
+      : task_(task),
+        queues_(hasOwnQueues(task.ending) ? std::make_shared<host::ThreadQueueFactory>() : nullptr),
+        host_(startHost(task, queues_)),
+        trash_(host_->trash()),
+        version_(task.firstVersion) {
+    for (const StoreInfo& info : kStores) {
+      stores_.push_back(host_->store<PersistentKeyValueStore>(info.identifier, kSession));
+    }
+    const int most = task.ending == Ending::Killed ? 8 : 32;
+    for (std::size_t i = 0; i < kThreads; ++i) windows_.push_back(std::make_shared<Window>(most));
   }
 
+  void start() {
+    tell(Record{});
+    for (std::size_t i = 0; i < kThreads; ++i) threads_.emplace_back([this, i] { run(i); });
+  }
+
+  void end() {
+    const bool isBusy = !finishesAll(task_.ending);
+    if (!isBusy) stopAsking();
+    if (task_.ending == Ending::LetGo) stores_.clear();
+    if (task_.ending == Ending::ShutDown) queues_->shutDown();
+    host_.reset();
+    if (isBusy) stopAsking();
+    for (const auto& window : windows_) window->waitUntilEmpty();
+    stores_.clear();
+    queues_.reset();
+  }
+
+ private:
   void tell(const Record& record) const {
     // Less than a pipe takes in one piece. A parent that has gone takes this process along.
-    if (::write(pipe_, &record, sizeof record) != static_cast<ssize_t>(sizeof record)) std::_Exit(3);
+    if (::write(task_.pipe, &record, sizeof record) != static_cast<ssize_t>(sizeof record)) std::_Exit(3);
+  }
+
+  void stopAsking() {
+    stops_ = true;
+    for (std::thread& thread : threads_) thread.join();
   }
 
   // Each thread has its own keys, so that the order of the operations on a key is known.
-  void run(std::size_t thread, std::uint64_t seed) {
-    std::mt19937_64 random(seed);
-    const auto window = std::make_shared<Window>();
-    while (true) {
+  void run(std::size_t thread) {
+    std::mt19937_64 random(task_.seed + thread);
+    const auto window = windows_[thread];
+    while (!stops_) {
       const auto dice = random() % 1000;
       if (dice < 3) {
         housekeep(random());
@@ -91,12 +146,13 @@ class Worker {
     }
   }
 
- private:
   template <class T> void report(Future<T> future, Record record, std::shared_ptr<Window> window) {
     future.then(nullptr, [this, record, window = std::move(window)](std::future<T>& result) mutable {
       record.kind = Record::Kind::Done;
       try {
         result.get();
+      } catch (const std::future_error&) {
+        record.kind = Record::Kind::Dropped;
       } catch (const std::exception&) {
         record.kind = Record::Kind::Failed;
       }
@@ -136,11 +192,11 @@ class Worker {
     }
   }
 
-  // Limits are enforced and directories thrown away in the midst of it all.
+  // Limits are enforced, directories thrown away and descriptors used up in the midst of it all.
   void housekeep(std::uint64_t dice) {
     const auto done = [] {};
     const auto failed = [](const std::exception&) {};
-    switch (dice % 5) {
+    switch (dice % 6) {
       case 0:
         return stores_[3]->pruneBackToNormal(done, failed, false);
       case 1:
@@ -148,35 +204,73 @@ class Worker {
       case 2:
         return stores_[3]->pruneBackToNormal(done, failed, true);
       case 3:
-        return stores_[2]->clear(done, failed);
+        return clear();
+      case 4:
+        return goWithoutDescriptors();
       default:
         return throwATreeAway(dice);
     }
   }
 
-  void throwATreeAway(std::uint64_t dice) {
-    FileUtils files;
-    const std::string tree = root_ + "/tree" + std::to_string(dice);
-    files.createDirectory(tree + "/branch", true);
-    for (int i = 0; i < 20; ++i) files.writeFile(tree + "/branch/" + std::to_string(i), {'x'});
-    host_.trash()->collectPath(tree);
+  void clear() {
+    Record record{};
+    record.kind = Record::Kind::Begun;
+    record.operation = Record::Operation::Clear;
+    record.store = kRecent;
+    record.version = ++version_;
+    tell(record);
+    const auto telling = [this, record](Record::Kind kind) {
+      Record ended = record;
+      ended.kind = kind;
+      tell(ended);
+    };
+    stores_[kRecent]->clear([telling] { telling(Record::Kind::Done); },
+                            [telling](const std::exception&) { telling(Record::Kind::Failed); });
   }
 
-  const std::string root_;
-  host::Host host_;
-  const int pipe_;
+  // For a moment nothing can be opened.
+  void goWithoutDescriptors() {
+    const std::lock_guard<std::mutex> lock(limitMutex_);
+    rlimit before{};
+    if (::getrlimit(RLIMIT_NOFILE, &before) != 0) return;
+    const rlimit none = {0, before.rlim_max};
+    (void)::setrlimit(RLIMIT_NOFILE, &none);
+    std::this_thread::sleep_for(std::chrono::microseconds(300));
+    (void)::setrlimit(RLIMIT_NOFILE, &before);
+  }
+
+  void throwATreeAway(std::uint64_t dice) {
+    FileUtils files;
+    const std::string tree = task_.root + "/tree" + std::to_string(dice);
+    try {
+      files.createDirectory(tree + "/branch", true);
+      for (int i = 0; i < 20; ++i) files.writeFile(tree + "/branch/" + std::to_string(i), {'x'});
+    } catch (const std::exception&) {  // without descriptors
+    }
+    trash_->collectPath(tree);
+  }
+
+  const Task task_;
+  std::shared_ptr<host::ThreadQueueFactory> queues_;  // the application's own, or null
+  std::unique_ptr<host::Host> host_;
+  const std::shared_ptr<TrashCollector> trash_;
   std::atomic<std::uint32_t> version_;
+  std::atomic<bool> stops_{false};
+  std::mutex limitMutex_;  // so that the limit that is found is the process's own
   std::vector<std::shared_ptr<PersistentKeyValueStore>> stores_;
+  std::vector<std::shared_ptr<Window>> windows_;
+  std::vector<std::thread> threads_;
 };
 
 }  // namespace
 
-void work(const std::string& root, std::uint64_t seed, std::uint32_t firstVersion, int pipe) {
-  Worker worker(root, firstVersion, pipe);
-  worker.tell(Record{});
-  std::vector<std::thread> threads;
-  for (std::size_t i = 0; i < kThreads; ++i) threads.emplace_back([&, i] { worker.run(i, seed + i); });
-  for (std::thread& thread : threads) thread.join();
+void work(const Task& task) {
+  Worker worker(task);
+  worker.start();
+  char nothing = 0;
+  while (::read(task.control, &nothing, 1) < 0) continue;
+  worker.end();
+  std::_Exit(0);  // threads that an impatient host has left behind may still be on their way out
 }
 
 }  // namespace velmora::mobile::xplat::cellar::crash
