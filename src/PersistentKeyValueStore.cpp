@@ -99,7 +99,8 @@ struct PersistentKeyValueStore::FileWrite {
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
   Writer writer;
   const bool mayRunEarly;  // before the writes in front of it are over
-  std::weak_ptr<PersistentKeyValueStore> store;
+  const std::weak_ptr<PersistentKeyValueStore> store;
+  const Token operation;
   std::shared_ptr<Promise<void>> promise = std::make_shared<Promise<void>>();
   std::shared_ptr<WritesInFlight::Write> inFlight;  // once its record stands in the manifest
 
@@ -113,12 +114,13 @@ struct PersistentKeyValueStore::FileWrite {
   std::weak_ptr<FileWrite> next;  // the write of the store whose task stands right behind on the file queue
 
   FileWrite(const std::string& key_, std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata_, Writer writer_,
-            bool mayRunEarly_, std::weak_ptr<PersistentKeyValueStore> store_)
+            bool mayRunEarly_, PersistentKeyValueStore& store_)
       : key(key_),
         extendedMetadata(std::move(extendedMetadata_)),
         writer(std::move(writer_)),
         mayRunEarly(mayRunEarly_),
-        store(std::move(store_)) {}
+        store(store_.weak_from_this<PersistentKeyValueStore>()),
+        operation(store_.operation_) {}
   FileWrite(const FileWrite&) = delete;
   FileWrite& operator=(const FileWrite&) = delete;
 
@@ -169,11 +171,15 @@ struct PersistentKeyValueStore::Fetch {
   const std::vector<std::string> keys;
   const Loader loader;
   const std::weak_ptr<PersistentKeyValueStore> store;
+  const Token operation;
   std::shared_ptr<const DiskCacheItem> item;  // once it is found
   Promise<Fetched> promise;
 
-  Fetch(std::vector<std::string> keys_, Loader loader_, std::weak_ptr<PersistentKeyValueStore> store_)
-      : keys(std::move(keys_)), loader(std::move(loader_)), store(std::move(store_)) {}
+  Fetch(std::vector<std::string> keys_, Loader loader_, PersistentKeyValueStore& store_)
+      : keys(std::move(keys_)),
+        loader(std::move(loader_)),
+        store(store_.weak_from_this<PersistentKeyValueStore>()),
+        operation(store_.operation_) {}
 };
 
 std::shared_ptr<PersistentKeyValueStore> PersistentKeyValueStore::createPersistentKeyValueStore(
@@ -232,13 +238,13 @@ Future<void> PersistentKeyValueStore::store(const std::string& key, const std::v
       fileUtils->writeFile(filePath, *value);
       return static_cast<unsigned int>(value->size());
     };
-    return storeFile(std::make_shared<FileWrite>(key, std::move(extendedMetadata), writeValue, true,
-                                                 weak_from_this<PersistentKeyValueStore>()));
+    return storeFile(std::make_shared<FileWrite>(key, std::move(extendedMetadata), writeValue, true, *this));
   }
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
   dispatchWork(Keys(key), *promise,
-               [weakThis = weak_from_this<PersistentKeyValueStore>(), key, value, extendedMetadata, promise] {
+               [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_, key, value,
+                extendedMetadata, promise] {
                  if (const auto self = weakThis.lock()) {
                    self->storeInline(key, *value, extendedMetadata, promise);
                  } else {
@@ -259,8 +265,7 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
     return future;
   }
   // A host's writer may take its time, or wait for an earlier store.
-  return storeFile(std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer), false,
-                                               weak_from_this<PersistentKeyValueStore>()));
+  return storeFile(std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer), false, *this));
 }
 
 Future<void> PersistentKeyValueStore::storeFile(const std::shared_ptr<FileWrite>& write) {
@@ -518,7 +523,8 @@ std::optional<std::string> PersistentKeyValueStore::writeInline(
 // kill in the middle of the next write of the key could bring its value back.
 void PersistentKeyValueStore::deleteReplacedFile(const std::string& filePath,
                                                  const std::shared_ptr<Promise<void>>& promise) {
-  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), filePath, promise] {
+  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_,
+                         deletion = fileDeletion_, filePath, promise] {
     if (const auto self = weakThis.lock()) self->deleteFiles({filePath});
     promise->setValue();
   };
@@ -574,8 +580,7 @@ Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValue
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetchFirstOf(
     std::vector<std::string> keys, Loader loader) {
-  const auto fetch =
-      std::make_shared<Fetch>(std::move(keys), std::move(loader), weak_from_this<PersistentKeyValueStore>());
+  const auto fetch = std::make_shared<Fetch>(std::move(keys), std::move(loader), *this);
   Future<Fetched> future = fetch->promise.getFuture();
   dispatchWork(Keys(fetch->keys), fetch->promise, [fetch] {
     if (const auto self = fetch->store.lock()) {
@@ -695,7 +700,8 @@ std::optional<std::int32_t> PersistentKeyValueStore::fetchModificationDate(const
 Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_, key,
+                                     promise] {
     settle(*promise, [&] {
       const auto self = weakThis.lock();
       if (self == nullptr) return;
@@ -726,7 +732,8 @@ void PersistentKeyValueStore::reportAccess(const DiskCacheItem* item, const std:
 Future<void> PersistentKeyValueStore::removeItem(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), key, promise] {
+  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_, key,
+                                     promise] {
     if (const auto self = weakThis.lock()) {
       self->remove(key, promise);
     } else {
@@ -787,6 +794,8 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shar
     clear->hasBegun = true;
     auto items = cancelWrites();
     for (DiskCacheItem& item : takeNext(*clear)) items.push_back(std::move(item));
+    // What was removed just before, by a prune say, may have its files still: the file queue has to pass them.
+    if (items.empty() && fileDeletion_.use_count() > 1) items.emplace_back();
     return items;
   }
   return takeNext(*clear);
@@ -848,7 +857,8 @@ void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
   count(evictions_);
   const auto filePath = fileOf(*item);
   if (!filePath || writesInFlight_->revoke(item->key)) return;
-  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), path = *filePath] {
+  const auto deleteIt = [weakThis = weak_from_this<PersistentKeyValueStore>(), deletion = fileDeletion_,
+                         path = *filePath] {
     const auto self = weakThis.lock();
     if (self == nullptr) return;
     try {
@@ -888,10 +898,10 @@ std::vector<DiskCacheItem> PersistentKeyValueStore::evictBatch(
 void PersistentKeyValueStore::deleteFilesInBatches(std::function<const std::vector<DiskCacheItem>()> provider,
                                                    std::function<void()> onSuccess,
                                                    std::function<void(const std::exception&)> onError) {
-  const auto holdingToken = [token = deletionsToken_, provider = std::move(provider)] { return provider(); };
-  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), holdingToken,
+  const auto countedProvider = [operation = operation_, provider = std::move(provider)] { return provider(); };
+  workQueue_->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>(), countedProvider,
                         onSuccess = std::move(onSuccess), onError = std::move(onError)] {
-    if (const auto self = weakThis.lock()) self->deleteNextBatch(holdingToken, onSuccess, onError);
+    if (const auto self = weakThis.lock()) self->deleteNextBatch(countedProvider, onSuccess, onError);
   });
 }
 
@@ -932,7 +942,8 @@ void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<Di
 Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>& paths) {
   try {
     throwIfInvalid();
-    auto deleted = dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), paths] {
+    auto deleted = dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), deletion = fileDeletion_,
+                                                   paths] {
       const auto self = weakThis.lock();
       if (self == nullptr) return;
       self->throwIfClosed();
@@ -1080,13 +1091,15 @@ void PersistentKeyValueStore::invalidateSoon() {
   });
 }
 
-void PersistentKeyValueStore::keepUntilIdle() { passQueues(weak_from_this<PersistentKeyValueStore>().lock()); }
+void PersistentKeyValueStore::keepUntilIdle() {
+  if (operation_.use_count() > 1) passQueues(weak_from_this<PersistentKeyValueStore>().lock());
+}
 
 // What the work queue has taken so far has put its tasks on the file queue when the first of these runs.
 void PersistentKeyValueStore::passQueues(const std::shared_ptr<PersistentKeyValueStore>& self) {
   const auto passFileQueue = [self] {
     self->fileQueue_->dispatch([self] {
-      if (self->deletionsToken_.use_count() > 1) passQueues(self);
+      if (self->operation_.use_count() > 1) passQueues(self);
     });
   };
   try {

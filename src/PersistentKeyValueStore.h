@@ -47,6 +47,8 @@ struct SettledValue;
 // writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (one that ends in
 // the manifest's or the attributes' file name). A manifest that is damaged, or cannot be written, fails nothing: the
 // store is PURGED, all its values go to the trash, the log says so in one line, and work goes on with an empty store.
+// Where it cannot be purged the operation fails. A manifest that cannot be opened fails the operation at hand, too, and
+// is opened again by the next one.
 //
 // Keys are file names as they stand: one that holds a "/" or is ".." reaches outside the store's directory. Encode what
 // is not under your own control (the host kit has `encodeFileName`). A key that holds a zero byte fails with
@@ -115,7 +117,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // --- Values ---
 
   // Stores the value under the key, replacing what is there. The bytes are copied once, here. Fulfilled when value and
-  // record are written.
+  // record are written, and the file of a value that is inline from now on is deleted.
   Future<void> store(const std::string& key, const std::vector<unsigned char>& data,
                      std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata = nullptr);
 
@@ -140,16 +142,17 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Removes value and record. Not an error: a key that is not there.
   Future<void> removeItem(const std::string& key);
 
-  // Removes every item, in batches, and calls one of the two on the work queue when that is done. What is stored after
-  // the first batch has been taken stays.
+  // Removes every item, in batches, and calls one of the two on the work queue when that is done and the files are
+  // deleted, those of writes that it found under way too. What is stored after the first batch has been taken stays.
   void clear(std::function<void()> onSuccess, std::function<void(const std::exception&)> onError);
 
   // The keys of all items, in no order. Throws `DiskCacheManifestException` before the manifest is loaded, and
   // `InvalidatedException`.
   std::vector<std::string> getAllKeys();
 
-  // When the value was stored, in seconds since the Unix epoch; empty for a miss. Reads one record from disk before the
-  // manifest is loaded. Throws `InvalidatedException`, and what reading throws.
+  // When the value was stored, in seconds since the Unix epoch; empty for a miss. Waits for the operation on the
+  // manifest that is under way, and reads one record from disk before the manifest is loaded. Throws
+  // `InvalidatedException`, and what reading throws.
   std::optional<std::int32_t> fetchModificationDate(const std::string& key);
 
   // Counts as a use of the item, and is reported as one. Not an error: a key that is not there.
@@ -170,8 +173,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Invalidates without waiting, on any thread; the manifest is closed when the file queue has got so far.
   void invalidateSoon() override;
 
-  // Passes both queues until no deletion in batches is under way either. The store is then released by the last of
-  // these tasks, or when a queue drops it. Nothing is kept when the work queue takes no tasks.
+  // Passes both queues until no operation is under way. The store is then released by the last of these tasks, or when
+  // a queue drops it. Not kept: a store without operations, or one whose work queue takes no tasks.
   void keepUntilIdle() override;
 
   // Throws `InvalidatedException` "Store has been invalidated." once that is so.
@@ -205,7 +208,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Deletes the files on the file queue, in order. One that cannot be deleted is one error line.
   Future<void> deleteBatch(const std::vector<std::string>& paths);
 
-  // Purges the store: its directory goes to the trash, and it goes on empty. Throws when it cannot even begin again.
+  // Purges the store: its directory goes to the trash, and it goes on empty. Throws when it cannot even begin again,
+  // when the directory cannot be collected (nothing has changed then), and once the store is invalidated.
   void handleCorruptedManifest(const LarderException& error);
 
   // Tells the size callback the total bytes of all items, on the work queue, if the manifest is loaded.
@@ -330,8 +334,10 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   std::mutex
       removalMutex_;  // taken before mutex_; held until a removal has deleted its file: invalidation waits for it
 
-  const std::shared_ptr<const char> deletionsToken_ =
-      std::make_shared<const char>();  // each deletion in batches holds it
+  // Whoever stands for one of these holds a copy, so that the number of owners tells whether there are any.
+  using Token = std::shared_ptr<const char>;
+  const Token operation_ = std::make_shared<const char>();     // an operation that has been accepted and is not over
+  const Token fileDeletion_ = std::make_shared<const char>();  // a deletion of files that waits on the file queue
 
   std::mutex manifestMutex_;  // taken after mutex_; guards the creation of the manifest
   std::atomic<bool> manifestCreated_{false};

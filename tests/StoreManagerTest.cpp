@@ -348,8 +348,19 @@ TEST_F(StoreManagerRelease, LeavesAStoreToWhoHoldsItAndFinishesToo) {
   EXPECT_EQ(store.use_count(), 1);
 }
 
+TEST_F(StoreManagerRelease, OfAnIdleStoreDestroysItAtOnce) {
+  auto store = openStore();
+  store->store("key", Value{'v'});
+  queues->runAll();
+  const std::weak_ptr<Store> released = store;
+  store.reset();
+  manager_.reset();
+  EXPECT_TRUE(released.expired());
+}
+
 TEST_F(StoreManagerRelease, OfAQueueThatTakesNoTasksReleasesTheStoreAndSaysSo) {
   auto store = openStore();
+  store->store("key", Value{'v'});
   const std::weak_ptr<Store> released = store;
   store.reset();
   for (const auto& queue : queues->all()) queue->throwOnDispatch(true);
