@@ -2,6 +2,7 @@
 
 #include <glog/logging.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <chrono>
@@ -10,7 +11,11 @@
 #include <cstdio>
 #include <ctime>
 #include <exception>
+#include <mutex>
+#include <random>
+#include <set>
 #include <thread>
+#include <vector>
 
 #include "AnalyticsEventReporter.h"
 #include "FileUtils.h"
@@ -32,23 +37,23 @@ constexpr int kMaxMoves = 10;
 // The trash directory and the passes that empty it.
 class TrashCollector::Trash {
  public:
-  Trash(const std::string& path, const std::shared_ptr<FileUtils>& fileUtils) : path_(path), fileUtils_(fileUtils) {}
+  Trash(const std::string& path, const std::shared_ptr<FileUtils>& fileUtils)
+      : path_(path), fileUtils_(fileUtils), random_(static_cast<std::uint64_t>(std::time(nullptr))) {}
 
-  // One pass: until the trash is gone or the pass is interrupted. Never throws for a failed file operation. Called from
-  // within a pass, by a file layer that collects something on a queue that runs tasks at once, it leaves that to the
-  // pass.
-  void collect() {
-    if (passThread_ == std::this_thread::get_id()) return;
-    const std::lock_guard<std::mutex> lock(passMutex_);
-    passThread_ = std::this_thread::get_id();
-    try {
-      bool wasEmpty = true;
-      while (running_ && fileUtils_->pathExists(path_) && deleteTrash(wasEmpty)) {
-      }
-    } catch (const std::exception& error) {
-      LOG(ERROR) << "Cannot collect trash. " << error.what();
+  // One pass: until the trash is gone, what is left in it cannot be deleted, or the pass is interrupted. Never throws
+  // for a failed file operation. Called from within a pass, by a file layer that collects something on a queue that
+  // runs tasks at once, it leaves that to the pass.
+  void collect();
+
+  // A path in the trash that nothing has yet.
+  std::string freeEntry() {
+    const std::lock_guard<std::mutex> lock(randomMutex_);
+    while (true) {
+      char name[17];
+      (void)std::snprintf(name, sizeof name, "%016" PRIx64, static_cast<std::uint64_t>(random_()));
+      std::string entry = fileUtils_->combinePath(path_, name);
+      if (!fileUtils_->pathExists(entry) && !fileUtils_->isSymLink(entry)) return entry;
     }
-    passThread_ = std::thread::id();
   }
 
   // Moves a path to its entry in the trash. No pass takes the trash directory away under it, but another process may:
@@ -80,6 +85,8 @@ class TrashCollector::Trash {
   std::uint32_t deletedCount() const { return deletedCount_; }
 
  private:
+  class Pass;
+
   // While there is one, the trash directory stays.
   class Move {
    public:
@@ -106,46 +113,6 @@ class TrashCollector::Trash {
     }
   }
 
-  // False when the rest is left to the pass that follows upon somebody's `moveIn`. `wasEmpty`: nothing has been found
-  // in the trash so far.
-  bool deleteTrash(bool& wasEmpty) {
-    const unsigned int moves = moves_;
-    const bool isDirectory = !fileUtils_->isSymLink(path_) && fileUtils_->isDirectory(path_);
-    if (!isDirectory || deleteContents(path_)) wasEmpty = false;
-    if (!running_) return false;
-    const std::lock_guard<std::recursive_mutex> lock(moveMutex_);
-    if (movesUnderWay_ > 0) return false;
-    if (moves != moves_) return true;
-    // The directory itself counts with what it held: emptying an empty trash deletes nothing worth telling.
-    if (!wasEmpty) ++deletedCount_;
-    fileUtils_->deleteFile(path_);
-    return true;
-  }
-
-  // The listing says what an entry is: asking the path again would follow a link.
-  void recursiveDelete(const FileUtils::Info& entry) {
-    if (!running_) return;
-    if (entry.type == FileUtils::Type::Directory) deleteContents(entry.path);
-    if (!running_) return;
-    ++deletedCount_;
-    fileUtils_->deleteFile(entry.path);
-  }
-
-  // False when there was nothing in it.
-  bool deleteContents(const std::string& path) {
-    int listings = 0;
-    for (; listings < kMaxListings && running_; ++listings) {
-      const auto entries = fileUtils_->listDirectory(path);
-      if (entries.empty()) break;
-      for (const FileUtils::Info& entry : entries) {
-        // Whoever has put a link in the directory's place meanwhile would have us delete what lies behind it.
-        if (fileUtils_->isSymLink(path)) return true;
-        recursiveDelete(entry);
-      }
-    }
-    return listings > 0;
-  }
-
   const std::string path_;
   const std::shared_ptr<FileUtils> fileUtils_;
   std::mutex passMutex_;  // held by a pass: two at once would take each other's files away
@@ -156,17 +123,122 @@ class TrashCollector::Trash {
   std::atomic<unsigned int> moves_{0};
   std::atomic<bool> running_{true};
   std::atomic<std::uint32_t> deletedCount_{0};
+  std::mutex randomMutex_;
+  std::mt19937_64 random_;  // guarded by randomMutex_
 };
+
+// One pass over the trash. An entry that cannot be deleted is left where it fails, and the others are deleted all the
+// same.
+class TrashCollector::Trash::Pass {
+ public:
+  explicit Pass(Trash& trash) : trash_(trash), fileUtils_(*trash.fileUtils_) {}
+
+  // False when the rest is left to the pass that follows upon somebody's `moveIn`. Throws why the first entry that
+  // cannot be deleted cannot.
+  bool deleteTrash() {
+    const unsigned int moves = trash_.moves_;
+    const bool isDirectory = !fileUtils_.isSymLink(trash_.path_) && fileUtils_.isDirectory(trash_.path_);
+    if (!isDirectory || deleteEntries()) wasEmpty_ = false;
+    if (failure_ != nullptr) std::rethrow_exception(failure_);
+    if (!trash_.running_) return false;
+    const std::lock_guard<std::recursive_mutex> lock(trash_.moveMutex_);
+    if (trash_.movesUnderWay_ > 0) return false;
+    if (moves != trash_.moves_) return true;
+    // The directory itself counts with what it held: emptying an empty trash deletes nothing worth telling.
+    if (!wasEmpty_) ++trash_.deletedCount_;
+    fileUtils_.deleteFile(trash_.path_);
+    return true;
+  }
+
+ private:
+  using Entries = std::vector<FileUtils::Info>;
+
+  // False when there was nothing in the trash.
+  bool deleteEntries() {
+    int listings = 0;
+    for (; listings < kMaxListings && trash_.running_; ++listings) {
+      const Entries entries = untriedEntries();
+      if (entries.empty()) break;
+      for (const FileUtils::Info& entry : entries) deleteEntry(entry);
+    }
+    return listings > 0;
+  }
+
+  // What is in the trash but for the entries that cannot be deleted.
+  Entries untriedEntries() {
+    Entries entries = fileUtils_.listDirectory(trash_.path_);
+    const auto isStuck = [this](const FileUtils::Info& entry) { return stuck_.count(entry.path) > 0; };
+    entries.erase(std::remove_if(entries.begin(), entries.end(), isStuck), entries.end());
+    return entries;
+  }
+
+  void deleteEntry(const FileUtils::Info& entry) {
+    if (fileUtils_.isSymLink(trash_.path_)) return;  // put there meanwhile
+    try {
+      recursiveDelete(entry);
+    } catch (const std::exception&) {
+      stuck_.insert(entry.path);
+      if (failure_ == nullptr) failure_ = std::current_exception();
+    }
+  }
+
+  // The listing says what an entry is: asking the path again would follow a link.
+  void recursiveDelete(const FileUtils::Info& entry) {
+    if (!trash_.running_) return;
+    if (entry.type != FileUtils::Type::Directory) return deletePath(entry.path);
+    deleteContents(entry.path);
+    if (trash_.running_) deletePath(entry.path);
+  }
+
+  void deleteContents(const std::string& path) {
+    for (int listings = 0; listings < kMaxListings && trash_.running_; ++listings) {
+      const Entries entries = fileUtils_.listDirectory(path);
+      if (entries.empty()) return;
+      deleteFrom(path, entries);
+    }
+  }
+
+  void deleteFrom(const std::string& directory, const Entries& entries) {
+    for (const FileUtils::Info& entry : entries) {
+      // Whoever has put a link in the directory's place meanwhile would have us delete what lies behind it.
+      if (fileUtils_.isSymLink(directory)) return;
+      recursiveDelete(entry);
+    }
+  }
+
+  void deletePath(const std::string& path) {
+    ++trash_.deletedCount_;
+    fileUtils_.deleteFile(path);
+  }
+
+  Trash& trash_;
+  FileUtils& fileUtils_;
+  bool wasEmpty_ = true;         // nothing has been found in the trash so far
+  std::set<std::string> stuck_;  // the entries that cannot be deleted
+  std::exception_ptr failure_;   // of the first of them
+};
+
+void TrashCollector::Trash::collect() {
+  if (passThread_ == std::this_thread::get_id()) return;
+  const std::lock_guard<std::mutex> lock(passMutex_);
+  passThread_ = std::this_thread::get_id();
+  try {
+    Pass pass(*this);
+    while (running_ && fileUtils_->pathExists(path_) && pass.deleteTrash()) {
+    }
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Cannot collect trash. " << error.what();
+  }
+  passThread_ = std::thread::id();
+}
 
 TrashCollector::TrashCollector(const std::string& trashPath, const std::shared_ptr<FileUtils>& fileUtils,
                                const std::shared_ptr<AnalyticsEventReporter>& reporter,
                                const std::shared_ptr<TaskQueueFactory>& taskQueueFactory)
-    : trashPath_(trashPath),
-      fileUtils_(fileUtils),
+    : fileUtils_(fileUtils),
       reporter_(reporter),
       trash_(std::make_shared<Trash>(trashPath, fileUtils)),
-      queue_(taskQueueFactory == nullptr ? nullptr : taskQueueFactory->createQueue()),
-      random_(static_cast<std::uint64_t>(std::time(nullptr))) {}
+      queue_(taskQueueFactory == nullptr ? nullptr : taskQueueFactory->createQueue()) {}
 
 bool TrashCollector::collectPath(const std::string& path) {
   try {
@@ -174,7 +246,7 @@ bool TrashCollector::collectPath(const std::string& path) {
       fileUtils_->recursiverDirectoryDelete(path);
       return true;
     }
-    trash_->moveIn(path, freeTrashEntry());
+    trash_->moveIn(path, trash_->freeEntry());
     queue_->dispatch([weakTrash = std::weak_ptr<Trash>(trash_)] {
       if (const auto trash = weakTrash.lock()) trash->collect();
     });
@@ -211,16 +283,6 @@ bool TrashCollector::removeFilesWithFilter(const std::string& path,
   } catch (const std::exception& error) {
     LOG(ERROR) << "Cannot collect path. " << error.what();
     return false;
-  }
-}
-
-std::string TrashCollector::freeTrashEntry() {
-  const std::lock_guard<std::mutex> lock(randomMutex_);
-  while (true) {
-    char name[17];
-    (void)std::snprintf(name, sizeof name, "%016" PRIx64, static_cast<std::uint64_t>(random_()));
-    std::string entry = fileUtils_->combinePath(trashPath_, name);
-    if (!fileUtils_->pathExists(entry) && !fileUtils_->isSymLink(entry)) return entry;
   }
 }
 

@@ -2,8 +2,6 @@
 
 #include <functional>
 #include <memory>
-#include <mutex>
-#include <random>
 #include <string>
 
 #include "Export.h"
@@ -18,6 +16,10 @@ class FileUtils;
 // what is collected; it exists only while there is something in it. Shared by all managers and stores; any thread may
 // call. Never throws for a failed file operation: it answers false, or logs one error line. Links are removed as links
 // and never followed, so nothing outside a collected tree is touched.
+//
+// A path that cannot be deleted
+// stays in the trash, from where deleting it failed, and the trash directory with it; everything else in the trash is
+// deleted all the same. The first failure of a pass is its one error line, and the next pass tries again.
 //
 // What survives: a collected path is gone from its place even when the process is killed right after the call; what is
 // still in the trash then is removed by the next pass of a collector over the same trash directory.
@@ -51,17 +53,12 @@ class CELLAR_EXPORT TrashCollector {
  private:
   class Trash;
 
-  std::string freeTrashEntry();
   void drainQueue();
 
-  const std::string trashPath_;
   const std::shared_ptr<FileUtils> fileUtils_;
   const std::shared_ptr<AnalyticsEventReporter> reporter_;
   const std::shared_ptr<Trash> trash_;          // what a pass works on, so that it can outlive the collector
   const std::shared_ptr<AsyncExecutor> queue_;  // null: everything on the caller's thread
-
-  std::mutex randomMutex_;
-  std::mt19937_64 random_;  // guarded by randomMutex_
 };
 
 }  // namespace velmora::mobile::xplat::cellar
