@@ -292,4 +292,16 @@ bool FileUtils::isSymLink(const string& path) {
   return ::lstat(withoutSlashes(path).c_str(), &status) == 0 && S_ISLNK(status.st_mode);
 }
 
+std::vector<string> FileUtils::listOtherEntries(const string& path) {
+  std::vector<string> paths;
+  DIR* const stream = path.empty() ? nullptr : openUnlessLink(withoutSlashes(path));
+  if (stream == nullptr) return paths;
+  DirectoryStream directory(stream);
+  while (const dirent* entry = directory.next()) {
+    const bool isListed = entry->d_type == DT_REG || entry->d_type == DT_LNK || entry->d_type == DT_DIR;
+    if (!isListed) paths.push_back(combinePath(path, entry->d_name));
+  }
+  return paths;
+}
+
 }  // namespace velmora::mobile::xplat::cellar

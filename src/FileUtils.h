@@ -86,6 +86,10 @@ class CELLAR_EXPORT FileUtils {
 
   // Whether the path itself, slashes at its end aside, is a link, dangling or not. Never throws.
   virtual bool isSymLink(const std::string& path);
+
+  // The full paths of what `listDirectory` leaves out: fifos, sockets, devices, and entries whose type the file system
+  // does not tell. None for what is not a directory, a link among them, and for one that cannot be read.
+  virtual std::vector<std::string> listOtherEntries(const std::string& path);
 };
 
 }  // namespace velmora::mobile::xplat::cellar

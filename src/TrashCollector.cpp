@@ -167,8 +167,20 @@ class TrashCollector::Trash::Pass {
   // What is in the trash but for the entries that cannot be deleted.
   Entries untriedEntries() {
     Entries entries = fileUtils_.listDirectory(trash_.path_);
+    const Entries others = otherEntries(trash_.path_);
+    entries.insert(entries.end(), others.begin(), others.end());
     const auto isStuck = [this](const FileUtils::Info& entry) { return stuck_.count(entry.path) > 0; };
     entries.erase(std::remove_if(entries.begin(), entries.end(), isStuck), entries.end());
+    return entries;
+  }
+
+  // What the listing of a directory leaves out. A directory among it, on a file system that tells no types, is noticed
+  // when it cannot be removed as a file.
+  Entries otherEntries(const std::string& directory) {
+    Entries entries;
+    for (const std::string& path : fileUtils_.listOtherEntries(directory)) {
+      entries.emplace_back(path, 0, FileUtils::Type::File);
+    }
     return entries;
   }
 
@@ -206,9 +218,18 @@ class TrashCollector::Trash::Pass {
     }
   }
 
+  // A directory may still hold what its listing leaves out.
   void deletePath(const std::string& path) {
     ++trash_.deletedCount_;
-    fileUtils_.deleteFile(path);
+    Entries others;
+    try {
+      return fileUtils_.deleteFile(path);
+    } catch (const FileUtilsIoException& error) {
+      if (error.code() == ENOTEMPTY || error.code() == EEXIST) others = otherEntries(path);
+      if (others.empty()) throw;
+    }
+    deleteFrom(path, others);
+    if (trash_.running_) fileUtils_.deleteFile(path);
   }
 
   Trash& trash_;

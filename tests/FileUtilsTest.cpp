@@ -187,6 +187,7 @@ class FileUtilsTest : public testing::Test {
   }
 
   string makeFifo(const string& name) {
+    std::filesystem::create_directories(std::filesystem::path(directory_.file(name)).parent_path());
     if (mkfifo(directory_.file(name).c_str(), 0600) != 0) throw std::runtime_error("cannot make a fifo");
     return directory_.file(name);
   }
@@ -735,6 +736,25 @@ TEST_F(FileUtilsTest, ListingLeavesOutWhatIsNeitherFileNorLinkNorDirectory) {
   makeFifo("fifo");
   makeSocket("socket");
   EXPECT_TRUE(files_.listDirectory(directory_.path()).empty());
+}
+
+TEST_F(FileUtilsTest, ListingOtherEntriesGivesTheFullPathsOfWhatIsLeftOut) {
+  directory_.write("file", "");
+  directory_.makeDirectory("directory");
+  link("link", "fifo");
+  EXPECT_THAT(files_.listOtherEntries(directory_.path()),
+              UnorderedElementsAre(makeFifo("fifo"), makeSocket("socket"), makeFifo(".hidden")));
+  EXPECT_THAT(files_.listOtherEntries(directory_.path() + "/"), testing::Contains(directory_.file("fifo")));
+}
+
+TEST_F(FileUtilsTest, ThereAreNoOtherEntriesInWhatCannotBeListed) {
+  makeFifo("target/fifo");
+  const std::ptrdiff_t before = openDescriptors();
+  for (const string& path : {string(), directory_.file("missing"), directory_.write("file", ""), link("link", "target"),
+                             directory_.file("link/"), circle(), tooLongName()}) {
+    EXPECT_TRUE(files_.listOtherEntries(path).empty()) << path;
+  }
+  EXPECT_EQ(openDescriptors(), before);
 }
 
 TEST_F(FileUtilsTest, ListingCombinesPathsAsCombinePathDoes) {

@@ -1,11 +1,13 @@
-// What a pass over the trash does with entries that are in its way.
+// What a pass over the trash does with entries that are in its way: some that cannot be deleted, fifos.
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstddef>
+#include <filesystem>
 #include <functional>
 #include <memory>
 #include <stdexcept>
@@ -24,6 +26,7 @@ using test::FaultyFileUtils;
 using test::ioFailure;
 using test::Operation;
 using testing::ElementsAre;
+using testing::IsEmpty;
 using testing::UnorderedElementsAre;
 
 class TrashCollectorPass : public test::TrashFixture {
@@ -37,6 +40,12 @@ class TrashCollectorPass : public test::TrashFixture {
   static string logged(int code, const string& text) { return "Cannot collect trash. " + ioFailure(code, text); }
 
   string entry(const string& name) const { return trashPath() + "/" + name; }
+
+  string makeFifo(const string& name) const {
+    std::filesystem::create_directories(std::filesystem::path(directory_.file(name)).parent_path());
+    if (mkfifo(directory_.file(name).c_str(), 0600) != 0) throw std::runtime_error("cannot make a fifo");
+    return directory_.file(name);
+  }
 
   std::size_t deletionsBelow(const string& path) const {
     const std::vector<string> trace = files_->trace();
@@ -139,6 +148,63 @@ TEST_F(TrashCollectorPass, OfAnEmptyingCountsWhatItDeletesBesideAStuckEntry) {
   EXPECT_EQ(reportedCount(), 4U);  // the tree with its two files, and the attempt
   EXPECT_THAT(trashed(), ElementsAre("stuck"));
   EXPECT_EQ(log_.errorCount(), 1U);
+}
+
+// --- Entries that no listing shows ---
+
+TEST_F(TrashCollectorPass, DeletesFifosAndSocketsWhereverTheyAre) {
+  makeFifo("tree/fifo");
+  makeFifo("tree/deep/er/fifo");
+  directory_.write("tree/deep/file", "");
+  ASSERT_EQ(mknod(directory_.file("tree/deep/socket").c_str(), S_IFSOCK | 0600U, 0), 0);
+  EXPECT_TRUE(collector_->collectPath(directory_.file("tree")));
+  EXPECT_TRUE(collector_->collectPath(makeFifo("fifo")));
+  empty();
+  EXPECT_THAT(directory_.names("cache"), IsEmpty());
+  EXPECT_THAT(log_.messages(), IsEmpty());
+  EXPECT_EQ(reportedCount(), 9U);  // three fifos, a socket, a file, three directories and the trash
+}
+
+TEST_F(TrashCollectorPass, DeletesAFifoBesideWhatCannotBeDeleted) {
+  directory_.write("cache/trash/stuck", "");
+  makeFifo("cache/trash/fifo");
+  files_->failPath(Operation::DeleteFile, entry("stuck"), EBUSY);
+  pass();
+  EXPECT_THAT(trashed(), ElementsAre("stuck"));
+}
+
+TEST_F(TrashCollectorPass, LeavesAFifoThatCannotBeDeletedAndDeletesTheOtherEntries) {
+  for (const char* stuck : {"fifo", "tree/fifo"}) {
+    makeFifo(string("cache/trash/") + stuck);
+    makeTree("cache/trash/other");
+    files_->failPath(Operation::DeleteFile, entry(stuck), EBUSY);
+    pass();
+    EXPECT_EQ(trashed().size(), 1U) << stuck;
+    files_->heal();
+  }
+  EXPECT_THAT(log_.messages(), testing::Each(logged(EBUSY, "Device or resource busy")));
+  EXPECT_EQ(log_.errorCount(), 2U);
+}
+
+TEST_F(TrashCollectorPass, DeletesEverythingOnAFileSystemThatTellsNoTypes) {
+  class Typeless : public FaultyFileUtils {
+   public:
+    std::vector<FileUtils::Info> listDirectory(const string&) override { return {}; }
+    std::vector<string> listOtherEntries(const string& path) override {
+      std::vector<string> paths;
+      for (const auto& info : FaultyFileUtils::listDirectory(path)) paths.push_back(info.path);
+      return paths;
+    }
+  };
+  collector_ = makeCollector(std::make_shared<Typeless>());
+  makeTree("target");
+  makeTree("tree/deep/er");
+  link("tree/link", directory_.file("target"));
+  EXPECT_TRUE(collector_->collectPath(directory_.file("tree")));
+  queues_->runAll();
+  EXPECT_THAT(directory_.names("cache"), IsEmpty());
+  EXPECT_EQ(directory_.names("target").size(), 2U);
+  EXPECT_THAT(log_.messages(), IsEmpty());
 }
 
 }  // namespace

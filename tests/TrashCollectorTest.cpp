@@ -701,6 +701,7 @@ TEST_F(TrashCollectorTest, AFailureOfAnotherTypeDoesNotEscapeAPass) {
 TEST_F(TrashCollectorTest, APassThatMeetsWhatCannotBeListedEndsInsteadOfTryingForEver) {
   directory_.makeDirectory("tree");
   ASSERT_EQ(mkfifo(directory_.file("tree/fifo").c_str(), 0600), 0);
+  files_->failAlways(Operation::ListOtherEntries, EMFILE);
   collector_->collectPath(directory_.file("tree"));
   queues_->runAll();
   EXPECT_THAT(log_.messages(), ElementsAre("Cannot collect trash. " +

@@ -41,6 +41,8 @@ const char* nameOf(Operation operation) {
       return "listDirectory";
     case Operation::IsSymLink:
       return "isSymLink";
+    case Operation::ListOtherEntries:
+      return "listOtherEntries";
   }
   return "";
 }
@@ -175,6 +177,11 @@ std::vector<FileUtils::Info> FaultyFileUtils::listDirectory(const std::string& p
 
 bool FaultyFileUtils::isSymLink(const std::string& path) {
   return !failureOf(Operation::IsSymLink, path) && FileUtils::isSymLink(path);
+}
+
+std::vector<std::string> FaultyFileUtils::listOtherEntries(const std::string& path) {
+  if (failureOf(Operation::ListOtherEntries, path)) return {};
+  return FileUtils::listOtherEntries(path);
 }
 
 void FaultyFileUtils::failIfTold(Operation operation, const std::string& path, const std::string& rest) {

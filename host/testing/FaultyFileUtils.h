@@ -30,12 +30,13 @@ enum class Operation {
   ListDirectories,
   ListDirectory,
   IsSymLink,
+  ListOtherEntries,
 };
 
 // The real file system, with every call recorded and chosen ones failing before they touch anything. A failing
 // operation throws FileUtilsIoException with the given code and the system's text for it; a failing query (IsDirectory,
-// PathExists, IsSymLink) answers false. Calls that operations make among themselves are recorded and fail too.
-// Thread-safe; `onCall` is to be set before other threads use the object.
+// PathExists, IsSymLink) answers false, and ListOtherEntries none. Calls that operations make among themselves are
+// recorded and fail too. Thread-safe; `onCall` is to be set before other threads use the object.
 class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
  public:
   using Operation = test::Operation;
@@ -89,6 +90,7 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
   std::vector<std::string> listDirectories(const std::string& path) override;
   std::vector<FileUtils::Info> listDirectory(const std::string& path) override;
   bool isSymLink(const std::string& path) override;
+  std::vector<std::string> listOtherEntries(const std::string& path) override;
 
  private:
   struct Failure {

@@ -1,5 +1,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <functional>
@@ -41,6 +42,7 @@ TEST_F(FaultyFileUtilsTest, WorksLikeTheRealOneUntilToldOtherwise) {
   EXPECT_EQ(files_.listDirectory(directory_.file("a")).size(), 1U);
   files_.createSymLink(directory_.file("link"), "a");
   EXPECT_TRUE(files_.isSymLink(directory_.file("link")));
+  EXPECT_TRUE(files_.listOtherEntries(directory_.path()).empty());
   EXPECT_GT(files_.getDiskSpace(directory_.path()).total, 0);
   files_.deleteFile(directory_.file("link"));
   files_.recursiverDirectoryDelete(directory_.file("a"));
@@ -79,6 +81,14 @@ TEST_F(FaultyFileUtilsTest, AFailingQueryAnswersFalse) {
   EXPECT_FALSE(files_.isDirectory(directory_.path()));
   EXPECT_TRUE(files_.pathExists(directory_.path()));
   EXPECT_TRUE(files_.isDirectory(directory_.path()));
+}
+
+TEST_F(FaultyFileUtilsTest, AFailingListOfOtherEntriesIsEmpty) {
+  ASSERT_EQ(mkfifo(directory_.file("fifo").c_str(), 0600), 0);
+  files_.failNext(Operation::ListOtherEntries, EIO);
+  EXPECT_TRUE(files_.listOtherEntries(directory_.path()).empty());
+  EXPECT_THAT(files_.listOtherEntries(directory_.path()), ElementsAre(directory_.file("fifo")));
+  EXPECT_THAT(files_.trace(), testing::Each("listOtherEntries " + directory_.path()));
 }
 
 TEST_F(FaultyFileUtilsTest, ATornWriteLeavesItsBeginning) {
