@@ -29,6 +29,10 @@ namespace {
 // A directory that something else keeps filling is given up after as many listings.
 constexpr int kMaxListings = 10;
 
+// How long a path is let become behind that of the trash. The system takes no more than PATH_MAX bytes, and each level
+// takes a piece of the stack.
+constexpr std::size_t kMaxPathInTrash = 512;
+
 // How often a path is moved again when a pass has just removed the trash directory under it.
 constexpr int kMaxMoves = 10;
 
@@ -184,13 +188,19 @@ class TrashCollector::Trash::Pass {
     return entries;
   }
 
+  // With all that is moved up from within it, each part of which may fail by itself.
   void deleteEntry(const FileUtils::Info& entry) {
     if (fileUtils_.isSymLink(trash_.path_)) return;  // put there meanwhile
-    try {
-      recursiveDelete(entry);
-    } catch (const std::exception&) {
-      stuck_.insert(entry.path);
-      if (failure_ == nullptr) failure_ = std::current_exception();
+    parts_ = {entry};
+    while (!parts_.empty() && trash_.running_) {
+      const FileUtils::Info part = parts_.back();
+      parts_.pop_back();
+      try {
+        recursiveDelete(part);
+      } catch (const std::exception&) {
+        stuck_.insert(part.path);
+        if (failure_ == nullptr) failure_ = std::current_exception();
+      }
     }
   }
 
@@ -198,8 +208,22 @@ class TrashCollector::Trash::Pass {
   void recursiveDelete(const FileUtils::Info& entry) {
     if (!trash_.running_) return;
     if (entry.type != FileUtils::Type::Directory) return deletePath(entry.path);
+    if (entry.path.size() > trash_.path_.size() + kMaxPathInTrash && moveUp(entry.path)) return;
     deleteContents(entry.path);
     if (trash_.running_) deletePath(entry.path);
+  }
+
+  // Out of the depth in which it is, to be deleted as an entry of the trash. False when it cannot be moved: it may be
+  // deleted where it is.
+  bool moveUp(const std::string& path) {
+    const std::string entry = trash_.freeEntry();
+    try {
+      fileUtils_.rename(path, entry);
+    } catch (const FileUtilsIoException&) {
+      return false;
+    }
+    parts_.emplace_back(entry, 0, FileUtils::Type::Directory);
+    return true;
   }
 
   void deleteContents(const std::string& path) {
@@ -235,6 +259,7 @@ class TrashCollector::Trash::Pass {
   Trash& trash_;
   FileUtils& fileUtils_;
   bool wasEmpty_ = true;         // nothing has been found in the trash so far
+  Entries parts_;                // what is left of the entry at hand: itself, and what has been moved up from within it
   std::set<std::string> stuck_;  // the entries that cannot be deleted
   std::exception_ptr failure_;   // of the first of them
 };

@@ -17,7 +17,7 @@ class FileUtils;
 // call. Never throws for a failed file operation: it answers false, or logs one error line. Links are removed as links
 // and never followed, so nothing outside a collected tree is touched.
 //
-// Whatever is in the trash is deleted: fifos and sockets too. A path that cannot be deleted
+// Whatever is in the trash is deleted: trees deeper than PATH_MAX, fifos and sockets too. A path that cannot be deleted
 // stays in the trash, from where deleting it failed, and the trash directory with it; everything else in the trash is
 // deleted all the same. The first failure of a pass is its one error line, and the next pass tries again.
 //

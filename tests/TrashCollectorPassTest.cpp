@@ -1,17 +1,22 @@
-// What a pass over the trash does with entries that are in its way: some that cannot be deleted, fifos.
+// What a pass over the trash does with entries that are in its way: some that cannot be deleted, fifos, paths longer
+// than the system takes.
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <climits>
 #include <cstddef>
 #include <filesystem>
 #include <functional>
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "TrashCollector.h"
@@ -29,6 +34,8 @@ using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::UnorderedElementsAre;
 
+constexpr int kManyLevels = PATH_MAX * 3 / 5;  // with names of one character
+
 class TrashCollectorPass : public test::TrashFixture {
  protected:
   // One pass in the background.
@@ -45,6 +52,22 @@ class TrashCollectorPass : public test::TrashFixture {
     std::filesystem::create_directories(std::filesystem::path(directory_.file(name)).parent_path());
     if (mkfifo(directory_.file(name).c_str(), 0600) != 0) throw std::runtime_error("cannot make a fifo");
     return directory_.file(name);
+  }
+
+  // So many directories of that name, one in the other, with a file in the last.
+  string makeDeep(const string& name, const string& component, int levels) const {
+    string path = directory_.makeDirectory(name);
+    int descriptor = open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    for (int level = 0; level < levels; ++level) {
+      mkdirat(descriptor, component.c_str(), 0700);
+      const int next = openat(descriptor, component.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+      close(std::exchange(descriptor, next));
+    }
+    const int file = openat(descriptor, "leaf", O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+    if (file == -1) throw std::runtime_error("cannot make a deep tree");
+    close(file);
+    close(descriptor);
+    return path;
   }
 
   std::size_t deletionsBelow(const string& path) const {
@@ -205,6 +228,74 @@ TEST_F(TrashCollectorPass, DeletesEverythingOnAFileSystemThatTellsNoTypes) {
   EXPECT_THAT(directory_.names("cache"), IsEmpty());
   EXPECT_EQ(directory_.names("target").size(), 2U);
   EXPECT_THAT(log_.messages(), IsEmpty());
+}
+
+// --- Entries deeper than a path may be long ---
+
+TEST_F(TrashCollectorPass, DeletesWhatIsDeeperThanAPathMayBeLong) {
+  EXPECT_TRUE(collector_->collectPath(makeDeep("long names", string(200, 'n'), 2 * PATH_MAX / 200)));
+  EXPECT_TRUE(collector_->collectPath(makeDeep("many levels", "d", kManyLevels)));
+  queues_->runAll();
+  EXPECT_THAT(directory_.names("cache"), IsEmpty());
+  EXPECT_THAT(log_.messages(), IsEmpty());
+}
+
+TEST_F(TrashCollectorPass, CountsEachDirectoryOfADeepEntryOnce) {
+  EXPECT_TRUE(collector_->collectPath(makeDeep("deep", "d", kManyLevels)));
+  empty();
+  EXPECT_EQ(reportedCount(), std::size_t{kManyLevels} + 3U);  // the outermost, the file, and the trash
+}
+
+TEST_F(TrashCollectorPass, DeletesDeepEntriesOfATrashWhosePathIsLong) {
+  string below = "cache";
+  while (directory_.file(below).size() < 2800) below += "/" + string(200, 'n');
+  const string trash = directory_.file(below + "/trash");
+  TrashCollector collector(trash, files_, nullptr, queues_);
+  EXPECT_TRUE(collector.collectPath(makeDeep("deep", string(200, 'd'), 2 * PATH_MAX / 200)));
+  queues_->runAll();
+  EXPECT_FALSE(std::filesystem::exists(trash));
+  EXPECT_THAT(log_.messages(), IsEmpty());
+}
+
+TEST_F(TrashCollectorPass, MovesNothingOfAnOrdinaryTree) {
+  const string names = "/" + string(200, 'a') + "/" + string(200, 'b') + "/";
+  for (const std::size_t length : {92U, 93U}) {  // 512 and 513 characters behind the trash directory's path
+    const std::size_t before = files_->calls(Operation::Rename);
+    directory_.makeDirectory("tree" + names + string(length, 'c'));
+    EXPECT_TRUE(collector_->collectPath(directory_.file("tree")));
+    queues_->runAll();
+    EXPECT_EQ(files_->calls(Operation::Rename) - before, length == 92U ? 1U : 2U);
+    EXPECT_FALSE(directory_.exists("cache/trash"));
+  }
+}
+
+TEST_F(TrashCollectorPass, LeavesADeepEntryThatCannotBeDeletedAndDeletesTheOthers) {
+  collector_->collectPath(makeDeep("deep", string(200, 'd'), 2 * PATH_MAX / 200));
+  files_->failAlways(Operation::Rename, EACCES);
+  makeTree("cache/trash/tree");
+  queues_->runAll();
+  EXPECT_EQ(trashed().size(), 1U);
+  EXPECT_THAT(log_.messages(), ElementsAre(logged(ENAMETOOLONG, "Could not open directory: File name too long")));
+}
+
+TEST_F(TrashCollectorPass, DeletesWhereItIsWhatCannotBeMoved) {
+  collector_->collectPath(makeDeep("deep", string(200, 'd'), 10));
+  files_->failAlways(Operation::Rename, EXDEV);
+  queues_->runAll();
+  EXPECT_FALSE(directory_.exists("cache/trash"));
+  EXPECT_THAT(log_.messages(), IsEmpty());
+}
+
+TEST_F(TrashCollectorPass, ThatFailsInTheMidstOfADeepEntryLeavesAllOfItToTheNext) {
+  collector_->collectPath(makeDeep("deep", string(200, 'd'), 2 * PATH_MAX / 200));
+  files_->failAlways(Operation::DeleteFile, EBUSY);
+  queues_->runAll();
+  EXPECT_GT(trashed().size(), 1U);
+  EXPECT_THAT(log_.messages(), ElementsAre(logged(EBUSY, "Device or resource busy")));
+  files_->heal();
+  pass();
+  EXPECT_FALSE(directory_.exists("cache/trash"));
+  EXPECT_EQ(log_.errorCount(), 1U);
 }
 
 }  // namespace
