@@ -66,6 +66,7 @@ class TrashCollector::Trash {
     const Move move(*this);
     for (int attempt = 1;; ++attempt) {
       try {
+        throwIfLink();
         makeDirectory();
         fileUtils_->rename(path, entry);
         break;
@@ -106,6 +107,11 @@ class TrashCollector::Trash {
     Trash& trash_;
   };
 
+  // What is collected through a link would lie in somebody else's directory, where no pass deletes anything.
+  void throwIfLink() const {
+    if (fileUtils_->isSymLink(path_)) throw FileUtilsIoException(0, "Trash directory \"" + path_ + "\" is a link");
+  }
+
   // One that goes at the moment when it is looked at seems to be a file in the way.
   void makeDirectory() {
     try {
@@ -141,8 +147,8 @@ class TrashCollector::Trash::Pass {
   // cannot be deleted cannot.
   bool deleteTrash() {
     const unsigned int moves = trash_.moves_;
-    const bool isDirectory = !fileUtils_.isSymLink(trash_.path_) && fileUtils_.isDirectory(trash_.path_);
-    if (!isDirectory || deleteEntries()) wasEmpty_ = false;
+    trash_.throwIfLink();
+    if (!fileUtils_.isDirectory(trash_.path_) || deleteEntries()) wasEmpty_ = false;
     if (failure_ != nullptr) std::rethrow_exception(failure_);
     if (!trash_.running_) return false;
     const std::lock_guard<std::recursive_mutex> lock(trash_.moveMutex_);
@@ -190,7 +196,7 @@ class TrashCollector::Trash::Pass {
 
   // With all that is moved up from within it, each part of which may fail by itself.
   void deleteEntry(const FileUtils::Info& entry) {
-    if (fileUtils_.isSymLink(trash_.path_)) return;  // put there meanwhile
+    trash_.throwIfLink();  // put there meanwhile
     parts_ = {entry};
     while (!parts_.empty() && trash_.running_) {
       const FileUtils::Info part = parts_.back();

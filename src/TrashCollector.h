@@ -15,7 +15,8 @@ class FileUtils;
 // Makes directory trees vanish at once and frees their space later. The trash is a directory on the same file system as
 // what is collected; it exists only while there is something in it. Shared by all managers and stores; any thread may
 // call. Never throws for a failed file operation: it answers false, or logs one error line. Links are removed as links
-// and never followed, so nothing outside a collected tree is touched.
+// and never followed, so nothing outside a collected tree is touched. A link in the place of the trash directory itself
+// is refused: nothing is collected then, and no pass deletes anything.
 //
 // Whatever is in the trash is deleted: trees deeper than PATH_MAX, fifos and sockets too. A path that cannot be deleted
 // stays in the trash, from where deleting it failed, and the trash directory with it; everything else in the trash is

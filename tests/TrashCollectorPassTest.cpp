@@ -1,5 +1,5 @@
 // What a pass over the trash does with entries that are in its way: some that cannot be deleted, fifos, paths longer
-// than the system takes.
+// than the system takes, links.
 
 #include <fcntl.h>
 #include <gmock/gmock.h>
@@ -296,6 +296,63 @@ TEST_F(TrashCollectorPass, ThatFailsInTheMidstOfADeepEntryLeavesAllOfItToTheNext
   pass();
   EXPECT_FALSE(directory_.exists("cache/trash"));
   EXPECT_EQ(log_.errorCount(), 1U);
+}
+
+// --- A link in the place of the trash directory ---
+
+class TrashCollectorOverALink : public TrashCollectorPass {
+ protected:
+  string refusal() const { return ioFailure(0, "Trash directory \"" + trashPath() + "\" is a link"); }
+};
+
+TEST_F(TrashCollectorOverALink, RefusesToCollectAndLosesNothing) {
+  for (const char* target : {"outside", "nowhere", "file"}) {
+    directory_.makeDirectory("outside");
+    directory_.write("file", "");
+    link("cache/trash", directory_.file(target));
+    makeTree("tree");
+    EXPECT_FALSE(collector_->collectPath(directory_.file("tree"))) << target;
+    EXPECT_TRUE(log_.contains("Cannot collect path. " + refusal()));
+    EXPECT_EQ(directory_.names("tree").size(), 2U);
+    EXPECT_THAT(directory_.names("outside"), IsEmpty());
+    std::filesystem::remove(trashPath());
+  }
+  EXPECT_EQ(log_.errorCount(), 3U);
+}
+
+TEST_F(TrashCollectorOverALink, NamedWithASlashRefusesToo) {
+  directory_.makeDirectory("outside");
+  link("cache/trash", directory_.file("outside"));
+  TrashCollector collector(trashPath() + "/", files_, nullptr, queues_);
+  EXPECT_FALSE(collector.collectPath(makeTree("tree")));
+  EXPECT_THAT(directory_.names("outside"), IsEmpty());
+}
+
+TEST_F(TrashCollectorOverALink, EmptiesNothingAndSaysSo) {
+  makeTree("outside/tree");
+  link("cache/trash", directory_.file("outside"));
+  empty();
+  EXPECT_THAT(log_.messages(), ElementsAre("Cannot collect trash. " + refusal()));
+  EXPECT_EQ(directory_.names("outside/tree").size(), 2U);
+  EXPECT_EQ(reportedCount(), 0U);
+}
+
+TEST_F(TrashCollectorOverALink, ThatWasPutThereAfterAMoveSaysSoToo) {
+  EXPECT_TRUE(collector_->collectPath(makeTree("tree")));
+  std::filesystem::rename(trashPath(), directory_.file("moved"));
+  link("cache/trash", directory_.file("moved"));
+  queues_->runAll();
+  EXPECT_THAT(log_.messages(), ElementsAre("Cannot collect trash. " + refusal()));
+  EXPECT_EQ(directory_.names("moved").size(), 1U);
+}
+
+TEST_F(TrashCollectorOverALink, AboveTheTrashIsNoReasonToRefuse) {
+  directory_.makeDirectory("elsewhere");
+  link("cache", directory_.file("elsewhere"));
+  EXPECT_TRUE(collector_->collectPath(makeTree("tree")));
+  EXPECT_EQ(directory_.names("elsewhere/trash").size(), 1U);
+  queues_->runAll();
+  EXPECT_THAT(directory_.names("elsewhere"), IsEmpty());
 }
 
 }  // namespace
