@@ -2,7 +2,12 @@
 
 #include <glog/logging.h>
 
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstddef>
 #include <map>
+#include <set>
 #include <stdexcept>
 #include <utility>
 
@@ -25,6 +30,8 @@
 namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
+
+constexpr std::array<Area, 3> kAreas = {Area::Caches, Area::Documents, Area::Shared};
 
 // Managers of one area and scope have the same directory, and each takes the stores of the other for stale ones.
 void refuseSharedDirectories(const Configuration& configuration, const JsonValue& document) {
@@ -129,6 +136,32 @@ class Host::Ending {
   Scope& scope_;
 };
 
+// The time in which a session that is not open is discarded and cannot be opened. One at a time.
+class Host::Discarding {
+ public:
+  Discarding(Host& host, const std::string& tag) : host_(host) {
+    std::unique_lock<std::mutex> lock(host_.mutex_);
+    host_.changed_.wait(lock, [this] { return !host_.discardedTag_; });
+    isOpen_ = host_.openSession_ && host_.openSession_->tag == tag;
+    if (!isOpen_) host_.discardedTag_ = tag;
+  }
+  ~Discarding() {
+    if (isOpen_) return;
+    const std::lock_guard<std::mutex> lock(host_.mutex_);
+    host_.discardedTag_.reset();
+    host_.changed_.notify_all();
+  }
+  Discarding(const Discarding&) = delete;
+  Discarding& operator=(const Discarding&) = delete;
+
+  // Then nothing has begun.
+  bool isOpen() const { return isOpen_; }
+
+ private:
+  Host& host_;
+  bool isOpen_ = false;
+};
+
 Host::Host(HostOptions options)
     : configuration_(readConfiguration(options.configuration)),
       fileUtils_(options.fileUtils ? options.fileUtils : std::make_shared<FileUtils>()),
@@ -136,6 +169,7 @@ Host::Host(HostOptions options)
       locations_(std::make_shared<DirectoryPathLocations>(options.root)),
       nameBuilders_(std::make_shared<StoreDirectoryNameBuilderFactory>(options.versionTag, options.localeSecondTag,
                                                                        options.localeFirstTag)),
+      tagsTellKeys_(!options.sessionTagMapper),
       sessionTagMapper_(options.sessionTagMapper ? options.sessionTagMapper : nameOfSession),
       runMaintenance_(options.runMaintenance),
       shutDownPatience_(options.shutDownPatience),
@@ -203,36 +237,69 @@ std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definiti
 std::string Host::openSession(const std::optional<std::string>& sessionKey) {
   std::unique_lock<std::mutex> lock(mutex_);
   if (!openSession_) {
-    const std::string key = sessionKey.value_or("");
+    SessionName session{sessionKey.value_or(""), ""};
     lock.unlock();
-    (void)sessionTagMapper_(key);  // throws for a key that cannot name a directory: it opens no session
+    session.tag = sessionTagMapper_(session.key);  // throws for a key that cannot name a directory: it opens no session
     lock.lock();
-    if (!openSession_) openSession_ = key;
+    if (discardedTag_ == session.tag) throw InvalidatedException("The session is being logged out.");
+    if (!openSession_) openSession_ = std::move(session);
+    hasOpenedSession_ = true;
   }
-  if (sessionKey && *sessionKey != *openSession_) {
+  if (sessionKey && *sessionKey != openSession_->key) {
     throw std::logic_error("Another session is open, log out before you ask for a new one.");
   }
-  return *openSession_;
+  return openSession_->key;
 }
 
 void Host::logOut() {
   refuseOnQueueThread("Host::logOut");
-  const Ending ending(*this, sessionScoped_);
-  std::optional<std::string> session;
+  if (endOpenSession(std::nullopt)) return;
   {
     const std::lock_guard<std::mutex> lock(mutex_);
-    session.swap(openSession_);
+    if (hasOpenedSession_) return;
   }
-  if (!session) return;
-  invalidateAll(sessionScoped_);
-  trashSessionDirectories(*session);
+  const std::size_t stored = sessions().size();
+  if (stored == 0) return;
+  throw std::logic_error("No session has been opened yet. Sessions with data on disk: " + std::to_string(stored) +
+                         ". Name the one to end, as in logOut(sessionKey).");
+}
+
+bool Host::logOut(const std::string& sessionKey) { return endSession({sessionKey, sessionTagMapper_(sessionKey)}); }
+
+bool Host::logOut(const StoredSession& session) { return endSession({session.key.value_or(""), session.tag}); }
+
+bool Host::endSession(const SessionName& session) {
+  refuseOnQueueThread("Host::logOut");
+  while (true) {
+    const Discarding discarding(*this, session.tag);
+    if (!discarding.isOpen()) return discard(session);
+    if (endOpenSession(session.tag)) return true;  // unless somebody else has ended it just now
+  }
 }
 
 void Host::invalidate() {
   refuseOnQueueThread("Host::invalidate");
-  logOut();
+  endOpenSession(std::nullopt);
   const Ending ending(*this, sessionless_);
   invalidateAll(sessionless_);
+}
+
+// False when no session is open, or not the one of that tag.
+bool Host::endOpenSession(const std::optional<std::string>& tag) {
+  const Ending ending(*this, sessionScoped_);
+  std::optional<SessionName> session;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    session = openSession_;
+  }
+  if (!session || (tag && *tag != session->tag)) return false;
+  invalidateAll(sessionScoped_);
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    openSession_.reset();
+  }
+  discard(*session);
+  return true;
 }
 
 // Called while the scope is ending, so that nobody else uses its managers. One that throws is left to the next attempt.
@@ -243,13 +310,77 @@ void Host::invalidateAll(Scope& scope) {
   }
 }
 
-void Host::trashSessionDirectories(const std::string& sessionKey) {
-  const auto names = nameBuilders_->createStoreDirectoryNameBuilder(sessionTagMapper_(sessionKey));
-  for (const Area area : {Area::Caches, Area::Documents, Area::Shared}) {
-    const std::string directory =
-        fileUtils_->combinePath(locations_->pathForArea(area, sessionKey), names->buildStoreManagerName());
-    if (fileUtils_->pathExists(directory)) trash_->collectPath(directory);
+// Whether there was anything. What cannot be discarded in one area does not keep the other areas from it.
+bool Host::discard(const SessionName& session) {
+  const std::string name = nameBuilders_->createStoreDirectoryNameBuilder(session.tag)->buildStoreManagerName();
+  bool isFound = false;
+  std::string remaining;
+  for (const Area area : kAreas) {
+    try {
+      if (discardIn(locations_->pathForArea(area, session.key), name)) isFound = true;
+    } catch (const FileUtilsIoException& error) {
+      remaining += (remaining.empty() ? "" : "; ") + std::string(error.description());
+    }
   }
+  if (!remaining.empty()) throw FileUtilsIoException(0, "Data of the session remains: " + remaining);
+  return isFound;
+}
+
+// Whether there was anything. Looks again afterwards: a store that is being created in the background may have put its
+// directory back.
+bool Host::discardIn(const std::string& area, const std::string& name) {
+  const std::string path = fileUtils_->combinePath(area, name);
+  int attempts = 0;
+  for (; holds(area, name); ++attempts) {
+    if (attempts == 2) throw FileUtilsIoException(0, "could not move \"" + path + "\" to the trash");
+    trash_->collectPath(path);
+  }
+  return attempts > 0;
+}
+
+bool Host::holds(const std::string& area, const std::string& name) const {
+  const auto names = directoriesIn(area);
+  return std::find(names.begin(), names.end(), name) != names.end();
+}
+
+std::vector<StoredSession> Host::sessions() const {
+  const auto names = nameBuilders_->createStoreDirectoryNameBuilder("");
+  const std::size_t prefix = names->buildStoreManagerName().size();
+  std::set<std::string> tags;
+  for (const Area area : kAreas) {
+    const auto directories = directoriesIn(locations_->pathForArea(area, ""));
+    for (const std::string& name : names->filterStoreManagerNames({}, directories)) tags.insert(name.substr(prefix));
+  }
+  std::vector<StoredSession> sessions;
+  for (const std::string& tag : tags) sessions.push_back({tag, keyOf(tag)});
+  return sessions;
+}
+
+std::optional<std::string> Host::keyOf(const std::string& tag) const {
+  if (!tagsTellKeys_) return std::nullopt;
+  if (tag.empty()) return tag;
+  try {
+    std::string key = decodeFileName(tag);
+    if (nameOfSession(key) == tag) return key;
+  } catch (const std::invalid_argument&) {
+    // Named by another mapper.
+  }
+  return std::nullopt;
+}
+
+// The names of its directories, and links, which may lead to some. None where there is no area yet.
+std::vector<std::string> Host::directoriesIn(const std::string& area) const {
+  std::vector<std::string> names;
+  try {
+    for (const FileUtils::Info& entry : fileUtils_->listDirectory(area)) {
+      if (entry.type != FileUtils::Type::File) names.push_back(fileUtils_->basename(entry.path));
+    }
+  } catch (const FileUtilsIoException& error) {
+    if (error.code() != ENOENT) {
+      throw FileUtilsIoException(error.code(), "could not read \"" + area + "\": " + error.description());
+    }
+  }
+  return names;
 }
 
 }  // namespace velmora::mobile::xplat::cellar::host

@@ -62,13 +62,22 @@ struct HostOptions {
   bool lockRoot = true;
 };
 
+// A session of which the disk holds data.
+struct StoredSession {
+  std::string tag;  // what its directories are named after
+
+  // Absent where the tag does not tell: with a mapper of yours, or for a directory that this host has not named.
+  std::optional<std::string> key;
+};
+
 // Everything that an application needs to use the library, built in one go:
 //
 //   Host host(configurationText, "/data/app/storage");
 //   auto thumbs = host.store<DiskCache>("thumbs");
 //   await(thumbs->store("cat", bytes));
 //   auto letters = host.store<PersistentKeyValueStore>("letters", "session-42");
-//   host.logOut();
+//   host.logOut();                                                     // the session that is open
+//   for (const auto& session : host.sessions()) host.logOut(session);  // and those of earlier runs
 //
 // Under the root: "caches", "documents", "shared" (the areas), "trash" and the lock file "_cellar_lock". One host at a
 // time may use a root, in all processes together. Any thread may call.
@@ -76,7 +85,8 @@ struct HostOptions {
 // Sessions: one at a time. The first request that gives a session key opens that session, a request without one for a
 // session-scoped manager opens the session "", and requests without a key mean the open one. Asking for another session
 // throws until `logOut`, because a manager keeps its first session and its maintenance removes all others. Managers
-// without session scope ignore keys.
+// without session scope ignore keys. After a restart no session is open, and the data of the last one is still there:
+// `sessions` lists it, and `logOut(sessionKey)` discards it.
 //
 // Destroying the host loses no data: work that waits for the lazy delay is dropped, what is queued is finished, then
 // the host's own threads end, and another host may use the root. Managers and stores that are still held do no work
@@ -118,14 +128,30 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
     return detail::storeAs<StoreType>(storeIdentifier, getStore(storeIdentifier, sessionKey));
   }
 
-  // Ends the open session: its managers and stores become invalid and its directories go to the trash, those of
-  // managers that nobody has asked for included. The next request may open another session. Stores finish what they are
-  // writing meanwhile, and requests for session-scoped managers are refused: must not be called on one of the stores'
-  // queues, nor in a callback that runs there. On the host kit's own threads it throws `std::logic_error`. Not an
-  // error: no session is open.
+  // Ends the open session: its managers and stores become invalid and its directories go to the trash, in all areas,
+  // those of managers that nobody has asked for included. The next request may open another session. Stores finish what
+  // they are writing meanwhile, and requests for session-scoped managers are refused: must not be called on one of the
+  // stores' queues, nor in a callback that runs there. On the host kit's own threads it throws `std::logic_error`.
+  //
+  // Throws `FileUtilsIoException` that names what could not be discarded; the session has ended then all the same, and
+  // `logOut(sessionKey)` tries again. Not an error: the session that was open has ended already. But when none has been
+  // opened since the host was created, and there is data of sessions, it throws `std::logic_error`: it cannot know
+  // whose to discard.
   void logOut();
 
-  // Ends the open session and discards the data of the other managers that were asked for, too. As `logOut` otherwise.
+  // Ends that session, as `logOut()` if it is open. If not, as after a restart, its directories in all areas go to the
+  // trash, which an open session does not notice; requests that would open it meanwhile throw `InvalidatedException`.
+  // True when the session was open or there was data of it; that there was none is not an error. Throws as `logOut()`,
+  // and what the mapper throws for the key.
+  bool logOut(const std::string& sessionKey);
+  bool logOut(const StoredSession& session);
+
+  // The sessions of which there are directories in some area, by tag; the open one is among them once it has been used.
+  // Throws `FileUtilsIoException` when an area cannot be read.
+  std::vector<StoredSession> sessions() const;
+
+  // Ends the open session, if there is one, and discards the data of the other managers that were asked for, too. Waits
+  // and throws as `logOut`.
   void invalidate() override;
 
   // The services behind it, for those who build more on them. None is null but `analytics`.
@@ -150,21 +176,33 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
     std::size_t requests = 0;                // under way
     bool isEnding = false;                   // and lets no further request in
   };
+  struct SessionName {
+    std::string key;
+    std::string tag;
+  };
   class Request;
   class Ending;
+  class Discarding;
 
   std::shared_ptr<Store> getStore(const std::string& identifier, const std::optional<std::string>& sessionKey);
   std::shared_ptr<StoreManager> managerIn(const Request& request, const std::optional<std::string>& sessionKey);
   std::shared_ptr<StoreManager> build(const StoreManagerDefinition& definition, const std::string& sessionKey);
   std::string openSession(const std::optional<std::string>& sessionKey);
   static void invalidateAll(Scope& scope);
-  void trashSessionDirectories(const std::string& sessionKey);
+  bool endSession(const SessionName& session);
+  bool endOpenSession(const std::optional<std::string>& tag);
+  bool discard(const SessionName& session);
+  bool discardIn(const std::string& area, const std::string& name);
+  bool holds(const std::string& area, const std::string& name) const;
+  std::vector<std::string> directoriesIn(const std::string& area) const;
+  std::optional<std::string> keyOf(const std::string& tag) const;
 
   const std::shared_ptr<const Configuration> configuration_;
   const std::shared_ptr<FileUtils> fileUtils_;
   const std::unique_ptr<const RootLock> rootLock_;  // null when it is not wanted; released after all that follows
   const std::shared_ptr<PathLocations> locations_;
   const std::shared_ptr<StoreDirectoryNameBuilderFactory> nameBuilders_;
+  const bool tagsTellKeys_;
   const std::function<std::string(const std::string&)> sessionTagMapper_;
   const bool runMaintenance_;
   const std::chrono::seconds shutDownPatience_;
@@ -177,11 +215,13 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<LazyDispatcher> lazyWork_;
   const std::shared_ptr<AsyncExecutor> measuringQueue_;
 
-  std::mutex mutex_;                 // guards the three below, never held while anything is called
-  std::condition_variable changed_;  // a scope's requests, or its end
+  std::mutex mutex_;                 // guards all below, never held while anything is called
+  std::condition_variable changed_;  // a scope's requests, its end, or that of a discarding
   Scope sessionScoped_;
   Scope sessionless_;
-  std::optional<std::string> openSession_;
+  std::optional<SessionName> openSession_;
+  bool hasOpenedSession_ = false;            // at any time
+  std::optional<std::string> discardedTag_;  // of a session that is not open, while it is discarded
 };
 
 }  // namespace host

@@ -91,6 +91,7 @@ int main(int argc, char** argv) {
     host->logOut();  // alice's thumbs, drafts and exports are gone
     const auto bobs = host->store<cellar::PersistentKeyValueStore>("drafts", "bob");
     std::cout << "bob has a letter: " << (cellar::host::await(bobs->fetch("letter")) != nullptr ? "yes" : "no") << '\n';
+    for (const auto& session : host->sessions()) std::cout << "data of: " << session.key.value_or("?") << '\n';
     return 0;
   } catch (const std::exception& error) {
     std::cerr << "photos: " << error.what() << '\n';

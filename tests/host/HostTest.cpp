@@ -8,9 +8,11 @@
 #include <cerrno>
 #include <chrono>
 #include <filesystem>
+#include <fstream>
 #include <future>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -129,6 +131,22 @@ class HostTest : public testing::Test {
       return error.description();
     }
     return "no error";
+  }
+
+  // What an earlier run has left of a session in two areas.
+  void leaveSession(const std::string& key) const {
+    HostOptions earlier = options();
+    earlier.runMaintenance = false;  // others may be there
+    Host host(std::move(earlier));
+    for (const std::string store : {"letters", "files"}) {
+      std::ofstream(host.store<UnmanagedStore>(store, key)->path + "/value") << key;
+    }
+  }
+
+  static std::vector<std::string> tagsOf(const std::vector<StoredSession>& sessions) {
+    std::vector<std::string> tags;
+    for (const StoredSession& session : sessions) tags.push_back(session.tag);
+    return tags;
   }
 
   const TemporaryDirectory directory;
@@ -567,11 +585,20 @@ TEST_F(HostTest, MaintenanceRemovesOtherSessions) {
   EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_store_alice"});
 }
 
-TEST_F(HostTest, LoggingOutWithoutASessionDoesNothing) {
-  directory.makeDirectory("caches/_store_");
+TEST_F(HostTest, LoggingOutBeforeASessionIsOpenedSaysThatThereIsOneToName) {
+  start()->store<UnmanagedStore>("letters", "alice");
   const auto host = start();
+  EXPECT_EQ(
+      errorOf<std::logic_error>([&] { host->logOut(); }),
+      "No session has been opened yet. Sessions with data on disk: 1. Name the one to end, as in logOut(sessionKey).");
+  EXPECT_TRUE(directory.exists("caches/_store_alice"));
+}
+
+TEST_F(HostTest, LoggingOutWithoutASessionAndItsDataDoesNothing) {
+  const auto host = start();
+  host->manager("media");
   host->logOut();
-  EXPECT_TRUE(directory.exists("caches/_store_"));
+  EXPECT_TRUE(host->manager("media")->isValid());
 }
 
 TEST_F(HostTest, LoggingOutTwiceIsLoggingOutOnce) {
@@ -627,6 +654,191 @@ TEST_F(HostTest, NoManagerOfASessionSurvivesItsLogOut) {
   host->logOut();
   EXPECT_EQ(managers.size() + refused, 60U);
   for (const auto& manager : managers) EXPECT_FALSE(manager->isValid());
+}
+
+// Sessions of earlier runs
+
+TEST_F(HostTest, ASessionIsLoggedOutAfterARestartInAllAreasThoughNobodyHasOpenedIt) {
+  leaveSession("alice");
+  const auto host = start();
+  EXPECT_TRUE(host->logOut("alice"));
+  EXPECT_TRUE(directory.names("caches").empty());
+  EXPECT_TRUE(directory.names("documents").empty());
+  EXPECT_TRUE(directory.names(host->store<UnmanagedStore>("letters", "alice")->path.substr(directory.path().size() + 1))
+                  .empty());
+}
+
+TEST_F(HostTest, LoggingOutTheSessionThatIsOpenByItsKeyEndsIt) {
+  const auto host = start();
+  const auto inbox = host->manager("inbox", "alice");
+  EXPECT_TRUE(host->logOut("alice"));
+  EXPECT_FALSE(inbox->isValid());
+  EXPECT_TRUE(directory.names("caches").empty());
+  EXPECT_TRUE(host->manager("inbox", "bob")->isValid());
+}
+
+TEST_F(HostTest, LoggingOutASessionLeavesTheOthersAndTheOpenOneAlone) {
+  leaveSession("bob");
+  leaveSession("carol");
+  HostOptions withoutMaintenance = options();
+  withoutMaintenance.runMaintenance = false;
+  Host host(std::move(withoutMaintenance));
+  const auto inbox = host.manager("inbox", "alice");
+  EXPECT_TRUE(host.logOut("bob"));
+  EXPECT_EQ(tagsOf(host.sessions()), (std::vector<std::string>{"alice", "carol"}));
+  EXPECT_TRUE(inbox->isValid());
+  EXPECT_EQ(host.manager("inbox"), inbox);
+}
+
+TEST_F(HostTest, LoggingOutASessionWithoutDataIsNotAnError) {
+  const auto host = start();
+  EXPECT_FALSE(host->logOut("alice"));
+  host->manager("inbox", "bob");
+  EXPECT_FALSE(host->logOut("alice"));
+}
+
+TEST_F(HostTest, LoggingOutAKeyThatCannotNameADirectoryThrows) {
+  EXPECT_THROW(start()->logOut(std::string(300, 'x')), std::length_error);
+}
+
+TEST_F(HostTest, SessionsWithDataOnDiskAreListedWithTheirKeys) {
+  leaveSession("Al/ice");
+  leaveSession("");
+  directory.makeDirectory("shared/_store_carol");
+  directory.makeDirectory("shared/_store_Dave");  // of another mapper
+  directory.makeDirectory("shared/_store_%");
+  directory.makeDirectory("shared/_sessionlessStore");
+  directory.makeDirectory("shared/_cellar_quarantine");
+  directory.write("shared/_store_file", "no directory");
+  const auto host = start();
+  std::vector<std::pair<std::string, std::optional<std::string>>> found;
+  for (const StoredSession& session : host->sessions()) found.emplace_back(session.tag, session.key);
+  EXPECT_EQ(found,
+            (std::vector<std::pair<std::string, std::optional<std::string>>>{
+                {"", ""}, {"%", std::nullopt}, {"%41l%2fice", "Al/ice"}, {"Dave", std::nullopt}, {"carol", "carol"}}));
+}
+
+TEST_F(HostTest, EverySessionThatIsListedCanBeLoggedOut) {
+  leaveSession("alice");
+  leaveSession("bob");
+  directory.makeDirectory("shared/_store_Of another mapper");
+  const auto host = start();
+  for (const StoredSession& session : host->sessions()) EXPECT_TRUE(host->logOut(session));
+  EXPECT_TRUE(host->sessions().empty());
+}
+
+TEST_F(HostTest, ThereAreNoSessionsBeforeThereIsAnArea) { EXPECT_TRUE(start()->sessions().empty()); }
+
+TEST_F(HostTest, SessionsThatAMapperOfTheApplicationHasNamedAreListedWithoutKeys) {
+  HostOptions mapped = options();
+  mapped.sessionTagMapper = [](const std::string& key) { return "of-" + key; };
+  Host host(std::move(mapped));
+  host.manager("inbox", "alice");
+  const auto sessions = host.sessions();
+  ASSERT_EQ(tagsOf(sessions), std::vector<std::string>{"of-alice"});
+  EXPECT_FALSE(sessions.front().key);
+  EXPECT_TRUE(host.logOut("alice"));
+  EXPECT_TRUE(host.sessions().empty());
+}
+
+TEST_F(HostTest, LoggingOutAKeyThatNamesTheDirectoriesOfTheOpenSessionEndsThat) {
+  HostOptions mapped = options();
+  mapped.sessionTagMapper = [](const std::string& key) { return key.substr(0, 1); };
+  Host host(std::move(mapped));
+  const auto inbox = host.manager("inbox", "alice");
+  EXPECT_TRUE(host.logOut("anna"));
+  EXPECT_FALSE(inbox->isValid());
+}
+
+TEST_F(HostTest, ALinkInTheDirectorysPlaceIsASessionToo) {
+  directory.write("elsewhere/letters_v1/letter", "kept");
+  directory.makeDirectory("caches");
+  std::filesystem::create_symlink(directory.file("elsewhere"), directory.file("caches/_store_alice"));
+  const auto host = start();
+  EXPECT_EQ(tagsOf(host->sessions()), std::vector<std::string>{"alice"});
+  EXPECT_TRUE(host->logOut("alice"));
+  EXPECT_TRUE(host->sessions().empty());
+  EXPECT_EQ(directory.read("elsewhere/letters_v1/letter"), "kept");
+}
+
+TEST_F(HostTest, WhatCannotBeDiscardedIsSaidAndTheRestIsDiscarded) {
+  leaveSession("alice");
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  files->failPath(FaultyFileUtils::Operation::Rename, directory.file("caches/_store_alice"), EIO);
+  EXPECT_NE(errorOf<FileUtilsIoException>([&] { host.logOut("alice"); })
+                .find("Data of the session remains: could not move \"" + directory.file("caches/_store_alice") +
+                      "\" to the trash"),
+            std::string::npos);
+  EXPECT_TRUE(directory.exists("caches/_store_alice/letters_v1/value"));
+  EXPECT_TRUE(directory.names("documents").empty());
+  files->heal();
+  EXPECT_TRUE(host.logOut("alice"));
+  EXPECT_TRUE(host.sessions().empty());
+}
+
+TEST_F(HostTest, AnOpenSessionWhoseDataCannotBeDiscardedHasEndedAllTheSame) {
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  const auto inbox = host.manager("inbox", "alice");
+  files->failAlways(FaultyFileUtils::Operation::Rename, EIO);
+  EXPECT_EQ(codeOf([&] { host.logOut(); }), 0);
+  EXPECT_FALSE(inbox->isValid());
+  EXPECT_TRUE(directory.exists("caches/_store_alice"));
+  files->heal();
+  EXPECT_TRUE(host.logOut("alice"));
+  EXPECT_TRUE(host.manager("inbox", "bob")->isValid());
+}
+
+TEST_F(HostTest, AnAreaThatCannotBeReadIsNotTakenForEmpty) {
+  leaveSession("alice");
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  files->failPath(FaultyFileUtils::Operation::ListDirectory, directory.file("caches"), EACCES);
+  const std::string reason = "could not read \"" + directory.file("caches") + "\": ";
+  EXPECT_NE(errorOf<FileUtilsIoException>([&] { host.sessions(); }).find(reason), std::string::npos);
+  EXPECT_NE(errorOf<FileUtilsIoException>([&] { host.logOut("alice"); }).find("remains: " + reason), std::string::npos);
+  EXPECT_TRUE(directory.names("documents").empty());
+}
+
+TEST_F(HostTest, ASessionCannotBeOpenedWhileItIsDiscardedAndOthersCan) {
+  leaveSession("bob");
+  const auto files = std::make_shared<FaultyFileUtils>();
+  Host host(optionsWith(files));
+  std::string refusal;
+  bool isOther = false;
+  files->onCall = [&](FaultyFileUtils::Operation operation, const std::string& path) {
+    if (operation != FaultyFileUtils::Operation::Rename || path != directory.file("caches/_store_bob")) return;
+    refusal = errorOf<InvalidatedException>([&] { host.manager("inbox", "bob"); });
+    isOther = host.manager("archive", "alice")->isValid();
+  };
+  EXPECT_TRUE(host.logOut("bob"));
+  EXPECT_EQ(refusal, InvalidatedException("The session is being logged out.").what());
+  EXPECT_TRUE(isOther);
+}
+
+TEST_F(HostTest, LoggingOutByKeyBesideRequestsLeavesNoManagerOfTheSessionValid) {
+  const LogCapture log;  // two that discard a directory at once meet each other
+  const auto host = start();
+  std::mutex mutex;
+  std::vector<std::shared_ptr<StoreManager>> managers;
+  runOnThreads(4, [&](std::size_t thread) {
+    for (int i = 0; i < 20; ++i) {
+      if (thread < 2) {
+        host->logOut("alice");
+        continue;
+      }
+      try {
+        auto manager = host->manager(thread == 2 ? "archive" : "inbox", "alice");
+        const std::lock_guard<std::mutex> lock(mutex);
+        managers.push_back(std::move(manager));
+      } catch (const InvalidatedException&) {
+      }
+    }
+  });
+  host->logOut("alice");
+  for (const auto& manager : managers) EXPECT_FALSE(manager->isValid());
+  EXPECT_TRUE(host->sessions().empty());
 }
 
 // Waiting would be for ever: the end of the session waits for the queue that the request is made on.
@@ -766,12 +978,14 @@ TEST_F(HostTest, EndingASessionInACallbackOfItsStoreIsRefusedAndChangesNothing) 
   const auto letters = host.store<PersistentKeyValueStore>("letters");
   std::promise<std::vector<std::string>> refusals;
   letters->store("first", {1}).then(nullptr, [&](std::future<void>&) {
-    refusals.set_value(
-        {errorOf<std::logic_error>([&] { host.logOut(); }), errorOf<std::logic_error>([&] { host.invalidate(); })});
+    refusals.set_value({errorOf<std::logic_error>([&] { host.logOut(); }),
+                        errorOf<std::logic_error>([&] { host.logOut(""); }),
+                        errorOf<std::logic_error>([&] { host.invalidate(); })});
   });
   const std::string rest =
       " may wait for itself on a thread of the host kit's queues. Use a thread of your own instead.";
-  EXPECT_EQ(refusals.get_future().get(), (std::vector<std::string>{"Host::logOut" + rest, "Host::invalidate" + rest}));
+  EXPECT_EQ(refusals.get_future().get(),
+            (std::vector<std::string>{"Host::logOut" + rest, "Host::logOut" + rest, "Host::invalidate" + rest}));
   EXPECT_NE(await(letters->fetch("first")), nullptr);
 }
 
