@@ -191,6 +191,7 @@ Host::Host(const std::string& configuration, const std::string& root) : Host(pla
 Host::~Host() {
   lazyWork_->willBeTriggeredExternally();
   if (threads_ == nullptr) return;
+  threads_->refuseNewWork();
   if (threads_->drain(shutDownPatience_)) {
     threads_->shutDown();
   } else {

@@ -52,7 +52,7 @@ struct HostOptions {
   // Until stores that nobody has asked for are created, and directories measured, in the background.
   long lazyDelaySeconds = 10;
   bool runMaintenance = true;  // whether managers clean up what is stale and prune what is over its limit
-  std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for work that is under way
+  std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for work that it has accepted
 
   std::shared_ptr<FileUtils> fileUtils;                // null: the real file system
   std::shared_ptr<TaskQueueFactory> taskQueueFactory;  // null: threads of the host's own
@@ -88,11 +88,15 @@ struct StoredSession {
 // without session scope ignore keys. After a restart no session is open, and the data of the last one is still there:
 // `sessions` lists it, and `logOut(sessionKey)` discards it.
 //
-// Destroying the host loses no data: work that waits for the lazy delay is dropped, what is queued is finished, then
-// the host's own threads end, and another host may use the root. Managers and stores that are still held do no work
-// from then on: their futures are broken promises. Queues that came with the options are not waited for: have them done
-// before another host uses the root. The destructor may run on one of the host's own queues, and then waits for
-// nothing.
+// Destroying the host loses no data. It ends promptly, however busy other threads are: what they ask for from then on
+// fails at once with a broken promise in its future, work that waits for the lazy delay is dropped, and what was
+// accepted before is finished, from queue to queue. Then the host's own threads end, and another host may use the root.
+// What is not finished after the patience (a task that is stuck, callbacks that keep starting new work) is left to the
+// threads, which are left behind, with one error line: a write that they do not come to fails, and the value before it
+// stays. Managers and stores that are still held do no work from then on: their futures are broken promises.
+//
+// Queues that came with the options are not waited for: have them done before another host uses the root. The
+// destructor may run on one of the host's own queues, and then waits for nothing.
 class CELLAR_EXPORT Host : public session::Invalidatable {
  public:
   // Throws what `Configuration` throws; `ConfigurationException` when two managers of one area are both session scoped

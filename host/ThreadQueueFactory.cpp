@@ -135,12 +135,13 @@ class Queue {
  public:
   Queue(std::string name, std::shared_ptr<Group> group) : name_(std::move(name)), group_(std::move(group)) {}
 
-  // Takes the task over, or leaves it as it is and answers false when the queue is closed.
+  // Takes the task over, or leaves it as it is and answers false when the queue is closed, or to others and the caller
+  // is not one of the factory's threads.
   bool add(Task& task) {
     bool isAsleep = false;
     {
       const std::lock_guard<std::mutex> lock(mutex_);
-      if (closed_) return false;
+      if (closed_ || (closedToOthers_ && currentGroup != group_.get())) return false;
       tasks_.push_back(std::move(task));
       group_->taskBegins();
       hasNews_.store(true, std::memory_order_release);
@@ -148,6 +149,11 @@ class Queue {
     }
     if (isAsleep) changed_.notify_one();
     return true;
+  }
+
+  void closeToOthers() {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    closedToOthers_ = true;
   }
 
   void close() {
@@ -208,9 +214,10 @@ class Queue {
   std::atomic<bool> finished_{false};
   std::atomic<bool> hasNews_{false};  // changed with the mutex held, looked out for without
 
-  std::mutex mutex_;  // guards the three below
+  std::mutex mutex_;  // guards the four below
   std::deque<Task> tasks_;
   bool closed_ = false;
+  bool closedToOthers_ = false;
   bool isAsleep_ = false;
   std::condition_variable changed_;
 };
@@ -383,6 +390,7 @@ class ThreadQueueFactory::Threads {
     const std::string name = "cellar-" + role + "-" + std::to_string(++queuesOfRole_[role]);
     const auto queue = std::make_shared<Queue>(name, group_);
     auto handle = std::make_shared<ThreadQueue>(queue, timers_);
+    if (closedToOthers_) queue->closeToOthers();
     if (closed_) {
       queue->close();
       return handle;
@@ -400,6 +408,13 @@ class ThreadQueueFactory::Threads {
 
   bool drain(std::chrono::milliseconds patience) {
     return !onOwnThread() && group_->waitUntilIdle(deadlineAfter(inNanoseconds(patience)));
+  }
+
+  void refuseNewWork() {
+    timers_->stop();
+    const std::lock_guard<std::mutex> lock(mutex_);
+    closedToOthers_ = true;
+    for (const Worker& worker : workers_) worker.queue->closeToOthers();
   }
 
   void shutDown() {
@@ -456,11 +471,12 @@ class ThreadQueueFactory::Threads {
 
   std::mutex
       joinMutex_;     // so that a second `shutDown` waits for the first; taken before the other, never by own threads
-  std::mutex mutex_;  // guards the four below
+  std::mutex mutex_;  // guards the five below
   std::unordered_map<std::string, unsigned int> queuesOfRole_;
   std::vector<Worker> workers_;
   std::thread timerThread_;
   bool closed_ = false;
+  bool closedToOthers_ = false;
 };
 
 ThreadQueueFactory::ThreadQueueFactory() : threads_(std::make_unique<Threads>()) {}
@@ -483,6 +499,8 @@ void ThreadQueueFactory::refuseOnQueueThread(const std::string& operation, const
 }
 
 bool ThreadQueueFactory::drain(std::chrono::milliseconds patience) { return threads_->drain(patience); }
+
+void ThreadQueueFactory::refuseNewWork() { threads_->refuseNewWork(); }
 
 void ThreadQueueFactory::shutDown() { threads_->shutDown(); }
 

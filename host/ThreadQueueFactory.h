@@ -28,8 +28,9 @@ namespace velmora::mobile::xplat::cellar::host {
 // open.
 //
 // Closing (`shutDown`, `abandon`, the destructor): what was dispatched before still runs, timers that have not fired
-// are dropped, and what is dispatched afterwards is destroyed unrun on the caller's thread, which fails the promises
-// that it holds.
+// are dropped, and what is dispatched afterwards, by those tasks too, is destroyed unrun on the caller's thread, which
+// fails the promises that it holds. To have work that goes from queue to queue finished first, `refuseNewWork` and
+// `drain`.
 class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
  public:
   // Starts the timer thread. Throws `std::system_error` when the system gives no thread.
@@ -55,6 +56,11 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   // about after `patience`. Armed timers do not count. Tells nothing about what other threads dispatch meanwhile.
   // Called from a task of these queues it would wait for itself: false at once.
   bool drain(std::chrono::milliseconds patience);
+
+  // From now on what other threads dispatch is destroyed unrun, on their threads, and timers are dropped; what was
+  // dispatched before runs, and so does what that dispatches. So `drain` ends, however busy other threads are; tasks
+  // that keep dispatching further ones without end hold it up.
+  void refuseNewWork();
 
   // Closes and waits for the threads: no task runs any more when it returns. From a task of these queues it closes and
   // returns at once. Calling it again does no harm.

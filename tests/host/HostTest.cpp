@@ -1081,6 +1081,74 @@ TEST_F(HostTest, DestroyingTheHostFinishesWhatIsQueuedAndWhatThatQueues) {
   EXPECT_EQ(ran, 100);
 }
 
+TEST_F(HostTest, DestroyingTheHostRefusesNewWorkAndFinishesWhatItHadAccepted) {
+  const Watchdog watchdog(kLongEnough);
+  HostOptions patient = options();
+  patient.shutDownPatience = kLongPatience;
+  auto host = std::make_unique<Host>(std::move(patient));
+  const auto first = host->queues()->createQueue();
+  const auto second = host->queues()->createWorkQueue();
+  Latch begun(1);
+  Latch gate(1);
+  std::atomic<int> ran{0};
+  first->dispatch([&] {
+    begun.countDown();
+    gate.wait();
+    second->dispatch([&] { first->dispatch([&] { ++ran; }); });
+  });
+  begun.wait();
+  std::thread ending([&] { host.reset(); });
+  const auto isRefused = [&] {
+    return errorOf<std::future_error>([&] { dispatchTask<void>(second, [] {}).get(); }) != "no error";
+  };
+  while (!isRefused()) std::this_thread::yield();
+  EXPECT_EQ(ran, 0);
+  gate.countDown();
+  ending.join();
+  EXPECT_EQ(ran, 1);
+}
+
+// Without an end to the new work the destructor waits for as long as its patience lasts, and then loses values.
+TEST_F(HostTest, DestroyingTheHostUnderLoadEndsPromptlyAndLosesNoValue) {
+  const Watchdog watchdog(kLongEnough);
+  constexpr std::size_t keys = 50;
+  HostOptions patient = options();
+  patient.configuration = kConfigurationOfValues;
+  patient.shutDownPatience = kLongPatience;
+  auto host = std::make_unique<Host>(std::move(patient));
+  const auto letters = host->store<PersistentKeyValueStore>("letters");
+  for (std::size_t key = 0; key < keys; ++key) await(letters->store("key" + std::to_string(key), {1}));
+
+  Latch busy(2);
+  std::vector<std::thread> threads;
+  for (std::size_t thread = 0; thread < 2; ++thread) {
+    threads.emplace_back([&] {
+      std::vector<Future<void>> writes;
+      for (std::size_t i = 0; true; ++i) {
+        writes.push_back(letters->store("key" + std::to_string(i % keys), {2}));
+        if (i < 100) continue;
+        busy.countDown();
+        try {
+          await(writes[i - 100]);
+        } catch (const std::future_error&) {
+          return;
+        }
+      }
+    });
+  }
+  busy.wait();
+  host.reset();
+  for (std::thread& thread : threads) thread.join();
+
+  HostOptions again = options();
+  again.configuration = kConfigurationOfValues;
+  host = std::make_unique<Host>(std::move(again));
+  const auto reopened = host->store<PersistentKeyValueStore>("letters");
+  for (std::size_t key = 0; key < keys; ++key) {
+    EXPECT_NE(await(reopened->fetch("key" + std::to_string(key))), nullptr) << key;
+  }
+}
+
 TEST_F(HostTest, DestroyingTheHostDropsTheLazyWork) {
   auto host = start();
   host->manager("media");

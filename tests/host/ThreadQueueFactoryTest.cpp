@@ -853,6 +853,103 @@ TEST_F(ThreadQueueFactoryTest, DrainFromATaskIsFalseAtOnce) {
   EXPECT_FALSE(drained);
 }
 
+// Refusing new work
+
+TEST_F(ThreadQueueFactoryTest, WorkOfOtherThreadsThatIsRefusedIsDestroyedUnrun) {
+  const auto queue = factory->createQueue();
+  factory->refuseNewWork();
+  Latch gone(1);
+  std::atomic<bool> ran{false};
+  queue->dispatch([&ran, sentinel = countDownWhenGone(gone)] { ran = true; });
+  EXPECT_TRUE(gone.isOpen());
+  EXPECT_THROW(dispatchTask<void>(queue, [] {}).get(), std::future_error);
+  EXPECT_TRUE(factory->drain(kLongPatience));
+  EXPECT_FALSE(ran);
+}
+
+TEST_F(ThreadQueueFactoryTest, WhatWasDispatchedBeforeTheRefusalRunsAndMayDispatchFurtherTasks) {
+  const auto first = factory->createQueue();
+  const auto second = factory->createWorkQueue();
+  const auto gate = std::make_shared<Latch>(1);
+  block(first, gate);
+  std::atomic<int> hops{0};
+  std::function<void()> hop = [&] {
+    const int done = ++hops;
+    if (done < 100) (done % 2 == 0 ? first : second)->dispatch(hop);
+  };
+  first->dispatch(hop);
+  factory->refuseNewWork();
+  gate->countDown();
+  EXPECT_TRUE(factory->drain(kLongPatience));
+  EXPECT_EQ(hops, 100);
+}
+
+TEST_F(ThreadQueueFactoryTest, TasksOfAnotherFactoryAreRefusedLikeThoseOfAnyThread) {
+  ThreadQueueFactory other;
+  const auto queue = factory->createQueue();
+  factory->refuseNewWork();
+  const auto work = [&] { dispatchTask<void>(queue, [] {}).get(); };
+  EXPECT_THROW(dispatchTask<void>(other.createQueue(), work).get(), std::future_error);
+}
+
+TEST_F(ThreadQueueFactoryTest, AQueueThatIsCreatedAfterTheRefusalWorksForTasksOnly) {
+  const auto queue = factory->createQueue();
+  const auto gate = std::make_shared<Latch>(1);
+  block(queue, gate);
+  std::atomic<bool> ran{false};
+  queue->dispatch([&] { factory->createWorkQueue()->dispatch([&] { ran = true; }); });
+  factory->refuseNewWork();
+  const auto late = factory->createQueue();
+  EXPECT_THROW(dispatchTask<void>(late, [] {}).get(), std::future_error);
+  gate->countDown();
+  EXPECT_TRUE(factory->drain(kLongPatience));
+  EXPECT_TRUE(ran);
+}
+
+TEST_F(ThreadQueueFactoryTest, TheRefusalDropsTimersArmedBeforeAndAfterIt) {
+  const auto queue = factory->createQueue();
+  Latch gone(2);
+  std::atomic<bool> ran{false};
+  const auto before = queue->dispatchAfter(
+      kHour, [&ran, sentinel = countDownWhenGone(gone)] { ran = true; }, nullptr);
+  factory->refuseNewWork();
+  const auto after = queue->dispatchAfter(
+      0, [&ran, sentinel = countDownWhenGone(gone)] { ran = true; }, nullptr);
+  EXPECT_TRUE(gone.isOpen());
+  factory->shutDown();
+  EXPECT_FALSE(ran);
+}
+
+TEST_F(ThreadQueueFactoryTest, DrainEndsThoughOtherThreadsKeepDispatchingOnceTheyAreRefused) {
+  const auto queue = factory->createQueue();
+  std::atomic<bool> isOver{false};
+  Latch busy(2);
+  std::vector<std::thread> threads;
+  for (int i = 0; i < 2; ++i) {
+    threads.emplace_back([&] {
+      while (!isOver) {
+        queue->dispatch([] {});
+        busy.countDown();
+      }
+    });
+  }
+  busy.wait();
+  factory->refuseNewWork();
+  EXPECT_TRUE(factory->drain(kLongPatience));
+  isOver = true;
+  for (std::thread& thread : threads) thread.join();
+}
+
+TEST_F(ThreadQueueFactoryTest, TasksThatKeepDispatchingAreNotRefusedAndEndWhenTheQueuesAreClosed) {
+  const auto queue = factory->createQueue();
+  std::function<void()> hop = [&] { queue->dispatch(hop); };
+  queue->dispatch(hop);
+  factory->refuseNewWork();
+  EXPECT_FALSE(factory->drain(std::chrono::milliseconds(2)));
+  factory->shutDown();
+  EXPECT_TRUE(factory->drain(std::chrono::milliseconds(0)));
+}
+
 TEST_F(ThreadQueueFactoryTest, ATaskOfAnotherFactoryMayDrainThisOne) {
   ThreadQueueFactory other;
   const auto queue = other.createQueue();
