@@ -119,6 +119,14 @@ struct Life::Process {
     return all;
   }
 
+  // What waits on the queues never runs, nor what is asked of them for that reason.
+  void dropAll() const {
+    const auto waits = [](const std::shared_ptr<ManualExecutor>& queue) { return queue->pending() > 0; };
+    for (auto all = executors(); std::any_of(all.begin(), all.end(), waits); all = executors()) {
+      for (const auto& queue : all) queue->dropAll();
+    }
+  }
+
   // What the application holds; the queues stay.
   void letGo() {
     lazyWork->willBeTriggeredExternally();
@@ -194,7 +202,7 @@ void Life::step(std::size_t number) {
 
 void Life::end() {
   if (process_ == nullptr) return;
-  process_->lazyWork->willBeTriggeredExternally();
+  process_->letGo();
   settle();
   process_.reset();
 }
@@ -384,7 +392,7 @@ void Life::closeInTheMiddle() {
     write.written->isPending() ? notBegun.push_back(write) : take(write);
   }
   process_->letGo();
-  for (const auto& queue : process_->executors()) queue->dropAll();
+  process_->dropAll();
   notePurges();
   process_.reset();
   for (const Asked& write : notBegun) forget(write);
