@@ -122,7 +122,7 @@ class FaultInjection : public testing::Test {
     // A query that fails answers false, or nothing, and work goes on from there.
     faults.isDueToBeTold = [](Life& life, std::size_t n) {
       const std::string call = life.files->trace().at(n - 1);
-      const auto isCallOf = [&](const char* name) { return call.rfind(name, 0) == 0; };
+      const auto isCallOf = [&](const char* operation) { return call.rfind(operation, 0) == 0; };
       return !isCallOf("pathExists") && !isCallOf("is") && !isCallOf("listOtherEntries");
     };
     sweep(faults);
