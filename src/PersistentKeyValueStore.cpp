@@ -383,9 +383,13 @@ unsigned int PersistentKeyValueStore::runWriter(const FileWrite& write) {
 
 void PersistentKeyValueStore::recordWritten(FileWrite& write) {
   if (write.outcome == FileWrite::Outcome::Failed) return;
-  const bool othersAreInFlight = writesInFlight_->end(write.inFlight);
   if (write.inFlight->isRevoked) write.outcome = FileWrite::Outcome::Discarded;
-  if (write.outcome == FileWrite::Outcome::Discarded) return;
+  if (write.outcome == FileWrite::Outcome::Discarded) {
+    const auto settled = writesInFlight_->drop(write.inFlight);
+    if (settled && settled->isReplaced) discardRecord(write.key, false);
+    return;
+  }
+  const bool othersAreInFlight = writesInFlight_->end(write.inFlight);
   try {
     const DiskCacheItem record = write.record();
     const auto setRecord = [&] {
@@ -700,20 +704,21 @@ std::optional<std::int32_t> PersistentKeyValueStore::fetchModificationDate(const
 Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_, key,
-                                     promise] {
-    settle(*promise, [&] {
-      const auto self = weakThis.lock();
-      if (self == nullptr) return;
-      self->throwIfInvalid();
-      if (self->analyticsReporter_ != nullptr) {
-        self->analyticsReporter_->reportEvent(
-            PersistentKeyValueStoreEventBuilder(PersistentKeyValueStoreEvent::Hit::Found, self->name_, key).get());
-      }
-      const std::lock_guard<std::mutex> lock(self->mutex_);
-      self->purgingIfDamaged([&] { self->getManifest()->updateLastAccessDate(key); });
-    });
-  });
+  dispatchWork(
+      Keys(key), *promise,
+      [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_, key, promise] {
+        settle(*promise, [&] {
+          const auto self = weakThis.lock();
+          if (self == nullptr) return;
+          self->throwIfInvalid();
+          if (self->analyticsReporter_ != nullptr) {
+            self->analyticsReporter_->reportEvent(
+                PersistentKeyValueStoreEventBuilder(PersistentKeyValueStoreEvent::Hit::Found, self->name_, key).get());
+          }
+          const std::lock_guard<std::mutex> lock(self->mutex_);
+          self->purgingIfDamaged([&] { self->getManifest()->updateLastAccessDate(key); });
+        });
+      });
   return future;
 }
 
@@ -732,14 +737,14 @@ void PersistentKeyValueStore::reportAccess(const DiskCacheItem* item, const std:
 Future<void> PersistentKeyValueStore::removeItem(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  dispatchWork(Keys(key), *promise, [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_, key,
-                                     promise] {
-    if (const auto self = weakThis.lock()) {
-      self->remove(key, promise);
-    } else {
-      promise->setValue();
-    }
-  });
+  dispatchWork(Keys(key), *promise,
+               [weakThis = weak_from_this<PersistentKeyValueStore>(), operation = operation_, key, promise] {
+                 if (const auto self = weakThis.lock()) {
+                   self->remove(key, promise);
+                 } else {
+                   promise->setValue();
+                 }
+               });
   return future;
 }
 
@@ -942,13 +947,13 @@ void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<Di
 Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>& paths) {
   try {
     throwIfInvalid();
-    auto deleted = dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), deletion = fileDeletion_,
-                                                   paths] {
-      const auto self = weakThis.lock();
-      if (self == nullptr) return;
-      self->throwIfClosed();
-      self->deleteFiles(paths);
-    });
+    auto deleted = dispatchTask<void>(
+        fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), deletion = fileDeletion_, paths] {
+          const auto self = weakThis.lock();
+          if (self == nullptr) return;
+          self->throwIfClosed();
+          self->deleteFiles(paths);
+        });
     const std::lock_guard<std::mutex> lock(mutex_);  // not before: a queue may run the task at once
     lastFileWrite_.reset();
     return deleted;

@@ -116,8 +116,8 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   void invalidate();
 
   // Leaves all stores to whoever else holds them and hands out no more, without touching their data: the manager's
-  // handle was released. Each store finishes what it has accepted before it is destroyed. A store's size callback keeps the manager, so the two would keep each other for ever. What is held
-  // is measured and pruned as before.
+  // handle was released. Each store finishes what it has accepted before it is destroyed. A store's size callback keeps
+  // the manager, so the two would keep each other for ever. What is held is measured and pruned as before.
   void close();
 
   bool isValid();

@@ -17,9 +17,10 @@ struct SettledValue {
   std::unique_ptr<DiskCacheItem> record;
   std::vector<unsigned char> inlineData{};  // of a record that has some
   bool isUnknown = false;                   // the manifest did not tell: what lies in the key's place is the value
+  bool isReplaced = false;                  // by the record of a write that was dropped since
   bool hasStrayFile = false;  // a file may lie in the key's place that has no record any more: to be deleted
 
-  static SettledValue lost() { return {nullptr, {}, false, true}; }
+  static SettledValue lost() { return {nullptr, {}, false, false, true}; }
   bool isPlainMiss() const { return record == nullptr && !isUnknown && !hasStrayFile; }
 };
 
@@ -53,7 +54,7 @@ class WritesInFlight {
     return write.isRunning;
   }
 
-  // The write has come about, or was revoked. True when another write of its key is in flight.
+  // The write has come about. True when another write of its key is in flight.
   bool end(const std::shared_ptr<Write>& write) {
     const std::lock_guard<std::mutex> lock(mutex_);
     if (!erase(write)) return false;
@@ -68,11 +69,15 @@ class WritesInFlight {
     if (writes_.count(key) > 0) settled_[key] = std::move(settled);
   }
 
-  // The write will not come about. What its key goes back to; empty when that is not due, because another write of the
-  // key is in flight or this one is over.
+  // The write will not come about, or was revoked. What its key goes back to; empty when that is not due, because
+  // another write of the key is in flight or this one is over.
   std::optional<SettledValue> drop(const std::shared_ptr<Write>& write) {
     const std::lock_guard<std::mutex> lock(mutex_);
-    if (!erase(write) || writes_.count(write->key) > 0) return std::nullopt;
+    if (!erase(write)) return std::nullopt;
+    if (writes_.count(write->key) > 0) {
+      settled_[write->key].isReplaced = true;
+      return std::nullopt;
+    }
     const auto settled = settled_.find(write->key);
     if (settled == settled_.end()) return SettledValue();
     SettledValue result = std::move(settled->second);

@@ -135,6 +135,22 @@ TEST_F(PersistentKeyValueStoreClosing, RefusedOverwriteBetweenTwoOthersLeavesThe
   EXPECT_EQ(get("key"), "newer value");
 }
 
+TEST_F(PersistentKeyValueStoreClosing, RefusedWriteBehindAFirstWriteLeavesItItsValue) {
+  open();
+  const Written first = watch(store->store("key", bytesOf("first")));
+  ASSERT_TRUE(work().runNext());
+  file().throwOnDispatch(true);
+  const Written refused = watch(store->store("key", bytesOf("refused")));
+  work().runAll();
+  ASSERT_TRUE(file().runNext());
+  file().throwOnDispatch(false);
+  settle();
+  EXPECT_EQ(told(first), "<done>");
+  EXPECT_EQ(told(refused), "<error> The queue takes no tasks.");
+  EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 0 1000000 1000000 -"));
+  EXPECT_EQ(get("key"), "first");
+}
+
 TEST_F(PersistentKeyValueStoreClosing, TheTotalIsThatOfTheRestoredRecords) {
   open();
   put("key", "old");

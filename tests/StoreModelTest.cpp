@@ -607,9 +607,10 @@ class SettledSequence {
     items_.erase(key);
   }
 
-  // Writes whose writer is never called: the file queue refuses or drops its task, or the store goes before.
+  // Writes whose writer is never called: the file queue refuses or drops its task, or the store is released before.
+  // Where the second of them would evict another item, none is tried.
   void storeInVain(const std::string& key) {
-    if (setup_.inlineData || (setup_.capacity && items_.size() >= *setup_.capacity)) return;
+    if (setup_.inlineData || (setup_.capacity && items_.size() + 1 >= *setup_.capacity)) return;
     const unsigned int kind = script_.below(3);
     script_.say("store " + key + " in vain, in way " + std::to_string(kind));
     ManualExecutor& files = session_->queue(Session::kFileQueue);
