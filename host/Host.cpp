@@ -219,9 +219,14 @@ std::shared_ptr<Store> Host::getStore(const std::string& identifier, const std::
 std::shared_ptr<StoreManager> Host::managerIn(const Request& request, const std::optional<std::string>& sessionKey) {
   const std::string session = request.definition->sessionScoped ? openSession(sessionKey) : "";
   Slot& slot = request.slot();
-  const std::lock_guard<std::mutex> lock(slot.mutex);
-  if (slot.manager == nullptr) slot.manager = build(*request.definition, session);
-  return slot.manager;
+  std::unique_lock<std::mutex> lock(slot.mutex);
+  if (slot.manager != nullptr) return slot.manager;
+  auto manager = build(*request.definition, session);
+  slot.manager = manager;
+  lock.unlock();
+  // It has registered the directories of its unmanaged stores; measuring them is nobody else's task.
+  lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
+  return manager;
 }
 
 // By a factory of its own: one that has failed to build a manager never builds it again.
@@ -230,8 +235,6 @@ std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definiti
                               lazyWork_, locations_, nameBuilders_, taskQueueFactory_, trash_, sessionTagMapper_);
   auto manager = factory.managerForIdentifier(definition.name, sessionKey, runMaintenance_);
   manager->retryFailedCreations();
-  // It has registered the directories of its unmanaged stores; measuring them is nobody else's task.
-  lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
   return manager;
 }
 

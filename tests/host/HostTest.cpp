@@ -9,6 +9,7 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <future>
 #include <memory>
 #include <mutex>
@@ -79,6 +80,18 @@ const char* const kConfigurationOfValues = R"({
 // A store type that no configuration has.
 class OtherStore : public Store {
   using Store::Store;
+};
+
+class CallingSink : public XAnalytics {
+ public:
+  explicit CallingSink(std::function<void()> call) : call_(std::move(call)) {}
+  void logEvent(const std::string& /*name*/, const std::string& /*category*/, const std::string& /*payload*/,
+                const std::string& /*time*/) override {
+    call_();
+  }
+
+ private:
+  const std::function<void()> call_;
 };
 
 class HostTest : public testing::Test {
@@ -1043,6 +1056,24 @@ TEST_F(HostTest, ManagersThatAreBuiltAfterTheLazyWorkAreMeasuredToo) {
   host.manager("archive");
   queues->runAll();
   EXPECT_EQ(host.sizes()->fetchDirectorySize(directory.file("documents/_store_/files_v1")), 7);
+}
+
+// The queue measures on the thread that builds the manager.
+TEST_F(HostTest, ASinkMayAskForTheManagerWhoseMeasuringItHearsOf) {
+  const Watchdog watchdog(kLongEnough);
+  start()->store<UnmanagedStore>("thumbs");
+  const auto queues = std::make_shared<ManualQueueFactory>();
+  int answers = 0;
+  std::unique_ptr<Host> host;
+  HostOptions observed = optionsWith(nullptr, queues);
+  observed.analytics = std::make_unique<CallingSink>([&] {
+    if (host->manager("media")->isValid()) ++answers;
+  });
+  host = std::make_unique<Host>(std::move(observed));
+  for (const auto& queue : queues->all()) queue->onDispatch = [&queue = *queue] { queue.runAll(); };
+  host->lazyWork()->dispatchNow();
+  host->manager("media");
+  EXPECT_GT(answers, 0);
 }
 
 TEST_F(HostTest, ReportsGoToTheSink) {
