@@ -342,9 +342,11 @@ bool Host::discardIn(const std::string& area, const std::string& name) {
   return attempts > 0;
 }
 
+// Listing says when the area cannot be read, but not on every file system what is a directory.
 bool Host::holds(const std::string& area, const std::string& name) const {
   const auto names = directoriesIn(area);
-  return std::find(names.begin(), names.end(), name) != names.end();
+  return std::find(names.begin(), names.end(), name) != names.end() ||
+         fileUtils_->pathExists(fileUtils_->combinePath(area, name));
 }
 
 std::vector<StoredSession> Host::sessions() const {
@@ -356,6 +358,7 @@ std::vector<StoredSession> Host::sessions() const {
     for (const std::string& name : names->filterStoreManagerNames({}, directories)) tags.insert(name.substr(prefix));
   }
   std::vector<StoredSession> sessions;
+  sessions.reserve(tags.size());
   for (const std::string& tag : tags) sessions.push_back({tag, keyOf(tag)});
   return sessions;
 }

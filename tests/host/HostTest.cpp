@@ -82,6 +82,12 @@ class OtherStore : public Store {
   using Store::Store;
 };
 
+// As on a file system that leaves the types of a directory's entries open: they are left out of the list.
+class FilesOfUnknownTypes : public FileUtils {
+ public:
+  std::vector<Info> listDirectory(const std::string& /*path*/) override { return {}; }
+};
+
 class CallingSink : public XAnalytics {
  public:
   explicit CallingSink(std::function<void()> call) : call_(std::move(call)) {}
@@ -772,6 +778,14 @@ TEST_F(HostTest, ALinkInTheDirectorysPlaceIsASessionToo) {
   EXPECT_TRUE(host->logOut("alice"));
   EXPECT_TRUE(host->sessions().empty());
   EXPECT_EQ(directory.read("elsewhere/letters_v1/letter"), "kept");
+}
+
+TEST_F(HostTest, ASessionIsLoggedOutWhereListingsDoNotTellWhatIsADirectory) {
+  leaveSession("alice");
+  Host host(optionsWith(std::make_shared<FilesOfUnknownTypes>()));
+  EXPECT_TRUE(host.logOut("alice"));
+  EXPECT_TRUE(directory.names("caches").empty());
+  EXPECT_TRUE(directory.names("documents").empty());
 }
 
 TEST_F(HostTest, WhatCannotBeDiscardedIsSaidAndTheRestIsDiscarded) {
