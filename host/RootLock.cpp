@@ -34,6 +34,11 @@ constexpr std::chrono::milliseconds kBetweenLooks(1);
   fail(path, error, std::generic_category().message(error));
 }
 
+[[noreturn]] void throwInUse(const std::string& root, pid_t owner) {
+  const std::string who = owner == 0 ? "another process" : "process " + std::to_string(owner);
+  throw FileUtilsIoException(EWOULDBLOCK, "Root '" + root + "' is in use by " + who + ".");
+}
+
 std::string inDirectory(const std::string& directory, const std::string& name) {
   return directory.empty() || directory.back() == '/' ? directory + name : directory + "/" + name;
 }
@@ -101,12 +106,8 @@ RootLock::RootLock(const std::string& root)
   file_->requireRegular();
   for (int look = 1; !file_->tryLock(); ++look) {
     const pid_t owner = file_->livingOwner();
-    if (owner == 0 && look < kLooks) {
-      std::this_thread::sleep_for(kBetweenLooks);
-      continue;
-    }
-    const std::string who = owner == 0 ? "another process" : "process " + std::to_string(owner);
-    throw FileUtilsIoException(EWOULDBLOCK, "Root '" + root + "' is in use by " + who + ".");
+    if (owner != 0 || look == kLooks) throwInUse(root, owner);
+    std::this_thread::sleep_for(kBetweenLooks);
   }
   file_->writeOwner(std::to_string(owner_) + "\n");
 }
