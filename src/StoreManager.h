@@ -74,7 +74,8 @@ class CELLAR_EXPORT StoreManager {
   void trashStoreOnStartup(const std::string& identifier);
 
   // Invalidates all stores and discards the manager's directory with all its data. Waits until the stores have finished
-  // what they were writing: must not be called on one of their queues. A second call does nothing.
+  // what they were writing: must not be called on one of their queues. A second call does nothing but wait until the
+  // first is over; made from within the first, on its thread, it returns at once.
   void invalidate();
 
   bool isValid();

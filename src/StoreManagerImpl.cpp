@@ -98,6 +98,7 @@ std::string StoreManagerImpl::getStorePath(std::shared_ptr<const StoreDefinition
 }
 
 void StoreManagerImpl::invalidate() {
+  if (common_.isInvalidatingHere()) return;
   common_.invalidate();
   // No other thread's clean-up is under way any more when this returns.
   const std::lock_guard<std::recursive_mutex> lock(cleanupMutex_);

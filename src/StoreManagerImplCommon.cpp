@@ -189,14 +189,39 @@ void StoreManagerImplCommon::trashDirectories(const std::string& parent, const s
   }
 }
 
+// An invalidation under way. Its end, however it comes, wakes whoever waits for it.
+class StoreManagerImplCommon::Invalidation {
+ public:
+  explicit Invalidation(StoreManagerImplCommon& manager) : manager_(manager) {}
+  ~Invalidation() {
+    const std::lock_guard<std::mutex> lock(manager_.mutex_);
+    manager_.invalidatingThread_ = std::thread::id();
+    manager_.invalidation_.notify_all();
+  }
+  Invalidation(const Invalidation&) = delete;
+  Invalidation& operator=(const Invalidation&) = delete;
+
+ private:
+  StoreManagerImplCommon& manager_;
+};
+
 void StoreManagerImplCommon::invalidate() {
+  if (isInvalidatingHere()) return;
   StoreMap slots;
   {
-    const std::lock_guard<std::mutex> lock(mutex_);
+    std::unique_lock<std::mutex> lock(mutex_);
+    invalidation_.wait(lock, [this] { return invalidatingThread_ == std::thread::id(); });
     if (invalid_) return;
     invalid_ = true;
+    invalidatingThread_ = std::this_thread::get_id();
     slots.swap(stores_);
   }
+  const Invalidation invalidation(*this);
+  discard(std::move(slots));
+}
+
+// Also releases the stores, before the invalidation is over: their directory may be somebody else's after it.
+void StoreManagerImplCommon::discard(StoreMap slots) {
   std::vector<std::shared_ptr<Store>> stores;
   for (const auto& [identifier, item] : slots) {
     const std::lock_guard<std::mutex> lock(item->mutex);
@@ -211,6 +236,11 @@ void StoreManagerImplCommon::invalidate() {
     }
   }
   trashCollector_->collectPath(managerPath_);
+}
+
+bool StoreManagerImplCommon::isInvalidatingHere() {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  return invalidatingThread_ == std::this_thread::get_id();
 }
 
 void StoreManagerImplCommon::close() {

@@ -6,6 +6,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <thread>
 #include <unordered_map>
 #include <vector>
 
@@ -112,8 +113,12 @@ class CELLAR_EXPORT StoreManagerImplCommon {
                         const std::vector<std::string>& keep);
 
   // Invalidates all stores and moves the manager's directory with all its data to the trash. Waits until the stores
-  // have finished what they were writing, so it must not be called on one of their queues. A second call does nothing.
+  // have finished what they were writing, so it must not be called on one of their queues. A second call does nothing
+  // but wait until the first is over; made from within the first, on its thread, it returns at once.
   void invalidate();
+
+  // Whether this thread is in the midst of `invalidate`.
+  bool isInvalidatingHere();
 
   // Leaves all stores to whoever else holds them and hands out no more, without touching their data: the manager's
   // handle was released. Each store finishes what it has accepted before it is destroyed. A store's size callback keeps
@@ -131,6 +136,9 @@ class CELLAR_EXPORT StoreManagerImplCommon {
  private:
   using StoreMap = std::unordered_map<std::string, std::shared_ptr<Item>>;
 
+  class Invalidation;
+
+  void discard(StoreMap slots);
   static void abandon(Item& item);
   static void noteFailure(Item& item);
   static std::shared_ptr<Store> leaveToOthers(Item& item);
@@ -147,11 +155,13 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   const std::string managerPath_;
   const std::string temporaryDirectoryPath_;
 
-  std::mutex mutex_;  // guards the four below
+  std::mutex mutex_;  // guards all below
   StoreMap stores_;   // by identifier; emptied by invalidation, which parts manager and stores
   bool invalid_ = false;
   bool closed_ = false;
   bool retriesFailedCreations_ = false;
+  std::thread::id invalidatingThread_;    // while an invalidation is under way
+  std::condition_variable invalidation_;  // signalled when it is over
 };
 
 }  // namespace velmora::mobile::xplat::cellar

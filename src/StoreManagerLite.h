@@ -31,7 +31,8 @@ class CELLAR_EXPORT StoreManagerLite {
   // need queues.
   std::shared_ptr<Store> getStoreImpl(const std::string& identifier);
 
-  // Discards the manager's directory with all its data. A second call does nothing.
+  // Discards the manager's directory with all its data. A second call does nothing but wait until the first is over;
+  // made from within the first, on its thread, it returns at once.
   void invalidate();
 
   bool isValid();

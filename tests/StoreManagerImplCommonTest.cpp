@@ -20,6 +20,7 @@
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -84,6 +85,8 @@ class StoreManagerImplCommonTest : public testing::Test, protected test::Manager
   std::unique_ptr<Common> common_;
   test::LogCapture log_;
 };
+
+class StoreManagerImplCommonInvalidation : public StoreManagerImplCommonTest {};
 
 // Construction
 
@@ -519,6 +522,73 @@ TEST_F(StoreManagerImplCommonTest, OfManyThreadsThatInvalidateOneDoes) {
   EXPECT_EQ((*stores)["a"]->invalidations(), 1U);
 }
 
+TEST_F(StoreManagerImplCommonInvalidation, ASecondOneWaitsForTheFirstSoThatTheNextManagerKeepsItsFiles) {
+  build({{"a", fake("a")}});
+  get("a");
+  Latch collecting(1);
+  Latch release(1);
+  trash->onCollect = [&](const string& path) {
+    if (path != managerPath()) return;
+    collecting.countDown();
+    release.wait();
+  };
+  Latch started(1);
+  std::atomic<bool> returned{false};
+  std::thread first([&] { common_->invalidate(); });
+  collecting.wait();
+  std::thread second([&] {
+    started.countDown();
+    common_->invalidate();
+    directory.write(inManager("a_250_v1/value"), "of the next session");
+    returned = true;
+  });
+  started.wait();
+  for (int i = 0; i < 10000 && !returned; ++i) std::this_thread::yield();
+  EXPECT_FALSE(returned);
+  release.countDown();
+  first.join();
+  second.join();
+  EXPECT_EQ(directory.read(inManager("a_250_v1/value")), "of the next session");
+}
+
+TEST_F(StoreManagerImplCommonInvalidation, IsNotOverBeforeTheStoresAreReleased) {
+  build({{"a", fake("a")}});
+  get("a");
+  bool isInvalidating = false;
+  const auto look = [&](void*) { isInvalidating = common_->isInvalidatingHere(); };
+  (*stores)["a"]->onInvalidate = [atRelease = std::shared_ptr<void>(nullptr, look)] {};
+  common_->invalidate();
+  EXPECT_TRUE(isInvalidating);
+}
+
+TEST_F(StoreManagerImplCommonInvalidation, AnotherOneFromWithinItReturnsAtOnce) {
+  const test::Watchdog watchdog(60);
+  int calls = 0;
+  const auto invalidateAgain = [&] {
+    common_->invalidate();
+    ++calls;
+  };
+  stores->onCreated = [&](const string&, FakeStore& store) { store.onInvalidate = invalidateAgain; };
+  trash->onCollect = [&](const string&) { invalidateAgain(); };
+  build({{"a", fake("a")}, {"b", fake("b")}});
+  get("a");
+  get("b");
+  EXPECT_FALSE(common_->isInvalidatingHere());
+  common_->invalidate();
+  EXPECT_EQ(calls, 3);
+  EXPECT_FALSE(common_->isInvalidatingHere());
+  EXPECT_EQ(trash->collected().size(), 1U);
+}
+
+TEST_F(StoreManagerImplCommonInvalidation, ThatIsLeftByAnExceptionLetsOthersGo) {
+  const test::Watchdog watchdog(60);
+  build({});
+  trash->onCollect = [](const string&) { throw std::runtime_error("odd host"); };
+  EXPECT_THROW(common_->invalidate(), std::runtime_error);
+  std::thread([&] { common_->invalidate(); }).join();
+  EXPECT_FALSE(common_->isValid());
+}
+
 TEST_F(StoreManagerImplCommonTest, ADirectoryThatCannotBeTrashedLeavesTheManagerInvalidAllTheSame) {
   build({});
   trash->refuses = true;
@@ -556,7 +626,6 @@ TEST_F(StoreManagerImplCommonTest, AStoreThatWaitsForAnotherThreadToUseTheManage
       EXPECT_TRUE(common_->copyStoreMap().empty());
       const std::lock_guard<std::mutex> lockA(itemA->mutex);
       const std::lock_guard<std::mutex> lockB(itemB->mutex);
-      common_->invalidate();
       used = true;
     }).join();
   };

@@ -23,6 +23,7 @@
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 #include "support/TestClock.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -906,6 +907,29 @@ TEST_F(StoreManagerImplTest, InvalidatingFromWithinTheCleanUpDoesNotWaitForItsel
   settle();
   trash->onCollect = nullptr;
   EXPECT_FALSE(manager_->isValid());
+}
+
+TEST_F(StoreManagerImplTest, InvalidatingFromWithinAnInvalidationDoesNotWaitForACleanUp) {
+  const test::Watchdog watchdog(60);
+  build(manager({{"a", fake("a")}}));
+  get("a");
+  test::Latch cleaning(1);
+  test::Latch release(1);
+  files->onCall = [&](Operation operation, const string& path) {
+    if (operation != Operation::ListDirectories || path != areaPath()) return;
+    cleaning.countDown();
+    release.wait();
+  };
+  (*stores)["a"]->onInvalidate = [&] {
+    manager_->invalidate();
+    release.countDown();
+  };
+  manager_->startCleanup();
+  std::thread cleaner([&] { settle(); });
+  cleaning.wait();
+  manager_->invalidate();
+  cleaner.join();
+  EXPECT_TRUE(release.isOpen());
 }
 
 TEST_F(StoreManagerImplTest, AMeasuredSizeKeepsTheManagerAliveUntilItIsCounted) {
