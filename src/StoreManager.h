@@ -35,11 +35,11 @@ std::shared_ptr<StoreType> storeAs(const std::string& identifier, const std::sha
 // way: a store that is still held works on, and is measured and pruned.
 class CELLAR_EXPORT StoreManager {
  public:
-  // Builds the manager and starts it. With `runMaintenance` it is cleansed first if that is forced or necessary, and
-  // what other versions and sessions left behind is cleaned up in the background, and stores are pruned. Always:
-  // unmanaged stores are registered for measuring, and the configured stores are created in the background when the
-  // lazy dispatcher says so. Throws what creating the manager's directories throws. `analyticsReporter` and
-  // `lazyDispatcher` may be null.
+  // Builds the manager and starts it. With `runMaintenance` all its data, in any area, is discarded first if that is
+  // forced, or (with an error line) if the file system has less than 75 MiB in total; what other versions and sessions
+  // left behind is cleaned up in the background, and stores are pruned. Always: unmanaged stores are registered for
+  // measuring, and the configured stores are created in the background when the lazy dispatcher says so. Throws what
+  // creating the manager's directories throws. `analyticsReporter` and `lazyDispatcher` may be null.
   StoreManager(const std::string& parentPath, const StoreManagerDefinition& definition, bool forceCleanse,
                const std::shared_ptr<StoreDirectoryNameBuilder>& nameBuilder,
                const std::shared_ptr<TrashCollector>& trashCollector,

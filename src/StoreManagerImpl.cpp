@@ -110,14 +110,23 @@ bool StoreManagerImpl::isValid() { return common_.isValid(); }
 
 void StoreManagerImpl::cleanseIfNecessary(bool force) {
   if (!fileUtils_->pathExists(common_.managerPath())) return;
-  bool cleanse = force;
+  const bool isTooSmall = isFileSystemTooSmall();
+  if (force || isTooSmall) common_.trashDirectories(common_.parentPath(), {common_.managerDirectoryName()}, {});
+}
+
+// Logs it: what is discarded for it may be the only copy.
+bool StoreManagerImpl::isFileSystemTooSmall() {
+  const std::string& path = common_.managerPath();
   try {
-    const std::int64_t diskSpace = fileUtils_->getDiskSpace(common_.managerPath()).total;
-    cleanse = cleanse || diskSpace < kCleanseMinimumFreeSizeTrash;
+    const std::int64_t size = fileUtils_->getDiskSpace(path).total;
+    if (size >= kCleanseMinimumFreeSizeTrash) return false;
+    LOG(ERROR) << "Discarding manager directory \"" << path << "\": its file system of " << size
+               << " bytes is smaller than the limit of " << kCleanseMinimumFreeSizeTrash << " bytes.";
+    return true;
   } catch (const LarderException& error) {
     LOG(ERROR) << "Could not read disk space: " << error.what();
+    return false;
   }
-  if (cleanse) common_.trashDirectories(common_.parentPath(), {common_.managerDirectoryName()}, {});
 }
 
 void StoreManagerImpl::startCleanup() {

@@ -67,7 +67,9 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   bool isValid();
 
   // Moves the manager's whole directory to the trash when forced, or when the file system is smaller than
-  // `kCleanseMinimumFreeSizeTrash`. It takes the temporary directory along until something creates it again.
+  // `kCleanseMinimumFreeSizeTrash`: all data in any area, documents too, at each start, with an error line that names
+  // directory, size and limit. So no data lasts on such a file system. The temporary directory is also removed, until
+  // something creates it again.
   void cleanseIfNecessary(bool force);
 
   // Cleans up what other versions and sessions left behind, on the manager's queue.
@@ -105,6 +107,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
                                 const std::shared_ptr<const StoreDefinition>& definition);
   void createAllStores();
   std::vector<PruneRequest> beginPruneRound();
+  bool isFileSystemTooSmall();
   bool isInSurvivalMode();
   void noteIfRoundIsOver();
   void startPruning(const PruneRequest& request);

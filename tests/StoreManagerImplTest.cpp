@@ -1015,6 +1015,7 @@ TEST_F(StoreManagerImplTest, AForcedCleanseTrashesTheManagersDirectory) {
   manager_->cleanseIfNecessary(true);
   EXPECT_EQ(trash->collected(), Texts{managerPath()});
   EXPECT_EQ(directory.names("area"), Texts{"_store_2"});
+  EXPECT_TRUE(log_.messages().empty());
 }
 
 TEST_F(StoreManagerImplTest, ADiskBelowSeventyFiveMebibytesIsCleansed) {
@@ -1022,6 +1023,10 @@ TEST_F(StoreManagerImplTest, ADiskBelowSeventyFiveMebibytesIsCleansed) {
   files->total = 78643199;
   manager_->cleanseIfNecessary(false);
   EXPECT_EQ(trash->collected(), Texts{managerPath()});
+  EXPECT_EQ(log_.messages(),
+            Texts{"Discarding manager directory \"" + managerPath() +
+                  "\": its file system of 78643199 bytes is smaller than the limit of 78643200 bytes."});
+  EXPECT_EQ(log_.errorCount(), 1U);
 }
 
 TEST_F(StoreManagerImplTest, ADiskOfSeventyFiveMebibytesIsNotCleansedHoweverFull) {
@@ -1030,6 +1035,7 @@ TEST_F(StoreManagerImplTest, ADiskOfSeventyFiveMebibytesIsNotCleansedHoweverFull
   files->available = 0;
   manager_->cleanseIfNecessary(false);
   EXPECT_TRUE(trash->collected().empty());
+  EXPECT_TRUE(log_.messages().empty());
 }
 
 TEST_F(StoreManagerImplTest, AVeryLargeDiskIsNotCleansed) {
