@@ -83,6 +83,7 @@ std::shared_ptr<StoreManager> StoreManagerFactory::managerForStoreIdentifier(con
 }
 
 void StoreManagerFactory::invalidate() {
+  const std::lock_guard<std::recursive_mutex> invalidation(invalidationMutex_);
   decltype(managers_) managers;
   {
     const std::lock_guard<std::mutex> lock(mutex_);

@@ -69,9 +69,9 @@ class CELLAR_EXPORT StoreManagerFactory : public session::Invalidatable {
   std::shared_ptr<StoreManager> managerForStoreIdentifier(const std::string& storeIdentifier);
 
   // Invalidates every manager built so far, discarding all its data, and forgets them: the next request builds a new
-  // one. Waits for managers still being built and for what their stores are writing; must not be called on one of their
-  // queues. Managers that could not be had are skipped, but one whose building threw makes this throw
-  // `std::future_error` (broken promise), and the managers after it stay valid.
+  // one. Waits for managers still being built, for what their stores are writing and for an invalidation by another
+  // thread; must not be called on one of their queues. Managers that could not be had are skipped, but one whose
+  // building threw makes this throw `std::future_error` (broken promise), and the managers after it stay valid.
   void invalidate() override;
 
  private:
@@ -90,6 +90,8 @@ class CELLAR_EXPORT StoreManagerFactory : public session::Invalidatable {
   const std::shared_ptr<TrashCollector> trashCollector_;
   const std::function<std::string(const std::string&)> sessionTagMapper_;
   const bool servesSessionScoped_;
+
+  std::recursive_mutex invalidationMutex_;  // held by an invalidation, within which another may begin
 
   std::mutex mutex_;
   std::unordered_map<std::string, std::shared_future<std::shared_ptr<StoreManager>>> managers_;  // guarded by mutex_

@@ -23,6 +23,7 @@
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -550,6 +551,45 @@ TEST_F(StoreManagerFactoryTest, InvalidatingWaitsForAManagerThatIsBeingBuilt) {
   EXPECT_TRUE(waited);
   ASSERT_NE(manager, nullptr);
   EXPECT_FALSE(manager->isValid());
+}
+
+TEST_F(StoreManagerFactoryTest, ASecondInvalidationWaitsForTheFirst) {
+  define("media", {{"s", fake("s")}});
+  Latch invalidating(1);
+  Latch release(1);
+  Latch started(1);
+  std::atomic<bool> returned{false};
+  build();
+  get("media")->getStore<FakeStore>("s")->onInvalidate = [&] {
+    invalidating.countDown();
+    release.wait();
+  };
+  std::thread first([&] { factory_->invalidate(); });
+  invalidating.wait();
+  std::thread second([&] {
+    started.countDown();
+    factory_->invalidate();
+    returned = true;
+  });
+  started.wait();
+  for (int i = 0; i < 10000 && !returned; ++i) std::this_thread::yield();
+  EXPECT_FALSE(returned);
+  release.countDown();
+  first.join();
+  second.join();
+}
+
+TEST_F(StoreManagerFactoryTest, AnInvalidationFromWithinAnotherReturns) {
+  const test::Watchdog watchdog(60);
+  define("media", {{"s", fake("s")}});
+  build();
+  bool returned = false;
+  get("media")->getStore<FakeStore>("s")->onInvalidate = [&] {
+    factory_->invalidate();
+    returned = true;
+  };
+  factory_->invalidate();
+  EXPECT_TRUE(returned);
 }
 
 TEST_F(StoreManagerFactoryTest, NoLockIsHeldWhileManagersAreInvalidated) {
