@@ -155,7 +155,7 @@ TEST_F(AttributeStoreTest, ADirectoryInThePlaceOfTheFileIsAFailureOfAccess) {
 }
 
 TEST_F(AttributeStoreTest, AFifoInThePlaceOfTheFileIsAFailureOfAccessAndHoldsNobodyUp) {
-  const test::Watchdog watchdog(10);
+  const test::Watchdog watchdog(60);
   ASSERT_EQ(mkfifo(directory_.file(kFileName).c_str(), 0600), 0);
   EXPECT_EQ(store_.get(directory_.path()), JsonValue::object());
   EXPECT_EQ(log_.messages().back(),

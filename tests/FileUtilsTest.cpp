@@ -364,7 +364,7 @@ TEST_F(FileUtilsTest, AFileThatCannotSeekToItsEndIsReported) {
 }
 
 TEST_F(FileUtilsTest, APipeCannotBeReadAsAFile) {
-  const test::Watchdog watchdog(10);
+  const test::Watchdog watchdog(60);
   const string path = makeFifo("fifo");
   expectSystemFailure([&] { files_.readFile(path); }, ESPIPE, "Could not seek to end of file");
   expectSystemFailure([&] { files_.readFile(link("link", "fifo")); }, ESPIPE, "Could not seek to end of file");
@@ -375,7 +375,7 @@ TEST_F(FileUtilsTest, APipeCannotBeReadAsAFile) {
 }
 
 TEST_F(FileUtilsTest, APipeCannotBeWrittenAsAFile) {
-  const test::Watchdog watchdog(10);
+  const test::Watchdog watchdog(60);
   const string path = makeFifo("fifo");
   expectSystemFailure([&] { files_.writeFile(path, bytes("x")); }, ENXIO, "Could not open file");
   expectSystemFailure([&] { files_.writeFile(link("link", "fifo"), {}); }, ENXIO, "Could not open file");

@@ -267,7 +267,7 @@ TEST_F(StoringAValue, CopiesTheBytesAtTheCall) {
 }
 
 TEST_F(StoringAValue, WhereAFifoLiesFailsAndLeavesAMiss) {
-  const test::Watchdog watchdog(10);
+  const test::Watchdog watchdog(60);
   open();
   ASSERT_EQ(mkfifo(pathOf("key").c_str(), 0600), 0);
   const Written written = watch(store->store("key", bytesOf("value")));
@@ -518,7 +518,7 @@ TEST_F(FetchingAValue, WhoseFileVanishedBehindTheStoreIsTheErrorOfReading) {
 }
 
 TEST_F(FetchingAValue, WhoseFileIsAFifoIsTheErrorOfReadingUntilTheKeyIsRemoved) {
-  const test::Watchdog watchdog(10);
+  const test::Watchdog watchdog(60);
   open();
   put("key", "value");
   std::filesystem::remove(pathOf("key"));

@@ -241,7 +241,7 @@ TEST_F(Inspecting, GoesOnBesideADamagedManifest) {
 }
 
 TEST_F(Inspecting, WaitsForNoFifoInThePlaceOfAttributesOrALog) {
-  const test::Watchdog watchdog(20);
+  const test::Watchdog watchdog(60);
   makeRoot();
   ASSERT_EQ(mkfifo(data_.path(kWeb + "/_cellar_extended_attributes").c_str(), 0600), 0);
   EXPECT_EQ(storeIn(look(), kWeb).recordedBytes, std::nullopt);
