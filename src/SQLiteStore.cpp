@@ -2,6 +2,7 @@
 
 #include <glog/logging.h>
 #include <sqlite3.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <array>
@@ -44,6 +45,50 @@ std::string fileOf(const std::shared_ptr<sqlite3>& database) {
 
 std::string withFile(const std::string& message, const std::shared_ptr<sqlite3>& database) {
   return message + " (" + fileOf(database) + ")";
+}
+
+bool isPresent(const std::string& path, struct stat& status) { return ::stat(path.c_str(), &status) == 0; }
+
+// Opening or reading it may wait for somebody else, who need not ever come.
+bool isFifoOrDevice(const struct stat& status) { return !S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode); }
+
+std::string cannotOpen(const std::string& path) { return "Cannot open database: '" + path + "'"; }
+
+void throwIfCompanionMayBlock(const std::string& companion, const std::string& path) {
+  struct stat status = {};
+  if (!isPresent(companion, status) || !isFifoOrDevice(status)) return;
+  throwSQLiteException(SQLITE_CANTOPEN, cannotOpen(path) + ": '" + companion + "' is not a regular file");
+}
+
+// The file's name is SQLite's, which has followed links. Beside a database without a byte in it, SQLite removes a log
+// or journal without opening it.
+void throwIfCompanionsMayBlock(const std::shared_ptr<sqlite3>& database, const std::string& path, bool isEmpty) {
+  const std::string file = fileOf(database);
+  if (file.empty()) return;
+  throwIfCompanionMayBlock(file + "-shm", path);
+  if (isEmpty) return;
+  throwIfCompanionMayBlock(file + "-wal", path);
+  throwIfCompanionMayBlock(file + "-journal", path);
+}
+
+// What a file of somebody else may bring along is not run: triggers and views (which may never end), functions with
+// effects, changes of the schema behind SQLite's back.
+void distrustSchema(sqlite3* database) {
+  int* const noAnswer = nullptr;
+  for (const int option :
+       {SQLITE_DBCONFIG_ENABLE_TRIGGER, SQLITE_DBCONFIG_ENABLE_VIEW, SQLITE_DBCONFIG_TRUSTED_SCHEMA}) {
+    sqlite3_db_config(database, option, 0, noAnswer);
+  }
+  sqlite3_db_config(database, SQLITE_DBCONFIG_DEFENSIVE, 1, noAnswer);
+}
+
+// Far more than any statement or table of ours takes.
+void limitStatements(sqlite3* database) {
+  sqlite3_limit(database, SQLITE_LIMIT_SQL_LENGTH, 1'000'000);
+  sqlite3_limit(database, SQLITE_LIMIT_EXPR_DEPTH, 100);
+  sqlite3_limit(database, SQLITE_LIMIT_VDBE_OP, 100'000);
+  sqlite3_limit(database, SQLITE_LIMIT_LIKE_PATTERN_LENGTH, 100);
+  sqlite3_limit(database, SQLITE_LIMIT_ATTACHED, 0);
 }
 
 // SQLite counts bytes in an int and takes a negative number for "up to the first zero byte".
@@ -182,12 +227,17 @@ template <> std::vector<unsigned char> SQLiteStoreCursor::get<std::vector<unsign
 SQLiteStoreColumn::SQLiteStoreColumn(const std::string& name_, const std::string& type_) : name(name_), type(type_) {}
 
 SQLiteStore::SQLiteStore(const std::string& path) : path_(path) {
+  struct stat status = {};
+  if (isPresent(path_, status) && isFifoOrDevice(status)) throwSQLiteException(SQLITE_NOTADB, cannotOpen(path_));
   sqlite3* handle = nullptr;
   const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX;
   const int resultCode = sqlite3_open_v2(path_.c_str(), &handle, flags, nullptr);
   // A failed open hands out a handle too, which has to be closed like any other.
   database_ = std::shared_ptr<sqlite3>(handle, sqlite3_close);
-  throwSQLiteException(resultCode, "Cannot open database: '" + path_ + "'");
+  throwSQLiteException(resultCode, cannotOpen(path_));
+  throwIfCompanionsMayBlock(database_, path_, status.st_size == 0);
+  distrustSchema(handle);
+  limitStatements(handle);
 }
 
 SQLiteStore::~SQLiteStore() = default;

@@ -84,10 +84,15 @@ struct CELLAR_EXPORT SQLiteStoreColumn {
 // gone. The connection has no lock of its own: the store and its cursors are used by one thread at a time. Operations
 // are virtual so that a test or another back end can stand in through a SQLiteStoreFactory. Every operation throws
 // SQLiteStoreException, or SQLiteStoreCorruptedException for a damaged or foreign file.
+//
+// The file may be another program's, so what it brings along is not run: triggers do not fire, views cannot be read,
+// and the schema cannot be written but by CREATE, ALTER and the like. A statement has at most a million bytes, a
+// hundred levels of expressions and a hundred bytes of a pattern for LIKE; no other database can be attached.
 class CELLAR_EXPORT SQLiteStore {
  public:
-  // Opens the database, creating the file (not its directory) when it is missing. Not an error yet: a file that is no
-  // database; the first statement meets that.
+  // Opens the database, creating the file (not its directory) when it is missing. Not an error yet: a file that is not
+  // a database; the first statement meets that. A fifo or device in its place is refused as such a file at once, and
+  // one in the place of its "-wal", "-shm" or "-journal" as one that cannot be opened: neither is ever waited for.
   explicit SQLiteStore(const std::string& path);
   virtual ~SQLiteStore();
 
