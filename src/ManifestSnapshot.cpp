@@ -16,6 +16,7 @@
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
 #include "SQLiteStore.h"
+#include "SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -155,6 +156,7 @@ std::vector<std::string> ManifestSnapshot::damages() const {
   std::vector<std::string> lines;
   try {
     SQLiteStore store(path_);
+    throwIfTableCallsFunctions(store, "LarderManifest");
     SQLiteStoreCursor cursor = store.cursor("PRAGMA integrity_check;");
     while (cursor.next()) lines.push_back(cursor.get<std::string>(0));
     if (lines == std::vector<std::string>{"ok"}) lines.clear();

@@ -9,6 +9,7 @@
 
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
+#include "SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -55,6 +56,7 @@ void checkColumn(const std::vector<SQLiteStoreColumn>& columns, std::size_t posi
 }
 
 void initializeDatabase(SQLiteStore& store) {
+  throwIfTableCallsFunctions(store, tableName);
   store.exec(createTable);
   const auto columns = store.info(tableName);
   for (std::size_t position = 0; position < firstVersionColumns.size(); ++position) {

@@ -16,8 +16,9 @@
 //   +-------------------+---------+------------------------------------------------------------------+
 //
 // The first version of the table ended with last_access_date: opening such a database adds the last column and keeps
-// every row. A table whose columns differ in name, type or order in any other way is foreign and is refused; columns
-// beyond these are left alone.
+// every row. A table whose columns differ in name, type or order in any other way is foreign and is refused, and so is
+// one that calls functions: in a check, a default value, a generated column or an index. Columns beyond these are left
+// alone; triggers and views are not run.
 
 #include <cstdint>
 #include <memory>

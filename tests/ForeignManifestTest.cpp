@@ -13,7 +13,9 @@
 #include <string>
 #include <vector>
 
+#include "FileUtils.h"
 #include "LarderException.h"
+#include "ManifestSnapshot.h"
 #include "SQLiteManifestPersistence.h"
 #include "SQLiteStore.h"
 #include "support/KeyValueStoreFixture.h"
@@ -23,6 +25,7 @@
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
+using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::SizeIs;
 using testing::StartsWith;
@@ -39,6 +42,8 @@ const std::string kColumns =
 const std::string kTable = "CREATE TABLE LarderManifest (" + kColumns + ");";
 const std::string kRow = "INSERT INTO LarderManifest VALUES ('old', 'old', 1, 0, NULL, 1, 1, NULL);";
 const std::string kEndless = "WITH RECURSIVE c(i) AS (SELECT 1 UNION ALL SELECT i + 1 FROM c) SELECT i FROM c";
+// One search of a long text in a longer one, which takes years.
+const std::string kSearch = "instr(zeroblob(900000000), zeroblob(450000000) || x'01')";
 
 std::string endlessTriggers() {
   std::string script = "CREATE TABLE numbers (number);";
@@ -255,6 +260,24 @@ class SQLiteManifestPersistenceOfAnother : public testing::Test {
     return failureOf<ManifestPersistenceException, ManifestCorruptedException>(
         [this] { manifest = std::make_unique<SQLiteManifestPersistence>(path, nullptr, nullptr); });
   }
+  void expectIsForeign(const std::string& script) {
+    fs::remove(path);
+    run(path, script);
+    const Failure failure = failureOfOpening();
+    EXPECT_EQ(failure.description, "Invalid schema.") << script;
+    EXPECT_EQ(failure.code, -1);
+    EXPECT_TRUE(failure.corrupted);
+  }
+  void expectIsOurs(const std::string& script) {
+    fs::remove(path);
+    run(path, script);
+    EXPECT_EQ(failureOfOpening().description, "") << script;
+    if (manifest == nullptr) return;
+    manifest->setItem({"new", "new", 2, false, 2, 2, nullptr});
+    EXPECT_NE(manifest->getItem("new"), nullptr) << script;
+    manifest.reset();
+  }
+
   const test::TemporaryDirectory directory;
   const std::string path = directory.file("manifest_v1.sqlite");
   std::unique_ptr<SQLiteManifestPersistence> manifest;
@@ -295,6 +318,48 @@ TEST_F(SQLiteManifestPersistenceOfAnother, ThatIsAViewIsAPlainError) {
   const Failure failure = failureOfOpening();
   EXPECT_THAT(failure.description, StartsWith("SQLite Error #1: views may not be indexed"));
   EXPECT_FALSE(failure.corrupted);
+}
+
+TEST_F(SQLiteManifestPersistenceOfAnother, ThatCallsFunctionsIsForeign) {
+  const std::string open = "CREATE TABLE LarderManifest (key TEXT, filename TEXT, size INTEGER, ";
+  const std::string rest = "modification_date INTEGER, last_access_date INTEGER, extended_manifest BLOB";
+  expectIsForeign("CREATE TABLE LarderManifest (" + kColumns + ", CHECK (" + kSearch + " IS NULL))");
+  expectIsForeign(open + "has_inline_data BOOLEAN, inline_data BLOB DEFAULT (" + kSearch + "), " + rest + ")");
+  expectIsForeign(open + "has_inline_data BOOLEAN, inline_data BLOB AS (" + kSearch + ") STORED, " + rest + ")");
+  expectIsForeign("CREATE TABLE LarderManifest (" + kColumns + ", CHECK (key GLOB filename))");
+  expectIsForeign("CREATE TABLE larderMANIFEST (" + kColumns + ", CHECK (length(key) > 0))");
+  expectIsForeign(kTable + "CREATE INDEX i ON LarderManifest(" + kSearch + ")");
+  expectIsForeign(kTable + "CREATE INDEX i ON LarderManifest(size) WHERE ifnull(size, 1)");
+}
+
+// The index by access date is made when it is missing, which computes what it holds.
+TEST_F(SQLiteManifestPersistenceOfAnother, ThatCallsFunctionsIsForeignBeforeAnyIsCalled) {
+  expectIsForeign(
+      "CREATE TABLE LarderManifest (key TEXT, filename TEXT, size INTEGER, has_inline_data BOOLEAN, inline_data BLOB, "
+      "modification_date INTEGER, PRIMARY KEY(key)); INSERT INTO LarderManifest (key) VALUES ('a');"
+      "ALTER TABLE LarderManifest ADD last_access_date INTEGER AS (" +
+      kSearch + ") VIRTUAL; ALTER TABLE LarderManifest ADD extended_manifest BLOB");
+}
+
+TEST_F(SQLiteManifestPersistenceOfAnother, ThatCallsNoFunctionsStays) {
+  expectIsOurs("CREATE TABLE LarderManifest (" + kColumns + ", CHECK (size >= 0), CHECK (has_inline_data IN (0, 1)))");
+  expectIsOurs(
+      "CREATE TABLE LarderManifest (key TEXT, filename TEXT, size INTEGER, has_inline_data BOOLEAN, "
+      "inline_data BLOB, modification_date INTEGER, last_access_date INTEGER, extended_manifest BLOB, "
+      "price DECIMAL(10, 2) DEFAULT (1 + 2), note VARCHAR(30) DEFAULT 'f(x)', "
+      "twice INTEGER AS (size + size), PRIMARY KEY(key))");
+  expectIsOurs(kTable + "CREATE INDEX i ON LarderManifest(size, key); CREATE INDEX j ON LarderManifest(size + 1)");
+  expectIsOurs(kTable + "CREATE TABLE other (x CHECK (length(x) > 0)); CREATE INDEX k ON other(lower(x))");
+  expectIsOurs(kTable + "CREATE VIEW v AS SELECT length(key) FROM LarderManifest");
+}
+
+TEST_F(SQLiteManifestPersistenceOfAnother, ThatCallsFunctionsIsDamagedToTheSnapshot) {
+  run(path, "CREATE TABLE LarderManifest (" + kColumns + ", CHECK (" + kSearch + " IS NULL));");
+  run(path, "PRAGMA ignore_check_constraints = ON;" + kRow);
+  const ManifestSnapshot snapshot(directory.path(), directory.makeDirectory("temporary"),
+                                  std::make_shared<FileUtils>());
+  EXPECT_THAT(snapshot.damages(), ElementsAre("Invalid schema."));
+  EXPECT_THROW(snapshot.records(nullptr), ManifestCorruptedException);
 }
 
 // --- A store ---
@@ -351,6 +416,14 @@ TEST_F(PersistentKeyValueStoreOfAnother, WithTriggersThatNeverEndKeepsItsValues)
   reopen();
   EXPECT_EQ(get("key"), "later value");
   EXPECT_EQ(clear(), "<done>");
+}
+
+TEST_F(PersistentKeyValueStoreOfAnother, WithATableThatCallsFunctionsBeginsAgain) {
+  run(manifestPath(), "CREATE INDEX slow ON LarderManifest(size) WHERE size = 1000 AND " + kSearch);
+  openUnloaded();
+  settleAll();
+  put("new", "value");
+  EXPECT_EQ(get("new"), "value");
 }
 
 TEST_F(PersistentKeyValueStoreOfAnother, WithAFifoInPlaceOfItsManifestBeginsAgain) {
