@@ -322,6 +322,7 @@ std::shared_ptr<PersistentKeyValueStore::FileWrite> PersistentKeyValueStore::beg
 // Writes a file, and then its record. To wait for the manifest would cost two switches between threads for each write:
 // while others are busy with it, the files of the next writes are written instead, and then all their records at once.
 void PersistentKeyValueStore::finishFileWrites(const std::shared_ptr<FileWrite>& first) {
+  const Token deletion = fileDeletion_;  // of what a writer that fails, or is revoked, leaves behind
   std::vector<std::shared_ptr<FileWrite>> writes = {first};
   writeFile(*first);
   std::unique_lock<std::mutex> lock(mutex_, std::try_to_lock);
@@ -430,6 +431,7 @@ void PersistentKeyValueStore::reportTotal(FileWrite& write) {
 // Ends a write that has failed or was dropped. When no other write of its key is in flight, the key goes back to what
 // it has without them.
 void PersistentKeyValueStore::rollBack(const FileWrite& write) {
+  const Token deletion = fileDeletion_;
   bool hasStrayFile = false;
   try {
     const std::lock_guard<std::mutex> lock(mutex_);
@@ -791,19 +793,19 @@ void PersistentKeyValueStore::clear(std::function<void()> onSuccess,
 // The next items to be deleted. Pruning to nothing leaves items of no size, and would take what has been stored since
 // the clear began.
 std::vector<DiskCacheItem> PersistentKeyValueStore::takeForClear(const std::shared_ptr<Clear>& clear) {
+  std::vector<DiskCacheItem> items;
   if (!clear->hasBegun) {
     const auto hasEnded = [](const std::weak_ptr<Clear>& other) { return other.expired(); };
     clearsUnderWay_.erase(std::remove_if(clearsUnderWay_.begin(), clearsUnderWay_.end(), hasEnded),
                           clearsUnderWay_.end());
     clearsUnderWay_.push_back(clear);
     clear->hasBegun = true;
-    auto items = cancelWrites();
-    for (DiskCacheItem& item : takeNext(*clear)) items.push_back(std::move(item));
-    // What was removed just before, by a prune say, may have its files still: the file queue has to pass them.
-    if (items.empty() && fileDeletion_.use_count() > 1) items.emplace_back();
-    return items;
+    items = cancelWrites();
   }
-  return takeNext(*clear);
+  for (DiskCacheItem& item : takeNext(*clear)) items.push_back(std::move(item));
+  // What somebody else has removed, a prune say, may have its files still: the file queue has to pass them.
+  if (items.empty() && fileDeletion_.use_count() > 1) items.emplace_back();
+  return items;
 }
 
 std::vector<DiskCacheItem> PersistentKeyValueStore::takeNext(Clear& clear) {
@@ -947,8 +949,9 @@ void PersistentKeyValueStore::deleteNextBatch(std::function<const std::vector<Di
 Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>& paths) {
   try {
     throwIfInvalid();
-    auto deleted = dispatchTask<void>(
-        fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), deletion = fileDeletion_, paths] {
+    const Token deletion = paths.empty() ? nullptr : fileDeletion_;
+    auto deleted =
+        dispatchTask<void>(fileQueue_, [weakThis = weak_from_this<PersistentKeyValueStore>(), deletion, paths] {
           const auto self = weakThis.lock();
           if (self == nullptr) return;
           self->throwIfClosed();

@@ -509,6 +509,19 @@ TEST_F(PersistentKeyValueStoreClear, OfWritesInFlightAloneSucceedsWhenTheirFiles
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
+TEST_F(PersistentKeyValueStoreClear, SucceedsWhenTheFilesThatAnotherClearHasTakenAreGone) {
+  open();
+  put("key", "old");
+  store->clear(nullptr, nullptr);
+  store->clear(onSuccess(), onError());
+  work().runAll();
+  EXPECT_EQ(ending, "");
+  EXPECT_EQ(valueFile("key"), "old");
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
 TEST_F(PersistentKeyValueStoreClear, OfAnEmptyStoreDoesNotWaitForTheFileQueue) {
   open();
   store->clear(onSuccess(), onError());
