@@ -249,5 +249,26 @@ void intrude(const std::string& root, pid_t owner, Findings& findings) {
   }
 }
 
-void endSession(const std::string&, Ledger&, Findings&) {}  // TMP
+void endSession(const std::string& root, Ledger& ledger, Findings& findings) {
+  const auto isListed = [](const host::Host& host) {
+    const auto sessions = host.sessions();
+    return std::any_of(sessions.begin(), sessions.end(), [](const auto& session) { return session.key == kSession; });
+  };
+  try {
+    host::Host host(kConfiguration, root);
+    if (!isListed(host)) findings.faults.emplace_back("a session with data is not listed");
+    if (!host.logOut(kSession)) findings.faults.emplace_back("a session with data is not found by its end");
+    if (isListed(host)) findings.faults.emplace_back("a session that was ended is listed");
+    const auto drafts = host.store<PersistentKeyValueStore>(kStores.at(kDrafts).identifier, kSession);
+    for (const Ledger::Key& key : ledger.keys()) {
+      if (key.first != kDrafts) continue;
+      if (host::await(drafts->fetch(keyName(key.second)))) findings.faults.emplace_back("an ended session has a value");
+      ledger.settle(key, std::nullopt);
+    }
+    ++findings.sessionsEnded;
+  } catch (const std::exception& error) {
+    findings.faults.push_back(std::string("ending a session fails: ") + error.what());
+  }
+}
+
 }  // namespace velmora::mobile::xplat::cellar::crash

@@ -32,8 +32,8 @@ extern const char* const kConfiguration;
 enum class Ending : std::uint8_t {
   Killed,
   AtRest,     // nobody asks for anything any more: the host finishes what is queued
-  Busy,       // the host is destroyed while threads go on asking, and has a second for it
-  Impatient,  // the same, at once
+  Busy,       // the host is destroyed while threads go on asking
+  Impatient,  // the same, without waiting for what is under way
   ShutDown,   // the application's own queues are shut down, then the host is destroyed, while threads go on asking
   LetGo,      // the host and all stores are released, and the application's own queues finish what is queued
 };

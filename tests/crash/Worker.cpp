@@ -83,7 +83,6 @@ std::unique_ptr<host::Host> startHost(const Task& task, std::shared_ptr<TaskQueu
   options.configuration = kConfiguration;
   options.root = task.root;
   options.taskQueueFactory = std::move(queues);
-  if (task.ending == Ending::Busy) options.shutDownPatience = std::chrono::seconds(1);
   if (task.ending == Ending::Impatient) options.shutDownPatience = std::chrono::seconds(0);
   return std::make_unique<host::Host>(std::move(options));
 }

@@ -139,14 +139,14 @@ TEST_F(FaultInjection, TheLifeItselfMeetsNoTrouble) {
 TEST_F(FaultInjection, AFileOperationThatFailsOnce) { sweepFiles("file operation, EIO", EIO, false, 1); }
 
 TEST_F(FaultInjection, AFileOperationThatFindsNoSpaceOnceAndWritesTorn) {
-  sweepFiles("file operation, ENOSPC, torn", ENOSPC, true, 2);
+  sweepFiles("file operation, ENOSPC, torn", ENOSPC, true, 3);
 }
 
 // From the n-th file operation on the disk takes nothing more, from nobody.
 TEST_F(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
   Faults faults;
   faults.name = "a full disk from the n-th file operation on";
-  faults.stride = 7;
+  faults.stride = 11;
   faults.hardship = Life::Hardship::ManyFaults;
   faults.plan = [](Life& life, std::size_t n) {
     life.files->tearFailingWrites(true);
@@ -164,7 +164,7 @@ TEST_F(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
 TEST_F(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
   Faults faults;
   faults.name = "a dead disk from the n-th file operation on";
-  faults.stride = 7;
+  faults.stride = 11;
   faults.hardship = Life::Hardship::ManyFaults;
   faults.plan = [](Life& life, std::size_t n) {
     life.files->onCall = [&life, left = n](Operation, const std::string&) mutable {
@@ -214,7 +214,7 @@ TEST_F(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
 TEST_F(FaultInjection, AManifestThatCannotBeWrittenBesideATrashThatTakesNothing) {
   Faults faults;
   faults.name = "no writing and no collecting from the n-th file operation on";
-  faults.stride = 7;
+  faults.stride = 11;
   faults.hardship = Life::Hardship::ManyFaults;
   faults.plan = [](Life& life, std::size_t n) {
     life.files->onCall = [&life, left = n](Operation, const std::string&) mutable {
@@ -254,13 +254,13 @@ TEST_P(DatabaseFaultInjection, ACallThatFailsOnce) {
 INSTANTIATE_TEST_SUITE_P(
     SQLite, DatabaseFaultInjection,
     testing::Values(DatabaseFault{"OpenCannot", VfsCall::Open, SQLITE_CANTOPEN, 1, false},
-                    DatabaseFault{"ReadFails", VfsCall::Read, SQLITE_IOERR_READ, 1, false},
-                    DatabaseFault{"ReadIsShort", VfsCall::Read, SQLITE_IOERR_SHORT_READ, 1, false},
+                    DatabaseFault{"ReadFails", VfsCall::Read, SQLITE_IOERR_READ, 2, false},
+                    DatabaseFault{"ReadIsShort", VfsCall::Read, SQLITE_IOERR_SHORT_READ, 2, false},
                     DatabaseFault{"WriteFails", VfsCall::Write, SQLITE_IOERR_WRITE, 7, false},
                     DatabaseFault{"WriteFindsNoSpaceAndIsTorn", VfsCall::Write, SQLITE_FULL, 7, true},
                     DatabaseFault{"TruncateFails", VfsCall::Truncate, SQLITE_IOERR_TRUNCATE, 1, false},
                     DatabaseFault{"SyncFails", VfsCall::Sync, SQLITE_IOERR_FSYNC, 1, false},
-                    DatabaseFault{"FileSizeFails", VfsCall::FileSize, SQLITE_IOERR_FSTAT, 1, false},
+                    DatabaseFault{"FileSizeFails", VfsCall::FileSize, SQLITE_IOERR_FSTAT, 2, false},
                     DatabaseFault{"LockIsBusy", VfsCall::Lock, SQLITE_BUSY, 1, false},
                     DatabaseFault{"LockFails", VfsCall::Lock, SQLITE_IOERR_LOCK, 1, false},
                     DatabaseFault{"DeleteFails", VfsCall::Delete, SQLITE_IOERR_DELETE, 1, false},
