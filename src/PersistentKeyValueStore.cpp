@@ -302,7 +302,6 @@ Future<void> PersistentKeyValueStore::storeFile(const std::shared_ptr<FileWrite>
 // caller may be the last to hold, to release it without the mutex.
 std::shared_ptr<PersistentKeyValueStore::FileWrite> PersistentKeyValueStore::beginFileWrite(
     const std::shared_ptr<FileWrite>& write) {
-  const bool isDueToBeCleared = noteStored(write->key);
   std::optional<ReplacedItem> replaced;
   const auto setRecord = [&] { replaced = getManifest()->replaceItem(write->record(), true); };
   if (!prepareWrite() || !purgingIfUnwritable(setRecord)) {
@@ -311,7 +310,7 @@ std::shared_ptr<PersistentKeyValueStore::FileWrite> PersistentKeyValueStore::beg
   }
   auto settled = replaced ? SettledValue{std::move(replaced->item), std::move(replaced->inlineData)}
                           : SettledValue{nullptr, {}, true};
-  if (isDueToBeCleared && !settled.isPlainMiss()) settled = SettledValue::lost();
+  if (noteStored(write->key) && !settled.isPlainMiss()) settled = SettledValue::lost();  // a clear would have taken it
   write->inFlight = writesInFlight_->begin(write->key, std::move(settled));
   auto last = lastFileWrite_.lock();
   if (last != nullptr) last->setNext(write);
@@ -401,12 +400,13 @@ void PersistentKeyValueStore::recordWritten(FileWrite& write) {
     if (purgingIfUnwritable(setRecord) && othersAreInFlight) {
       writesInFlight_->settle(write.key, {std::make_unique<DiskCacheItem>(record)});
     }
-    write.total = totalToReport();
   } catch (...) {
     write.failure = std::current_exception();
     write.outcome = FileWrite::Outcome::Discarded;
     discardRecord(write.key, othersAreInFlight);
+    return;
   }
+  write.total = totalToReport();
 }
 
 // Takes back the provisional record of a write whose final one could not be written.
@@ -517,12 +517,31 @@ std::optional<std::string> PersistentKeyValueStore::writeInline(
     manifest->setInlineData(key, data);
     count(stores_);
   };
-  noteStored(key);
-  const bool isWritten = prepareWrite() && purgingIfUnwritable(write);
-  if (!isWritten) writesInFlight_->revoke(key);
+  bool isWritten = false;
+  try {
+    isWritten = prepareWrite() && purgingIfUnwritable(write);
+  } catch (...) {
+    if (replaced) takeInlineRecordBack(key, std::move(*replaced));
+    throw;
+  }
   reportSize();
-  const bool hasReplaced = isWritten && replaced && replaced->item != nullptr;
-  return hasReplaced ? fileOf(*replaced->item) : std::nullopt;
+  if (!isWritten) {
+    writesInFlight_->revoke(key);
+    return std::nullopt;
+  }
+  noteStored(key);
+  return replaced && replaced->item != nullptr ? fileOf(*replaced->item) : std::nullopt;
+}
+
+// A record whose bytes could not be written must not be left: the value in a file is back then, an inline one is gone.
+void PersistentKeyValueStore::takeInlineRecordBack(const std::string& key, ReplacedItem replaced) {
+  SettledValue settled;
+  if (replaced.item != nullptr && !replaced.item->hasInlineData) settled.record = std::move(replaced.item);
+  try {
+    restoreRecord(key, settled);
+  } catch (const std::exception& error) {
+    logLostRecord(key, error);
+  }
 }
 
 // On the file queue, behind the fetches that wait for the file. The promise waits too: as long as the file is there, a

@@ -27,6 +27,7 @@ class LarderException;
 class PruneStrategyBase;
 class TrashCollector;
 class WritesInFlight;
+struct ReplacedItem;
 struct SettledValue;
 
 // Values by key, in a directory of their own: one file for each, or inside the manifest ("inline", for small ones).
@@ -254,6 +255,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void reportTotal(FileWrite& write);
   std::optional<std::string> writeInline(const std::string& key, const std::vector<unsigned char>& data,
                                          std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
+  void takeInlineRecordBack(const std::string& key, ReplacedItem replaced);
   bool noteStored(const std::string& key);
   bool prepareWrite();
   void restoreRecord(const std::string& key, const SettledValue& settled);

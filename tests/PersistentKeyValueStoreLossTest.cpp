@@ -552,6 +552,23 @@ TEST_F(PersistentKeyValueStoreClear, ListsTheKeysOnceWhenItemsHaveNoSize) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
+TEST_F(PersistentKeyValueStoreClear, TakesAValueThatAnotherWriteHasFailedToReplaceMeanwhile) {
+  options.batchSize = 1;
+  openWatched();
+  put("first", "old");
+  clock.advance(1);
+  put("key", "old");
+  store->clear(onSuccess(), onError());
+  ASSERT_TRUE(work().runNext());  // takes "first"
+  manifest->failNext(ManifestCall::SetItem, std::runtime_error("odd manifest"));
+  const Written written = watch(store->store("key", bytesOf("newer")));
+  settle();
+  EXPECT_EQ(told(written), "<error> odd manifest");
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_THAT(keysInMedium(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
 TEST_F(PersistentKeyValueStoreClear, ThatFailsMidwayGoesOnWhereItFailed) {
   options.batchSize = 2;
   openWatched();
@@ -623,6 +640,22 @@ TEST_F(PersistentKeyValueStoreGoingInline, DeletesTheFileThoughTheQueueTakesNoTa
   file().throwOnDispatch(false);
   EXPECT_EQ(told(written), "<done>");
   EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(PersistentKeyValueStoreGoingInline, HasTheOldValueWhenTheBytesCannotBeWritten) {
+  openWatched();
+  put("key", "old");
+  options.inlineData = true;
+  reopenWatched();
+  manifest->failNext(ManifestCall::SetInlineData, std::runtime_error("odd manifest"));
+  const Written written = watch(store->store("key", bytesOf("new")));
+  settle();
+  EXPECT_EQ(told(written), "<error> odd manifest");
+  EXPECT_EQ(get("key"), "old");
+  manifest->failNext(ManifestCall::SetInlineData, std::runtime_error("odd manifest"));
+  watch(store->store("other", bytesOf("new")));
+  settle();
+  EXPECT_EQ(get("other"), "<miss>");
 }
 
 // A kill between record and bytes leaves a record that is not inline, under a key that no file may have.
