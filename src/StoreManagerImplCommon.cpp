@@ -222,8 +222,9 @@ void StoreManagerImplCommon::invalidate() {
 
 // Also releases the stores, before the invalidation is over: their directory may be somebody else's after it.
 void StoreManagerImplCommon::discard(StoreMap slots) {
+  const StoreMap released = std::move(slots);
   std::vector<std::shared_ptr<Store>> stores;
-  for (const auto& [identifier, item] : slots) {
+  for (const auto& [identifier, item] : released) {
     const std::lock_guard<std::mutex> lock(item->mutex);
     if (auto store = item->getStore()) stores.push_back(std::move(store));
   }
