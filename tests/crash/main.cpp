@@ -156,7 +156,7 @@ class Tormentor {
   Ending drawClosing() {
     constexpr std::array<Ending, 5> endings = {Ending::AtRest, Ending::Busy, Ending::Impatient, Ending::ShutDown,
                                                Ending::LetGo};
-    return endings.at(random_() % endings.size());
+    return endings.at(static_cast<std::size_t>(random_() % endings.size()));
   }
 
   // One in four is ended while it is still opening its stores, the others at work.
