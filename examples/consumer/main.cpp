@@ -44,7 +44,8 @@ bool keepsALetter(const std::string& directory) {
   cellar::host::await(letters->store("first", {'h', 'e', 'l', 'l', 'o'}));
   const auto found = cellar::host::await(letters->fetch("first"));
   CountingFiles files;
-  files.readFile("/dev/null");
+  files.writeFile(directory + "/note", {'n', 'o', 't', 'e'});
+  files.readFile(directory + "/note");
   return found != nullptr && textOf(found->value) == "hello" && files.reads == 1 && unknownStoreIsAnError(host);
 }
 
