@@ -22,13 +22,15 @@ void Ledger::note(const Record& record) {
   if (record.kind == Record::Kind::Done) ++acknowledged;
   if (record.kind == Record::Kind::Failed) ++failed;
   if (record.kind == Record::Kind::Dropped) ++dropped;
+  if (record.kind == Record::Kind::Ready) isShort_ = false;
   if (record.kind == Record::Kind::Ready || record.operation == Record::Operation::Fetch) return;
 
+  if (record.operation == Record::Operation::Shortage) return noteShortage(record);
   lastVersion_ = std::max(lastVersion_, record.version);
   if (record.operation == Record::Operation::Clear) return noteClear(record);
   const State wanted{record.operation == Record::Operation::Store, record.version, record.length};
   auto& attempts = histories_[{record.store, record.key}].attempts;
-  if (record.kind == Record::Kind::Begun) return attempts.push_back({wanted});
+  if (record.kind == Record::Kind::Begun) return attempts.push_back({wanted, false, false, isShort_});
   if (record.kind == Record::Kind::Dropped) return;
   for (Attempt& attempt : attempts) {
     const bool isIt = !attempt.isAcknowledged && !attempt.hasFailed && attempt.wanted.isThere == wanted.isThere &&
@@ -58,6 +60,14 @@ void Ledger::noteClear(const Record& record) {
   }
 }
 
+// What fails takes the value along before it says so.
+void Ledger::noteShortage(const Record& record) {
+  isShort_ = record.kind == Record::Kind::Begun;
+  for (auto& [key, history] : histories_) {
+    for (Attempt& attempt : history.attempts) attempt.mayBeFailing = attempt.mayBeFailing || isShort_;
+  }
+}
+
 bool Ledger::isCleared(const Key& key) const {
   const auto history = histories_.find(key);
   return history != histories_.end() && history->second.cleared == history->second.attempts.size();
@@ -72,7 +82,7 @@ std::vector<Ledger::State> Ledger::possible(const History& history) {
     // Operations on a key take effect in order: this one has, and so have those before it.
     if (attempt.isAcknowledged) states.clear();
     states.push_back(attempt.wanted);
-    if (attempt.hasFailed) states.push_back({});
+    if (attempt.hasFailed || (attempt.mayBeFailing && !attempt.isAcknowledged)) states.push_back({});
   }
   return states;
 }

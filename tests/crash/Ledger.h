@@ -55,7 +55,8 @@ class Ledger {
   struct Attempt {
     State wanted;
     bool isAcknowledged = false;
-    bool hasFailed = false;  // and may have taken what was there
+    bool hasFailed = false;     // and may have taken what was there
+    bool mayBeFailing = false;  // it met a shortage
   };
   struct History {
     State settled;
@@ -68,10 +69,12 @@ class Ledger {
   static std::vector<State> possible(const History& history);
 
   void noteClear(const Record& record);
+  void noteShortage(const Record& record);
 
   std::map<Key, History> histories_;
   std::map<std::uint32_t, Met> clears_;  // under way, by number
   std::uint32_t lastVersion_ = 0;
+  bool isShort_ = false;
 };
 
 }  // namespace velmora::mobile::xplat::cellar::crash

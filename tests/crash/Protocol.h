@@ -42,10 +42,11 @@ enum class Ending : std::uint8_t {
 constexpr bool finishesAll(Ending ending) { return ending == Ending::AtRest || ending == Ending::LetGo; }
 
 // What the worker tells through the pipe, in whole records: before it asks for an operation and when that is done.
-// `Dropped`: its promise was broken, so that it has not begun. A clear has no key, and its number for a version.
+// `Dropped`: its promise was broken, so that it has not begun. A clear has no key, and its number for a version. During
+// a shortage nothing can be opened, so that operations fail.
 struct Record {
   enum class Kind : std::uint8_t { Ready, Begun, Done, Failed, Dropped };
-  enum class Operation : std::uint8_t { Store, Remove, Fetch, Clear };
+  enum class Operation : std::uint8_t { Store, Remove, Fetch, Clear, Shortage };
 
   Kind kind;
   Operation operation;

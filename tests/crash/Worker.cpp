@@ -232,10 +232,16 @@ class Worker {
     const std::lock_guard<std::mutex> lock(limitMutex_);
     rlimit before{};
     if (::getrlimit(RLIMIT_NOFILE, &before) != 0) return;
+    Record shortage{};
+    shortage.kind = Record::Kind::Begun;
+    shortage.operation = Record::Operation::Shortage;
+    tell(shortage);
     const rlimit none = {0, before.rlim_max};
     (void)::setrlimit(RLIMIT_NOFILE, &none);
     std::this_thread::sleep_for(std::chrono::microseconds(300));
     (void)::setrlimit(RLIMIT_NOFILE, &before);
+    shortage.kind = Record::Kind::Done;
+    tell(shortage);
   }
 
   void throwATreeAway(std::uint64_t dice) {
