@@ -257,13 +257,13 @@ std::string Host::openSession(const std::optional<std::string>& sessionKey) {
 
 void Host::logOut() {
   refuseOnQueueThread("Host::logOut");
-  if (endOpenSession(std::nullopt)) return;
-  {
+  const auto hasOpenedSession = [this] {
     const std::lock_guard<std::mutex> lock(mutex_);
-    if (hasOpenedSession_) return;
-  }
+    return hasOpenedSession_;
+  };
+  if (endOpenSession(std::nullopt) || hasOpenedSession()) return;
   const std::size_t stored = sessions().size();
-  if (stored == 0) return;
+  if (stored == 0 || hasOpenedSession()) return;  // one that is opened meanwhile has data on disk, too
   throw std::logic_error("No session has been opened yet. Sessions with data on disk: " + std::to_string(stored) +
                          ". Name the one to end, as in logOut(sessionKey).");
 }
