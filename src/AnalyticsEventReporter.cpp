@@ -1,9 +1,9 @@
 #include "AnalyticsEventReporter.h"
 
-#include <ctime>
 #include <stdexcept>
 #include <utility>
 
+#include "Clock.h"
 #include "JsonValue.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -44,7 +44,7 @@ class Payload {
 
 void log(XAnalytics& analytics, const std::string& eventName, const Payload& payload) {
   const std::string text = payload.object().dump(-1, ' ', false, JsonValue::error_handler_t::replace);
-  analytics.logEvent(eventName, kCategory, text, std::to_string(std::time(nullptr)));
+  analytics.logEvent(eventName, kCategory, text, std::to_string(Clock::now()));
 }
 
 }  // namespace

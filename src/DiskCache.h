@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -16,9 +17,10 @@ namespace velmora::mobile::xplat::cellar {
 // whatever is written.
 class CELLAR_EXPORT DiskCache : public PersistentKeyValueStore {
  public:
-  // As `createPersistentKeyValueStore`, and: `normalSize` and `survivalSize` are the bytes that a prune leaves, the
-  // second when the device is short of space. `extendedMetadataFactory` may be null (metadata is not read back) and so
-  // may `pruneStrategy` (least recently used first).
+  // As `PersistentKeyValueStore::create`.
+  static std::shared_ptr<DiskCache> create(DiskCacheOptions options, const StoreServices& services);
+
+  // The same, with each option as a parameter.
   static std::shared_ptr<DiskCache> createDiskCache(
       const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
       std::optional<std::uint64_t> capacity, long staleAge, unsigned int normalSize, unsigned int survivalSize,
@@ -28,7 +30,8 @@ class CELLAR_EXPORT DiskCache : public PersistentKeyValueStore {
       std::shared_ptr<DiskCacheManifestInterface> manifest, std::shared_ptr<FileUtils> fileUtils,
       std::function<void(unsigned int)> sizeChangedCallback, unsigned int batchSize);
 
-  // As `createDiskCache`, but loads nothing. The store must be owned by a shared pointer.
+  // As the two above, but loads nothing. The store must be owned by a shared pointer.
+  DiskCache(DiskCacheOptions options, const StoreServices& services);
   DiskCache(const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
             std::optional<std::uint64_t> capacity, long staleAge, unsigned int normalSize, unsigned int survivalSize,
             bool inlineData, std::shared_ptr<TaskQueueFactory> taskQueueFactory,
@@ -54,7 +57,7 @@ class CELLAR_EXPORT DiskCache : public PersistentKeyValueStore {
   using PersistentKeyValueStore::overrideConfiguration;
 
  private:
-  std::uint32_t normalSize_;  // guarded by the store's mutex
+  std::atomic<std::uint32_t> normalSize_;
   const std::uint32_t survivalSize_;
 };
 

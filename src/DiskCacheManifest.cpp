@@ -2,14 +2,14 @@
 
 #include <glog/logging.h>
 
-#include <ctime>
 #include <exception>
 #include <iterator>
 #include <utility>
 
+#include "Clock.h"
 #include "LarderException.h"
-#include "ManifestRecords.h"
 #include "SQLiteManifestPersistence.h"
+#include "manifest/ManifestRecords.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -18,7 +18,7 @@ namespace {
 constexpr std::int64_t kFlushIntervalNanoseconds = 120'000'000'000;
 constexpr std::size_t kMaxPendingAccessDates = 512;
 
-std::int32_t now() { return static_cast<std::int32_t>(std::time(nullptr)); }
+std::int32_t now() { return static_cast<std::int32_t>(Clock::now()); }
 
 }  // namespace
 

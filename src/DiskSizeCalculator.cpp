@@ -3,13 +3,13 @@
 #include <glog/logging.h>
 
 #include <cstdint>
-#include <ctime>
 #include <exception>
 #include <type_traits>
 #include <vector>
 
 #include "AnalyticsEventReporter.h"
 #include "AttributeStore.h"
+#include "Clock.h"
 #include "FileUtils.h"
 #include "JsonValue.h"
 
@@ -25,8 +25,6 @@ double secondsSince(std::clock_t start) {
   const auto elapsed = now - static_cast<std::make_unsigned_t<std::clock_t>>(start);
   return static_cast<double>(elapsed) / kClockTicksPerSecond;
 }
-
-std::int64_t currentTime() { return static_cast<std::int64_t>(std::time(nullptr)); }
 
 // The member as an integer, or 0 when the document has none. Throws the JSON library's type error for anything else.
 std::int64_t integerIn(const JsonValue& document, const std::string& key) {
@@ -160,7 +158,7 @@ DiskSizeCalculator::Stats DiskSizeCalculator::getCachedStats(const std::string& 
     const Stats kept(true, numberIn(document, ATTR_TIME_SPENT), integerIn(document, ATTR_FILE_COUNT),
                      integerIn(document, ATTR_SIZE));
     const std::int64_t timeStamp = integerIn(document, ATTR_TIME_STAMP);
-    return timeStamp > 0 && currentTime() - timeStamp <= staleInterval ? kept : none;
+    return timeStamp > 0 && Clock::now() - timeStamp <= staleInterval ? kept : none;
   } catch (const JsonValue::exception&) {
     return none;  // something else wrote there: measuring again mends it
   }
@@ -170,7 +168,7 @@ void DiskSizeCalculator::setCachedStats(const std::string& path, const Stats& st
   attributeStore_->set(path, {{ATTR_SIZE, stats.size},
                               {ATTR_TIME_SPENT, stats.timeSpent},
                               {ATTR_FILE_COUNT, stats.fileCount},
-                              {ATTR_TIME_STAMP, currentTime()}});
+                              {ATTR_TIME_STAMP, Clock::now()}});
 }
 
 void DiskSizeCalculator::reportAnalytics(const std::string& path, const Stats& stats) {

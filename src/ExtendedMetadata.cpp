@@ -5,7 +5,7 @@
 #include <string_view>
 #include <system_error>
 
-#include "Configuration.h"
+#include "StoreDefinition.h"
 
 namespace velmora::mobile::xplat::cellar {
 

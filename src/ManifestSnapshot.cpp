@@ -16,7 +16,7 @@
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
 #include "SQLiteStore.h"
-#include "SchemaFunctions.h"
+#include "manifest/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -114,7 +114,7 @@ std::string withoutPath(std::string text, const std::string& path) {
 
 }  // namespace
 
-const std::string ManifestSnapshot::manifestName = "manifest_v1.sqlite";
+const std::string ManifestSnapshot::manifestName = kManifestFileName;
 
 ManifestSnapshot::ManifestSnapshot(const std::string& storeDirectory, const std::string& temporaryDirectory,
                                    std::shared_ptr<FileUtils> fileUtils)

@@ -2,8 +2,8 @@
 
 #include <string>
 
-#include "Configuration.h"
 #include "Export.h"
+#include "StoreDefinition.h"
 
 namespace velmora::mobile::xplat::cellar {
 

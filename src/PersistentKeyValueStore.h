@@ -1,34 +1,23 @@
 #pragma once
 
-#include <atomic>
 #include <cstdint>
 #include <exception>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
-#include <unordered_set>
 #include <vector>
 
 #include "DiskCacheItem.h"
 #include "Export.h"
 #include "Future.h"
 #include "Store.h"
+#include "StoreOptions.h"
 #include "executor/TaskQueueFactory.h"
 
 namespace velmora::mobile::xplat::cellar {
 
-class AnalyticsEventReporter;
-class DiskCacheManifestInterface;
-class ExtendedMetadataFactory;
-class FileUtils;
 class LarderException;
-class PruneStrategyBase;
-class TrashCollector;
-class WritesInFlight;
-struct ReplacedItem;
-struct SettledValue;
 
 // Values by key, in a directory of their own: one file for each, or inside the manifest ("inline", for small ones).
 // Found again after a restart, expired when they have not been used for long, limited in number if configured.
@@ -82,19 +71,17 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // What a store has done since it was created, each number counted by itself: read while the store works they need not
   // belong to one moment.
   struct CELLAR_EXPORT OperationCounts {
-    std::uint64_t hits;    // fetches that found an item, whether its value could be read or not
-    std::uint64_t misses;  // fetches that found none; those without a key count as neither
-    std::uint64_t stores;  // values that were written, those that replaced another too
-    std::uint64_t
-        evictions;  // items that went for the capacity, in a prune or by expiry; not those of a clear or purge
+    std::uint64_t hits;       // fetches that found an item, whether its value could be read or not
+    std::uint64_t misses;     // fetches that found none; those without a key count as neither
+    std::uint64_t stores;     // values that were written, those that replaced another too
+    std::uint64_t evictions;  // items removed for the capacity, by a prune or by expiry; not those of a clear or purge
   };
 
-  // Creates the store's directory, takes two queues from the factory and starts loading the manifest. `name` appears in
-  // log lines and events. `capacity`: items, absent for no limit; checked before each write, which then evicts the one
-  // item used least recently, also when it overwrites. `staleAge`: seconds without access after which an item expires;
-  // checked 300 seconds after loading and then every hour, in batches of `batchSize` (at least 1). `manifest` may be
-  // null: one is then created in the directory on first use. `analyticsReporter` may be null and `sizeChangedCallback`
-  // empty; the latter is called on the work queue. Throws what creating the directory throws.
+  // Creates the store's directory, takes two queues from the services and starts loading the manifest. Throws what
+  // creating the directory throws.
+  static std::shared_ptr<PersistentKeyValueStore> create(KeyValueStoreOptions options, const StoreServices& services);
+
+  // The same, with each option as a parameter.
   static std::shared_ptr<PersistentKeyValueStore> createPersistentKeyValueStore(
       const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
       std::optional<std::uint64_t> capacity, long staleAge, bool inlineData,
@@ -103,7 +90,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
       std::shared_ptr<FileUtils> fileUtils, std::function<void(unsigned int)> sizeChangedCallback,
       unsigned int batchSize);
 
-  // As `createPersistentKeyValueStore`, but loads nothing. The store must be owned by a shared pointer.
+  // As the two above, but loads nothing. The store must be owned by a shared pointer.
+  PersistentKeyValueStore(KeyValueStoreOptions options, const StoreServices& services);
   PersistentKeyValueStore(const std::string& directory, const std::string& temporaryDirectoryPath,
                           const std::string& name, std::optional<std::uint64_t> capacity, long staleAge,
                           bool inlineData, std::shared_ptr<TaskQueueFactory> taskQueueFactory,
@@ -193,7 +181,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Expires what is stale now. Called on the work queue.
   void startStaleItemRemoval();
 
-  // Evicts the item used least recently if the store is at its capacity. Called with the store's mutex held.
+  // Evicts the item used least recently if the store is at its capacity.
   void removeOldestItemIfOverMaxCapacity();
 
   // Deletes the files of what `provider` yields, batch by batch, until a batch is empty. Each batch is asked for on the
@@ -229,127 +217,23 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   std::string getTemporaryDirectoryPath();
 
  protected:
-  std::mutex& mutex() { return mutex_; }
-  unsigned int batchSize() const { return batchSize_; }
-  const std::shared_ptr<PruneStrategyBase>& pruneStrategy() const { return pruneStrategy_; }
+  using Prune = std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>;
 
-  // Takes a batch out of the manifest by `prune`, for `deleteFilesInBatches`. Locks the mutex; a corrupted manifest
-  // purges the store and yields an empty batch.
-  std::vector<DiskCacheItem> takeBatch(
-      const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune);
+  // Takes a batch out of the manifest by `prune`, for `deleteFilesInBatches`, and counts its items as evicted. A
+  // damaged manifest purges the store and yields an empty batch.
+  std::vector<DiskCacheItem> evictBatch(const Prune& prune);
 
-  // The same, and counts the items as evicted.
-  std::vector<DiskCacheItem> evictBatch(
-      const std::function<std::vector<DiskCacheItem>(DiskCacheManifestInterface& manifest)>& prune);
+  unsigned int batchSize() const;
+  const std::shared_ptr<PruneStrategyBase>& pruneStrategy() const;
 
  private:
-  using Fetched = std::unique_ptr<FetchResult>;
-  class Keys;
-  struct FileWrite;
-  struct Clear;
-  struct Fetch;
+  struct Parts;
 
-  // These are called with the mutex held.
-  std::shared_ptr<FileWrite> beginFileWrite(const std::shared_ptr<FileWrite>& write);
-  void recordWritten(FileWrite& write);
-  void reportTotal(FileWrite& write);
-  std::optional<std::string> writeInline(const std::string& key, const std::vector<unsigned char>& data,
-                                         std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata);
-  void takeInlineRecordBack(const std::string& key, ReplacedItem replaced);
-  bool noteStored(const std::string& key);
-  bool prepareWrite();
-  void restoreRecord(const std::string& key, const SettledValue& settled);
-  void restoreRecords();
-  void discardRecord(const std::string& key, bool othersAreInFlight);
-  std::unique_ptr<DiskCacheItem> lookUp(Keys keys);
-  std::vector<DiskCacheItem> takeForClear(const std::shared_ptr<Clear>& clear);
-  std::vector<DiskCacheItem> takeNext(Clear& clear);
-  std::vector<DiskCacheItem> cancelWrites();
-  std::vector<DiskCacheItem> takeAllBut(Clear& clear);
-  template <class Operation> bool purgingIfDamaged(Operation operation);
-  template <class Operation> bool purgingIfUnwritable(Operation operation);
-  bool purge(const LarderException& error);
-  void beginAnew();
-  void armStaleRemoval(long delaySeconds);
-
-  // These run on the file queue.
-  void finishFileWrites(const std::shared_ptr<FileWrite>& first);
-  void writeFile(FileWrite& write);
-  unsigned int runWriter(const FileWrite& write);
-  void rollBack(const FileWrite& write);
-  void load(Fetch& fetch);
-  bool hasLostItem(const DiskCacheItem& item);
-  void deleteLeftoverFile(const std::string& key);
-
-  // These run on the work queue.
-  void storeInline(const std::string& key, const std::vector<unsigned char>& data,
-                   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
-                   const std::shared_ptr<Promise<void>>& promise);
-  void deleteReplacedFile(const std::string& filePath, const std::shared_ptr<Promise<void>>& promise);
-  void remove(const std::string& key, const std::shared_ptr<Promise<void>>& promise);
-  void find(const std::shared_ptr<Fetch>& fetch);
-  void reportAccess(const DiskCacheItem* item, const std::string& key);
-
-  static void passQueues(const std::shared_ptr<PersistentKeyValueStore>& self);
-  Future<void> storeFile(const std::shared_ptr<FileWrite>& write);
-  Future<Fetched> fetchFirstOf(std::vector<std::string> keys, Loader loader);
-  template <class T> void dispatchWork(Keys keys, Promise<T>& promise, std::function<void()> task);
-  void throwIfReserved(const std::string& key) const;
-  void throwIfClosed();
-  std::optional<std::uint32_t> totalToReport();
-  void dispatchReport(std::uint32_t total);
   bool markInvalid(Future<void>& barrier);
   void closeManifest();
-  bool hasFile(const std::string& key);
-  void deleteFiles(const std::vector<std::string>& paths);
-  std::optional<std::string> fileOf(const DiskCacheItem& item);
-  void logPurge(const LarderException& error) const;
-  void logLostRecord(const std::string& key, const std::exception& error) const;
+  void passQueues();
 
-  const std::string name_;
-  const std::optional<std::uint64_t> capacity_;
-  const bool inlineData_;
-  const std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory_;
-  const std::shared_ptr<TrashCollector> trashCollector_;
-  const std::shared_ptr<PruneStrategyBase> pruneStrategy_;
-  const std::shared_ptr<AnalyticsEventReporter> analyticsReporter_;
-  const std::shared_ptr<FileUtils> fileUtils_;
-  const unsigned int batchSize_;
-  const std::function<void(unsigned int)> sizeChangedCallback_;
-  const std::string temporaryDirectoryPath_;
-  const std::string manifestPath_;
-  std::shared_ptr<AsyncExecutor> fileQueue_;
-  std::shared_ptr<AsyncExecutor> workQueue_;
-
-  std::mutex mutex_;  // one operation on the manifest and its bookkeeping at a time; guards the six below
-  long staleAge_;
-  std::unique_ptr<AsyncTimer> staleRemovalTimer_;
-  const std::unique_ptr<WritesInFlight> writesInFlight_;
-  std::weak_ptr<FileWrite> lastFileWrite_;  // null once another task of the store stands behind it
-  std::vector<std::weak_ptr<Clear>> clearsUnderWay_;
-  bool isHalfPurged_ = false;  // its directory has gone to the trash, and no new one is there
-
-  std::atomic<bool> invalidated_{false};  // set under the mutex
-  // Set by the barrier of an invalidation, on the file queue: from then on the paths may be those of another store.
-  std::atomic<bool> isClosed_{false};
-
-  std::mutex
-      removalMutex_;  // taken before mutex_; held until a removal has deleted its file: invalidation waits for it
-
-  // Whoever stands for one of these holds a copy, so that the number of owners tells whether there are any.
-  using Token = std::shared_ptr<const char>;
-  const Token operation_ = std::make_shared<const char>();     // an operation that has been accepted and is not over
-  const Token fileDeletion_ = std::make_shared<const char>();  // a deletion of files that waits on the file queue
-
-  std::mutex manifestMutex_;  // taken after mutex_; guards the creation of the manifest
-  std::atomic<bool> manifestCreated_{false};
-  std::shared_ptr<DiskCacheManifestInterface> manifest_;
-
-  // Relaxed: they are added to and read, and order nothing.
-  std::atomic<std::uint64_t> hits_{0};
-  std::atomic<std::uint64_t> misses_{0};
-  std::atomic<std::uint64_t> stores_{0};
-  std::atomic<std::uint64_t> evictions_{0};
+  const std::unique_ptr<Parts> parts_;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

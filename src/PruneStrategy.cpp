@@ -3,9 +3,9 @@
 #include <cstdint>
 #include <utility>
 
-#include "Configuration.h"
 #include "DiskCacheItem.h"
-#include "VideoPruneDate.h"
+#include "StoreDefinition.h"
+#include "base/VideoPruneDate.h"
 
 namespace velmora::mobile::xplat::cellar {
 

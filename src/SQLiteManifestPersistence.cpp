@@ -9,7 +9,7 @@
 
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
-#include "SchemaFunctions.h"
+#include "manifest/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -1,6 +1,6 @@
 #pragma once
 
-// The manifest on disk: an SQLite database ("manifest_v1.sqlite" in the store's directory, with SQLite's own "-wal" and
+// The manifest on disk: an SQLite database in the store's directory (`kManifestFileName`, with SQLite's own "-wal" and
 // "-shm" beside it while it is open) with one table.
 //
 //   LarderManifest
@@ -33,9 +33,10 @@
 
 namespace velmora::mobile::xplat::cellar {
 
+class ExtendedMetadataFactory;
 class SQLiteStoreException;
 
-class ExtendedMetadataFactory;
+inline constexpr char kManifestFileName[] = "manifest_v1.sqlite";
 
 // The manifest in an SQLite database. What an operation has written survives the death of the process; a power failure
 // may take the last writes with it, but never damages the rest. On a full disk an operation throws and changes nothing.

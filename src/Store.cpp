@@ -3,7 +3,7 @@
 #include <stdexcept>
 #include <utility>
 
-#include "Configuration.h"
+#include "StoreDefinition.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -30,14 +30,5 @@ std::uint32_t UnmanagedStore::getMaxSize() const { return definition->maxSize; }
 bool UnmanagedStore::isPrunable() { return false; }
 
 void UnmanagedStore::invalidate() {}
-
-std::shared_ptr<Store> UnmanagedStoreDefinition::createStore(
-    const std::string& storePath, const std::string& /*temporaryDirectoryPath*/,
-    std::shared_ptr<TaskQueueFactory> /*taskQueueFactory*/, std::shared_ptr<TrashCollector> /*trashCollector*/,
-    std::shared_ptr<AnalyticsEventReporter> /*analyticsReporter*/, std::shared_ptr<FileUtils> /*fileUtils*/,
-    std::function<void(unsigned int)> /*sizeChangedCallback*/, PruneStrategyIdentifier /*pruneStrategy*/,
-    std::shared_ptr<const StoreDefinition> definition) const {
-  return std::make_shared<UnmanagedStore>(storePath, std::move(definition));
-}
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <iterator>
 
-#include "Configuration.h"
+#include "StoreDefinition.h"
 
 namespace velmora::mobile::xplat::cellar {
 

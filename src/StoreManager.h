@@ -5,9 +5,9 @@
 #include <string>
 #include <typeinfo>
 
-#include "Configuration.h"
 #include "Export.h"
 #include "Store.h"
+#include "StoreDefinition.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -6,6 +6,7 @@
 #include <stdexcept>
 #include <utility>
 
+#include "Clock.h"
 #include "DiskSizeCalculator.h"
 #include "FileUtils.h"
 #include "LarderException.h"
@@ -198,8 +199,8 @@ std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() 
   const StoreManagerDefinition& definition = common_.definition();
   if (pruneInProgress_) noteIfRoundIsOver();  // a store that has gone in the middle of its prune tells nobody
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
-  const auto nextPruneTime = static_cast<std::int64_t>(lastPruneTime_) + definition.pruneInterval;
-  if (lastPruneTime_ != 0 && static_cast<std::int64_t>(std::time(nullptr)) < nextPruneTime) return {};
+  const auto nextPruneTime = lastPruneTime_ + definition.pruneInterval;
+  if (lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};
   const bool survivalMode = isInSurvivalMode();
   if (totalSize_ <= definition.maxSize && !survivalMode) return {};
 
@@ -266,7 +267,7 @@ void StoreManagerImpl::noteIfRoundIsOver() {
     anyIsPruning = anyIsPruning || (item->isPruning && item->getStore() != nullptr);
   }
   pruneInProgress_ = anyIsPruning;
-  if (!anyIsPruning) lastPruneTime_ = std::time(nullptr);
+  if (!anyIsPruning) lastPruneTime_ = Clock::now();
 }
 
 void StoreManagerImpl::reportEventToAnalytics(const std::string& storeName, StoreManagerEvent::Type type,

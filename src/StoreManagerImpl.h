@@ -1,15 +1,14 @@
 #pragma once
 
 #include <cstdint>
-#include <ctime>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <vector>
 
 #include "AnalyticsEventReporter.h"
-#include "Configuration.h"
 #include "Export.h"
+#include "StoreDefinition.h"
 #include "StoreManagerImplCommon.h"
 #include "executor/TaskQueueFactory.h"
 
@@ -114,7 +113,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
 
   std::mutex mutex_;  // guards the three below
   std::uint32_t totalSize_ = 0;
-  std::time_t lastPruneTime_ = 0;
+  std::int64_t lastPruneTime_ = 0;
   bool pruneInProgress_ = false;
 
   std::recursive_mutex cleanupMutex_;  // held by a clean-up in the background, which may lead to an invalidation

@@ -10,8 +10,8 @@
 #include <unordered_map>
 #include <vector>
 
-#include "Configuration.h"
 #include "Export.h"
+#include "StoreDefinition.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -3,8 +3,8 @@
 #include <memory>
 #include <string>
 
-#include "Configuration.h"
 #include "Export.h"
+#include "StoreDefinition.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -9,7 +9,6 @@
 #include <cinttypes>
 #include <cstdint>
 #include <cstdio>
-#include <ctime>
 #include <exception>
 #include <mutex>
 #include <random>
@@ -18,6 +17,7 @@
 #include <vector>
 
 #include "AnalyticsEventReporter.h"
+#include "Clock.h"
 #include "FileUtils.h"
 #include "Future.h"
 #include "LarderException.h"
@@ -42,7 +42,7 @@ constexpr int kMaxMoves = 10;
 class TrashCollector::Trash {
  public:
   Trash(const std::string& path, const std::shared_ptr<FileUtils>& fileUtils)
-      : path_(path), fileUtils_(fileUtils), random_(static_cast<std::uint64_t>(std::time(nullptr))) {}
+      : path_(path), fileUtils_(fileUtils), random_(static_cast<std::uint64_t>(Clock::now())) {}
 
   // One pass: until the trash is gone, what is left in it cannot be deleted, or the pass is interrupted. Never throws
   // for a failed file operation. Called from within a pass, by a file layer that collects something on a queue that

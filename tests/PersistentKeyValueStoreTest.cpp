@@ -25,7 +25,7 @@
 #include "Configuration.h"
 #include "DiskCacheManifest.h"
 #include "LarderException.h"
-#include "StoreDefaults.h"
+#include "base/StaleAge.h"
 #include "support/KeyValueStoreFixture.h"
 #include "support/Watchdog.h"
 

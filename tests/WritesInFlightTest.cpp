@@ -1,7 +1,7 @@
 // Writes that are on their way while other operations on their keys come in between: in every order in which two queues
 // can run them, what is left is what the operations say, one after the other.
 
-#include "WritesInFlight.h"
+#include "keyvalue/WritesInFlight.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -48,66 +48,97 @@ using Contents = std::map<std::string, std::string>;
 
 // --- The bookkeeping ---
 
+using State = WritesInFlight::State;
+using Write = WritesInFlight::Write;
+
 TEST(WritesInFlight, KnowsAWriteFromItsBeginningToItsEnd) {
   WritesInFlight writes;
+  Write write("key");
+  EXPECT_EQ(write.state, State::New);
   EXPECT_FALSE(writes.contains("key"));
-  const auto write = writes.begin("key", {});
-  EXPECT_EQ(write->key, "key");
-  EXPECT_FALSE(write->isRunning);
-  EXPECT_FALSE(write->isRevoked);
+  writes.begin(write, {});
+  EXPECT_EQ(write.state, State::Queued);
   EXPECT_TRUE(writes.contains("key"));
   EXPECT_FALSE(writes.contains("other"));
   writes.end(write);
+  EXPECT_EQ(write.state, State::Done);
   EXPECT_FALSE(writes.contains("key"));
   EXPECT_THAT(writes.keys(), IsEmpty());
 }
 
 TEST(WritesInFlight, EndsOneOfSeveralOfAKeyAndNoneTwice) {
   WritesInFlight writes;
-  const auto first = writes.begin("key", {});
-  const auto second = writes.begin("key", {});
-  EXPECT_FALSE(first->isOver);
+  Write first("key");
+  Write second("key");
+  writes.begin(first, {});
+  writes.begin(second, {});
   EXPECT_TRUE(writes.end(first));
   EXPECT_FALSE(writes.end(first));
-  EXPECT_TRUE(first->isOver);
+  EXPECT_EQ(first.state, State::Done);
   EXPECT_THAT(writes.keys(), ElementsAre("key"));
-  EXPECT_FALSE(second->isOver);
+  EXPECT_EQ(second.state, State::Queued);
   EXPECT_TRUE(writes.contains("key"));
 }
 
 TEST(WritesInFlight, RevokesAllOfAKeyAndNoOther) {
   WritesInFlight writes;
-  const auto first = writes.begin("key", {});
-  const auto second = writes.begin("key", {});
-  const auto other = writes.begin("other", {});
+  Write first("key");
+  Write second("key");
+  Write other("other");
+  for (Write* write : {&first, &second, &other}) writes.begin(*write, {});
   EXPECT_TRUE(writes.revoke("key"));
-  EXPECT_TRUE(first->isRevoked);
-  EXPECT_TRUE(second->isRevoked);
-  EXPECT_FALSE(other->isRevoked);
+  EXPECT_EQ(first.state, State::Revoked);
+  EXPECT_EQ(second.state, State::Revoked);
+  EXPECT_EQ(other.state, State::Queued);
   EXPECT_FALSE(writes.revoke("unknown"));
 }
 
-TEST(WritesInFlight, StartUnlessTheyAreRevoked) {
+TEST(WritesInFlight, AreClaimedOnceAndWrittenUnlessTheyAreRevoked) {
   WritesInFlight writes;
-  const auto write = writes.begin("key", {});
-  const auto revoked = writes.begin("revoked", {});
+  Write write("key");
+  Write revoked("revoked");
+  writes.begin(write, {});
+  writes.begin(revoked, {});
   writes.revoke("revoked");
-  EXPECT_TRUE(writes.start(*write));
-  EXPECT_TRUE(write->isRunning);
-  EXPECT_FALSE(writes.start(*revoked));
-  EXPECT_FALSE(revoked->isRunning);
+  EXPECT_FALSE(write.isClaimed());
+  EXPECT_FALSE(revoked.isClaimed());
+  EXPECT_TRUE(writes.claim(write));
+  EXPECT_EQ(write.state, State::Writing);
+  EXPECT_TRUE(write.isClaimed());
+  EXPECT_FALSE(writes.claim(write));
+  EXPECT_TRUE(writes.claim(revoked));
+  EXPECT_EQ(revoked.state, State::Discarded);
+  EXPECT_FALSE(writes.claim(revoked));
 }
 
-TEST(WritesInFlight, ThatLoseTheirRecordsAreRevokedIfTheyRunAndGoOnWithoutOtherwise) {
+TEST(WritesInFlight, ThatAreRevokedUnderTheirWriterAreDiscarded) {
   WritesInFlight writes;
-  const auto running = writes.begin("running", {});
-  EXPECT_TRUE(writes.start(*running));
-  const auto waiting = writes.begin("waiting", {});
-  EXPECT_TRUE(waiting->hasRecord);
-  writes.loseRecords(writes.holdStarts());
-  EXPECT_TRUE(running->isRevoked);
-  EXPECT_FALSE(waiting->isRevoked);
-  EXPECT_FALSE(waiting->hasRecord);
+  Write write("key");
+  writes.begin(write, {});
+  writes.claim(write);
+  EXPECT_TRUE(writes.revoke("key"));
+  EXPECT_EQ(write.state, State::Discarded);
+}
+
+TEST(WritesInFlight, ThatHaveNotBegunAreTheClaimersOwn) {
+  WritesInFlight writes;
+  Write write("key");
+  EXPECT_TRUE(writes.claim(write));
+  EXPECT_EQ(write.state, State::New);
+}
+
+TEST(WritesInFlight, ThatLoseTheirRecordsAreDiscardedIfTheyRunAndGoOnWithoutOtherwise) {
+  WritesInFlight writes;
+  Write running("running");
+  Write waiting("waiting");
+  writes.begin(running, {});
+  writes.begin(waiting, {});
+  writes.claim(running);
+  EXPECT_TRUE(waiting.hasRecord);
+  writes.detachRecords(writes.holdClaims());
+  EXPECT_EQ(running.state, State::Discarded);
+  EXPECT_EQ(waiting.state, State::Queued);
+  EXPECT_FALSE(waiting.hasRecord);
 }
 
 // --- In one breath ---

@@ -1,4 +1,4 @@
-#include "ManifestRecords.h"
+#include "manifest/ManifestRecords.h"
 
 #include <typeinfo>
 #include <utility>

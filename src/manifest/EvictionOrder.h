@@ -4,7 +4,7 @@
 #include <cstdint>
 #include <vector>
 
-#include "ManifestRecord.h"
+#include "manifest/ManifestRecord.h"
 
 namespace velmora::mobile::xplat::cellar {
 

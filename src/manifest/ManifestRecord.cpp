@@ -1,4 +1,4 @@
-#include "ManifestRecord.h"
+#include "manifest/ManifestRecord.h"
 
 #include <new>
 #include <stdexcept>

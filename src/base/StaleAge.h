@@ -6,18 +6,10 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-// Items that a store built from a definition deletes at a time.
-constexpr unsigned int kDefaultBatchSize = 50;
-
 // A definition's seconds as a store takes them. Where `long` has 32 bits, more than it holds must not turn into a
 // negative age, with which everything would be stale at once.
 inline long staleAgeOf(std::uint32_t seconds) {
   return static_cast<long>(std::min<std::uint64_t>(seconds, std::numeric_limits<long>::max()));
-}
-
-// The seconds between two dates as an event reports them: where `long` has 32 bits, the greatest it holds at most.
-inline long ageOf(std::int64_t seconds) {
-  return static_cast<long>(std::min<std::int64_t>(seconds, std::numeric_limits<long>::max()));
 }
 
 }  // namespace velmora::mobile::xplat::cellar

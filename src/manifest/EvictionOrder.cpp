@@ -1,4 +1,4 @@
-#include "EvictionOrder.h"
+#include "manifest/EvictionOrder.h"
 
 #include <algorithm>
 

@@ -1,9 +1,9 @@
-#include "VideoEvictionOrder.h"
+#include "manifest/VideoEvictionOrder.h"
 
 #include <utility>
 
 #include "PruneStrategy.h"
-#include "VideoPruneDate.h"
+#include "base/VideoPruneDate.h"
 
 namespace velmora::mobile::xplat::cellar {
 

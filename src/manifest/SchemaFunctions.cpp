@@ -1,4 +1,4 @@
-#include "SchemaFunctions.h"
+#include "manifest/SchemaFunctions.h"
 
 #include <sqlite3.h>
 

@@ -9,8 +9,8 @@
 #include <unordered_map>
 #include <vector>
 
-#include "EvictionOrder.h"
-#include "VideoEvictionOrder.h"
+#include "manifest/EvictionOrder.h"
+#include "manifest/VideoEvictionOrder.h"
 
 namespace velmora::mobile::xplat::cellar {
 

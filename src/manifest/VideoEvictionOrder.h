@@ -2,7 +2,7 @@
 
 #include <cstddef>
 
-#include "EvictionOrder.h"
+#include "manifest/EvictionOrder.h"
 
 namespace velmora::mobile::xplat::cellar {
 

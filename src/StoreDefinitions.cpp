@@ -1,0 +1,70 @@
+// How the definitions of a configuration make their stores.
+
+#include <utility>
+
+#include "DiskCache.h"
+#include "ExtendedMetadata.h"
+#include "PersistentKeyValueStore.h"
+#include "PruneStrategy.h"
+#include "Store.h"
+#include "StoreDefinition.h"
+#include "StoreOptions.h"
+#include "base/StaleAge.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+template <class Definition> void setOptions(KeyValueStoreOptions& options, const Definition& definition,
+                                            const std::string& storePath, const std::string& temporaryDirectoryPath,
+                                            std::function<void(unsigned int)> sizeChangedCallback) {
+  options.directory = storePath;
+  options.temporaryDirectory = temporaryDirectoryPath;
+  options.name = definition.name;
+  options.capacity = definition.capacity;
+  options.staleAge = staleAgeOf(definition.staleAge);
+  options.inlineData = definition.inlineData;
+  options.onSizeChanged = std::move(sizeChangedCallback);
+}
+
+}  // namespace
+
+std::shared_ptr<Store> UnmanagedStoreDefinition::createStore(
+    const std::string& storePath, const std::string& /*temporaryDirectoryPath*/,
+    std::shared_ptr<TaskQueueFactory> /*taskQueueFactory*/, std::shared_ptr<TrashCollector> /*trashCollector*/,
+    std::shared_ptr<AnalyticsEventReporter> /*analyticsReporter*/, std::shared_ptr<FileUtils> /*fileUtils*/,
+    std::function<void(unsigned int)> /*sizeChangedCallback*/, PruneStrategyIdentifier /*pruneStrategy*/,
+    std::shared_ptr<const StoreDefinition> definition) const {
+  return std::make_shared<UnmanagedStore>(storePath, std::move(definition));
+}
+
+std::shared_ptr<Store> PKVSDefinition::createStore(
+    const std::string& storePath, const std::string& temporaryDirectoryPath,
+    std::shared_ptr<TaskQueueFactory> taskQueueFactory, std::shared_ptr<TrashCollector> trashCollector,
+    std::shared_ptr<AnalyticsEventReporter> analyticsReporter, std::shared_ptr<FileUtils> fileUtils,
+    std::function<void(unsigned int)> sizeChangedCallback, PruneStrategyIdentifier /*pruneStrategy*/,
+    std::shared_ptr<const StoreDefinition> /*definition*/) const {
+  KeyValueStoreOptions options;
+  setOptions(options, *this, storePath, temporaryDirectoryPath, std::move(sizeChangedCallback));
+  return PersistentKeyValueStore::create(std::move(options), {std::move(taskQueueFactory), std::move(trashCollector),
+                                                              std::move(fileUtils), std::move(analyticsReporter)});
+}
+
+std::shared_ptr<Store> DiskCacheDefinition::createStore(
+    const std::string& storePath, const std::string& temporaryDirectoryPath,
+    std::shared_ptr<TaskQueueFactory> taskQueueFactory, std::shared_ptr<TrashCollector> trashCollector,
+    std::shared_ptr<AnalyticsEventReporter> analyticsReporter, std::shared_ptr<FileUtils> fileUtils,
+    std::function<void(unsigned int)> sizeChangedCallback, PruneStrategyIdentifier pruneStrategyOverride,
+    std::shared_ptr<const StoreDefinition> /*definition*/) const {
+  DiskCacheOptions options;
+  setOptions(options, *this, storePath, temporaryDirectoryPath, std::move(sizeChangedCallback));
+  options.normalSize = lruSizeLimit;
+  options.survivalSize = survivalSize;
+  options.extendedMetadataFactory = ExtendedMetadataFactoryFactory(metadataFactory);
+  options.pruneStrategy = PruneStrategyFactory(
+      pruneStrategyOverride == PruneStrategyIdentifier::Null ? pruneStrategy : pruneStrategyOverride);
+  return DiskCache::create(std::move(options), {std::move(taskQueueFactory), std::move(trashCollector),
+                                                std::move(fileUtils), std::move(analyticsReporter)});
+}
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,52 @@
+#include "keyvalue/StoreContext.h"
+
+#include <algorithm>
+
+#include "FileUtils.h"
+#include "LarderException.h"
+#include "SQLiteManifestPersistence.h"
+#include "keyvalue/ReservedKeys.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+KeyValueStoreOptions inRange(KeyValueStoreOptions options) {
+  options.batchSize = std::max(options.batchSize, 1U);
+  return options;
+}
+
+std::string pathOfManifest(const KeyValueStoreOptions& options, FileUtils& files) {
+  files.createDirectory(options.directory, true);
+  return files.combinePath(options.directory, kManifestFileName);
+}
+
+}  // namespace
+
+StoreContext::StoreContext(Store& store, KeyValueStoreOptions storeOptions, const StoreServices& services)
+    : options(inRange(std::move(storeOptions))),
+      files(services.files),
+      trash(services.trash),
+      analytics(services.analytics),
+      manifestPath(pathOfManifest(options, *files)),
+      fileQueue(services.queues->createQueue()),
+      workQueue(services.queues->createWorkQueue()),
+      store_(store) {}
+
+void StoreContext::throwIfInvalid() const {
+  if (isInvalidated) throw InvalidatedException("Store has been invalidated.");
+}
+
+void StoreContext::throwIfClosed() const {
+  if (isClosed) throwIfInvalid();
+}
+
+void StoreContext::dispatchWork(KeyRange keys, std::function<void()> task) {
+  throwIfInvalid();
+  if (!options.inlineData) {
+    for (const std::string& key : keys) throwIfReserved(key);
+  }
+  workQueue->dispatch(std::move(task));
+}
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,55 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "DiskCacheItem.h"
+#include "Future.h"
+#include "PersistentKeyValueStore.h"
+#include "keyvalue/StoreContext.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+class FileQueue;
+class StoreManifest;
+class ValueFiles;
+class WritesInFlight;
+
+// Looks items up, on the work queue, and reads their values, on the file queue.
+class ValueFetcher {
+ public:
+  using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
+  using Loader = PersistentKeyValueStore::Loader;
+
+  ValueFetcher(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, FileQueue& fileQueue,
+               ValueFiles& files)
+      : context_(context), manifest_(manifest), writes_(writes), fileQueue_(fileQueue), files_(files) {}
+
+  Future<Fetched> fetchFirst(std::vector<std::string> keys, Loader loader);
+
+  // The loader of a plain fetch.
+  bool readValue(const DiskCacheItem& item, const std::string& path, std::vector<unsigned char>& value);
+
+  std::optional<std::int32_t> modificationDate(const std::string& key);
+
+  void updateLastAccessDate(const std::string& key);  // on the work queue
+
+ private:
+  struct Fetch;
+
+  void find(const std::shared_ptr<Fetch>& fetch);
+  void load(Fetch& fetch);
+  bool hasLostItem(const DiskCacheItem& item);
+  void reportAccess(const DiskCacheItem* item, const std::string& key);
+
+  StoreContext& context_;
+  StoreManifest& manifest_;
+  WritesInFlight& writes_;
+  FileQueue& fileQueue_;
+  ValueFiles& files_;
+};
+
+}  // namespace velmora::mobile::xplat::cellar

@@ -1,0 +1,45 @@
+#include "keyvalue/ValueFiles.h"
+
+#include <glog/logging.h>
+
+#include "FileUtils.h"
+#include "LarderException.h"
+#include "keyvalue/ReservedKeys.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+std::string ValueFiles::pathOf(const std::string& filename) const {
+  return context_.files->combinePath(context_.options.directory, filename);
+}
+
+std::optional<std::string> ValueFiles::fileOf(const DiskCacheItem& item) const {
+  if (item.hasInlineData || item.filename.empty() || isReserved(item.filename)) return std::nullopt;
+  return pathOf(item.filename);
+}
+
+bool ValueFiles::exists(const std::string& key) const {
+  const std::string path = pathOf(key);
+  return context_.files->pathExists(path) && !context_.files->isDirectory(path);
+}
+
+void ValueFiles::deleteAll(const std::vector<std::string>& paths) const {
+  for (const std::string& path : paths) {
+    try {
+      context_.files->deleteFile(path);
+    } catch (const LarderException& error) {
+      LOG(ERROR) << "Failed to delete file at \"" << path << "\" " << error.what();
+    }
+  }
+}
+
+void ValueFiles::deleteLeftover(const std::string& key) const {
+  if (context_.isClosed) return;
+  try {
+    if (exists(key)) context_.files->deleteFile(pathOf(key));
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Store \"" << context_.options.name << "\" could not delete the file of an unfinished write of \""
+               << key << "\": " << error.what();
+  }
+}
+
+}  // namespace velmora::mobile::xplat::cellar

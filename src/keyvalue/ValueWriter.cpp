@@ -1,0 +1,185 @@
+#include "keyvalue/ValueWriter.h"
+
+#include <cstddef>
+#include <exception>
+#include <optional>
+#include <utility>
+
+#include "keyvalue/Clearing.h"
+#include "keyvalue/FileQueue.h"
+#include "keyvalue/ItemRemover.h"
+#include "keyvalue/Rollback.h"
+#include "keyvalue/StoreManifest.h"
+#include "keyvalue/ValueFiles.h"
+#include "keyvalue/WritesInFlight.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+// How far the files of writes may get ahead of their records: the first of them waits for the last.
+constexpr std::size_t kMaxGroupSize = 32;
+constexpr std::uint64_t kMaxGroupBytes = 1 << 20;
+
+}  // namespace
+
+Future<void> ValueWriter::store(const std::string& key,
+                                std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata,
+                                PersistentKeyValueStore::Writer writer, bool isGroupable) {
+  const auto write = std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer), isGroupable,
+                                                 context_.weak(*this), context_.operation);
+  Future<void> future = write->promise.getFuture();
+  context_.dispatchWork(KeyRange(write->key), write->promise, [write] {
+    if (const auto self = write->owner.lock()) {
+      self->begin(write);
+    } else {
+      write->promise.setValue();
+    }
+  });
+  return future;
+}
+
+void ValueWriter::begin(const std::shared_ptr<FileWrite>& write) {
+  try {
+    bool hasBegun = false;
+    {
+      const StoreLock lock = context_.lock();
+      context_.throwIfInvalid();
+      hasBegun = beginRecord(lock, *write);
+    }
+    if (!hasBegun) return write->promise.setValue();  // the store was purged instead
+    // A queue that takes no task drops the write: its end takes the record away again.
+    fileQueue_.dispatchWrite(write, [write] {
+      if (const auto self = write->owner.lock()) {
+        if (self->writes_.claim(*write)) self->commitGroup(write);
+      } else if (!write->isClaimed()) {
+        write->promise.setValue();
+      }
+    });
+  } catch (...) {
+    // The task of an earlier write may have it by now, though the queue has refused its own.
+    if (writes_.claim(*write)) write->promise.setException(std::current_exception());
+  }
+}
+
+// Puts a provisional record into the manifest. False when the store had to be purged instead.
+bool ValueWriter::beginRecord(const StoreLock& lock, FileWrite& write) {
+  std::optional<ReplacedItem> replaced;
+  const auto setRecord = [&] { replaced = manifest_.get()->replaceItem(write.record(), true); };
+  if (!remover_.makeRoom(lock) || !manifest_.purgingIfUnwritable(lock, setRecord)) {
+    writes_.revoke(write.key);  // an earlier value must not take the place of this one
+    return false;
+  }
+  auto settled = replaced ? SettledValue{std::move(replaced->item), std::move(replaced->inlineData)}
+                          : SettledValue{nullptr, {}, true};
+  const bool isDueToBeCleared = clearing_.noteStored(lock, write.key);
+  if (isDueToBeCleared && !settled.isPlainMiss()) settled = SettledValue::lost();
+  writes_.begin(write, std::move(settled));
+  return true;
+}
+
+// Writes a file, and then its record. To wait for the manifest would cost two switches between threads for each write:
+// while others are busy with it, the files of the next writes are written instead, and then all their records at once.
+void ValueWriter::commitGroup(const std::shared_ptr<FileWrite>& first) {
+  const Token deletion = context_.fileDeletion;  // of what a writer that fails, or is revoked, leaves behind
+  Group group = {first};
+  writeFile(*first);
+  StoreLock lock = StoreLock::tryTo(context_.mutex);
+  if (!lock.isHeld()) {
+    extendGroup(group);
+    lock.lock();
+  }
+  for (const auto& write : group) recordWritten(lock, *write);
+  for (const auto& write : group) reportTotal(*write);  // together, so that the work queue's thread is woken once
+  lock.unlock();
+  deliver(group);
+}
+
+void ValueWriter::extendGroup(Group& group) {
+  group.reserve(kMaxGroupSize);
+  std::uint64_t bytes = group.back()->size;
+  while (group.size() < kMaxGroupSize && bytes < kMaxGroupBytes) {
+    auto write = fileQueue_.next(group);
+    if (write == nullptr || !writes_.claim(*write)) return;
+    writeFile(*write);
+    bytes += write->size;
+    group.push_back(std::move(write));
+  }
+}
+
+void ValueWriter::deliver(const Group& group) {
+  std::exception_ptr failure;  // of a callback: the executor's affair, but not the other writes'
+  for (const auto& write : group) {
+    if (write->leavesFile) files_.deleteLeftover(write->key);
+    try {
+      write->failure == nullptr ? write->promise.setValue() : write->promise.setException(write->failure);
+    } catch (...) {
+      failure = std::current_exception();
+    }
+  }
+  if (failure != nullptr) std::rethrow_exception(failure);
+}
+
+void ValueWriter::writeFile(FileWrite& write) {
+  try {
+    context_.throwIfClosed();
+    if (write.state == FileWrite::State::Writing) write.size = runWriter(write);
+  } catch (...) {
+    write.failure = std::current_exception();
+  }
+}
+
+unsigned int ValueWriter::runWriter(FileWrite& write) {
+  try {
+    return write.writer(files_.pathOf(write.key));
+  } catch (...) {
+    {
+      const StoreLock lock = context_.lock();
+      writes_.settle(write.key, SettledValue::lost());
+    }
+    rollback_.end(write);
+    files_.deleteLeftover(write.key);
+    throw;
+  }
+}
+
+void ValueWriter::recordWritten(const StoreLock& lock, FileWrite& write) {
+  if (write.failure != nullptr) return;
+  if (write.state == FileWrite::State::Discarded) {
+    write.leavesFile = true;
+    const auto settled = writes_.drop(write);
+    if (settled && settled->isReplaced) rollback_.discardRecord(lock, write.key, false);
+    return;
+  }
+  const bool othersAreInFlight = writes_.end(write);
+  try {
+    const DiskCacheItem record = write.record();
+    const auto setRecord = [&] {
+      if (!write.hasRecord) remover_.evictOldestIfFull(lock);
+      manifest_.get()->setItem(record);
+      StoreContext::count(context_.stores);
+    };
+    if (manifest_.purgingIfUnwritable(lock, setRecord) && othersAreInFlight) {
+      writes_.settle(write.key, {std::make_unique<DiskCacheItem>(record)});
+    }
+  } catch (...) {
+    write.failure = std::current_exception();
+    write.leavesFile = true;
+    rollback_.discardRecord(lock, write.key, othersAreInFlight);
+    return;
+  }
+  write.total = manifest_.totalToReport();
+}
+
+void ValueWriter::reportTotal(FileWrite& write) {
+  if (!write.total) return;
+  try {
+    manifest_.dispatchReport(*write.total);
+  } catch (...) {
+    write.failure = std::current_exception();
+  }
+}
+
+void ValueWriter::rollBack(FileWrite& write) { rollback_.end(write); }
+
+}  // namespace velmora::mobile::xplat::cellar
