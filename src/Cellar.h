@@ -1,20 +1,18 @@
 #pragma once
 
-// Every public header. The way in is StoreManagerFactory.h; what a host must bring is in executor/, PathLocations.h and
-// XAnalytics.h.
+// Every public header but three, which only a host without the kit needs and which would double what this one costs to
+// compile: AttributeStore.h and JsonValue.h, which bring in the JSON library, and DiskSizeCalculator.h. The way in is
+// StoreManagerFactory.h; what a host must bring is in executor/, PathLocations.h and XAnalytics.h.
 
 #include "AnalyticsEventReporter.h"
-#include "AttributeStore.h"
 #include "Clock.h"
 #include "Configuration.h"
 #include "DiskCache.h"
 #include "DiskCacheItem.h"
 #include "DiskCacheManifest.h"
-#include "DiskSizeCalculator.h"
 #include "ExtendedMetadata.h"
 #include "FileUtils.h"
 #include "Future.h"
-#include "JsonValue.h"
 #include "LarderException.h"
 #include "LazyDispatcher.h"
 #include "ManifestPersistence.h"
