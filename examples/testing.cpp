@@ -24,10 +24,16 @@ struct Surroundings {
 };
 
 std::shared_ptr<PersistentKeyValueStore> openDrafts(const Surroundings& with, const std::string& directory) {
-  const auto trash = std::make_shared<TrashCollector>(directory + "/trash", with.files, nullptr, with.queues);
-  return PersistentKeyValueStore::createPersistentKeyValueStore(directory + "/drafts", directory + "/tmp", "drafts", {},
-                                                                3600, false, with.queues, trash, with.reporter, nullptr,
-                                                                with.files, nullptr, 50);
+  StoreServices services;
+  services.queues = with.queues;
+  services.files = with.files;
+  services.analytics = with.reporter;
+  services.trash = std::make_shared<TrashCollector>(directory + "/trash", with.files, nullptr, with.queues);
+  KeyValueStoreOptions options;
+  options.directory = directory + "/drafts";
+  options.temporaryDirectory = directory + "/tmp";
+  options.name = "drafts";
+  return PersistentKeyValueStore::create(options, services);
 }
 
 // A draft is not there before the queues have run, and a full disk is an error that the caller sees.

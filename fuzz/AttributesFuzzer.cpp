@@ -18,7 +18,7 @@
 #include "harness/Check.h"
 #include "harness/Fuzzing.h"
 #include "harness/Scratch.h"
-#include "support/TestClock.h"
+#include "host/testing/ManualClock.h"
 
 namespace velmora::mobile::xplat::cellar::fuzz {
 namespace {
@@ -95,7 +95,7 @@ void checkMeasuring(Services& services, const std::string& above, const std::str
 }
 
 void run(const std::string& bytes) {
-  const test::TestClock clock(kNow);
+  const test::ManualClock clock(kNow);
   const Scratch scratch;
   Services services;
   const std::string above = scratch.makeDirectory("above");

@@ -24,8 +24,8 @@
 #include "harness/Fuzzing.h"
 #include "harness/ManifestFile.h"
 #include "harness/Scratch.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar::fuzz {
 namespace {
@@ -184,7 +184,7 @@ void beginAgain(Manifest& manifest) {
 }
 
 void run(const std::string& bytes) {
-  const test::TestClock clock(kNow);
+  const test::ManualClock clock(kNow);
   const Scratch scratch;
   scratch.write("manifest_v1.sqlite", bytes);
   Manifest manifest(scratch);

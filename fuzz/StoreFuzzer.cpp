@@ -29,8 +29,8 @@
 #include "harness/Fuzzing.h"
 #include "harness/Scratch.h"
 #include "harness/StoreDirectory.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar::fuzz {
 namespace {
@@ -340,7 +340,7 @@ std::string keyFrom(ByteReader& input, const std::vector<std::string>& names) {
   return key.find("..") == std::string::npos || key == ".." ? key : "a";  // stays near
 }
 
-void operate(StoreUse& use, ByteReader& input, test::TestClock& clock) {
+void operate(StoreUse& use, ByteReader& input, test::ManualClock& clock) {
   const std::uint8_t operation = input.byte();
   switch (operation % 12) {
     case 0:
@@ -371,7 +371,7 @@ void operate(StoreUse& use, ByteReader& input, test::TestClock& clock) {
 }
 
 void run(ByteReader input) {
-  test::TestClock clock(kNow);
+  test::ManualClock clock(kNow);
   const Scratch scratch;
   const Options options(input);
   StoreUse use(scratch, options, buildStoreDirectory(scratch, input));

@@ -13,7 +13,7 @@ class FileUtils;
 // Keeps a small JSON document of attributes with a directory, in the file "_cellar_extended_attributes" inside it.
 // There is one document for a directory: whoever sets it replaces what others had set. Keeps nothing in memory and
 // takes no lock; callers that write one directory's attributes from several threads keep themselves apart. Never
-// throws: a failure is one error line in the log, and a neutral answer.
+// throws: a failure is one error line in the log, and a neutral result.
 class CELLAR_EXPORT AttributeStore {
  public:
   // The name of the attributes file, which no key and no file of a host's should have.

@@ -22,7 +22,7 @@ struct Node {
   JsonValue value;  // an empty object or array for those
   std::vector<Node> members;
 
-  // The member of that name, the last when there are several; null when there is none or this is no object.
+  // The member of that name, the last when there are several; null when there is none or this is not an object.
   const Node* find(const string& wanted) const {
     for (auto member = members.rbegin(); member != members.rend(); ++member) {
       if (member->name == wanted) return &*member;
@@ -122,7 +122,7 @@ Node parseDocument(const string& json) {
   return document;
 }
 
-// Strict: a number is no boolean, 1.5 and true are no integers.
+// Strict: a number is not a boolean, 1.5 and true are not integers.
 template <class T> T as(const JsonValue& value) { return value.get<T>(); }
 template <> std::int64_t as(const JsonValue& value) { return value.get_ref<const JsonValue::number_integer_t&>(); }
 

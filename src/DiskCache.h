@@ -49,7 +49,7 @@ class CELLAR_EXPORT DiskCache : public PersistentKeyValueStore {
   void pruneBackToNormal(std::function<void()> onSuccess, std::function<void(const std::exception&)> onError,
                          bool survivalMode) override;
 
-  // Null when the cache goes by least recent use.
+  // Null when the cache removes the least recently used first.
   std::shared_ptr<PruneStrategyBase> getPruneStrategy();
 
   // Replaces the stale age (seconds) and the normal size (bytes), from the next expiry and prune on.

@@ -19,7 +19,7 @@ namespace {
 
 constexpr double kClockTicksPerSecond = 1000000.0;
 
-// With 32 bits the clock begins anew every 72 minutes of processor time; the difference is right across that.
+// With 32 bits the clock wraps every 72 minutes of processor time; the difference is right across that.
 double secondsSince(std::clock_t start) {
   const auto now = static_cast<std::make_unsigned_t<std::clock_t>>(std::clock());
   const auto elapsed = now - static_cast<std::make_unsigned_t<std::clock_t>>(start);
@@ -160,7 +160,7 @@ DiskSizeCalculator::Stats DiskSizeCalculator::getCachedStats(const std::string& 
     const std::int64_t timeStamp = integerIn(document, ATTR_TIME_STAMP);
     return timeStamp > 0 && Clock::now() - timeStamp <= staleInterval ? kept : none;
   } catch (const JsonValue::exception&) {
-    return none;  // something else wrote there: measuring again mends it
+    return none;  // something else wrote there: measuring again fixes it
   }
 }
 

@@ -12,7 +12,7 @@ namespace velmora::mobile::xplat::cellar {
 // two operations on one path apart is the callers' business.
 //
 // Every failure is a `FileUtilsIoException` whose description ends in the system's error text and whose code is
-// `errno`. Paths are used as they stand: "/" is the only separator, and nothing is normalised.
+// `errno`. Paths are used as given: "/" is the only separator, and nothing is normalised.
 class CELLAR_EXPORT FileUtils {
  public:
   enum class Type : int { File = 0, SymLink = 1, Directory = 2 };
@@ -42,7 +42,7 @@ class CELLAR_EXPORT FileUtils {
   // The last component, trailing slashes skipped: "b" for "/a/b//". A path without a "/" before it comes back whole.
   virtual std::string basename(const std::string& path);
 
-  // What stands before the last component's slash: "/a" for "/a/b". Empty for "/a", "a" and "".
+  // What comes before the last component's slash: "/a" for "/a/b". Empty for "/a", "a" and "".
   virtual std::string parentPath(const std::string& path);
 
   // The bytes of a regular file. Throws for everything else (a directory, a fifo, a device) and waits for nobody.

@@ -32,7 +32,7 @@ class CELLAR_EXPORT LazyDispatcher : public std::enable_shared_from_this<LazyDis
   // under the dispatcher's lock: it must not come back here).
   void addTask(const std::function<void()>& task, const std::shared_ptr<AsyncExecutor>& executor);
 
-  // Starts the delay anew, cancelling the one that runs.
+  // Restarts the delay, cancelling the one that runs.
   void scheduleDispatch(long delaySeconds);
 
   // Releases all held tasks now. Any thread; calling it again does no harm. When an executor's `dispatch` throws, the

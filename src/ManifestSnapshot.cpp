@@ -24,7 +24,7 @@ namespace {
 
 using Bytes = std::vector<unsigned char>;
 
-constexpr std::size_t kLogHeaderSize = 32;  // changes whenever SQLite begins the write-ahead log anew
+constexpr std::size_t kLogHeaderSize = 32;  // changes whenever SQLite restarts the write-ahead log
 constexpr int kAttempts = 10;
 constexpr int kStatementDoesNotFit = 1;  // SQLite's code for a statement that names what is not there
 
@@ -53,7 +53,7 @@ Bytes headerOf(const Bytes& log) {
 }
 
 // Whether the log was only written on between two readings. Then whatever a checkpoint has moved into the manifest
-// meanwhile still stands in the later reading, too, and manifest and log go together.
+// meanwhile is still in the later reading, too, and manifest and log go together.
 bool isSameLog(const std::optional<Bytes>& earlier, const std::optional<Bytes>& later) {
   if (!earlier || !later) return !earlier && !later;
   return earlier->size() <= later->size() && headerOf(*earlier) == headerOf(*later);
@@ -152,7 +152,7 @@ std::vector<ManifestSnapshot::Record> ManifestSnapshot::records(
   return records;
 }
 
-std::vector<std::string> ManifestSnapshot::damages() const {
+std::vector<std::string> ManifestSnapshot::integrityErrors() const {
   std::vector<std::string> lines;
   try {
     SQLiteStore store(path_);

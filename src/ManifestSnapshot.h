@@ -41,12 +41,12 @@ class CELLAR_EXPORT ManifestSnapshot {
   ManifestSnapshot& operator=(const ManifestSnapshot&) = delete;
 
   // Every record, in no order. Without a metadata factory (null) metadata is left out. Throws
-  // `ManifestPersistenceException` for what `damages` finds. Not an error: an empty file.
+  // `ManifestPersistenceException` for what `integrityErrors` finds. Not an error: an empty file.
   std::vector<Record> records(std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory) const;
 
   // What SQLite's integrity check, or opening the manifest as a store does, finds wrong with it, a line each; empty for
   // a sound one.
-  std::vector<std::string> damages() const;
+  std::vector<std::string> integrityErrors() const;
 
  private:
   const std::shared_ptr<FileUtils> fileUtils_;

@@ -24,7 +24,7 @@ class LarderException;
 //
 //   <store directory>/
 //     manifest_v1.sqlite   the records of all items and the inline values (and SQLite's companions, -wal and -shm)
-//     <key>                the value, for a store with files; the key is the file name as it stands
+//     <key>                the value, for a store with files; the key is the file name, unchanged
 //
 // Threads. Any thread may call. Calls only take their arguments in and return a future: the manifest is used on the
 // work queue and files on the file queue, both the host's and serial. `getAllKeys`, `fetchModificationDate`,
@@ -36,12 +36,12 @@ class LarderException;
 // Errors travel in the futures: `InvalidatedException` after invalidation, `FileUtilsIoException` for files, what a
 // writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (one that ends in
 // the manifest's or the attributes' file name). A manifest that is damaged, or cannot be written, fails nothing: the
-// store is PURGED, all its values go to the trash, the log says so in one line, and work goes on with an empty store.
+// store is PURGED, all its values go to the trash, the log says so in one line, and work continues with an empty store.
 // Where it cannot be purged the operation fails. A manifest that cannot be opened fails the operation at hand, too, and
 // is opened again by the next one.
 //
-// Keys are file names as they stand: one that holds a "/" or is ".." reaches outside the store's directory. Encode what
-// is not under your own control (the host kit has `encodeFileName`). A key that holds a zero byte fails with
+// Keys are used as file names, unchanged: one that holds a "/" or is ".." reaches outside the store's directory. Encode
+// what is not under your own control (the host kit has `encodeFileName`). A key that holds a zero byte fails with
 // `std::invalid_argument`.
 //
 // What survives. The process killed: every value whose future has been fulfilled. Caught in the middle of an overwrite:
@@ -185,7 +185,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   void removeOldestItemIfOverMaxCapacity();
 
   // Deletes the files of what `provider` yields, batch by batch, until a batch is empty. Each batch is asked for on the
-  // work queue when the files of the last one are gone. Then one of the callbacks is called there. No lock is held
+  // work queue when the files of the last one are deleted. Then one of the callbacks is called there. No lock is held
   // around any of the three.
   void deleteFilesInBatches(std::function<const std::vector<DiskCacheItem>()> provider, std::function<void()> onSuccess,
                             std::function<void(const std::exception&)> onError);
@@ -197,7 +197,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Deletes the files on the file queue, in order. One that cannot be deleted is one error line.
   Future<void> deleteBatch(const std::vector<std::string>& paths);
 
-  // Purges the store: its directory goes to the trash, and it goes on empty. Throws when it cannot even begin again,
+  // Purges the store: its directory goes to the trash, and it continues empty. Throws when it cannot even begin again,
   // when the directory cannot be collected (nothing has changed then), and once the store is invalidated.
   void handleCorruptedManifest(const LarderException& error);
 
@@ -209,7 +209,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
 
   // --- Parts ---
 
-  // The manifest, created on first use. What creating it throws is thrown again by later calls that try anew; a
+  // The manifest, created on first use. What creating it throws is thrown; later calls try again. A
   // corrupted one is replaced by an empty one together with all files.
   std::shared_ptr<DiskCacheManifestInterface> getManifest();
 

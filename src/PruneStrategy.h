@@ -10,9 +10,9 @@ namespace velmora::mobile::xplat::cellar {
 struct DiskCacheItem;
 enum class PruneStrategyIdentifier : int;
 
-// Says which of two items of a disk cache goes first when room is needed. Implementations keep no state that changes,
-// or guard it: any thread may compare. Objects are made with std::make_shared of their concrete type, which is what
-// destroys them: none is ever deleted through a base.
+// Says which of two items of a disk cache is removed first when room is needed. Implementations keep no state that
+// changes, or guard it: any thread may compare. Objects are made with std::make_shared of their concrete type, which is
+// what destroys them: none is ever deleted through a base.
 class CELLAR_EXPORT PruneStrategyBase {
  public:
   // True when `a` is to be pruned before `b`. Should be a strict weak order; where it is not, the order of pruning is

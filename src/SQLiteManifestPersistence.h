@@ -55,7 +55,7 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   SQLiteManifestPersistence(const SQLiteManifestPersistence&) = delete;
   SQLiteManifestPersistence& operator=(const SQLiteManifestPersistence&) = delete;
 
-  // Opens the database anew and lets go of the old connection. When opening fails, the old one stays in use. Deletes no
+  // Reopens the database and closes the old connection. When opening fails, the old one remains in use. Deletes no
   // row: the table is empty afterwards only if the caller removed the database file before.
   void clearItems() override;
   void setItem(const DiskCacheItem& item) override;

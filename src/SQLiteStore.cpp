@@ -32,12 +32,12 @@ bool isSuccess(int resultCode) {
   return resultCode == SQLITE_OK || resultCode == SQLITE_ROW || resultCode == SQLITE_DONE;
 }
 
-bool meansDamagedFile(int resultCode) {
+bool isCorruption(int resultCode) {
   return resultCode == SQLITE_INTERNAL || resultCode == SQLITE_CORRUPT || resultCode == SQLITE_FORMAT ||
          resultCode == SQLITE_NOTADB;
 }
 
-// SQLite answers null for a connection without a file, and wants none asked of a null connection.
+// SQLite returns null for a connection without a file, and wants none asked of a null connection.
 std::string fileOf(const std::shared_ptr<sqlite3>& database) {
   const char* const file = database != nullptr ? sqlite3_db_filename(database.get(), "main") : nullptr;
   return file != nullptr ? file : "";
@@ -109,7 +109,7 @@ template <class Bytes> Bytes bytesOf(const std::shared_ptr<sqlite3>& database, s
   return Bytes(first, first + sqlite3_column_bytes(statement, column));
 }
 
-// What stands between the outermost brackets of a CREATE TABLE text.
+// What is between the outermost brackets of a CREATE TABLE text.
 std::string declarationsOf(std::string createTable) {
   const auto closing = createTable.rfind(')');
   if (closing != std::string::npos) createTable.erase(closing);
@@ -147,7 +147,7 @@ std::vector<SQLiteStoreColumn> columnsDeclaredBy(const std::string& createTable)
 void throwSQLiteException(int resultCode, const std::string& message) {
   if (isSuccess(resultCode)) return;
   const std::string text = "SQLite Error #" + std::to_string(resultCode) + ": " + message;
-  if (meansDamagedFile(resultCode)) throw SQLiteStoreCorruptedException(text, resultCode);
+  if (isCorruption(resultCode)) throw SQLiteStoreCorruptedException(text, resultCode);
   throw SQLiteStoreException(text, resultCode);
 }
 

@@ -26,7 +26,7 @@ CELLAR_EXPORT void throwSQLiteException(int resultCode, const std::string& messa
 CELLAR_EXPORT void throwIfSQLiteError(const std::shared_ptr<sqlite3>& database, int resultCode);
 
 // One prepared statement: bind its parameters, call `next` until it says false, and read the columns of each row
-// between. It keeps the connection open even when the store is gone. Moved, never copied. One thread at a time,
+// between. It keeps the connection open even when the store is destroyed. Moved, never copied. One thread at a time,
 // together with its store. Every operation throws SQLiteStoreException (or its corrupted subclass) when SQLite reports
 // an error; one on a cursor that was moved from does so too.
 class CELLAR_EXPORT SQLiteStoreCursor {
@@ -82,8 +82,8 @@ struct CELLAR_EXPORT SQLiteStoreColumn {
 
 // One connection to an SQLite database, open from construction on and closed when the store and all its cursors are
 // gone. The connection has no lock of its own: the store and its cursors are used by one thread at a time. Operations
-// are virtual so that a test or another back end can stand in through a SQLiteStoreFactory. Every operation throws
-// SQLiteStoreException, or SQLiteStoreCorruptedException for a damaged or foreign file.
+// are virtual so that a test or another back end can be used instead, through a SQLiteStoreFactory. Every operation
+// throws SQLiteStoreException, or SQLiteStoreCorruptedException for a damaged or foreign file.
 //
 // The file may be another program's, so what it brings along is not run: triggers do not fire, views cannot be read,
 // and the schema cannot be written but by CREATE, ALTER and the like. A statement has at most a million bytes, a

@@ -35,7 +35,7 @@ class CELLAR_EXPORT StoreDefinition {
                   bool hasVersion, unsigned int version, unsigned int maxSize, bool isCache, bool isManaged);
 
   // Creates the store of this definition over `storePath`. Called by a manager, once per store, with the manager's
-  // temporary directory, its services, a callback to be told the store's size in bytes, and this definition itself in
+  // temporary directory, its services, a callback for the store's size in bytes, and this definition itself in
   // shared ownership. Throws what the file utilities throw; an unmanaged store ignores everything but its path and
   // definition.
   virtual std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,

@@ -34,7 +34,7 @@ class CELLAR_EXPORT StoreDirectoryNameBuilder {
   // The manager's directory name in its area.
   virtual std::string buildStoreManagerName() const;
 
-  // Whether directories of other sessions may stand next to the manager's own.
+  // Whether directories of other sessions may lie next to the manager's own.
   virtual bool hasStaleNamesInParent(const StoreManagerDefinition& manager) const;
 
   // Those of `names` that are managers' directories of sessions, in their order; the current session's own is among

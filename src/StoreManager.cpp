@@ -14,7 +14,7 @@ namespace {
 std::mutex forceCleanseMutex;
 bool forceCleanseAtStart = false;  // guarded by forceCleanseMutex
 
-std::string readable(const std::type_info& type) {
+std::string demangle(const std::type_info& type) {
   int status = 0;
   const std::unique_ptr<char, void (*)(void*)> name(abi::__cxa_demangle(type.name(), nullptr, nullptr, &status),
                                                     &std::free);
@@ -24,7 +24,7 @@ std::string readable(const std::type_info& type) {
 }  // namespace
 
 void detail::throwStoreTypeMismatch(const std::string& identifier, const std::type_info& wanted, const Store& store) {
-  throw std::logic_error("Store '" + identifier + "' is a " + readable(typeid(store)) + ", not a " + readable(wanted) +
+  throw std::logic_error("Store '" + identifier + "' is a " + demangle(typeid(store)) + ", not a " + demangle(wanted) +
                          ".");
 }
 

@@ -197,7 +197,7 @@ void StoreManagerImpl::pruneStoresIfNecessary() {
 std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() {
   const std::lock_guard<std::mutex> lock(mutex_);
   const StoreManagerDefinition& definition = common_.definition();
-  if (pruneInProgress_) noteIfRoundIsOver();  // a store that has gone in the middle of its prune tells nobody
+  if (pruneInProgress_) noteIfRoundIsOver();  // a store that is destroyed in the middle of its prune does not say so
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
   const auto nextPruneTime = lastPruneTime_ + definition.pruneInterval;
   if (lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};

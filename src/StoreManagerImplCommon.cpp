@@ -86,7 +86,7 @@ void StoreManagerImplCommon::noteFailure(Item& item) {
   item.condition.notify_all();
 }
 
-// The directory has gone from under the creator. Whoever waits for the store gets what later callers get: none.
+// The directory was removed under the creator. Whoever waits for the store gets what later callers get: none.
 void StoreManagerImplCommon::abandon(Item& item) {
   {
     const std::lock_guard<std::mutex> lock(item.mutex);
@@ -130,7 +130,7 @@ std::shared_ptr<Store> StoreManagerImplCommon::createStore(const std::string& id
   // Whoever invalidated or closed the manager meanwhile could not see this store. Without waiting: this thread may be
   // the one that the store's queues run on, and there is nothing yet to wait for.
   if (!isValid()) store->invalidateSoon();
-  if (isClosed()) leaveToOthers(*item);
+  if (isClosed()) releaseOwnership(*item);
   return store;
 }
 
@@ -252,15 +252,15 @@ void StoreManagerImplCommon::close() {
     slots = stores_;
   }
   for (const auto& [identifier, item] : slots) {
-    if (const auto store = leaveToOthers(*item)) store->keepUntilIdle();
+    if (const auto store = releaseOwnership(*item)) store->keepUntilIdle();
   }
 }
 
-// Answers the store, whose last owner may be here, to be let go of without the lock.
-std::shared_ptr<Store> StoreManagerImplCommon::leaveToOthers(Item& item) {
+// Returns the store, so that the caller can release what may be the last reference after unlocking.
+std::shared_ptr<Store> StoreManagerImplCommon::releaseOwnership(Item& item) {
   const std::lock_guard<std::mutex> lock(item.mutex);
   if (item.store == nullptr) return nullptr;
-  item.storeOfOthers = item.store;
+  item.weakStore = item.store;
   item.isAbandoned = true;
   return std::exchange(item.store, nullptr);
 }

@@ -35,20 +35,20 @@ class CELLAR_EXPORT StoreManagerImplCommon {
 
   // The slot of one store, shared by the store map and everybody who waits for the store.
   struct CELLAR_EXPORT Item {
-    std::shared_ptr<Store> store;        // empty until the store has been created, and once the manager is closed
-    std::weak_ptr<Store> storeOfOthers;  // in a closed manager: the store, while somebody else holds it
-    std::uint32_t currentSize = 0;       // bytes that the store reported last
-    std::uint32_t maxSize = 0;           // bytes, the definition's
-    std::string name;                    // the definition's
-    bool isPruning = false;              // a prune of the store is under way
-    bool sizeReported = false;           // its first size has been reported
-    bool isAbandoned = false;            // nobody need wait: creating failed beside an invalidation, or it is closed
-    bool hasFailed = false;              // the last attempt to create the store
-    std::mutex mutex;                    // guards all of the above; held by the caller of the below
-    std::condition_variable condition;   // signalled when `store` has been set, creating failed, or it is abandoned
+    std::shared_ptr<Store> store;       // empty until the store has been created, and once the manager is closed
+    std::weak_ptr<Store> weakStore;     // in a closed manager: the store, while somebody else holds it
+    std::uint32_t currentSize = 0;      // bytes that the store reported last
+    std::uint32_t maxSize = 0;          // bytes, the definition's
+    std::string name;                   // the definition's
+    bool isPruning = false;             // a prune of the store is under way
+    bool sizeReported = false;          // its first size has been reported
+    bool isAbandoned = false;           // nobody need wait: creating failed beside an invalidation, or it is closed
+    bool hasFailed = false;             // the last attempt to create the store
+    std::mutex mutex;                   // guards all of the above; held by the caller of the below
+    std::condition_variable condition;  // signalled when `store` has been set, creating failed, or it is abandoned
 
     // The store, if it has been created and is still there.
-    std::shared_ptr<Store> getStore() const { return store != nullptr ? store : storeOfOthers.lock(); }
+    std::shared_ptr<Store> getStore() const { return store != nullptr ? store : weakStore.lock(); }
   };
 
   // Moves a temporary directory that an earlier run left behind to the trash and creates a fresh one, with the manager
@@ -141,7 +141,7 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   void discard(StoreMap slots);
   static void abandon(Item& item);
   static void noteFailure(Item& item);
-  static std::shared_ptr<Store> leaveToOthers(Item& item);
+  static std::shared_ptr<Store> releaseOwnership(Item& item);
   bool isClosed();
   bool isMarkedForTrashing(const std::string& storePath);
 

@@ -44,7 +44,7 @@ class TrashCollector::Trash {
   Trash(const std::string& path, const std::shared_ptr<FileUtils>& fileUtils)
       : path_(path), fileUtils_(fileUtils), random_(static_cast<std::uint64_t>(Clock::now())) {}
 
-  // One pass: until the trash is gone, what is left in it cannot be deleted, or the pass is interrupted. Never throws
+  // One pass: until the trash is empty, what is left in it cannot be deleted, or the pass is interrupted. Never throws
   // for a failed file operation. Called from within a pass, by a file layer that collects something on a queue that
   // runs tasks at once, it leaves that to the pass.
   void collect();
@@ -112,7 +112,7 @@ class TrashCollector::Trash {
     if (fileUtils_->isSymLink(path_)) throw FileUtilsIoException(0, "Trash directory \"" + path_ + "\" is a link");
   }
 
-  // One that goes at the moment when it is looked at seems to be a file in the way.
+  // One that is removed at the moment when it is looked at seems to be a file in the way.
   void makeDirectory() {
     try {
       fileUtils_->createDirectory(path_, true);
@@ -127,7 +127,7 @@ class TrashCollector::Trash {
   const std::shared_ptr<FileUtils> fileUtils_;
   std::mutex passMutex_;  // held by a pass: two at once would take each other's files away
   std::atomic<std::thread::id> passThread_{};
-  std::recursive_mutex moveMutex_;  // held where a move begins, and while the directory goes; recursive because a
+  std::recursive_mutex moveMutex_;  // held where a move begins, and while the directory is removed; recursive because a
                                     // substituted file layer may collect something then
   std::atomic<unsigned int> movesUnderWay_{0};
   std::atomic<unsigned int> moves_{0};
@@ -324,7 +324,7 @@ bool TrashCollector::removeFilesWithFilter(const std::string& path,
     if (!fileUtils_->isSymLink(path) && fileUtils_->isDirectory(path)) {
       bool allRemoved = true;
       for (const FileUtils::Info& entry : fileUtils_->listDirectory(path)) {
-        if (fileUtils_->isSymLink(path)) break;  // put there meanwhile: it goes as a link
+        if (fileUtils_->isSymLink(path)) break;  // put there meanwhile: it is removed as a link
         allRemoved = removeFilesWithFilter(entry.path, filter) && allRemoved;
       }
       if (!allRemoved) return false;

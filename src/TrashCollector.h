@@ -14,7 +14,7 @@ class FileUtils;
 
 // Makes directory trees vanish at once and frees their space later. The trash is a directory on the same file system as
 // what is collected; it exists only while there is something in it. Shared by all managers and stores; any thread may
-// call. Never throws for a failed file operation: it answers false, or logs one error line. Links are removed as links
+// call. Never throws for a failed file operation: it returns false, or logs one error line. Links are removed as links
 // and never followed, so nothing outside a collected tree is touched. A link in the place of the trash directory itself
 // is refused: nothing is collected then, and no pass deletes anything.
 //
@@ -22,8 +22,8 @@ class FileUtils;
 // stays in the trash, from where deleting it failed, and the trash directory with it; everything else in the trash is
 // deleted all the same. The first failure of a pass is its one error line, and the next pass tries again.
 //
-// What survives: a collected path is gone from its place even when the process is killed right after the call; what is
-// still in the trash then is removed by the next pass of a collector over the same trash directory.
+// What survives: a collected path is removed from its place even when the process is killed right after the call; what
+// is still in the trash then is removed by the next pass of a collector over the same trash directory.
 class CELLAR_EXPORT TrashCollector {
  public:
   // With a task queue factory, deletion runs on a queue of the collector's own; what is still queued when the collector

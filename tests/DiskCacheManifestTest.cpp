@@ -26,19 +26,19 @@
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
 #include "PruneStrategy.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::LogCapture;
+using test::ManualClock;
 using test::ManualExecutor;
 using test::TemporaryDirectory;
-using test::TestClock;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::SizeIs;
@@ -402,7 +402,7 @@ TEST_F(DiskCacheManifestTest, AKeyRemovedBeforeLoadingIsGoneFromTheMediumWhether
 }
 
 TEST_F(DiskCacheManifestTest, AnItemUsedBeforeLoadingIsReadAndDatedNow) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   medium_->put(item("a", 7, 1));
   create();
 
@@ -764,7 +764,7 @@ TEST_F(DiskCacheManifestTest, AnInlineValueForAKeyWithoutARecordMakesNone) {
 // --- Access dates ---
 
 TEST_F(DiskCacheManifestTest, UsingAnItemDatesItInMemoryAndWritesNothingYet) {
-  TestClock clock(5000);
+  ManualClock clock(5000);
   createLoaded();
   fill(1);
   medium_->forgetCalls();
@@ -783,7 +783,7 @@ TEST_F(DiskCacheManifestTest, UsingAnItemDatesItInMemoryAndWritesNothingYet) {
 }
 
 TEST_F(DiskCacheManifestTest, FiveHundredAndTwelveUsedItemsWaitForTheTimer) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(512);
   medium_->forgetCalls();
@@ -797,7 +797,7 @@ TEST_F(DiskCacheManifestTest, FiveHundredAndTwelveUsedItemsWaitForTheTimer) {
 }
 
 TEST_F(DiskCacheManifestTest, TheFiveHundredAndThirteenthSendsAllOfThemInOneTask) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(513);
   medium_->forgetCalls();
@@ -825,7 +825,7 @@ TEST_F(DiskCacheManifestTest, TheFiveHundredAndThirteenthSendsAllOfThemInOneTask
 }
 
 TEST_F(DiskCacheManifestTest, AnExecutorThatTakesNoTaskLosesNoDate) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(513);
   medium_->forgetCalls();
@@ -973,7 +973,7 @@ TEST_F(DiskCacheManifestTest, TheTimerIsArmedAgainWhenDatesCannotBeWritten) {
 // --- Dates that cannot be written ---
 
 TEST_F(DiskCacheManifestTest, DatesThatCannotBeWrittenAreOneErrorLineAndWaitForTheNextTime) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(5);
   use(5);
@@ -996,7 +996,7 @@ TEST_F(DiskCacheManifestTest, DatesThatCannotBeWrittenAreOneErrorLineAndWaitForT
 }
 
 TEST_F(DiskCacheManifestTest, AnItemUsedAgainBeforeTheNextTimeKeepsItsNewerDate) {
-  TestClock clock(5000);
+  ManualClock clock(5000);
   createLoaded();
   fill(1);
   use(1);
@@ -1012,7 +1012,7 @@ TEST_F(DiskCacheManifestTest, AnItemUsedAgainBeforeTheNextTimeKeepsItsNewerDate)
 }
 
 TEST_F(DiskCacheManifestTest, AFailedTaskOfFiveHundredAndThirteenIsKeptToo) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(513);
   use(513);
@@ -1053,7 +1053,7 @@ class DiskCacheManifestFlush : public DiskCacheManifestTest {
   // As many as the next use of another item sends off.
   static constexpr int kItems = 2 * 513;
 
-  TestClock clock_{5000};
+  ManualClock clock_{5000};
 };
 
 TEST_F(DiskCacheManifestFlush, ThatFailedIsNotTriedAgainByFetches) {
@@ -1222,7 +1222,7 @@ class WaitingDates : public DiskCacheManifestTest {
     return medium_->calls("updateLastAccessDate");
   }
 
-  TestClock clock_{5000};
+  ManualClock clock_{5000};
 };
 
 TEST_F(WaitingDates, SettingTheItemDropsIts) {
@@ -1365,7 +1365,7 @@ TEST_F(DiskCacheManifestTest, ATimerTaskDoesNotKeepTheManifestAlive) {
 }
 
 TEST_F(DiskCacheManifestTest, TheLastReferenceMayGoWhileTheTimerTaskRuns) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(2);
   use(2);
@@ -1421,7 +1421,7 @@ TEST_F(DiskCacheManifestTest, InvalidationDuringAFlushIsTheEndOfTheTimer) {
 }
 
 TEST_F(DiskCacheManifestTest, DestroyingAnInvalidatedManifestWritesNothing) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(1);
   use(1);
@@ -1499,7 +1499,7 @@ TEST_F(DiskCacheManifestTest, PrunedRecordsComeWhole) {
 }
 
 TEST_F(DiskCacheManifestTest, UsingAnItemMovesItToTheEndOfTheOrder) {
-  const TestClock clock(5000);
+  const ManualClock clock(5000);
   createLoaded();
   fill(3);
   manifest_->updateLastAccessDate("0");
@@ -1822,7 +1822,7 @@ TEST_F(DiskCacheManifestOnDisk, RecordsAndInlineValuesAreFoundAgainAfterARestart
 }
 
 TEST_F(DiskCacheManifestOnDisk, AccessDatesReachTheDatabaseWithTheTimerAndAtTheEnd) {
-  TestClock clock(5000);
+  ManualClock clock(5000);
   open();
   manifest_->setItem(item("a", 1, 1));
   manifest_->updateLastAccessDate("a");

@@ -28,12 +28,12 @@
 #include "PruneStrategy.h"
 #include "TrashCollector.h"
 #include "host/testing/FaultyFileUtils.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -42,11 +42,11 @@ using test::EventLog;
 using test::FaultyFileUtils;
 using test::Latch;
 using test::LogCapture;
+using test::ManualClock;
 using test::ManualExecutor;
 using test::ManualQueueFactory;
 using test::Operation;
 using test::TemporaryDirectory;
-using test::TestClock;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::Not;
@@ -233,7 +233,7 @@ class DiskCacheTest : public testing::Test {
   std::string storePath() const { return directory_.file("store"); }
 
   TemporaryDirectory directory_;
-  TestClock clock_{1'700'000'000};
+  ManualClock clock_{1'700'000'000};
   std::shared_ptr<FaultyFileUtils> files_ = std::make_shared<FaultyFileUtils>();
   std::shared_ptr<ManualQueueFactory> trashQueues_ = std::make_shared<ManualQueueFactory>();
   std::shared_ptr<TrashCollector> trash_ =

@@ -17,14 +17,14 @@
 #include "DiskCacheManifest.h"
 #include "ExtendedMetadata.h"
 #include "PruneStrategy.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
+using test::ManualClock;
 using test::ManualExecutor;
-using test::TestClock;
 
 using Items = std::map<std::string, DiskCacheItem>;
 using ItemPointers = std::vector<std::unique_ptr<DiskCacheItem>>;
@@ -204,7 +204,7 @@ class EvictionOrder : public testing::TestWithParam<Case> {
 
   std::mt19937 random_{20261121};
   std::int64_t now_ = 1'700'000'000;
-  TestClock clock_{static_cast<std::time_t>(now_)};
+  ManualClock clock_{static_cast<std::time_t>(now_)};
   const Comparator before_;
   const Comparator byDate_;
   Items items_;

@@ -358,7 +358,7 @@ TEST_F(SQLiteManifestPersistenceOfAnother, ThatCallsFunctionsIsDamagedToTheSnaps
   run(path, "PRAGMA ignore_check_constraints = ON;" + kRow);
   const ManifestSnapshot snapshot(directory.path(), directory.makeDirectory("temporary"),
                                   std::make_shared<FileUtils>());
-  EXPECT_THAT(snapshot.damages(), ElementsAre("Invalid schema."));
+  EXPECT_THAT(snapshot.integrityErrors(), ElementsAre("Invalid schema."));
   EXPECT_THROW(snapshot.records(nullptr), ManifestCorruptedException);
 }
 

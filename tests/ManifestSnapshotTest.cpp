@@ -128,7 +128,7 @@ TEST_F(ManifestSnapshotTest, ChangesNothingInTheStoresDirectory) {
 
   const auto before = traceOf(directory_, "store");
   EXPECT_THAT(records(), ElementsAre("key key 7 0 10 20 -"));
-  EXPECT_THAT(take()->damages(), IsEmpty());
+  EXPECT_THAT(take()->integrityErrors(), IsEmpty());
   EXPECT_EQ(traceOf(directory_, "store"), before);
 }
 
@@ -145,7 +145,7 @@ TEST_F(ManifestSnapshotTest, LeavesNothingInTheTemporaryDirectory) {
     const auto snapshot = take();
     EXPECT_EQ(directory_.names("temporary").size(), 1U);
     (void)snapshot->records(nullptr);
-    EXPECT_THAT(snapshot->damages(), IsEmpty());
+    EXPECT_THAT(snapshot->integrityErrors(), IsEmpty());
   }
   EXPECT_THAT(directory_.names("temporary"), IsEmpty());
 }
@@ -191,25 +191,25 @@ TEST_F(ManifestSnapshotTest, ReadsTheFirstVersionOfTheTableAndLeavesItAsItIs) {
 TEST_F(ManifestSnapshotTest, OfAnEmptyFileHasNoRecordsAndNoDamage) {
   directory_.write("store/" + ManifestSnapshot::manifestName, "");
   EXPECT_THAT(records(), IsEmpty());
-  EXPECT_THAT(take()->damages(), IsEmpty());
+  EXPECT_THAT(take()->integrityErrors(), IsEmpty());
 }
 
 TEST_F(ManifestSnapshotTest, OfSomethingElseThanADatabaseIsDamaged) {
   directory_.write("store/" + ManifestSnapshot::manifestName, std::string(4096, 'x'));
   EXPECT_THROW(take()->records(nullptr), ManifestCorruptedException);
-  EXPECT_THAT(take()->damages(), ElementsAre("SQLite Error #26: file is not a database"));
+  EXPECT_THAT(take()->integrityErrors(), ElementsAre("SQLite Error #26: file is not a database"));
 }
 
 TEST_F(ManifestSnapshotTest, OfAForeignTableIsDamaged) {
   run("CREATE TABLE LarderManifest (key TEXT, last_access_date TEXT);");
   EXPECT_THROW(take()->records(nullptr), ManifestCorruptedException);
-  EXPECT_THAT(take()->damages(), ElementsAre("Invalid schema."));
+  EXPECT_THAT(take()->integrityErrors(), ElementsAre("Invalid schema."));
 }
 
 TEST_F(ManifestSnapshotTest, OfATableWithoutDatesIsDamaged) {
   run("CREATE TABLE LarderManifest (key TEXT, name TEXT);");
   EXPECT_THROW(take()->records(nullptr), ManifestPersistenceException);
-  EXPECT_THAT(take()->damages(), ElementsAre(testing::HasSubstr("last_access_date")));
+  EXPECT_THAT(take()->integrityErrors(), ElementsAre(testing::HasSubstr("last_access_date")));
 }
 
 TEST_F(ManifestSnapshotTest, FindsWhatTheIntegrityCheckFinds) {
@@ -224,7 +224,7 @@ TEST_F(ManifestSnapshotTest, FindsWhatTheIntegrityCheckFinds) {
   ASSERT_GT(bytes.size(), 4 * pageSize);
   for (std::size_t i = bytes.size() - pageSize; i < bytes.size(); ++i) bytes[i] = 'x';
   directory_.write("store/" + ManifestSnapshot::manifestName, bytes);
-  EXPECT_THAT(take()->damages(), testing::Not(IsEmpty()));
+  EXPECT_THAT(take()->integrityErrors(), testing::Not(IsEmpty()));
 }
 
 // --- Beside a running store ---
@@ -259,7 +259,7 @@ TEST_F(ManifestSnapshotTest, IsTakenAgainWhenACheckpointCameInBetween) {
   const ManifestSnapshot snapshot(directory_.file("store"), directory_.file("temporary"), files);
   EXPECT_TRUE(isDone);
   EXPECT_EQ(snapshot.records(nullptr).size(), 2U);
-  EXPECT_THAT(snapshot.damages(), IsEmpty());
+  EXPECT_THAT(snapshot.integrityErrors(), IsEmpty());
 }
 
 TEST_F(ManifestSnapshotTest, IsTakenAgainWhenAnEmptyLogHasBegunMeanwhile) {

@@ -15,9 +15,9 @@
 #include "DiskSizeCalculator.h"
 #include "TrashCollector.h"
 #include "host/testing/FaultyFileUtils.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "support/TemporaryDirectory.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -98,7 +98,7 @@ TEST_F(APlantedLink, MetByTheDeletionOfATreeIsDeletedAsALink) {
 }
 
 TEST_F(APlantedLink, UnderTheNextNameInTheTrashIsLeftAloneThoughItLeadsNowhere) {
-  const test::TestClock clock(1'234'567);
+  const test::ManualClock clock(1'234'567);
   std::mt19937_64 random(1'234'567U);
   char name[17];
   ASSERT_EQ(std::snprintf(name, sizeof name, "%016" PRIx64, static_cast<std::uint64_t>(random())), 16);

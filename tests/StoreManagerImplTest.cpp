@@ -19,10 +19,10 @@
 
 #include "LarderException.h"
 #include "LazyDispatcher.h"
+#include "host/testing/ManualClock.h"
 #include "support/Barrier.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
-#include "support/TestClock.h"
 #include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -85,7 +85,7 @@ class StoreManagerImplTest : public testing::Test, protected test::ManagerServic
 
   static string ioFailure(int code) { return FileUtilsIoException(code, std::generic_category().message(code)).what(); }
 
-  test::TestClock clock_{kNow};
+  test::ManualClock clock_{kNow};
   test::LogCapture log_;
   std::shared_ptr<test::ManualQueueFactory> lazyQueues_ = std::make_shared<test::ManualQueueFactory>();
   std::shared_ptr<LazyDispatcher> dispatcher_;

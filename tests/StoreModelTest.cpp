@@ -36,9 +36,9 @@
 #include "PersistentKeyValueStore.h"
 #include "PruneStrategy.h"
 #include "TrashCollector.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "support/LogCapture.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -46,9 +46,9 @@ namespace {
 namespace fs = std::filesystem;
 
 using test::LogCapture;
+using test::ManualClock;
 using test::ManualExecutor;
 using test::ManualQueueFactory;
-using test::TestClock;
 
 using Bytes = std::vector<unsigned char>;
 using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
@@ -880,7 +880,7 @@ class SettledSequence {
   Script& script_;
   Setup setup_;
   ScratchDirectory directory_;
-  TestClock clock_{kStart};
+  ManualClock clock_{kStart};
   std::int64_t now_ = kStart;
   std::int64_t lastInventedDate_ = 500'000'000;
   Items items_;
@@ -1360,7 +1360,7 @@ class InterleavedSequence {
   const Setup setup_;
   const bool isCorrupted_;
   ScratchDirectory directory_;
-  TestClock clock_{kStart};
+  ManualClock clock_{kStart};
   std::map<std::string, History> histories_;
   unsigned int underWay_ = 0;
   unsigned int deletionsUnderWay_ = 0;

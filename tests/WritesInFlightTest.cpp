@@ -33,10 +33,10 @@ using test::bytesOf;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
+using test::ManualClock;
 using test::ManualQueueFactory;
 using test::MemoryMedium;
 using test::MemoryPersistence;
-using test::TestClock;
 using test::textOf;
 using test::told;
 using test::watch;
@@ -424,7 +424,7 @@ struct Scenario {
 // One way of running a script: each choice is who takes the next step, the caller or one of the queues.
 class Performance {
  public:
-  Performance(const Scenario& scenario, TestClock& clock) : scenario_(scenario), model_(scenario.before) {
+  Performance(const Scenario& scenario, ManualClock& clock) : scenario_(scenario), model_(scenario.before) {
     const auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_),
                                                               std::make_shared<test::ManualExecutor>(), nullptr);
     store_ = DiskCache::createDiskCache("store", "", "larder", scenario.capacity, 1000, 2, 2, false, queues_, nullptr,

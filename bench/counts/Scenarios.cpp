@@ -16,7 +16,7 @@
 #include "counts/Scenario.h"
 #include "floors/FileFloor.h"
 #include "floors/ManifestFloor.h"
-#include "support/TestClock.h"
+#include "host/testing/ManualClock.h"
 #include "support/Values.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
@@ -71,7 +71,7 @@ class CacheScenario : public Scenario {
   }
 
  private:
-  const test::TestClock clock_{kNow};
+  const test::ManualClock clock_{kNow};
   const std::string directory_;
   test::ManualQueueFactory queues_;
   std::shared_ptr<DiskCache> cache_;
@@ -164,7 +164,7 @@ class Events : public Scenario {
   void verify() override { throwUnless(events_ == kOperations, "not everything was reported"); }
 
  private:
-  const test::TestClock clock_{kNow};
+  const test::ManualClock clock_{kNow};
   std::size_t events_ = 0;
   const AnalyticsEventReporter reporter_{std::make_unique<Sink>(events_)};
 };

@@ -18,9 +18,11 @@ bool aFullDiskIsToldToTheCaller(const std::string& directory) {
   const auto files = std::make_shared<cellar::test::FaultyFileUtils>();
   const auto queues = std::make_shared<cellar::test::ManualQueueFactory>();
   const auto trash = std::make_shared<cellar::TrashCollector>(directory + "/trash", files, nullptr, queues);
-  const auto letters = cellar::PersistentKeyValueStore::createPersistentKeyValueStore(
-      directory + "/letters", directory + "/tmp", "letters", {}, 3600, false, queues, trash, nullptr, nullptr, files,
-      nullptr, 50);
+  cellar::KeyValueStoreOptions options;
+  options.directory = directory + "/letters";
+  options.temporaryDirectory = directory + "/tmp";
+  options.name = "letters";
+  const auto letters = cellar::PersistentKeyValueStore::create(options, {queues, trash, files, nullptr});
   files->failNext(cellar::test::Operation::WriteFile, ENOSPC);
   cellar::Future<void> stored = letters->store("first", {'h', 'i'});
   queues->runAll();

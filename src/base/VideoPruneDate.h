@@ -6,7 +6,7 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-// By what date the video strategy goes for an item with this metadata, with its tunables as they are now.
+// The date by which the video strategy orders an item with this metadata, with its tunables as they are now.
 std::int32_t videoPruneDate(std::int32_t lastAccessDate, const VideoDownloadExtendedMetadata& metadata);
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -13,7 +13,7 @@ namespace velmora::mobile::xplat::cellar {
 
 struct FileWrite;
 
-// The file queue of a store, which remembers of each write which one stands right behind it: a task that has to wait
+// The file queue of a store, which remembers of each write which one comes right behind it: a task that has to wait
 // for the manifest anyway writes their files meanwhile. Nothing else is ever overtaken. Any thread may call.
 class FileQueue {
  public:
@@ -37,7 +37,7 @@ class FileQueue {
 
   const std::shared_ptr<AsyncExecutor> queue_;
   std::mutex mutex_;               // guards the one below, and `next` of writes
-  std::weak_ptr<FileWrite> last_;  // null once another task stands behind it
+  std::weak_ptr<FileWrite> last_;  // null once another task is behind it
 };
 
 }  // namespace velmora::mobile::xplat::cellar

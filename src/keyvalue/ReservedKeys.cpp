@@ -12,7 +12,7 @@ namespace velmora::mobile::xplat::cellar {
 
 namespace {
 
-// The names that stand beside the values. Built on first use: one of them is another file's constant.
+// The names of what lies beside the values. Built on first use: one of them is another file's constant.
 const std::array<std::string, 5>& reservedNames() {
   static const std::string manifest(kManifestFileName);
   static const std::array<std::string, 5> names = {manifest, manifest + "-journal", manifest + "-wal",

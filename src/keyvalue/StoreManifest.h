@@ -61,7 +61,7 @@ class StoreManifest {
   // The second half of a purge. On a full disk it can fail; the next operation then tries it again.
   void finishPurge(const StoreLock& lock);
 
-  // The total bytes of all items; empty when nobody is to be told it, and before the manifest is loaded. Any thread.
+  // The total bytes of all items; empty when nobody wants to know it, and before the manifest is loaded. Any thread.
   std::optional<std::uint32_t> totalToReport();
 
   // Tells the size callback, on the work queue. Any thread.

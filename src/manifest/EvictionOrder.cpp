@@ -18,7 +18,7 @@ const ManifestRecord* EvictionOrder::first() {
     const std::int32_t date = dateOf_(*front.record);
     if (date <= front.date) return front.record;
     front.date = date;
-    front.turn = turns_++;
+    front.turn = nextSequence_++;
     moveDown(0);
   }
   return nullptr;
@@ -30,7 +30,7 @@ void EvictionOrder::reserveOneMore() {
 }
 
 void EvictionOrder::added(ManifestRecord& record) {
-  heap_.push_back({dateOf_(record), turns_++, &record});
+  heap_.push_back({dateOf_(record), nextSequence_++, &record});
   moveUp(heap_.size() - 1);
 }
 
@@ -40,7 +40,7 @@ void EvictionOrder::changed(const ManifestRecord& record) {
   const std::int32_t date = dateOf_(record);
   if (date >= entry.date) return;
   entry.date = date;
-  entry.turn = turns_++;
+  entry.turn = nextSequence_++;
   moveUp(record.*place_);
 }
 

@@ -56,7 +56,7 @@ class EvictionOrder {
   const Date dateOf_;
   const Place place_;
   std::vector<Entry> heap_;
-  std::uint32_t turns_ = 0;  // given out so far
+  std::uint32_t nextSequence_ = 0;  // given out so far
 };
 
 }  // namespace velmora::mobile::xplat::cellar

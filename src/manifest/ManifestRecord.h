@@ -36,8 +36,8 @@ class ManifestRecord {
   std::int32_t lastAccessDate = 0;
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
 
-  std::uint32_t placeByAccessDate = 0;  // kept by the two orders of eviction
-  std::uint32_t placeByPriority = 0;
+  std::uint32_t accessDateIndex = 0;  // kept by the two orders of eviction
+  std::uint32_t priorityIndex = 0;
 
  private:
   const std::uint32_t keyLength_ : 31;

@@ -10,7 +10,7 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 // Yields records in the order of a comparator, one by one. A heap: taking the first few of many does not sort the rest,
-// and with a comparator that is no consistent order, which a host's may be, it still yields every record once. (The
+// and with a comparator that is not a consistent order, which a host's may be, it still yields every record once. (The
 // standard algorithms are undefined then.)
 class ComparedRecords {
  public:
@@ -65,7 +65,7 @@ ManifestRecords::ManifestRecords(std::shared_ptr<PruneStrategyBase> strategy)
     : strategy_(std::move(strategy)),
       isVideoStrategy_(isExactly<VideoDownloadPruneStrategy>(strategy_.get())),
       isOwnStrategy_(strategy_ != nullptr && !isVideoStrategy_ && !isExactly<LRUPruneStrategy>(strategy_.get())),
-      byAccessDate_(accessDateOf, &ManifestRecord::placeByAccessDate) {}
+      byAccessDate_(accessDateOf, &ManifestRecord::accessDateIndex) {}
 
 std::vector<std::string> ManifestRecords::keys() const {
   std::vector<std::string> keys;

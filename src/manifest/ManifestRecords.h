@@ -20,7 +20,7 @@ class PruneStrategyBase;
 // by its manifest. Pointers to a record are good until it is replaced or removed; what changes one goes through here.
 class ManifestRecords {
  public:
-  // Yields the record that is to go next; null when there are no more. Each is removed before the next is asked for.
+  // Yields the record to remove next; null when there are no more. Each is removed before the next is asked for.
   using Next = std::function<const ManifestRecord*()>;
 
   // Null: least recently used first.

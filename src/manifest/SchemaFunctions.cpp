@@ -51,7 +51,7 @@ class Scratch {
 // pair around its columns, one around an expression and one for the call; an index one for its columns and one for the
 // call.
 std::vector<std::string> statementsWithRoomForCalls(SQLiteStore& store, const std::string& table) {
-  SQLiteStoreCursor made = store.SQLiteStore::cursor(  // not what may stand in for it in a derived class
+  SQLiteStoreCursor made = store.SQLiteStore::cursor(  // not its override in a derived class
       "SELECT sql, type = 'table' FROM sqlite_master "
       "WHERE tbl_name = ?1 COLLATE NOCASE AND type <> 'trigger' AND type <> 'view'");
   made.bind<std::string>(1, table);

@@ -8,7 +8,7 @@ namespace velmora::mobile::xplat::cellar {
 
 // The order of eviction that the video strategy gives, kept like the one by access date. It is kept as dates, which
 // takes metadata with every record, or with none: the strategy compares an item that has some with one that has none by
-// their access dates, and what comes out of that is no order to keep.
+// their access dates, and the result is not an order to keep.
 class VideoEvictionOrder {
  public:
   enum class Basis { AccessDate, Priority, Comparison };
@@ -28,7 +28,7 @@ class VideoEvictionOrder {
   void clear();
 
  private:
-  EvictionOrder order_ = {dateOf, &ManifestRecord::placeByPriority};
+  EvictionOrder order_ = {dateOf, &ManifestRecord::priorityIndex};
   std::size_t recordsWithMetadata_ = 0;
   int priorityWeight_ = 0;  // the host's tunables as they were last seen
   int highPriorityVideoSecondCutoff_ = 0;

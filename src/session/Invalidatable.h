@@ -4,7 +4,7 @@
 
 namespace velmora::mobile::xplat::session {
 
-// Something that holds data of a session and can be told that the session is over.
+// Something that holds data of a session and can be notified that the session is over.
 class CELLAR_EXPORT Invalidatable {
  public:
   virtual ~Invalidatable() = default;

@@ -8,12 +8,12 @@
 #include <string>
 #include <vector>
 
+#include "host/testing/ManualClock.h"
 #include "support/FaultyVfs.h"
 #include "support/KeyValueStoreFixture.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 #include "support/ShortPauses.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 
@@ -125,7 +125,7 @@ class Life {
 
   const std::string root_;
   const Hardship hardship_;
-  TestClock clock_{2'000'000'000};
+  ManualClock clock_{2'000'000'000};
   ShortPauses pauses_;
   LogCapture log_;
   std::map<std::string, Keys> memory_;                   // by store

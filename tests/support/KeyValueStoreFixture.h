@@ -25,13 +25,13 @@
 #include "PersistentKeyValueStore.h"
 #include "TrashCollector.h"
 #include "host/testing/FaultyFileUtils.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "host/testing/RecordingAnalytics.h"
 #include "support/FaultyManifest.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 #include "support/TemporaryDirectory.h"
-#include "support/TestClock.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 
@@ -343,7 +343,7 @@ class KeyValueStoreFixture : public testing::Test {
   }
 
   Options options;
-  TestClock clock{kStart};
+  ManualClock clock{kStart};
   TemporaryDirectory directory;
   std::shared_ptr<FaultyFileUtils> files = std::make_shared<FaultyFileUtils>();
   std::shared_ptr<EventLog> events = std::make_shared<EventLog>();

@@ -18,9 +18,9 @@
 #include "FileUtils.h"
 #include "TrashCollector.h"
 #include "host/Await.h"
+#include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "support/TemporaryDirectory.h"
-#include "support/TestClock.h"
 #include "tune/Access.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -96,7 +96,7 @@ class RealCache {
     return host::await(std::move(future));
   }
 
-  test::TestClock clock_{1'000'000};
+  test::ManualClock clock_{1'000'000};
   test::TemporaryDirectory directory_;
   std::shared_ptr<test::ManualQueueFactory> queues_ = std::make_shared<test::ManualQueueFactory>();
   std::shared_ptr<DiskCache> cache_;

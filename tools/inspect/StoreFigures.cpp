@@ -192,7 +192,7 @@ StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configur
     return store;
   }
   const ManifestSnapshot snapshot(place.path, context.temporaryDirectory, std::make_shared<UntouchedFiles>());
-  store.damages = snapshot.damages();
+  store.damages = snapshot.integrityErrors();
   if (!store.damages.empty()) {
     useFiles(values, context, store);
     return store;

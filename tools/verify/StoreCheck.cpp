@@ -32,7 +32,7 @@ class StoreCheck {
   StoreCheck(const std::string& directory, OnFile onFile) : directory_(directory), onFile_(std::move(onFile)) {}
 
   Findings check(const ManifestSnapshot& snapshot) {
-    const auto damages = snapshot.damages();
+    const auto damages = snapshot.integrityErrors();
     if (!damages.empty()) {
       Finding finding = make(Finding::Kind::DamagedManifest, ManifestSnapshot::manifestName);
       finding.detail = damages.front();
