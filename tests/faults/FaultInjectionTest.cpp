@@ -30,6 +30,12 @@ std::size_t openDescriptors() {
   return static_cast<std::size_t>(std::distance(begin(descriptors), end(descriptors)));
 }
 
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr std::size_t kStrides = 4;  // a life takes several times as long there
+#else
+constexpr std::size_t kStrides = 1;
+#endif
+
 // What is to fail in a life, and how often.
 struct Faults {
   std::string name;
@@ -58,7 +64,7 @@ class FaultInjection : public testing::Test {
     std::size_t met = 0;
     std::size_t lives = 0;
     Places places;
-    const std::size_t stride = std::getenv("CELLAR_EVERY_FAULT") != nullptr ? 1 : faults.stride;
+    const std::size_t stride = std::getenv("CELLAR_EVERY_FAULT") != nullptr ? 1 : faults.stride * kStrides;
     for (std::size_t n = 1; !HasFailure(); n += stride) {
       const testing::ScopedTrace trace(__FILE__, __LINE__, faults.name + ", n = " + std::to_string(n));
       const std::size_t metNow = live(faults, n, places);
