@@ -225,6 +225,7 @@ TEST_F(Expiry, ThatFailsLogsAndComesAgainInAnHour) {
   ASSERT_TRUE(fire(300));
   settle();
   ASSERT_THAT(errorLines(log), ElementsAre(std::string("Failed to delete stale items: ") + unwritable.what()));
+  EXPECT_EQ(log.lines().front().file, "PersistentKeyValueStore.cpp");
   EXPECT_THAT(work().armedDelays(), ElementsAre(3600 * kSecond));
 }
 
@@ -239,6 +240,7 @@ TEST_F(Expiry, WhoseFilesCannotBeDeletedLogsEachAndIsNoFailure) {
   settle();
   const FileUtilsIoException failure(EACCES, std::generic_category().message(EACCES));
   ASSERT_THAT(errorLines(log), ElementsAre("Failed to delete file at \"" + pathOf("a") + "\" " + failure.what()));
+  EXPECT_EQ(log.lines().front().file, "PersistentKeyValueStore.cpp");
   EXPECT_THAT(valueFiles(), ElementsAre("a"));
   EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
 }
@@ -458,6 +460,7 @@ TEST_F(Capacity, WhoseEvictedFileCannotBeDeletedLogsAndStoresAllTheSame) {
   put("b", "2");
   const FileUtilsIoException failure(EACCES, std::generic_category().message(EACCES));
   ASSERT_THAT(errorLines(log), ElementsAre(std::string("Failed to remove the oldest item ") + failure.what()));
+  EXPECT_EQ(log.lines().front().file, "PersistentKeyValueStore.cpp");
   EXPECT_EQ(get("b"), "2");
 }
 

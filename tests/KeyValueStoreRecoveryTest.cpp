@@ -43,6 +43,7 @@ class RecoveryFixture : public KeyValueStoreFixture {
   // The store has begun again, said so once, and works.
   void expectPurged(const LogCapture& log, const std::exception& error) {
     ASSERT_THAT(errorLines(log), ElementsAre(purgeLine(error)));
+    EXPECT_EQ(log.lines().front().file, "PersistentKeyValueStore.cpp");
     EXPECT_THAT(trash->collected(), ElementsAre(storePath()));
     EXPECT_EQ(manifest->calls(ManifestCall::Clear), 1U);
     EXPECT_EQ(manifest->calls(ManifestCall::Load), 2U);

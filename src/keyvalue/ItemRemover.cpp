@@ -1,12 +1,11 @@
 #include "keyvalue/ItemRemover.h"
 
-#include <glog/logging.h>
-
 #include <optional>
 
 #include "FileUtils.h"
 #include "LarderException.h"
 #include "keyvalue/FileQueue.h"
+#include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
 #include "keyvalue/WritesInFlight.h"
@@ -59,7 +58,7 @@ void ItemRemover::evictOldestIfFull(const StoreLock& /*lock*/) {
     try {
       context->files->deleteFile(path);
     } catch (const LarderException& error) {
-      LOG(ERROR) << "Failed to remove the oldest item " << error.what();
+      errorLine(__LINE__).stream() << "Failed to remove the oldest item " << error.what();
     }
   };
   try {

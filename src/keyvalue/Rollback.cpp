@@ -1,8 +1,7 @@
 #include "keyvalue/Rollback.h"
 
-#include <glog/logging.h>
-
 #include "keyvalue/FileWrite.h"
+#include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
 
@@ -52,8 +51,8 @@ void Rollback::restore(const std::string& key, const SettledValue& settled) {
 }
 
 void Rollback::logLostRecord(const std::string& key, const std::exception& error) const {
-  LOG(ERROR) << "Store \"" << context_.options.name << "\" could not restore the record of \"" << key
-             << "\": " << error.what();
+  errorLine(__LINE__).stream() << "Store \"" << context_.options.name << "\" could not restore the record of \"" << key
+                               << "\": " << error.what();
 }
 
 }  // namespace velmora::mobile::xplat::cellar

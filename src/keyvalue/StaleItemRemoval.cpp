@@ -1,13 +1,12 @@
 #include "keyvalue/StaleItemRemoval.h"
 
-#include <glog/logging.h>
-
 #include <cstdint>
 #include <optional>
 #include <utility>
 
 #include "Clock.h"
 #include "keyvalue/BatchRemoval.h"
+#include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -58,7 +57,7 @@ void StaleItemRemoval::start() {
   };
   const auto onError = [onSuccess](const std::exception& error) {
     onSuccess();
-    LOG(ERROR) << "Failed to delete stale items: " << error.what();
+    errorLine(__LINE__).stream() << "Failed to delete stale items: " << error.what();
   };
   try {
     const auto cutoff = prepare();

@@ -1,9 +1,8 @@
 #include "keyvalue/StoreManifest.h"
 
-#include <glog/logging.h>
-
 #include "FileUtils.h"
 #include "TrashCollector.h"
+#include "keyvalue/StoreLog.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -83,7 +82,8 @@ void StoreManifest::finishPurge(const StoreLock& /*lock*/) {
 }
 
 void StoreManifest::logPurge(const LarderException& error) const {
-  LOG(ERROR) << "Store \"" << context_.options.name << "\" purged due to corrupted manifest. " << error.what();
+  errorLine(__LINE__).stream() << "Store \"" << context_.options.name << "\" purged due to corrupted manifest. "
+                               << error.what();
 }
 
 std::optional<std::uint32_t> StoreManifest::totalToReport() {

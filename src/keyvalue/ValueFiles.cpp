@@ -1,10 +1,9 @@
 #include "keyvalue/ValueFiles.h"
 
-#include <glog/logging.h>
-
 #include "FileUtils.h"
 #include "LarderException.h"
 #include "keyvalue/ReservedKeys.h"
+#include "keyvalue/StoreLog.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -27,7 +26,7 @@ void ValueFiles::deleteAll(const std::vector<std::string>& paths) const {
     try {
       context_.files->deleteFile(path);
     } catch (const LarderException& error) {
-      LOG(ERROR) << "Failed to delete file at \"" << path << "\" " << error.what();
+      errorLine(__LINE__).stream() << "Failed to delete file at \"" << path << "\" " << error.what();
     }
   }
 }
@@ -37,8 +36,9 @@ void ValueFiles::deleteLeftover(const std::string& key) const {
   try {
     if (exists(key)) context_.files->deleteFile(pathOf(key));
   } catch (const std::exception& error) {
-    LOG(ERROR) << "Store \"" << context_.options.name << "\" could not delete the file of an unfinished write of \""
-               << key << "\": " << error.what();
+    errorLine(__LINE__).stream() << "Store \"" << context_.options.name
+                                 << "\" could not delete the file of an unfinished write of \"" << key
+                                 << "\": " << error.what();
   }
 }
 
