@@ -8,6 +8,7 @@
 #include <array>
 #include <cerrno>
 #include <cstddef>
+#include <cstring>
 #include <ctime>
 #include <exception>
 #include <limits>
@@ -35,6 +36,62 @@ bool isSuccess(int resultCode) {
 bool isCorruption(int resultCode) {
   return resultCode == SQLITE_INTERNAL || resultCode == SQLITE_CORRUPT || resultCode == SQLITE_FORMAT ||
          resultCode == SQLITE_NOTADB;
+}
+
+// Compiled statements of a connection that no cursor has at the moment, so that the next one with the same text need
+// not compile it again. The one that was used last comes last. An idle statement holds no lock and no values.
+class IdleStatements {
+ public:
+  IdleStatements() { statements_.reserve(kMost); }
+  IdleStatements(const IdleStatements&) = delete;
+  IdleStatements& operator=(const IdleStatements&) = delete;
+  ~IdleStatements() { finalizeAll(); }
+
+  // Null when there is none.
+  sqlite3_stmt* take(const std::string& sql) {
+    const auto hasText = [&](sqlite3_stmt* statement) { return std::strcmp(sqlite3_sql(statement), sql.c_str()) == 0; };
+    const auto found = std::find_if(statements_.begin(), statements_.end(), hasText);
+    if (found == statements_.end()) return nullptr;
+    sqlite3_stmt* const statement = *found;
+    statements_.erase(found);
+    return statement;
+  }
+
+  // It must have been reset.
+  void put(sqlite3_stmt* statement) {
+    sqlite3_clear_bindings(statement);
+    if (statements_.size() == kMost) {
+      sqlite3_finalize(statements_.front());
+      statements_.erase(statements_.begin());
+    }
+    statements_.push_back(statement);
+  }
+
+  void finalizeAll() {
+    for (sqlite3_stmt* const statement : statements_) sqlite3_finalize(statement);
+    statements_.clear();
+  }
+
+ private:
+  static constexpr std::size_t kMost = 8;  // a few kilobytes each, and more than a manifest uses all the time
+
+  std::vector<sqlite3_stmt*> statements_;
+};
+
+// Closes a connection of ours. Cursors find its idle statements here, as they know nothing but the connection.
+struct ConnectionCloser {
+  std::shared_ptr<IdleStatements> idle = std::make_shared<IdleStatements>();
+
+  void operator()(sqlite3* database) const {
+    idle->finalizeAll();
+    sqlite3_close(database);
+  }
+};
+
+// Null for a connection that a host has opened itself.
+IdleStatements* idleStatementsOf(const std::shared_ptr<sqlite3>& database) {
+  const auto* const closer = std::get_deleter<ConnectionCloser>(database);
+  return closer != nullptr ? closer->idle.get() : nullptr;
 }
 
 // SQLite returns null for a connection without a file, and wants none asked of a null connection.
@@ -158,6 +215,8 @@ void throwIfSQLiteError(const std::shared_ptr<sqlite3>& database, int resultCode
 
 SQLiteStoreCursor::SQLiteStoreCursor(std::shared_ptr<sqlite3> database, const std::string& sql)
     : database_(std::move(database)) {
+  if (IdleStatements* const idle = idleStatementsOf(database_)) statement_ = idle->take(sql);
+  if (statement_ != nullptr) return;
   throwIfSQLiteError(database_, sqlite3_prepare_v2(database_.get(), sql.c_str(), -1, &statement_, nullptr));
 }
 
@@ -176,10 +235,15 @@ SQLiteStoreCursor& SQLiteStoreCursor::operator=(SQLiteStoreCursor&& other) noexc
 
 void SQLiteStoreCursor::finalize() noexcept {
   if (statement_ == nullptr) return;
+  sqlite3_stmt* const statement = std::exchange(statement_, nullptr);
+  IdleStatements* const idle = idleStatementsOf(database_);
+  const int resultCode = idle != nullptr ? sqlite3_reset(statement) : sqlite3_finalize(statement);
   try {
-    throwIfSQLiteError(database_, sqlite3_finalize(std::exchange(statement_, nullptr)));
+    throwIfSQLiteError(database_, resultCode);
+    if (idle != nullptr) idle->put(statement);
   } catch (const std::exception& exception) {
     LOG(ERROR) << "Could not finalize sqlite3 statement: " << exception.what();
+    if (idle != nullptr) sqlite3_finalize(statement);
   }
 }
 
@@ -233,7 +297,7 @@ SQLiteStore::SQLiteStore(const std::string& path) : path_(path) {
   const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX;
   const int resultCode = sqlite3_open_v2(path_.c_str(), &handle, flags, nullptr);
   // A failed open hands out a handle too, which has to be closed like any other.
-  database_ = std::shared_ptr<sqlite3>(handle, sqlite3_close);
+  database_ = std::shared_ptr<sqlite3>(handle, ConnectionCloser());
   throwSQLiteException(resultCode, cannotOpen(path_));
   throwIfCompanionsMayBlock(database_, path_, status.st_size == 0);
   distrustSchema(handle);

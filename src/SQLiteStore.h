@@ -26,9 +26,10 @@ CELLAR_EXPORT void throwSQLiteException(int resultCode, const std::string& messa
 CELLAR_EXPORT void throwIfSQLiteError(const std::shared_ptr<sqlite3>& database, int resultCode);
 
 // One prepared statement: bind its parameters, call `next` until it says false, and read the columns of each row
-// between. It keeps the connection open even when the store is destroyed. Moved, never copied. One thread at a time,
-// together with its store. Every operation throws SQLiteStoreException (or its corrupted subclass) when SQLite reports
-// an error; one on a cursor that was moved from does so too.
+// between. Compiled once: the connection keeps a few statements for the next cursors with the same text. It keeps the
+// connection open even when the store is destroyed. Moved, never copied. One thread at a time, together with its store.
+// Every operation throws SQLiteStoreException (or its corrupted subclass) when SQLite reports an error; one on a cursor
+// that was moved from does so too.
 class CELLAR_EXPORT SQLiteStoreCursor {
  public:
   // Prepares the first statement of `sql`; bytes after a zero byte are not read.

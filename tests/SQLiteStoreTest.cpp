@@ -417,6 +417,119 @@ TEST_F(SQLiteStoreTest, ACursorThatGoesBeforeItsLastRowLogsNothing) {
   EXPECT_THAT(log.lines(), IsEmpty());
 }
 
+// --- Statements that are kept ---
+
+sqlite3* lastOpened = nullptr;
+
+int noteOpened(sqlite3* database, char** /*message*/, const sqlite3_api_routines* /*routines*/) {
+  lastOpened = database;
+  return SQLITE_OK;
+}
+
+class SQLiteStoreStatements : public SQLiteStoreTest {
+ protected:
+  SQLiteStoreStatements() {
+    using Entry = void (*)();
+    sqlite3_auto_extension(reinterpret_cast<Entry>(noteOpened));
+    store = std::make_unique<SQLiteStore>(path);
+    sqlite3_reset_auto_extension();
+    store->exec("CREATE TABLE t (n INTEGER PRIMARY KEY, v TEXT); INSERT INTO t VALUES(1, 'a'), (2, 'b')");
+  }
+
+  // Compiled, whether a cursor has them or not.
+  static std::size_t statements() {
+    std::size_t count = 0;
+    for (sqlite3_stmt* it = nullptr; (it = sqlite3_next_stmt(lastOpened, it)) != nullptr;) ++count;
+    return count;
+  }
+
+  std::string firstOf(const std::string& sql) {
+    SQLiteStoreCursor cursor = store->cursor(sql);
+    return cursor.next() ? cursor.get<std::string>(0) : "<none>";
+  }
+
+  std::unique_ptr<SQLiteStore> store;
+};
+
+TEST_F(SQLiteStoreStatements, AreCompiledOnceForAllCursorsWithTheirText) {
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_EQ(firstOf("SELECT v FROM t"), "a");
+    EXPECT_EQ(statements(), 1U);
+  }
+  EXPECT_EQ(firstOf("SELECT n FROM t"), "1");
+  EXPECT_EQ(statements(), 2U);
+}
+
+TEST_F(SQLiteStoreStatements, OfTwoCursorsAtATimeAreTwo) {
+  SQLiteStoreCursor first = store->cursor("SELECT n FROM t ORDER BY n");
+  SQLiteStoreCursor second = store->cursor("SELECT n FROM t ORDER BY n");
+  EXPECT_TRUE(first.next());
+  EXPECT_TRUE(second.next());
+  EXPECT_TRUE(first.next());
+  EXPECT_EQ(first.get<unsigned long long>(0), 2U);
+  EXPECT_EQ(second.get<unsigned long long>(0), 1U);
+  EXPECT_EQ(statements(), 2U);
+}
+
+TEST_F(SQLiteStoreStatements, ForgetTheValuesThatWereBound) {
+  {
+    SQLiteStoreCursor cursor = store->cursor("SELECT ?1 IS NULL");
+    cursor.bind<std::string>(1, "text");
+    ASSERT_TRUE(cursor.next());
+    EXPECT_FALSE(cursor.get<bool>(0));
+  }
+  EXPECT_EQ(firstOf("SELECT ?1 IS NULL"), "1");
+  EXPECT_EQ(statements(), 1U);
+}
+
+TEST_F(SQLiteStoreStatements, ThatWereNotReadToTheirEndHoldNothing) {
+  EXPECT_EQ(firstOf("SELECT v FROM t"), "a");  // there is a second row
+  store->exec("DROP TABLE t");
+  EXPECT_EQ(failureOf([&] { firstOf("SELECT v FROM t"); }).code, SQLITE_ERROR);
+}
+
+TEST_F(SQLiteStoreStatements, FollowChangesOfTheSchema) {
+  EXPECT_EQ(firstOf("SELECT * FROM t WHERE n = 2"), "2");
+  store->exec(
+      "CREATE TABLE u (w TEXT, n INTEGER); INSERT INTO u VALUES('w', 2); DROP TABLE t; "
+      "ALTER TABLE u RENAME TO t");
+  EXPECT_EQ(firstOf("SELECT * FROM t WHERE n = 2"), "w");
+}
+
+TEST_F(SQLiteStoreStatements, ThatFailedAreNotKept) {
+  EXPECT_THROW(firstOf("INSERT INTO t VALUES(1, 'again')"), SQLiteStoreException);
+  EXPECT_EQ(statements(), 0U);
+  EXPECT_THROW(firstOf("INSERT INTO t VALUES(1, 'again')"), SQLiteStoreException);
+  EXPECT_EQ(firstOf("INSERT INTO t VALUES(3, 'c')"), "<none>");
+}
+
+TEST_F(SQLiteStoreStatements, AreAFewAtMostAndThoseThatWereUsedLast) {
+  for (int i = 0; i < 20; ++i) {
+    EXPECT_EQ(firstOf("SELECT 'kept'"), "kept");
+    EXPECT_EQ(firstOf("SELECT " + std::to_string(i)), std::to_string(i));
+  }
+  EXPECT_EQ(statements(), 8U);
+  EXPECT_EQ(firstOf("SELECT 'kept'"), "kept");
+  EXPECT_EQ(statements(), 8U);
+  EXPECT_EQ(firstOf("SELECT 0"), "0");  // compiled again, in place of another
+  EXPECT_EQ(statements(), 8U);
+}
+
+TEST_F(SQLiteStoreStatements, GoWithTheConnectionThatACursorKeepsOpen) {
+  const auto before = sqlite3_memory_used();
+  {
+    SQLiteStore other(directory.file("other"));
+    SQLiteStoreCursor outliving = other.cursor("SELECT 1");
+    EXPECT_TRUE(other.cursor("SELECT 2").next());
+  }
+  EXPECT_EQ(sqlite3_memory_used(), before);
+  SQLiteStoreCursor outliving = store->cursor("SELECT 'alive'");
+  EXPECT_EQ(firstOf("SELECT 2"), "2");
+  store.reset();
+  EXPECT_TRUE(outliving.next());
+  EXPECT_EQ(outliving.get<std::string>(0), "alive");
+}
+
 TEST_F(SQLiteStoreTest, ACursorIsMovedAndNotCopied) {
   EXPECT_FALSE(std::is_copy_constructible_v<SQLiteStoreCursor>);
   EXPECT_FALSE(std::is_copy_assignable_v<SQLiteStoreCursor>);
