@@ -51,7 +51,7 @@ JsonLinesAnalytics::~JsonLinesAnalytics() = default;
 
 void JsonLinesAnalytics::logEvent(const std::string& eventName, const std::string& category, const std::string& payload,
                                   const std::string& time) {
-  const std::lock_guard<std::mutex> lock(mutex_);
+  const Lock lock(mutex_);
   try {
     OrderedJson event;
     event["event"] = eventName;
@@ -60,19 +60,19 @@ void JsonLinesAnalytics::logEvent(const std::string& eventName, const std::strin
     event["time"] = timeValue(time);
     const std::string line = event.dump(-1, ' ', false, OrderedJson::error_handler_t::replace) + "\n";
     // What a failed write left behind is a line of its own, and not the beginning of this one.
-    if (write(failing_ ? "\n" + line : line)) {
+    if (write(lock, failing_ ? "\n" + line : line)) {
       failing_ = false;
     } else {
-      noteFailure(stream_ == nullptr ? std::generic_category().message(errno) : "stream failed");
+      noteFailure(lock, stream_ == nullptr ? std::generic_category().message(errno) : "stream failed");
     }
   } catch (const std::exception& exception) {
-    noteFailure(exception.what());
+    noteFailure(lock, exception.what());
   } catch (...) {
-    noteFailure("unknown exception");
+    noteFailure(lock, "unknown exception");
   }
 }
 
-bool JsonLinesAnalytics::write(const std::string& line) {
+bool JsonLinesAnalytics::write(const Lock& /*lock*/, const std::string& line) {
   if (stream_ == nullptr) return std::fwrite(line.data(), 1, line.size(), file_.get()) == line.size();
   stream_->clear();  // an earlier failure may have passed
   stream_->write(line.data(), static_cast<std::streamsize>(line.size()));
@@ -80,7 +80,7 @@ bool JsonLinesAnalytics::write(const std::string& line) {
   return stream_->good();
 }
 
-void JsonLinesAnalytics::noteFailure(const std::string& reason) {
+void JsonLinesAnalytics::noteFailure(const Lock& /*lock*/, const std::string& reason) {
   if (!failing_) LOG(ERROR) << "Cannot write analytics: " << reason;
   failing_ = true;
 }

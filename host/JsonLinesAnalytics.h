@@ -41,9 +41,10 @@ class CELLAR_EXPORT JsonLinesAnalytics : public XAnalytics {
     void operator()(std::FILE* file) const;
   };
 
-  // Called with the mutex held.
-  bool write(const std::string& line);
-  void noteFailure(const std::string& reason);
+  using Lock = std::lock_guard<std::mutex>;
+
+  bool write(const Lock& lock, const std::string& line);
+  void noteFailure(const Lock& lock, const std::string& reason);
 
   std::mutex mutex_;  // guards all below
   std::ostream* const stream_;

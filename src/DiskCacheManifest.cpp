@@ -55,7 +55,7 @@ DiskCacheManifest::~DiskCacheManifest() {
 
 void DiskCacheManifest::clear() {
   const std::lock_guard<std::mutex> loadLock(loadMutex_);
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   records_->clear();
   pendingAccessDates_.clear();
   persistence_->clearItems();
@@ -67,7 +67,7 @@ void DiskCacheManifest::load() {
   {
     const std::lock_guard<std::mutex> loadLock(loadMutex_);
     auto records = persistence_->getAllItems();
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    const ItemsLock lock(itemsMutex_);
     if (!loaded_) {
       records_->reserve(records.size());
       for (auto& record : records) {
@@ -83,7 +83,7 @@ void DiskCacheManifest::load() {
 void DiskCacheManifest::invalidate() {
   std::unique_ptr<AsyncTimer> timer;
   {
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    const ItemsLock lock(itemsMutex_);
     invalidated_ = true;
     timer = std::move(flushTimer_);
   }
@@ -91,26 +91,27 @@ void DiskCacheManifest::invalidate() {
 }
 
 void DiskCacheManifest::setItem(const DiskCacheItem& item) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
-  set(item);
+  const ItemsLock lock(itemsMutex_);
+  set(lock, item);
 }
 
 std::optional<ReplacedItem> DiskCacheManifest::replaceItem(const DiskCacheItem& item, bool withInlineData) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
-  auto replaced = whatIsReplaced(item.key, withInlineData);
-  set(item);
+  const ItemsLock lock(itemsMutex_);
+  auto replaced = whatIsReplaced(lock, item.key, withInlineData);
+  set(lock, item);
   return replaced;
 }
 
-void DiskCacheManifest::set(const DiskCacheItem& item) {
+void DiskCacheManifest::set(const ItemsLock& /*lock*/, const DiskCacheItem& item) {
   persistence_->setItem(item);
   pendingAccessDates_.erase(item.key);
   records_->store(item);
 }
 
-std::optional<ReplacedItem> DiskCacheManifest::whatIsReplaced(const std::string& key, bool withInlineData) {
+std::optional<ReplacedItem> DiskCacheManifest::whatIsReplaced(const ItemsLock& lock, const std::string& key,
+                                                              bool withInlineData) {
   try {
-    const ManifestRecord* const record = findOrRead(key);
+    const ManifestRecord* const record = findOrRead(lock, key);
     if (record == nullptr) return ReplacedItem();
     ReplacedItem replaced{std::make_unique<DiskCacheItem>(record->item()), {}};
     if (withInlineData && record->hasInlineData) replaced.inlineData = persistence_->getInlineData(key);
@@ -123,20 +124,20 @@ std::optional<ReplacedItem> DiskCacheManifest::whatIsReplaced(const std::string&
 }
 
 std::unique_ptr<DiskCacheItem> DiskCacheManifest::getItem(const std::string& key) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
-  const ManifestRecord* const record = findOrRead(key);
+  const ItemsLock lock(itemsMutex_);
+  const ManifestRecord* const record = findOrRead(lock, key);
   return record == nullptr ? nullptr : std::make_unique<DiskCacheItem>(record->item());
 }
 
 void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
   std::shared_ptr<AccessDates> due;
   {
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
-    if (findOrRead(key) == nullptr) return;
+    const ItemsLock lock(itemsMutex_);
+    if (findOrRead(lock, key) == nullptr) return;
     const std::int32_t date = now();
     records_->setLastAccessDate(key, date);
     pendingAccessDates_[key] = date;
-    if (!isFlushDue()) return;
+    if (!isFlushDue(lock)) return;
     due = std::make_shared<AccessDates>();
     due->swap(pendingAccessDates_);
     queuedAccessDates_ = due;
@@ -146,7 +147,7 @@ void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
       if (const auto self = weakThis.lock()) self->runQueuedFlush(*due);
     });
   } catch (...) {
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    const ItemsLock lock(itemsMutex_);
     pendingAccessDates_.merge(*due);  // those used again meanwhile stay as they are
     due->clear();
     throw;
@@ -154,62 +155,63 @@ void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
 }
 
 std::optional<std::int32_t> DiskCacheManifest::getModificationDate(const std::string& key) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
-  const ManifestRecord* const record = findOrRead(key);
+  const ItemsLock lock(itemsMutex_);
+  const ManifestRecord* const record = findOrRead(lock, key);
   return record == nullptr ? std::nullopt : std::make_optional(record->modificationDate);
 }
 
 void DiskCacheManifest::removeItem(const std::string& key) {
   const std::lock_guard<std::mutex> loadLock(loadMutex_);
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   const ManifestRecord* const record = records_->find(key);
   if (record != nullptr) {
-    remove(*record);
+    remove(lock, *record);
   } else if (!loaded_) {
     persistence_->removeItem(key);
   }
 }
 
 std::vector<unsigned char> DiskCacheManifest::getInlineData(const std::string& key) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   const ManifestRecord* const record = records_->find(key);
   const bool hasInlineData = record == nullptr ? !loaded_ : record->hasInlineData;
   return hasInlineData ? persistence_->getInlineData(key) : std::vector<unsigned char>();
 }
 
 void DiskCacheManifest::setInlineData(const std::string& key, const std::vector<unsigned char>& data) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   persistence_->setInlineData(key, data);
-  if (findOrRead(key) != nullptr) records_->setHasInlineData(key, true);
+  if (findOrRead(lock, key) != nullptr) records_->setHasInlineData(key, true);
 }
 
 void DiskCacheManifest::removeInlineData(const std::string& key) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   persistence_->removeInlineData(key);
-  if (findOrRead(key) != nullptr) records_->setHasInlineData(key, false);
+  if (findOrRead(lock, key) != nullptr) records_->setHasInlineData(key, false);
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneToSize(std::uint32_t size, std::uint32_t count) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   if (!loaded_ || records_->totalSize() <= size) return {};
-  return prune(records_->byStrategy(), count, [&](const ManifestRecord&) { return records_->totalSize() > size; });
+  return prune(lock, records_->byStrategy(), count,
+               [&](const ManifestRecord&) { return records_->totalSize() > size; });
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneOldEntries(long date, std::uint32_t count) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   if (!loaded_) return {};
-  return prune(records_->leastRecentlyUsed(), count,
+  return prune(lock, records_->leastRecentlyUsed(), count,
                [&](const ManifestRecord& record) { return record.lastAccessDate < date; });
 }
 
 std::unique_ptr<DiskCacheItem> DiskCacheManifest::pruneOldestItem() {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   const ManifestRecord* const oldest = loaded_ ? records_->leastRecentlyUsed()() : nullptr;
-  return oldest == nullptr ? nullptr : std::make_unique<DiskCacheItem>(remove(*oldest));
+  return oldest == nullptr ? nullptr : std::make_unique<DiskCacheItem>(remove(lock, *oldest));
 }
 
 std::vector<std::string> DiskCacheManifest::getAllKeys() {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   if (!loaded_) {
     throw DiskCacheManifestException("Manifest hasn't been loaded from disk yet", "QZDiskCacheManifestErrorDomain", 0);
   }
@@ -217,22 +219,22 @@ std::vector<std::string> DiskCacheManifest::getAllKeys() {
 }
 
 std::uint32_t DiskCacheManifest::size() {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   return records_->totalSize();
 }
 
 std::uint32_t DiskCacheManifest::count() {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   return static_cast<std::uint32_t>(records_->count());
 }
 
 bool DiskCacheManifest::isLoaded() {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   return loaded_;
 }
 
 // The record in memory, read into it first when the manifest is not loaded yet.
-const ManifestRecord* DiskCacheManifest::findOrRead(const std::string& key) {
+const ManifestRecord* DiskCacheManifest::findOrRead(const ItemsLock& /*lock*/, const std::string& key) {
   const ManifestRecord* const record = records_->find(key);
   if (record != nullptr || loaded_) return record;
   const auto item = persistence_->getItem(key);
@@ -240,7 +242,7 @@ const ManifestRecord* DiskCacheManifest::findOrRead(const std::string& key) {
 }
 
 // The persistence first: when it fails, nothing has changed.
-DiskCacheItem DiskCacheManifest::remove(const ManifestRecord& record) {
+DiskCacheItem DiskCacheManifest::remove(const ItemsLock& /*lock*/, const ManifestRecord& record) {
   const std::string key(record.key());
   persistence_->removeItem(key);
   pendingAccessDates_.erase(key);
@@ -249,14 +251,15 @@ DiskCacheItem DiskCacheManifest::remove(const ManifestRecord& record) {
 
 // Removes records as `next` yields them, at most `count`, up to the first that may not go.
 template <class MayGo>
-std::vector<DiskCacheItem> DiskCacheManifest::prune(const std::function<const ManifestRecord*()>& next,
+std::vector<DiskCacheItem> DiskCacheManifest::prune(const ItemsLock& lock,
+                                                    const std::function<const ManifestRecord*()>& next,
                                                     std::uint32_t count, MayGo mayGo) {
   std::vector<DiskCacheItem> removed;
   while (removed.size() < count) {
     try {
       const ManifestRecord* const record = next();  // by a strategy that may be the host's
       if (record == nullptr || !mayGo(*record)) break;
-      removed.push_back(remove(*record));
+      removed.push_back(remove(lock, *record));
     } catch (...) {
       if (removed.empty()) throw;
       break;  // the files of those that went must go too; the next call meets the failure at its first item
@@ -274,7 +277,7 @@ void DiskCacheManifest::armFlushTimer() {
     self->armFlushTimer();
   };
   std::unique_ptr<AsyncTimer> timer;  // the old one is destroyed without the lock
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   if (invalidated_) return;
   timer = std::exchange(flushTimer_, executor_->scheduleAfter(kFlushIntervalNanoseconds, onTimer, nullptr));
 }
@@ -282,14 +285,14 @@ void DiskCacheManifest::armFlushTimer() {
 void DiskCacheManifest::flush() {
   AccessDates dates;
   {
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    const ItemsLock lock(itemsMutex_);
     dates.swap(pendingAccessDates_);
   }
   commitAccessTimeUpdates(dates);
 }
 
 // Enough dates for a flush of their own, and neither a queued flush nor the timer is to come first.
-bool DiskCacheManifest::isFlushDue() const {
+bool DiskCacheManifest::isFlushDue(const ItemsLock& /*lock*/) const {
   if (!loaded_ || hasFlushFailed_ || pendingAccessDates_.size() <= kMaxPendingAccessDates) return false;
   const auto queued = queuedAccessDates_.lock();
   return queued == nullptr || queued->empty();
@@ -298,13 +301,13 @@ bool DiskCacheManifest::isFlushDue() const {
 void DiskCacheManifest::runQueuedFlush(AccessDates& queued) {
   AccessDates dates;
   {
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
+    const ItemsLock lock(itemsMutex_);
     dates.swap(queued);
   }
   commitAccessTimeUpdates(dates);
   {
-    const std::lock_guard<std::mutex> lock(itemsMutex_);
-    if (!isFlushDue()) return;
+    const ItemsLock lock(itemsMutex_);
+    if (!isFlushDue(lock)) return;
     dates.swap(pendingAccessDates_);  // what has come together while the flush was queued
   }
   commitAccessTimeUpdates(dates);
@@ -321,20 +324,20 @@ void DiskCacheManifest::commitAccessTimeUpdates(AccessDates& dates) {
   } catch (const std::exception& error) {
     LOG(ERROR) << "Could not write access dates: " << error.what();
   }
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
+  const ItemsLock lock(itemsMutex_);
   hasFlushFailed_ = !dates.empty();
   for (auto left = dates.begin(); left != dates.end();) {
-    left = hasAccessDate(left->first, left->second) ? std::next(left) : dates.erase(left);
+    left = hasAccessDate(lock, left->first, left->second) ? std::next(left) : dates.erase(left);
   }
   pendingAccessDates_.merge(dates);
 }
 
 bool DiskCacheManifest::isAccessDate(const std::string& key, std::int32_t date) {
-  const std::lock_guard<std::mutex> lock(itemsMutex_);
-  return hasAccessDate(key, date);
+  const ItemsLock lock(itemsMutex_);
+  return hasAccessDate(lock, key, date);
 }
 
-bool DiskCacheManifest::hasAccessDate(const std::string& key, std::int32_t date) const {
+bool DiskCacheManifest::hasAccessDate(const ItemsLock& /*lock*/, const std::string& key, std::int32_t date) const {
   const ManifestRecord* const record = records_->find(key);
   return record != nullptr && record->lastAccessDate == date;
 }

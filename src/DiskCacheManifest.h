@@ -147,14 +147,16 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
  private:
   using AccessDates = std::unordered_map<std::string, std::int32_t>;
 
-  // These are called with the items mutex held.
-  void set(const DiskCacheItem& item);
-  std::optional<ReplacedItem> whatIsReplaced(const std::string& key, bool withInlineData);
-  const ManifestRecord* findOrRead(const std::string& key);
-  DiskCacheItem remove(const ManifestRecord& record);
-  bool hasAccessDate(const std::string& key, std::int32_t date) const;
-  bool isFlushDue() const;
-  template <class MayGo> std::vector<DiskCacheItem> prune(const std::function<const ManifestRecord*()>& next,
+  using ItemsLock = std::lock_guard<std::mutex>;  // of the items mutex
+
+  void set(const ItemsLock& lock, const DiskCacheItem& item);
+  std::optional<ReplacedItem> whatIsReplaced(const ItemsLock& lock, const std::string& key, bool withInlineData);
+  const ManifestRecord* findOrRead(const ItemsLock& lock, const std::string& key);
+  DiskCacheItem remove(const ItemsLock& lock, const ManifestRecord& record);
+  bool hasAccessDate(const ItemsLock& lock, const std::string& key, std::int32_t date) const;
+  bool isFlushDue(const ItemsLock& lock) const;
+  template <class MayGo> std::vector<DiskCacheItem> prune(const ItemsLock& lock,
+                                                          const std::function<const ManifestRecord*()>& next,
                                                           std::uint32_t count, MayGo mayGo);
 
   void armFlushTimer();

@@ -197,7 +197,8 @@ void StoreManagerImpl::pruneStoresIfNecessary() {
 std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() {
   const std::lock_guard<std::mutex> lock(mutex_);
   const StoreManagerDefinition& definition = common_.definition();
-  if (pruneInProgress_) noteIfRoundIsOver();  // a store that is destroyed in the middle of its prune does not say so
+  if (pruneInProgress_)
+    noteIfRoundIsOver(lock);  // a store that is destroyed in the middle of its prune does not say so
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
   const auto nextPruneTime = lastPruneTime_ + definition.pruneInterval;
   if (lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};
@@ -217,8 +218,7 @@ std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() 
   return requests;
 }
 
-// Called with the mutex held.
-bool StoreManagerImpl::isInSurvivalMode() {
+bool StoreManagerImpl::isInSurvivalMode() const {
   try {
     return fileUtils_->getDiskSpace(common_.managerPath()).total < kMinimumFreeSizeSurvivalMode;
   } catch (const LarderException& error) {
@@ -256,11 +256,10 @@ void StoreManagerImpl::onStorePruneBackToNormalComplete(const std::string& ident
 void StoreManagerImpl::checkPruneCompletion() {
   // Looking and noting under one lock: of two stores that finish at once, the later to note has seen both.
   const std::lock_guard<std::mutex> lock(mutex_);
-  noteIfRoundIsOver();
+  noteIfRoundIsOver(lock);
 }
 
-// Called with the mutex held.
-void StoreManagerImpl::noteIfRoundIsOver() {
+void StoreManagerImpl::noteIfRoundIsOver(const std::lock_guard<std::mutex>& /*lock*/) {
   bool anyIsPruning = false;
   for (const auto& [identifier, item] : common_.copyStoreMap()) {
     const std::lock_guard<std::mutex> itemLock(item->mutex);

@@ -107,8 +107,8 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   void createAllStores();
   std::vector<PruneRequest> beginPruneRound();
   bool isFileSystemTooSmall();
-  bool isInSurvivalMode();
-  void noteIfRoundIsOver();
+  bool isInSurvivalMode() const;
+  void noteIfRoundIsOver(const std::lock_guard<std::mutex>& lock);
   void startPruning(const PruneRequest& request);
 
   std::mutex mutex_;  // guards the three below

@@ -197,13 +197,13 @@ std::optional<int> FaultyFileUtils::failureOf(Operation operation, const std::st
   }
   if (onCall) onCall(operation, path);
   const std::lock_guard<std::mutex> lock(mutex_);
-  const std::optional<int> failure = nextFailure(operation, path);
+  const std::optional<int> failure = nextFailure(lock, operation, path);
   if (failure) ++failures_;
   return failure;
 }
 
-// Called with the mutex held.
-std::optional<int> FaultyFileUtils::nextFailure(Operation operation, const std::string& path) {
+std::optional<int> FaultyFileUtils::nextFailure(const std::lock_guard<std::mutex>& /*lock*/, Operation operation,
+                                                const std::string& path) {
   if (callsToNth_ > 0 && --callsToNth_ == 0) return nthErrnoCode_;
   std::deque<int>& queued = next_[operation];
   if (!queued.empty()) {

@@ -100,7 +100,7 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
 
   void failIfTold(Operation operation, const std::string& path, const std::string& rest = "");
   std::optional<int> failureOf(Operation operation, const std::string& path, const std::string& rest = "");
-  std::optional<int> nextFailure(Operation operation, const std::string& path);
+  std::optional<int> nextFailure(const std::lock_guard<std::mutex>& lock, Operation operation, const std::string& path);
   std::optional<Failure> failureOfWrite(const std::string& path, std::size_t length);
 
   mutable std::mutex mutex_;  // guards everything below
