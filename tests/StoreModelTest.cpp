@@ -39,16 +39,20 @@
 #include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "support/LogCapture.h"
+#include "support/ManifestOnDisk.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 namespace fs = std::filesystem;
 
+using test::kManifestName;
 using test::LogCapture;
+using test::ManifestOnDisk;
 using test::ManualClock;
 using test::ManualExecutor;
 using test::ManualQueueFactory;
+using test::valueFiles;
 
 using Bytes = std::vector<unsigned char>;
 using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
@@ -56,7 +60,6 @@ using ItemType = VideoDownloadExtendedMetadata::ItemType;
 
 constexpr std::int64_t kSecond = 1'000'000'000;
 constexpr std::time_t kStart = 1'700'000'000;
-const std::string kManifestName = "manifest_v1.sqlite";
 const std::string kRefusal = "The queue takes no tasks.";
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || defined(__arm__)
@@ -92,78 +95,6 @@ class ScratchDirectory {
  private:
   std::string path_;
 };
-
-Bytes bytesOf(const std::string& path) {
-  std::ifstream stream(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(stream), std::istreambuf_iterator<char>()};
-}
-
-// A manifest as it lies on disk, by a connection that shares no code with the library.
-class ManifestOnDisk {
- public:
-  struct Row {
-    std::string filename;
-    std::uint32_t size = 0;
-    bool isInline = false;
-    Bytes inlineData;
-    std::int64_t modificationDate = 0;
-    std::int64_t lastAccessDate = 0;
-  };
-
-  // Not there before the store has needed it: no rows.
-  explicit ManifestOnDisk(const std::string& storePath) {
-    if (!fs::exists(storePath + "/" + kManifestName)) return;
-    EXPECT_EQ(sqlite3_open((storePath + "/" + kManifestName).c_str(), &database_), SQLITE_OK);
-  }
-  ManifestOnDisk(const ManifestOnDisk&) = delete;
-  ManifestOnDisk& operator=(const ManifestOnDisk&) = delete;
-  ~ManifestOnDisk() { sqlite3_close(database_); }
-
-  std::map<std::string, Row> rows() const {
-    std::map<std::string, Row> rows;
-    if (database_ == nullptr) return rows;
-    sqlite3_stmt* statement = nullptr;
-    const char* sql =
-        "SELECT key, filename, size, has_inline_data, inline_data, modification_date, last_access_date "
-        "FROM LarderManifest";
-    EXPECT_EQ(sqlite3_prepare_v2(database_, sql, -1, &statement, nullptr), SQLITE_OK) << sqlite3_errmsg(database_);
-    while (statement != nullptr && sqlite3_step(statement) == SQLITE_ROW) {
-      const auto bytes = [&](int column) {
-        const auto* begin = static_cast<const unsigned char*>(sqlite3_column_blob(statement, column));
-        return begin == nullptr ? Bytes() : Bytes(begin, begin + sqlite3_column_bytes(statement, column));
-      };
-      const Bytes key = bytes(0);
-      const Bytes filename = bytes(1);
-      rows[std::string(key.begin(), key.end())] = {std::string(filename.begin(), filename.end()),
-                                                   static_cast<std::uint32_t>(sqlite3_column_int64(statement, 2)),
-                                                   sqlite3_column_int(statement, 3) != 0,
-                                                   bytes(4),
-                                                   sqlite3_column_int64(statement, 5),
-                                                   sqlite3_column_int64(statement, 6)};
-    }
-    sqlite3_finalize(statement);
-    return rows;
-  }
-
-  void setLastAccessDate(const std::string& key, std::int64_t date) const {
-    const std::string sql =
-        "UPDATE LarderManifest SET last_access_date = " + std::to_string(date) + " WHERE key = '" + key + "'";
-    EXPECT_EQ(sqlite3_exec(database_, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK) << sqlite3_errmsg(database_);
-  }
-
- private:
-  sqlite3* database_ = nullptr;
-};
-
-// Value files by name; the manifest's own files are left out.
-std::map<std::string, Bytes> valueFiles(const std::string& storePath) {
-  std::map<std::string, Bytes> files;
-  for (const auto& entry : fs::directory_iterator(storePath)) {
-    const std::string name = entry.path().filename().string();
-    if (name.rfind(kManifestName, 0) != 0) files[name] = bytesOf(entry.path().string());
-  }
-  return files;
-}
 
 // The real file system, which lets others do something in the middle of the operations that no lock is held around.
 class InterruptedFileUtils final : public FileUtils {
