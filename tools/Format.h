@@ -4,9 +4,19 @@
 #include <cstdint>
 #include <string>
 
-#include "demo/Trees.h"
-
 namespace velmora::mobile::xplat::cellar::tools {
+
+// How many files, and bytes in them.
+struct TreeSize {
+  std::uint64_t files = 0;
+  std::uint64_t bytes = 0;
+
+  TreeSize& operator+=(const TreeSize& other) {
+    files += other.files;
+    bytes += other.bytes;
+    return *this;
+  }
+};
 
 // "850 B", "1.2 KB", "12.0 MB": powers of 1024, as in the configuration.
 std::string formatSize(std::uint64_t bytes);
