@@ -1,6 +1,7 @@
 #include "Progress.h"
 
 #include <algorithm>
+#include <utility>
 
 #include "Console.h"
 #include "Format.h"
@@ -10,47 +11,35 @@ namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
 constexpr std::size_t kBarWidth = 30;
-constexpr std::chrono::milliseconds kDrawingInterval(40);
-constexpr std::uint64_t kWorthPlainLines = 2000;  // files: fewer are written before anybody wonders
+constexpr std::chrono::milliseconds kDrawingInterval(100);
+constexpr std::uint32_t kCallsBetweenLooksAtTheClock = 64;
 
 }  // namespace
 
-Progress::Progress(Console& console, std::uint64_t totalFiles)
-    : console_(console), totalFiles_(std::max<std::uint64_t>(totalFiles, 1)) {}
+Progress::Progress(Console& console, std::string what, std::chrono::milliseconds patience)
+    : console_(console), what_(std::move(what)), nextDrawing_(std::chrono::steady_clock::now() + patience) {}
 
 Progress::~Progress() {
-  if (console_.isTerminal()) console_.rewriteLine("");
+  if (isDrawn_) console_.rewriteLine("");
 }
 
-void Progress::advance(std::uint64_t bytes) {
-  ++files_;
-  bytes_ += bytes;
-  if (console_.isTerminal()) {
-    drawBar();
-  } else {
-    printQuarter();
-  }
-}
-
-void Progress::drawBar() {
+void Progress::advanceTo(std::uint64_t part, std::uint64_t whole) {
+  if (!console_.isTerminal() || ++calls_ % kCallsBetweenLooksAtTheClock != 0) return;
   const auto now = std::chrono::steady_clock::now();
   if (now < nextDrawing_) return;
   nextDrawing_ = now + kDrawingInterval;
-  const auto done = static_cast<std::size_t>(std::min<std::uint64_t>(kBarWidth, files_ * kBarWidth / totalFiles_));
-  console_.rewriteLine("  [" + std::string(done, '#') + std::string(kBarWidth - done, '.') + "] " + figures());
+  draw(part, whole);
 }
 
-void Progress::printQuarter() {
-  if (totalFiles_ < kWorthPlainLines) return;
-  const std::uint64_t quarters = files_ * 4 / totalFiles_;
-  if (quarters <= quarters_) return;
-  quarters_ = quarters;
-  console_.line(figures());
-}
-
-std::string Progress::figures() const {
-  return std::to_string(files_ * 100 / totalFiles_) + " % of " + formatCount(totalFiles_, "file", "files") + ", " +
-         formatSize(bytes_);
+void Progress::draw(std::uint64_t part, std::uint64_t whole) {
+  isDrawn_ = true;
+  if (whole == 0) {
+    console_.rewriteLine("  " + what_ + ": " + formatCount(part));
+    return;
+  }
+  const auto done = static_cast<std::size_t>(std::min<std::uint64_t>(kBarWidth, part * kBarWidth / whole));
+  console_.rewriteLine("  [" + std::string(done, '#') + std::string(kBarWidth - done, '.') + "] " + what_ + ", " +
+                       std::to_string(std::min<std::uint64_t>(100, part * 100 / whole)) + " %");
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

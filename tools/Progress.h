@@ -8,30 +8,28 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 class Console;
 
-// How far copying files has come: a bar that moves on a terminal, and elsewhere, when there
-// are many, a plain line for every quarter.
+// How far something has come that may take longer than a moment: a bar on a terminal, once patience is over, and
+// nothing anywhere else.
 class Progress {
  public:
-  Progress(Console& console, std::uint64_t totalFiles);
+  Progress(Console& console, std::string what, std::chrono::milliseconds patience = std::chrono::seconds(1));
 
   // Leaves no half-drawn bar behind.
   ~Progress();
   Progress(const Progress&) = delete;
   Progress& operator=(const Progress&) = delete;
 
-  void advance(std::uint64_t bytes);  // by one file
+  // Cheap enough for every item of millions. `whole` is 0 when it is not known: then the parts are counted.
+  void advanceTo(std::uint64_t part, std::uint64_t whole);
 
  private:
-  void drawBar();
-  void printQuarter();
-  std::string figures() const;
+  void draw(std::uint64_t part, std::uint64_t whole);
 
   Console& console_;
-  const std::uint64_t totalFiles_;
-  std::uint64_t files_ = 0;
-  std::uint64_t bytes_ = 0;
-  std::uint64_t quarters_ = 0;
+  const std::string what_;
   std::chrono::steady_clock::time_point nextDrawing_;
+  std::uint32_t calls_ = 0;
+  bool isDrawn_ = false;
 };
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -16,7 +16,7 @@
 #include "AttributeStore.h"
 #include "Console.h"
 #include "ExtendedMetadata.h"
-#include "Meter.h"
+#include "Progress.h"
 #include "Stopwatch.h"
 #include "Table.h"
 #include "host/Await.h"
@@ -143,7 +143,7 @@ void Story::fillEmptyDirectories(std::size_t mostFiles, std::uint64_t coversPerc
     if (!store->isManaged) stores.push_back(store->name);
   }
   const Stopwatch watch;
-  Meter progress(console_, "writing files");
+  Progress progress(console_, "writing files");
   TreeSize written;
   for (std::size_t part = 0; part < stores.size(); ++part) {
     TreeSize& size = directories_[stores[part]];
@@ -201,7 +201,7 @@ Story::Values Story::placeFiles() const {
 
 void Story::store(const std::string& store, const std::vector<Value>& values) {
   const auto target = app_.values(store);
-  Meter progress(console_, "storing " + store);
+  Progress progress(console_, "storing " + store);
   std::size_t done = 0;
   std::vector<Future<void>> underWay;
   const auto finish = [&] {

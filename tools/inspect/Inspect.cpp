@@ -9,14 +9,15 @@
 
 #include "Console.h"
 #include "InputError.h"
+#include "Progress.h"
 #include "TextFile.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"
 #include "page/Page.h"
 #include "storage/ConfiguredStores.h"
-#include "storage/FileProgress.h"
 #include "storage/Layout.h"
+#include "storage/UntouchedFiles.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -46,9 +47,11 @@ Survey survey(const InspectOptions& options, Console& console) {
   const ConfiguredStores configured =
       options.configuration.empty() ? ConfiguredStores() : ConfiguredStores(options.configuration);
   const Layout layout = findLayout(options.root);
-  FileProgress progress(console, layout.root);
+  Progress progress(console, "looking at files");
+  const std::uint64_t files = console.isTerminal() ? countFiles(layout.root) : 0;
+  std::uint64_t seen = 0;
   return makeSurvey(layout, configured, options.top, std::time(nullptr),
-                    [&progress](std::uint64_t bytes) { progress.advance(bytes); });
+                    [&](std::uint64_t /*bytes*/) { progress.advanceTo(++seen, files); });
 }
 
 std::string textOf(const nlohmann::ordered_json& json) {

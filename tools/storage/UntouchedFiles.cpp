@@ -91,6 +91,15 @@ std::vector<Entry> listUntouched(const std::string& directory) {
   return entries;
 }
 
+std::uint64_t countFiles(const std::string& directory) {
+  std::uint64_t files = 0;
+  for (const Entry& entry : listUntouched(directory)) {
+    if (entry.type == Entry::Type::File) ++files;
+    if (entry.type == Entry::Type::Directory) files += countFiles(directory + "/" + entry.name);
+  }
+  return files;
+}
+
 std::uint64_t allocatedBy(const std::string& path) {
   struct stat status = {};
   return lstat(path.c_str(), &status) == 0 ? allocatedIn(status) : 0;

@@ -23,6 +23,9 @@ struct Entry {
 // allows that. Throws `FileUtilsIoException`. Not an error: an entry that goes meanwhile.
 std::vector<Entry> listUntouched(const std::string& directory);
 
+// The files of a tree, listed likewise.
+std::uint64_t countFiles(const std::string& directory);
+
 // What the directory itself takes on the disk.
 std::uint64_t allocatedBy(const std::string& path);
 

@@ -10,7 +10,7 @@
 #include "Console.h"
 #include "Format.h"
 #include "InputError.h"
-#include "Meter.h"
+#include "Progress.h"
 #include "PruneStrategy.h"
 #include "TextFile.h"
 #include "check/ConfigurationDocument.h"
@@ -98,10 +98,10 @@ void readReportedEvents(const TuneOptions& options, LineReader& lines, Trace& tr
 
 void readTrace(const TuneOptions& options, Console& console, Trace& trace, TuneReport& report) {
   LineReader lines(options.events);
-  Meter meter(console, "reading " + lines.name());
+  Progress progress(console, "reading " + lines.name());
   const auto onLine = [&] {
     const bool isKnown = lines.bytesInAll() > 0;
-    meter.advanceTo(isKnown ? lines.bytesRead() : lines.lineNumber(), lines.bytesInAll());
+    progress.advanceTo(isKnown ? lines.bytesRead() : lines.lineNumber(), lines.bytesInAll());
   };
   report.source = lines.name();
   report.store = options.store;
@@ -114,10 +114,10 @@ void readTrace(const TuneOptions& options, Console& console, Trace& trace, TuneR
 }
 
 Tuning tuneTrace(const TuneOptions& options, const Trace& trace, std::int64_t present, Console& console) {
-  Meter meter(console, "playing the accesses");
+  Progress progress(console, "playing the accesses");
   std::uint64_t done = 0;
   const std::uint64_t rounds = trace.hasMetadata() ? 2 : 1;
-  return tune(trace, present, options.worth / kPercent, [&] { meter.advanceTo(++done, rounds * trace.accesses()); });
+  return tune(trace, present, options.worth / kPercent, [&] { progress.advanceTo(++done, rounds * trace.accesses()); });
 }
 
 void runTune(const TuneOptions& options) {

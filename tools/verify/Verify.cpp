@@ -7,8 +7,9 @@
 
 #include "Console.h"
 #include "Format.h"
-#include "storage/FileProgress.h"
+#include "Progress.h"
 #include "storage/Layout.h"
+#include "storage/UntouchedFiles.h"
 #include "verify/Verification.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -34,9 +35,11 @@ std::string verdictOf(const VerificationResult& result, bool repair) {
 int runVerify(const VerifyOptions& options) {
   Console console = Console::standardOutput();
   const Layout layout = findLayout(options.root);
-  auto progress = std::make_unique<FileProgress>(console, layout.root);
+  auto progress = std::make_unique<Progress>(console, "looking at files");
+  const std::uint64_t files = console.isTerminal() ? countFiles(layout.root) : 0;
+  std::uint64_t seen = 0;
   const VerificationResult result = verify(
-      layout, options.repair, [&progress](std::uint64_t bytes) { progress->advance(bytes); },
+      layout, options.repair, [&](std::uint64_t /*bytes*/) { progress->advanceTo(++seen, files); },
       [&console](const std::string& line) {
         if (console.isTerminal()) console.rewriteLine("");
         console.raw(line + "\n");

@@ -1,4 +1,4 @@
-#include "Meter.h"
+#include "Progress.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -23,23 +23,23 @@ std::string written(bool isTerminal, std::chrono::milliseconds patience, std::ui
   std::ostringstream out;
   Console console(out, isTerminal, false);
   {
-    Meter meter(console, "reading", patience);
-    for (std::uint64_t i = 1; i <= part; ++i) meter.advanceTo(i, whole);
+    Progress progress(console, "reading", patience);
+    for (std::uint64_t i = 1; i <= part; ++i) progress.advanceTo(i, whole);
   }
   return out.str();
 }
 
-TEST(Meter, DrawsABarOnATerminalAndWipesItAway) {
-  const std::string bar = written(true, kNone, 1024, 4096);
+TEST(Progress, DrawsABarOnATerminalAndWipesItAway) {
+  const std::string bar = written(true, kNone, 64, 256);
   EXPECT_THAT(bar, HasSubstr("[#######.......................] reading, 25 %"));
   EXPECT_THAT(bar, EndsWith("\r\x1b[2K"));
 }
 
-TEST(Meter, CountsWhenTheWholeIsNotKnown) { EXPECT_THAT(written(true, kNone, 1024, 0), HasSubstr("reading: 1,024")); }
+TEST(Progress, CountsWhenTheWholeIsNotKnown) { EXPECT_THAT(written(true, kNone, 64, 0), HasSubstr("reading: 64")); }
 
-TEST(Meter, DrawsNothingBeforePatienceIsOver) { EXPECT_EQ(written(true, std::chrono::hours(1), 5000, 5000), ""); }
+TEST(Progress, DrawsNothingBeforePatienceIsOver) { EXPECT_EQ(written(true, std::chrono::hours(1), 5000, 5000), ""); }
 
-TEST(Meter, DrawsNothingWhereThereIsNoTerminal) { EXPECT_EQ(written(false, kNone, 5000, 5000), ""); }
+TEST(Progress, DrawsNothingWhereThereIsNoTerminal) { EXPECT_EQ(written(false, kNone, 5000, 5000), ""); }
 
 }  // namespace
 }  // namespace velmora::mobile::xplat::cellar::tools
