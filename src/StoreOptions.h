@@ -35,7 +35,7 @@ struct KeyValueStoreOptions {
   std::optional<std::uint64_t> capacity;
 
   // Seconds without access after which an item expires. Checked 300 seconds after loading and then every hour.
-  long staleAge = 50 * 365 * 86400L;
+  long staleAge = 50L * 365 * 86400;
 
   bool inlineData = false;      // values lie inside the manifest, not in files
   unsigned int batchSize = 50;  // items that an expiry, a clear or a prune removes at a time; at least 1
