@@ -1,9 +1,10 @@
 // The first ten lines of a host. usage: quickstart [CONFIGURATION.json [STORAGE-DIRECTORY]]
-#include <fstream>
 #include <iostream>
 #include <sstream>
 
 // README: begin
+#include <fstream>
+
 #include <cellar/Cellar.h>
 #include <cellar/host/Await.h>
 #include <cellar/host/Host.h>

@@ -1,21 +1,22 @@
 // Tests of a host's own use of a store: nothing runs before the test says so, the disk fails on demand, events are
 // kept. Exits with 0 when what it expects comes true.
 
-#include <cerrno>
 #include <cstdlib>
 #include <iostream>
+
+// GUIDE: begin
+#include <cellar/Cellar.h>
+#include <cellar/host/Await.h>
+#include <cellar/host/testing/FaultyFileUtils.h>
+#include <cellar/host/testing/ManualQueue.h>
+#include <cellar/host/testing/RecordingAnalytics.h>
+
+#include <cerrno>
 #include <memory>
 #include <string>
 
-#include "Cellar.h"
-#include "host/Await.h"
-#include "host/testing/FaultyFileUtils.h"
-#include "host/testing/ManualQueue.h"
-#include "host/testing/RecordingAnalytics.h"
-
 using namespace velmora::mobile::xplat::cellar;  // NOLINT: an example may
 
-// GUIDE: begin
 struct Surroundings {
   std::shared_ptr<test::ManualQueueFactory> queues = std::make_shared<test::ManualQueueFactory>();
   std::shared_ptr<test::FaultyFileUtils> files = std::make_shared<test::FaultyFileUtils>();
