@@ -9,11 +9,11 @@
 #include <string>
 #include <vector>
 
+#include "benchmarks/Benchmarks.h"
 #include "support/Context.h"
 #include "support/Memory.h"
 #include "support/Recording.h"
 #include "support/Stopwatch.h"
-#include "topics/Topics.h"
 
 namespace {
 
@@ -25,9 +25,10 @@ constexpr std::size_t kKept = std::size_t{1} << 28U;
 struct Arguments {
   bool quick = false;
   std::vector<std::string> places;
-  std::vector<std::string> topics;
+  std::vector<std::string> benchmarks;
   std::string results;
   std::string document;
+  std::string summary;
   std::string plots;
 };
 
@@ -36,16 +37,17 @@ bench::Place placeOf(const std::string& text) {
   return {text.substr(0, colon), text.substr(colon + 1)};
 }
 
-bool isWanted(const Arguments& arguments, const std::string& topic) {
-  const auto& wanted = arguments.topics;
-  return wanted.empty() || std::find(wanted.begin(), wanted.end(), topic) != wanted.end();
+bool isWanted(const Arguments& arguments, const std::string& benchmark) {
+  const auto& wanted = arguments.benchmarks;
+  return wanted.empty() || std::find(wanted.begin(), wanted.end(), benchmark) != wanted.end();
 }
 
-// After each topic, so that one that fails or is interrupted takes nothing along.
+// After each benchmark, so that the results so far are kept when one fails or is interrupted.
 void record(const Arguments& arguments, const bench::Report& report) {
   std::ofstream(arguments.results) << report.json().dump(2) << "\n";
   if (!arguments.plots.empty()) bench::writePlotScripts(report, arguments.plots);
   if (!arguments.document.empty()) bench::recordTables(report, arguments.document);
+  if (!arguments.summary.empty()) bench::recordSummaries(report, arguments.summary);
 }
 
 void run(const Arguments& arguments) {
@@ -57,13 +59,13 @@ void run(const Arguments& arguments) {
   bench::Manifests manifests(places.back());
   if (arguments.quick) places.resize(1);
   const bench::Context context{arguments.quick, places, report, manifests};
-  for (const auto& topic : bench::topics()) {
-    if (!isWanted(arguments, topic.name)) continue;
+  for (const auto& benchmark : bench::benchmarks()) {
+    if (!isWanted(arguments, benchmark.name)) continue;
     const bench::Stopwatch watch;
-    report.begin(topic.name, topic.title);
-    topic.measure(context);
-    std::cout << "\n" << topic.title << "\n\n" << bench::tableText(report.topics().back()) << std::flush;
-    std::cerr << topic.name << ": " << watch.microseconds() / 1e6 << " s\n";
+    report.begin(benchmark.name, benchmark.title);
+    benchmark.measure(context);
+    std::cout << "\n" << benchmark.title << "\n\n" << bench::tableText(report.sections().back()) << std::flush;
+    std::cerr << benchmark.name << ": " << watch.microseconds() / 1e6 << " s\n";
     record(arguments, report);
   }
 }
@@ -77,8 +79,9 @@ int main(int argc, char** argv) {
   app.add_option("--place", arguments.places, "NAME:DIRECTORY to measure in")->required();
   app.add_option("--results", arguments.results, "The file for the results, as JSON")->required();
   app.add_option("--plots", arguments.plots, "A directory for gnuplot scripts");
-  app.add_option("--document", arguments.document, "The document that takes the tables over");
-  app.add_option("--topic", arguments.topics, "Measure only this topic; may be repeated");
+  app.add_option("--document", arguments.document, "The document to write the tables into");
+  app.add_option("--summary", arguments.summary, "The document to write the shortened tables into");
+  app.add_option("--benchmark", arguments.benchmarks, "Measure only this benchmark; may be repeated");
   CLI11_PARSE(app, argc, argv);
   try {
     run(arguments);

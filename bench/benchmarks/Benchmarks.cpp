@@ -1,9 +1,9 @@
-#include "topics/Topics.h"
+#include "benchmarks/Benchmarks.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-const std::vector<TopicDefinition>& topics() {
-  static const std::vector<TopicDefinition> all = {
+const std::vector<Benchmark>& benchmarks() {
+  static const std::vector<Benchmark> all = {
       {"store", "Storing: microseconds for each of many new values", measureStores},
       {"fetch", "Fetching: microseconds for each of many values that are there", measureFetches},
       {"caller", "The caller's time: microseconds until a call returns", measureCallers},

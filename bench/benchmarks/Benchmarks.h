@@ -19,12 +19,12 @@ void measureEvents(const Context& context);
 void measureStart(const Context& context);
 void measureSpace(const Context& context);
 
-struct TopicDefinition {
+struct Benchmark {
   std::string name;
   std::string title;
   void (*measure)(const Context& context);
 };
 
-const std::vector<TopicDefinition>& topics();
+const std::vector<Benchmark>& benchmarks();
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -9,12 +9,12 @@
 
 #include <cellar/host/Await.h>
 
-#include "rivals/Rival.h"
+#include "benchmarks/Benchmarks.h"
+#include "competitors/Competitor.h"
 #include "support/Memory.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
 #include "support/StoreUnderTest.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -87,21 +87,22 @@ class OurCaller : public Contestant {
   StoreUnderTest store_;
 };
 
-class RivalCaller : public Contestant {
+class CompetitorCaller : public Contestant {
  public:
-  RivalCaller(const Place& place, const OpenRival& open) : scratch_(place), rival_(open(scratch_.path())) {}
+  CompetitorCaller(const Place& place, const OpenCompetitor& open)
+      : scratch_(place), competitor_(open(scratch_.path())) {}
 
   double put(std::size_t number, const Bytes& value) override {
     const std::string key = keyOf(number);
     const Stopwatch watch;
-    rival_->put(key, value);
+    competitor_->put(key, value);
     return watch.microseconds();
   }
 
   double get(std::size_t number, std::size_t size) override {
     const std::string key = keyOf(number);
     const Stopwatch watch;
-    const Bytes value = rival_->get(key);
+    const Bytes value = competitor_->get(key);
     const double taken = watch.microseconds();
     throwUnlessStamped(value.data(), value.size(), size, number);
     return taken;
@@ -109,7 +110,7 @@ class RivalCaller : public Contestant {
 
  private:
   const Scratch scratch_;
-  const std::unique_ptr<Rival> rival_;
+  const std::unique_ptr<Competitor> competitor_;
 };
 
 void takeTurn(Contestant& contestant, const Case& what, Taken& taken) {
@@ -148,8 +149,8 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   const Pinned guard(pinned);
   std::vector<std::pair<std::string, std::unique_ptr<Contestant>>> contestants;
   contestants.emplace_back("ours", std::make_unique<OurCaller>(place));
-  for (const auto& [name, open] : rivals()) {
-    contestants.emplace_back(name, std::make_unique<RivalCaller>(place, open));
+  for (const auto& [name, open] : competitors()) {
+    contestants.emplace_back(name, std::make_unique<CompetitorCaller>(place, open));
   }
   std::map<std::string, Taken> taken;
   for (int turn = 0; turn < context.scaled(7, 3); ++turn) {
@@ -161,7 +162,7 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   }
   const std::string size = sizeName(what.size);
   const std::vector<Goal> tailGoals = {{"LevelDB", 1}, {"SQLite", 1}};
-  report(context, "store, " + size, place, pinned, taken, &Taken::puts, kMedian, {{"fastest rival", 1}});
+  report(context, "store, " + size, place, pinned, taken, &Taken::puts, kMedian, {{"fastest competitor", 1}});
   report(context, "store, " + size, place, pinned, taken, &Taken::puts, kTail, tailGoals);
   report(context, "fetch, " + size, place, pinned, taken, &Taken::gets, kMedian, {});
   report(context, "fetch, " + size, place, pinned, taken, &Taken::gets, kTail, tailGoals);
@@ -192,7 +193,7 @@ void countCopies(const Context& context, const Place& place) {
 void measureCallers(const Context& context) {
   for (const Case& what : cases(context)) {
     for (const Place& place : context.places) {
-      // The largest take the rivals too long for a second place.
+      // The largest take the competitors too long for a second place.
       if (what.size >= 1U << 20U && place.name != context.places.front().name) continue;
       for (const bool pinned : context.pinnings(what.size)) measureCase(context, place, pinned, what);
     }

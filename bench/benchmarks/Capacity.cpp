@@ -9,13 +9,13 @@
 
 #include <cellar/DiskCacheManifest.h>
 
-#include "floors/FileFloor.h"
-#include "floors/ManifestFloor.h"
+#include "benchmarks/Benchmarks.h"
+#include "lower_bounds/FileLowerBound.h"
+#include "lower_bounds/ManifestLowerBound.h"
 #include "support/Fill.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
 #include "support/StoreUnderTest.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -65,11 +65,11 @@ Taken measureOurs(const Context& context, const Place& place, std::size_t items,
   return taken;
 }
 
-Taken measureFloor(const Context& context, const Place& place, std::size_t items, std::size_t writes) {
+Taken measureLowerBound(const Context& context, const Place& place, std::size_t items, std::size_t writes) {
   const Scratch scratch(place);
   context.manifests.copyTo(scratch.path(), items);
   fillFiles(scratch.path(), kFirstWrites + writes);
-  ManifestFloor manifest(scratch.path());
+  ManifestLowerBound manifest(scratch.path());
   settle(scratch.path());
   return timeWrites(items, writes, [&](std::size_t number, const Bytes& value) {
     const std::string oldest = keyOf(number);
@@ -101,16 +101,17 @@ void measureCapacity(const Context& context) {
                 return taken.each;
               }};
     };
-    last = interleaved(place, {contestant("ours", measureOurs), contestant("floor", measureFloor)},
+    last = interleaved(place, {contestant("ours", measureOurs), contestant("lower bound", measureLowerBound)},
                        context.scaled(3, 1), writes * kSize);
     if (items == few) ofFew = last;
     for (const auto& [name, figure] : last) plot.lines[name].emplace_back(static_cast<double>(items), figure);
     context.report.add(Row{countName(items) + " items", place.name, cpuName(false), "us a write", last, {}});
-    const Figures first = {{"ours", median(firsts["ours"])}, {"floor", median(firsts["floor"])}};
+    const Figures first = {{"ours", median(firsts["ours"])}, {"lower bound", median(firsts["lower bound"])}};
     context.report.add(
         Row{countName(items) + " items, the first after a start", place.name, cpuName(false), "us", first, {}});
   }
-  const Figures growth = {{"ours", last["ours"] / ofFew["ours"]}, {"floor", last["floor"] / ofFew["floor"]}};
+  const Figures growth = {{"ours", last["ours"] / ofFew["ours"]},
+                          {"lower bound", last["lower bound"] / ofFew["lower bound"]}};
   const std::string name = "growth from " + countName(few) + " to " + countName(many) + " items";
   context.report.add(Row{name, place.name, cpuName(false), "times", growth, {{"", 1.15}}});
   context.report.add(plot);

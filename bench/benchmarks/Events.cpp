@@ -8,8 +8,8 @@
 
 #include <cellar/AnalyticsEventReporter.h>
 
+#include "benchmarks/Benchmarks.h"
 #include "support/Samples.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 

@@ -8,13 +8,13 @@
 
 #include <cellar/host/Await.h>
 
-#include "floors/FileFloor.h"
-#include "rivals/Rival.h"
+#include "benchmarks/Benchmarks.h"
+#include "competitors/Competitor.h"
+#include "lower_bounds/FileLowerBound.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
 #include "support/StoreUnderTest.h"
 #include "support/Window.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -35,8 +35,8 @@ std::vector<Case> cases(const Context& context) {
   const auto fetches = context.scaled<std::size_t>(4000, 1000);
   // A store keeps up to 512 access dates in memory. With more items than that in use they are written again and again.
   return {
-      {4 << 10, 500, fetches, "", {{"floor", 1.3}}, {{"floor", 4}}},
-      {4 << 10, 5000, fetches, " of 5,000", {{"floor", 1.3}}, {{"floor", 4}}},
+      {4 << 10, 500, fetches, "", {{"lower bound", 1.3}}, {{"lower bound", 4}}},
+      {4 << 10, 5000, fetches, " of 5,000", {{"lower bound", 1.3}}, {{"lower bound", 4}}},
       {200, 500, fetches, "", {}, {}},
       {64 << 10, 100, fetches / 2, "", {}, {}},
       {1 << 20, 16, fetches / 20, "", {}, {}},
@@ -100,9 +100,9 @@ class OurFetches {
   StoreUnderTest store_;
 };
 
-class FloorFetches {
+class LowerBoundFetches {
  public:
-  FloorFetches(const Place& place, const Case& what) : what_(what), scratch_(place) {
+  LowerBoundFetches(const Place& place, const Case& what) : what_(what), scratch_(place) {
     fill(what, [this](const std::string& key, const Bytes& value) {
       writeFile(scratch_ / key, value);
       sizes_[key] = value.size();
@@ -124,16 +124,16 @@ class FloorFetches {
   std::unordered_map<std::string, std::size_t> sizes_;
 };
 
-class RivalFetches {
+class CompetitorFetches {
  public:
-  RivalFetches(const Place& place, const Case& what, const OpenRival& open)
-      : what_(what), scratch_(place), rival_(open(scratch_.path())) {
-    fill(what, [this](const std::string& key, const Bytes& value) { rival_->put(key, value); });
+  CompetitorFetches(const Place& place, const Case& what, const OpenCompetitor& open)
+      : what_(what), scratch_(place), competitor_(open(scratch_.path())) {
+    fill(what, [this](const std::string& key, const Bytes& value) { competitor_->put(key, value); });
   }
 
   double measure() const {
     return average(what_, [this](std::size_t number) {
-      const Bytes value = rival_->get(keyOf(number));
+      const Bytes value = competitor_->get(keyOf(number));
       throwUnlessStamped(value.data(), value.size(), what_.size, number);
     });
   }
@@ -141,18 +141,18 @@ class RivalFetches {
  private:
   const Case& what_;
   const Scratch scratch_;
-  const std::unique_ptr<Rival> rival_;
+  const std::unique_ptr<Competitor> competitor_;
 };
 
 void measureCase(const Context& context, const Place& place, bool pinned, const Case& what) {
   OurFetches ours(place, pinned, what);
-  const FloorFetches floor(place, what);
+  const LowerBoundFetches lowerBound(place, what);
   Contestants contestants = {{"64", [&] { return ours.outstanding(); }},
                              {"1", [&] { return ours.singly(); }},
-                             {"floor", [&] { return floor.measure(); }}};
-  for (const auto& [name, open] : rivals()) {
-    contestants.emplace_back(name,
-                             [rival = std::make_shared<RivalFetches>(place, what, open)] { return rival->measure(); });
+                             {"lower bound", [&] { return lowerBound.measure(); }}};
+  for (const auto& [name, open] : competitors()) {
+    contestants.emplace_back(
+        name, [competitor = std::make_shared<CompetitorFetches>(place, what, open)] { return competitor->measure(); });
   }
   Figures figures = interleaved(place, contestants, context.scaled(5, 3), what.size * kOutstanding);
   const double outstanding = figures.extract("64").mapped();

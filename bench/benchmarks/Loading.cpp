@@ -9,12 +9,12 @@
 #include <cellar/DiskCacheManifest.h>
 #include <cellar/host/ThreadQueueFactory.h>
 
-#include "floors/SQLite.h"
+#include "benchmarks/Benchmarks.h"
+#include "lower_bounds/SQLite.h"
 #include "support/Fill.h"
 #include "support/Memory.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -32,7 +32,7 @@ void throwUnless(std::size_t expected, std::size_t found) {
   if (found != expected) throw std::runtime_error("not all records were loaded");
 }
 
-double measureFloor(const std::string& directory, std::size_t items) {
+double measureLowerBound(const std::string& directory, std::size_t items) {
   const Stopwatch watch;
   Database database(directory + "/manifest_v1.sqlite");
   Statement all(database,
@@ -93,18 +93,19 @@ void measureLoading(const Context& context) {
     const double bytes = measureMemory(scratch / "store", items);
     last = interleaved(place,
                        {{"ours", [&] { return measureOurs(scratch / "store", items); }},
-                        {"floor", [&] { return measureFloor(scratch / "store", items); }}},
+                        {"lower bound", [&] { return measureLowerBound(scratch / "store", items); }}},
                        context.scaled(5, 3), items * 300);
     if (items == few) first = last;
     for (const auto& [name, figure] : last) plot.lines[name].emplace_back(static_cast<double>(items), figure);
     const std::string name = countName(items) + " items";
-    const std::vector<Goal> goals = items < few ? std::vector<Goal>() : std::vector<Goal>{{"floor", 1.3}};
+    const std::vector<Goal> goals = items < few ? std::vector<Goal>() : std::vector<Goal>{{"lower bound", 1.3}};
     context.report.add(Row{name, place.name, cpuName(false), "us an item", last, goals});
     context.report.add(Row{name + ", memory", "memory", "", "bytes an item", {{"ours", bytes}}, {{"", 200}}});
   }
-  const Figures growth = {{"ours", last["ours"] / first["ours"]}, {"floor", last["floor"] / first["floor"]}};
+  const Figures growth = {{"ours", last["ours"] / first["ours"]},
+                          {"lower bound", last["lower bound"] / first["lower bound"]}};
   const std::string name = "growth from " + countName(few) + " to " + countName(many) + " items";
-  context.report.add(Row{name, place.name, cpuName(false), "times", growth, {{"floor", 1.1}}});
+  context.report.add(Row{name, place.name, cpuName(false), "times", growth, {{"lower bound", 1.1}}});
   context.report.add(plot);
 }
 

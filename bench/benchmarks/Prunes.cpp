@@ -6,12 +6,12 @@
 
 #include <cellar/DiskCacheManifest.h>
 
-#include "floors/ManifestFloor.h"
+#include "benchmarks/Benchmarks.h"
+#include "lower_bounds/ManifestLowerBound.h"
 #include "support/Fill.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
 #include "support/StoreUnderTest.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -49,11 +49,11 @@ double measureOurs(const Context& context, const Place& place, const Case& what)
   return result;
 }
 
-double measureFloor(const Context& context, const Place& place, const Case& what) {
+double measureLowerBound(const Context& context, const Place& place, const Case& what) {
   const Scratch scratch(place);
   context.manifests.copyTo(scratch.path(), what.items);
   fillFiles(scratch.path(), what.files);
-  ManifestFloor manifest(scratch.path());
+  ManifestLowerBound manifest(scratch.path());
   settle(scratch.path());
   const Stopwatch watch;
   for (std::size_t number = 0; number < what.pruned; ++number) {
@@ -69,7 +69,7 @@ double measureFloor(const Context& context, const Place& place, const Case& what
 Figures measureCase(const Context& context, const Place& place, const Case& what, int repetitions) {
   return interleaved(place,
                      {{"ours", [&] { return measureOurs(context, place, what); }},
-                      {"floor", [&] { return measureFloor(context, place, what); }}},
+                      {"lower bound", [&] { return measureLowerBound(context, place, what); }}},
                      repetitions, what.files * 4096);
 }
 
@@ -78,7 +78,7 @@ void measureDown(const Context& context, const Place& place) {
   const Case what{items, items / 10 * 9, items};
   const Figures figures = measureCase(context, place, what, context.scaled(3, 1));
   const std::string name = countName(items) + " items down to " + countName(items / 10);
-  context.report.add(Row{name, place.name, cpuName(false), "us an item", figures, {{"floor", 1.1}}});
+  context.report.add(Row{name, place.name, cpuName(false), "us an item", figures, {{"lower bound", 1.1}}});
 }
 
 void measureGrowth(const Context& context, const Place& place) {
@@ -95,7 +95,8 @@ void measureGrowth(const Context& context, const Place& place) {
     const std::string name = countName(pruned) + " of " + countName(items) + " items";
     context.report.add(Row{name, place.name, cpuName(false), "us an item", last, {}});
   }
-  const Figures growth = {{"ours", last["ours"] / first["ours"]}, {"floor", last["floor"] / first["floor"]}};
+  const Figures growth = {{"ours", last["ours"] / first["ours"]},
+                          {"lower bound", last["lower bound"] / first["lower bound"]}};
   const std::string name = "growth from " + countName(few) + " to " + countName(many) + " items";
   context.report.add(Row{name, place.name, cpuName(false), "times", growth, {{"", 1.1}}});
   if (place.name == context.places.front().name) context.report.add(plot);

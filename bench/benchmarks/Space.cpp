@@ -2,11 +2,11 @@
 #include <memory>
 #include <string>
 
-#include "rivals/Rival.h"
+#include "benchmarks/Benchmarks.h"
+#include "competitors/Competitor.h"
 #include "support/Fill.h"
 #include "support/StoreUnderTest.h"
 #include "support/Window.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -38,11 +38,11 @@ double ourSpace(const Place& place, std::size_t size, std::size_t count, bool in
   return spaceOf(scratch, size, count);
 }
 
-double rivalSpace(const Place& place, std::size_t size, std::size_t count, const OpenRival& open) {
+double competitorSpace(const Place& place, std::size_t size, std::size_t count, const OpenCompetitor& open) {
   const Scratch scratch(place);
   {
-    const std::unique_ptr<Rival> rival = open(scratch.path());
-    putAll(size, count, [&](const std::string& key, const Bytes& value) { rival->put(key, value); });
+    const std::unique_ptr<Competitor> competitor = open(scratch.path());
+    putAll(size, count, [&](const std::string& key, const Bytes& value) { competitor->put(key, value); });
   }
   return spaceOf(scratch, size, count);
 }
@@ -56,7 +56,7 @@ void measureSpace(const Context& context) {
     const std::size_t count = (context.scaled<std::size_t>(16, 4) << 20U) / size / (size < 4096 ? 8 : 1);
     Figures figures = {{"ours", ourSpace(place, size, count, false)}};
     const double inlined = ourSpace(place, size, count, true);
-    for (const auto& [name, open] : rivals()) figures[name] = rivalSpace(place, size, count, open);
+    for (const auto& [name, open] : competitors()) figures[name] = competitorSpace(place, size, count, open);
     context.report.add(Row{sizeName(size), place.name, "", "bytes a byte", figures, {}});
     context.report.add(Row{sizeName(size) + " inline", place.name, "", "bytes a byte", {{"ours", inlined}}, {}});
     figures["ours, inline"] = inlined;

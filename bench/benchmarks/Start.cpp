@@ -7,12 +7,12 @@
 #include <cellar/host/Await.h>
 #include <cellar/host/Host.h>
 
-#include "floors/ManifestFloor.h"
+#include "benchmarks/Benchmarks.h"
+#include "lower_bounds/ManifestLowerBound.h"
 #include "support/Fill.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
 #include "support/StoreUnderTest.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -80,7 +80,7 @@ double fetchOne(StoreUnderTest& store, std::size_t number) {
   return taken;
 }
 
-double selectOne(ManifestFloor& manifest, std::size_t number) {
+double selectOne(ManifestLowerBound& manifest, std::size_t number) {
   const std::string key = keyOf(number);
   const Stopwatch watch;
   Statement statement(manifest.database(),
@@ -106,7 +106,7 @@ void measureUnloaded(const Context& context, const Place& place) {
     for (std::size_t number = 0; number < fetched; ++number) loaded.push_back(fetchOne(store, number));
   }
   {
-    ManifestFloor manifest(directory);
+    ManifestLowerBound manifest(directory);
     for (std::size_t number = 0; number < fetched; ++number) selected.push_back(selectOne(manifest, number));
   }
   std::vector<double> before;
@@ -124,20 +124,20 @@ void measureUnloaded(const Context& context, const Place& place) {
     store->loadManifest();
     meanwhile.push_back(fetchOne(store, number));
   }
-  const double floor = median(loaded) + median(selected);
+  const double lowerBound = median(loaded) + median(selected);
   const std::string name = "a fetch from " + countName(items) + " items, ";
   context.report.add(Row{name + "not loading yet",
                          place.name,
                          cpuName(false),
                          "us",
-                         {{"ours", median(before)}, {"floor", floor}},
-                         {{"floor", 2}}});
+                         {{"ours", median(before)}, {"lower bound", lowerBound}},
+                         {{"lower bound", 2}}});
   context.report.add(Row{name + "while they load",
                          place.name,
                          cpuName(false),
                          "us",
-                         {{"ours", median(meanwhile)}, {"floor", floor}},
-                         {{"floor", 2}}});
+                         {{"ours", median(meanwhile)}, {"lower bound", lowerBound}},
+                         {{"lower bound", 2}}});
 }
 
 }  // namespace

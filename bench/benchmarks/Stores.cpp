@@ -3,14 +3,14 @@
 #include <string>
 #include <vector>
 
-#include "floors/FileFloor.h"
-#include "floors/ManifestFloor.h"
-#include "rivals/Rival.h"
+#include "benchmarks/Benchmarks.h"
+#include "competitors/Competitor.h"
+#include "lower_bounds/FileLowerBound.h"
+#include "lower_bounds/ManifestLowerBound.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
 #include "support/StoreUnderTest.h"
 #include "support/Window.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -28,9 +28,13 @@ struct Case {
 
 std::vector<Case> cases(const Context& context) {
   return {
-      {200, context.scaled<std::size_t>(2000, 500), true, {{"floor", 1.1}}, {}},
-      {4 << 10, context.scaled<std::size_t>(2000, 500), false, {{"floor", 0.85}}, {{"floor", 1.5}}},
-      {64 << 10, context.scaled<std::size_t>(500, 150), false, {{"floor", 0.85}, {"LevelDB", 1}, {"SQLite", 1}}, {}},
+      {200, context.scaled<std::size_t>(2000, 500), true, {{"lower bound", 1.1}}, {}},
+      {4 << 10, context.scaled<std::size_t>(2000, 500), false, {{"lower bound", 0.85}}, {{"lower bound", 1.5}}},
+      {64 << 10,
+       context.scaled<std::size_t>(500, 150),
+       false,
+       {{"lower bound", 0.85}, {"LevelDB", 1}, {"SQLite", 1}},
+       {}},
       {1 << 20, context.scaled<std::size_t>(60, 20), false, {{"LevelDB", 0.2}, {"SQLite", 0.2}}, {}},
   };
 }
@@ -58,10 +62,10 @@ double measureOurs(const Place& place, bool pinned, const Case& what, std::size_
   return result;
 }
 
-double measureFloor(const Place& place, bool pinned, const Case& what) {
+double measureLowerBound(const Place& place, bool pinned, const Case& what) {
   const Scratch scratch(place);
   const Pinned guard(pinned);
-  ManifestFloor manifest(scratch.path());
+  ManifestLowerBound manifest(scratch.path());
   Bytes value = valueOf(what.size);
   const Stopwatch watch;
   for (std::size_t number = 0; number < what.count; ++number) {
@@ -84,19 +88,19 @@ double measureFloor(const Place& place, bool pinned, const Case& what) {
   return result;
 }
 
-double measureRival(const Place& place, bool pinned, const Case& what, const OpenRival& open) {
+double measureCompetitor(const Place& place, bool pinned, const Case& what, const OpenCompetitor& open) {
   const Scratch scratch(place);
   const Pinned guard(pinned);
-  const std::unique_ptr<Rival> rival = open(scratch.path());
+  const std::unique_ptr<Competitor> competitor = open(scratch.path());
   Bytes value = valueOf(what.size);
   const Stopwatch watch;
   for (std::size_t number = 0; number < what.count; ++number) {
     stamp(value, number);
-    rival->put(keyOf(number), value);
+    competitor->put(keyOf(number), value);
   }
   const double result = average(watch, what.count);
   for (std::size_t number = 0; number < what.count; ++number) {
-    throwUnlessValue(rival->get(keyOf(number)), what.size, number);
+    throwUnlessValue(competitor->get(keyOf(number)), what.size, number);
   }
   return result;
 }
@@ -105,10 +109,10 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   Contestants contestants = {
       {"64", [&] { return measureOurs(place, pinned, what, kOutstanding); }},
       {"1", [&] { return measureOurs(place, pinned, what, 1); }},
-      {"floor", [&] { return measureFloor(place, pinned, what); }},
+      {"lower bound", [&] { return measureLowerBound(place, pinned, what); }},
   };
-  for (const auto& [name, open] : rivals()) {
-    contestants.emplace_back(name, [&, open = open] { return measureRival(place, pinned, what, open); });
+  for (const auto& [name, open] : competitors()) {
+    contestants.emplace_back(name, [&, open = open] { return measureCompetitor(place, pinned, what, open); });
   }
   Figures figures = interleaved(place, contestants, context.scaled(5, 3), what.count * what.size);
   const double outstanding = figures.extract("64").mapped();

@@ -19,11 +19,11 @@
 #include <cellar/TrashCollector.h>
 #include <cellar/host/ThreadQueueFactory.h>
 
+#include "benchmarks/Benchmarks.h"
 #include "support/Fill.h"
 #include "support/Samples.h"
 #include "support/Stopwatch.h"
 #include "support/Values.h"
-#include "topics/Topics.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -181,7 +181,7 @@ void measureTrash(const Context& context, const Place& place) {
     const Scratch scratch(place);
     const Figures figures = interleaved(
         place,
-        {{"ours", [&] { return collecting(scratch, count); }}, {"floor", [&] { return moving(scratch, count); }}},
+        {{"ours", [&] { return collecting(scratch, count); }}, {"lower bound", [&] { return moving(scratch, count); }}},
         context.scaled(11, 5), 0);
     const std::string name = "collectPath of " + countName(count) + " files";
     context.report.add(Row{name, place.name, cpuName(false), "us", figures, {{"", 50}}});

@@ -12,25 +12,25 @@ namespace velmora::mobile::xplat::cellar::bench {
 
 // What applications use instead: values by key, on the caller's thread. Each is set up as its users would for data that
 // survives a killed process, without a sync for each write.
-class Rival {
+class Competitor {
  public:
-  Rival() = default;
-  virtual ~Rival() = default;
-  Rival(const Rival&) = delete;
-  Rival& operator=(const Rival&) = delete;
+  Competitor() = default;
+  virtual ~Competitor() = default;
+  Competitor(const Competitor&) = delete;
+  Competitor& operator=(const Competitor&) = delete;
 
   virtual void put(const std::string& key, const Bytes& value) = 0;
   virtual Bytes get(const std::string& key) = 0;  // throws when there is none
 };
 
-using OpenRival = std::function<std::unique_ptr<Rival>(const std::string& directory)>;
+using OpenCompetitor = std::function<std::unique_ptr<Competitor>(const std::string& directory)>;
 
-std::unique_ptr<Rival> openLevelDB(const std::string& directory);
-std::unique_ptr<Rival> openLMDB(const std::string& directory);
-std::unique_ptr<Rival> openRocksDB(const std::string& directory);
-std::unique_ptr<Rival> openSQLite(const std::string& directory);
+std::unique_ptr<Competitor> openLevelDB(const std::string& directory);
+std::unique_ptr<Competitor> openLMDB(const std::string& directory);
+std::unique_ptr<Competitor> openRocksDB(const std::string& directory);
+std::unique_ptr<Competitor> openSQLite(const std::string& directory);
 
 // All of them, by the names that reports have.
-const std::vector<std::pair<std::string, OpenRival>>& rivals();
+const std::vector<std::pair<std::string, OpenCompetitor>>& competitors();
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -1,9 +1,9 @@
-#include "rivals/Rival.h"
+#include "competitors/Competitor.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-const std::vector<std::pair<std::string, OpenRival>>& rivals() {
-  static const std::vector<std::pair<std::string, OpenRival>> all = {
+const std::vector<std::pair<std::string, OpenCompetitor>>& competitors() {
+  static const std::vector<std::pair<std::string, OpenCompetitor>> all = {
       {"LevelDB", openLevelDB}, {"LMDB", openLMDB}, {"RocksDB", openRocksDB}, {"SQLite", openSQLite}};
   return all;
 }

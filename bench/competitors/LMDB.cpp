@@ -3,7 +3,7 @@
 #include <filesystem>
 #include <stdexcept>
 
-#include "rivals/Rival.h"
+#include "competitors/Competitor.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -20,7 +20,7 @@ MDB_val bytesOf(const void* data, std::size_t size) { return {size, const_cast<v
 
 // A transaction for each operation. Without a sync: what is written is the system's by then, so a killed process loses
 // nothing.
-class LMDB : public Rival {
+class LMDB : public Competitor {
  public:
   explicit LMDB(const std::string& directory) {
     const std::string path = directory + "/lmdb";
@@ -71,6 +71,6 @@ class LMDB : public Rival {
 
 }  // namespace
 
-std::unique_ptr<Rival> openLMDB(const std::string& directory) { return std::make_unique<LMDB>(directory); }
+std::unique_ptr<Competitor> openLMDB(const std::string& directory) { return std::make_unique<LMDB>(directory); }
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -2,7 +2,7 @@
 
 #include <stdexcept>
 
-#include "rivals/Rival.h"
+#include "competitors/Competitor.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -12,7 +12,7 @@ void throwUnlessOk(const leveldb::Status& status) {
   if (!status.ok()) throw std::runtime_error(status.ToString());
 }
 
-class LevelDB : public Rival {
+class LevelDB : public Competitor {
  public:
   explicit LevelDB(const std::string& directory) {
     leveldb::Options options;
@@ -39,6 +39,6 @@ class LevelDB : public Rival {
 
 }  // namespace
 
-std::unique_ptr<Rival> openLevelDB(const std::string& directory) { return std::make_unique<LevelDB>(directory); }
+std::unique_ptr<Competitor> openLevelDB(const std::string& directory) { return std::make_unique<LevelDB>(directory); }
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -2,7 +2,7 @@
 
 #include <stdexcept>
 
-#include "rivals/Rival.h"
+#include "competitors/Competitor.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
@@ -12,7 +12,7 @@ void throwUnlessOk(const rocksdb::Status& status) {
   if (!status.ok()) throw std::runtime_error(status.ToString());
 }
 
-class RocksDB : public Rival {
+class RocksDB : public Competitor {
  public:
   explicit RocksDB(const std::string& directory) {
     rocksdb::Options options;
@@ -39,6 +39,6 @@ class RocksDB : public Rival {
 
 }  // namespace
 
-std::unique_ptr<Rival> openRocksDB(const std::string& directory) { return std::make_unique<RocksDB>(directory); }
+std::unique_ptr<Competitor> openRocksDB(const std::string& directory) { return std::make_unique<RocksDB>(directory); }
 
 }  // namespace velmora::mobile::xplat::cellar::bench

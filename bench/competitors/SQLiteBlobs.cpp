@@ -1,14 +1,14 @@
 #include <stdexcept>
 
-#include "floors/SQLite.h"
-#include "rivals/Rival.h"
+#include "competitors/Competitor.h"
+#include "lower_bounds/SQLite.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
 namespace {
 
 // Values as blobs in a table, by statements that are prepared once.
-class SQLiteBlobs : public Rival {
+class SQLiteBlobs : public Competitor {
  public:
   explicit SQLiteBlobs(const std::string& directory) : database_(directory + "/blobs.sqlite") {
     database_.exec(
@@ -39,6 +39,8 @@ class SQLiteBlobs : public Rival {
 
 }  // namespace
 
-std::unique_ptr<Rival> openSQLite(const std::string& directory) { return std::make_unique<SQLiteBlobs>(directory); }
+std::unique_ptr<Competitor> openSQLite(const std::string& directory) {
+  return std::make_unique<SQLiteBlobs>(directory);
+}
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -14,9 +14,9 @@
 #include <cellar/host/testing/ManualQueue.h>
 
 #include "counts/Scenario.h"
-#include "floors/FileFloor.h"
-#include "floors/ManifestFloor.h"
 #include "host/testing/ManualClock.h"
+#include "lower_bounds/FileLowerBound.h"
+#include "lower_bounds/ManifestLowerBound.h"
 #include "support/Values.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
@@ -42,7 +42,7 @@ class CacheScenario : public Scenario {
       : directory_(directory + "/store") {
     const auto files = std::make_shared<FileUtils>();
     files->createDirectory(directory_, true);
-    if (itemsBefore > 0) ManifestFloor(directory_).fill(itemsBefore, kSize);
+    if (itemsBefore > 0) ManifestLowerBound(directory_).fill(itemsBefore, kSize);
     const auto queues = std::shared_ptr<TaskQueueFactory>(&queues_, [](TaskQueueFactory*) {});
     cache_ = std::make_shared<DiskCache>(
         directory_, directory + "/tmp", "counted", std::nullopt, kTenYears, normalSize, normalSize, false, queues,

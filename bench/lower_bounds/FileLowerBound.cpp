@@ -1,4 +1,4 @@
-#include "floors/FileFloor.h"
+#include "lower_bounds/FileLowerBound.h"
 
 #include <cerrno>
 #include <cstdio>

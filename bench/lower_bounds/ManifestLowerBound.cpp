@@ -1,4 +1,4 @@
-#include "floors/ManifestFloor.h"
+#include "lower_bounds/ManifestLowerBound.h"
 
 #include <stdexcept>
 
@@ -40,30 +40,30 @@ void bindRecord(Statement& statement, const std::string& key, std::size_t size, 
 
 }  // namespace
 
-ManifestFloor::ManifestFloor(const std::string& directory) : database_(directory + "/manifest_v1.sqlite") {
+ManifestLowerBound::ManifestLowerBound(const std::string& directory) : database_(directory + "/manifest_v1.sqlite") {
   database_.exec(kScript);
 }
 
-void ManifestFloor::put(const std::string& key, std::size_t size, std::int32_t date) {
+void ManifestLowerBound::put(const std::string& key, std::size_t size, std::int32_t date) {
   Statement statement(database_, kPut);
   bindRecord(statement, key, size, date);
   statement.next();
 }
 
-void ManifestFloor::putValue(const std::string& key, const Bytes& value) {
+void ManifestLowerBound::putValue(const std::string& key, const Bytes& value) {
   Statement statement(database_, kPutValue);
   statement.text(1, key).blob(2, value).next();
 }
 
-Bytes ManifestFloor::value(const std::string& key) {
+Bytes ManifestLowerBound::value(const std::string& key) {
   Statement statement(database_, "SELECT  inline_data FROM  LarderManifest WHERE  has_inline_data IS 1 AND  key = ?1");
   if (!statement.text(1, key).next()) throw std::runtime_error("no record of " + key);
   return statement.blob(0);
 }
 
-void ManifestFloor::remove(const std::string& key) { Statement(database_, kRemove).text(1, key).next(); }
+void ManifestLowerBound::remove(const std::string& key) { Statement(database_, kRemove).text(1, key).next(); }
 
-void ManifestFloor::fill(std::size_t count, std::size_t size) {
+void ManifestLowerBound::fill(std::size_t count, std::size_t size) {
   database_.exec("PRAGMA cache_size = -500000");  // in KiB: all of it
   database_.exec("BEGIN");
   {

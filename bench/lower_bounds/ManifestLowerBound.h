@@ -4,15 +4,15 @@
 #include <cstdint>
 #include <string>
 
-#include "floors/SQLite.h"
+#include "lower_bounds/SQLite.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
 // The records of a store on disk, written by hand: the same table by the same statements, each prepared anew for each
 // operation, and nothing else.
-class ManifestFloor {
+class ManifestLowerBound {
  public:
-  explicit ManifestFloor(const std::string& directory);
+  explicit ManifestLowerBound(const std::string& directory);
 
   void put(const std::string& key, std::size_t size, std::int32_t date);
   void putValue(const std::string& key, const Bytes& value);  // of a record that is there

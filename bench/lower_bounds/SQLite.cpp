@@ -1,4 +1,4 @@
-#include "floors/SQLite.h"
+#include "lower_bounds/SQLite.h"
 
 #include <sqlite3.h>
 

@@ -9,7 +9,7 @@
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-// What a topic needs to know.
+// What a benchmark needs to know.
 struct Context {
   bool quick = false;
   std::vector<Place> places{};

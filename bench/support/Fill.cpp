@@ -4,8 +4,8 @@
 
 #include <filesystem>
 
-#include "floors/FileFloor.h"
-#include "floors/ManifestFloor.h"
+#include "lower_bounds/FileLowerBound.h"
+#include "lower_bounds/ManifestLowerBound.h"
 #include "support/Values.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
@@ -15,7 +15,7 @@ void Manifests::copyTo(const std::string& directory, std::size_t count) {
   if (file.empty()) {
     const std::string place = scratch_ / std::to_string(count);
     std::filesystem::create_directories(place);
-    ManifestFloor(place).fill(count, kItemSize);
+    ManifestLowerBound(place).fill(count, kItemSize);
     file = place + "/manifest_v1.sqlite";
   }
   std::filesystem::create_directories(directory);

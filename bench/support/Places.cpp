@@ -10,7 +10,7 @@
 #include <filesystem>
 #include <system_error>
 
-#include "floors/FileFloor.h"
+#include "lower_bounds/FileLowerBound.h"
 #include "support/Values.h"
 
 namespace velmora::mobile::xplat::cellar::bench {

@@ -51,27 +51,44 @@ std::string scriptOf(const Plot& plot) {
   return script.str();
 }
 
+std::string beginOf(const std::string& name) { return "<!-- begin: " + name + " -->\n"; }
+std::string endOf(const std::string& name) { return "<!-- end: " + name + " -->\n"; }
+
+std::string textOf(const std::string& path) {
+  std::ifstream file(path);
+  return {std::istreambuf_iterator<char>(file), {}};
+}
+
+void write(const std::string& document, const std::string& path) {
+  std::ofstream file(path);
+  file << document;
+  if (!file.flush()) throw std::runtime_error("cannot write " + path);
+}
+
 }  // namespace
 
 std::string withSection(const std::string& document, const std::string& name, const std::string& content) {
-  const std::string begin = "<!-- begin: " + name + " -->\n";
-  const std::string end = "<!-- end: " + name + " -->\n";
-  const auto first = document.find(begin);
-  const auto last = document.find(end, first);
+  const auto first = document.find(beginOf(name));
+  const auto last = document.find(endOf(name), first);
   if (first == std::string::npos || last == std::string::npos) {
     throw std::runtime_error("the document has no place for '" + name + "'");
   }
-  return document.substr(0, first + begin.size()) + content + document.substr(last);
+  return document.substr(0, first + beginOf(name).size()) + content + document.substr(last);
 }
 
 void recordTables(const Report& report, const std::string& documentPath) {
-  std::ifstream source(documentPath);
-  std::string document((std::istreambuf_iterator<char>(source)), {});
-  document = withSection(document, "environment", environmentText());
-  for (const auto& topic : report.topics()) document = withSection(document, topic.name, tableMarkdown(topic));
-  std::ofstream target(documentPath);
-  target << document;
-  if (!target.flush()) throw std::runtime_error("cannot write " + documentPath);
+  std::string document = withSection(textOf(documentPath), "environment", environmentText());
+  for (const auto& section : report.sections()) document = withSection(document, section.name, tableMarkdown(section));
+  write(document, documentPath);
+}
+
+void recordSummaries(const Report& report, const std::string& documentPath) {
+  std::string document = withSection(textOf(documentPath), "environment", environmentText());
+  for (const auto& section : report.sections()) {
+    if (document.find(beginOf(section.name)) == std::string::npos) continue;
+    document = withSection(document, section.name, summaryMarkdown(section));
+  }
+  write(document, documentPath);
 }
 
 void writePlotScripts(const Report& report, const std::string& directory) {

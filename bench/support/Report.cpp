@@ -7,13 +7,15 @@
 #include <utility>
 
 #include "Table.h"
+#include "support/Places.h"
 
 namespace velmora::mobile::xplat::cellar::bench {
 
 namespace {
 
-constexpr const char* kFastest = "fastest rival";
-const std::vector<std::string> kContestants = {"ours", "floor", "LevelDB", "LMDB", "RocksDB", "SQLite", "du", "rm -rf"};
+constexpr const char* kFastest = "fastest competitor";
+const std::vector<std::string> kContestants = {"ours",    "lower bound", "LevelDB", "LMDB",
+                                               "RocksDB", "SQLite",      "du",      "rm -rf"};
 
 std::string formatted(double value) {
   char text[32];
@@ -26,13 +28,13 @@ double comparedWith(const Row& row, const Goal& goal) {
   if (goal.against != kFastest) return row.figures.at(goal.against);
   double fastest = std::numeric_limits<double>::max();
   for (const auto& [name, figure] : row.figures) {
-    if (name != "ours" && name != "floor") fastest = std::min(fastest, figure);
+    if (name != "ours" && name != "lower bound") fastest = std::min(fastest, figure);
   }
   return fastest;
 }
 
-bool contains(const Report::Topic& topic, const std::string& contestant) {
-  return std::any_of(topic.rows.begin(), topic.rows.end(),
+bool contains(const Report::Section& section, const std::string& contestant) {
+  return std::any_of(section.rows.begin(), section.rows.end(),
                      [&](const Row& row) { return row.figures.count(contestant) > 0; });
 }
 
@@ -43,19 +45,19 @@ std::string goalText(const Row& row, const Goal& goal) {
 
 using Cells = std::vector<std::string>;
 
-Cells titlesOf(const Report::Topic& topic) {
+Cells titlesOf(const Report::Section& section) {
   Cells titles = {"what", "where", "on", "unit"};
   for (const auto& contestant : kContestants) {
-    if (contains(topic, contestant)) titles.push_back(contestant);
+    if (contains(section, contestant)) titles.push_back(contestant);
   }
   for (const char* title : {"ratio", "goal", "met"}) titles.emplace_back(title);
   return titles;
 }
 
-Cells figureCells(const Report::Topic& topic, const Row& row) {
+Cells figureCells(const Report::Section& section, const Row& row) {
   Cells cells;
   for (const auto& contestant : kContestants) {
-    if (!contains(topic, contestant)) continue;
+    if (!contains(section, contestant)) continue;
     const auto figure = row.figures.find(contestant);
     cells.push_back(figure == row.figures.end() ? "" : formatted(figure->second));
   }
@@ -68,8 +70,8 @@ Cells verdictCells(const Row& row, const Goal& goal) {
 }
 
 // A row with several goals has a line for each, the figures only in the first.
-std::vector<Cells> linesOf(const Report::Topic& topic, const Row& row) {
-  const Cells figures = figureCells(topic, row);
+std::vector<Cells> linesOf(const Report::Section& section, const Row& row) {
+  const Cells figures = figureCells(section, row);
   Cells first = {row.what, row.where, row.cpus, row.unit};
   first.insert(first.end(), figures.begin(), figures.end());
   std::vector<Cells> lines;
@@ -79,10 +81,33 @@ std::vector<Cells> linesOf(const Report::Topic& topic, const Row& row) {
     lines.push_back(std::move(line));
   }
   if (!lines.empty()) return lines;
-  const bool hasFloor = row.figures.count("floor") > 0;
-  first.push_back(hasFloor ? formatted(ratioOf(row, {"floor", 0})) : "");
+  const bool hasLowerBound = row.figures.count("lower bound") > 0;
+  first.push_back(hasLowerBound ? formatted(ratioOf(row, {"lower bound", 0})) : "");
   first.resize(first.size() + 2);
   return {first};
+}
+
+bool isFigure(const std::string& title) {
+  return title == "ratio" || std::count(kContestants.begin(), kContestants.end(), title) > 0;
+}
+
+std::string markdown(const Cells& titles, const std::vector<Cells>& lines) {
+  const auto line = [](const Cells& cells) {
+    std::string text = "|";
+    for (const auto& cell : cells) text += " " + cell + " |";
+    return text + "\n";
+  };
+  std::string text = line(titles) + "|";
+  for (const auto& title : titles) text += isFigure(title) ? "---:|" : "---|";
+  text += "\n";
+  for (const Cells& cells : lines) text += line(cells);
+  return text;
+}
+
+// Of the places, the first alone; of the two ways to use processors, all of them.
+bool isInSummary(const Report::Section& section, const Row& row) {
+  const bool isOfFirstPlace = row.where == section.rows.front().where || row.where == "memory";
+  return isOfFirstPlace && row.cpus != cpuName(true);
 }
 
 nlohmann::ordered_json jsonOf(const Row& row) {
@@ -99,16 +124,16 @@ nlohmann::ordered_json jsonOf(const Row& row) {
 
 }  // namespace
 
-void Report::begin(const std::string& name, const std::string& title) { topics_.push_back({name, title, {}}); }
+void Report::begin(const std::string& name, const std::string& title) { sections_.push_back({name, title, {}}); }
 
-void Report::add(Row row) { topics_.back().rows.push_back(std::move(row)); }
+void Report::add(Row row) { sections_.back().rows.push_back(std::move(row)); }
 
 void Report::add(Plot plot) { plots_.push_back(std::move(plot)); }
 
 nlohmann::ordered_json Report::json() const {
   nlohmann::ordered_json json = nlohmann::ordered_json::object();
-  for (const Topic& topic : topics_) {
-    for (const Row& row : topic.rows) json[topic.name].push_back(jsonOf(row));
+  for (const Section& section : sections_) {
+    for (const Row& row : section.rows) json[section.name].push_back(jsonOf(row));
   }
   return json;
 }
@@ -120,36 +145,38 @@ bool isMet(const Row& row, const Goal& goal) {
   return measured <= goal.limit;
 }
 
-std::string tableText(const Report::Topic& topic) {
+std::string tableText(const Report::Section& section) {
   std::vector<tools::Table::Column> columns;
-  for (const auto& title : titlesOf(topic)) {
-    const bool isFigure = std::count(kContestants.begin(), kContestants.end(), title) > 0 || title == "ratio";
-    columns.push_back({title, isFigure ? tools::Table::Align::Right : tools::Table::Align::Left});
+  for (const auto& title : titlesOf(section)) {
+    columns.push_back({title, isFigure(title) ? tools::Table::Align::Right : tools::Table::Align::Left});
   }
   tools::Table table(columns);
-  for (const Row& row : topic.rows) {
-    for (Cells& line : linesOf(topic, row)) table.addRow(std::move(line));
+  for (const Row& row : section.rows) {
+    for (Cells& line : linesOf(section, row)) table.addRow(std::move(line));
   }
   return table.text();
 }
 
-std::string tableMarkdown(const Report::Topic& topic) {
-  const auto line = [](const Cells& cells) {
-    std::string text = "|";
-    for (const auto& cell : cells) text += " " + cell + " |";
-    return text + "\n";
-  };
-  const Cells titles = titlesOf(topic);
-  std::string text = line(titles) + "|";
-  for (const auto& title : titles) {
-    const bool isFigure = std::count(kContestants.begin(), kContestants.end(), title) > 0 || title == "ratio";
-    text += isFigure ? "---:|" : "---|";
+std::string tableMarkdown(const Report::Section& section) {
+  std::vector<Cells> lines;
+  for (const Row& row : section.rows) {
+    for (Cells& line : linesOf(section, row)) lines.push_back(std::move(line));
   }
-  text += "\n";
-  for (const Row& row : topic.rows) {
-    for (const Cells& cells : linesOf(topic, row)) text += line(cells);
+  return markdown(titlesOf(section), lines);
+}
+
+std::string summaryMarkdown(const Report::Section& section) {
+  Cells titles = {"what", "unit"};
+  for (const auto& contestant : kContestants) {
+    if (contains(section, contestant)) titles.push_back(contestant);
   }
-  return text;
+  std::vector<Cells> lines;
+  for (const Row& row : section.rows) {
+    if (!isInSummary(section, row)) continue;
+    lines.push_back({row.what, row.unit});
+    for (auto& cell : figureCells(section, row)) lines.back().push_back(std::move(cell));
+  }
+  return markdown(titles, lines);
 }
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -10,14 +10,14 @@
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-// Ours is to be at most `limit` times that of `against`: "floor", the name of a rival, "fastest rival", or empty when
-// the limit is a figure of its own.
+// Ours is to be at most `limit` times that of `against`: "lower bound", the name of a competitor, "fastest competitor",
+// or empty when the limit is a figure of its own.
 struct Goal {
   std::string against;
   double limit;
 };
 
-// One comparison: what was measured where, and the figures of all who took part ("ours", "floor", rivals).
+// One comparison: what was measured where, and the figures of all who took part ("ours", "lower bound", competitors).
 struct Row {
   std::string what;
   std::string where;
@@ -37,26 +37,26 @@ struct Plot {
   std::map<std::string, std::vector<std::pair<double, double>>> lines{};
 };
 
-// What was measured, by topic.
+// What was measured, a section for each benchmark.
 class Report {
  public:
-  // What is added from now on belongs to this topic.
+  // What is added from now on belongs to this section.
   void begin(const std::string& name, const std::string& title);
   void add(Row row);
   void add(Plot plot);
 
-  struct Topic {
+  struct Section {
     std::string name;
     std::string title;
     std::vector<Row> rows;
   };
-  const std::vector<Topic>& topics() const { return topics_; }
+  const std::vector<Section>& sections() const { return sections_; }
   const std::vector<Plot>& plots() const { return plots_; }
 
   nlohmann::ordered_json json() const;
 
  private:
-  std::vector<Topic> topics_;
+  std::vector<Section> sections_;
   std::vector<Plot> plots_;
 };
 
@@ -64,8 +64,11 @@ class Report {
 double ratioOf(const Row& row, const Goal& goal);
 bool isMet(const Row& row, const Goal& goal);
 
-// The rows of a topic, as a table for a terminal or in Markdown.
-std::string tableText(const Report::Topic& topic);
-std::string tableMarkdown(const Report::Topic& topic);
+// The rows of a section, as a table for a terminal or in Markdown.
+std::string tableText(const Report::Section& section);
+std::string tableMarkdown(const Report::Section& section);
+
+// In Markdown, only the figures, and only those of the first place on all processors.
+std::string summaryMarkdown(const Report::Section& section);
 
 }  // namespace velmora::mobile::xplat::cellar::bench
