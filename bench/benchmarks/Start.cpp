@@ -68,7 +68,7 @@ void measureHost(const Context& context, const Place& place) {
   add("configuration of 200 stores and threads", host, {});
   add("from the factory to the first store ever", first, {{"", 2000}});
   add("from the factory to the first store, again", store, {{"", 2000}});
-  add("from the factory to its first answer", answer, {{"", 2000}});
+  add("from the factory to its first value", answer, {{"", 2000}});
 }
 
 double fetchOne(StoreUnderTest& store, std::size_t number) {

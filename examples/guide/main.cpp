@@ -88,7 +88,7 @@ int main(int argc, char** argv) {
     std::cout << "draft: " << shown.get_future().get() << '\n';
 
     exportAlbum(*host, "summer.zip");
-    host->logOut();  // alice's thumbs, drafts and exports are gone
+    host->logOut();  // alice's thumbs, drafts and exports are removed
     const auto bobs = host->store<cellar::PersistentKeyValueStore>("drafts", "bob");
     std::cout << "bob has a letter: " << (cellar::host::await(bobs->fetch("letter")) != nullptr ? "yes" : "no") << '\n';
     for (const auto& session : host->sessions()) std::cout << "data of: " << session.key.value_or("?") << '\n';
