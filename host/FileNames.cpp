@@ -29,7 +29,7 @@ std::string encoded(const std::string& bytes) {
   return name;
 }
 
-// Takes what is no digit for 0: whoever calls compares the outcome with what it came from.
+// 0 for a character that is not a digit: the caller encodes the result again and compares.
 std::size_t valueOf(char digit) {
   const std::size_t value = std::string(kDigits).find(digit);
   return value == std::string::npos ? 0 : value;
@@ -57,7 +57,7 @@ std::string decodeFileName(const std::string& name) {
     }
   }
   if (encoded(bytes) != name || name.size() > kLongestName) {
-    throw std::invalid_argument("'" + name + "' is no encoded file name.");
+    throw std::invalid_argument("'" + name + "' is not an encoded file name.");
   }
   return bytes;
 }

@@ -7,8 +7,8 @@
 namespace velmora::mobile::xplat::cellar::host {
 
 // A file name for any bytes: percent-encoded, except a-z, 0-9, "-" and a "." that is not the first character. Different
-// bytes give different names, on file systems that ignore case too; no name is "." or "..", holds a "/" or a zero byte,
-// or is one that a store reserves for itself. No bytes at all become "%". For keys that are not under your own control:
+// bytes give different names, also on file systems that ignore case. No name is "." or "..", contains a "/" or a zero
+// byte, or is one that a store reserves for itself. The empty text becomes "%". For keys that you do not control:
 //
 //   store->fetch(host::encodeFileName(url));
 //
@@ -16,7 +16,8 @@ namespace velmora::mobile::xplat::cellar::host {
 // instead.
 CELLAR_EXPORT std::string encodeFileName(const std::string& bytes);
 
-// The bytes that the name was made of. Throws `std::invalid_argument` for a name that `encodeFileName` does not make.
+// The bytes that were encoded as this name. Throws `std::invalid_argument` for a name that `encodeFileName` cannot
+// return.
 CELLAR_EXPORT std::string decodeFileName(const std::string& name);
 
 }  // namespace velmora::mobile::xplat::cellar::host

@@ -33,7 +33,7 @@ namespace {
 
 constexpr std::array<Area, 3> kAreas = {Area::Caches, Area::Documents, Area::Shared};
 
-// Managers of one area and scope have the same directory, and each takes the stores of the other for stale ones.
+// Managers of one area and scope share a directory, and each treats the stores of the other as stale.
 void refuseSharedDirectories(const Configuration& configuration, const JsonValue& document) {
   std::map<std::pair<Area, bool>, std::string> owners;
   for (const auto& [name, ignored] : document.items()) {
@@ -80,8 +80,8 @@ HostOptions plainOptions(const std::string& configuration, const std::string& ro
 
 }  // namespace
 
-// A request on its way: the managers of its scope do not end meanwhile. Refused while they are ending, for a callback
-// on a store's queue that waited here would be waited for by the end of that store.
+// A request in progress: the managers of its scope are not ended during it. Refused while they are being ended: if a
+// callback on a store's queue waited here, it would deadlock with the end of that store.
 class Host::Request {
  public:
   // Throws for a name that the configuration does not have.
@@ -113,8 +113,7 @@ class Host::Request {
   Scope& scope_;
 };
 
-// The time in which a scope lets nobody in. One at a time; begins when the requests that are under way have got
-// through.
+// The time in which a scope refuses requests. One at a time; begins when the requests in progress have finished.
 class Host::Ending {
  public:
   Ending(Host& host, Scope& scope) : host_(host), scope_(scope) {
@@ -195,7 +194,7 @@ Host::~Host() {
   if (threads_->drain(shutDownPatience_)) {
     threads_->shutDown();
   } else {
-    LOG(ERROR) << "Host is destroyed while its queues are at work, their threads are left behind.";
+    LOG(ERROR) << "Host destroyed with work pending; its threads were detached.";
     threads_->abandon();
   }
 }
@@ -224,12 +223,12 @@ std::shared_ptr<StoreManager> Host::managerIn(const Request& request, const std:
   auto manager = build(*request.definition, session);
   slot.manager = manager;
   lock.unlock();
-  // It has registered the directories of its unmanaged stores; measuring them is nobody else's task.
+  // The manager has only registered the directories of its unmanaged stores; the host has to have them measured.
   lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
   return manager;
 }
 
-// By a factory of its own: one that has failed to build a manager never builds it again.
+// With a new factory each time: a factory that failed to build a manager never tries again.
 std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definition, const std::string& sessionKey) {
   StoreManagerFactory factory(definition.sessionScoped, analytics_, attributes_, configuration_, sizes_, fileUtils_,
                               lazyWork_, locations_, nameBuilders_, taskQueueFactory_, trash_, sessionTagMapper_);
@@ -243,7 +242,8 @@ std::string Host::openSession(const std::optional<std::string>& sessionKey) {
   if (!openSession_) {
     SessionName session{sessionKey.value_or(""), ""};
     lock.unlock();
-    session.tag = sessionTagMapper_(session.key);  // throws for a key that cannot name a directory: it opens no session
+    session.tag =
+        sessionTagMapper_(session.key);  // throws for a key that cannot name a directory: no session is opened
     lock.lock();
     if (discardedTag_ == session.tag) throw InvalidatedException("The session is being logged out.");
     if (!openSession_) openSession_ = std::move(session);
@@ -277,7 +277,7 @@ bool Host::endSession(const SessionName& session) {
   while (true) {
     const Discarding discarding(*this, session.tag);
     if (!discarding.isOpen()) return discard(session);
-    if (endOpenSession(session.tag)) return true;  // unless somebody else has ended it just now
+    if (endOpenSession(session.tag)) return true;  // false if another thread has just ended it
   }
 }
 
@@ -306,7 +306,7 @@ bool Host::endOpenSession(const std::optional<std::string>& tag) {
   return true;
 }
 
-// Called while the scope is ending, so that nobody else uses its managers. One that throws is left to the next attempt.
+// Called while the scope is ending, so that its managers are not used. If one throws, the next attempt continues there.
 void Host::invalidateAll(Scope& scope) {
   for (auto& [name, slot] : scope.managers) {
     if (slot.manager != nullptr) slot.manager->invalidate();
@@ -314,7 +314,7 @@ void Host::invalidateAll(Scope& scope) {
   }
 }
 
-// Whether there was anything. What cannot be discarded in one area does not keep the other areas from it.
+// Whether there was anything. A failure in one area does not prevent the other areas from being discarded.
 bool Host::discard(const SessionName& session) {
   const std::string name = nameBuilders_->createStoreDirectoryNameBuilder(session.tag)->buildStoreManagerName();
   bool isFound = false;
@@ -330,8 +330,8 @@ bool Host::discard(const SessionName& session) {
   return isFound;
 }
 
-// Whether there was anything. Looks again afterwards: a store that is being created in the background may have put its
-// directory back.
+// Whether there was anything. Checks again afterwards: a store that is being created in the background may have created
+// its directory again.
 bool Host::discardIn(const std::string& area, const std::string& name) {
   const std::string path = fileUtils_->combinePath(area, name);
   int attempts = 0;
@@ -342,7 +342,7 @@ bool Host::discardIn(const std::string& area, const std::string& name) {
   return attempts > 0;
 }
 
-// Listing says when the area cannot be read, but not on every file system what is a directory.
+// Listing reports an area that cannot be read, but not on every file system which entries are directories.
 bool Host::holds(const std::string& area, const std::string& name) const {
   const auto names = directoriesIn(area);
   return std::find(names.begin(), names.end(), name) != names.end() ||
@@ -375,7 +375,7 @@ std::optional<std::string> Host::keyOf(const std::string& tag) const {
   return std::nullopt;
 }
 
-// The names of its directories, and links, which may lead to some. None where there is no area yet.
+// The names of its directories and links (which may point to directories). None if the area does not exist yet.
 std::vector<std::string> Host::directoriesIn(const std::string& area) const {
   std::vector<std::string> names;
   try {

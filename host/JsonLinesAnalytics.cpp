@@ -15,7 +15,7 @@ namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
 
-// Keeps the members in the order in which they are written.
+// Keeps the members in their order.
 using OrderedJson = nlohmann::ordered_json;
 
 OrderedJson payloadValue(const std::string& payload) {
@@ -37,15 +37,16 @@ std::FILE* openForAppending(const std::string& path) {
     const int code = errno;
     throw FileUtilsIoException(code, "Could not open file: " + std::generic_category().message(code));
   }
-  std::setvbuf(file, nullptr, _IONBF, 0);  // a line is written at once, or its failure is known at once
+  std::setvbuf(file, nullptr, _IONBF, 0);  // so that each line is written, or fails, at once
   return file;
 }
 
 }  // namespace
 
-JsonLinesAnalytics::JsonLinesAnalytics(std::ostream& stream) : stream_(&stream) {}
+JsonLinesAnalytics::JsonLinesAnalytics(std::ostream& stream) : target_("a stream"), stream_(&stream) {}
 
-JsonLinesAnalytics::JsonLinesAnalytics(const std::string& path) : stream_(nullptr), file_(openForAppending(path)) {}
+JsonLinesAnalytics::JsonLinesAnalytics(const std::string& path)
+    : target_("'" + path + "'"), stream_(nullptr), file_(openForAppending(path)) {}
 
 JsonLinesAnalytics::~JsonLinesAnalytics() = default;
 
@@ -59,7 +60,7 @@ void JsonLinesAnalytics::logEvent(const std::string& eventName, const std::strin
     event["payload"] = payloadValue(payload);
     event["time"] = timeValue(time);
     const std::string line = event.dump(-1, ' ', false, OrderedJson::error_handler_t::replace) + "\n";
-    // What a failed write left behind is a line of its own, and not the beginning of this one.
+    // A part that a failed write may have left is ended first, so that it is not the beginning of this line.
     if (write(lock, failing_ ? "\n" + line : line)) {
       failing_ = false;
     } else {
@@ -74,14 +75,14 @@ void JsonLinesAnalytics::logEvent(const std::string& eventName, const std::strin
 
 bool JsonLinesAnalytics::write(const Lock& /*lock*/, const std::string& line) {
   if (stream_ == nullptr) return std::fwrite(line.data(), 1, line.size(), file_.get()) == line.size();
-  stream_->clear();  // an earlier failure may have passed
+  stream_->clear();  // the cause of an earlier failure may be over
   stream_->write(line.data(), static_cast<std::streamsize>(line.size()));
   stream_->flush();
   return stream_->good();
 }
 
 void JsonLinesAnalytics::noteFailure(const Lock& /*lock*/, const std::string& reason) {
-  if (!failing_) LOG(ERROR) << "Cannot write analytics: " << reason;
+  if (!failing_) LOG(ERROR) << "Cannot write analytics to " << target_ << ": " << reason;
   failing_ = true;
 }
 

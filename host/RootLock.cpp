@@ -21,9 +21,9 @@ namespace {
 
 constexpr mode_t kMode = 0664;  // less the umask
 
-// An owner writes its process id right after it has the lock: whoever comes in between looks again, this often.
-constexpr int kLooks = 20;
-constexpr std::chrono::milliseconds kBetweenLooks(1);
+// An owner writes its process id right after it has locked the file. Between the two, others try again this often.
+constexpr int kAttempts = 20;
+constexpr std::chrono::milliseconds kBetweenAttempts(1);
 
 [[noreturn]] void fail(const std::string& path, int code, const std::string& reason) {
   throw FileUtilsIoException(code, "Could not lock \"" + path + "\": " + reason);
@@ -59,7 +59,7 @@ class RootLock::File {
     if (!S_ISREG(status.st_mode)) fail(path_, 0, "not a regular file");
   }
 
-  // False when somebody else has the lock.
+  // False if the file is locked already.
   bool tryLock() const {
     while (::flock(descriptor_, LOCK_EX | LOCK_NB) != 0) {
       if (errno == EWOULDBLOCK) return false;
@@ -68,10 +68,10 @@ class RootLock::File {
     return true;
   }
 
-  // For all who share the open file: closing it would not do while a child has it, too.
+  // Explicitly: closing does not release the lock while a forked child has the file open, too.
   void unlock() const { (void)::flock(descriptor_, LOCK_UN); }
 
-  // 0 when none is written, or one that has ended without taking its number along.
+  // 0 if no process id is written, or that of a process that has ended without removing it.
   pid_t livingOwner() const {
     std::array<char, 32> text{};
     if (::pread(descriptor_, text.data(), text.size() - 1, 0) <= 0) return 0;
@@ -80,14 +80,14 @@ class RootLock::File {
     return isAlive ? owner : 0;
   }
 
-  // Read by those who are refused only, so it does not matter if it fails, on a full disk for example.
+  // Only for messages, so a failure, for example on a full disk, is ignored.
   void writeOwner(const std::string& text) const {
     if (::ftruncate(descriptor_, 0) != 0) return;
     (void)!::pwrite(descriptor_, text.data(), text.size(), 0);
   }
 
  private:
-  // Does not block, whatever has that name: a fifo is opened at both ends, and a link is refused.
+  // Never blocks: a fifo is opened for reading and writing, and a link is refused.
   static int open(const std::string& path) {
     constexpr int flags = O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY;
     const int descriptor = ::open(path.c_str(), flags, kMode);
@@ -104,10 +104,10 @@ const std::string RootLock::fileName = "_cellar_lock";
 RootLock::RootLock(const std::string& root)
     : owner_(::getpid()), file_(std::make_unique<const File>(inDirectory(root, fileName))) {
   file_->requireRegular();
-  for (int look = 1; !file_->tryLock(); ++look) {
+  for (int attempt = 1; !file_->tryLock(); ++attempt) {
     const pid_t owner = file_->livingOwner();
-    if (owner != 0 || look == kLooks) throwInUse(root, owner);
-    std::this_thread::sleep_for(kBetweenLooks);
+    if (owner != 0 || attempt == kAttempts) throwInUse(root, owner);
+    std::this_thread::sleep_for(kBetweenAttempts);
   }
   file_->writeOwner(std::to_string(owner_) + "\n");
 }

@@ -33,7 +33,7 @@ namespace {
 using Task = std::function<void()>;
 using Clock = std::chrono::steady_clock;
 
-// No wait is longer, so that no deadline leaves the range of a 32-bit `time_t`.
+// The longest single wait, so that no deadline leaves the range of a 32-bit `time_t`.
 constexpr std::chrono::hours kLongestWait(1);
 
 Clock::time_point deadlineAfter(std::chrono::nanoseconds delay) {
@@ -42,14 +42,14 @@ Clock::time_point deadlineAfter(std::chrono::nanoseconds delay) {
   return delay < Clock::time_point::max() - now ? now + delay : Clock::time_point::max();
 }
 
-Clock::time_point nextLookAt(Clock::time_point deadline) { return std::min(deadline, Clock::now() + kLongestWait); }
+Clock::time_point cappedDeadline(Clock::time_point deadline) { return std::min(deadline, Clock::now() + kLongestWait); }
 
 std::chrono::nanoseconds inNanoseconds(std::chrono::milliseconds duration) {
   constexpr std::chrono::milliseconds longest = std::chrono::hours(24 * 365 * 100);
   return std::clamp(duration, std::chrono::milliseconds::zero(), longest);
 }
 
-// What all threads of one factory share: how many tasks are dispatched and not yet over.
+// Shared by all threads of one factory: the number of tasks that are dispatched and not finished.
 class Group {
  public:
   void taskBegins() { ++unfinished_; }
@@ -64,35 +64,35 @@ class Group {
     std::unique_lock<std::mutex> lock(mutex_);
     while (unfinished_ > 0) {
       if (Clock::now() >= deadline) return false;
-      idle_.wait_until(lock, nextLookAt(deadline));
+      idle_.wait_until(lock, cappedDeadline(deadline));
     }
     return true;
   }
 
  private:
   std::atomic<std::size_t> unfinished_{0};
-  std::mutex mutex_;  // so that the last task cannot end unnoticed between a waiter's look and its sleep
+  std::mutex mutex_;  // so that a waiter does not miss the end of the last task between its check and its sleep
   std::condition_variable idle_;
 };
 
-// The group that this thread works for. Its threads keep a group alive, so no other can come to have its address.
+// The group that this thread works for. Its threads keep a group alive, so its address cannot be reused meanwhile.
 thread_local const Group* currentGroup = nullptr;
 
-// Work in the background must not be in the way of those who ask for it: as a batch thread it does not take the
-// processor from another thread at the moment that wakes it. Not vital, so no matter if the system refuses.
+// Background work must not delay its callers: a batch thread does not preempt the thread that wakes it. If the system
+// refuses, that is ignored.
 void enterThread(const Group& group, const std::string& name) {
   currentGroup = &group;
 #if defined(__linux__)
   const sched_param noPriority{};
   (void)pthread_setschedparam(pthread_self(), SCHED_BATCH, &noPriority);
-  constexpr std::size_t longest = 15;  // bytes that the system has room for
+  constexpr std::size_t longest = 15;  // bytes that the system allows
   pthread_setname_np(pthread_self(), name.substr(0, longest).c_str());
 #else
   static_cast<void>(name);
 #endif
 }
 
-// The machine may have more than this thread may use.
+// The number of processors that this thread may use; the machine may have more.
 unsigned int processorsOfThisThread() {
 #if defined(__linux__)
   cpu_set_t processors;
@@ -103,40 +103,38 @@ unsigned int processorsOfThisThread() {
   return std::thread::hardware_concurrency();
 }
 
-// How long a queue's thread stays awake for the next task when it has nothing to do. To wake a thread takes some tens
-// of microseconds, longer than many a task, so where one task follows the other it pays to look out for the next for a
-// moment: longer than a small file and its record take, because in a chain of queues each waits for the other.
-// Adaptive, to spare the battery: a sleep that was over so soon that it was not worth falling asleep makes the thread
-// look out from then on, and looking out in vain, or being kept away meanwhile, ends that. With one processor nothing
-// can come while one looks.
-class Patience {
+// Whether a queue's thread spins for the next task before it sleeps. Waking a thread takes some tens of microseconds,
+// longer than many tasks. The time to spin is longer than writing a small file and its record, because in a chain of
+// queues each waits for the other. Adaptive, to save power: a sleep that ended almost at once switches spinning on; a
+// spin that found nothing, or was preempted, switches it off. Off with a single processor.
+class AdaptiveSpin {
  public:
-  void lookOutFor(const std::atomic<bool>& news) {
-    if (!isAwake_) return;
-    const Clock::time_point end = Clock::now() + kMoment;
-    while (isAwake_ && !news.load(std::memory_order_acquire)) {
-      std::this_thread::yield();  // others may need the processor to have news
-      isAwake_ = Clock::now() < end;
+  void spinUntil(const std::atomic<bool>& news) {
+    if (!spins_) return;
+    const Clock::time_point end = Clock::now() + kLongestSpin;
+    while (spins_ && !news.load(std::memory_order_acquire)) {
+      std::this_thread::yield();  // the thread that dispatches may need the processor
+      spins_ = Clock::now() < end;
     }
   }
 
-  void hasSlept(Clock::duration duration) { isAwake_ = hasOtherProcessors_ && duration < kMoment; }
+  void hasSlept(Clock::duration duration) { spins_ = hasOtherProcessors_ && duration < kLongestSpin; }
 
  private:
-  static constexpr std::chrono::microseconds kMoment{200};
+  static constexpr std::chrono::microseconds kLongestSpin{200};
 
   const bool hasOtherProcessors_ = processorsOfThisThread() > 1;
-  bool isAwake_ = false;
+  bool spins_ = false;
 };
 
-// The tasks of one queue, shared by the handle that users own, its thread and its timers. No task is ever run or
+// The tasks of one queue, shared by the handle that users own, its thread and its timers. Tasks are neither run nor
 // destroyed under the lock.
 class Queue {
  public:
   Queue(std::string name, std::shared_ptr<Group> group) : name_(std::move(name)), group_(std::move(group)) {}
 
-  // Takes the task over, or leaves it as it is and answers false when the queue is closed, or to others and the caller
-  // is not one of the factory's threads.
+  // Moves the task into the queue. Returns false and leaves the task unchanged if the queue is closed, or if it is
+  // closed to others and the caller is not one of the factory's threads.
   bool add(Task& task) {
     bool isAsleep = false;
     {
@@ -168,31 +166,31 @@ class Queue {
   // The queue's thread: runs tasks until the queue is closed and empty.
   void run() {
     enterThread(*group_, name_);
-    Patience patience;
-    for (std::deque<Task> tasks; takeAll(tasks, patience);) {
+    AdaptiveSpin spin;
+    for (std::deque<Task> tasks; takeAll(tasks, spin);) {
       while (!tasks.empty()) {
         runLogged(tasks.front());
-        tasks.pop_front();  // what the task holds goes before it counts as ended
+        tasks.pop_front();  // its captures are destroyed before it counts as finished
         group_->taskEnds();
       }
     }
     finished_ = true;
   }
 
-  // Whether the thread is about to end, with nothing left to run.
+  // Whether the thread has run everything and is about to end.
   bool finished() const { return finished_; }
 
  private:
-  // All that waits, under one lock; false when nothing will come any more.
-  bool takeAll(std::deque<Task>& tasks, Patience& patience) {
-    patience.lookOutFor(hasNews_);
+  // Moves out all waiting tasks, under one lock; waits for the first. False when the queue is closed and empty.
+  bool takeAll(std::deque<Task>& tasks, AdaptiveSpin& spin) {
+    spin.spinUntil(hasNews_);
     std::unique_lock<std::mutex> lock(mutex_);
     if (!closed_ && tasks_.empty()) {
       const Clock::time_point since = Clock::now();
       isAsleep_ = true;
       changed_.wait(lock, [this] { return closed_ || !tasks_.empty(); });
       isAsleep_ = false;
-      patience.hasSlept(Clock::now() - since);
+      spin.hasSlept(Clock::now() - since);
     }
     hasNews_.store(closed_, std::memory_order_relaxed);
     tasks.swap(tasks_);
@@ -212,7 +210,7 @@ class Queue {
   const std::string name_;
   const std::shared_ptr<Group> group_;
   std::atomic<bool> finished_{false};
-  std::atomic<bool> hasNews_{false};  // changed with the mutex held, looked out for without
+  std::atomic<bool> hasNews_{false};  // changed with the mutex held, read without it
 
   std::mutex mutex_;  // guards the four below
   std::deque<Task> tasks_;
@@ -222,7 +220,7 @@ class Queue {
   std::condition_variable changed_;
 };
 
-// A task that runs once or, if it is cancelled first, never.
+// A task that runs once, or never if it is cancelled first.
 class DelayedTask {
  public:
   explicit DelayedTask(Task task) : task_(std::move(task)) {}
@@ -244,18 +242,19 @@ class DelayedTask {
   Task task_;
 };
 
-// The timers of all queues, in the order in which they are due. Hands due tasks to their queues and runs none itself.
+// The timers of all queues, in the order in which they are due. Dispatches due tasks to their queues.
 class Timers {
  public:
   struct Entry {
     std::weak_ptr<Queue> queue;
     std::shared_ptr<DelayedTask> task;
   };
-  using Key = std::pair<Clock::time_point, std::uint64_t>;  // due at; number, to keep those of one moment in order
+  using Key = std::pair<Clock::time_point,
+                        std::uint64_t>;  // due time; number, to keep the order of timers that are due at the same time
 
   explicit Timers(std::shared_ptr<Group> group) : group_(std::move(group)) {}
 
-  // No key when timers are not served any more; the task is cancelled then.
+  // No key if the timers have been stopped; the task is cancelled then.
   std::optional<Key> add(Clock::time_point due, Entry entry) {
     std::unique_lock<std::mutex> lock(mutex_);
     if (stopped_) {
@@ -294,7 +293,7 @@ class Timers {
   }
 
  private:
-  // The next one that is due, when it is; none when timers are not served any more.
+  // Waits for the next due timer; none when the timers have been stopped.
   std::optional<Entry> next() {
     std::unique_lock<std::mutex> lock(mutex_);
     while (!stopped_) {
@@ -305,7 +304,7 @@ class Timers {
       const auto first = entries_.begin();
       const Clock::time_point due = first->first.first;
       if (due > Clock::now()) {
-        changed_.wait_until(lock, nextLookAt(due));
+        changed_.wait_until(lock, cappedDeadline(due));
         continue;
       }
       std::optional<Entry> entry(std::move(first->second));
@@ -347,7 +346,7 @@ class Timer : public AsyncTimer {
   const std::shared_ptr<DelayedTask> task_;
 };
 
-// What users own of a queue.
+// The handle of a queue that users own.
 class ThreadQueue : public AsyncExecutor {
  public:
   ThreadQueue(std::shared_ptr<Queue> queue, std::shared_ptr<Timers> timers)
@@ -376,7 +375,7 @@ class ThreadQueue : public AsyncExecutor {
 
 }  // namespace
 
-// The threads, and the lists of what they serve.
+// The threads, with their queues and timers.
 class ThreadQueueFactory::Threads {
  public:
   Threads()
@@ -453,7 +452,7 @@ class ThreadQueueFactory::Threads {
     return threads;
   }
 
-  // Gives back what the system keeps of threads whose queues were let go.
+  // Joins the threads of queues that have been released, to free their system resources.
   void joinFinished() {
     std::vector<Worker> finished;
     {
@@ -469,8 +468,8 @@ class ThreadQueueFactory::Threads {
   const std::shared_ptr<Group> group_;
   const std::shared_ptr<Timers> timers_;
 
-  std::mutex
-      joinMutex_;     // so that a second `shutDown` waits for the first; taken before the other, never by own threads
+  // So that a second `shutDown` waits for the first. Locked before `mutex_`, never by the factory's own threads.
+  std::mutex joinMutex_;
   std::mutex mutex_;  // guards the five below
   std::unordered_map<std::string, unsigned int> queuesOfRole_;
   std::vector<Worker> workers_;
@@ -495,7 +494,7 @@ std::shared_ptr<AsyncExecutor> ThreadQueueFactory::createWorkQueue() { return th
 
 void ThreadQueueFactory::refuseOnQueueThread(const std::string& operation, const std::string& advice) {
   if (currentGroup == nullptr) return;
-  throw std::logic_error(operation + " may wait for itself on a thread of the host kit's queues. " + advice);
+  throw std::logic_error(operation + " may deadlock on a thread of the host kit's queues. " + advice);
 }
 
 bool ThreadQueueFactory::drain(std::chrono::milliseconds patience) { return threads_->drain(patience); }

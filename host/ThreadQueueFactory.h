@@ -10,64 +10,63 @@
 namespace velmora::mobile::xplat::cellar::host {
 
 // Serial queues with one thread each, for applications that have no queues of their own. Threads are named after their
-// role and number ("cellar-file-1", "cellar-work-2") where the system can show it; one more ("cellar-timer") serves the
-// timers of all queues. Any thread may call, and a queue may be used from its own tasks.
+// role and number ("cellar-file-1", "cellar-work-2") where the system supports it; one more thread ("cellar-timer")
+// serves the timers of all queues. Any thread may call, and a queue may be used from its own tasks.
 //
-// Queues: tasks of one queue run one at a time in the order of dispatch; an exception that leaves a task is one error
-// line in the log, and the queue goes on. A queue whose last owner lets go finishes what was dispatched and then ends
-// its thread; letting go never waits, so a task may drop its own queue. Queues may outlive the factory: they are closed
-// then.
+// Queues: tasks of one queue run one at a time in the order of dispatch. An exception that leaves a task is one error
+// line in the log, and the queue continues. A queue whose last reference is released runs what was dispatched and then
+// ends its thread; releasing never waits, so a task may release its own queue. Queues may outlive the factory: they are
+// closed then.
 //
-// A thread that has nothing to do sleeps; where tasks follow each other closely it looks out for the next one for up to
-// 200 microseconds first. On Linux the threads are batch threads: waking one never takes the processor from who did.
+// A thread without tasks sleeps; if tasks follow each other closely, it first spins for up to 200 microseconds. On
+// Linux the threads run as SCHED_BATCH, so that waking one does not preempt its waker.
 //
-// Timers: they fire once, on their queue, however they were armed; a delay of 0 or less is due at once, one that is
-// longer than the clock can say never comes. Companions are ignored. When the handle's destructor returns, the task
-// either runs already (or has run) or never will, and in the latter case what it captured is gone; a running task is
-// not waited for, so a handle may be destroyed under a lock and by the task itself. A timer does not keep its queue
-// open.
+// Timers: `dispatchAfter` and `scheduleAfter` both fire once, on their queue. A delay of 0 or less is due at once; a
+// delay beyond the range of the clock never ends. Companions are ignored. When the handle's destructor returns, the
+// task is running, has run, or will never run; in the last case its captures are destroyed. The destructor does not
+// wait for a running task, so a handle may be destroyed under a lock and by the task itself. A timer does not keep its
+// queue open.
 //
-// Closing (`shutDown`, `abandon`, the destructor): what was dispatched before still runs, timers that have not fired
-// are dropped, and what is dispatched afterwards, by those tasks too, is destroyed unrun on the caller's thread, which
-// fails the promises that it holds. To have work that goes from queue to queue finished first, `refuseNewWork` and
-// `drain`.
+// Closing (`shutDown`, `abandon`, the destructor): tasks that were dispatched before still run, timers that have not
+// fired are dropped, and tasks that are dispatched afterwards, also by those tasks, are destroyed without running, on
+// the caller's thread, which breaks their promises. To finish work that passes from queue to queue first, call
+// `refuseNewWork` and `drain`.
 class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
  public:
-  // Starts the timer thread. Throws `std::system_error` when the system gives no thread.
+  // Starts the timer thread. Throws `std::system_error` if the system cannot start a thread.
   ThreadQueueFactory();
 
-  // `shutDown` where threads can be waited for. On a thread of its own (a task held the last reference) it is
-  // `abandon`.
+  // As `shutDown`; on a thread of its own (a task held the last reference) as `abandon`.
   ~ThreadQueueFactory() override;
 
   ThreadQueueFactory(const ThreadQueueFactory&) = delete;
   ThreadQueueFactory& operator=(const ThreadQueueFactory&) = delete;
 
-  // A new queue, with a thread of the file or of the work role. After closing, a queue that is closed. Throws
-  // `std::system_error` when the system gives no thread.
+  // A new queue, with a thread of the file or of the work role. After closing, a closed queue. Throws
+  // `std::system_error` if the system cannot start a thread.
   std::shared_ptr<AsyncExecutor> createQueue() override;
   std::shared_ptr<AsyncExecutor> createWorkQueue() override;
 
-  // Throws `std::logic_error` on a thread of whichever factory: what `operation` waits for may have to be done there.
-  // The text names the operation and ends with the advice.
+  // Throws `std::logic_error` on a thread of any factory: what `operation` waits for may have to run there. The text
+  // names the operation and ends with the advice.
   static void refuseOnQueueThread(const std::string& operation, const std::string& advice);
 
-  // Waits until no queue has anything to run, what tasks hand on to other queues included; false when that has not come
-  // about after `patience`. Armed timers do not count. Tells nothing about what other threads dispatch meanwhile.
-  // Called from a task of these queues it would wait for itself: false at once.
+  // Waits until no queue has anything to run, including what tasks dispatch to other queues; false if that takes longer
+  // than `patience`. Armed timers do not count. Says nothing about what other threads dispatch during the call. Called
+  // from a task of these queues it would deadlock, so it returns false at once.
   bool drain(std::chrono::milliseconds patience);
 
-  // From now on what other threads dispatch is destroyed unrun, on their threads, and timers are dropped; what was
-  // dispatched before runs, and so does what that dispatches. So `drain` ends, however busy other threads are; tasks
-  // that keep dispatching further ones without end hold it up.
+  // From now on tasks that other threads dispatch are destroyed without running, on those threads, and timers are
+  // dropped; tasks that were dispatched before run, and so do those that they dispatch. So `drain` ends, however busy
+  // other threads are, unless tasks keep dispatching further ones forever.
   void refuseNewWork();
 
-  // Closes and waits for the threads: no task runs any more when it returns. From a task of these queues it closes and
-  // returns at once. Calling it again does no harm.
+  // Closes and waits for the threads: when it returns, no task is running. From a task of these queues it closes and
+  // returns at once. May be called again.
   void shutDown();
 
-  // Closes and waits for nobody: the threads end by themselves when they have run what was dispatched. For queues with
-  // a task that is stuck.
+  // Closes without waiting: the threads are detached, and end when they have run what was dispatched. For queues with a
+  // task that is stuck.
   void abandon();
 
  private:

@@ -113,7 +113,7 @@ void FaultyFileUtils::clearTrace() {
 }
 
 std::vector<unsigned char> FaultyFileUtils::readFile(const std::string& path) {
-  failIfTold(Operation::ReadFile, path);
+  failIfChosen(Operation::ReadFile, path);
   return FileUtils::readFile(path);
 }
 
@@ -128,27 +128,27 @@ void FaultyFileUtils::writeFile(const std::string& path, const std::vector<unsig
 }
 
 void FaultyFileUtils::deleteFile(const std::string& path) {
-  failIfTold(Operation::DeleteFile, path);
+  failIfChosen(Operation::DeleteFile, path);
   FileUtils::deleteFile(path);
 }
 
 void FaultyFileUtils::recursiverDirectoryDelete(const std::string& path) {
-  failIfTold(Operation::RecursiverDirectoryDelete, path);
+  failIfChosen(Operation::RecursiverDirectoryDelete, path);
   FileUtils::recursiverDirectoryDelete(path);
 }
 
 void FaultyFileUtils::rename(const std::string& from, const std::string& to) {
-  failIfTold(Operation::Rename, from, " " + to);
+  failIfChosen(Operation::Rename, from, " " + to);
   FileUtils::rename(from, to);
 }
 
 void FaultyFileUtils::createDirectory(const std::string& path, bool recursive) {
-  failIfTold(Operation::CreateDirectory, path);
+  failIfChosen(Operation::CreateDirectory, path);
   FileUtils::createDirectory(path, recursive);
 }
 
 void FaultyFileUtils::createSymLink(const std::string& linkPath, const std::string& targetPath) {
-  failIfTold(Operation::CreateSymLink, linkPath, " " + targetPath);
+  failIfChosen(Operation::CreateSymLink, linkPath, " " + targetPath);
   FileUtils::createSymLink(linkPath, targetPath);
 }
 
@@ -161,17 +161,17 @@ bool FaultyFileUtils::pathExists(const std::string& path) {
 }
 
 FileUtils::DiskSpace FaultyFileUtils::getDiskSpace(const std::string& path) {
-  failIfTold(Operation::GetDiskSpace, path);
+  failIfChosen(Operation::GetDiskSpace, path);
   return FileUtils::getDiskSpace(path);
 }
 
 std::vector<std::string> FaultyFileUtils::listDirectories(const std::string& path) {
-  failIfTold(Operation::ListDirectories, path);
+  failIfChosen(Operation::ListDirectories, path);
   return FileUtils::listDirectories(path);
 }
 
 std::vector<FileUtils::Info> FaultyFileUtils::listDirectory(const std::string& path) {
-  failIfTold(Operation::ListDirectory, path);
+  failIfChosen(Operation::ListDirectory, path);
   return FileUtils::listDirectory(path);
 }
 
@@ -184,12 +184,12 @@ std::vector<std::string> FaultyFileUtils::listOtherEntries(const std::string& pa
   return FileUtils::listOtherEntries(path);
 }
 
-void FaultyFileUtils::failIfTold(Operation operation, const std::string& path, const std::string& rest) {
+void FaultyFileUtils::failIfChosen(Operation operation, const std::string& path, const std::string& rest) {
   const std::optional<int> failure = failureOf(operation, path, rest);
   if (failure) fail(*failure);
 }
 
-// Records the call; the code it has to fail with, if any.
+// Records the call; returns the code with which it has to fail, if any.
 std::optional<int> FaultyFileUtils::failureOf(Operation operation, const std::string& path, const std::string& rest) {
   {
     const std::lock_guard<std::mutex> lock(mutex_);

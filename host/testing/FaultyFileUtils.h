@@ -33,16 +33,16 @@ enum class Operation {
   ListOtherEntries,
 };
 
-// The real file system, with every call recorded and chosen ones failing before they touch anything. A failing
-// operation throws FileUtilsIoException with the given code and the system's text for it; a failing query (IsDirectory,
-// PathExists, IsSymLink) answers false, and ListOtherEntries none. Calls that operations make among themselves are
-// recorded and fail too. Thread-safe; `onCall` is to be set before other threads use the object.
+// The real file system; records every call, and makes chosen ones fail before they change anything. A failing operation
+// throws FileUtilsIoException with the given code and the system's text for it; a failing query (IsDirectory,
+// PathExists, IsSymLink) returns false, and ListOtherEntries nothing. Calls that operations make among themselves are
+// recorded and can fail, too. Thread-safe; set `onCall` before other threads use the object.
 class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
  public:
   using Operation = test::Operation;
 
-  // Called at the beginning of each operation, before it may fail, with no lock held. `path` is the first argument.
-  // What it throws leaves the operation.
+  // Called at the beginning of each operation, before it may fail, without a lock. `path` is the first argument. The
+  // operation throws what this throws.
   std::function<void(Operation operation, const std::string& path)> onCall;
 
   // The next call fails; calling this n times makes the next n calls fail.
@@ -53,28 +53,28 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
   // Every call whose first argument is exactly `path` fails.
   void failPath(Operation operation, const std::string& path, int errnoCode);
 
-  // The n-th call from now fails, whatever it is; 1 is the next. Replaces what an earlier `failNth` has not met yet.
+  // The n-th call from now fails, whatever it is; 1 is the next. Replaces an earlier `failNth` that is still pending.
   void failNth(std::size_t n, int errnoCode);
 
-  // From now on a `writeFile` that is made to fail leaves the first half of the data behind.
+  // From now on a failing `writeFile` writes the first half of the data.
   void tearFailingWrites(bool tears);
 
-  // The next `writeFile` leaves only the first `bytes` bytes in the file and then fails, as on a disk that fills up.
+  // The next `writeFile` writes only the first `bytes` bytes and then fails, as on a disk that fills up.
   void tearNextWrite(std::size_t bytes, int errnoCode);
 
-  // From here on nothing fails. The records stay.
+  // From now on nothing fails. The recorded calls remain.
   void heal();
 
-  // How many calls have been made to fail so far.
+  // The number of calls that have failed so far.
   std::size_t failures() const;
 
-  // How many calls there were of one kind, failed ones included.
+  // The number of calls of one kind, including failed ones.
   std::size_t calls(Operation operation) const;
 
-  // Every call so far, failed ones too: the operation's name and its paths, as in "rename /a /b".
+  // Every call so far, including failed ones: the operation's name and its paths, as in "rename /a /b".
   std::vector<std::string> trace() const;
 
-  // Forgets the calls recorded so far.
+  // Removes the calls recorded so far.
   void clearTrace();
 
   std::vector<unsigned char> readFile(const std::string& path) override;
@@ -95,10 +95,10 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
  private:
   struct Failure {
     int errnoCode;
-    std::optional<std::size_t> bytesWritten;  // by a `writeFile` that fails midway
+    std::optional<std::size_t> bytesWritten;  // by a torn `writeFile`
   };
 
-  void failIfTold(Operation operation, const std::string& path, const std::string& rest = "");
+  void failIfChosen(Operation operation, const std::string& path, const std::string& rest = "");
   std::optional<int> failureOf(Operation operation, const std::string& path, const std::string& rest = "");
   std::optional<int> nextFailure(const std::lock_guard<std::mutex>& lock, Operation operation, const std::string& path);
   std::optional<Failure> failureOfWrite(const std::string& path, std::size_t length);
@@ -106,7 +106,7 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
   mutable std::mutex mutex_;  // guards everything below
   std::vector<std::pair<Operation, std::string>> calls_;
   std::size_t failures_ = 0;
-  std::size_t callsToNth_ = 0;  // 0: none is to fail
+  std::size_t callsToNth_ = 0;  // 0: no `failNth` is pending
   int nthErrnoCode_ = 0;
   bool tearsFailingWrites_ = false;
   std::map<Operation, std::deque<int>> next_;

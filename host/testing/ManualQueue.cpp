@@ -14,7 +14,7 @@ struct ManualExecutor::Entry {
 
   bool isArmed() const { return !info.cancelled && !info.fired; }
 
-  // Takes the task out, so that it is destroyed where no lock is held.
+  // Returns the task, so that the caller destroys it after unlocking.
   std::function<void()> cancel() {
     if (!isArmed()) return nullptr;
     info.cancelled = true;
@@ -25,8 +25,8 @@ struct ManualExecutor::Entry {
 struct ManualExecutor::State {
   std::mutex mutex;
   std::condition_variable idle;
-  std::thread::id runner;  // who runs a task now
-  int depth = 0;           // how many it runs, one inside the other
+  std::thread::id runner;  // the thread that runs a task
+  int depth = 0;           // the number of nested tasks that it runs
   std::deque<std::function<void()>> tasks;
   std::vector<std::shared_ptr<Entry>> timers;
   std::size_t companions = 0;
@@ -40,7 +40,7 @@ struct ManualExecutor::State {
   }
 };
 
-// The right to run a task: one thread at a time. No lock is held meanwhile, so a task may use the queue freely.
+// The right to run a task: one thread at a time. No lock is held while it runs, so the task may use the queue.
 class ManualExecutor::Turn {
  public:
   explicit Turn(std::shared_ptr<State> state) : state_(std::move(state)) {
@@ -58,10 +58,10 @@ class ManualExecutor::Turn {
   }
 
  private:
-  std::shared_ptr<State> state_;  // the task may let go of the queue itself
+  std::shared_ptr<State> state_;  // the task may release the queue itself
 };
 
-// The handle. It outlives the queue without harm.
+// The handle. It may outlive the queue.
 class ManualExecutor::Timer : public AsyncTimer {
  public:
   Timer(std::shared_ptr<State> state, std::shared_ptr<Entry> entry)

@@ -13,7 +13,7 @@
 
 namespace velmora::mobile::xplat::cellar::test {
 
-// What a test sees of a timer that was armed on a ManualExecutor.
+// A timer that was armed on a ManualExecutor.
 struct TimerInfo {
   std::int64_t delayNanoseconds;
   bool viaSchedule;  // armed with scheduleAfter, not with dispatchAfter
@@ -21,13 +21,14 @@ struct TimerInfo {
   bool fired;
 };
 
-// A serial queue under the test's control: nothing runs until the test says so, then it runs on the calling thread, one
-// task at a time even when several threads run the queue. A task that runs its own queue (as `onDispatch` may) nests.
-// Thread-safe. An exception that leaves a task reaches whoever ran it; the task is gone by then.
+// A serial queue under the test's control: nothing runs until the test says so. Tasks then run on the calling thread,
+// one at a time even when several threads run the queue. A task that runs its own queue (as `onDispatch` may) nests.
+// Thread-safe. An exception that leaves a task is passed to the caller; the task is destroyed by then.
 class CELLAR_EXPORT ManualExecutor : public AsyncExecutor {
  public:
-  // Called after each dispatch on the dispatching thread, with no lock held: `queue.onDispatch = [&] { queue.runAll();
-  // }` makes a queue that runs everything at once. To be set before other threads use the queue.
+  // Called after each dispatch on the dispatching thread, without a lock. With
+  // `queue.onDispatch = [&] { queue.runAll(); }` the queue runs everything at once. Set it before other threads use the
+  // queue.
   std::function<void()> onDispatch;
 
   ManualExecutor();
@@ -35,7 +36,7 @@ class CELLAR_EXPORT ManualExecutor : public AsyncExecutor {
   ManualExecutor& operator=(const ManualExecutor&) = delete;
   ~ManualExecutor() override;
 
-  // Throws std::runtime_error and takes no task while `throwOnDispatch` is set.
+  // Throws std::runtime_error and drops the task while `throwOnDispatch` is set.
   void dispatch(std::function<void()> task) override;
 
   std::unique_ptr<AsyncTimer> dispatchAfter(std::int64_t delayNanoseconds, std::function<void()> task,
@@ -43,33 +44,33 @@ class CELLAR_EXPORT ManualExecutor : public AsyncExecutor {
   std::unique_ptr<AsyncTimer> scheduleAfter(std::int64_t delayNanoseconds, std::function<void()> task,
                                             std::function<void()> companion) override;
 
-  // How many tasks wait.
+  // The number of waiting tasks.
   std::size_t pending() const;
 
-  // Runs the oldest task; false when there is none. Waits while another thread runs one.
+  // Runs the oldest task; false if there is none. Waits while another thread runs one.
   bool runNext();
 
-  // Runs until nothing is left, tasks added meanwhile too; the number of tasks run.
+  // Runs tasks until none is left, including those added meanwhile; returns the number of tasks run.
   std::size_t runAll();
 
-  // Destroys the waiting tasks without running them, as a queue does that is shut down. Timers stay armed.
+  // Destroys the waiting tasks without running them, like a queue that is shut down. Timers remain armed.
   void dropAll();
 
-  // Every timer ever armed, oldest first.
+  // Every timer that was ever armed, oldest first.
   std::vector<TimerInfo> timers() const;
 
   // The delays of the timers that are neither cancelled nor fired, oldest first.
   std::vector<std::int64_t> armedDelays() const;
 
-  // Runs the oldest armed timer of that delay on the calling thread; false when there is none.
+  // Runs the oldest armed timer with that delay on the calling thread; false if there is none.
   bool fireTimer(std::int64_t delayNanoseconds);
 
-  // Cancels every armed timer, as a queue does that is shut down. Their handles may live on.
+  // Cancels every armed timer, like a queue that is shut down. Their handles may continue to exist.
   void dropTimers();
 
   void throwOnDispatch(bool throws);
 
-  // How many timers came with a companion function.
+  // The number of timers that were armed with a companion function.
   std::size_t companions() const;
 
  private:
@@ -84,8 +85,8 @@ class CELLAR_EXPORT ManualExecutor : public AsyncExecutor {
   std::shared_ptr<State> state_;
 };
 
-// Hands out manual queues and keeps them in the order of their creation. Its destructor drops what still waits on them,
-// so that a task which holds its own queue cannot keep it alive for ever. Thread-safe.
+// Creates manual queues and keeps them in the order of their creation. Its destructor drops their waiting tasks, so
+// that a task that holds its own queue cannot keep it alive forever. Thread-safe.
 class CELLAR_EXPORT ManualQueueFactory : public TaskQueueFactory {
  public:
   ManualQueueFactory();
@@ -108,7 +109,8 @@ class CELLAR_EXPORT ManualQueueFactory : public TaskQueueFactory {
   // The queues, then the work queues, each in the order of their creation.
   std::vector<std::shared_ptr<ManualExecutor>> all() const;
 
-  // Runs one task of each queue in turn until all are empty, queues created meanwhile too; the number of tasks run.
+  // Runs one task of each queue in turn until all are empty, including queues created meanwhile; returns the number of
+  // tasks run.
   std::size_t runAll();
 
  private:

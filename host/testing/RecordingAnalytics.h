@@ -12,18 +12,18 @@
 
 namespace velmora::mobile::xplat::cellar::test {
 
-// One call of the analytics sink, as it came.
+// One call of the analytics sink, unchanged.
 struct CELLAR_EXPORT LoggedEvent {
   std::string name;
   std::string category;
   std::string payload;
   std::string time;
 
-  // The payload, parsed. Throws what parsing throws.
+  // The parsed payload. Throws what parsing throws.
   JsonValue json() const;
 };
 
-// Remembers events in the order in which they arrived. Thread-safe.
+// Records events in the order of their arrival. Thread-safe.
 class CELLAR_EXPORT EventLog {
  public:
   void add(LoggedEvent event);
@@ -36,7 +36,7 @@ class CELLAR_EXPORT EventLog {
   std::vector<LoggedEvent> events_;
 };
 
-// A sink that writes into an event log, which the test keeps.
+// A sink that writes into an event log of the test.
 class CELLAR_EXPORT RecordingAnalytics : public XAnalytics {
  public:
   explicit RecordingAnalytics(std::shared_ptr<EventLog> log);
@@ -48,7 +48,7 @@ class CELLAR_EXPORT RecordingAnalytics : public XAnalytics {
   std::shared_ptr<EventLog> log_;
 };
 
-// A reporter over such a sink.
+// A reporter with such a sink.
 CELLAR_EXPORT std::shared_ptr<AnalyticsEventReporter> recordingReporter(std::shared_ptr<EventLog> log);
 
 }  // namespace velmora::mobile::xplat::cellar::test

@@ -132,7 +132,7 @@ TEST(Await, IsRefusedOnAThreadOfTheKitAndLeavesTheFutureAlone) {
       refusal = error.what();
     }
   }).get();
-  EXPECT_EQ(refusal, "await may wait for itself on a thread of the host kit's queues. Use Future::then instead.");
+  EXPECT_EQ(refusal, "await may deadlock on a thread of the host kit's queues. Use Future::then instead.");
   promise.setValue();
   await(future);
 }

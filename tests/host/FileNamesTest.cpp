@@ -92,7 +92,7 @@ TEST(DecodingAFileName, RefusesWhatEncodingDoesNotMake) {
       decodeFileName(name);
       ADD_FAILURE() << name;
     } catch (const std::invalid_argument& error) {
-      EXPECT_EQ(error.what(), "'" + name + "' is no encoded file name.");
+      EXPECT_EQ(error.what(), "'" + name + "' is not an encoded file name.");
     }
   }
   EXPECT_THROW(decodeFileName(string(256, 'a')), std::invalid_argument);

@@ -996,7 +996,7 @@ TEST_F(HostTest, AwaitingInACallbackOfTheSameStoreIsRefused) {
     refusal.set_value(errorOf<std::logic_error>([&] { await(letters->fetch("first")); }));
   });
   EXPECT_EQ(refusal.get_future().get(),
-            "await may wait for itself on a thread of the host kit's queues. Use Future::then instead.");
+            "await may deadlock on a thread of the host kit's queues. Use Future::then instead.");
   EXPECT_NE(await(letters->fetch("first")), nullptr);
 }
 
@@ -1010,8 +1010,7 @@ TEST_F(HostTest, EndingASessionInACallbackOfItsStoreIsRefusedAndChangesNothing) 
                         errorOf<std::logic_error>([&] { host.logOut(""); }),
                         errorOf<std::logic_error>([&] { host.invalidate(); })});
   });
-  const std::string rest =
-      " may wait for itself on a thread of the host kit's queues. Use a thread of your own instead.";
+  const std::string rest = " may deadlock on a thread of the host kit's queues. Use a thread of your own instead.";
   EXPECT_EQ(refusals.get_future().get(),
             (std::vector<std::string>{"Host::logOut" + rest, "Host::logOut" + rest, "Host::invalidate" + rest}));
   EXPECT_NE(await(letters->fetch("first")), nullptr);
@@ -1239,8 +1238,7 @@ TEST_F(HostTest, WorkThatIsStuckIsLeftBehindAfterThePatience) {
   });
   begun.wait();
   host.reset();
-  EXPECT_EQ(log.messages(),
-            std::vector<std::string>{"Host is destroyed while its queues are at work, their threads are left behind."});
+  EXPECT_EQ(log.messages(), std::vector<std::string>{"Host destroyed with work pending; its threads were detached."});
   EXPECT_FALSE(over->isOpen());
   EXPECT_TRUE(start()->manager("media")->isValid());  // they do not keep the root
   gate->countDown();

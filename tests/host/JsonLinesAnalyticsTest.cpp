@@ -177,7 +177,7 @@ TEST_F(JsonLinesAnalyticsTest, AFullDiskIsLoggedOnceAndNothingIsThrown) {
   const LogCapture log;
   JsonLinesAnalytics analytics(std::string("/dev/full"));
   for (int i = 0; i < 3; ++i) EXPECT_NO_THROW(analytics.logEvent("event", "perf", "{}", "1"));
-  EXPECT_EQ(log.messages(), std::vector<std::string>{"Cannot write analytics: No space left on device"});
+  EXPECT_EQ(log.messages(), std::vector<std::string>{"Cannot write analytics to '/dev/full': No space left on device"});
 }
 #endif
 
@@ -187,7 +187,7 @@ TEST_F(JsonLinesAnalyticsTest, AStreamThatFailsIsLoggedOnce) {
   std::ostream stream(&disk);
   JsonLinesAnalytics analytics(stream);
   for (int i = 0; i < 3; ++i) analytics.logEvent("event", "perf", "{}", "1");
-  EXPECT_EQ(log.messages(), std::vector<std::string>{"Cannot write analytics: stream failed"});
+  EXPECT_EQ(log.messages(), std::vector<std::string>{"Cannot write analytics to a stream: stream failed"});
 }
 
 TEST_F(JsonLinesAnalyticsTest, AStreamThatThrowsIsLoggedOnce) {
@@ -198,7 +198,7 @@ TEST_F(JsonLinesAnalyticsTest, AStreamThatThrowsIsLoggedOnce) {
   JsonLinesAnalytics analytics(stream);
   for (int i = 0; i < 3; ++i) EXPECT_NO_THROW(analytics.logEvent("event", "perf", "{}", "1"));
   EXPECT_EQ(log.errorCount(), 1U);
-  EXPECT_TRUE(log.contains("Cannot write analytics: "));
+  EXPECT_TRUE(log.contains("Cannot write analytics to a stream: "));
 }
 
 TEST_F(JsonLinesAnalyticsTest, AfterAFailureLinesBeginOnALineOfTheirOwnAndTheNextFailureIsLoggedAgain) {
