@@ -5,7 +5,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Where a command writes: plain lines, or a terminal that understands colours and lines that change.
+// The output of a command: plain lines, or a terminal with colours and lines that can be rewritten.
 class Console {
  public:
   Console(std::ostream& out, bool isTerminal, bool hasColours);
@@ -19,7 +19,7 @@ class Console {
   void line(const std::string& text);  // indented
   void good(const std::string& text);  // indented
   void bad(const std::string& text);   // indented
-  void raw(const std::string& text);   // as it stands
+  void raw(const std::string& text);   // unchanged
 
   void verdict(const std::string& text, bool isGood);
 

@@ -4,7 +4,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// What the user gave cannot be worked with. The text is one line for them.
+// The user's input is not valid. The text is one line for the user.
 class InputError : public std::runtime_error {
  public:
   using std::runtime_error::runtime_error;

@@ -8,13 +8,12 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 class Console;
 
-// How far something has come that may take longer than a moment: a bar on a terminal, once patience is over, and
-// nothing anywhere else.
+// Progress of what may take longer than a moment: a bar on a terminal, once patience is over, and nothing elsewhere.
 class Progress {
  public:
   Progress(Console& console, std::string what, std::chrono::milliseconds patience = std::chrono::seconds(1));
 
-  // Leaves no half-drawn bar behind.
+  // Removes the bar.
   ~Progress();
   Progress(const Progress&) = delete;
   Progress& operator=(const Progress&) = delete;

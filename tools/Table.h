@@ -6,7 +6,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Rows of text under a header, set in columns that are as wide as they need to be.
+// Rows of text under a header; each column is as wide as its longest cell.
 class Table {
  public:
   enum class Align { Left, Right };
@@ -18,10 +18,10 @@ class Table {
 
   explicit Table(std::vector<Column> columns);
 
-  // One cell a column.
+  // One cell for each column.
   void addRow(std::vector<std::string> cells);
 
-  // The lines, each indented and ended. A column that is empty throughout still shows its title.
+  // The lines, each indented and with a line end. An empty column still shows its title.
   std::string text() const;
 
  private:

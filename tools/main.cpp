@@ -24,7 +24,7 @@ constexpr int kUsage = 2;
 
 constexpr const char* kVersion = "cellar " CELLAR_VERSION;
 
-// The log goes where a command sends it; on the terminal it would tear the output apart.
+// Commands redirect the log; on the terminal it would be mixed into the output.
 void keepLogOffTheTerminal(const char* program) {
   google::InitGoogleLogging(program);
   for (int severity = 0; severity < google::NUM_SEVERITIES; ++severity) google::SetLogDestination(severity, "");
@@ -33,13 +33,13 @@ void keepLogOffTheTerminal(const char* program) {
 
 void describe(CLI::App& app) {
   app.description(
-      "Cellar manages an application's storage on a device. This program shows it at work, looks into directories "
-      "that\n"
-      "it has filled, and helps with its configuration and its limits.");
+      "Cellar manages an application's storage on a device. This program demonstrates it, inspects and repairs what "
+      "it\n"
+      "has stored, and helps with its configuration and its limits.");
   app.footer(
       "Examples:\n  cellar demo ~/Pictures\n  cellar check storage.json\n  cellar inspect /tmp/cellar-demo\n  cellar "
       "tune "
-      "analytics.jsonl --store thumbs\n\nExit status: 0 when all is well, 1 when something was found, 2 for usage and "
+      "analytics.jsonl --store thumbs\n\nExit status: 0 without problems, 1 when a problem was found, 2 for usage and "
       "input errors.");
   app.set_version_flag("--version", kVersion);
   app.require_subcommand(1);

@@ -14,7 +14,7 @@
 #include "check/ConfigurationDocument.h"
 #include "check/Faults.h"
 #include "check/KnownKeys.h"
-#include "check/Understood.h"
+#include "check/ResolvedConfiguration.h"
 #include "check/Warnings.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -25,16 +25,16 @@ using testing::HasSubstr;
 using testing::IsEmpty;
 using Lines = std::vector<std::string>;
 
-Lines linesOf(const Remarks& findings) {
+Lines linesOf(const Diagnostics& findings) {
   Lines lines;
-  for (const Remark& finding : findings) lines.push_back(finding.pointer + ": " + finding.text);
+  for (const Diagnostic& finding : findings) lines.push_back(finding.pointer + ": " + finding.text);
   return lines;
 }
 
 Lines warningsOf(const std::string& text, const NameTags& tags = {}) {
   const ConfigurationDocument document = parseConfigurationDocument(text);
   EXPECT_THAT(linesOf(findFaults(document)), IsEmpty());
-  return linesOf(findWarnings(document, understand(document, tags)));
+  return linesOf(findWarnings(document, resolve(document, tags)));
 }
 
 // Of a manager with these members.
@@ -82,14 +82,14 @@ TEST(CheckWarnings, AKeyThatTheTypeIgnoresIsNamed) {
 
 TEST(CheckWarnings, AKeyThatIsGivenTwiceIsNamed) {
   EXPECT_THAT(ofManager(R"("max_size": "1MB", "max_size": "2MB")"),
-              ElementsAre("/m/max_size: stands here more than once; only the last counts"));
+              ElementsAre("/m/max_size: is defined more than once here; only the last counts"));
   EXPECT_THAT(ofCache(R"("version": 1, "capacity": [{"version": 1}], "version": 2)"),
-              ElementsAre(R"(/m/stores/s/capacity: [{"version":1}] is no integer: the store has no capacity limit)",
-                          "/m/stores/s/version: stands here more than once; only the last counts"));
+              ElementsAre(R"(/m/stores/s/capacity: [{"version":1}] is not an integer: the store has no capacity limit)",
+                          "/m/stores/s/version: is defined more than once here; only the last counts"));
 }
 
 TEST(CheckWarnings, StoresThatAreNoObjectAreNamed) {
-  EXPECT_THAT(ofManager(R"("stores": [])"), ElementsAre("/m/stores: is no object: there are no stores"));
+  EXPECT_THAT(ofManager(R"("stores": [])"), ElementsAre("/m/stores: is not an object: there are no stores"));
   EXPECT_THAT(ofManager(R"("stores": {})"), IsEmpty());
 }
 
@@ -97,49 +97,48 @@ TEST(CheckWarnings, StoresThatAreNoObjectAreNamed) {
 
 TEST(CheckWarnings, ASizeThatWrappedIsNamedWithWhatItHasBecome) {
   EXPECT_THAT(ofManager(R"("max_size": "4GB")"),
-              ElementsAre("/m/max_size: '4GB' does not fit into 32 bits and has become 0 B"));
+              ElementsAre("/m/max_size: '4GB' does not fit into 32 bits and becomes 0 B"));
   EXPECT_THAT(ofManager(R"("max_size": "5GB")"),
-              ElementsAre("/m/max_size: '5GB' does not fit into 32 bits and has become 1.0 GB"));
+              ElementsAre("/m/max_size: '5GB' does not fit into 32 bits and becomes 1.0 GB"));
   EXPECT_THAT(ofManager(R"("max_size": "-1B")"),
-              ElementsAre("/m/max_size: '-1B' does not fit into 32 bits and has become 4.0 GB"));
+              ElementsAre("/m/max_size: '-1B' does not fit into 32 bits and becomes 4.0 GB"));
   EXPECT_THAT(ofManager(R"("max_size": "4294967295B")"), IsEmpty());
   EXPECT_THAT(ofManager(R"("max_size": "4095MB")"), IsEmpty());
   EXPECT_THAT(ofStore(R"("type": "unmanaged", "max_size": "4097MB")"),
-              ElementsAre("/m/stores/s/max_size: '4097MB' does not fit into 32 bits and has become 1.0 MB"));
+              ElementsAre("/m/stores/s/max_size: '4097MB' does not fit into 32 bits and becomes 1.0 MB"));
   EXPECT_THAT(ofStore(R"("type": "disk_cache", "lru_size_limit": "8193MB", "survival_size": "4097MB")"),
-              ElementsAre("/m/stores/s/lru_size_limit: '8193MB' does not fit into 32 bits and has become 1.0 MB",
-                          "/m/stores/s/survival_size: '4097MB' does not fit into 32 bits and has become 1.0 MB"));
+              ElementsAre("/m/stores/s/lru_size_limit: '8193MB' does not fit into 32 bits and becomes 1.0 MB",
+                          "/m/stores/s/survival_size: '4097MB' does not fit into 32 bits and becomes 1.0 MB"));
 }
 
 TEST(CheckWarnings, ADurationThatWrappedIsNamedWithWhatItHasBecome) {
   EXPECT_THAT(ofStore(R"("type": "pkvs", "stale_age": "137 years")"),
-              ElementsAre("/m/stores/s/stale_age: '137 years' does not fit into 32 bits and has become 294 days 17 "
+              ElementsAre("/m/stores/s/stale_age: '137 years' does not fit into 32 bits and becomes 294 days 17 "
                           "hours 31 minutes 44 seconds"));
   EXPECT_THAT(ofStore(R"("type": "pkvs", "stale_age": "136 years")"), IsEmpty());
   EXPECT_THAT(ofManager(R"("prune_interval": "50000 days")"),
-              ElementsAre("/m/prune_interval: '50000 days' does not fit into 32 bits and has become 289 days 17 hours "
+              ElementsAre("/m/prune_interval: '50000 days' does not fit into 32 bits and becomes 289 days 17 hours "
                           "31 minutes 44 seconds"));
 }
 
 TEST(CheckWarnings, AVersionThatWrappedIsNamed) {
   EXPECT_THAT(ofCache(R"("version": -1)"),
-              ElementsAre("/m/stores/s/version: -1 does not fit into 32 bits and has become 4294967295"));
+              ElementsAre("/m/stores/s/version: -1 does not fit into 32 bits and becomes 4294967295"));
   EXPECT_THAT(ofCache(R"("version": 4294967296)"),
-              ElementsAre("/m/stores/s/version: 4294967296 does not fit into 32 bits and has become 0"));
+              ElementsAre("/m/stores/s/version: 4294967296 does not fit into 32 bits and becomes 0"));
   EXPECT_THAT(ofCache(R"("version": 4294967295)"), IsEmpty());
 }
 
 TEST(CheckWarnings, TextBehindTheUnitIsNamed) {
-  EXPECT_THAT(ofManager(R"("max_size": "20 MB or so")"),
-              ElementsAre("/m/max_size: 'or so' behind the unit counts for nothing"));
+  EXPECT_THAT(ofManager(R"("max_size": "20 MB or so")"), ElementsAre("/m/max_size: 'or so' after the unit is ignored"));
   EXPECT_THAT(ofManager(R"("max_size": " 20  MB ")"), IsEmpty());
 }
 
 TEST(CheckWarnings, ACapacityThatIsNoIntegerOrNegativeIsNamed) {
   EXPECT_THAT(ofCache(R"("capacity": "100")"),
-              ElementsAre("/m/stores/s/capacity: \"100\" is no integer: the store has no capacity limit"));
+              ElementsAre("/m/stores/s/capacity: \"100\" is not an integer: the store has no capacity limit"));
   EXPECT_THAT(ofCache(R"("capacity": 1.5)"),
-              ElementsAre("/m/stores/s/capacity: 1.5 is no integer: the store has no capacity limit"));
+              ElementsAre("/m/stores/s/capacity: 1.5 is not an integer: the store has no capacity limit"));
   EXPECT_THAT(ofCache(R"("capacity": -1)"),
               ElementsAre("/m/stores/s/capacity: -1 is negative: the store has no capacity limit"));
   EXPECT_THAT(ofCache(R"("capacity": 100)"), IsEmpty());
@@ -159,8 +158,8 @@ TEST(CheckWarnings, ACacheWithoutALimitIsNamed) {
 
 TEST(CheckWarnings, ASurvivalSizeAboveTheLimitIsNamed) {
   EXPECT_THAT(ofCache(R"("survival_size": "11MB")"),
-              ElementsAre("/m/stores/s/survival_size: 11.0 MB is more than the limit of 10.0 MB: a device short of "
-                          "space would keep more"));
+              ElementsAre("/m/stores/s/survival_size: 11.0 MB is more than the limit of 10.0 MB: a device that is "
+                          "short of space would keep more"));
   EXPECT_THAT(ofCache(R"("survival_size": "10MB")"), IsEmpty());
 }
 
@@ -183,7 +182,7 @@ TEST(CheckWarnings, CachesThatTogetherExceedTheirManagersLimitAreNamed) {
 TEST(CheckWarnings, AManagerThatNeverPrunesIsNamedIfItHasWhatNeedsPruning) {
   EXPECT_THAT(
       ofManager(R"("prune_interval": "0 hours", "stores": {"a": {"type": "disk_cache", "lru_size_limit": "6MB"}})"),
-      ElementsAre("/m/prune_interval: is 0: the manager never prunes, and its disk caches grow without end"));
+      ElementsAre("/m/prune_interval: is 0: the manager never prunes, and its disk caches grow without limit"));
   EXPECT_THAT(ofManager(R"("prune_interval": "0 hours", "stores": {"a": {"type": "pkvs"}})"), IsEmpty());
   EXPECT_THAT(
       ofManager(R"("prune_interval": "1 minutes", "stores": {"a": {"type": "disk_cache", "lru_size_limit": "6MB"}})"),
@@ -194,17 +193,17 @@ TEST(CheckWarnings, AManagerThatNeverPrunesIsNamedIfItHasWhatNeedsPruning) {
 
 TEST(CheckWarnings, ANameThatCannotBeAFileNameIsNamed) {
   EXPECT_THAT(ofCache(R"("name": "a/b")"),
-              ElementsAre("/m/stores/s/name: 'a/b' holds a '/' and reaches outside the manager's directory"));
+              ElementsAre("/m/stores/s/name: 'a/b' contains a '/' and leads outside the manager's directory"));
   EXPECT_THAT(ofCache(R"("name": "")"), ElementsAre("/m/stores/s/name: the name is empty"));
   EXPECT_THAT(ofCache("\"name\": \"a\\u0000b\""),
-              ElementsAre("/m/stores/s/name: the name holds a zero byte, at which the system cuts it off"));
+              ElementsAre("/m/stores/s/name: the name contains a zero byte, at which the system truncates it"));
   EXPECT_THAT(ofManager(R"("stores": {"a/b": {"type": "pkvs"}})"),
-              ElementsAre("/m/stores/a~1b: 'a/b' holds a '/' and reaches outside the manager's directory"));
+              ElementsAre("/m/stores/a~1b: 'a/b' contains a '/' and leads outside the manager's directory"));
   const std::string longest(255 - 4, 'x');  // with "__v1" behind it
   EXPECT_THAT(ofCache(R"("name": ")" + longest + "\""), IsEmpty());
   EXPECT_THAT(ofCache(R"("name": "x)" + longest + "\""),
               ElementsAre("/m/stores/s/name: the directory's name has 256 bytes, more than the 255 that file systems "
-                          "take"));
+                          "allow"));
 }
 
 TEST(CheckWarnings, StoresOfOneManagerThatShareADirectoryAreNamed) {
@@ -222,14 +221,14 @@ TEST(CheckWarnings, StoresOfOneManagerThatShareADirectoryAreNamed) {
 
 TEST(CheckWarnings, StoresOfOneNameInSeveralPlacesAreNamed) {
   EXPECT_THAT(ofManager(R"("stores": {"a": {"type": "pkvs"}, "b": {"type": "pkvs", "name": "a", "version": 2}})"),
-              ElementsAre("/m/stores/b: has the name 'a' of /m/stores/a: events and log lines, which carry names, "
-                          "cannot tell them apart"));
+              ElementsAre("/m/stores/b: has the name 'a' of /m/stores/a: they cannot be told apart in events and "
+                          "log lines"));
   EXPECT_THAT(ofManager(R"("stores": {"a": {"type": "pkvs"}, "b": {"type": "pkvs", "name": "c"}})"), IsEmpty());
 }
 
 TEST(CheckWarnings, ManagersThatShareADirectoryAreNamed) {
   EXPECT_THAT(warningsOf(R"({"m": {}, "n": {}})"),
-              ElementsAre("/n: shares its directory caches/_store_% with /m: each cleans up the other's stores"));
+              ElementsAre("/n: shares its directory caches/_store_% with /m: each removes the other's stores"));
   EXPECT_THAT(warningsOf(R"({"m": {}, "n": {"session_scoped": false}, "o": {"area": "shared"}})"), IsEmpty());
 }
 
@@ -248,15 +247,15 @@ TEST(CheckFaults, EachIsNamedWithItsPlaceInTheParsersWords) {
 }
 
 TEST(CheckFaults, IdentifiersThatAreMetTwiceAreNamedWithTheirPlace) {
-  EXPECT_THAT(faultsOf(R"({"m": {}, "m": {}})"), ElementsAre("/m: stands here twice"));
+  EXPECT_THAT(faultsOf(R"({"m": {}, "m": {}})"), ElementsAre("/m: is defined twice here"));
   EXPECT_THAT(faultsOf(R"({"m": {"stores": {"s": {"type": "pkvs"}, "s": {"type": "pkvs"}}}})"),
-              ElementsAre("/m/stores/s: stands here twice"));
+              ElementsAre("/m/stores/s: is defined twice here"));
   EXPECT_THAT(faultsOf(R"({"m": {"stores": {"s": {"type": "pkvs"}}}, "n": {"stores": {"s": {"type": "pkvs"}}}})"),
               ElementsAre("/n/stores/s: another manager has a store of this identifier"));
 }
 
 TEST(CheckFaults, ADocumentThatIsNoObjectIsOne) {
-  EXPECT_THAT(faultsOf("[]"), ElementsAre(": is no object of managers"));
+  EXPECT_THAT(faultsOf("[]"), ElementsAre(": is not an object of managers"));
   EXPECT_THAT(faultsOf("{}"), IsEmpty());
 }
 
@@ -310,7 +309,7 @@ TEST(KnownKeys, TheNearestIsNotFarOff) {
   EXPECT_EQ(nearestKey(std::string(1000, 'a'), keysOfManagers()), "");
 }
 
-// --- What was understood ---
+// --- The resolved configuration ---
 
 TEST(CheckReport, FillsInEveryDefault) {
   CheckResult result;
@@ -318,7 +317,7 @@ TEST(CheckReport, FillsInEveryDefault) {
   const ConfigurationDocument document =
       parseConfigurationDocument(R"({"m": {"stores": {"c": {"type": "disk_cache"}, "k": {"type": "pkvs"},
                                      "u": {"type": "unmanaged"}}}})");
-  result.understood = understand(document, {"250", "en", "US", "Alice"});
+  result.resolved = resolve(document, {"250", "en", "US", "Alice"});
   std::ostringstream out;
   Console console(out, false, false);
   printCheck(result, console);
@@ -343,8 +342,8 @@ TEST(CheckReport, ForMachinesHasBytesAndSeconds) {
   const ConfigurationDocument document = parseConfigurationDocument(
       R"({"m": {"area": "shared", "max_size": "1KB", "session_scoped": false, "prune_interval": "2 days",
           "stores": {"s": {"type": "disk_cache", "lru_size_limit": "3KB", "capacity": 7, "locale_sensitive": true}}}})");
-  result.understood = understand(document, {"250", "en", "US", ""});
-  result.warnings = findWarnings(document, result.understood);
+  result.resolved = resolve(document, {"250", "en", "US", ""});
+  result.warnings = findWarnings(document, result.resolved);
   const OrderedJson json = checkAsJson(result);
   const OrderedJson& manager = json.at("managers").at(0);
   EXPECT_EQ(manager.at("directory"), "shared/_sessionlessStore");

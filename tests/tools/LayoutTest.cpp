@@ -100,7 +100,7 @@ TEST_F(LayoutTest, OfAnEmptyDirectoryAndOfEmptyAreasHasNothing) {
 
 TEST_F(LayoutTest, OfSomethingElseIsAnInputErrorThatSaysWhy) {
   data_.putFile("pictures/2023/sunrise.jpg", "x");
-  EXPECT_THAT(complaint(data_.root()), HasSubstr("' is no storage root, nor a part of one"));
+  EXPECT_THAT(complaint(data_.root()), HasSubstr("' is not a storage root or a part of one"));
   EXPECT_EQ(complaint(data_.path("nothing")), "ROOT '" + data_.path("nothing") + "' does not exist");
   EXPECT_EQ(complaint(data_.path("pictures/2023/sunrise.jpg")),
             "ROOT '" + data_.path("pictures/2023/sunrise.jpg") + "' is not a directory");

@@ -178,10 +178,10 @@ TEST_F(TraceReadersTest, MetadataOfVideosIsTakenWhereItIs) {
 
 TEST_F(TraceReadersTest, WhatCannotBeReadIsNamedWithItsPlace) {
   EXPECT_EQ(refusalOf("lbn,size\na,1\n", columns()), ":1: there is no column 'bytes'");
-  EXPECT_EQ(refusalOf("lbn,bytes\na,1\nb,1x\n", columns()), ":3: '1x' is no size in bytes");
-  EXPECT_EQ(refusalOf("lbn,bytes\na,-1\n", columns()), ":2: '-1' is no size in bytes");
+  EXPECT_EQ(refusalOf("lbn,bytes\na,1\nb,1x\n", columns()), ":3: '1x' is not a size in bytes");
+  EXPECT_EQ(refusalOf("lbn,bytes\na,-1\n", columns()), ":2: '-1' is not a size in bytes");
   EXPECT_EQ(refusalOf("lbn,bytes\na,99999999999999999999\n", columns()),
-            ":2: '99999999999999999999' is no size in bytes");
+            ":2: '99999999999999999999' is not a size in bytes");
   EXPECT_EQ(refusalOf("lbn,bytes\na\n", columns()), ":2: there are only 1 cells");
   EXPECT_EQ(refusalOf("lbn,bytes\n", columns()), "");
 }

@@ -125,7 +125,7 @@ TEST_F(TuningTest, SaysHowManyReportedHitsItCannotSee) {
   report.reportedFirstHits = 10;
   EXPECT_THAT(print(),
               HasSubstr("reported 100.00 % hits\n  10 of these were the first request of a key that was stored "
-                        "unseen; they count as misses below\n"));
+                        "before; they count as misses below\n"));
 }
 
 TEST_F(TuningTest, NamesTheRuleThatItsAdviceFollows) {

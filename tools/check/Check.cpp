@@ -10,7 +10,7 @@
 #include "check/CheckReport.h"
 #include "check/ConfigurationDocument.h"
 #include "check/Faults.h"
-#include "check/Understood.h"
+#include "check/ResolvedConfiguration.h"
 #include "check/Warnings.h"
 #include "storage/Printable.h"
 
@@ -51,13 +51,13 @@ CheckResult check(const CheckOptions& options) {
   result.file = options.file;
   result.faults = findFaults(document);
   if (!result.faults.empty()) return result;
-  result.understood = understand(document, tags);
-  result.warnings = findWarnings(document, result.understood);
+  result.resolved = resolve(document, tags);
+  result.warnings = findWarnings(document, result.resolved);
   return result;
 }
 
 void printFaults(const CheckResult& result) {
-  for (const Remark& fault : result.faults) {
+  for (const Diagnostic& fault : result.faults) {
     const std::string place = fault.pointer.empty() ? "" : fault.pointer + ": ";
     std::cerr << "cellar: " << result.file << ": " << printable(place + fault.text) << std::endl;
   }
@@ -80,20 +80,23 @@ int runCheck(const CheckOptions& options) {
 
 void addCheckCommand(CLI::App& app, int& status) {
   const auto options = std::make_shared<CheckOptions>();
-  CLI::App* const check = app.add_subcommand("check", "Say what a configuration means, and what it cannot mean");
+  CLI::App* const check =
+      app.add_subcommand("check", "Show how the library reads a configuration, and warn of probable mistakes");
   check->add_option("CONFIG", options->file, "The configuration, a JSON document")->required()->type_name("FILE");
   check->add_option("--version-tag", options->versionTag, "The host's version tag, for the names of directories")
       ->type_name("TAG");
-  check->add_option("--locale", options->locale, "The host's locale, \"en_US\" say, for the names of directories")
+  check
+      ->add_option("--locale", options->locale,
+                   "The host's locale, for example \"en_US\", for the names of directories")
       ->type_name("LOCALE");
-  check->add_option("--session", options->session, "The key of a session, named as the host kit names it")
+  check->add_option("--session", options->session, "The key of a session; directories are named as by the host kit")
       ->type_name("KEY");
   check->add_flag("--json", options->json, "Print one JSON object for machines; sizes in bytes, durations in seconds");
   check->footer(
-      "The document is read with the library's own parser. Printed is what that has understood: managers and\n"
-      "stores, every default filled in, and the directories that the tags lead to. Then a line for everything\n"
-      "that the library accepts though nobody means it: misspelt and ignored keys, sizes that wrapped, caches\n"
-      "without a limit, stores that share a directory, and more.\n\n"
+      "Reads the document with the library's own parser and prints the result: managers and stores with every\n"
+      "default filled in, and their directories. Then one line for each thing that the library accepts but that\n"
+      "is probably a mistake: misspelt and ignored keys, sizes that wrapped, caches without a limit, stores that\n"
+      "share a directory, and more.\n\n"
       "Example:\n  cellar check storage.json --version-tag 250 --locale en_US --session alice\n\n"
       "Exit status: 0 without warnings, 1 with some, 2 when the library refuses the document.");
   check->callback([options, &status] { status = runCheck(*options); });

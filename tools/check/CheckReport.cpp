@@ -63,7 +63,7 @@ Lines rulesOf(const StoreDefinition& store) {
   return {"a cache, emptied when it is opened with more than " + formatSize(store.maxSize)};
 }
 
-void printManager(const UnderstoodManager& manager, Console& console) {
+void printManager(const ResolvedManager& manager, Console& console) {
   const StoreManagerDefinition& definition = *manager.definition;
   console.heading(printable(definition.name));
   const std::string rounds = definition.pruneInterval == 0
@@ -72,21 +72,21 @@ void printManager(const UnderstoodManager& manager, Console& console) {
   console.line(printable(manager.directory) + (definition.sessionScoped ? ", a session's" : ", of no session") +
                "; limit " + formatSize(definition.maxSize) + ", " + rounds);
   if (manager.stores.empty()) console.line("no stores");
-  for (const UnderstoodStore& store : manager.stores) {
+  for (const ResolvedStore& store : manager.stores) {
     console.line(printable(store.identifier + ": " + typeName(*store.definition) + " in " + store.directory));
     for (const std::string& rule : rulesOf(*store.definition)) console.line("    " + rule);
   }
 }
 
-std::size_t storesIn(const Understood& understood) {
+std::size_t storesIn(const ResolvedConfiguration& resolved) {
   std::size_t count = 0;
-  for (const UnderstoodManager& manager : understood) count += manager.stores.size();
+  for (const ResolvedManager& manager : resolved) count += manager.stores.size();
   return count;
 }
 
-OrderedJson asJson(const Remarks& findings) {
+OrderedJson asJson(const Diagnostics& findings) {
   OrderedJson list = OrderedJson::array();
-  for (const Remark& finding : findings) {
+  for (const Diagnostic& finding : findings) {
     list.push_back({{"kind", finding.kind}, {"path", finding.pointer}, {"text", finding.text}});
   }
   return list;
@@ -96,7 +96,7 @@ OrderedJson asJson(const std::optional<std::int64_t>& capacity) {
   return capacity.has_value() ? OrderedJson(*capacity) : OrderedJson();
 }
 
-OrderedJson asJson(const UnderstoodStore& store) {
+OrderedJson asJson(const ResolvedStore& store) {
   const StoreDefinition& definition = *store.definition;
   OrderedJson json = {{"identifier", store.identifier},
                       {"name", definition.name},
@@ -126,10 +126,10 @@ OrderedJson asJson(const UnderstoodStore& store) {
   return json;
 }
 
-OrderedJson asJson(const UnderstoodManager& manager) {
+OrderedJson asJson(const ResolvedManager& manager) {
   const StoreManagerDefinition& definition = *manager.definition;
   OrderedJson stores = OrderedJson::array();
-  for (const UnderstoodStore& store : manager.stores) stores.push_back(asJson(store));
+  for (const ResolvedStore& store : manager.stores) stores.push_back(asJson(store));
   return {{"name", definition.name},
           {"area", areaName(definition)},
           {"directory", manager.directory},
@@ -142,20 +142,20 @@ OrderedJson asJson(const UnderstoodManager& manager) {
 }  // namespace
 
 void printCheck(const CheckResult& result, Console& console) {
-  for (const UnderstoodManager& manager : result.understood) printManager(manager, console);
+  for (const ResolvedManager& manager : result.resolved) printManager(manager, console);
   console.raw("\n");
-  for (const Remark& warning : result.warnings) {
+  for (const Diagnostic& warning : result.warnings) {
     console.bad(printable("warning: " + warning.pointer + ": " + warning.text));
   }
-  const std::string counts = formatCount(result.understood.size(), "manager", "managers") + ", " +
-                             formatCount(storesIn(result.understood), "store", "stores") + ", ";
+  const std::string counts = formatCount(result.resolved.size(), "manager", "managers") + ", " +
+                             formatCount(storesIn(result.resolved), "store", "stores") + ", ";
   console.verdict(result.file + ": " + counts + formatCount(result.warnings.size(), "warning", "warnings"),
                   result.warnings.empty());
 }
 
 OrderedJson checkAsJson(const CheckResult& result) {
   OrderedJson managers = OrderedJson::array();
-  for (const UnderstoodManager& manager : result.understood) managers.push_back(asJson(manager));
+  for (const ResolvedManager& manager : result.resolved) managers.push_back(asJson(manager));
   return {{"file", result.file},
           {"managers", std::move(managers)},
           {"warnings", asJson(result.warnings)},

@@ -3,8 +3,8 @@
 #include <string>
 
 #include "check/ConfigurationDocument.h"
-#include "check/Remarks.h"
-#include "check/Understood.h"
+#include "check/Diagnostic.h"
+#include "check/ResolvedConfiguration.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -13,9 +13,9 @@ class Console;
 // What `cellar check` has found out.
 struct CheckResult {
   std::string file;
-  Understood understood;  // empty when there are faults
-  Remarks faults;
-  Remarks warnings;
+  ResolvedConfiguration resolved;  // empty when there are faults
+  Diagnostics faults;
+  Diagnostics warnings;
 };
 
 void printCheck(const CheckResult& result, Console& console);

@@ -12,7 +12,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-// Watches the parser pass over the names of objects, and notes those that an object has twice.
+// Collects the names that an object has twice, from the parser's events.
 class RepeatedNames {
  public:
   void onEvent(OrderedJson::parse_event_t event, const OrderedJson& parsed) {
@@ -38,16 +38,16 @@ class RepeatedNames {
 
  private:
   static constexpr std::size_t kDeepest = 4;    // document, manager, "stores", store
-  static constexpr std::size_t kTooDeep = 200;  // values are copied and shown, which takes stack for each level
+  static constexpr std::size_t kTooDeep = 200;  // values are copied and printed recursively
 
   struct Names {
-    std::set<std::string> met;
+    std::set<std::string> names;
     std::string latest;
   };
 
   void note(const std::string& name) {
     open_.back().latest = name;
-    if (open_.back().met.insert(name).second) return;
+    if (open_.back().names.insert(name).second) return;
     std::string pointer;
     for (const Names& names : open_) pointer = memberPointer(pointer, names.latest);
     pointers_.push_back(std::move(pointer));

@@ -9,14 +9,14 @@ namespace velmora::mobile::xplat::cellar::tools {
 // Keeps members in the order of the document.
 using OrderedJson = nlohmann::ordered_json;
 
-// A configuration as its author wrote it, keys included that the library passes over.
+// A configuration as written, including the keys that the library ignores.
 struct ConfigurationDocument {
   std::string text;
-  OrderedJson root;                   // of names that are met twice, the last
+  OrderedJson root;                   // of duplicate names, the last
   std::vector<std::string> repeated;  // JSON pointers of those names
 };
 
-// Reads the file. Throws `InputError`, naming it, when it cannot be read, is not JSON or is nested beyond all reason.
+// Reads the file. Throws `InputError`, naming it, when it cannot be read, is not JSON or is nested too deeply.
 ConfigurationDocument readConfigurationDocument(const std::string& path);
 
 // The same from a text. Throws the JSON library's parse errors, and `InputError` for the nesting.

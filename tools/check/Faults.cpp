@@ -14,13 +14,13 @@ namespace {
 
 constexpr const char* kKind = "refused";
 
-// "[json.exception.type_error.302] type must be string" tells a reader nothing in its first part.
+// "[json.exception.type_error.302] type must be string" has a first part that is of no use to a reader.
 std::string withoutLibraryName(const std::string& text) {
   const std::size_t end = text.find("] ");
   return text.rfind("[json.exception.", 0) == 0 && end != std::string::npos ? text.substr(end + 2) : text;
 }
 
-// What the library says of a document; empty when it takes it.
+// The library's error for a document; empty if it accepts it.
 std::string refusalOf(const OrderedJson& document) {
   try {
     const Configuration configuration(document.dump(-1, ' ', false, OrderedJson::error_handler_t::replace));
@@ -30,12 +30,12 @@ std::string refusalOf(const OrderedJson& document) {
   }
 }
 
-// Each value is put before the parser alone, in the smallest document that can hold it.
+// Each value is parsed separately, in the smallest possible document.
 class FaultFinder {
  public:
-  Remarks find(const OrderedJson& root) {
+  Diagnostics find(const OrderedJson& root) {
     if (!root.is_object()) {
-      add("", "is no object of managers");
+      add("", "is not an object of managers");
       return findings_;
     }
     for (const auto& [name, manager] : root.items()) lookAtManager(memberPointer("", name), manager);
@@ -86,31 +86,31 @@ class FaultFinder {
 
   static OrderedJson around(const OrderedJson& store) { return {{"m", {{"stores", {{"s", store}}}}}}; }
 
-  Remarks findings_;
+  Diagnostics findings_;
 };
 
-// A manager's name, or a store's identifier, which may not be met twice.
+// A manager's name, or a store's identifier, which must be unique.
 bool namesADefinition(const std::string& pointer) {
   const auto depth = std::count(pointer.begin(), pointer.end(), '/');
   return depth == 1 || (depth == 3 && pointer.find("/stores/") != std::string::npos);
 }
 
-// Where an identifier stands in the document for the second time.
-Remarks findRepeatedIdentifiers(const ConfigurationDocument& document) {
-  Remarks findings;
+// Where an identifier is used a second time.
+Diagnostics findRepeatedIdentifiers(const ConfigurationDocument& document) {
+  Diagnostics findings;
   for (const std::string& pointer : document.repeated) {
     if (!namesADefinition(pointer)) continue;
-    findings.push_back({kKind, pointer, "stands here twice"});
+    findings.push_back({kKind, pointer, "is defined twice here"});
   }
-  std::vector<std::string> met;
+  std::vector<std::string> seen;
   if (!document.root.is_object()) return findings;
   for (const auto& [name, manager] : document.root.items()) {
     const OrderedJson stores = manager.is_object() ? manager.value("stores", OrderedJson()) : OrderedJson();
     if (!stores.is_object()) continue;
     for (const auto& [identifier, store] : stores.items()) {
       const std::string pointer = memberPointer(memberPointer(memberPointer("", name), "stores"), identifier);
-      if (std::find(met.begin(), met.end(), identifier) == met.end()) {
-        met.push_back(identifier);
+      if (std::find(seen.begin(), seen.end(), identifier) == seen.end()) {
+        seen.push_back(identifier);
       } else {
         findings.push_back({kKind, pointer, "another manager has a store of this identifier"});
       }
@@ -121,7 +121,7 @@ Remarks findRepeatedIdentifiers(const ConfigurationDocument& document) {
 
 }  // namespace
 
-Remarks findFaults(const ConfigurationDocument& document) {
+Diagnostics findFaults(const ConfigurationDocument& document) {
   std::string refusal;
   try {
     const Configuration configuration(document.text);
@@ -129,8 +129,8 @@ Remarks findFaults(const ConfigurationDocument& document) {
   } catch (const std::exception& error) {
     refusal = error.what();
   }
-  Remarks findings = FaultFinder().find(document.root);
-  const Remarks repeated = findRepeatedIdentifiers(document);
+  Diagnostics findings = FaultFinder().find(document.root);
+  const Diagnostics repeated = findRepeatedIdentifiers(document);
   findings.insert(findings.end(), repeated.begin(), repeated.end());
   if (findings.empty()) findings.push_back({kKind, "", refusal});
   return findings;

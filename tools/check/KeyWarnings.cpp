@@ -19,7 +19,7 @@ bool contains(const std::vector<std::string>& keys, const std::string& key) {
   return std::find(keys.begin(), keys.end(), key) != keys.end();
 }
 
-// A size or duration as it is written: the number before it is cut to 32 bits, and what the parser leaves unread.
+// A size or duration as written: the number before it is truncated to 32 bits, and the text that the parser ignores.
 struct Quantity {
   std::int64_t number = 0;
   std::string unit;
@@ -50,7 +50,7 @@ std::string inHumanUnits(std::uint32_t value, Measure measure) {
 }
 
 void warnOfQuantity(const std::string& pointer, const OrderedJson& object, const char* key, Measure measure,
-                    Remarks& findings) {
+                    Diagnostics& findings) {
   const auto member = object.find(key);
   if (member == object.end()) return;
   const std::string text = member->get<std::string>();
@@ -60,16 +60,16 @@ void warnOfQuantity(const std::string& pointer, const OrderedJson& object, const
   const auto wrapped = static_cast<std::uint32_t>(exact);
   const std::string place = memberPointer(pointer, key);
   if (exact != static_cast<std::int64_t>(wrapped)) {
-    findings.push_back({"wrapped", place,
-                        "'" + text + "' does not fit into 32 bits and has become " + inHumanUnits(wrapped, measure)});
+    findings.push_back(
+        {"wrapped", place, "'" + text + "' does not fit into 32 bits and becomes " + inHumanUnits(wrapped, measure)});
   }
   if (!quantity.rest.empty()) {
-    findings.push_back({"ignored_text", place, "'" + quantity.rest + "' behind the unit counts for nothing"});
+    findings.push_back({"ignored_text", place, "'" + quantity.rest + "' after the unit is ignored"});
   }
 }
 
 void warnOfUnknownKey(const std::string& place, const std::string& key, const std::vector<std::string>& known,
-                      const std::string& otherwise, Remarks& findings) {
+                      const std::string& otherwise, Diagnostics& findings) {
   const std::string nearest = nearestKey(key, known);
   const std::string hint = nearest.empty() ? otherwise : "; did you mean '" + nearest + "'?";
   findings.push_back({"unknown_key", place, "unknown key" + hint});
@@ -85,7 +85,8 @@ std::vector<std::string> keysOfAnyStore() {
   return keys;
 }
 
-void warnOfStoreKey(const std::string& pointer, const std::string& type, const std::string& key, Remarks& findings) {
+void warnOfStoreKey(const std::string& pointer, const std::string& type, const std::string& key,
+                    Diagnostics& findings) {
   const std::vector<std::string>& known = keysOfStores(type);
   if (contains(known, key)) return;
   const std::string place = memberPointer(pointer, key);
@@ -100,7 +101,7 @@ void warnOfStoreKey(const std::string& pointer, const std::string& type, const s
   }
 }
 
-void warnOfVersion(const std::string& pointer, const OrderedJson& store, Remarks& findings) {
+void warnOfVersion(const std::string& pointer, const OrderedJson& store, Diagnostics& findings) {
   const auto version = store.find("version");
   if (version == store.end()) return;
   const auto written = version->get<std::int64_t>();
@@ -109,15 +110,15 @@ void warnOfVersion(const std::string& pointer, const OrderedJson& store, Remarks
                        !(version->is_number_unsigned() && version->get<std::uint64_t>() > wrapped);
   if (isWhole) return;
   findings.push_back({"wrapped", memberPointer(pointer, "version"),
-                      version->dump() + " does not fit into 32 bits and has become " + std::to_string(wrapped)});
+                      version->dump() + " does not fit into 32 bits and becomes " + std::to_string(wrapped)});
 }
 
-void warnOfCapacity(const std::string& pointer, const OrderedJson& store, Remarks& findings) {
+void warnOfCapacity(const std::string& pointer, const OrderedJson& store, Diagnostics& findings) {
   const auto capacity = store.find("capacity");
   if (capacity == store.end()) return;
   const std::string place = memberPointer(pointer, "capacity");
   if (!capacity->is_number_integer()) {
-    findings.push_back({"capacity", place, capacity->dump() + " is no integer: the store has no capacity limit"});
+    findings.push_back({"capacity", place, capacity->dump() + " is not an integer: the store has no capacity limit"});
   } else if (!capacity->is_number_unsigned() && capacity->get<std::int64_t>() < 0) {
     findings.push_back({"capacity", place, capacity->dump() + " is negative: the store has no capacity limit"});
   }
@@ -125,7 +126,7 @@ void warnOfCapacity(const std::string& pointer, const OrderedJson& store, Remark
 
 }  // namespace
 
-void warnOfManagerKeys(const std::string& pointer, const OrderedJson& manager, Remarks& findings) {
+void warnOfManagerKeys(const std::string& pointer, const OrderedJson& manager, Diagnostics& findings) {
   for (const auto& [key, value] : manager.items()) {
     if (contains(keysOfManagers(), key)) continue;
     const bool isStores = contains(keysOfAnyStore(), key);
@@ -136,11 +137,11 @@ void warnOfManagerKeys(const std::string& pointer, const OrderedJson& manager, R
   warnOfQuantity(pointer, manager, "prune_interval", Measure::Duration, findings);
   const auto stores = manager.find("stores");
   if (stores != manager.end() && !stores->is_object()) {
-    findings.push_back({"ignored_stores", memberPointer(pointer, "stores"), "is no object: there are no stores"});
+    findings.push_back({"ignored_stores", memberPointer(pointer, "stores"), "is not an object: there are no stores"});
   }
 }
 
-void warnOfStoreKeys(const std::string& pointer, const OrderedJson& store, Remarks& findings) {
+void warnOfStoreKeys(const std::string& pointer, const OrderedJson& store, Diagnostics& findings) {
   const std::string type = store.at("type").get<std::string>();
   for (const auto& [key, value] : store.items()) warnOfStoreKey(pointer, type, key, findings);
   warnOfVersion(pointer, store, findings);

@@ -11,7 +11,7 @@ namespace {
 
 using Keys = std::vector<std::string>;
 
-// Differences in case and in how words are joined count for nothing: "maxSize" is "max_size".
+// Ignores differences in case and in how words are joined: "maxSize" is "max_size".
 std::string withoutStyle(const std::string& key) {
   std::string plain;
   for (const char character : key) {
@@ -65,7 +65,7 @@ const Keys& storeTypes() {
 }
 
 std::string nearestKey(const std::string& key, const Keys& known) {
-  constexpr std::size_t longest = 64;  // longer ones resemble nothing, and comparing takes time
+  constexpr std::size_t longest = 64;  // longer ones resemble no known key, and comparing takes time
   if (key.size() > longest) return "";
   const std::string plain = withoutStyle(key);
   std::string nearest;

@@ -11,7 +11,7 @@ const std::vector<std::string>& keysOfStores(const std::string& type);  // those
 const std::vector<std::string>& storeTypes();
 
 // The known key that the reader may have meant: the nearest by changed, added, missing and swapped characters, or empty
-// when even that one is too far off to be what was meant.
+// if even that one is too different.
 std::string nearestKey(const std::string& key, const std::vector<std::string>& known);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -15,7 +15,7 @@ namespace {
 
 constexpr std::size_t kLongestFileName = 255;  // bytes, of the file systems of phones
 
-void warnOfDiskCache(const UnderstoodStore& store, const DiskCacheDefinition& cache, Remarks& findings) {
+void warnOfDiskCache(const ResolvedStore& store, const DiskCacheDefinition& cache, Diagnostics& findings) {
   if (cache.lruSizeLimit == 0) {
     findings.push_back({"no_limit", memberPointer(store.pointer, "lru_size_limit"),
                         "is 0 B: each round of pruning empties the cache"});
@@ -23,7 +23,7 @@ void warnOfDiskCache(const UnderstoodStore& store, const DiskCacheDefinition& ca
   if (cache.survivalSize > cache.lruSizeLimit) {
     findings.push_back({"survival_size", memberPointer(store.pointer, "survival_size"),
                         formatSize(cache.survivalSize) + " is more than the limit of " +
-                            formatSize(cache.lruSizeLimit) + ": a device short of space would keep more"});
+                            formatSize(cache.lruSizeLimit) + ": a device that is short of space would keep more"});
   }
   if (cache.pruneStrategy == PruneStrategyIdentifier::VideoDownload &&
       cache.metadataFactory != ExtendedMetadataFactoryIdentifier::VideoDownload) {
@@ -33,7 +33,7 @@ void warnOfDiskCache(const UnderstoodStore& store, const DiskCacheDefinition& ca
   }
 }
 
-void warnOfLimits(const UnderstoodStore& store, Remarks& findings) {
+void warnOfLimits(const ResolvedStore& store, Diagnostics& findings) {
   const StoreDefinition& definition = *store.definition;
   if (definition.type == StoreDefinition::Type::DiskCache) {
     warnOfDiskCache(store, static_cast<const DiskCacheDefinition&>(definition), findings);
@@ -44,26 +44,26 @@ void warnOfLimits(const UnderstoodStore& store, Remarks& findings) {
   }
 }
 
-void warnOfFileName(const UnderstoodStore& store, Remarks& findings) {
+void warnOfFileName(const ResolvedStore& store, Diagnostics& findings) {
   const std::string& name = store.definition->name;
   const std::string place = name == store.identifier ? store.pointer : memberPointer(store.pointer, "name");
   if (name.find('/') != std::string::npos) {
-    findings.push_back({"file_name", place, "'" + name + "' holds a '/' and reaches outside the manager's directory"});
+    findings.push_back({"file_name", place, "'" + name + "' contains a '/' and leads outside the manager's directory"});
   } else if (name.find('\0') != std::string::npos) {
-    findings.push_back({"file_name", place, "the name holds a zero byte, at which the system cuts it off"});
+    findings.push_back({"file_name", place, "the name contains a zero byte, at which the system truncates it"});
   } else if (name.empty()) {
     findings.push_back({"file_name", place, "the name is empty"});
   } else if (store.directory.size() > kLongestFileName) {
     findings.push_back({"file_name", place,
                         "the directory's name has " + std::to_string(store.directory.size()) +
-                            " bytes, more than the " + std::to_string(kLongestFileName) + " that file systems take"});
+                            " bytes, more than the " + std::to_string(kLongestFileName) + " that file systems allow"});
   }
 }
 
-// Caches within their limits may still be over their manager's, and then nothing is there to be pruned.
-void warnOfManagerLimit(const UnderstoodManager& manager, Remarks& findings) {
+// Caches within their limits can together exceed their manager's, and then nothing can be pruned.
+void warnOfManagerLimit(const ResolvedManager& manager, Diagnostics& findings) {
   std::uint64_t sum = 0;
-  for (const UnderstoodStore& store : manager.stores) {
+  for (const ResolvedStore& store : manager.stores) {
     if (store.definition->isCache) sum += store.definition->maxSize;
   }
   if (sum <= manager.definition->maxSize) return;
@@ -72,37 +72,37 @@ void warnOfManagerLimit(const UnderstoodManager& manager, Remarks& findings) {
                           formatSize(manager.definition->maxSize)});
 }
 
-void warnOfPruning(const UnderstoodManager& manager, Remarks& findings) {
+void warnOfPruning(const ResolvedManager& manager, Diagnostics& findings) {
   if (manager.definition->pruneInterval != 0) return;
-  for (const UnderstoodStore& store : manager.stores) {
+  for (const ResolvedStore& store : manager.stores) {
     if (store.definition->type != StoreDefinition::Type::DiskCache) continue;
     findings.push_back({"never_prunes", memberPointer(manager.pointer, "prune_interval"),
-                        "is 0: the manager never prunes, and its disk caches grow without end"});
+                        "is 0: the manager never prunes, and its disk caches grow without limit"});
     return;
   }
 }
 
-// Stores that stand in one directory take each other's files for their own; those of one name cannot be told apart in
-// events and log lines.
+// Stores in one directory treat each other's files as their own; stores of one name cannot be told apart in events and
+// log lines.
 class Namesakes {
  public:
-  void lookAt(const UnderstoodManager& manager, Remarks& findings) {
+  void lookAt(const ResolvedManager& manager, Diagnostics& findings) {
     lookAtManagerDirectory(manager, findings);
-    for (const UnderstoodStore& store : manager.stores) lookAtStore(manager, store, findings);
+    for (const ResolvedStore& store : manager.stores) lookAtStore(manager, store, findings);
   }
 
  private:
   using FirstOf = std::map<std::string, std::string>;  // to its pointer
 
-  void lookAtManagerDirectory(const UnderstoodManager& manager, Remarks& findings) {
+  void lookAtManagerDirectory(const ResolvedManager& manager, Diagnostics& findings) {
     const auto [first, isFirst] = managers_.emplace(manager.directory, manager.pointer);
     if (isFirst) return;
-    findings.push_back({"shared_directory", manager.pointer,
-                        "shares its directory " + manager.directory + " with " + first->second +
-                            ": each cleans up the other's stores"});
+    findings.push_back(
+        {"shared_directory", manager.pointer,
+         "shares its directory " + manager.directory + " with " + first->second + ": each removes the other's stores"});
   }
 
-  void lookAtStore(const UnderstoodManager& manager, const UnderstoodStore& store, Remarks& findings) {
+  void lookAtStore(const ResolvedManager& manager, const ResolvedStore& store, Diagnostics& findings) {
     const auto [place, isFirstThere] = stores_.emplace(manager.directory + "/" + store.directory, store.pointer);
     const auto [namesake, isFirstOfName] = names_.emplace(store.definition->name, store.pointer);
     if (!isFirstThere) {
@@ -111,7 +111,7 @@ class Namesakes {
     } else if (!isFirstOfName) {
       findings.push_back({"shared_name", store.pointer,
                           "has the name '" + store.definition->name + "' of " + namesake->second +
-                              ": events and log lines, which carry names, cannot tell them apart"});
+                              ": they cannot be told apart in events and log lines"});
     }
   }
 
@@ -120,23 +120,23 @@ class Namesakes {
   FirstOf names_;
 };
 
-void warnOfRepeatedKeys(const ConfigurationDocument& document, Remarks& findings) {
+void warnOfRepeatedKeys(const ConfigurationDocument& document, Diagnostics& findings) {
   for (const std::string& pointer : document.repeated) {
-    findings.push_back({"repeated_key", pointer, "stands here more than once; only the last counts"});
+    findings.push_back({"repeated_key", pointer, "is defined more than once here; only the last counts"});
   }
 }
 
 }  // namespace
 
-Remarks findWarnings(const ConfigurationDocument& document, const Understood& understood) {
-  Remarks findings;
+Diagnostics findWarnings(const ConfigurationDocument& document, const ResolvedConfiguration& resolved) {
+  Diagnostics findings;
   Namesakes namesakes;
-  for (const UnderstoodManager& manager : understood) {
+  for (const ResolvedManager& manager : resolved) {
     const OrderedJson& written = document.root.at(manager.definition->name);
     warnOfManagerKeys(manager.pointer, written, findings);
     warnOfManagerLimit(manager, findings);
     warnOfPruning(manager, findings);
-    for (const UnderstoodStore& store : manager.stores) {
+    for (const ResolvedStore& store : manager.stores) {
       warnOfStoreKeys(store.pointer, written.at("stores").at(store.identifier), findings);
       warnOfLimits(store, findings);
       warnOfFileName(store, findings);

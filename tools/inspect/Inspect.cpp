@@ -33,14 +33,14 @@ struct InspectOptions {
   std::string page;
 };
 
-// Looking must not change what is looked at.
+// Inspecting must not change anything in ROOT.
 void requireOutside(const std::string& root, const std::string& page) {
   namespace fs = std::filesystem;
   std::error_code error;
   const fs::path outer = fs::canonical(root, error);
   const fs::path inner = fs::weakly_canonical(page, error);
   const bool isInside = std::mismatch(outer.begin(), outer.end(), inner.begin(), inner.end()).first == outer.end();
-  if (!error && isInside) throw InputError("cannot write the page '" + page + "': it would lie in ROOT");
+  if (!error && isInside) throw InputError("cannot write the page '" + page + "': it would be in ROOT");
 }
 
 Survey survey(const InspectOptions& options, Console& console) {
@@ -77,26 +77,26 @@ int runInspect(const InspectOptions& options) {
 
 void addInspectCommand(CLI::App& app, int& status) {
   const auto options = std::make_shared<InspectOptions>();
-  CLI::App* const inspect = app.add_subcommand("inspect", "Show what a storage root, or a part of one, holds");
+  CLI::App* const inspect = app.add_subcommand("inspect", "Show what is in a storage root or a part of one");
   inspect->add_option("ROOT", options->root, "The directory: a root with its areas, an area, a manager or a store")
       ->required();
   inspect
       ->add_option("--config", options->configuration,
-                   "The configuration of the application: names, limits, what is stale, what goes first")
+                   "The configuration of the application: names, limits, what is stale, what is evicted next")
       ->type_name("CONFIG.json");
-  inspect->add_option("--top", options->top, "How many of the largest items, and of the next to go, are listed")
+  inspect->add_option("--top", options->top, "How many of the largest items, and of the next to be evicted, are listed")
       ->type_name("N")
       ->capture_default_str();
   inspect->add_flag("--json", options->json, "Print everything for machines");
-  inspect
-      ->add_option("--html", options->page, "Write a page with charts to this file, which needs nothing beside itself")
+  inspect->add_option("--html", options->page, "Write a page with charts to this file, which needs no other files")
       ->type_name("FILE");
   inspect->footer(
-      "Nothing is changed: manifests are read from copies, no log is checkpointed, no access date moves.\n\n"
-      "Held is what the values' files and the inline values take, recorded what the manifest says, on disk what the\n"
-      "file system has set aside. Version tag and locale stand in no configuration: of several directories of one\n"
-      "store the one used last is taken to be the present one. Video priorities are the application's, too: without\n"
-      "them items go by their last use.\n\n"
+      "Nothing is changed: manifests are read from copies, no log is checkpointed, access dates remain.\n\n"
+      "\"Held\" is the size of the values in files and inline, \"recorded\" the size in the manifest, \"on disk\" "
+      "what\n"
+      "the file system has allocated. The configuration contains neither version tag nor locale: of several\n"
+      "directories of one store, the last used one counts as the present one. It does not contain video priorities\n"
+      "either: items are listed by their last use.\n\n"
       "Examples:\n  cellar inspect /tmp/cellar-demo --config media-app.json --top 3\n"
       "  cellar inspect /tmp/cellar-demo --html storage.html");
   inspect->callback([options, &status] { status = runInspect(*options); });

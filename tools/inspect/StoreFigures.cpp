@@ -52,7 +52,7 @@ std::vector<ItemFigures> largestOf(const std::vector<ItemFigures>& items, std::s
 
 // --- Files ---
 
-// What lies in the directory; the files of values in `values`.
+// Everything in the directory; the files of values in `values`.
 void measureFiles(const StorePlace& place, const StoreContext& context, StoreSurvey& store,
                   std::vector<ItemFigures>& values) {
   store.allocatedBytes = allocatedBy(place.path);
@@ -71,7 +71,7 @@ void measureFiles(const StorePlace& place, const StoreContext& context, StoreSur
   });
 }
 
-// The result that the last measurement kept with the directory.
+// The stored result of the last measurement of the directory.
 std::optional<std::uint64_t> keptSize(const std::string& path) {
   AttributeStore attributes(std::make_shared<UntouchedFiles>());
   const JsonValue document = attributes.get(path);
@@ -93,7 +93,7 @@ ItemFigures figuresOf(const DiskCacheItem& item) {
 }
 
 // The keys of all items in the order in which a prune takes them. The order of a strategy need not be consistent, which
-// the standard sorts do not bear: a stable insertion by halves, as a merge does, bears any.
+// the standard sorts require: a merge by halves works with any order.
 void sortForPrune(std::vector<const DiskCacheItem*>& items, const Comparator& before) {
   if (items.size() < 2) return;
   const auto middle = items.begin() + static_cast<std::ptrdiff_t>(items.size() / 2);

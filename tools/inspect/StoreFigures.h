@@ -11,7 +11,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 struct ConfiguredStore;
 struct StorePlace;
 
-// What of a store's surroundings its figures need.
+// What is needed for the figures of a store.
 struct StoreContext {
   std::string root;
   std::string temporaryDirectory;  // for the copy of a manifest
@@ -20,10 +20,10 @@ struct StoreContext {
   OnFile onFile;
 };
 
-// Looks at one store's directory.
+// The figures of one store's directory.
 StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configured, const StoreContext& context);
 
-// Files of a tree that is no store.
+// The files of a tree that is not a store.
 void measureTree(const std::string& path, Leftover& leftover, const OnFile& onFile);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -26,11 +26,11 @@ struct ItemFigures {
   bool isInline = false;
 };
 
-enum class StoreKind { Unmanaged, Keyed, KeyValue, DiskCache };  // Keyed: one of the two after it, nothing says which
+enum class StoreKind { Unmanaged, Keyed, KeyValue, DiskCache };  // Keyed: one of the two after it, unknown which
 
 enum class LeftoverKind { OtherVersion, OtherSession, NotConfigured, Temporary, Trash, Quarantine };
 
-// What one store's directory holds. Dates are of the last access for items with records, else of the last change.
+// The contents of one store's directory. Dates are of the last access for items with records, else of the last change.
 struct StoreSurvey {
   std::string path;  // below the root
   std::string name;  // of the directory
@@ -59,7 +59,7 @@ struct StoreSurvey {
 
   std::vector<ItemFigures> largest;
   std::vector<ItemFigures> nextToGo;          // in the order of a prune, of stores with keys
-  std::optional<std::uint64_t> itemsToPrune;  // of a disk cache with a limit: what a prune would take now
+  std::optional<std::uint64_t> itemsToPrune;  // of a disk cache with a limit: what a prune would remove now
   std::optional<std::uint64_t> bytesToPrune;
 
   std::vector<Bucket> ages;
@@ -69,14 +69,14 @@ struct StoreSurvey {
 };
 
 struct ManagerSurvey {
-  std::string path;  // below the root, ".." above a store that stands by itself
+  std::string path;  // below the root; ".." for the manager of a store that is inspected alone
   std::string directory;
   std::string name;  // by the configuration
   std::string area;
   std::string session;
   bool isSessionless = false;
   std::optional<std::uint64_t> limitBytes;
-  std::uint64_t countedBytes = 0;  // of its stores with keys, which is what counts for the limit
+  std::uint64_t countedBytes = 0;  // of its stores with keys, which count for the limit
   std::vector<StoreSurvey> stores;
 };
 
@@ -98,8 +98,8 @@ struct Survey {
 
 using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each file that is looked at
 
-// Looks at everything in the layout and changes none of it. `top`: how many of the largest items, and of the next to
-// go, are named for each store. Throws `InputError` for what cannot be read.
+// Inspects everything in the layout without changing it. `top`: how many of the largest items, and of the next to be
+// evicted, are listed for each store. Throws `InputError` for what cannot be read.
 Survey makeSurvey(const Layout& layout, const ConfiguredStores& configured, std::size_t top, std::int64_t now,
                   const OnFile& onFile);
 

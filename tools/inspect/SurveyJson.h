@@ -6,8 +6,8 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// The survey for machines, and for the page. Keys stay as they are from release to release; new ones may come. What is
-// not known is null.
+// The survey as JSON, for machines and for the page. Keys do not change between releases; new ones may be added.
+// Unknown values are null.
 nlohmann::ordered_json surveyAsJson(const Survey& survey);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

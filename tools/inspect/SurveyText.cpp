@@ -142,9 +142,9 @@ class Printer {
     console_.raw("\n");
     printList(printable(store.name) + ", largest", store.largest);
     if (store.nextToGo.empty()) return;
-    std::string title = printable(store.name) + ", next to go";
+    std::string title = printable(store.name) + ", next to be evicted";
     if (store.itemsToPrune.value_or(0) > 0) {
-      title += " (a prune now takes " + formatCount(*store.itemsToPrune, "item", "items") + ", " +
+      title += " (a prune would remove " + formatCount(*store.itemsToPrune, "item", "items") + ", " +
                formatSize(*store.bytesToPrune) + ")";
     }
     printList(title, store.nextToGo);

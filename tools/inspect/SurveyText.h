@@ -6,7 +6,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 class Console;
 
-// The survey for people.
+// The survey as text.
 void printSurvey(const Survey& survey, Console& console);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -9,7 +9,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-// Four digits are enough for everybody, and the same on every machine.
+// Four digits are enough, and the same on every machine.
 std::optional<double> ratio(std::uint64_t part, std::optional<std::uint64_t> whole) {
   if (!whole || *whole == 0) return std::nullopt;
   constexpr double digits = 10000;

@@ -8,7 +8,8 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Of all stores, those that are left over too; the leftover figures count these once more, with the trash and the like.
+// Of all stores, including those that are left over; the leftover figures count these again, with the trash and the
+// like.
 struct Totals {
   std::uint64_t stores = 0;
   std::uint64_t items = 0;
@@ -23,7 +24,7 @@ struct Totals {
 
 Totals totalsOf(const Survey& survey);
 
-// 1 for full; of a store without a limit of its own but with a capacity, by its items. Empty without either.
+// 1 for full; for a store with a capacity but no size limit, by its items. Empty without either.
 std::optional<double> fillOf(const StoreSurvey& store);
 std::optional<double> fillOf(const ManagerSurvey& manager);
 

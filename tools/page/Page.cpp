@@ -2,12 +2,12 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Made at build time, too.
+// Generated at build time, too.
 extern const char* const kChartLibrary;
 
 namespace {
 
-// A "<" stands only in strings of a document, where it may be written so: no text can end the element that it is in.
+// In JSON a "<" occurs only in strings, where it may be escaped: so no text can end its HTML element.
 std::string withoutMarkup(const std::string& json) {
   std::string text;
   for (const char character : json) {
@@ -28,7 +28,7 @@ void fill(std::string& page, const std::string& mark, const std::string& text) {
 
 std::string pageOf(const char* page, const std::string& document) {
   std::string filled = page;
-  // The document stands in front, and may hold whatever looks like a mark.
+  // Last, because the document may contain text that looks like a mark.
   fill(filled, "@CHARTS@", kChartLibrary);
   fill(filled, "@DOCUMENT@", withoutMarkup(document));
   return filled;

@@ -1,5 +1,5 @@
 "use strict";
-// What the pages share. The document that a page shows stands in it.
+// Shared by the pages. Each page contains the document that it shows.
 
 const shown = JSON.parse(document.getElementById("document").textContent);
 

@@ -1,4 +1,4 @@
-// Fills the page from the survey that stands in it. Each figure carries the way to it in the document in `data-figure`.
+// Fills the page from the survey in it. The attribute `data-figure` of each figure is its path in the document.
 
 const survey = shown;
 
@@ -56,7 +56,7 @@ function storeFigures(store, at) {
   if (store.oldest_access !== null) add("Oldest use", "oldest_access", formatAge(store.oldest_access));
   if (store.newest_access !== null) add("Last use", "newest_access", formatAge(store.newest_access));
   if (store.stale_items !== null) add("Stale", "stale_items", formatCount(store.stale_items));
-  if (store.items_to_prune) add("A prune takes now", "items_to_prune", formatCount(store.items_to_prune));
+  if (store.items_to_prune) add("A prune would remove", "items_to_prune", formatCount(store.items_to_prune));
   return list;
 }
 
@@ -73,7 +73,7 @@ function storeCard(store, at) {
   card.append(storeFigures(store, at));
   for (const damage of store.damages) card.append(make("p", { className: "damage", textContent: "Damaged manifest: " + damage }));
   if (store.largest.length > 0) card.append(itemList("Largest", store.largest));
-  if (store.next_to_go.length > 0) card.append(itemList("Next to go", store.next_to_go));
+  if (store.next_to_go.length > 0) card.append(itemList("Next to be evicted", store.next_to_go));
   return card;
 }
 
@@ -155,13 +155,13 @@ function bytesByStore() {
   return shown;
 }
 
-// Sizes are counted in powers of two, and their axis stands at such places.
+// Sizes have units of powers of two, and so have the marks of their axis.
 function sizeStep(values) {
   const fifth = Math.max(1, ...values) / 5;
   return 2 ** Math.ceil(Math.log2(fifth));
 }
 
-// "< 30 days" in two lines: it stands under a narrow bar.
+// "< 30 days" in two lines, because bars are narrow.
 function inTwoLines(value) {
   const words = this.getLabelForValue(value).split(" ");
   return words.length < 2 ? words : [words.slice(0, -1).join(" "), words.at(-1)];

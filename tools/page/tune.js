@@ -1,4 +1,4 @@
-// Fills the page from the report that stands in it, and draws the hit rate over the limit.
+// Fills the page from the report in it, and draws the hit rate over the limit.
 
 // ---- the page ---------------------------------------------------------------------------------------------------------
 
@@ -21,7 +21,7 @@ function fillTable() {
 
 // ---- the chart --------------------------------------------------------------------------------------------------------
 
-// A limit's place: each doubling goes on by one.
+// A limit's place on the axis: each doubling is one step.
 const placeOf = (limit) => Math.log2(limit);
 const percent = (share) => (share * 100).toFixed(1) + " %";
 
@@ -48,10 +48,10 @@ function curves() {
     curve("requests", "accent", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.hit_rate }))),
     curve("bytes", "third", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.byte_hit_rate })), [6, 4]),
   ];
-  const played = shown.limits.filter((limit) => limit.video_hits !== undefined);
-  if (played.length > 0) {
+  const simulated = shown.limits.filter((limit) => limit.video_hits !== undefined);
+  if (simulated.length > 0) {
     all.push(curve("requests, video strategy", "second",
-      played.map((limit) => ({ x: placeOf(limit.limit), y: limit.video_hits / shown.requests })), [2, 3]));
+      simulated.map((limit) => ({ x: placeOf(limit.limit), y: limit.video_hits / shown.requests })), [2, 3]));
   }
   return all;
 }

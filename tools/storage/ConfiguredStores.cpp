@@ -17,14 +17,14 @@ constexpr std::array<const char*, 3> kAreaNames = {"caches", "documents", "share
 
 bool isDigit(char character) { return character >= '0' && character <= '9'; }
 
-// An area of another name is a host's own way to place things, and may be any of them.
+// An area of another name belongs to a host with its own locations, and may be any of them.
 bool isArea(const std::string& directoryName, Area area) {
   const auto found = std::find(kAreaNames.begin(), kAreaNames.end(), directoryName);
   return found == kAreaNames.end() || found - kAreaNames.begin() == static_cast<int>(area);
 }
 
-// Whether the part of a name between the store's own and its version holds the locale and the version tag that belong
-// there: "_en_US", "_250", "_en_US_250".
+// Whether the part of a name between the store's name and its version is the expected locale and version tag: "_en_US",
+// "_250", "_en_US_250".
 bool fits(const std::string& middle, const StoreDefinition& store) {
   const auto parts = std::count(middle.begin(), middle.end(), '_');
   const int needed = (store.localeSensitive ? 2 : 0) + (store.hasVersion ? 0 : 1);

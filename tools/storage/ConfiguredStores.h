@@ -10,8 +10,8 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 struct ManagerPlace;
 
-// Which definition a directory belongs to. Version tag and locale are the application's and stand in no document, so a
-// name matches whatever they are.
+// Which definition a directory belongs to. Version tag and locale come from the application and are not in the
+// document, so a name matches with any of them.
 struct ConfiguredStore {
   std::shared_ptr<const StoreManagerDefinition> manager;
   std::string identifier;  // empty: no store of that name is configured
@@ -24,7 +24,7 @@ class ConfiguredStores {
   // Nothing is configured.
   ConfiguredStores() = default;
 
-  // Reads the document. Throws `InputError`, naming the file, for one that cannot be read or used.
+  // Reads the document. Throws `InputError`, naming the file, if it cannot be read or is not valid.
   explicit ConfiguredStores(const std::string& file);
 
   bool isEmpty() const;
@@ -32,14 +32,14 @@ class ConfiguredStores {
   // The managers that may keep their stores in that directory.
   std::vector<std::shared_ptr<const StoreManagerDefinition>> managersOf(const ManagerPlace& place) const;
 
-  // Of several stores that fit, the one with the longest name.
+  // Of several matching stores, the one with the longest name.
   ConfiguredStore find(const ManagerPlace& place, const std::string& directoryName) const;
 
  private:
   std::vector<std::shared_ptr<const StoreManagerDefinition>> managers_;
 };
 
-// "thumbs_250" and 2 for "thumbs_250_v2"; the whole name and nothing for one without a version.
+// "thumbs_250" and 2 for "thumbs_250_v2"; the whole name and no number for one without a version.
 struct VersionedName {
   std::string stem;
   std::string version;

@@ -120,7 +120,7 @@ class Finder {
     }
   }
 
-  // A host that was opened and asked for nothing has left its lock file only.
+  // A host that was opened but not used has left only its lock file.
   static bool holdsLock(const std::string& root) {
     std::error_code ignored;
     return fs::is_regular_file(fs::symlink_status(in(root, host::RootLock::fileName), ignored));
@@ -141,7 +141,7 @@ class Finder {
     }
     layout_.kind = isRoot ? Layout::Kind::Root : Layout::Kind::Empty;
     if (!isRoot && !listUntouched(root).empty()) {
-      throw InputError("ROOT '" + root + "' is no storage root, nor a part of one: there is no manager's directory (" +
+      throw InputError("ROOT '" + root + "' is not a storage root or a part of one: there is no manager's directory (" +
                        kSessionless + ", " + kSessionPrefix + "...) in it or one level below, and no " +
                        ManifestSnapshot::manifestName);
     }

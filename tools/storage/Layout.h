@@ -5,30 +5,30 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// The directory in which `cellar verify --repair` keeps what it takes out of stores. It stands beside the managers'
-// directories, where no clean-up of an application comes by.
+// The directory into which `cellar verify --repair` moves what it removes from stores. It is beside the managers'
+// directories, where no application cleans up.
 extern const char* const kQuarantineName;
 
-// A store's directory, as far as its names tell.
+// A store's directory, judged by its names.
 struct StorePlace {
   std::string path;
   std::string name;          // of the directory
-  bool hasManifest = false;  // a store with keys; without: an unmanaged one, or one that is empty
+  bool hasManifest = false;  // a store with keys; else: an unmanaged or an empty one
 };
 
 // A manager's directory.
 struct ManagerPlace {
   std::string path;
-  std::string name;  // of the directory; empty when it is none that a manager would have
-  std::string area;  // the name of the directory that it stands in
+  std::string name;  // of the directory; empty if it is not a manager's
+  std::string area;  // the name of the directory that contains it
   std::vector<StorePlace> stores;
 
-  std::string directory() const;  // the name of the directory, whatever it is
+  std::string directory() const;  // the name of the directory, in any case
   bool isSessionless() const;
   std::string sessionTag() const;  // empty without a session
 };
 
-// What belongs to no store.
+// Directories that do not belong to a store.
 struct OtherPlace {
   enum class Kind { Temporary, Trash, Quarantine };
 
@@ -36,7 +36,7 @@ struct OtherPlace {
   Kind kind;
 };
 
-// What a directory of storage consists of.
+// The parts of a directory of storage.
 struct Layout {
   enum class Kind { Empty, Root, Area, Manager, Store };
 
@@ -46,8 +46,8 @@ struct Layout {
   std::vector<OtherPlace> others;
 };
 
-// Finds out which depth of a storage root the directory is, and what is in it. Touches nothing. Throws `InputError` for
-// a path that cannot be read or is nothing of the kind.
+// Finds out whether the directory is a storage root, an area, a manager or a store, and what is in it. Changes nothing.
+// Throws `InputError` for a path that cannot be read or is none of these.
 Layout findLayout(const std::string& path);
 
 // The part of `path` below `root`; "." for the root itself.

@@ -7,13 +7,13 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Whether a file of that name (below the store's directory) is the manifest or one of SQLite's companions of it.
+// Whether a file of that name (below the store's directory) is the manifest or one of SQLite's files beside it.
 bool isManifestFile(const std::string& name);
 
-// Whether it is where a directory's attributes are kept.
+// Whether it is the file of a directory's attributes.
 bool isAttributesFile(const Entry& entry);
 
-// Every entry of a tree, a directory before what is in it, links not followed; each with its path below the tree.
+// Every entry of a tree, a directory before its contents, links not followed; each with its path below the tree.
 // Throws `FileUtilsIoException`.
 void walkTree(const std::string& directory, const std::function<void(const std::string& below, const Entry&)>& onEntry);
 

@@ -16,7 +16,7 @@ std::string makeFolder() {
   const std::filesystem::path parent = std::filesystem::temp_directory_path(error);
   std::string path = (parent / "cellar-XXXXXX").string();
   if (error || mkdtemp(path.data()) == nullptr) {
-    throw InputError("cannot make the temporary directory '" + path +
+    throw InputError("cannot create the temporary directory '" + path +
                      "': " + (error ? error.message() : std::generic_category().message(errno)));
   }
   return path;

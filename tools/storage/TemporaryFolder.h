@@ -4,8 +4,8 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// An empty directory of the program's own, where the system keeps such things, gone with everything in it at the end.
-// Throws `InputError` when it cannot be made.
+// An empty temporary directory, removed with its contents by the destructor. Throws `InputError` if it cannot be
+// created.
 class TemporaryFolder {
  public:
   TemporaryFolder();

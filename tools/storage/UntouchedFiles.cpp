@@ -24,13 +24,13 @@ constexpr std::uint64_t kBlock = 512;  // the unit of st_blocks, whatever the fi
   throw FileUtilsIoException(code, "cannot read '" + path + "': " + std::generic_category().message(code));
 }
 
-// Only the owner of a file, or root, may ask that its access date stays.
+// Only the owner of a file, or root, may read it without changing its access date.
 int openUntouched(const std::string& path, int flags) {
   const int file = open(path.c_str(), flags | O_RDONLY | O_CLOEXEC | O_NOATIME);
   return file >= 0 || errno != EPERM ? file : open(path.c_str(), flags | O_RDONLY | O_CLOEXEC);
 }
 
-// Opens without waiting for the other end of a fifo.
+// Does not wait for the other end of a fifo.
 class Descriptor {
  public:
   explicit Descriptor(const std::string& path) : file_(openUntouched(path, O_NONBLOCK)) {

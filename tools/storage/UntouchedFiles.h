@@ -15,21 +15,21 @@ struct Entry {
   std::string name;
   Type type = Type::Other;
   std::uint64_t size = 0;       // bytes of a file, else 0
-  std::uint64_t allocated = 0;  // bytes that it takes on the disk
+  std::uint64_t allocated = 0;  // bytes allocated on the disk
   std::int64_t modified = 0;    // seconds since the Unix epoch
 };
 
-// The entries of a directory by name. Reading it leaves its dates as they are, its access date too where the system
-// allows that. Throws `FileUtilsIoException`. Not an error: an entry that goes meanwhile.
+// The entries of a directory by name. Reading does not change its dates, including the access date where the system
+// allows that. Throws `FileUtilsIoException`. Not an error: an entry that is removed meanwhile.
 std::vector<Entry> listUntouched(const std::string& directory);
 
 // The files of a tree, listed likewise.
 std::uint64_t countFiles(const std::string& directory);
 
-// What the directory itself takes on the disk.
+// Bytes that the directory itself has allocated on the disk.
 std::uint64_t allocatedBy(const std::string& path);
 
-// The real files, read without moving their access dates where the system allows that.
+// The real files, read without changing their access dates where the system allows that.
 class UntouchedFiles final : public FileUtils {
  public:
   std::vector<unsigned char> readFile(const std::string& path) override;

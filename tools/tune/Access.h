@@ -6,8 +6,8 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 enum class AccessKind : std::uint8_t {
   Fetch,   // counts; one that misses is followed by storing the item
-  Store,   // a use that is no request
-  Remove,  // the item goes
+  Store,   // a use that is not a request
+  Remove,  // the item is removed
 };
 
 // One use of an item of a cache.

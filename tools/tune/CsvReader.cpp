@@ -38,7 +38,7 @@ void split(const std::string& line, Cells& cells) {
   }
 }
 
-// Where the columns stand.
+// The positions of the columns.
 class Layout {
  public:
   Layout(const LineReader& lines, const Cells& header, const CsvColumns& columns)
@@ -70,14 +70,14 @@ class Row {
  public:
   Row(const LineReader& lines, const Cells& cells) : lines_(lines), cells_(cells) {}
 
-  // Empty when the column is not there.
+  // Empty if the column is absent.
   std::string text(const Layout::Place& place) const {
     if (!place) return "";
     if (*place >= cells_.size()) lines_.fail("there are only " + std::to_string(cells_.size()) + " cells");
     return cells_[*place];
   }
 
-  // A whole number; of one with decimals, what stands before the point.
+  // A whole number; decimals are ignored.
   std::optional<std::int64_t> number(const Layout::Place& place, const char* what, std::int64_t least,
                                      std::int64_t most) const {
     const std::string cell = text(place);
@@ -86,7 +86,7 @@ class Row {
     const char* const end = cell.data() + cell.size();
     const auto [rest, error] = std::from_chars(cell.data(), end, value);
     const bool isWhole = error == std::errc() && (rest == end || isFraction(rest, end));
-    if (!isWhole || value < least || value > most) lines_.fail("'" + cell + "' is no " + what);
+    if (!isWhole || value < least || value > most) lines_.fail("'" + cell + "' is not a " + what);
     return value;
   }
 
@@ -114,7 +114,7 @@ Access readAccess(const Row& row, const Layout& layout, const CsvColumns& column
   access.date = row.number(layout.time, "time in seconds", -mostSeconds, mostSeconds).value_or(0);
   if (layout.op) access.kind = kindOf(row.text(layout.op), columns);
   const auto second = row.number(layout.chunkSecond, "second of a video", -mostInt, mostInt);
-  const auto type = row.number(layout.itemType, "item type", 0, mostInt);
+  const auto type = row.number(layout.itemType, "valid item type", 0, mostInt);
   if (second || type) {
     access.chunkSecond = static_cast<std::int32_t>(second.value_or(0));
     access.itemType = static_cast<std::int32_t>(type.value_or(0));

@@ -9,7 +9,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 class LineReader;
 class Trace;
 
-// Which columns of a table mean what. Those without a name are not there.
+// The meaning of the columns of a table. Columns without a name are absent.
 struct CsvColumns {
   std::string key;
   std::string size;         // bytes; an empty cell is a size that is not known
@@ -17,13 +17,13 @@ struct CsvColumns {
   std::string op;           // what is done; every operation that neither list below names is a fetch
   std::string chunkSecond;  // of a video download
   std::string itemType;
-  std::vector<std::string> stores;   // operations that store, "2a" say
+  std::vector<std::string> stores;   // operations that store, for example "2a"
   std::vector<std::string> removes;  // operations that remove
 };
 
-// Appends the accesses in the table, whose first line names its columns, to the trace. Cells are parted by commas and
-// may stand in double quotes. Throws `InputError`, naming file and line, for a column that is not there and a cell that
-// is no number. `onLine` is called after each line.
+// Appends the accesses in the table, whose first line names its columns, to the trace. Cells are separated by commas
+// and may be in double quotes. Throws `InputError`, naming file and line, for a missing column and a cell that is not a
+// number. `onLine` is called after each line.
 void readCsv(LineReader& lines, const CsvColumns& columns, Trace& trace, const std::function<void()>& onLine);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

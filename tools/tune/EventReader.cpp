@@ -36,7 +36,7 @@ std::optional<std::string> text(const Json& object, const char* name) {
   return member->get<std::string>();
 }
 
-// Empty when the event is no access, or not one that a store reports.
+// Empty if the event is not an access, or not one that a store reports.
 std::optional<AccessEvent> readAccess(const Json& event) {
   if (text(event, "event") != kAccessEvent) return std::nullopt;
   const auto payload = event.find("payload");
@@ -49,7 +49,7 @@ std::optional<AccessEvent> readAccess(const Json& event) {
   return AccessEvent{*store, *key, *hit == kFound, *size, integer(event, "time").value_or(0)};
 }
 
-// A miss carries no size, and neither does a use that is not a fetch, which is reported as a hit of 0 bytes.
+// A miss has no size, and neither has a use that is not a fetch, which is reported as a hit of 0 bytes.
 void append(const AccessEvent& event, Trace& trace) {
   Access access;
   access.date = event.date;

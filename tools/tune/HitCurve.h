@@ -8,8 +8,8 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 // How many requests are found, and how many bytes, at every size limit.
 //
-// Kept for the limits of at most eleven binary digits, "50MB" and "700KB" say, of any magnitude: neighbours are less
-// than 0.1 % apart, and at each of them the figures are exact. Memory does not grow with the number of requests.
+// Kept for the limits of at most eleven binary digits, for example "50MB" and "700KB", of any magnitude: neighbours are
+// less than 0.1 % apart, and at each of them the figures are exact. Memory does not grow with the number of requests.
 class HitCurve {
  public:
   struct Point {
@@ -18,7 +18,7 @@ class HitCurve {
     std::uint64_t hitBytes = 0;
   };
 
-  // The figures at `exactLimit` are exact whatever its digits.
+  // The figures at `exactLimit` are exact in any case.
   explicit HitCurve(std::int64_t exactLimit = 0);
 
   // A request of an item of that size, which is found at `leastLimit` and above.

@@ -29,7 +29,7 @@ void StackDistances::remove(std::uint32_t key) {
   (void)takeOut(items_[key]);
 }
 
-// The items below lose its bytes, and its leaf is read on the way down.
+// Subtracts its bytes from the items below, and reads its leaf on the way down.
 std::int64_t StackDistances::takeOut(Item& item) {
   const Node bytes{-item.size, 0};
   std::size_t node = 1;
@@ -47,7 +47,7 @@ std::int64_t StackDistances::takeOut(Item& item) {
   return tree_[node].greatest;
 }
 
-// All items get its bytes above them, and its own leaf begins anew.
+// Adds its bytes to all items, and resets its own leaf.
 void StackDistances::putOnTop(std::uint32_t key, Item& item) {
   add(tree_[1], {item.size, item.size});
   std::size_t node = 1;
@@ -63,7 +63,7 @@ void StackDistances::putOnTop(std::uint32_t key, Item& item) {
   peak_ = std::max(peak_, total_);
 }
 
-// Each use takes a new slot. When all are taken, the items that are there move together.
+// Each use takes a new slot. When all are used, the items are moved to the first ones.
 void StackDistances::makeRoom() {
   const std::size_t slots = keys_.size();
   for (std::size_t node = 1; node < slots; ++node) pushDown(node);

@@ -7,13 +7,13 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// A cache that gives up what was used least recently, at every size limit at once.
+// A cache that evicts the least recently used items, at every size limit at once.
 //
-// The cache of limit L takes in each item that is used, and then gives up items, least recently used first, until at
-// most L bytes are left. Imagine a stack of all items, the latest used on top. An item is still in that cache exactly
+// The cache of limit L adds each item that is used, and then evicts items, least recently used first, until at most L
+// bytes are left. Imagine a stack of all items, the last used one on top. An item is still in that cache exactly
 // when, after each use since its own, the items from the top down to it, itself included, had no more than L bytes: the
 // greatest of these sums is the least limit that keeps it. Sizes may change with each use. A sum can shrink again, when
-// an item above becomes smaller, but what was given up for it has gone.
+// an item above becomes smaller, but what was evicted for it remains evicted.
 //
 // A tree over the items in the order of their last use keeps each one's sum and the greatest that it has been. A use
 // takes time logarithmic in the number of items; memory is linear in it. One thread.
@@ -25,10 +25,10 @@ class StackDistances {
   // limit has kept: a new one, or one that was removed.
   std::optional<std::int64_t> use(std::uint32_t key, std::int64_t size);
 
-  // The item goes. Not an error: one that is not there.
+  // Removes the item. Not an error: one that is not there.
   void remove(std::uint32_t key);
 
-  // The least limit at which nothing has been given up so far.
+  // The least limit at which nothing has been evicted so far.
   std::int64_t peak() const { return peak_; }
 
  private:

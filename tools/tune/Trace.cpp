@@ -11,7 +11,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-// So that no sum of sizes leaves 64 bits.
+// So that no sum of sizes exceeds 64 bits.
 constexpr std::int64_t kMostBytes = std::int64_t{1} << 60;
 
 [[noreturn]] void fail(const char* what, int code) {
@@ -21,7 +21,7 @@ constexpr std::int64_t kMostBytes = std::int64_t{1} << 60;
 }  // namespace
 
 Trace::Trace() : file_(std::tmpfile()) {
-  if (file_ == nullptr) fail("cannot make a temporary file for the accesses", errno);
+  if (file_ == nullptr) fail("cannot create a temporary file for the accesses", errno);
 }
 
 Trace::~Trace() = default;

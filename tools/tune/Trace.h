@@ -12,8 +12,8 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// The accesses to one cache, in order. They are kept in a temporary file, which has no name and goes with the trace, so
-// that memory is needed for the keys only.
+// The accesses to one cache, in order. They are kept in a temporary file, which has no name and is removed with the
+// trace, so that memory is needed for the keys only.
 class Trace {
  public:
   Trace();
@@ -24,14 +24,14 @@ class Trace {
   // Appends an access; its `key` is filled in here. Throws `InputError` when there is no room for it.
   void append(const std::string& key, Access access);
 
-  // For a key whose accesses say that it was found, without a size: if none of them ever tells one, it is 0.
+  // For a key that was found without a size: if none of its accesses has a size, it is 0.
   void mayBeEmpty(const std::string& key);
 
-  // Bytes of an item whose size no access tells; without it, the mean of all others.
+  // Bytes of an item of which no access has a size; without it, the mean of all others.
   void assumeSize(std::int64_t bytes) { assumedSize_ = bytes; }
 
-  // Calls `visit` with each access, every size filled in: where an access does not tell it, as the last access of the
-  // key before it does, or else the first one after it. Throws `InputError` when the file cannot be read again.
+  // Calls `visit` with each access, every size filled in: if it is not known, from the last access of the key before
+  // it, or else from the first one after it. Throws `InputError` when the file cannot be read again.
   void replay(const std::function<void(const Access&)>& visit) const;
 
   std::uint64_t accesses() const { return accesses_; }
@@ -51,7 +51,7 @@ class Trace {
 
   std::unique_ptr<std::FILE, CloseFile> file_;
   std::unordered_map<std::string, std::uint32_t> numbers_;
-  std::vector<std::int64_t> firstSizes_;  // by key; the first that is told
+  std::vector<std::int64_t> firstSizes_;  // by key; the first known one
   std::vector<bool> mayBeEmpty_;          // by key
   std::uint64_t accesses_ = 0;
   std::int64_t bytes_ = 0;

@@ -15,7 +15,7 @@
 #include "TextFile.h"
 #include "check/ConfigurationDocument.h"
 #include "check/Faults.h"
-#include "check/Understood.h"
+#include "check/ResolvedConfiguration.h"
 #include "tune/CsvReader.h"
 #include "tune/EventReader.h"
 #include "tune/LineReader.h"
@@ -47,10 +47,10 @@ struct TuneOptions {
   int earlySeconds = 0;
 };
 
-// The store of that identifier or, since events carry names, of that name.
-std::shared_ptr<const StoreDefinition> findStore(const Understood& understood, const std::string& store) {
-  for (const UnderstoodManager& manager : understood) {
-    for (const UnderstoodStore& candidate : manager.stores) {
+// The store of that identifier or, because events contain names, of that name.
+std::shared_ptr<const StoreDefinition> findStore(const ResolvedConfiguration& resolved, const std::string& store) {
+  for (const ResolvedManager& manager : resolved) {
+    for (const ResolvedStore& candidate : manager.stores) {
       if (candidate.identifier == store || candidate.definition->name == store) return candidate.definition;
     }
   }
@@ -59,12 +59,12 @@ std::shared_ptr<const StoreDefinition> findStore(const Understood& understood, c
 
 std::int64_t configuredLimit(const std::string& file, const std::string& name) {
   const ConfigurationDocument document = readConfigurationDocument(file);
-  const Remarks faults = findFaults(document);
+  const Diagnostics faults = findFaults(document);
   if (!faults.empty()) throw InputError(file + ": " + faults.front().pointer + ": " + faults.front().text);
-  const auto store = findStore(understand(document, {}), name);
+  const auto store = findStore(resolve(document, {}), name);
   if (store == nullptr) throw InputError(file + ": there is no store '" + name + "'");
   if (store->type != StoreDefinition::Type::DiskCache) {
-    throw InputError(file + ": store '" + name + "' is no disk cache and has no size limit");
+    throw InputError(file + ": store '" + name + "' is not a disk cache and has no size limit");
   }
   if (store->maxSize == 0) throw InputError(file + ": the limit of store '" + name + "' is 0");
   return store->maxSize;
@@ -78,7 +78,7 @@ std::string listOf(const EventCounts& counts) {
   return list;
 }
 
-// Fills in what the events tell beside the accesses themselves.
+// Fills in the other figures of the events.
 void readReportedEvents(const TuneOptions& options, LineReader& lines, Trace& trace, TuneReport& report,
                         const std::function<void()>& onLine) {
   const EventCounts counts = readEvents(lines, options.store, trace, onLine);
@@ -114,7 +114,7 @@ void readTrace(const TuneOptions& options, Console& console, Trace& trace, TuneR
 }
 
 Tuning tuneTrace(const TuneOptions& options, const Trace& trace, std::int64_t present, Console& console) {
-  Progress progress(console, "playing the accesses");
+  Progress progress(console, "simulating the accesses");
   std::uint64_t done = 0;
   const std::uint64_t rounds = trace.hasMetadata() ? 2 : 1;
   return tune(trace, present, options.worth / kPercent, [&] { progress.advanceTo(++done, rounds * trace.accesses()); });
@@ -122,7 +122,7 @@ Tuning tuneTrace(const TuneOptions& options, const Trace& trace, std::int64_t pr
 
 void runTune(const TuneOptions& options) {
   if (!options.configuration.empty() && options.store.empty()) {
-    throw InputError("--config needs --store, to know whose limit to take");
+    throw InputError("--config needs --store, to know which limit to read");
   }
   const std::int64_t present =
       options.configuration.empty() ? options.limit : configuredLimit(options.configuration, options.store);
@@ -147,7 +147,7 @@ void runTune(const TuneOptions& options) {
 
 void addCsvOptions(CLI::App& tune, TuneOptions& options) {
   CLI::Option* const csv =
-      tune.add_flag("--csv", options.csv, "EVENTS is a table with a line of titles, parted by commas");
+      tune.add_flag("--csv", options.csv, "EVENTS is a table with a line of titles, separated by commas");
   const auto column = [&](const char* name, std::string& target, const char* help) {
     return tune.add_option(name, target, help)->type_name("COLUMN")->needs(csv);
   };
@@ -188,7 +188,7 @@ void addTuneCommand(CLI::App& app, int& status) {
   tune->add_option("EVENTS", options->events, "What the host kit's sink has written, JSON lines; - for standard input")
       ->required()
       ->type_name("FILE");
-  tune->add_option("--store", options->store, "The store's name; not needed when the events are of one store only")
+  tune->add_option("--store", options->store, "The store's name; not needed if all events are of one store")
       ->type_name("NAME");
   CLI::Option* const limit = tune->add_option("--limit", options->limit, "The present limit: 52428800, 50MB")
                                  ->transform(CLI::AsSizeValue(false).description(""))
@@ -212,9 +212,8 @@ void addTuneCommand(CLI::App& app, int& status) {
   addCsvOptions(*tune, *options);
   addVideoOptions(*tune, *options);
   tune->footer(
-      "For every size limit: how many requests a cache would have found that gives up what was used least\n"
-      "recently, as soon as it is over its limit. docs/tuning.md says what the figures mean and what they leave "
-      "out.\n\n"
+      "Computes for every size limit how many requests a cache would have found that evicts the least recently\n"
+      "used items as soon as it is over its limit. docs/tuning.md explains the figures and their limits.\n\n"
       "Examples:\n"
       "  cellar tune analytics.jsonl --store thumbs --config storage.json --svg thumbs.svg\n"
       "  zcat trace.csv.gz | cellar tune - --csv --key lbn --size size --op op --store-op 2a");

@@ -6,7 +6,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// The report as one page that needs nothing else: the curve, what it advises and the table.
+// The report as one page that needs no other files: the curve, the advice and the table.
 std::string tuningAsPage(const TuneReport& report);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -6,7 +6,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// The hit rate over the limit as an SVG image that needs nothing else, light or dark as the reader's screen is.
+// The hit rate over the limit as an SVG image that needs no other files; light or dark like the reader's screen.
 std::string tuningAsSvg(const TuneReport& report);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

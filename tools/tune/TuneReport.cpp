@@ -63,15 +63,15 @@ std::vector<std::string> notesOn(const TuneReport& report) {
     notes.push_back("the running cache reported " + percent(share(*report.reportedHits, tuning.requests)) + " hits");
     if (report.reportedFirstHits > 0) {
       notes.push_back(formatCount(report.reportedFirstHits) +
-                      " of these were the first request of a key that was stored unseen; they count as misses below");
+                      " of these were the first request of a key that was stored before; they count as misses below");
     }
   }
   if (tuning.keysOfUnknownSize > 0) {
     notes.push_back(formatCount(tuning.keysOfUnknownSize, "key was", "keys were") +
-                    " never found, so that nothing tells a size: taken to have " + bytes(tuning.assumedSize) + " each");
+                    " never found and have no known size: assumed to have " + bytes(tuning.assumedSize) + " each");
   }
   if (report.damagedLines > 0) {
-    notes.push_back(formatCount(report.damagedLines, "line is", "lines are") + " no JSON and not counted");
+    notes.push_back(formatCount(report.damagedLines, "line is", "lines are") + " not JSON and not counted");
   }
   return notes;
 }
@@ -79,7 +79,7 @@ std::vector<std::string> notesOn(const TuneReport& report) {
 // With the rule that it follows from.
 std::string adviceOf(const Tuning& tuning) {
   const TunedLimit* const enough = enoughLimit(tuning);
-  if (enough == nullptr) return "No limit would have found anything: no item is asked for twice.";
+  if (enough == nullptr) return "No limit would have found anything: no item is requested twice.";
   const bool fits = enough->lru.limit <= std::numeric_limits<std::uint32_t>::max();
   return wholeBytes(enough->lru.limit) + " is enough: from there on, doubling the limit always turns less than " +
          percent(tuning.worth) + " of the requests into hits." +

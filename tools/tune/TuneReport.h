@@ -16,8 +16,8 @@ class Console;
 struct TuneReport {
   std::string source;                         // what was read
   std::string store;                          // may be empty
-  std::optional<std::uint64_t> reportedHits;  // by the running cache, where the source tells
-  std::uint64_t reportedFirstHits = 0;        // the first access to their key: of what was stored unseen
+  std::optional<std::uint64_t> reportedHits;  // by the running cache, if the source has it
+  std::uint64_t reportedFirstHits = 0;        // the first access to their key: items that were stored before
   std::uint64_t damagedLines = 0;
   Tuning tuning;
 };

@@ -67,26 +67,26 @@ std::vector<HitCurve::Point> pointsToPlot(const HitCurve& curve, std::int64_t fi
   return points;
 }
 
-struct Played {
+struct Simulated {
   HitCurve curve;
   std::int64_t everything = 0;
 };
 
-Played playLeastRecentlyUsed(const Trace& trace, std::int64_t present, const std::function<void()>& onAccess) {
-  Played played{HitCurve(present)};
+Simulated simulateLeastRecentlyUsed(const Trace& trace, std::int64_t present, const std::function<void()>& onAccess) {
+  Simulated simulated{HitCurve(present)};
   StackDistances distances;
   trace.replay([&](const Access& access) {
     if (access.kind == AccessKind::Remove) {
       distances.remove(access.key);
     } else {
       const auto least = distances.use(access.key, access.size);
-      if (access.kind == AccessKind::Fetch && least) played.curve.addHit(*least, access.size);
-      if (access.kind == AccessKind::Fetch && !least) played.curve.addMiss(access.size);
+      if (access.kind == AccessKind::Fetch && least) simulated.curve.addHit(*least, access.size);
+      if (access.kind == AccessKind::Fetch && !least) simulated.curve.addMiss(access.size);
     }
     onAccess();
   });
-  played.everything = distances.peak();
-  return played;
+  simulated.everything = distances.peak();
+  return simulated;
 }
 
 void playVideoStrategy(const Trace& trace, std::vector<TunedLimit>& limits, const std::function<void()>& onAccess) {
@@ -111,8 +111,8 @@ const TunedLimit* first(const Tuning& tuning, bool TunedLimit::*mark) {
 }  // namespace
 
 Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::function<void()>& onAccess) {
-  const Played played = playLeastRecentlyUsed(trace, present, onAccess);
-  const HitCurve& curve = played.curve;
+  const Simulated simulated = simulateLeastRecentlyUsed(trace, present, onAccess);
+  const HitCurve& curve = simulated.curve;
   const std::int64_t enough = roundedUp(curve.enough(worth).limit);
   Tuning tuning;
   tuning.requests = curve.requests();
@@ -121,13 +121,13 @@ Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::f
   tuning.keysOfUnknownSize = trace.keysOfUnknownSize();
   tuning.assumedSize = trace.assumedSize();
   tuning.seconds = trace.seconds();
-  tuning.everything = played.everything;
+  tuning.everything = simulated.everything;
   tuning.worth = worth;
-  for (const std::int64_t limit : limitsToList(curve, played.everything, present, enough)) {
+  for (const std::int64_t limit : limitsToList(curve, simulated.everything, present, enough)) {
     tuning.limits.push_back({curve.at(limit), std::nullopt, limit == present, limit == enough});
   }
   if (trace.hasMetadata()) playVideoStrategy(trace, tuning.limits, onAccess);
-  const std::int64_t last = powerOfTwoFrom(played.everything);
+  const std::int64_t last = powerOfTwoFrom(simulated.everything);
   tuning.curve = pointsToPlot(curve, firstLimit(curve, last), last);
   return tuning;
 }

@@ -9,9 +9,9 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Caches of several limits that give items up in the order of the library's video-download strategy. That order has no
-// stack that would do for all limits at once: an item may be given up while less recently used ones of high priority
-// stay. So each limit is played by itself. One thread.
+// Caches of several limits that evict items in the order of the library's video-download strategy. That order cannot be
+// computed for all limits at once: an item may be evicted while less recently used ones of high priority remain. So
+// each limit is simulated separately. One thread.
 class VideoCaches {
  public:
   explicit VideoCaches(const std::vector<std::int64_t>& limits);
@@ -25,7 +25,7 @@ class VideoCaches {
   std::vector<Result> results() const;
 
  private:
-  // The date that the strategy compares, then, for items of one date, the order of their uses.
+  // The date that the strategy compares; for items of one date, the order of their uses.
   using Rank = std::tuple<std::int32_t, std::uint64_t, std::uint32_t>;
 
   struct Item {

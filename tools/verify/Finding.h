@@ -6,7 +6,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// One thing that is not as a store leaves it.
+// One inconsistency in a store.
 struct Finding {
   enum class Kind {
     RecordWithoutFile,

@@ -4,14 +4,14 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Where repairs put what they take out of stores: a directory beside the managers' directories, in which everything
+// Where repairs move what they remove from stores: a directory beside the managers' directories, in which everything
 // keeps its place. Nothing in it is ever replaced.
 class Quarantine {
  public:
-  // `base`: the directory that holds the managers', or a store's that stands by itself.
+  // `base`: the directory of the managers' directories, or that of a store that is verified alone.
   explicit Quarantine(std::string base);
 
-  // Moves a file or directory that lies somewhere below the base; where it is now. Throws
+  // Moves a file or directory below the base; returns its new path. Throws
   // `std::filesystem::filesystem_error`.
   std::string take(const std::string& path) const;
 

@@ -15,7 +15,7 @@ Repair::Repair(std::string root, Quarantine quarantine) : root_(std::move(root))
 
 Repair::~Repair() = default;
 
-std::string Repair::mend(const Finding& finding) {
+std::string Repair::fix(const Finding& finding) {
   switch (finding.kind) {
     case Finding::Kind::RecordWithoutFile:
     case Finding::Kind::InlineValueMissing:
@@ -56,7 +56,7 @@ std::string Repair::quarantineFile(const Finding& finding) {
   return "moved to " + printable(relativeTo(root_, now));
 }
 
-// Nobody can tell any more which values its files are: they stay together with it.
+// It is no longer known which values its files contain: they are kept together with it.
 std::string Repair::quarantineStore(const Finding& finding) {
   std::string manifest;
   std::uint64_t others = 0;

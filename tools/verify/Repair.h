@@ -23,7 +23,7 @@ class Repair {
   Repair& operator=(const Repair&) = delete;
 
   // Mends it; what was done. Throws what went wrong: the finding then remains.
-  std::string mend(const Finding& finding);
+  std::string fix(const Finding& finding);
 
  private:
   SQLiteManifestPersistence& manifestOf(const Finding& finding);

@@ -17,7 +17,7 @@ namespace fs = std::filesystem;
 
 namespace {
 
-// Links are followed, as a store does when it reads a value. A file of the store's own is no value.
+// Links are followed, as a store does when it reads a value. The store's own files are not values.
 std::optional<std::uint64_t> sizeOfValue(const std::string& directory, const std::string& below) {
   if (isManifestFile(below)) return std::nullopt;
   const fs::path path = fs::path(directory) / below;

@@ -15,7 +15,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-// Beside the managers' directories, or beside a store's that stands by itself.
+// Beside the managers' directories, or beside the directory of a store that is verified alone.
 Quarantine quarantineFor(const Layout& layout, const ManagerPlace& manager) {
   const bool standsByItself = layout.kind == Layout::Kind::Store && manager.name.empty();
   return Quarantine(standsByItself ? manager.path : std::filesystem::path(manager.path).parent_path().string());
@@ -48,14 +48,14 @@ class Verifier {
     for (const Finding& finding : findings) {
       ++result_.findings;
       std::string line = printable(relativeTo(layout_.root, finding.directory)) + ": " + describe(finding);
-      if (repair_) line += "; " + mend(repair, finding);
+      if (repair_) line += "; " + fix(repair, finding);
       onLine_(line);
     }
   }
 
-  std::string mend(Repair& repair, const Finding& finding) {
+  std::string fix(Repair& repair, const Finding& finding) {
     try {
-      std::string done = repair.mend(finding);
+      std::string done = repair.fix(finding);
       ++result_.repaired;
       return done;
     } catch (const std::exception& error) {

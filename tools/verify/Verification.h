@@ -18,7 +18,7 @@ struct VerificationResult {
 
 using OnLine = std::function<void(const std::string& line)>;  // one finding, with what was done about it
 
-// Checks every store in the layout, and mends what it finds when `repair` says so. Throws `InputError` for what cannot
+// Checks every store in the layout, and repairs what it finds if `repair` is set. Throws `InputError` for what cannot
 // be read.
 VerificationResult verify(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine);
 

@@ -54,19 +54,19 @@ int runVerify(const VerifyOptions& options) {
 
 void addVerifyCommand(CLI::App& app, int& status) {
   const auto options = std::make_shared<VerifyOptions>();
-  CLI::App* const verify = app.add_subcommand("verify", "Hold the records of stores against their files, and repair");
+  CLI::App* const verify = app.add_subcommand("verify", "Compare the records of stores with their files, and repair");
   verify->add_option("ROOT", options->root, "The directory: a root with its areas, an area, a manager or a store")
       ->required();
-  verify->add_flag("--repair", options->repair, "Mend what is found, without losing a value");
+  verify->add_flag("--repair", options->repair, "Repair what is found, without losing a value");
   verify->footer(
-      "Each finding is one line: records without a file, files without a record, sizes that differ, what a write that\n"
-      "was interrupted left, damaged manifests, attributes that are not JSON. Without --repair nothing is changed.\n\n"
+      "Each finding is one line: records without a file, files without a record, sizes that differ, traces of "
+      "interrupted\n"
+      "writes, damaged manifests, attributes that are not JSON. Without --repair nothing is changed.\n\n"
       "--repair gives a record the size of its file, and removes a record without a value. A file without a record\n"
-      "goes to \"_cellar_quarantine\" beside the managers' directories, and so does a damaged manifest, with the "
-      "files\n"
-      "that nobody can tell apart any more: the store begins anew. Nothing is deleted but records.\n"
-      "Stop the application first: a store that is running is not to be repaired, and what it is just writing looks\n"
-      "like a finding.\n\n"
+      "is moved to \"_cellar_quarantine\" beside the managers' directories, and so is a damaged manifest with all\n"
+      "files of its store, which then starts empty. Only records are deleted.\n"
+      "Stop the application first: a running store must not be repaired, and a write in progress looks like a\n"
+      "finding.\n\n"
       "Exit status: 0 when nothing was found or everything is repaired, 1 when something remains, 2 for usage and\n"
       "input errors.\n\n"
       "Example:\n  cellar verify /tmp/cellar-demo --repair");

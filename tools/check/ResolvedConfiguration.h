@@ -13,7 +13,7 @@ struct StoreManagerDefinition;
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// What directories are named after. The defaults are those of the host kit.
+// The parts of directory names that are not in the configuration. The defaults are those of the host kit.
 struct NameTags {
   std::string versionTag;
   std::string localeFirstTag;
@@ -21,25 +21,25 @@ struct NameTags {
   std::string sessionKey;
 };
 
-// A configuration as the library has understood it, with every default filled in, in the order of the document.
-struct UnderstoodStore {
+// A configuration as the library reads it, with every default filled in, in the order of the document.
+struct ResolvedStore {
   std::string identifier;
   std::string pointer;  // JSON pointer into the document
   std::shared_ptr<const StoreDefinition> definition;
   std::string directory;  // its name within the manager's directory
 };
 
-struct UnderstoodManager {
+struct ResolvedManager {
   std::string pointer;
   std::shared_ptr<const StoreManagerDefinition> definition;
-  std::string directory;  // with the area's: "caches/_store_alice"
-  std::vector<UnderstoodStore> stores;
+  std::string directory;  // with the area: "caches/_store_alice"
+  std::vector<ResolvedStore> stores;
 };
 
-using Understood = std::vector<UnderstoodManager>;
+using ResolvedConfiguration = std::vector<ResolvedManager>;
 
-// The document must be one that the library takes.
-Understood understand(const ConfigurationDocument& document, const NameTags& tags);
+// The library must accept the document.
+ResolvedConfiguration resolve(const ConfigurationDocument& document, const NameTags& tags);
 
 // "caches", "disk_cache", "lru": as they are written in a configuration.
 std::string areaName(const StoreManagerDefinition& manager);
