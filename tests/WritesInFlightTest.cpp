@@ -422,9 +422,9 @@ struct Scenario {
 };
 
 // One way of running a script: each choice is who takes the next step, the caller or one of the queues.
-class Performance {
+class Interleaving {
  public:
-  Performance(const Scenario& scenario, ManualClock& clock) : scenario_(scenario), model_(scenario.before) {
+  Interleaving(const Scenario& scenario, ManualClock& clock) : scenario_(scenario), model_(scenario.before) {
     const auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_),
                                                               std::make_shared<test::ManualExecutor>(), nullptr);
     store_ = DiskCache::createDiskCache("store", "", "larder", scenario.capacity, 1000, 2, 2, false, queues_, nullptr,
@@ -662,8 +662,8 @@ class InEveryOrder : public KeyValueStoreFixture {
       std::string told = scenario.script + " after " + std::to_string(scenario.before.size()) + ", steps";
       std::vector<std::size_t> widths;
       {
-        Performance performance(scenario, clock);
-        for (auto choices = performance.choices(); !choices.empty(); choices = performance.choices()) {
+        Interleaving interleaving(scenario, clock);
+        for (auto choices = interleaving.choices(); !choices.empty(); choices = interleaving.choices()) {
           if (path.size() == widths.size()) path.push_back(0);
           const std::size_t choice = path[widths.size()];
           widths.push_back(choices.size());
@@ -671,7 +671,7 @@ class InEveryOrder : public KeyValueStoreFixture {
           choices[choice]();
         }
         SCOPED_TRACE(told);
-        performance.check();
+        interleaving.check();
       }
       ++orders;
       while (!path.empty() && path.back() + 1 == widths[path.size() - 1]) path.pop_back();

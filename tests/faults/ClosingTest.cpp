@@ -16,7 +16,7 @@
 #include "PersistentKeyValueStore.h"
 #include "StoreManager.h"
 #include "TrashCollector.h"
-#include "faults/Life.h"
+#include "faults/ScriptedWorkload.h"
 #include "host/Await.h"
 #include "host/Host.h"
 #include "host/ThreadQueueFactory.h"

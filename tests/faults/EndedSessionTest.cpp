@@ -12,7 +12,7 @@
 #include <utility>
 
 #include "PersistentKeyValueStore.h"
-#include "faults/Life.h"
+#include "faults/ScriptedWorkload.h"
 #include "host/Await.h"
 #include "host/Host.h"
 #include "host/testing/FaultyFileUtils.h"

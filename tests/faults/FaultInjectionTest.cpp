@@ -1,4 +1,4 @@
-// A scripted life of the system with one call after the other failing: each sweep runs it once for every n, and the
+// A scripted workload with one call after the other failing: each sweep runs it once for every n, and the
 // n-th call of its kind fails, until a run meets no fault.
 
 #include <gtest/gtest.h>
@@ -16,14 +16,14 @@
 #include <string>
 #include <utility>
 
-#include "faults/Life.h"
+#include "faults/ScriptedWorkload.h"
 #include "support/TemporaryDirectory.h"
 #include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 namespace {
 
-constexpr unsigned int kPatience = 60;  // seconds for one life
+constexpr unsigned int kPatience = 60;  // seconds for one run
 
 std::size_t openDescriptors() {
   const std::filesystem::directory_iterator descriptors("/proc/self/fd");
@@ -31,25 +31,25 @@ std::size_t openDescriptors() {
 }
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr std::size_t kStrides = 4;  // a life takes several times as long there
+constexpr std::size_t kStrides = 4;  // a run takes several times as long there
 #else
 constexpr std::size_t kStrides = 1;
 #endif
 
-// What is to fail in a life, and how often.
+// What fails in a run of the workload, and how often.
 struct Faults {
   std::string name;
-  std::function<void(Life& life, std::size_t n)> plan;
+  std::function<void(ScriptedWorkload& workload, std::size_t n)> plan;
   std::size_t stride = 1;  // how many n it goes on by, to be done in seconds; CELLAR_EVERY_FAULT=1 leaves none out
-  // Whether the n-th fault of that life must have been noticed by somebody; by nobody when absent.
-  std::function<bool(Life& life, std::size_t n)> isDueToBeTold;
-  Life::Hardship hardship = Life::Hardship::OneFault;
+  // Whether the n-th fault must have been reported; if absent, none must be.
+  std::function<bool(ScriptedWorkload& workload, std::size_t n)> mustBeReported;
+  ScriptedWorkload::FaultMode mode = ScriptedWorkload::FaultMode::OneFault;
 };
 
-// The lives that met a fault in one and the same statement or file operation.
+// The runs with a fault in the same statement or file operation.
 struct Place {
-  std::size_t lives = 0;
-  std::size_t livesWithDiscards = 0;  // that had a store discarded
+  std::size_t runs = 0;
+  std::size_t runsWithDiscards = 0;  // that had a store discarded
 };
 using Places = std::map<std::string, Place>;
 
@@ -58,41 +58,41 @@ bool isWrite(const std::string& place) { return place == "INSERT" || place == "U
 
 class FaultInjection : public testing::Test {
  protected:
-  // Lives one life after the other, with the n-th call failing in the n-th, until one meets no fault.
+  // Runs the workload again and again, with the n-th call failing in the n-th run, until a run has no fault.
   void sweep(const Faults& faults) {
     const std::size_t descriptors = openDescriptors();
     std::size_t met = 0;
-    std::size_t lives = 0;
+    std::size_t runs = 0;
     Places places;
     const std::size_t stride = std::getenv("CELLAR_EVERY_FAULT") != nullptr ? 1 : faults.stride * kStrides;
     for (std::size_t n = 1; !HasFailure(); n += stride) {
       const testing::ScopedTrace trace(__FILE__, __LINE__, faults.name + ", n = " + std::to_string(n));
       const std::size_t metNow = live(faults, n, places);
       met += metNow;
-      ++lives;
+      ++runs;
       if (metNow == 0) break;
     }
     EXPECT_GT(met, 0U);
     EXPECT_EQ(openDescriptors(), descriptors);
-    std::cout << faults.name << ": " << met << " faults in " << lives << " lives\n";
+    std::cout << faults.name << ": " << met << " faults in " << runs << " runs\n";
     RecordProperty("faults", std::to_string(met));
-    if (faults.hardship != Life::Hardship::ManyFaults) lookAt(places, faults.hardship);
+    if (faults.mode != ScriptedWorkload::FaultMode::ManyFaults) lookAt(places, faults.mode);
   }
 
   // Only where the manifest is written may one fault cost a store; or where SQLite was shown damage.
-  static void lookAt(const Places& places, Life::Hardship hardship) {
+  static void lookAt(const Places& places, ScriptedWorkload::FaultMode mode) {
     for (const auto& [name, place] : places) {
-      std::cout << "  in " << name << ": " << place.livesWithDiscards << " of " << place.lives
-                << " lives had a store discarded\n";
-      if (isWrite(name) || hardship == Life::Hardship::SilentLoss) continue;
-      EXPECT_EQ(place.livesWithDiscards, 0U) << name;
+      std::cout << "  in " << name << ": " << place.runsWithDiscards << " of " << place.runs
+                << " runs had a store discarded\n";
+      if (isWrite(name) || mode == ScriptedWorkload::FaultMode::SilentLoss) continue;
+      EXPECT_EQ(place.runsWithDiscards, 0U) << name;
     }
   }
 
-  // Where the one fault of a life was met: the name of the file operation, or the first word of the statement.
-  static std::string placeOf(const Life& life, std::size_t n) {
-    const bool isFile = life.files->failures() > 0;
-    const std::string text = isFile ? life.files->trace().at(n - 1) : life.vfs.statementOfLastFailure();
+  // Where the one fault of a run happened: the name of the file operation, or the first word of the statement.
+  static std::string placeOf(const ScriptedWorkload& workload, std::size_t n) {
+    const bool isFile = workload.files->failures() > 0;
+    const std::string text = isFile ? workload.files->trace().at(n - 1) : workload.vfs.statementOfLastFailure();
     return text.empty() ? "no statement" : text.substr(0, text.find(' '));
   }
 
@@ -100,19 +100,19 @@ class FaultInjection : public testing::Test {
   static std::size_t live(const Faults& faults, std::size_t n, Places& places) {
     const Watchdog watchdog(kPatience);
     const TemporaryDirectory directory(quickPlace());
-    Life life(directory.path(), faults.hardship);
-    faults.plan(life, n);
-    for (std::size_t step = 0; step < Life::stepCount() && !HasFailure(); ++step) life.step(step);
-    const std::size_t met = life.vfs.failures() + life.files->failures();
-    const bool mustTell = met > 0 && faults.isDueToBeTold && faults.isDueToBeTold(life, n);
-    EXPECT_TRUE(!mustTell || life.hasToldOfTrouble());
-    EXPECT_TRUE(met > 0 || !life.hasToldOfTrouble());
-    if (!HasFailure()) life.verify();
-    life.end();
+    ScriptedWorkload workload(directory.path(), faults.mode);
+    faults.plan(workload, n);
+    for (std::size_t step = 0; step < ScriptedWorkload::stepCount() && !HasFailure(); ++step) workload.step(step);
+    const std::size_t met = workload.vfs.failures() + workload.files->failures();
+    const bool isReportExpected = met > 0 && faults.mustBeReported && faults.mustBeReported(workload, n);
+    EXPECT_TRUE(!isReportExpected || workload.hasReportedTrouble());
+    EXPECT_TRUE(met > 0 || !workload.hasReportedTrouble());
+    if (!HasFailure()) workload.verify();
+    workload.end();
     if (met == 1) {
-      Place& place = places[placeOf(life, n)];
-      ++place.lives;
-      if (life.discards() > 0) ++place.livesWithDiscards;
+      Place& place = places[placeOf(workload, n)];
+      ++place.runs;
+      if (workload.discards() > 0) ++place.runsWithDiscards;
     }
     return met;
   }
@@ -121,13 +121,13 @@ class FaultInjection : public testing::Test {
     Faults faults;
     faults.name = name;
     faults.stride = stride;
-    faults.plan = [=](Life& life, std::size_t n) {
-      life.files->failNth(n, errnoCode);
-      life.files->tearFailingWrites(tears);
+    faults.plan = [=](ScriptedWorkload& workload, std::size_t n) {
+      workload.files->failNth(n, errnoCode);
+      workload.files->tearFailingWrites(tears);
     };
     // A query that fails answers false, or nothing, and work goes on from there.
-    faults.isDueToBeTold = [](Life& life, std::size_t n) {
-      const std::string call = life.files->trace().at(n - 1);
+    faults.mustBeReported = [](ScriptedWorkload& workload, std::size_t n) {
+      const std::string call = workload.files->trace().at(n - 1);
       const auto isCallOf = [&](const char* operation) { return call.rfind(operation, 0) == 0; };
       return !isCallOf("pathExists") && !isCallOf("is") && !isCallOf("listOtherEntries");
     };
@@ -137,7 +137,7 @@ class FaultInjection : public testing::Test {
 
 TEST_F(FaultInjection, TheLifeItselfMeetsNoTrouble) {
   Faults none;
-  none.plan = [](Life&, std::size_t) {};
+  none.plan = [](ScriptedWorkload&, std::size_t) {};
   Places places;
   EXPECT_EQ(live(none, 1, places), 0U);
 }
@@ -153,15 +153,15 @@ TEST_F(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
   Faults faults;
   faults.name = "a full disk from the n-th file operation on";
   faults.stride = 11;
-  faults.hardship = Life::Hardship::ManyFaults;
-  faults.plan = [](Life& life, std::size_t n) {
-    life.files->tearFailingWrites(true);
-    life.vfs.tearFailingWrites(true);
-    life.files->onCall = [&life, left = n](Operation, const std::string&) mutable {
+  faults.mode = ScriptedWorkload::FaultMode::ManyFaults;
+  faults.plan = [](ScriptedWorkload& workload, std::size_t n) {
+    workload.files->tearFailingWrites(true);
+    workload.vfs.tearFailingWrites(true);
+    workload.files->onCall = [&workload, left = n](Operation, const std::string&) mutable {
       if (left == 0 || --left > 0) return;
-      life.files->failAlways(Operation::WriteFile, ENOSPC);
-      life.files->failAlways(Operation::CreateDirectory, ENOSPC);
-      life.vfs.failFromNth(VfsCall::Write, 1, SQLITE_FULL);
+      workload.files->failAlways(Operation::WriteFile, ENOSPC);
+      workload.files->failAlways(Operation::CreateDirectory, ENOSPC);
+      workload.vfs.failFromNth(VfsCall::Write, 1, SQLITE_FULL);
     };
   };
   sweep(faults);
@@ -171,20 +171,20 @@ TEST_F(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
   Faults faults;
   faults.name = "a dead disk from the n-th file operation on";
   faults.stride = 11;
-  faults.hardship = Life::Hardship::ManyFaults;
-  faults.plan = [](Life& life, std::size_t n) {
-    life.files->onCall = [&life, left = n](Operation, const std::string&) mutable {
+  faults.mode = ScriptedWorkload::FaultMode::ManyFaults;
+  faults.plan = [](ScriptedWorkload& workload, std::size_t n) {
+    workload.files->onCall = [&workload, left = n](Operation, const std::string&) mutable {
       if (left == 0 || --left > 0) return;
       for (const Operation operation :
            {Operation::ReadFile, Operation::WriteFile, Operation::DeleteFile, Operation::RecursiverDirectoryDelete,
             Operation::Rename, Operation::CreateDirectory, Operation::GetDiskSpace, Operation::ListDirectories,
             Operation::ListDirectory}) {
-        life.files->failAlways(operation, EIO);
+        workload.files->failAlways(operation, EIO);
       }
       for (const auto& [call, code] :
            {std::pair(VfsCall::Read, SQLITE_IOERR_READ), std::pair(VfsCall::Write, SQLITE_IOERR_WRITE),
             std::pair(VfsCall::Sync, SQLITE_IOERR_FSYNC), std::pair(VfsCall::Open, SQLITE_CANTOPEN)}) {
-        life.vfs.failFromNth(call, 1, code);
+        workload.vfs.failFromNth(call, 1, code);
       }
     };
   };
@@ -193,7 +193,7 @@ TEST_F(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
 
 // No manifest can be opened from one step on, for one step or for several, as when descriptors or rights are missing.
 TEST_F(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
-  const std::size_t last = Life::stepCount() - 1;
+  const std::size_t last = ScriptedWorkload::stepCount() - 1;
   std::size_t met = 0;
   for (std::size_t first = 0; first <= last && !HasFailure(); ++first) {
     for (const std::size_t length : {std::size_t{1}, std::size_t{2}, std::size_t{3}}) {
@@ -201,15 +201,15 @@ TEST_F(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
                                        std::to_string(length) + " from step " + std::to_string(first));
       const Watchdog watchdog(kPatience);
       const TemporaryDirectory directory(quickPlace());
-      Life life(directory.path(), Life::Hardship::ManifestClosed);
+      ScriptedWorkload workload(directory.path(), ScriptedWorkload::FaultMode::ManifestClosed);
       for (std::size_t step = 0; step <= last && !HasFailure(); ++step) {
-        if (step == first) life.vfs.failFromNth(VfsCall::Open, 1, SQLITE_CANTOPEN);
-        life.step(step);
-        if (step + 1 == first + length) life.vfs.heal();
+        if (step == first) workload.vfs.failFromNth(VfsCall::Open, 1, SQLITE_CANTOPEN);
+        workload.step(step);
+        if (step + 1 == first + length) workload.vfs.heal();
       }
-      if (!HasFailure()) life.verify();
-      EXPECT_EQ(life.discards(), 0U);
-      met += life.vfs.failures();
+      if (!HasFailure()) workload.verify();
+      EXPECT_EQ(workload.discards(), 0U);
+      met += workload.vfs.failures();
     }
   }
   EXPECT_GT(met, 0U);
@@ -221,12 +221,12 @@ TEST_F(FaultInjection, AManifestThatCannotBeWrittenBesideATrashThatTakesNothing)
   Faults faults;
   faults.name = "no writing and no collecting from the n-th file operation on";
   faults.stride = 11;
-  faults.hardship = Life::Hardship::ManyFaults;
-  faults.plan = [](Life& life, std::size_t n) {
-    life.files->onCall = [&life, left = n](Operation, const std::string&) mutable {
+  faults.mode = ScriptedWorkload::FaultMode::ManyFaults;
+  faults.plan = [](ScriptedWorkload& workload, std::size_t n) {
+    workload.files->onCall = [&workload, left = n](Operation, const std::string&) mutable {
       if (left == 0 || --left > 0) return;
-      life.files->failAlways(Operation::Rename, EIO);
-      life.vfs.failFromNth(VfsCall::Write, 1, SQLITE_FULL);
+      workload.files->failAlways(Operation::Rename, EIO);
+      workload.vfs.failFromNth(VfsCall::Write, 1, SQLITE_FULL);
     };
   };
   sweep(faults);
@@ -249,10 +249,10 @@ TEST_P(DatabaseFaultInjection, ACallThatFailsOnce) {
   Faults faults;
   faults.name = fault.name;
   faults.stride = fault.stride;
-  if (fault.code == SQLITE_IOERR_SHORT_READ) faults.hardship = Life::Hardship::SilentLoss;
-  faults.plan = [&](Life& life, std::size_t n) {
-    life.vfs.failNth(fault.call, n, fault.code);
-    life.vfs.tearFailingWrites(fault.tears);
+  if (fault.code == SQLITE_IOERR_SHORT_READ) faults.mode = ScriptedWorkload::FaultMode::SilentLoss;
+  faults.plan = [&](ScriptedWorkload& workload, std::size_t n) {
+    workload.vfs.failNth(fault.call, n, fault.code);
+    workload.vfs.tearFailingWrites(fault.tears);
   };
   sweep(faults);
 }

@@ -1,4 +1,4 @@
-// The scripted life on a small disk of its own that something else fills to the last byte.
+// The scripted workload on a small disk of its own that something else fills to the last byte.
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -13,7 +13,7 @@
 #include <string>
 #include <vector>
 
-#include "faults/Life.h"
+#include "faults/ScriptedWorkload.h"
 #include "support/TemporaryDirectory.h"
 #include "support/Watchdog.h"
 
@@ -68,28 +68,28 @@ void liveOnAFullDisk(std::size_t first, std::size_t last) {
   const TemporaryDirectory directory;
   const SmallDisk disk(directory.path());
   if (!disk.whyNot().empty()) GTEST_SKIP() << "no disk can be mounted here: " << disk.whyNot();
-  Life life(directory.file("root"), Life::Hardship::ManyFaults);
-  for (std::size_t step = 0; step < Life::stepCount(); ++step) {
+  ScriptedWorkload workload(directory.file("root"), ScriptedWorkload::FaultMode::ManyFaults);
+  for (std::size_t step = 0; step < ScriptedWorkload::stepCount(); ++step) {
     const testing::ScopedTrace trace(__FILE__, __LINE__, "full from step " + std::to_string(first));
     if (step == first) disk.fill();
-    life.isInTrouble = step >= first && step <= last;
-    life.step(step);
+    workload.isInTrouble = step >= first && step <= last;
+    workload.step(step);
     if (step == last) disk.makeRoom();
   }
-  life.isInTrouble = false;
-  life.verify();
-  life.end();
+  workload.isInTrouble = false;
+  workload.verify();
+  workload.end();
 }
 
 TEST(FullDisk, FilledBeforeAnyStepCostsNothingThatIsNotDescribedOnceThereIsRoom) {
-  for (std::size_t step = 0; step < Life::stepCount() && !testing::Test::IsSkipped(); ++step) {
+  for (std::size_t step = 0; step < ScriptedWorkload::stepCount() && !testing::Test::IsSkipped(); ++step) {
     liveOnAFullDisk(step, step);
   }
 }
 
 TEST(FullDisk, FilledBeforeAnyStepUntilTheEndIsForgottenOnceThereIsRoom) {
-  for (std::size_t step = 0; step < Life::stepCount() && !testing::Test::IsSkipped(); ++step) {
-    liveOnAFullDisk(step, Life::stepCount() - 1);
+  for (std::size_t step = 0; step < ScriptedWorkload::stepCount() && !testing::Test::IsSkipped(); ++step) {
+    liveOnAFullDisk(step, ScriptedWorkload::stepCount() - 1);
   }
 }
 

@@ -1,4 +1,4 @@
-// The scripted life in a process that has no descriptor left for a while.
+// The scripted workload in a process that has no descriptor left for a while.
 
 #include <gtest/gtest.h>
 #include <sys/resource.h>
@@ -6,14 +6,14 @@
 #include <cstddef>
 #include <string>
 
-#include "faults/Life.h"
+#include "faults/ScriptedWorkload.h"
 #include "support/TemporaryDirectory.h"
 #include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 namespace {
 
-// While it lives, this process can open nothing. What is open stays open.
+// While it runs, this process can open nothing. What is open stays open.
 class NoDescriptors {
  public:
   NoDescriptors() {
@@ -39,23 +39,23 @@ constexpr bool kCanGoWithoutDescriptors = true;
 // None before each step in turn, for as many steps.
 void liveWithoutDescriptors(std::size_t length) {
   if (!kCanGoWithoutDescriptors) GTEST_SKIP();
-  for (std::size_t first = 0; first < Life::stepCount() && !testing::Test::HasFailure(); ++first) {
+  for (std::size_t first = 0; first < ScriptedWorkload::stepCount() && !testing::Test::HasFailure(); ++first) {
     const testing::ScopedTrace trace(__FILE__, __LINE__, "none from step " + std::to_string(first));
     const Watchdog watchdog(60);
     const TemporaryDirectory directory(quickPlace());
-    Life life(directory.path(), Life::Hardship::OneFault);
-    for (std::size_t step = 0; step < Life::stepCount() && !testing::Test::HasFailure(); ++step) {
-      life.isInTrouble = step >= first && step < first + length;
-      if (life.isInTrouble) {
+    ScriptedWorkload workload(directory.path(), ScriptedWorkload::FaultMode::OneFault);
+    for (std::size_t step = 0; step < ScriptedWorkload::stepCount() && !testing::Test::HasFailure(); ++step) {
+      workload.isInTrouble = step >= first && step < first + length;
+      if (workload.isInTrouble) {
         const NoDescriptors none;
-        life.step(step);
+        workload.step(step);
       } else {
-        life.step(step);
+        workload.step(step);
       }
     }
-    life.isInTrouble = false;
-    if (!testing::Test::HasFailure()) life.verify();
-    EXPECT_EQ(life.discards(), 0U);
+    workload.isInTrouble = false;
+    if (!testing::Test::HasFailure()) workload.verify();
+    EXPECT_EQ(workload.discards(), 0U);
   }
 }
 
@@ -63,7 +63,7 @@ TEST(OutOfDescriptors, ForAnyStepCostsNoStore) { liveWithoutDescriptors(1); }
 
 TEST(OutOfDescriptors, ForAnyThreeStepsCostsNoStore) { liveWithoutDescriptors(3); }
 
-TEST(OutOfDescriptors, FromAnyStepToTheEndCostsNoStore) { liveWithoutDescriptors(Life::stepCount()); }
+TEST(OutOfDescriptors, FromAnyStepToTheEndCostsNoStore) { liveWithoutDescriptors(ScriptedWorkload::stepCount()); }
 
 }  // namespace
 }  // namespace velmora::mobile::xplat::cellar::test

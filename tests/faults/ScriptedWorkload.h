@@ -17,50 +17,50 @@
 
 namespace velmora::mobile::xplat::cellar::test {
 
-// What may be found under a key, by what was asked for and what was answered.
+// What a fetch of a key may return, by the operations so far and their results.
 struct Remembered {
   std::set<std::string> values;       // any of these, whole
-  std::set<std::string> everWritten;  // what it ever held or was to hold
+  std::set<std::string> everWritten;  // every value that was stored or attempted
   bool mayBeMissing = true;
-  bool mayFail = false;  // a record whose file could not be written, and which could not be taken back
+  bool mayFail = false;  // a record whose file could not be written, and that could not be rolled back
   bool mayBeTorn = false;
 };
 
-// Where thousands of lives can be lived: in memory, where the machine has a place for that.
+// A directory for thousands of runs: in memory, if the machine has such a place.
 std::string quickPlace();
 
-// A scripted life of an application's storage, from its configuration to its end and back, on queues that run when the
-// script says so. It remembers what it was promised, and holds the stores to it: each step, each fetch in it and
-// `verify` are test assertions. Files and databases may be made to fail meanwhile.
-class Life {
+// A scripted workload on an application's storage, from its configuration to its end and a restart, on queues that run
+// when the script says so. It records what was acknowledged, and checks that the stores keep it: each step, each fetch
+// in it and `verify` are test assertions. Files and databases can be made to fail meanwhile.
+class ScriptedWorkload {
  public:
-  enum class Hardship {
+  enum class FaultMode {
     OneFault,
-    ManyFaults,      // so that what a failure has left cannot always be taken away
+    ManyFaults,      // so that what a failure has left cannot always be removed
     ManifestClosed,  // it cannot be opened for a while: a write that fails has changed nothing
     SilentLoss,      // the database is cut short under SQLite: values may vanish without a word, but none may be wrong
   };
 
   // Under `root`.
-  Life(const std::string& root, Hardship hardship);
-  Life(const Life&) = delete;
-  Life& operator=(const Life&) = delete;
-  ~Life();
+  ScriptedWorkload(const std::string& root, FaultMode mode);
+  ScriptedWorkload(const ScriptedWorkload&) = delete;
+  ScriptedWorkload& operator=(const ScriptedWorkload&) = delete;
+  ~ScriptedWorkload();
 
   static std::size_t stepCount();
 
   // Runs one step of the script; they come in order.
   void step(std::size_t number);
 
-  // The faults are over: everything that is remembered is there, in this run of the process if it can be asked, and
+  // Call it when the faults are over: everything that was recorded is there, in this process if it still runs, and
   // after a restart, and new work succeeds.
   void verify();
 
-  // Nothing is asked of the storage of this run any more, as when the process ends.
+  // Ends the use of the storage, like the end of the process.
   void end();
 
-  // Whether anybody was told that something went wrong: a caller by an exception or a future, or the log.
-  bool hasToldOfTrouble() const;
+  // Whether a failure was reported: to a caller by an exception or a future, or in the log.
+  bool hasReportedTrouble() const;
 
   // How many times so far a store has been discarded for its manifest.
   std::size_t discards() const;
@@ -108,7 +108,7 @@ class Life {
   void drop(const std::string& store, const std::string& key);
   void expectNewWorkSucceeds();
   void expectDatabasesAreSound();
-  void expectEachPurgeIsTold() const;
+  void expectEachPurgeIsReported() const;
   void expectAllIsAnswered(const std::string& store, const std::string& key, const std::string& answer);
 
   bool has(const std::string& store) const;
@@ -124,13 +124,13 @@ class Life {
   std::size_t faults() const;
 
   const std::string root_;
-  const Hardship hardship_;
+  const FaultMode mode_;
   ManualClock clock_{2'000'000'000};
   ShortPauses pauses_;
   LogCapture log_;
   std::map<std::string, Keys> memory_;                   // by store
   std::map<std::string, std::size_t> purges_;            // of this process, by store
-  std::map<std::string, std::size_t> linesBeforeStart_;  // that told of a purge, by store
+  std::map<std::string, std::size_t> linesBeforeStart_;  // that reported a purge, by store
   std::size_t complaints_ = 0;                           // exceptions and failed futures
   bool mayThrow_ = false;  // a manifest is being loaded: its task passes on what is not damage
   int freshVersion_ = 100;

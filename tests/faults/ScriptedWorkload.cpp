@@ -1,4 +1,4 @@
-#include "faults/Life.h"
+#include "faults/ScriptedWorkload.h"
 
 #include <gtest/gtest.h>
 #include <sqlite3.h>
@@ -81,7 +81,7 @@ std::string oneAnswer(sqlite3* database, const char* question) {
 }  // namespace
 
 // One run of the application.
-struct Life::Process {
+struct ScriptedWorkload::Process {
   std::shared_ptr<ManualQueueFactory> queues = std::make_shared<ManualQueueFactory>();
   std::shared_ptr<ManualQueueFactory> trashQueues = std::make_shared<ManualQueueFactory>();
   std::shared_ptr<EventLog> events = std::make_shared<EventLog>();
@@ -146,7 +146,7 @@ struct Life::Process {
 };
 
 // A write that has been asked for.
-struct Life::Asked {
+struct ScriptedWorkload::Asked {
   std::string store;
   std::string key;
   std::string value;
@@ -155,52 +155,52 @@ struct Life::Asked {
   std::size_t faultsBefore;
 };
 
-struct Life::Step {
+struct ScriptedWorkload::Step {
   const char* name;
-  void (Life::*run)();
+  void (ScriptedWorkload::*run)();
 };
 
-const std::vector<Life::Step>& Life::script() {
+const std::vector<ScriptedWorkload::Step>& ScriptedWorkload::script() {
   static const std::vector<Step> steps = {
-      {"start", &Life::start},
-      {"fill", &Life::fill},
-      {"fetch", &Life::fetchSome},
-      {"overwrite", &Life::overwrite},
-      {"remove", &Life::remove},
-      {"evict", &Life::evict},
-      {"prune", &Life::prune},
-      {"measure", &Life::measure},
-      {"expire", &Life::expire},
-      {"clear", &Life::clear},
-      {"flush", &Life::flush},
-      {"empty the trash", &Life::emptyTrash},
-      {"survive", &Life::survive},
-      {"mark for the trash", &Life::markForTrash},
-      {"invalidate", &Life::invalidate},
-      {"restart", &Life::restart},
-      {"fetch all", &Life::fetchAll},
-      {"fill again", &Life::fillAgain},
-      {"close in the middle", &Life::closeInTheMiddle},
-      {"let go in the middle", &Life::letGoInTheMiddle},
+      {"start", &ScriptedWorkload::start},
+      {"fill", &ScriptedWorkload::fill},
+      {"fetch", &ScriptedWorkload::fetchSome},
+      {"overwrite", &ScriptedWorkload::overwrite},
+      {"remove", &ScriptedWorkload::remove},
+      {"evict", &ScriptedWorkload::evict},
+      {"prune", &ScriptedWorkload::prune},
+      {"measure", &ScriptedWorkload::measure},
+      {"expire", &ScriptedWorkload::expire},
+      {"clear", &ScriptedWorkload::clear},
+      {"flush", &ScriptedWorkload::flush},
+      {"empty the trash", &ScriptedWorkload::emptyTrash},
+      {"survive", &ScriptedWorkload::survive},
+      {"mark for the trash", &ScriptedWorkload::markForTrash},
+      {"invalidate", &ScriptedWorkload::invalidate},
+      {"restart", &ScriptedWorkload::restart},
+      {"fetch all", &ScriptedWorkload::fetchAll},
+      {"fill again", &ScriptedWorkload::fillAgain},
+      {"close in the middle", &ScriptedWorkload::closeInTheMiddle},
+      {"let go in the middle", &ScriptedWorkload::letGoInTheMiddle},
   };
   return steps;
 }
 
-std::size_t Life::stepCount() { return script().size(); }
+std::size_t ScriptedWorkload::stepCount() { return script().size(); }
 
-Life::Life(const std::string& root, Hardship hardship) : root_(root), hardship_(hardship) {}
+ScriptedWorkload::ScriptedWorkload(const std::string& root, FaultMode mode) : root_(root), mode_(mode) {}
 
-Life::~Life() { end(); }
+ScriptedWorkload::~ScriptedWorkload() { end(); }
 
-void Life::step(std::size_t number) {
+void ScriptedWorkload::step(std::size_t number) {
   const Step& step = script().at(number);
   const testing::ScopedTrace trace(__FILE__, __LINE__, step.name);
   (this->*step.run)();
   notePurges();
-  if (hardship_ != Hardship::ManyFaults) expectEachPurgeIsTold();
+  if (mode_ != FaultMode::ManyFaults) expectEachPurgeIsReported();
 }
 
-void Life::end() {
+void ScriptedWorkload::end() {
   if (process_ == nullptr) return;
   process_->letGo();
   settle();
@@ -214,7 +214,7 @@ std::string quickPlace() {
 
 // --- The script ---
 
-void Life::start() {
+void ScriptedWorkload::start() {
   process_ = std::make_unique<Process>(root_, files);
   purges_.clear();
   for (const std::string& name : kStores) linesBeforeStart_[name] = purgeLines(lineOf(name));
@@ -244,12 +244,12 @@ void Life::start() {
   mayThrow_ = false;
 }
 
-void Life::restart() {
+void ScriptedWorkload::restart() {
   end();
   start();
 }
 
-void Life::fill() {
+void ScriptedWorkload::fill() {
   for (const char* key : {"a", "b", "c"}) {
     put("letters", key, 1);
     put("settings", key, 1);
@@ -259,31 +259,31 @@ void Life::fill() {
   put("notes", "a", 1);
 }
 
-void Life::fetchSome() {
+void ScriptedWorkload::fetchSome() {
   fetch("letters", "a");
   fetch("letters", "unknown");
   fetch("settings", "a");
   fetch("thumbs", "a");
 }
 
-void Life::overwrite() {
+void ScriptedWorkload::overwrite() {
   put("letters", "b", 2);
   put("settings", "b", 2);
   put("thumbs", "b", 2);
 }
 
-void Life::remove() {
+void ScriptedWorkload::remove() {
   drop("letters", "c");
   drop("settings", "c");
   drop("letters", "unknown");
 }
 
-void Life::evict() {
+void ScriptedWorkload::evict() {
   mayGo("recent");
   put("recent", "d", 1);
 }
 
-void Life::prune() {
+void ScriptedWorkload::prune() {
   for (const char* key : {"d", "e"}) {
     mayGo("thumbs");
     put("thumbs", key, 1);
@@ -293,13 +293,13 @@ void Life::prune() {
   settle();
 }
 
-void Life::measure() {
+void ScriptedWorkload::measure() {
   if (process_->web == nullptr) return;
   std::ofstream(process_->web->path + "/page") << std::string(2000, 'x');
   attempt([&] { process_->sizes->calculateDirectorySize(process_->web->path); });
 }
 
-void Life::expire() {
+void ScriptedWorkload::expire() {
   clock_.advance(7200);
   const std::size_t before = faults();
   mayGo("recent");
@@ -309,11 +309,11 @@ void Life::expire() {
     while (process_->queues->workQueue(i)->fireTimer(300 * kSecond)) settle();
   }
   notePurges();
-  if (!has("recent") || isInTrouble || faults() > 0 || before > 0 || hardship_ != Hardship::OneFault) return;
+  if (!has("recent") || isInTrouble || faults() > 0 || before > 0 || mode_ != FaultMode::OneFault) return;
   EXPECT_EQ(store("recent").getAllKeys(), std::vector<std::string>{"late"});
 }
 
-void Life::clear() {
+void ScriptedWorkload::clear() {
   if (!has("recent")) return;
   bool isCleared = false;
   attempt([&] { store("recent").clear([&] { isCleared = true; }, [&](const std::exception&) { ++complaints_; }); });
@@ -326,21 +326,21 @@ void Life::clear() {
   put("recent", "after", 1);
 }
 
-void Life::flush() {
+void ScriptedWorkload::flush() {
   for (std::size_t i = 0; i < process_->queues->workQueueCount(); ++i) {
     process_->queues->workQueue(i)->fireTimer(120 * kSecond);
   }
   settle();
 }
 
-void Life::emptyTrash() {
+void ScriptedWorkload::emptyTrash() {
   settle();
   process_->runQueuesAtOnce(true);
   attempt([&] { process_->trash->emptyAllTrash(); });
   process_->runQueuesAtOnce(false);
 }
 
-void Life::survive() {
+void ScriptedWorkload::survive() {
   clock_.advance(7200);
   files->total = 1LL << 20;
   mayGo("thumbs");
@@ -350,14 +350,14 @@ void Life::survive() {
   files->total = 1LL << 40;
 }
 
-void Life::markForTrash() {
+void ScriptedWorkload::markForTrash() {
   const auto media = process_->managers.find("media");
   if (media == process_->managers.end()) return;
   mayGo("thumbs");
   attempt([&] { media->second->trashStoreOnStartup("thumbs"); });
 }
 
-void Life::invalidate() {
+void ScriptedWorkload::invalidate() {
   settle();
   mayGo("notes");
   process_->runQueuesAtOnce(true);
@@ -368,13 +368,13 @@ void Life::invalidate() {
   process_->managers.erase("inbox");
 }
 
-void Life::fetchAll() {
+void ScriptedWorkload::fetchAll() {
   for (const auto& [store, keys] : memory_) {
     for (const auto& [key, remembered] : keys) fetch(store, key);
   }
 }
 
-void Life::fillAgain() {
+void ScriptedWorkload::fillAgain() {
   put("letters", "d", 3);
   put("letters", "a", 3);
   put("settings", "d", 3);
@@ -383,7 +383,7 @@ void Life::fillAgain() {
 }
 
 // The process ends while writes wait for the file queue. What has not begun by then has not happened.
-void Life::closeInTheMiddle() {
+void ScriptedWorkload::closeInTheMiddle() {
   const std::vector<Asked> asked = askForMany(4);
   for (std::size_t i = 0; i < process_->queues->workQueueCount(); ++i) runAll(*process_->queues->workQueue(i));
   for (std::size_t i = 0; i < process_->queues->queueCount(); ++i) runNext(*process_->queues->queue(i));
@@ -401,7 +401,7 @@ void Life::closeInTheMiddle() {
 }
 
 // Nobody holds a manager or a store any more while writes wait, but the queues run on: what was accepted is done.
-void Life::letGoInTheMiddle() {
+void ScriptedWorkload::letGoInTheMiddle() {
   const std::vector<Asked> asked = askForMany(5);
   process_->letGo();
   settle();
@@ -413,20 +413,20 @@ void Life::letGoInTheMiddle() {
 
 // --- What is done with a store ---
 
-void Life::put(const std::string& name, const std::string& key, int version) {
+void ScriptedWorkload::put(const std::string& name, const std::string& key, int version) {
   if (!has(name)) return;
   const Asked asked = ask(name, key, version);
   settle();
   take(asked);
 }
 
-Life::Asked Life::ask(const std::string& name, const std::string& key, int version) {
+ScriptedWorkload::Asked ScriptedWorkload::ask(const std::string& name, const std::string& key, int version) {
   const std::string value = valueOf(name + "/" + key, version);
   return {name, key, value, watch(store(name).store(key, bytesOf(value))), purges(name), faults()};
 }
 
 // Overwrites, and a first write or two.
-std::vector<Life::Asked> Life::askForMany(int version) {
+std::vector<ScriptedWorkload::Asked> ScriptedWorkload::askForMany(int version) {
   std::vector<Asked> asked;
   for (const char* key : {"a", "b", "d"}) {
     for (const char* name : {"letters", "settings", "notes"}) {
@@ -437,7 +437,7 @@ std::vector<Life::Asked> Life::askForMany(int version) {
 }
 
 // What follows from the answer.
-void Life::take(const Asked& asked) {
+void ScriptedWorkload::take(const Asked& asked) {
   const std::string& name = asked.store;
   notePurges();
   ASSERT_FALSE(asked.written->isPending()) << name << " " << asked.key;
@@ -452,20 +452,20 @@ void Life::take(const Asked& asked) {
     return;
   }
   if (!asked.written->hasSucceeded()) ++complaints_;
-  if (hardship_ == Hardship::ManifestClosed) return;
+  if (mode_ == FaultMode::ManifestClosed) return;
   remembered.values.insert(asked.value);
   remembered.mayBeMissing = true;
-  if (hardship_ != Hardship::OneFault) remembered.mayFail = remembered.mayBeTorn = true;
+  if (mode_ != FaultMode::OneFault) remembered.mayFail = remembered.mayBeTorn = true;
 }
 
 // What follows when the process ends before the writer is called: nothing, unless a fault was in the way of that.
-void Life::forget(const Asked& asked) {
+void ScriptedWorkload::forget(const Asked& asked) {
   Remembered& remembered = memory_[asked.store][asked.key];
   remembered.everWritten.insert(asked.value);
   if (isInTrouble || faults() > asked.faultsBefore) remembered.mayBeMissing = remembered.mayFail = true;
 }
 
-void Life::fetch(const std::string& name, const std::string& key) {
+void ScriptedWorkload::fetch(const std::string& name, const std::string& key) {
   if (!has(name)) return;
   const std::size_t faultsBefore = faults();
   const Fetched fetched = watch(store(name).fetch(key));
@@ -479,7 +479,7 @@ void Life::fetch(const std::string& name, const std::string& key) {
   expectAllIsAnswered(name, key, answer);
 }
 
-void Life::expectAllIsAnswered(const std::string& name, const std::string& key, const std::string& answer) {
+void ScriptedWorkload::expectAllIsAnswered(const std::string& name, const std::string& key, const std::string& answer) {
   const Remembered& remembered = memory_[name][key];
   if (answer == "<miss>") {
     EXPECT_TRUE(remembered.mayBeMissing) << name << " " << key << " is missing";
@@ -492,7 +492,7 @@ void Life::expectAllIsAnswered(const std::string& name, const std::string& key, 
   }
 }
 
-void Life::drop(const std::string& name, const std::string& key) {
+void ScriptedWorkload::drop(const std::string& name, const std::string& key) {
   if (!has(name)) return;
   const std::size_t purgesBefore = purges(name);
   const Written removed = watch(store(name).removeItem(key));
@@ -511,7 +511,7 @@ void Life::drop(const std::string& name, const std::string& key) {
 
 // --- Holding it to its promises ---
 
-void Life::verify() {
+void ScriptedWorkload::verify() {
   vfs.heal();
   files->heal();
   files->onCall = nullptr;
@@ -530,7 +530,7 @@ void Life::verify() {
   fetchAll();
 }
 
-void Life::expectNewWorkSucceeds() {
+void ScriptedWorkload::expectNewWorkSucceeds() {
   ++freshVersion_;
   for (const std::string& name : kStores) {
     if (!has(name)) continue;
@@ -549,8 +549,8 @@ void Life::expectNewWorkSucceeds() {
   }
 }
 
-void Life::expectDatabasesAreSound() {
-  if (hardship_ == Hardship::SilentLoss) return;  // SQLite could not know, and has gone on from what it read
+void ScriptedWorkload::expectDatabasesAreSound() {
+  if (mode_ == FaultMode::SilentLoss) return;  // SQLite could not know, and has gone on from what it read
   for (const auto& [name, opened] : process_->stores) {
     sqlite3* database = nullptr;
     const std::string path = opened->path + "/manifest_v1.sqlite";
@@ -563,55 +563,57 @@ void Life::expectDatabasesAreSound() {
   }
 }
 
-void Life::expectEachPurgeIsTold() const {
+void ScriptedWorkload::expectEachPurgeIsReported() const {
   for (const std::string& name : kStores) {
     if (name == "thumbs") continue;  // goes to the trash for its mark, too
     EXPECT_EQ(purges(name), purgeLines(lineOf(name)) - linesBeforeStart_.at(name)) << name;
   }
 }
 
-bool Life::hasToldOfTrouble() const { return complaints_ > 0 || log_.errorCount() > 0; }
+bool ScriptedWorkload::hasReportedTrouble() const { return complaints_ > 0 || log_.errorCount() > 0; }
 
-std::size_t Life::discards() const { return purgeLines(""); }
+std::size_t ScriptedWorkload::discards() const { return purgeLines(""); }
 
-bool Life::has(const std::string& name) const { return process_ != nullptr && process_->stores.count(name) > 0; }
+bool ScriptedWorkload::has(const std::string& name) const {
+  return process_ != nullptr && process_->stores.count(name) > 0;
+}
 
-PersistentKeyValueStore& Life::store(const std::string& name) const { return *process_->stores.at(name); }
+PersistentKeyValueStore& ScriptedWorkload::store(const std::string& name) const { return *process_->stores.at(name); }
 
 // A purge hands the store's directory to the collector.
-std::size_t Life::purges(const std::string& name) const {
+std::size_t ScriptedWorkload::purges(const std::string& name) const {
   const auto path = process_->paths.find(name);
   if (path == process_->paths.end()) return 0;
   const auto collected = process_->trash->collected();
   return static_cast<std::size_t>(std::count(collected.begin(), collected.end(), path->second));
 }
 
-std::size_t Life::purgeLines(const std::string& beginning) const {
+std::size_t ScriptedWorkload::purgeLines(const std::string& beginning) const {
   const auto lines = log_.messages();
   return static_cast<std::size_t>(std::count_if(lines.begin(), lines.end(), [&](const std::string& line) {
     return line.rfind(beginning, 0) == 0 && line.find(" purged due to corrupted manifest. ") != std::string::npos;
   }));
 }
 
-void Life::notePurges() {
+void ScriptedWorkload::notePurges() {
   if (process_ == nullptr) return;
   for (const std::string& name : kStores) {
     const std::size_t now = purges(name);
     const bool isPurged = now != std::exchange(purges_[name], now);
-    const bool isHarmed = isPurged || (hardship_ == Hardship::SilentLoss && faults() > 0);
+    const bool isHarmed = isPurged || (mode_ == FaultMode::SilentLoss && faults() > 0);
     if (isHarmed) mayGo(name);
-    if (!isHarmed || hardship_ == Hardship::OneFault) continue;
+    if (!isHarmed || mode_ == FaultMode::OneFault) continue;
     for (auto& [key, remembered] : memory_[name]) remembered.mayFail = true;
   }
 }
 
-void Life::mayGo(const std::string& name) {
+void ScriptedWorkload::mayGo(const std::string& name) {
   for (auto& [key, remembered] : memory_[name]) remembered.mayBeMissing = true;
 }
 
 // --- Running ---
 
-void Life::attempt(const std::function<void()>& work) {
+void ScriptedWorkload::attempt(const std::function<void()>& work) {
   try {
     work();
   } catch (const std::exception&) {
@@ -619,18 +621,18 @@ void Life::attempt(const std::function<void()>& work) {
   }
 }
 
-void Life::settle() {
+void ScriptedWorkload::settle() {
   for (bool ran = true; ran;) {
     ran = false;
     for (const auto& queue : process_->executors()) ran = runNext(*queue) || ran;
   }
 }
 
-void Life::runAll(ManualExecutor& queue) {
+void ScriptedWorkload::runAll(ManualExecutor& queue) {
   while (runNext(queue)) continue;
 }
 
-bool Life::runNext(ManualExecutor& queue) {
+bool ScriptedWorkload::runNext(ManualExecutor& queue) {
   try {
     return queue.runNext();
   } catch (const LarderException& error) {
@@ -640,6 +642,6 @@ bool Life::runNext(ManualExecutor& queue) {
   }
 }
 
-std::size_t Life::faults() const { return vfs.failures() + files->failures(); }
+std::size_t ScriptedWorkload::faults() const { return vfs.failures() + files->failures(); }
 
 }  // namespace velmora::mobile::xplat::cellar::test
