@@ -7,7 +7,7 @@ const std::vector<Benchmark>& benchmarks() {
       {"store", "Storing: microseconds for each of many new values", measureStores},
       {"fetch", "Fetching: microseconds for each of many values that are there", measureFetches},
       {"caller", "The caller's time: microseconds until a call returns", measureCallers},
-      {"prune", "Pruning: microseconds for each item that goes", measurePrunes},
+      {"prune", "Pruning: microseconds for each removed item", measurePrunes},
       {"capacity", "Writing to a store at its capacity: microseconds for each write", measureCapacity},
       {"load", "Loading a manifest: time and memory for each item", measureLoading},
       {"tree", "Measuring and freeing directories", measureTrees},

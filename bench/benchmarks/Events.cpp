@@ -15,7 +15,7 @@ namespace velmora::mobile::xplat::cellar::bench {
 
 namespace {
 
-// A sink that looks at what it gets and keeps nothing.
+// A sink that reads the events and discards them.
 class Sink : public XAnalytics {
  public:
   void logEvent(const std::string& eventName, const std::string& category, const std::string& payload,

@@ -22,7 +22,7 @@ template <class Put> void putAll(std::size_t size, std::size_t count, Put put) {
   }
 }
 
-// Bytes on disk for each byte that was stored, once whoever stored them has closed.
+// Bytes on disk for each stored byte, after the store or database was closed.
 double spaceOf(const Scratch& scratch, std::size_t size, std::size_t count) {
   return static_cast<double>(figuresOf(scratch.path()).bytes) / static_cast<double>(size * count);
 }

@@ -34,8 +34,8 @@ std::string configuration() {
 
 struct StartTimes {
   double host;    // parsing the configuration, starting threads
-  double store;   // from there until the first store was had
-  double answer;  // and until it had answered
+  double store;   // from there until the first store was there
+  double result;  // and until its first fetch returned
 };
 
 StartTimes start(const std::string& root) {
@@ -53,14 +53,14 @@ void measureHost(const Context& context, const Place& place) {
   std::vector<double> host;
   std::vector<double> first;
   std::vector<double> store;
-  std::vector<double> answer;
+  std::vector<double> result;
   for (int i = 0; i < context.scaled(41, 11); ++i) {
     const Scratch scratch(place);
     first.push_back(start(scratch.path()).store);
     const StartTimes again = start(scratch.path());
     host.push_back(again.host);
     store.push_back(again.store);
-    answer.push_back(again.answer);
+    result.push_back(again.result);
   }
   const auto add = [&](const std::string& what, const std::vector<double>& samples, const std::vector<Goal>& goals) {
     context.report.add(Row{what, place.name, cpuName(false), "us", {{"ours", median(samples)}}, goals});
@@ -68,7 +68,7 @@ void measureHost(const Context& context, const Place& place) {
   add("configuration of 200 stores and threads", host, {});
   add("from the factory to the first store ever", first, {{"", 2000}});
   add("from the factory to the first store, again", store, {{"", 2000}});
-  add("from the factory to its first value", answer, {{"", 2000}});
+  add("from the factory to its first result", result, {{"", 2000}});
 }
 
 double fetchOne(StoreUnderTest& store, std::size_t number) {

@@ -34,10 +34,10 @@ void throwUnless(bool condition, const char* message) {
   if (!condition) throw std::runtime_error(message);
 }
 
-// A disk cache whose queues run when it is told so.
+// A disk cache with manual queues.
 class CacheScenario : public Scenario {
  public:
-  // `itemsBefore`: so many are in its manifest when it is opened.
+  // `itemsBefore`: the number of items in its manifest when it is opened.
   CacheScenario(const std::string& directory, std::size_t itemsBefore, std::uint32_t normalSize)
       : directory_(directory + "/store") {
     const auto files = std::make_shared<FileUtils>();

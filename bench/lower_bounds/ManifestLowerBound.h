@@ -8,7 +8,7 @@
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-// The records of a store on disk, written by hand: the same table by the same statements, each prepared anew for each
+// The records of a store on disk, written by hand: the same table by the same statements, each prepared again for each
 // operation, and nothing else.
 class ManifestLowerBound {
  public:

@@ -10,8 +10,8 @@ struct sqlite3_stmt;
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-// A connection and its statements with nothing around SQLite but the check of its answers. What is bound must live
-// until the statement has run.
+// A connection and its statements: SQLite itself, with a check of its results. Bound values must exist until the
+// statement has run.
 class Database {
  public:
   explicit Database(const std::string& path);

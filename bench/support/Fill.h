@@ -9,7 +9,7 @@
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-// Databases with many records, made once and copied to whoever needs one.
+// Databases with many records, created once and copied for each use.
 class Manifests {
  public:
   static constexpr std::size_t kItemSize = 200;  // bytes of each item, by its record
@@ -28,7 +28,7 @@ class Manifests {
 // Creates the files of the first `count` items.
 void fillFiles(const std::string& directory, std::size_t count);
 
-// Creates `count` files of 100 bytes in so many sub-directories.
+// Creates `count` files of 100 bytes in `directories` sub-directories.
 void fillTree(const std::string& directory, std::size_t count, std::size_t directories);
 
 // The number of files (of any kind but directories) in the tree, and the bytes that it takes on disk.

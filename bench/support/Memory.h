@@ -4,8 +4,8 @@
 
 namespace velmora::mobile::xplat::cellar::bench {
 
-// Touches so much memory and gives it back to the system. A virtual machine may have given unused memory back to its
-// host, and whoever is first to touch it again would pay milliseconds for each MiB.
+// Touches that much memory and returns it to the system. A virtual machine may have returned unused memory to its host,
+// and the first thread to touch it again would wait milliseconds for each MiB.
 void warmMemory(std::size_t bytes);
 
 // Lets this process keep what it frees, this much of it touched beforehand. The C library would give a value of 1 MiB
@@ -13,8 +13,8 @@ void warmMemory(std::size_t bytes);
 // for a while.
 void keepMemory(std::size_t bytes);
 
-// What operator new gives out in this process while there is one of these. Not while time is taken: every thread counts
-// at one place.
+// Counts what operator new returns in this process while an object of this class exists. Not while time is taken: every
+// thread counts at one place.
 class CountedAllocations {
  public:
   CountedAllocations();
@@ -23,7 +23,7 @@ class CountedAllocations {
   CountedAllocations& operator=(const CountedAllocations&) = delete;
 
   std::size_t large() const;     // times that 256 KiB or more were asked for
-  std::ptrdiff_t bytes() const;  // given out and not given back, what the allocator rounds up included
+  std::ptrdiff_t bytes() const;  // allocated and not freed, as rounded up by the allocator
 };
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -14,7 +14,7 @@ struct Place {
 // Writes out what the file system of `path` still holds in memory, so that what comes next does not wait for it.
 void settle(const std::string& path);
 
-// An empty directory on a settled file system, which goes away with everything in it.
+// An empty directory on a settled file system; the destructor removes it with its contents.
 class Scratch {
  public:
   explicit Scratch(const Place& place);
@@ -29,7 +29,7 @@ class Scratch {
   std::string path_;
 };
 
-// Writes files of so many bytes in all and deletes them again, for the reason that `warmMemory` has: the system takes
+// Writes files of `bytes` bytes in total and deletes them again, for the reason that `warmMemory` has: the system takes
 // the memory for files from other places.
 void warmFiles(const Place& place, std::size_t bytes);
 

@@ -19,9 +19,9 @@ double median(std::vector<double> samples);
 using Contestants = std::vector<std::pair<std::string, std::function<double()>>>;
 using Figures = std::map<std::string, double>;
 
-// The median of so many measurements of each. They take turns, each round beginning with another one, so that whatever
-// else the machine does meets all of them. `bytes`: what a measurement writes to the place and reads; so much memory is
-// warmed before.
+// The median of `repetitions` measurements of each contestant. They alternate, and each round begins with another one,
+// so that other activity of the machine affects all of them. `bytes`: what a measurement writes to the place and reads;
+// that much memory is warmed before.
 Figures interleaved(const Place& place, const Contestants& contestants, int repetitions, std::size_t bytes);
 
 }  // namespace velmora::mobile::xplat::cellar::bench

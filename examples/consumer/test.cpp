@@ -14,7 +14,7 @@ namespace cellar = velmora::mobile::xplat::cellar;
 
 namespace {
 
-bool aFullDiskIsToldToTheCaller(const std::string& directory) {
+bool aFullDiskIsReported(const std::string& directory) {
   const auto files = std::make_shared<cellar::test::FaultyFileUtils>();
   const auto queues = std::make_shared<cellar::test::ManualQueueFactory>();
   const auto trash = std::make_shared<cellar::TrashCollector>(directory + "/trash", files, nullptr, queues);
@@ -37,7 +37,7 @@ bool aFullDiskIsToldToTheCaller(const std::string& directory) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  const bool isTold = argc == 2 && aFullDiskIsToldToTheCaller(argv[1]);
-  std::cout << (isTold ? "The full disk was told to the caller.\n" : "Nobody was told of the full disk.\n");
-  return isTold ? 0 : 1;
+  const bool isReported = argc == 2 && aFullDiskIsReported(argv[1]);
+  std::cout << (isReported ? "The full disk was reported to the caller.\n" : "The full disk was not reported.\n");
+  return isReported ? 0 : 1;
 }
