@@ -81,7 +81,7 @@ int main(int argc, char** argv) {
   app.add_option("--plots", arguments.plots, "A directory for gnuplot scripts");
   app.add_option("--document", arguments.document, "The document to write the tables into");
   app.add_option("--summary", arguments.summary, "The document to write the shortened tables into");
-  app.add_option("--benchmark", arguments.benchmarks, "Measure only this benchmark; may be repeated");
+  app.add_option("--topic", arguments.benchmarks, "Measure only this benchmark; may be repeated");
   CLI11_PARSE(app, argc, argv);
   try {
     run(arguments);
