@@ -71,7 +71,11 @@ bool DiskCache::isPrunable() { return true; }
 
 void DiskCache::pruneBackToNormal(std::function<void()> onSuccess, std::function<void(const std::exception&)> onError,
                                   bool survivalMode) {
-  const std::uint32_t target = survivalMode ? survivalSize_ : normalSize_.load();
+  std::uint32_t target = survivalSize_;
+  if (!survivalMode) {
+    const std::lock_guard<std::mutex> lock(mutex());
+    target = normalSize_;
+  }
   const auto takeNextBatch = [weakThis = weak_from_this<DiskCache>(), target]() -> std::vector<DiskCacheItem> {
     const auto self = weakThis.lock();
     if (self == nullptr) return {};
@@ -84,7 +88,10 @@ void DiskCache::pruneBackToNormal(std::function<void()> onSuccess, std::function
 std::shared_ptr<PruneStrategyBase> DiskCache::getPruneStrategy() { return pruneStrategy(); }
 
 void DiskCache::overrideConfiguration(long staleAge, unsigned int normalSize) {
-  normalSize_ = normalSize;
+  {
+    const std::lock_guard<std::mutex> lock(mutex());
+    normalSize_ = normalSize;
+  }
   overrideConfiguration(staleAge);
 }
 

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -57,7 +56,7 @@ class CELLAR_EXPORT DiskCache : public PersistentKeyValueStore {
   using PersistentKeyValueStore::overrideConfiguration;
 
  private:
-  std::atomic<std::uint32_t> normalSize_;
+  std::uint32_t normalSize_;  // guarded by the store's mutex
   const std::uint32_t survivalSize_;
 };
 

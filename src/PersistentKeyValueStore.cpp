@@ -210,7 +210,9 @@ void PersistentKeyValueStore::scheduleStaleRemoval(long delaySeconds) {
 void PersistentKeyValueStore::startStaleItemRemoval() { parts_->staleItems.start(); }
 
 void PersistentKeyValueStore::removeOldestItemIfOverMaxCapacity() {
-  parts_->remover.evictOldestIfFull(parts_->context.lock());
+  const StoreLock lock = parts_->context.lock();
+  throwIfInvalid();
+  parts_->remover.evictOldestIfFull(lock);
 }
 
 std::vector<DiskCacheItem> PersistentKeyValueStore::evictBatch(const Prune& prune) {
@@ -332,6 +334,8 @@ std::shared_ptr<DiskCacheManifestInterface> PersistentKeyValueStore::getManifest
 std::string PersistentKeyValueStore::getFilePath(const std::string& filename) { return parts_->files.pathOf(filename); }
 
 std::string PersistentKeyValueStore::getTemporaryDirectoryPath() { return parts_->context.options.temporaryDirectory; }
+
+std::mutex& PersistentKeyValueStore::mutex() { return parts_->context.mutex; }
 
 unsigned int PersistentKeyValueStore::batchSize() const { return parts_->context.options.batchSize; }
 

@@ -4,6 +4,7 @@
 #include <exception>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -181,7 +182,8 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // Expires what is stale now. Called on the work queue.
   void startStaleItemRemoval();
 
-  // Evicts the item used least recently if the store is at its capacity.
+  // Evicts the item used least recently if the store is at its capacity. Takes the store's mutex. Throws
+  // `InvalidatedException`, and what the manifest throws.
   void removeOldestItemIfOverMaxCapacity();
 
   // Deletes the files of what `provider` yields, batch by batch, until a batch is empty. Each batch is asked for on the
@@ -223,6 +225,7 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
   // damaged manifest purges the store and yields an empty batch.
   std::vector<DiskCacheItem> evictBatch(const Prune& prune);
 
+  std::mutex& mutex();
   unsigned int batchSize() const;
   const std::shared_ptr<PruneStrategyBase>& pruneStrategy() const;
 

@@ -293,11 +293,12 @@ SQLiteStoreColumn::SQLiteStoreColumn(const std::string& name_, const std::string
 SQLiteStore::SQLiteStore(const std::string& path) : path_(path) {
   struct stat status = {};
   if (isPresent(path_, status) && isFifoOrDevice(status)) throwSQLiteException(SQLITE_NOTADB, cannotOpen(path_));
+  const ConnectionCloser closer;
   sqlite3* handle = nullptr;
   const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX;
   const int resultCode = sqlite3_open_v2(path_.c_str(), &handle, flags, nullptr);
   // A failed open hands out a handle too, which has to be closed like any other.
-  database_ = std::shared_ptr<sqlite3>(handle, ConnectionCloser());
+  database_ = std::shared_ptr<sqlite3>(handle, closer);
   throwSQLiteException(resultCode, cannotOpen(path_));
   throwIfCompanionsMayBlock(database_, path_, status.st_size == 0);
   distrustSchema(handle);

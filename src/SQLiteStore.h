@@ -32,7 +32,8 @@ CELLAR_EXPORT void throwIfSQLiteError(const std::shared_ptr<sqlite3>& database, 
 // that was moved from does so too.
 class CELLAR_EXPORT SQLiteStoreCursor {
  public:
-  // Prepares the first statement of `sql`; bytes after a zero byte are not read.
+  // Prepares the first statement of `sql`; bytes after a zero byte are not read. When the connection has kept that
+  // statement, a change of the schema that no longer fits it is found by `next`.
   SQLiteStoreCursor(std::shared_ptr<sqlite3> database, const std::string& sql);
   // Never throws. SQLite repeats the error of a failed `next` here, which gives a line in the log.
   ~SQLiteStoreCursor();

@@ -14,7 +14,8 @@ namespace velmora::mobile::xplat::cellar {
 struct FileWrite;
 
 // The file queue of a store, which remembers of each write which one comes right behind it: a task that has to wait
-// for the manifest anyway writes their files meanwhile. Nothing else is ever overtaken. Any thread may call.
+// for the manifest anyway writes their files meanwhile. No other task is overtaken by a write of a key that it is
+// about. Any thread may call.
 class FileQueue {
  public:
   explicit FileQueue(std::shared_ptr<AsyncExecutor> queue) : queue_(std::move(queue)) {}

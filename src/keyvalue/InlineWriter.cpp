@@ -99,7 +99,8 @@ void InlineWriter::takeBack(const StoreLock& lock, const std::string& key, Repla
 // kill in the middle of the next write of the key could bring its value back.
 void InlineWriter::deleteReplacedFile(const std::string& path, const std::shared_ptr<Value>& value) {
   const auto deleteIt = [weakThis = context_.weak(*this), deletion = context_.fileDeletion, path, value] {
-    if (const auto self = weakThis.lock()) self->files_.deleteAll({path});
+    const auto self = weakThis.lock();
+    if (self != nullptr && !self->context_.isClosed) self->files_.deleteAll({path});
     value->promise.setValue();
   };
   try {

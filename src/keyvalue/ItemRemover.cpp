@@ -54,7 +54,7 @@ void ItemRemover::evictOldestIfFull(const StoreLock& /*lock*/) {
   if (!path || writes_.revoke(item->key)) return;
   const auto deleteIt = [weakContext = context_.weak(context_), deletion = context_.fileDeletion, path = *path] {
     const auto context = weakContext.lock();
-    if (context == nullptr) return;
+    if (context == nullptr || context->isClosed) return;  // the path may be another store's by now
     try {
       context->files->deleteFile(path);
     } catch (const LarderException& error) {

@@ -17,8 +17,9 @@ KeyValueStoreOptions inRange(KeyValueStoreOptions options) {
 }
 
 std::string pathOfManifest(const KeyValueStoreOptions& options, FileUtils& files) {
+  std::string path = files.combinePath(options.directory, kManifestFileName);
   files.createDirectory(options.directory, true);
-  return files.combinePath(options.directory, kManifestFileName);
+  return path;
 }
 
 }  // namespace

@@ -26,9 +26,6 @@ class StoreLock {
   // Not held when another thread has the mutex.
   static StoreLock tryTo(std::mutex& mutex) { return StoreLock(std::unique_lock<std::mutex>(mutex, std::try_to_lock)); }
 
-  // For an operation of the store's that is called with the mutex held.
-  static StoreLock heldByCaller() { return StoreLock(std::unique_lock<std::mutex>()); }
-
   bool isHeld() const { return lock_.owns_lock(); }
   void lock() { lock_.lock(); }
   void unlock() { lock_.unlock(); }

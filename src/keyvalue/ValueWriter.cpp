@@ -40,26 +40,31 @@ Future<void> ValueWriter::store(const std::string& key,
 }
 
 void ValueWriter::begin(const std::shared_ptr<FileWrite>& write) {
+  bool hasBegun = false;
   try {
-    bool hasBegun = false;
     {
       const StoreLock lock = context_.lock();
       context_.throwIfInvalid();
       hasBegun = beginRecord(lock, *write);
     }
-    if (!hasBegun) return write->promise.setValue();  // the store was purged instead
-    // A queue that takes no task drops the write: its end takes the record away again.
-    fileQueue_.dispatchWrite(write, [write] {
-      if (const auto self = write->owner.lock()) {
-        if (self->writes_.claim(*write)) self->commitGroup(write);
-      } else if (!write->isClaimed()) {
-        write->promise.setValue();
-      }
-    });
+    if (hasBegun) dispatch(write);
   } catch (...) {
     // The task of an earlier write may have it by now, though the queue has refused its own.
     if (writes_.claim(*write)) write->promise.setException(std::current_exception());
+    return;
   }
+  if (!hasBegun) write->promise.setValue();  // the store was purged instead
+}
+
+// A queue that takes no task drops the write: its end takes the record away again.
+void ValueWriter::dispatch(const std::shared_ptr<FileWrite>& write) {
+  fileQueue_.dispatchWrite(write, [write] {
+    if (const auto self = write->owner.lock()) {
+      if (self->writes_.claim(*write)) self->commitGroup(write);
+    } else if (!write->isClaimed()) {
+      write->promise.setValue();
+    }
+  });
 }
 
 // Puts a provisional record into the manifest. False when the store had to be purged instead.
@@ -82,7 +87,9 @@ bool ValueWriter::beginRecord(const StoreLock& lock, FileWrite& write) {
 // while others are busy with it, the files of the next writes are written instead, and then all their records at once.
 void ValueWriter::commitGroup(const std::shared_ptr<FileWrite>& first) {
   const Token deletion = context_.fileDeletion;  // of what a writer that fails, or is revoked, leaves behind
-  Group group = {first};
+  Group group;
+  group.reserve(kMaxGroupSize);
+  group.push_back(first);
   writeFile(*first);
   StoreLock lock = StoreLock::tryTo(context_.mutex);
   if (!lock.isHeld()) {
@@ -96,7 +103,6 @@ void ValueWriter::commitGroup(const std::shared_ptr<FileWrite>& first) {
 }
 
 void ValueWriter::extendGroup(Group& group) {
-  group.reserve(kMaxGroupSize);
   std::uint64_t bytes = group.back()->size;
   while (group.size() < kMaxGroupSize && bytes < kMaxGroupBytes) {
     auto write = fileQueue_.next(group);
@@ -168,13 +174,20 @@ void ValueWriter::recordWritten(const StoreLock& lock, FileWrite& write) {
     rollback_.discardRecord(lock, write.key, othersAreInFlight);
     return;
   }
-  write.total = manifest_.totalToReport();
+  noteTotal(write);
+}
+
+void ValueWriter::noteTotal(FileWrite& write) {
+  try {
+    write.total = manifest_.totalToReport();
+  } catch (...) {
+    write.failure = std::current_exception();
+  }
 }
 
 void ValueWriter::reportTotal(FileWrite& write) {
-  if (!write.total) return;
   try {
-    manifest_.dispatchReport(*write.total);
+    if (write.total) manifest_.dispatchReport(*write.total);
   } catch (...) {
     write.failure = std::current_exception();
   }

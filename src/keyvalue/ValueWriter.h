@@ -43,6 +43,7 @@ class ValueWriter {
   using Group = std::vector<std::shared_ptr<FileWrite>>;
 
   void begin(const std::shared_ptr<FileWrite>& write);
+  void dispatch(const std::shared_ptr<FileWrite>& write);
   bool beginRecord(const StoreLock& lock, FileWrite& write);
   void commitGroup(const std::shared_ptr<FileWrite>& first);
   void extendGroup(Group& group);
@@ -50,6 +51,7 @@ class ValueWriter {
   void writeFile(FileWrite& write);
   unsigned int runWriter(FileWrite& write);
   void recordWritten(const StoreLock& lock, FileWrite& write);
+  void noteTotal(FileWrite& write);
   void reportTotal(FileWrite& write);
 
   StoreContext& context_;
