@@ -29,208 +29,30 @@
 #include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 #include "support/LogCapture.h"
+#include "support/MemoryPersistence.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
+using test::Bytes;
 using test::LogCapture;
 using test::ManualClock;
 using test::ManualExecutor;
+using test::MemoryMedium;
+using test::MemoryPersistence;
 using test::TemporaryDirectory;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::SizeIs;
 using testing::UnorderedElementsAre;
 
-using Bytes = std::vector<unsigned char>;
 using ItemType = VideoDownloadExtendedMetadata::ItemType;
 
 constexpr std::int64_t kFlushInterval = 120'000'000'000;
 constexpr std::uint32_t kMany = std::numeric_limits<std::uint32_t>::max();
-
-// What a persistence writes on, so that a test can look at it and change it behind the manifest's back.
-class Medium {
- public:
-  struct Row {
-    DiskCacheItem item;
-    Bytes inlineData;
-  };
-
-  // Called at the end of each operation that has not failed, with no lock held.
-  std::function<void(const std::string& operation, const std::string& key)> onCall;
-
-  void put(const DiskCacheItem& item, const Bytes& inlineData = {}) {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    rows_[item.key] = {item, inlineData};
-  }
-  std::optional<Row> row(const std::string& key) const {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    const auto found = rows_.find(key);
-    return found == rows_.end() ? std::nullopt : std::make_optional(found->second);
-  }
-  std::map<std::string, Row> rows() const {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    return rows_;
-  }
-  std::vector<std::string> keys() const {
-    std::vector<std::string> keys;
-    for (const auto& row : rows()) keys.push_back(row.first);
-    return keys;
-  }
-  std::int32_t accessDate(const std::string& key) const { return row(key)->item.lastAccessDate; }
-
-  // The keys that an operation was called with, failed calls too.
-  std::vector<std::string> calls(const std::string& operation) const {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    std::vector<std::string> keys;
-    for (const auto& call : calls_) {
-      if (call.first == operation) keys.push_back(call.second);
-    }
-    return keys;
-  }
-  std::size_t writes() const {
-    return calls("setItem").size() + calls("removeItem").size() + calls("updateLastAccessDate").size() +
-           calls("setInlineData").size() + calls("removeInlineData").size();
-  }
-  void forgetCalls() {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    calls_.clear();
-  }
-
-  // The operation fails from its n-th call from now on (0: the next).
-  void fail(const std::string& operation, int after = 0) {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    failures_[operation] = after;
-  }
-  void heal() {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    failures_.clear();
-  }
-
-  // The operation, unless it is to fail or the medium has been let go of.
-  template <class Action> auto perform(const std::string& operation, const std::string& key, Action action) {
-    using Result = decltype(action(rows_));
-    if constexpr (std::is_void_v<Result>) {
-      if (!enter(operation, key)) return;
-      {
-        const std::lock_guard<std::mutex> lock(mutex_);
-        action(rows_);
-      }
-      if (onCall) onCall(operation, key);
-    } else {
-      Result result{};
-      if (!enter(operation, key)) return result;
-      {
-        const std::lock_guard<std::mutex> lock(mutex_);
-        result = action(rows_);
-      }
-      if (onCall) onCall(operation, key);
-      return result;
-    }
-  }
-
-  void invalidate() {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    invalidated_ = true;
-  }
-  bool isInvalidated() const {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    return invalidated_;
-  }
-
- private:
-  bool enter(const std::string& operation, const std::string& key) {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    calls_.emplace_back(operation, key);
-    if (invalidated_) return false;
-    const auto failure = failures_.find(operation);
-    if (failure != failures_.end() && failure->second-- <= 0) {
-      failure->second = 0;
-      throw ManifestPersistenceException("The medium is full.", 13);
-    }
-    return true;
-  }
-
-  mutable std::mutex mutex_;  // guards all below
-  std::map<std::string, Row> rows_;
-  std::vector<std::pair<std::string, std::string>> calls_;
-  std::map<std::string, int> failures_;
-  bool invalidated_ = false;
-};
-
-class FakePersistence final : public ManifestPersistence {
- public:
-  using Rows = std::map<std::string, Medium::Row>;
-
-  explicit FakePersistence(std::shared_ptr<Medium> medium) : medium_(std::move(medium)) {}
-
-  void clearItems() override {
-    medium_->perform("clearItems", "", [](Rows& rows) { rows.clear(); });
-  }
-  void setItem(const DiskCacheItem& item) override {
-    medium_->perform("setItem", item.key, [&](Rows& rows) { rows[item.key] = {item, {}}; });
-  }
-  std::unique_ptr<DiskCacheItem> getItem(const std::string& key) const override {
-    return medium_->perform("getItem", key, [&](Rows& rows) {
-      const auto found = rows.find(key);
-      return found == rows.end() ? nullptr : std::make_unique<DiskCacheItem>(found->second.item);
-    });
-  }
-  void removeItem(const std::string& key) override {
-    medium_->perform("removeItem", key, [&](Rows& rows) { rows.erase(key); });
-  }
-  void updateLastAccessDate(const std::string& key, long date) override {
-    medium_->perform("updateLastAccessDate", key, [&](Rows& rows) {
-      const auto found = rows.find(key);
-      if (found != rows.end()) found->second.item.lastAccessDate = static_cast<std::int32_t>(date);
-    });
-  }
-  std::vector<std::unique_ptr<DiskCacheItem>> getItemsLastAccessedBefore(long date) const override {
-    return items("getItemsLastAccessedBefore", [&](const DiskCacheItem& item) { return item.lastAccessDate < date; });
-  }
-  void invalidate() override { medium_->invalidate(); }
-  std::vector<std::unique_ptr<DiskCacheItem>> getAllItems() const override {
-    return items("getAllItems", [](const DiskCacheItem&) { return true; });
-  }
-  Bytes getInlineData(const std::string& key) const override {
-    return medium_->perform("getInlineData", key, [&](Rows& rows) {
-      const auto found = rows.find(key);
-      return found != rows.end() && found->second.item.hasInlineData ? found->second.inlineData : Bytes();
-    });
-  }
-  void setInlineData(const std::string& key, const Bytes& data) override {
-    medium_->perform("setInlineData", key, [&](Rows& rows) {
-      const auto found = rows.find(key);
-      if (found == rows.end()) return;
-      found->second.item.hasInlineData = true;
-      found->second.inlineData = data;
-    });
-  }
-  void removeInlineData(const std::string& key) override {
-    medium_->perform("removeInlineData", key, [&](Rows& rows) {
-      const auto found = rows.find(key);
-      if (found == rows.end()) return;
-      found->second.item.hasInlineData = false;
-      found->second.inlineData.clear();
-    });
-  }
-
- private:
-  template <class Wanted>
-  std::vector<std::unique_ptr<DiskCacheItem>> items(const std::string& operation, Wanted wanted) const {
-    return medium_->perform(operation, "", [&](Rows& rows) {
-      std::vector<std::unique_ptr<DiskCacheItem>> found;
-      for (const auto& row : rows) {
-        if (wanted(row.second.item)) found.push_back(std::make_unique<DiskCacheItem>(row.second.item));
-      }
-      return found;
-    });
-  }
-
-  const std::shared_ptr<Medium> medium_;
-};
 
 // A strategy made of any ordering, sensible or not.
 class AnyOrder final : public PruneStrategyBase {
@@ -261,8 +83,8 @@ std::vector<std::string> keysOf(const std::vector<DiskCacheItem>& items) {
 class DiskCacheManifestTest : public testing::Test {
  protected:
   void create(std::shared_ptr<PruneStrategyBase> strategy = nullptr) {
-    manifest_ =
-        std::make_shared<DiskCacheManifest>(std::make_unique<FakePersistence>(medium_), executor_, std::move(strategy));
+    manifest_ = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_), executor_,
+                                                    std::move(strategy));
   }
   void createLoaded(std::shared_ptr<PruneStrategyBase> strategy = nullptr) {
     create(std::move(strategy));
@@ -308,7 +130,7 @@ class DiskCacheManifestTest : public testing::Test {
     }
   }
 
-  std::shared_ptr<Medium> medium_ = std::make_shared<Medium>();
+  std::shared_ptr<MemoryMedium> medium_ = std::make_shared<MemoryMedium>();
   std::shared_ptr<ManualExecutor> executor_ = std::make_shared<ManualExecutor>();
   std::shared_ptr<DiskCacheManifest> manifest_;
 };
@@ -548,7 +370,7 @@ TEST_F(HeldOffByALoad, ARemovalWaitsSoThatTheKeyDoesNotComeBack) {
 TEST_F(DiskCacheManifestTest, AnItemThatIsSetIsOnTheMediumAtOnce) {
   createLoaded();
   manifest_->setItem(item("a", 7, 1));
-  EXPECT_EQ(medium_->row("a")->item.size, 7U);
+  EXPECT_EQ(medium_->row("a").item.size, 7U);
   EXPECT_EQ(manifest_->getItem("a")->size, 7U);
   expectConsistent();
 }
@@ -947,7 +769,7 @@ class RepeatingExecutor final : public AsyncExecutor {
 
 TEST_F(DiskCacheManifestTest, OnAHostWhoseTimersRepeatThereIsOneTimerAndEachFiringFlushesOnce) {
   const auto repeating = std::make_shared<RepeatingExecutor>();
-  auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<FakePersistence>(medium_), repeating, nullptr);
+  auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_), repeating, nullptr);
   manifest->setItem(item("a", 1, 1));
   manifest->load();
   for (int i = 0; i < 3; ++i) {
@@ -1332,7 +1154,7 @@ class LateExecutor final : public AsyncExecutor {
 
 TEST_F(DiskCacheManifestFlush, ThatHasRunIsOverAlsoWhereTheExecutorKeepsItsTask) {
   const auto late = std::make_shared<LateExecutor>();
-  auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<FakePersistence>(medium_), late, nullptr);
+  auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_), late, nullptr);
   manifest->load();
   ASSERT_THAT(late->tasks, SizeIs(1));  // the timer's
   for (std::size_t flushes = 1; flushes < 4; ++flushes) {
@@ -1345,7 +1167,7 @@ TEST_F(DiskCacheManifestFlush, ThatHasRunIsOverAlsoWhereTheExecutorKeepsItsTask)
 
 TEST_F(DiskCacheManifestTest, ATimerTaskThatOutlivesTheManifestDoesNothing) {
   const auto late = std::make_shared<LateExecutor>();
-  auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<FakePersistence>(medium_), late, nullptr);
+  auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_), late, nullptr);
   manifest->load();
   manifest.reset();
   medium_->forgetCalls();
@@ -1389,7 +1211,7 @@ TEST_F(DiskCacheManifestTest, AfterInvalidationMemoryWorksAndTheMediumIsLeftAlon
   createLoaded();
   fill(2);
   manifest_->invalidate();
-  EXPECT_TRUE(medium_->isInvalidated());
+  EXPECT_THAT(medium_->calls("invalidate"), SizeIs(1));
   manifest_->setItem(item("new", 5, 1));
   manifest_->removeItem("0");
   manifest_->setInlineData("1", {1});

@@ -35,6 +35,7 @@
 #include "host/ThreadQueueFactory.h"
 #include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
 
@@ -45,6 +46,7 @@ namespace fs = std::filesystem;
 
 using host::await;
 using host::ThreadQueueFactory;
+using test::Bytes;
 using test::EventLog;
 using test::LogCapture;
 using test::runOnThreads;
@@ -56,7 +58,6 @@ using testing::SizeIs;
 using testing::UnorderedElementsAre;
 using testing::UnorderedElementsAreArray;
 
-using Bytes = std::vector<unsigned char>;
 using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
 
 constexpr std::chrono::minutes kPatience(10);

@@ -19,31 +19,16 @@
 #include "PruneStrategy.h"
 #include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
+#include "support/MemoryPersistence.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::ManualClock;
 using test::ManualExecutor;
+using test::MemoryPersistence;
 
 using Items = std::map<std::string, DiskCacheItem>;
-using ItemPointers = std::vector<std::unique_ptr<DiskCacheItem>>;
-
-// Keeps nothing: what is asked of these tests happens in memory.
-class NoPersistence final : public ManifestPersistence {
- public:
-  void clearItems() override {}
-  void setItem(const DiskCacheItem&) override {}
-  std::unique_ptr<DiskCacheItem> getItem(const std::string&) const override { return nullptr; }
-  void removeItem(const std::string&) override {}
-  void updateLastAccessDate(const std::string&, long) override {}
-  ItemPointers getItemsLastAccessedBefore(long) const override { return {}; }
-  void invalidate() override {}
-  ItemPointers getAllItems() const override { return {}; }
-  std::vector<unsigned char> getInlineData(const std::string&) const override { return {}; }
-  void setInlineData(const std::string&, const std::vector<unsigned char>&) override {}
-  void removeInlineData(const std::string&) override {}
-};
 
 bool isLarger(const DiskCacheItem* a, const DiskCacheItem* b) {
   return a->size != b->size ? a->size > b->size : a->filename < b->filename;
@@ -106,7 +91,7 @@ std::shared_ptr<PruneStrategyBase> make(Strategy strategy) {
 class EvictionOrder : public testing::TestWithParam<Case> {
  protected:
   EvictionOrder() : before_(make(GetParam().strategy)) {
-    manifest_ = std::make_shared<DiskCacheManifest>(std::make_unique<NoPersistence>(),
+    manifest_ = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(),
                                                     std::make_shared<ManualExecutor>(), make(GetParam().strategy));
     manifest_->load();
   }
@@ -257,7 +242,7 @@ TEST_P(EvictionOrder, StartsAgainWhenTheManifestIsCleared) {
 
 // A second is long: all of a burst may come within one.
 TEST(EvictionOrderOfOneSecond, IsThatInWhichTheItemsCame) {
-  DiskCacheManifest manifest(std::make_unique<NoPersistence>(), std::make_shared<ManualExecutor>(), nullptr);
+  DiskCacheManifest manifest(std::make_unique<MemoryPersistence>(), std::make_shared<ManualExecutor>(), nullptr);
   manifest.load();
   const auto store = [&](int number) {
     const std::string key = std::to_string(number);
@@ -291,7 +276,7 @@ TEST(EvictionOrderOfAHost, ThatThrowsMidwayYieldsWhatHasGone) {
     int& left_;
   };
   int left = 1000;
-  DiskCacheManifest manifest(std::make_unique<NoPersistence>(), std::make_shared<ManualExecutor>(),
+  DiskCacheManifest manifest(std::make_unique<MemoryPersistence>(), std::make_shared<ManualExecutor>(),
                              std::make_shared<Tired>(left));
   manifest.load();
   for (const char* key : {"a", "b", "c", "d", "e", "f", "g", "h"})
@@ -312,7 +297,7 @@ TEST(EvictionOrderOfAHost, ThatThrowsMidwayYieldsWhatHasGone) {
 // What comes while the tunables are others is in its place for those; it has to leave it when they come back.
 TEST(EvictionOrderByPriority, FollowsTunablesThatWereOthersForAWhile) {
   const auto set = [](int weight) { VideoDownloadPruneStrategy::priorityWeight = weight; };
-  DiskCacheManifest manifest(std::make_unique<NoPersistence>(), std::make_shared<ManualExecutor>(),
+  DiskCacheManifest manifest(std::make_unique<MemoryPersistence>(), std::make_shared<ManualExecutor>(),
                              make(Strategy::Video));
   manifest.load();
   const auto metadata = std::make_shared<VideoDownloadExtendedMetadata>(0, VideoDownloadExtendedMetadata::ItemType(1));

@@ -26,6 +26,7 @@
 #include "LarderException.h"
 #include "host/testing/FaultyFileUtils.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 #include "support/TemporaryDirectory.h"
 #include "support/Watchdog.h"
 
@@ -71,11 +72,11 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using std::string;
+using test::Bytes;
 using test::FaultyFileUtils;
 using test::Operation;
 using testing::ElementsAre;
 using testing::UnorderedElementsAre;
-using Bytes = std::vector<unsigned char>;
 using Type = FileUtils::Type;
 
 Bytes bytes(const string& text) { return {text.begin(), text.end()}; }

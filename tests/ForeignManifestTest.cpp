@@ -25,14 +25,15 @@
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
+using test::Bytes;
+using test::kSecond;
+
 using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::SizeIs;
 using testing::StartsWith;
 
 namespace fs = std::filesystem;
-
-using Bytes = std::vector<unsigned char>;
 
 constexpr unsigned int kSeconds = 60;  // after which a call is taken for one that does not return
 

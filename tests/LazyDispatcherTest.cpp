@@ -14,15 +14,15 @@
 
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using std::string;
+using test::kSecond;
 using test::ManualExecutor;
 using test::ManualQueueFactory;
-
-constexpr std::int64_t kSecond = 1'000'000'000;
 
 // A host whose timers run although their handle is gone, as one that lost the race against the cancellation.
 class LateTimerExecutor : public AsyncExecutor {

@@ -17,10 +17,11 @@
 #include "DiskCacheManifest.h"
 #include "FileUtils.h"
 #include "PersistentKeyValueStore.h"
+#include "StoreOptions.h"
 #include "TrashCollector.h"
 #include "host/Await.h"
 #include "host/testing/ManualQueue.h"
-#include "support/FaultyManifest.h"
+#include "support/MemoryPersistence.h"
 #include "support/TemporaryDirectory.h"
 
 namespace {
@@ -96,14 +97,19 @@ class OutstandingOperations : public testing::Test {
     return bytes;
   }
 
+  std::shared_ptr<PersistentKeyValueStore> createIn(const test::TemporaryDirectory& parent) const {
+    KeyValueStoreOptions options;
+    options.directory = parent.file("store");
+    options.staleAge = 1000;
+    return PersistentKeyValueStore::create(options, {queues, trash, files, nullptr});
+  }
+
   const test::TemporaryDirectory directory;
   const std::shared_ptr<FileUtils> files = std::make_shared<FileUtils>();
   const std::shared_ptr<test::ManualQueueFactory> queues = std::make_shared<test::ManualQueueFactory>();
   const std::shared_ptr<TrashCollector> trash =
       std::make_shared<TrashCollector>(directory.file("trash"), files, nullptr, queues);
-  const std::shared_ptr<PersistentKeyValueStore> store = PersistentKeyValueStore::createPersistentKeyValueStore(
-      directory.file("store"), directory.file("tmp"), "larder", std::nullopt, 1000, false, queues, trash, nullptr,
-      nullptr, files, nullptr, 50);
+  const std::shared_ptr<PersistentKeyValueStore> store = createIn(directory);
 };
 
 TEST_F(OutstandingOperations, HoldTheirValueOnceAndLittleElse) {
@@ -125,9 +131,7 @@ TEST_F(OutstandingOperations, OfAStoreThatGoesWithItsQueueFullAreGivenBack) {
   const std::size_t before = bytesInUse;
   {
     const test::TemporaryDirectory another;
-    auto doomed = PersistentKeyValueStore::createPersistentKeyValueStore(another.file("store"), another.file("tmp"),
-                                                                         "doomed", std::nullopt, 1000, false, queues,
-                                                                         trash, nullptr, nullptr, files, nullptr, 50);
+    auto doomed = createIn(another);
     std::vector<Future<void>> futures;
     for (std::size_t i = 0; i < kOperations; ++i) {
       futures.push_back(doomed->store("key" + std::to_string(i), std::vector<unsigned char>(kValueBytes, 'x')));

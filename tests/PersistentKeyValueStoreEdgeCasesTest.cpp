@@ -21,9 +21,11 @@ namespace {
 
 using test::Bytes;
 using test::bytesOf;
+using test::Contents;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
+using test::kSecond;
 using test::ManifestCall;
 using test::ManualExecutor;
 using test::told;
@@ -32,7 +34,6 @@ using test::Written;
 using testing::ElementsAre;
 using testing::IsEmpty;
 
-using Contents = std::map<std::string, std::string>;
 using Loader = PersistentKeyValueStore::Loader;
 
 class ReservedKeys : public KeyValueStoreFixture {};

@@ -27,6 +27,7 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::bytesOf;
+using test::Contents;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
@@ -39,8 +40,6 @@ using test::Written;
 using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
-
-using Contents = std::map<std::string, std::string>;
 
 // --- Closing while writes wait ---
 

@@ -34,10 +34,12 @@ namespace {
 
 using test::Bytes;
 using test::bytesOf;
+using test::Contents;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
 using test::kInvalid;
+using test::kSecond;
 using test::LogCapture;
 using test::ManifestCall;
 using test::Operation;
@@ -48,7 +50,6 @@ using test::Written;
 using testing::ElementsAre;
 using testing::IsEmpty;
 
-using Contents = std::map<std::string, std::string>;
 using Loader = PersistentKeyValueStore::Loader;
 
 class CreatingAStore : public KeyValueStoreFixture {};
@@ -71,6 +72,31 @@ TEST_F(CreatingAStore, MakesItsDirectoryAndTheOnesAboveIt) {
   EXPECT_TRUE(std::filesystem::is_directory(path));
   EXPECT_EQ(queues->queueCount(), 1U);
   EXPECT_EQ(queues->workQueueCount(), 1U);
+}
+
+TEST_F(CreatingAStore, WithoutOptionsTakesEachArgumentInItsPlace) {
+  store = PersistentKeyValueStore::createPersistentKeyValueStore(storePath(), directory.file("temporary"), "larder", 3,
+                                                                 1000, true, queues, trash, reporter, nullptr, files,
+                                                                 options.onSizeChanged, 2);
+  settle();
+  EXPECT_EQ(store->getTemporaryDirectoryPath(), directory.file("temporary"));
+  for (const char* key : {"a", "b", "c", "d"}) {
+    put(key, "12345");
+    clock.advance(1);
+  }
+  EXPECT_EQ(contents(), (Contents{{"b", "12345"}, {"c", "12345"}, {"d", "12345"}}));
+  EXPECT_THAT(accesses(), testing::SizeIs(3));
+  EXPECT_EQ(sizes.back(), 15U);
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  store->clear(onSuccess(), onError());
+  ASSERT_TRUE(work().runNext());
+  EXPECT_EQ(store->getAllKeys().size(), 1U);  // after a batch
+  settle();
+  put("old", "value");
+  clock.advance(1001);
+  ASSERT_TRUE(fire(300));
+  settle();
+  EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
 TEST_F(CreatingAStore, ThrowsWhatCreatingTheDirectoryThrows) {
@@ -329,6 +355,19 @@ TEST_F(StoringAValue, CallsTheWriterOnTheFileQueueWithNoLockHeld) {
   EXPECT_EQ(told(written), "<done>");
 }
 
+TEST_F(StoringAValue, NeedsNoManifestThatCanTellWhatItReplaces) {
+  for (const bool inlineData : {false, true}) {
+    options.inlineData = inlineData;
+    openWatched();
+    manifest->cannotReplace = true;
+    put("key", "old");
+    put("key", "new");
+    EXPECT_EQ(get("key"), "new");
+    EXPECT_EQ(drop("key"), "<done>");
+    close();
+  }
+}
+
 TEST_F(StoringAValue, WithoutAWriterFailsAndLeavesAMiss) {
   open();
   const Written written = watch(store->store("key", nullptr, nullptr));
@@ -339,8 +378,9 @@ TEST_F(StoringAValue, WithoutAWriterFailsAndLeavesAMiss) {
 }
 
 TEST_F(StoringAValue, WorksWithoutReporterAndSizeCallback) {
-  store = PersistentKeyValueStore::createPersistentKeyValueStore(storePath(), "", "larder", std::nullopt, 10, false,
-                                                                 queues, trash, nullptr, nullptr, files, nullptr, 50);
+  reporter = nullptr;
+  options.onSizeChanged = nullptr;
+  open();
   put("key", "value");
   EXPECT_EQ(get("key"), "value");
   EXPECT_EQ(get("other"), "<miss>");

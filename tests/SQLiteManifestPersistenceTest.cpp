@@ -20,17 +20,19 @@
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
+
+using test::Bytes;
 
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::StartsWith;
 using testing::UnorderedElementsAre;
 
-using Bytes = std::vector<unsigned char>;
 using Items = std::vector<std::unique_ptr<DiskCacheItem>>;
 using ItemType = VideoDownloadExtendedMetadata::ItemType;
 

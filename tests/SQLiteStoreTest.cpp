@@ -15,18 +15,19 @@
 #include <vector>
 
 #include "LarderException.h"
+#include "support/Bytes.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
+using test::Bytes;
+
 using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
 using testing::StartsWith;
-
-using Bytes = std::vector<unsigned char>;
 
 constexpr long long mebibyte = 1024 * 1024;
 

@@ -35,9 +35,12 @@
 #include "LarderException.h"
 #include "PersistentKeyValueStore.h"
 #include "PruneStrategy.h"
+#include "StoreOptions.h"
 #include "TrashCollector.h"
 #include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
+#include "support/Bytes.h"
+#include "support/FaultyManifest.h"
 #include "support/LogCapture.h"
 #include "support/ManifestOnDisk.h"
 
@@ -46,19 +49,21 @@ namespace {
 
 namespace fs = std::filesystem;
 
+using test::Bytes;
+using test::FaultyManifest;
 using test::kManifestName;
+using test::kSecond;
 using test::LogCapture;
+using test::ManifestCall;
 using test::ManifestOnDisk;
 using test::ManualClock;
 using test::ManualExecutor;
 using test::ManualQueueFactory;
 using test::valueFiles;
 
-using Bytes = std::vector<unsigned char>;
 using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
 using ItemType = VideoDownloadExtendedMetadata::ItemType;
 
-constexpr std::int64_t kSecond = 1'000'000'000;
 constexpr std::time_t kStart = 1'700'000'000;
 const std::string kRefusal = "The queue takes no tasks.";
 
@@ -126,76 +131,18 @@ class InterruptedFileUtils final : public FileUtils {
   }
 };
 
-// --- The manifest, damaged on demand ---
-
-class CorruptibleManifest final : public DiskCacheManifestInterface {
- public:
-  using Create = std::function<std::shared_ptr<DiskCacheManifest>()>;
-
-  explicit CorruptibleManifest(Create create) : create_(std::move(create)) {}
-
-  // After so many calls that touch the disk, one finds it damaged.
-  void corruptAfter(unsigned int calls) { callsUntilCorrupt_ = calls; }
-  void heal() { callsUntilCorrupt_.reset(); }
-
-  void clear() override {
-    heal();
-    real_ == nullptr ? real()->load() : real_->clear();
-  }
-  void load() override { checked().load(); }
-  void invalidate() override { real()->invalidate(); }
-  void setItem(const DiskCacheItem& item) override { checked().setItem(item); }
-  std::unique_ptr<DiskCacheItem> getItem(const std::string& key) override { return checked().getItem(key); }
-  void updateLastAccessDate(const std::string& key) override { checked().updateLastAccessDate(key); }
-  std::optional<std::int32_t> getModificationDate(const std::string& key) override {
-    return checked().getModificationDate(key);
-  }
-  void removeItem(const std::string& key) override { checked().removeItem(key); }
-  Bytes getInlineData(const std::string& key) override { return checked().getInlineData(key); }
-  void setInlineData(const std::string& key, const Bytes& data) override { checked().setInlineData(key, data); }
-  void removeInlineData(const std::string& key) override { checked().removeInlineData(key); }
-  std::vector<DiskCacheItem> pruneToSize(std::uint32_t size, std::uint32_t count) override {
-    return checked().pruneToSize(size, count);
-  }
-  std::vector<DiskCacheItem> pruneOldEntries(long date, std::uint32_t count) override {
-    return checked().pruneOldEntries(date, count);
-  }
-  std::unique_ptr<DiskCacheItem> pruneOldestItem() override { return checked().pruneOldestItem(); }
-  std::vector<std::string> getAllKeys() override { return real()->getAllKeys(); }
-  std::uint32_t size() override { return real()->size(); }
-  std::uint32_t count() override { return real()->count(); }
-  bool isLoaded() override { return real()->isLoaded(); }
-  std::optional<ReplacedItem> replaceItem(const DiskCacheItem& item, bool withInlineData) override {
-    return checked().replaceItem(item, withInlineData);
-  }
-
- private:
-  const std::shared_ptr<DiskCacheManifest>& real() {
-    if (real_ == nullptr) real_ = create_();
-    return real_;
-  }
-  DiskCacheManifest& checked() {
-    if (!callsUntilCorrupt_ || (*callsUntilCorrupt_)-- > 0) return *real();
-    heal();
-    throw ManifestCorruptedException("Damaged for the test.", SQLITE_CORRUPT);
-  }
-
-  const Create create_;
-  std::shared_ptr<DiskCacheManifest> real_;
-  std::optional<unsigned int> callsUntilCorrupt_;
-};
-
 // --- The store under test ---
 
-struct Setup {
-  bool inlineData = false;
+struct Setup : DiskCacheOptions {
+  Setup() {
+    name = "model";
+    staleAge = 1000;
+    normalSize = 60;
+    survivalSize = 20;
+  }
+
   bool isDiskCache = false;
-  std::optional<std::uint64_t> capacity;
   PruneStrategyIdentifier strategy = PruneStrategyIdentifier::LRU;
-  unsigned int batchSize = 50;
-  long staleAge = 1000;
-  unsigned int normalSize = 60;
-  unsigned int survivalSize = 20;
 
   std::string describe() const {
     std::ostringstream text;
@@ -209,29 +156,25 @@ struct Setup {
 // One life of a store: from opening a directory to letting it go.
 class Session {
  public:
-  Session(const std::string& storePath, const std::string& trashPath, const Setup& setup, bool canBeCorrupted)
+  Session(const std::string& storePath, const std::string& trashPath, Setup setup, bool canBeCorrupted)
       : files(std::make_shared<InterruptedFileUtils>()),
         trash_(std::make_shared<TrashCollector>(trashPath, std::make_shared<FileUtils>(), nullptr, trashQueues_)) {
-    const auto strategy = PruneStrategyFactory(setup.strategy);
-    const auto metadata = std::make_shared<VideoDownloadExtendedMetadataFactory>();
-    if (canBeCorrupted) {
-      corruptible = std::make_shared<CorruptibleManifest>(
-          [queues = queues_, path = storePath + "/" + kManifestName, metadata, strategy] {
-            return DiskCacheManifest::createDiskCacheManifest(path, queues->workQueue(0), metadata, strategy);
-          });
-    }
-    const auto sizeChanged = [this](unsigned int size) { lastReportedSize = size; };
+    setup.directory = storePath;
+    setup.onSizeChanged = [this](unsigned int size) { lastReportedSize = size; };
+    if (canBeCorrupted) setup.manifest = corruptible(setup);
+    const StoreServices services{queues_, trash_, files, nullptr};
     if (setup.isDiskCache) {
-      cache = DiskCache::createDiskCache(storePath, "", "model", setup.capacity, setup.staleAge, setup.normalSize,
-                                         setup.survivalSize, setup.inlineData, queues_, metadata, trash_, strategy,
-                                         nullptr, corruptible, files, sizeChanged, setup.batchSize);
-      store = cache;
+      setup.extendedMetadataFactory = metadata_;
+      setup.pruneStrategy = PruneStrategyFactory(setup.strategy);
+      store = cache = DiskCache::create(setup, services);
     } else {
-      store = PersistentKeyValueStore::createPersistentKeyValueStore(
-          storePath, "", "model", setup.capacity, setup.staleAge, setup.inlineData, queues_, trash_, nullptr,
-          corruptible, files, sizeChanged, setup.batchSize);
+      store = PersistentKeyValueStore::create(setup, services);
     }
   }
+
+  // After so many calls that touch the disk, one finds the manifest damaged.
+  void corruptAfter(unsigned int calls) { *callsUntilCorrupt_ = calls; }
+  void heal() { callsUntilCorrupt_->reset(); }
 
   static constexpr int kFileQueue = 0;
   static constexpr int kWorkQueue = 1;
@@ -267,13 +210,31 @@ class Session {
   }
 
   std::shared_ptr<InterruptedFileUtils> files;
-  std::shared_ptr<CorruptibleManifest> corruptible;  // null: the store has made its own
   std::shared_ptr<PersistentKeyValueStore> store;
   std::shared_ptr<DiskCache> cache;  // the same, or null
   std::optional<unsigned int> lastReportedSize;
 
  private:
+  std::shared_ptr<FaultyManifest> corruptible(const Setup& setup) const {
+    auto manifest =
+        std::make_shared<FaultyManifest>([queues = queues_, path = setup.directory + "/" + kManifestName,
+                                          metadata = metadata_, strategy = PruneStrategyFactory(setup.strategy)] {
+          return DiskCacheManifest::createDiskCacheManifest(path, queues->workQueue(0), metadata, strategy);
+        });
+    manifest->onCall = [calls = callsUntilCorrupt_](ManifestCall call, const std::string&) {
+      if (call == ManifestCall::GetAllKeys || call == ManifestCall::Invalidate) return;
+      if (call != ManifestCall::Clear && (!*calls || (**calls)-- > 0)) return;
+      calls->reset();
+      if (call != ManifestCall::Clear) throw ManifestCorruptedException("Damaged for the test.", SQLITE_CORRUPT);
+    };
+    return manifest;
+  }
+
   std::shared_ptr<ManualQueueFactory> queues_ = std::make_shared<ManualQueueFactory>();
+  std::shared_ptr<std::optional<unsigned int>> callsUntilCorrupt_ =
+      std::make_shared<std::optional<unsigned int>>();  // empty: the manifest is whole
+  std::shared_ptr<VideoDownloadExtendedMetadataFactory> metadata_ =
+      std::make_shared<VideoDownloadExtendedMetadataFactory>();
   std::shared_ptr<ManualQueueFactory> trashQueues_ = std::make_shared<ManualQueueFactory>();
   std::shared_ptr<TrashCollector> trash_;
   bool isBusy_[2] = {false, false};
@@ -1104,7 +1065,7 @@ class InterleavedSequence {
     script_.say("damage the manifest");
     isLossy_ = true;
     wasCorrupted_ = true;
-    session_->corruptible->corruptAfter(script_.below(4));
+    session_->corruptAfter(script_.below(4));
   }
 
   // Exactly one of the callbacks is called, and it is the first; none, when the store goes meanwhile.
@@ -1126,7 +1087,7 @@ class InterleavedSequence {
   void restart() {
     isEnding_ = true;
     // A manifest that is damaged would be found out when it is next opened; this one is not.
-    if (session_->corruptible != nullptr) session_->corruptible->heal();
+    session_->heal();
     const unsigned int kind = script_.below(4);
     if (kind == 0) {
       script_.say("restart when all is done");
@@ -1213,7 +1174,7 @@ class InterleavedSequence {
 
   // All is done: files, records on disk and records in memory say the same, and it is what the calls asked for.
   void verify() {
-    if (session_->corruptible != nullptr) session_->corruptible->heal();  // nobody has met it
+    session_->heal();  // nobody has met it
     const auto manifest = session_->store->getManifest();
     const auto rows = ManifestOnDisk(storePath()).rows();
     const auto files = valueFiles(storePath());

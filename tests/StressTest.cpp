@@ -30,6 +30,7 @@
 #include "host/Host.h"
 #include "host/testing/RecordingAnalytics.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
 
@@ -38,10 +39,9 @@ namespace {
 
 using host::await;
 using host::Host;
+using test::Bytes;
 using test::runOnThreads;
 using test::TemporaryDirectory;
-
-using Bytes = std::vector<unsigned char>;
 
 const char* const kConfiguration = R"({
   "media": {

@@ -30,6 +30,7 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::bytesOf;
+using test::Contents;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
@@ -43,8 +44,6 @@ using test::watch;
 using test::Written;
 using testing::ElementsAre;
 using testing::IsEmpty;
-
-using Contents = std::map<std::string, std::string>;
 
 // --- The bookkeeping ---
 
@@ -425,11 +424,15 @@ struct Scenario {
 class Interleaving {
  public:
   Interleaving(const Scenario& scenario, ManualClock& clock) : scenario_(scenario), model_(scenario.before) {
-    const auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_),
-                                                              std::make_shared<test::ManualExecutor>(), nullptr);
-    store_ = DiskCache::createDiskCache("store", "", "larder", scenario.capacity, 1000, 2, 2, false, queues_, nullptr,
-                                        std::make_shared<TrashCollector>("trash", files_, nullptr, nullptr), nullptr,
-                                        nullptr, manifest, files_, nullptr, 50);
+    DiskCacheOptions options;
+    options.directory = "store";
+    options.capacity = scenario.capacity;
+    options.staleAge = 1000;
+    options.normalSize = options.survivalSize = 2;
+    options.manifest = std::make_shared<DiskCacheManifest>(std::make_unique<MemoryPersistence>(medium_),
+                                                           std::make_shared<test::ManualExecutor>(), nullptr);
+    const auto trash = std::make_shared<TrashCollector>("trash", files_, nullptr, nullptr);
+    store_ = DiskCache::create(std::move(options), {queues_, trash, files_, nullptr});
     clock.set(KeyValueStoreFixture::kStart);
     for (const auto& item : scenario.before) store_->store(item.first, bytesOf(item.second));
     for (const char* key : {"a", "b"}) {

@@ -24,8 +24,6 @@ namespace velmora::mobile::xplat::cellar::test {
 
 namespace {
 
-constexpr std::int64_t kSecond = 1'000'000'000;
-
 const char* const kConfiguration = R"({
   "media": {
     "max_size": "200B",

@@ -12,19 +12,16 @@
 
 #include "AnalyticsEventReporter.h"
 #include "host/JsonLinesAnalytics.h"
+#include "support/Bytes.h"
 
 // docs/events.md describes what the reporter really sends.
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
 
-using Json = nlohmann::json;
+using test::linesOf;
 
-std::vector<std::string> linesOf(std::istream&& text) {
-  std::vector<std::string> lines;
-  for (std::string line; std::getline(text, line);) lines.push_back(line);
-  return lines;
-}
+using Json = nlohmann::json;
 
 // One event of each kind and type, as the sink writes them.
 std::vector<Json> reportedEvents() {

@@ -14,21 +14,16 @@
 #include "JsonValue.h"
 #include "LarderException.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 namespace {
 
+using test::linesOf;
 using test::LogCapture;
 using test::TemporaryDirectory;
-
-std::vector<std::string> linesOf(const std::string& text) {
-  std::istringstream stream(text);
-  std::vector<std::string> lines;
-  for (std::string line; std::getline(stream, line);) lines.push_back(line);
-  return lines;
-}
 
 // A device with room for so many bytes; what comes after them fails.
 class SmallDisk : public std::streambuf {

@@ -23,23 +23,22 @@
 #include "Future.h"
 #include "LarderException.h"
 #include "PersistentKeyValueStore.h"
+#include "StoreOptions.h"
 #include "TrashCollector.h"
 #include "host/testing/FaultyFileUtils.h"
 #include "host/testing/ManualClock.h"
 #include "host/testing/ManualQueue.h"
 #include "host/testing/RecordingAnalytics.h"
+#include "support/Bytes.h"
 #include "support/FaultyManifest.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
+#include "support/MemoryPersistence.h"
 #include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 
-using Bytes = std::vector<unsigned char>;
 using FetchResult = PersistentKeyValueStore::FetchResult;
-
-inline Bytes bytesOf(const std::string& text) { return {text.begin(), text.end()}; }
-inline std::string textOf(const Bytes& bytes) { return {bytes.begin(), bytes.end()}; }
 
 // What an exception says; "" for none.
 inline std::string whatOf(const std::exception_ptr& failure) {
@@ -126,27 +125,25 @@ inline const std::string kInvalid =
 // A store with everything around it under the test's control: its queues, its files, its collector and the time.
 class KeyValueStoreFixture : public testing::Test {
  public:
-  static constexpr std::int64_t kSecond = 1'000'000'000;
   static constexpr std::time_t kStart = 1'000'000;
 
-  struct Options {
-    std::optional<std::uint64_t> capacity;
-    long staleAge = 1000;
-    bool inlineData = false;
-    unsigned int batchSize = 50;
-    bool hasSizeCallback = true;
-    std::shared_ptr<DiskCacheManifestInterface> manifest;
-  };
+  KeyValueStoreFixture() {
+    options.directory = storePath();
+    options.temporaryDirectory = directory.file("temporary");
+    options.name = "larder";
+    options.staleAge = 1000;
+    options.onSizeChanged = [this](unsigned int size) { sizes.push_back(size); };
+  }
 
   // --- The store's life ---
 
   // Creates the store; its loading waits on the work queue.
   void openUnloaded() {
-    std::function<void(unsigned int)> onSizeChange;
-    if (options.hasSizeCallback) onSizeChange = [this](unsigned int size) { sizes.push_back(size); };
-    store = PersistentKeyValueStore::createPersistentKeyValueStore(
-        storePath(), directory.file("temporary"), "larder", options.capacity, options.staleAge, options.inlineData,
-        queues, trash, reporter, options.manifest, files, std::move(onSizeChange), options.batchSize);
+    if (isDiskCache) {
+      store = DiskCache::create(options, services());
+    } else {
+      store = PersistentKeyValueStore::create(options, services());
+    }
   }
 
   void open() {
@@ -186,6 +183,8 @@ class KeyValueStoreFixture : public testing::Test {
     close();
     openWatched();
   }
+
+  StoreServices services() const { return {queues, trash, files, reporter}; }
 
   // --- The queues of the latest store ---
 
@@ -293,11 +292,7 @@ class KeyValueStoreFixture : public testing::Test {
     return rows;
   }
 
-  std::vector<std::string> keysInMedium() const {
-    std::vector<std::string> keys;
-    for (const auto& row : medium->rows()) keys.push_back(row.first);
-    return keys;
-  }
+  std::vector<std::string> keysInMedium() const { return medium->keys(); }
 
   // From now on every call of the watched manifest and every change or reading of the store's files, in one order, in
   // `journal`.
@@ -342,7 +337,8 @@ class KeyValueStoreFixture : public testing::Test {
     return lines;
   }
 
-  Options options;
+  bool isDiskCache = false;  // the next store
+  DiskCacheOptions options;  // of the next store
   ManualClock clock{kStart};
   TemporaryDirectory directory;
   std::shared_ptr<FaultyFileUtils> files = std::make_shared<FaultyFileUtils>();

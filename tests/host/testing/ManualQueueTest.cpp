@@ -14,14 +14,13 @@
 
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
+#include "support/Bytes.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 namespace {
 
 using std::string;
 using testing::ElementsAre;
-
-constexpr std::int64_t kSecond = 1000000000;
 
 TEST(ManualExecutor, RunsNothingUntilItIsTold) {
   ManualExecutor queue;

@@ -26,9 +26,11 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::bytesOf;
+using test::Contents;
 using test::Fetched;
 using test::KeyValueStoreFixture;
 using test::kInvalid;
+using test::kSecond;
 using test::LogCapture;
 using test::ManifestCall;
 using test::Operation;
@@ -41,7 +43,6 @@ using testing::IsEmpty;
 using testing::Not;
 using testing::UnorderedElementsAre;
 
-using Contents = std::map<std::string, std::string>;
 using Batch = std::vector<DiskCacheItem>;
 using Provider = std::function<const Batch()>;
 
@@ -296,7 +297,7 @@ TEST_F(Expiry, IsArmedThoughTheFirstLoadingCouldNotEvenPurge) {
 }
 
 TEST_F(Expiry, ComesAgainThoughTheQueueTookNoWork) {
-  options.hasSizeCallback = false;
+  options.onSizeChanged = nullptr;
   openWatched();
   work().throwOnDispatch(true);
   try {
@@ -866,17 +867,14 @@ TEST_F(SizeReport, IsSilentBeforeLoading) {
 }
 
 TEST_F(SizeReport, MayCallTheStoreAgain) {
-  std::shared_ptr<PersistentKeyValueStore>* target = &store;
   int calls = 0;
-  store = PersistentKeyValueStore::createPersistentKeyValueStore(
-      storePath(), "", "larder", std::nullopt, 10, false, queues, trash, nullptr, nullptr, files,
-      [&](unsigned int) {
-        if (++calls > 3) return;
-        (*target)->overrideConfiguration(5);
-        (*target)->reportSize();
-        watch((*target)->store("key" + std::to_string(calls), bytesOf("1")));
-      },
-      50);
+  options.onSizeChanged = [&](unsigned int) {
+    if (++calls > 3) return;
+    store->overrideConfiguration(5);
+    store->reportSize();
+    watch(store->store("key" + std::to_string(calls), bytesOf("1")));
+  };
+  open();
   put("key", "value");
   EXPECT_GT(calls, 3);
   EXPECT_EQ(get("key1"), "1");

@@ -216,16 +216,17 @@ class DamagedManifests : public KeyValueStoreFixture {
   }
 
   void openCache(bool inlineData) {
-    cache_ = DiskCache::createDiskCache(
-        storePath(), directory.file("temporary"), "larder", std::nullopt, 1000, kNormalSize, 0, inlineData, queues,
-        nullptr, trash, nullptr, nullptr, nullptr, files, [this](unsigned int size) { lastSize_ = size; }, 5);
-    store = cache_;
+    isDiskCache = true;
+    options.inlineData = inlineData;
+    options.normalSize = kNormalSize;
+    options.batchSize = 5;
+    options.onSizeChanged = [this](unsigned int size) { lastSize_ = size; };
+    openUnloaded();
     settleAll();
   }
 
   void close() {
     settleAll();
-    cache_.reset();
     KeyValueStoreFixture::close();
     queues = std::make_shared<test::ManualQueueFactory>();  // it would keep the queues of every store
   }
@@ -302,7 +303,7 @@ class DamagedManifests : public KeyValueStoreFixture {
 
   void expectPruned() {
     ending.clear();
-    cache_->pruneBackToNormal(onSuccess(), onError(), false);
+    store->pruneBackToNormal(onSuccess(), onError(), false);
     settleAll();
     EXPECT_EQ(ending, "<done>");
     EXPECT_LE(lastSize_, kNormalSize);
@@ -354,7 +355,6 @@ class DamagedManifests : public KeyValueStoreFixture {
     return found;
   }
 
-  std::shared_ptr<DiskCache> cache_;
   unsigned int lastSize_ = 0;
   int strayValues_ = 0;
   int purgesAtRestart_ = 0;

@@ -107,15 +107,15 @@ TEST_F(OperationCounts, DoNotTakeARemovalOrAClearForAnEviction) {
 }
 
 TEST_F(OperationCounts, CountWhatAPruneOfADiskCacheTakes) {
-  const auto cache =
-      DiskCache::createDiskCache(storePath(), directory.file("temporary"), "larder", {}, 1000, 20, 0, false, queues,
-                                 nullptr, trash, nullptr, reporter, nullptr, files, nullptr, 2);
-  for (const char* const key : {"a", "b", "c", "d", "e"}) cache->store(key, test::Bytes(10));
-  settle();
-  cache->pruneBackToNormal(onSuccess(), onError(), false);
+  isDiskCache = true;
+  options.normalSize = 20;
+  options.batchSize = 2;
+  open();
+  for (const char* const key : {"a", "b", "c", "d", "e"}) put(key, std::string(10, 'x'));
+  store->pruneBackToNormal(onSuccess(), onError(), false);
   settle();
   EXPECT_EQ(ending, "<done>");
-  EXPECT_EQ(cache->operationCounts().evictions, 3U);
+  EXPECT_EQ(store->operationCounts().evictions, 3U);
 }
 
 TEST_F(OperationCounts, AreThereAfterInvalidation) {

@@ -416,10 +416,8 @@ TEST_F(Invalidation, BetweenARecordAndItsFileLeavesNoRecordWithoutAFile) {
   close();
   for (const std::string key : {"fresh", "old"}) {
     InterruptedQueues between;
-    const auto interrupted = PersistentKeyValueStore::createPersistentKeyValueStore(
-        storePath(), directory.file("temporary"), "larder", std::nullopt, 1000, false,
-        std::shared_ptr<TaskQueueFactory>(&between, [](TaskQueueFactory*) {}), trash, nullptr, nullptr, files, nullptr,
-        50);
+    const std::shared_ptr<TaskQueueFactory> interruptedQueues(&between, [](TaskQueueFactory*) {});
+    const auto interrupted = PersistentKeyValueStore::create(options, {interruptedQueues, trash, files, nullptr});
     between.work->runAll();
     const Written written = watch(interrupted->store(key, bytesOf("newer")));
     between.file->beforeDispatch = [&] {

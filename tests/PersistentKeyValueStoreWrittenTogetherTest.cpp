@@ -25,6 +25,7 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::bytesOf;
+using test::Contents;
 using test::Fetched;
 using test::KeyValueStoreFixture;
 using test::Latch;
@@ -36,8 +37,6 @@ using test::watch;
 using test::Written;
 using testing::ElementsAre;
 using testing::IsEmpty;
-
-using Contents = std::map<std::string, std::string>;
 
 class WrittenTogether : public KeyValueStoreFixture {
  protected:

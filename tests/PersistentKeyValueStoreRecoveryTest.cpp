@@ -24,9 +24,11 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 using test::bytesOf;
+using test::Contents;
 using test::Fetched;
 using test::isA;
 using test::KeyValueStoreFixture;
+using test::kSecond;
 using test::LogCapture;
 using test::ManifestCall;
 using test::Operation;
@@ -35,8 +37,6 @@ using test::watch;
 using test::Written;
 using testing::ElementsAre;
 using testing::IsEmpty;
-
-using Contents = std::map<std::string, std::string>;
 
 class RecoveryFixture : public KeyValueStoreFixture {
  protected:
