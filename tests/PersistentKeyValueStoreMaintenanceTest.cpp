@@ -662,6 +662,42 @@ TEST_F(Clearing, OfAnInvalidatedStoreIsRefused) {
   EXPECT_THAT(valueFiles(), ElementsAre("key"));
 }
 
+// A clear takes the records batch by batch, but a write on its way is called off at once: its record must not stand
+// there without a file until its batch comes.
+class ClearingInBatches : public Clearing {
+ protected:
+  void SetUp() override {
+    options.batchSize = 1;
+    open();
+    putMany(2);
+    clock.advance(1);
+    const Written queued = watch(store->store("queued", bytesOf("value")));
+    ASSERT_TRUE(work().runNext());
+    store->clear(onSuccess(), onError());
+    ASSERT_TRUE(work().runNext());  // the first batch
+    file().runAll();                // the write comes by, and finds that it has been called off
+    ASSERT_EQ(told(queued), "<done>");
+    ASSERT_EQ(ending, "");
+  }
+};
+
+TEST_F(ClearingInBatches, LetsAKeyBeRemovedMeanwhile) {
+  EXPECT_EQ(drop("queued"), "<done>");
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+  EXPECT_THAT(valueFiles(), IsEmpty());
+}
+
+TEST_F(ClearingInBatches, LetsAWriteThatWasCalledOffBeAMiss) {
+  EXPECT_EQ(store->fetchModificationDate("queued"), std::nullopt);
+  EXPECT_EQ(get("queued"), "<miss>");
+  EXPECT_EQ(ending, "<done>");
+}
+
+TEST_F(ClearingInBatches, LeavesNoRecordWithoutAFileToAProcessThatIsKilledMeanwhile) {
+  for (const std::string& key : store->getAllKeys()) EXPECT_TRUE(directory.exists("store/" + key)) << key;
+}
+
 // --- Deleting in batches ---
 
 TEST_F(DeletingInBatches, DeletesBatchAfterBatchOnTheQueuesOfEach) {

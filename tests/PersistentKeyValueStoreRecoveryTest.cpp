@@ -270,6 +270,45 @@ TEST_F(ADamagedManifest, FoundByClearingIsDoneAndPurges) {
   expectPurged(log, corrupted);
 }
 
+TEST_F(ADamagedManifest, FoundByAWriteTakesAnEarlierOneOfItsKeyAlong) {
+  openWatched();
+  const Written earlier = watch(store->store("key", bytesOf("earlier")));
+  ASSERT_TRUE(work().runNext());
+  manifest->failNext(ManifestCall::SetItem, corrupted);
+  const LogCapture log;
+  const Written later = watch(store->store("key", bytesOf("later")));
+  ASSERT_TRUE(work().runNext());
+  settle();
+  EXPECT_EQ(told(earlier), "<done>");
+  EXPECT_EQ(told(later), "<done>");
+  expectPurged(log, corrupted);
+}
+
+TEST_F(ADamagedManifest, FoundByAFetchThatLostItsFileToARemovalIsAMissAndPurges) {
+  openWatched();
+  put("key", "value");
+  const Fetched fetched = watch(store->fetch("key"));
+  const Written removed = watch(store->removeItem("key"));
+  work().runAll();
+  manifest->failNext(ManifestCall::GetItem, corrupted);
+  const LogCapture log;
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_EQ(told(removed), "<done>");
+  expectPurged(log, corrupted);
+}
+
+TEST_F(ADamagedManifest, FoundByClearingCallsQueuedWritesOff) {
+  openWatched();
+  const Written written = watch(store->store("key", bytesOf("value")));
+  ASSERT_TRUE(work().runNext());
+  manifest->failNext(ManifestCall::RemoveItem, corrupted);
+  const LogCapture log;
+  EXPECT_EQ(clear(), "<done>");
+  EXPECT_EQ(told(written), "<done>");
+  expectPurged(log, corrupted);
+}
+
 TEST_F(ADamagedManifest, FoundByClearingWhatHasNoSizeIsDoneAndPurges) {
   openWatched();
   put("key", "");
