@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdint>
-#include <limits>
 #include <memory>
 #include <string>
 #include <type_traits>
@@ -36,29 +34,6 @@ TEST(DiskCacheItem, IsEmptyByDefault) {
   EXPECT_EQ(item.modificationDate, 0);
   EXPECT_EQ(item.lastAccessDate, 0);
   EXPECT_EQ(item.extendedMetadata, nullptr);
-}
-
-TEST(DiskCacheItem, TakesItsSevenValuesInOrder) {
-  int destroyed = 0;
-  const auto metadata = std::make_shared<CountedMetadata>(destroyed);
-  const DiskCacheItem item("key", "file", 3, true, 4, 5, metadata);
-  EXPECT_EQ(item.key, "key");
-  EXPECT_EQ(item.filename, "file");
-  EXPECT_EQ(item.size, 3U);
-  EXPECT_TRUE(item.hasInlineData);
-  EXPECT_EQ(item.modificationDate, 4);
-  EXPECT_EQ(item.lastAccessDate, 5);
-  EXPECT_EQ(item.extendedMetadata, metadata);
-}
-
-TEST(DiskCacheItem, HoldsTheWholeRangeOfItsNumbers) {
-  constexpr auto first = std::numeric_limits<std::int32_t>::min();
-  constexpr auto last = std::numeric_limits<std::int32_t>::max();
-  constexpr auto largest = std::numeric_limits<std::uint32_t>::max();
-  const DiskCacheItem item("key", "file", largest, false, first, last, nullptr);
-  EXPECT_EQ(item.size, largest);
-  EXPECT_EQ(item.modificationDate, first);
-  EXPECT_EQ(item.lastAccessDate, last);
 }
 
 TEST(DiskCacheItem, ACopyIsIndependentButSharesTheMetadata) {

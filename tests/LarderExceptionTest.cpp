@@ -4,7 +4,6 @@
 
 #include <climits>
 #include <exception>
-#include <memory>
 #include <stdexcept>
 #include <string>
 #include <type_traits>
@@ -52,26 +51,6 @@ TEST(LarderException, NegativeAndExtremeCodesArePrintedWithTheirSign) {
 TEST(LarderException, TheCodeIsPrintedPlainlyWhateverTheProcessLocale) {
   const test::GroupingLocale locale;
   EXPECT_STREQ(LarderException("t", "D", 1234567).what(), "domain: D; code: 1234567; description: t .");
-}
-
-TEST(LarderException, TextsAreCopiesThatOutliveTheArguments) {
-  auto description = std::make_unique<string>("description of some length, more than fits inside a string object");
-  auto domain = std::make_unique<string>("domain of some length, more than fits inside a string object");
-  const string expected = "domain: " + *domain + "; code: 3; description: " + *description + " .";
-  const LarderException exception(*description, *domain, 3);
-  description.reset();
-  domain.reset();
-  EXPECT_EQ(exception.what(), expected);
-}
-
-TEST(LarderException, ACopyKeepsItsTextsWhenTheOriginalIsGone) {
-  auto original = std::make_unique<SQLiteStoreException>("a description that does not fit inside a string object", 11);
-  const SQLiteStoreException copy(*original);
-  original.reset();
-  EXPECT_STREQ(copy.what(),
-               "domain: QZSQLiteStoreCorruptedErrorDomain; code: 11; description: a description that does not fit "
-               "inside a string object .");
-  EXPECT_STREQ(copy.description(), "a description that does not fit inside a string object");
 }
 
 TEST(LarderException, TheRuntimeErrorInsideCarriesTheDescriptionAlone) {
@@ -149,11 +128,6 @@ TEST(LarderException, CatchingABaseCatchesItsCorruptedSubclassAndNotTheReverse) 
 TEST(LarderException, FutureErrorIsNoMemberOfTheFamily) {
   EXPECT_FALSE((std::is_base_of_v<LarderException, FutureError>));
   EXPECT_TRUE((std::is_base_of_v<std::logic_error, FutureError>));
-}
-
-TEST(LarderException, ConstructionFromABareTextIsAlwaysExplicit) {
-  EXPECT_FALSE((std::is_convertible_v<string, ConfigurationException>));
-  EXPECT_FALSE((std::is_convertible_v<string, InvalidatedException>));
 }
 
 }  // namespace

@@ -9,7 +9,6 @@
 #include <string>
 
 #include "Configuration.h"
-#include "session/Invalidatable.h"
 #include "support/FakeStore.h"
 #include "support/TemporaryDirectory.h"
 
@@ -33,12 +32,6 @@ class PlainStore : public Store {
   using Store::Store;
   bool isPrunable() override { return true; }
   void invalidate() override {}
-};
-
-class Session : public session::Invalidatable {
- public:
-  void invalidate() override { over = true; }
-  bool over = false;
 };
 
 TEST(Store, KeepsThePathAsItWasGiven) {
@@ -74,20 +67,6 @@ TEST(Store, AWeakPointerAsATypeThatItIsNotIsEmpty) {
 TEST(Store, AStoreThatNoSharedPointerOwnsHasNoWeakPointer) {
   PlainStore store("/a");
   EXPECT_TRUE(store.weak_from_this<PlainStore>().expired());
-}
-
-TEST(Store, WeakPointersKeepNothingAlive) {
-  auto store = std::make_shared<PlainStore>("/a");
-  const auto weak = store->weak_from_this<PlainStore>();
-  store.reset();
-  EXPECT_TRUE(weak.expired());
-}
-
-TEST(Invalidatable, CanBeToldAndDestroyedThroughTheInterface) {
-  const auto concrete = std::make_shared<Session>();
-  const std::shared_ptr<session::Invalidatable> session = concrete;
-  session->invalidate();
-  EXPECT_TRUE(concrete->over);
 }
 
 TEST(UnmanagedStore, IsNeverPrunableNotEvenAsACache) {
