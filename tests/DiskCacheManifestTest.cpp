@@ -10,9 +10,7 @@
 #include <filesystem>
 #include <functional>
 #include <limits>
-#include <map>
 #include <memory>
-#include <mutex>
 #include <new>
 #include <optional>
 #include <random>

@@ -5,7 +5,6 @@
 
 #include <cstddef>
 #include <future>
-#include <map>
 #include <memory>
 #include <stdexcept>
 #include <string>

@@ -9,7 +9,6 @@
 #include <cstdint>
 #include <filesystem>
 #include <future>
-#include <map>
 #include <memory>
 #include <optional>
 #include <stdexcept>

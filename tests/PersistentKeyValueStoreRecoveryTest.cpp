@@ -8,7 +8,6 @@
 #include <cstddef>
 #include <filesystem>
 #include <fstream>
-#include <map>
 #include <optional>
 #include <stdexcept>
 #include <string>

@@ -12,7 +12,6 @@
 #include <functional>
 #include <future>
 #include <limits>
-#include <map>
 #include <memory>
 #include <optional>
 #include <stdexcept>

@@ -11,7 +11,6 @@
 #include <exception>
 #include <functional>
 #include <future>
-#include <map>
 #include <memory>
 #include <string>
 #include <thread>

@@ -4,8 +4,6 @@
 #include <sqlite3.h>
 
 #include <algorithm>
-#include <cstddef>
-#include <cstdint>
 #include <ctime>
 #include <exception>
 #include <functional>

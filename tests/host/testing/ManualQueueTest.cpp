@@ -3,7 +3,6 @@
 
 #include <algorithm>
 #include <atomic>
-#include <cstdint>
 #include <functional>
 #include <memory>
 #include <stdexcept>
