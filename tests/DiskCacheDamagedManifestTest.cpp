@@ -361,7 +361,7 @@ class DamagedManifests : public KeyValueStoreFixture {
   inline static bool movesToMemory_ = false;
 };
 
-class AManifestOfFiles : public DamagedManifests {
+class DiskCacheManifestOfFiles : public DamagedManifests {
  protected:
   Damages bits() { return flippedBits(closedManifest(false), "", 500); }
   Damages cuts() { return truncated(closedManifest(false), "", 150); }
@@ -375,7 +375,7 @@ class AManifestOfFiles : public DamagedManifests {
   }
 };
 
-class AManifestWithValues : public DamagedManifests {
+class DiskCacheManifestWithValues : public DamagedManifests {
  protected:
   Damages bits() { return flippedBits(closedManifest(true), "", 500); }
   Damages pages() {
@@ -387,7 +387,7 @@ class AManifestWithValues : public DamagedManifests {
   }
 };
 
-class AManifestOfTheFirstVersion : public DamagedManifests {
+class DiskCacheManifestOfTheFirstVersion : public DamagedManifests {
  protected:
   Damages all() {
     const Files sound = firstVersion();
@@ -399,7 +399,7 @@ class AManifestOfTheFirstVersion : public DamagedManifests {
 };
 
 // Another program's, or another version's.
-class AForeignManifest : public DamagedManifests {
+class DiskCacheForeignManifest : public DamagedManifests {
  protected:
   Damages all() {
     Damages damages;
@@ -439,7 +439,7 @@ class AForeignManifest : public DamagedManifests {
 };
 
 // Copied while it was in use, as a backup does that knows nothing of databases; and the companions damaged or lost.
-class AManifestInUse : public DamagedManifests {
+class DiskCacheManifestInUse : public DamagedManifests {
  protected:
   Damages all() {
     const Files sound = openManifest();
@@ -475,16 +475,16 @@ class AManifestInUse : public DamagedManifests {
   }
 };
 
-TEST_F(AManifestOfFiles, WithAFlippedBitLeavesAWorkingStore) { tryAll(bits(), false); }
-TEST_F(AManifestOfFiles, CutShortLeavesAWorkingStore) { tryAll(cuts(), false); }
-TEST_F(AManifestOfFiles, WithAnotherHeaderLeavesAWorkingStore) { tryAll(header(), false); }
-TEST_F(AManifestOfFiles, WithLostOrSwappedPagesLeavesAWorkingStore) { tryAll(pages(), false); }
-TEST_F(AManifestWithValues, WithAFlippedBitLeavesAWorkingStore) { tryAll(bits(), true); }
-TEST_F(AManifestWithValues, WithLostOrSwappedPagesLeavesAWorkingStore) { tryAll(pages(), true); }
-TEST_F(AManifestOfTheFirstVersion, DamagedLeavesAWorkingStore) { tryAll(all(), false); }
-TEST_F(AForeignManifest, LeavesAWorkingStore) { tryAll(all(), false); }
-TEST_F(AManifestInUse, CopiedInPartsLeavesAWorkingStore) { tryAll(all(), false); }
-TEST_F(AManifestInUse, WithStrangeCompanionsLeavesAWorkingStore) { tryAll(strangers(), false); }
+TEST_F(DiskCacheManifestOfFiles, WithAFlippedBitLeavesAWorkingStore) { tryAll(bits(), false); }
+TEST_F(DiskCacheManifestOfFiles, CutShortLeavesAWorkingStore) { tryAll(cuts(), false); }
+TEST_F(DiskCacheManifestOfFiles, WithAnotherHeaderLeavesAWorkingStore) { tryAll(header(), false); }
+TEST_F(DiskCacheManifestOfFiles, WithLostOrSwappedPagesLeavesAWorkingStore) { tryAll(pages(), false); }
+TEST_F(DiskCacheManifestWithValues, WithAFlippedBitLeavesAWorkingStore) { tryAll(bits(), true); }
+TEST_F(DiskCacheManifestWithValues, WithLostOrSwappedPagesLeavesAWorkingStore) { tryAll(pages(), true); }
+TEST_F(DiskCacheManifestOfTheFirstVersion, DamagedLeavesAWorkingStore) { tryAll(all(), false); }
+TEST_F(DiskCacheForeignManifest, LeavesAWorkingStore) { tryAll(all(), false); }
+TEST_F(DiskCacheManifestInUse, CopiedInPartsLeavesAWorkingStore) { tryAll(all(), false); }
+TEST_F(DiskCacheManifestInUse, WithStrangeCompanionsLeavesAWorkingStore) { tryAll(strangers(), false); }
 
 }  // namespace
 }  // namespace velmora::mobile::xplat::cellar

@@ -323,7 +323,7 @@ TEST_F(DiskCacheManifestTest, AnInlineValueSetWhileALoadIsUnderWayIsFoundAfterwa
 }
 
 // Another thread's call begins while a load is reading, and gets no further before that is done.
-class HeldOffByALoad : public DiskCacheManifestTest {
+class DiskCacheManifestHeldOffByALoad : public DiskCacheManifestTest {
  protected:
   void expectHeldOff(const std::string& operation, const std::function<void()>& call) {
     medium_->put(item("a", 7, 1));
@@ -350,13 +350,13 @@ class HeldOffByALoad : public DiskCacheManifestTest {
   }
 };
 
-TEST_F(HeldOffByALoad, AClearWaits) {
+TEST_F(DiskCacheManifestHeldOffByALoad, AClearWaits) {
   expectHeldOff("clearItems", [&] { manifest_->clear(); });
   EXPECT_EQ(manifest_->count(), 0U);
   EXPECT_EQ(manifest_->size(), 0U);
 }
 
-TEST_F(HeldOffByALoad, ARemovalWaitsSoThatTheKeyDoesNotComeBack) {
+TEST_F(DiskCacheManifestHeldOffByALoad, ARemovalWaitsSoThatTheKeyDoesNotComeBack) {
   expectHeldOff("removeItem", [&] { manifest_->removeItem("a"); });
   EXPECT_EQ(manifest_->getItem("a"), nullptr);
   EXPECT_EQ(manifest_->size(), 9U);
@@ -1028,7 +1028,7 @@ TEST_F(DiskCacheManifestFlush, ThatWasQueuedBeforeTheTimersFailedMayStillSucceed
 
 // --- What becomes of waiting dates ---
 
-class WaitingDates : public DiskCacheManifestTest {
+class DiskCacheManifestWaitingDates : public DiskCacheManifestTest {
  protected:
   // Items "0" and "1" of 1000 and 1001, used at 5000 and not written yet.
   void SetUp() override {
@@ -1045,45 +1045,45 @@ class WaitingDates : public DiskCacheManifestTest {
   ManualClock clock_{5000};
 };
 
-TEST_F(WaitingDates, SettingTheItemDropsIts) {
+TEST_F(DiskCacheManifestWaitingDates, SettingTheItemDropsIts) {
   manifest_->setItem(item("0", 1, 4000));
   EXPECT_THAT(flushed(), ElementsAre("1"));
   EXPECT_EQ(medium_->accessDate("0"), 4000);
   EXPECT_EQ(manifest_->getItem("0")->lastAccessDate, 4000);
 }
 
-TEST_F(WaitingDates, RemovingTheItemDropsItsSoThatALaterItemOfThatKeyKeepsItsOwn) {
+TEST_F(DiskCacheManifestWaitingDates, RemovingTheItemDropsItsSoThatALaterItemOfThatKeyKeepsItsOwn) {
   manifest_->removeItem("0");
   medium_->put(item("0", 1, 77));
   EXPECT_THAT(flushed(), ElementsAre("1"));
   EXPECT_EQ(medium_->accessDate("0"), 77);
 }
 
-TEST_F(WaitingDates, ClearingDropsAll) {
+TEST_F(DiskCacheManifestWaitingDates, ClearingDropsAll) {
   manifest_->clear();
   EXPECT_THAT(flushed(), IsEmpty());
 }
 
-TEST_F(WaitingDates, PruningDropsThoseOfWhatGoes) {
+TEST_F(DiskCacheManifestWaitingDates, PruningDropsThoseOfWhatGoes) {
   manifest_->setItem(item("2", 1, 1));
   manifest_->pruneToSize(0, kMany);
   EXPECT_THAT(flushed(), IsEmpty());
 }
 
-TEST_F(WaitingDates, WhenSettingTheItemFailsItsWaitsOn) {
+TEST_F(DiskCacheManifestWaitingDates, WhenSettingTheItemFailsItsWaitsOn) {
   medium_->fail("setItem");
   EXPECT_THROW(manifest_->setItem(item("0", 1, 4000)), ManifestPersistenceException);
   EXPECT_THAT(flushed(), UnorderedElementsAre("0", "1"));
 }
 
-TEST_F(WaitingDates, DestroyingTheManifestWritesThem) {
+TEST_F(DiskCacheManifestWaitingDates, DestroyingTheManifestWritesThem) {
   manifest_.reset();
   EXPECT_THAT(medium_->calls("updateLastAccessDate"), UnorderedElementsAre("0", "1"));
   EXPECT_EQ(medium_->accessDate("0"), 5000);
   EXPECT_EQ(medium_->accessDate("1"), 5000);
 }
 
-TEST_F(WaitingDates, DestroyingTheManifestOnAFullMediumIsOneErrorLine) {
+TEST_F(DiskCacheManifestWaitingDates, DestroyingTheManifestOnAFullMediumIsOneErrorLine) {
   medium_->fail("updateLastAccessDate");
   const LogCapture log;
   manifest_.reset();
@@ -1091,7 +1091,7 @@ TEST_F(WaitingDates, DestroyingTheManifestOnAFullMediumIsOneErrorLine) {
   EXPECT_TRUE(log.contains("The medium is full."));
 }
 
-TEST_F(WaitingDates, OfATaskThatHasNotRunDoNotTurnBackTheDateOfAnItemThatIsSetMeanwhile) {
+TEST_F(DiskCacheManifestWaitingDates, OfATaskThatHasNotRunDoNotTurnBackTheDateOfAnItemThatIsSetMeanwhile) {
   for (int i = 2; i < 513; ++i) manifest_->setItem(item(std::to_string(i), 1, 1000));
   use(513);
   ASSERT_EQ(executor_->pending(), 1U);
@@ -1102,7 +1102,7 @@ TEST_F(WaitingDates, OfATaskThatHasNotRunDoNotTurnBackTheDateOfAnItemThatIsSetMe
   EXPECT_EQ(medium_->accessDate("1"), 5000);
 }
 
-TEST_F(WaitingDates, ThatCouldNotBeWrittenDoNotTurnBackTheDateOfAnItemThatWasSetMeanwhile) {
+TEST_F(DiskCacheManifestWaitingDates, ThatCouldNotBeWrittenDoNotTurnBackTheDateOfAnItemThatWasSetMeanwhile) {
   medium_->onCall = [&](const std::string& operation, const std::string& key) {
     if (operation != "updateLastAccessDate") return;
     medium_->fail("updateLastAccessDate");
@@ -1346,7 +1346,7 @@ TEST_F(DiskCacheManifestTest, BothConfiguredStrategiesAndNoneOrderByDateWithTheD
   }
 }
 
-class WeightedVideo : public DiskCacheManifestTest {
+class DiskCacheManifestWeightedVideo : public DiskCacheManifestTest {
  protected:
   void SetUp() override {
     VideoDownloadPruneStrategy::priorityWeight = 100;
@@ -1361,7 +1361,7 @@ class WeightedVideo : public DiskCacheManifestTest {
   }
 };
 
-TEST_F(WeightedVideo, EarlyChunksAreKeptLonger) {
+TEST_F(DiskCacheManifestWeightedVideo, EarlyChunksAreKeptLonger) {
   createLoaded(PruneStrategyFactory(PruneStrategyIdentifier::VideoDownload));
   manifest_->setItem(item("early", 1, 1000, chunk(10)));
   manifest_->setItem(item("late", 1, 1050, chunk(11)));
@@ -1369,7 +1369,7 @@ TEST_F(WeightedVideo, EarlyChunksAreKeptLonger) {
   EXPECT_THAT(keysOf(manifest_->pruneToSize(0, kMany)), ElementsAre("late", "early", "latest"));
 }
 
-TEST_F(WeightedVideo, ExpiryAndTheOldestItemGoByDateAloneWhateverTheStrategy) {
+TEST_F(DiskCacheManifestWeightedVideo, ExpiryAndTheOldestItemGoByDateAloneWhateverTheStrategy) {
   createLoaded(PruneStrategyFactory(PruneStrategyIdentifier::VideoDownload));
   manifest_->setItem(item("early", 1, 1000, chunk(10)));
   manifest_->setItem(item("late", 1, 1050, chunk(11)));
@@ -1379,7 +1379,7 @@ TEST_F(WeightedVideo, ExpiryAndTheOldestItemGoByDateAloneWhateverTheStrategy) {
 }
 
 // With a weight, video items go by their weighted dates among themselves and by plain dates beside others: circles.
-TEST_F(WeightedVideo, ItemsWithoutMetadataAmongTheOthersAreStillPrunedOnceEach) {
+TEST_F(DiskCacheManifestWeightedVideo, ItemsWithoutMetadataAmongTheOthersAreStillPrunedOnceEach) {
   createLoaded(PruneStrategyFactory(PruneStrategyIdentifier::VideoDownload));
   std::mt19937 random(7);
   for (int i = 0; i < 300; ++i) {
@@ -1398,7 +1398,7 @@ TEST_F(WeightedVideo, ItemsWithoutMetadataAmongTheOthersAreStillPrunedOnceEach) 
   EXPECT_EQ(manifest_->size(), 0U);
 }
 
-class SenselessOrder : public DiskCacheManifestTest, public testing::WithParamInterface<int> {
+class DiskCacheManifestSenselessOrder : public DiskCacheManifestTest, public testing::WithParamInterface<int> {
  protected:
   std::shared_ptr<PruneStrategyBase> order() {
     switch (GetParam()) {
@@ -1417,7 +1417,7 @@ class SenselessOrder : public DiskCacheManifestTest, public testing::WithParamIn
   std::mt19937 random_{11};
 };
 
-TEST_P(SenselessOrder, EveryItemIsPrunedOnceAndTheTotalIsRight) {
+TEST_P(DiskCacheManifestSenselessOrder, EveryItemIsPrunedOnceAndTheTotalIsRight) {
   for (const int count : {1, 2, 3, 16, 17, 100, 500}) {
     createLoaded(order());
     fill(count, 3);
@@ -1434,7 +1434,7 @@ TEST_P(SenselessOrder, EveryItemIsPrunedOnceAndTheTotalIsRight) {
   }
 }
 
-TEST_P(SenselessOrder, PruningStopsAtTheSizeAllTheSame) {
+TEST_P(DiskCacheManifestSenselessOrder, PruningStopsAtTheSizeAllTheSame) {
   createLoaded(order());
   fill(100, 3);
   EXPECT_THAT(manifest_->pruneToSize(120, kMany), SizeIs(60));
@@ -1442,7 +1442,7 @@ TEST_P(SenselessOrder, PruningStopsAtTheSizeAllTheSame) {
   expectConsistent();
 }
 
-INSTANTIATE_TEST_SUITE_P(DiskCacheManifest, SenselessOrder, testing::Range(0, 4));
+INSTANTIATE_TEST_SUITE_P(DiskCacheManifest, DiskCacheManifestSenselessOrder, testing::Range(0, 4));
 
 // --- Pruning old entries ---
 

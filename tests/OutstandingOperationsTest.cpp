@@ -71,9 +71,9 @@ namespace {
 constexpr std::size_t kOperations = 10'000;
 constexpr std::size_t kValueBytes = 4096;
 
-class OutstandingOperations : public testing::Test {
+class PersistentKeyValueStoreOutstandingOperations : public testing::Test {
  protected:
-  OutstandingOperations() { queues->runAll(); }
+  PersistentKeyValueStoreOutstandingOperations() { queues->runAll(); }
 
   // What each of many calls holds until the queues get to it, and that nothing stays behind.
   template <class Call> std::size_t bytesOfACall(const char* name, Call call) {
@@ -112,14 +112,14 @@ class OutstandingOperations : public testing::Test {
   const std::shared_ptr<PersistentKeyValueStore> store = createIn(directory);
 };
 
-TEST_F(OutstandingOperations, HoldTheirValueOnceAndLittleElse) {
+TEST_F(PersistentKeyValueStoreOutstandingOperations, HoldTheirValueOnceAndLittleElse) {
   const std::vector<unsigned char> value(kValueBytes, 'x');
   const std::size_t bytes = bytesOfACall("store", [&](const std::string& key) { return store->store(key, value); });
   EXPECT_GE(bytes, kValueBytes);
   EXPECT_LE(bytes, kValueBytes + 1536);
 }
 
-TEST_F(OutstandingOperations, ThatBringNoValueAreSmall) {
+TEST_F(PersistentKeyValueStoreOutstandingOperations, ThatBringNoValueAreSmall) {
   EXPECT_LE(bytesOfACall("fetch", [&](const std::string& key) { return store->fetch(key); }), 1024U);
   EXPECT_LE(bytesOfACall("removeItem", [&](const std::string& key) { return store->removeItem(key); }), 1024U);
   EXPECT_LE(
@@ -127,7 +127,7 @@ TEST_F(OutstandingOperations, ThatBringNoValueAreSmall) {
       1024U);
 }
 
-TEST_F(OutstandingOperations, OfAStoreThatGoesWithItsQueueFullAreGivenBack) {
+TEST_F(PersistentKeyValueStoreOutstandingOperations, OfAStoreThatGoesWithItsQueueFullAreGivenBack) {
   const std::size_t before = bytesInUse;
   {
     const test::TemporaryDirectory another;
@@ -145,7 +145,7 @@ TEST_F(OutstandingOperations, OfAStoreThatGoesWithItsQueueFullAreGivenBack) {
 }
 
 // Of an item with a key of 24 characters, when a manifest is loaded and when another item has come to it.
-TEST(ItemsInMemory, AreSmall) {
+TEST(DiskCacheManifestItemsInMemory, AreSmall) {
   constexpr std::size_t items = 10'000;
   constexpr std::size_t longest = 24;
   constexpr std::size_t most = sizeof(void*) == 4 ? 110 : 200;

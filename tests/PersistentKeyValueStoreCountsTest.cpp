@@ -13,7 +13,7 @@ using test::KeyValueStoreFixture;
 using test::told;
 using test::watch;
 
-class OperationCounts : public KeyValueStoreFixture {
+class PersistentKeyValueStoreOperationCounts : public KeyValueStoreFixture {
  protected:
   // "hits misses stores evictions"
   std::string counts() const {
@@ -23,7 +23,7 @@ class OperationCounts : public KeyValueStoreFixture {
   }
 };
 
-TEST_F(OperationCounts, BeginAtNothingWithEveryStart) {
+TEST_F(PersistentKeyValueStoreOperationCounts, BeginAtNothingWithEveryStart) {
   open();
   EXPECT_EQ(counts(), "0 0 0 0");
   put("key", "value");
@@ -31,7 +31,7 @@ TEST_F(OperationCounts, BeginAtNothingWithEveryStart) {
   EXPECT_EQ(counts(), "0 0 0 0");
 }
 
-TEST_F(OperationCounts, TellHitsFromMisses) {
+TEST_F(PersistentKeyValueStoreOperationCounts, TellHitsFromMisses) {
   open();
   put("key", "value");
   get("key");
@@ -40,7 +40,7 @@ TEST_F(OperationCounts, TellHitsFromMisses) {
   EXPECT_EQ(counts(), "2 1 1 0");
 }
 
-TEST_F(OperationCounts, CountASearchForSeveralKeysOnceAndOneForNoneNotAtAll) {
+TEST_F(PersistentKeyValueStoreOperationCounts, CountASearchForSeveralKeysOnceAndOneForNoneNotAtAll) {
   open();
   put("b", "value");
   const auto found = watch(store->fetchFirst({"a", "b"}, answering("value")));
@@ -51,7 +51,7 @@ TEST_F(OperationCounts, CountASearchForSeveralKeysOnceAndOneForNoneNotAtAll) {
   EXPECT_EQ(counts(), "1 1 1 0");
 }
 
-TEST_F(OperationCounts, CountAHitWhoseFileHasGone) {
+TEST_F(PersistentKeyValueStoreOperationCounts, CountAHitWhoseFileHasGone) {
   open();
   put("key", "value");
   files->deleteFile(pathOf("key"));
@@ -59,7 +59,7 @@ TEST_F(OperationCounts, CountAHitWhoseFileHasGone) {
   EXPECT_EQ(counts(), "1 0 1 0");
 }
 
-TEST_F(OperationCounts, CountWhatWasWrittenAndNotWhatFailed) {
+TEST_F(PersistentKeyValueStoreOperationCounts, CountWhatWasWrittenAndNotWhatFailed) {
   for (const bool inlineData : {false, true}) {
     options.inlineData = inlineData;
     open();
@@ -77,7 +77,7 @@ TEST_F(OperationCounts, CountWhatWasWrittenAndNotWhatFailed) {
   EXPECT_EQ(counts(), "0 0 0 0");
 }
 
-TEST_F(OperationCounts, CountWhatGoesForTheCapacity) {
+TEST_F(PersistentKeyValueStoreOperationCounts, CountWhatGoesForTheCapacity) {
   for (const bool inlineData : {false, true}) {
     options.inlineData = inlineData;
     options.capacity = 3;
@@ -89,7 +89,7 @@ TEST_F(OperationCounts, CountWhatGoesForTheCapacity) {
   }
 }
 
-TEST_F(OperationCounts, CountWhatExpires) {
+TEST_F(PersistentKeyValueStoreOperationCounts, CountWhatExpires) {
   open();
   putMany(3);
   clock.advance(1001);
@@ -98,7 +98,7 @@ TEST_F(OperationCounts, CountWhatExpires) {
   EXPECT_EQ(counts(), "0 0 3 3");
 }
 
-TEST_F(OperationCounts, DoNotTakeARemovalOrAClearForAnEviction) {
+TEST_F(PersistentKeyValueStoreOperationCounts, DoNotTakeARemovalOrAClearForAnEviction) {
   open();
   putMany(3);
   drop("key0");
@@ -106,7 +106,7 @@ TEST_F(OperationCounts, DoNotTakeARemovalOrAClearForAnEviction) {
   EXPECT_EQ(counts(), "0 0 3 0");
 }
 
-TEST_F(OperationCounts, CountWhatAPruneOfADiskCacheTakes) {
+TEST_F(PersistentKeyValueStoreOperationCounts, CountWhatAPruneOfADiskCacheTakes) {
   isDiskCache = true;
   options.normalSize = 20;
   options.batchSize = 2;
@@ -118,7 +118,7 @@ TEST_F(OperationCounts, CountWhatAPruneOfADiskCacheTakes) {
   EXPECT_EQ(store->operationCounts().evictions, 3U);
 }
 
-TEST_F(OperationCounts, AreThereAfterInvalidation) {
+TEST_F(PersistentKeyValueStoreOperationCounts, AreThereAfterInvalidation) {
   open();
   put("key", "value");
   auto future = store->invalidateWithFuture();

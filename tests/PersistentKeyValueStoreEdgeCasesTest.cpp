@@ -35,14 +35,14 @@ using testing::IsEmpty;
 
 using Loader = PersistentKeyValueStore::Loader;
 
-class ReservedKeys : public KeyValueStoreFixture {};
-class HostileKeys : public KeyValueStoreFixture {};
-class AGoneStore : public KeyValueStoreFixture {};
-class AFailingQueue : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreReservedKeys : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreHostileKeys : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreGone : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreFailingQueue : public KeyValueStoreFixture {};
 
 // --- Reserved keys ---
 
-TEST_F(ReservedKeys, FailEveryOperationOfAStoreWithFilesAndTouchNothing) {
+TEST_F(PersistentKeyValueStoreReservedKeys, FailEveryOperationOfAStoreWithFilesAndTouchNothing) {
   open();
   put("key", "value");
   const std::string before = directory.read("store/manifest_v1.sqlite");
@@ -84,7 +84,7 @@ TEST_F(ReservedKeys, FailEveryOperationOfAStoreWithFilesAndTouchNothing) {
   EXPECT_EQ(contents(), (Contents{{"key", "value"}}));
 }
 
-TEST_F(ReservedKeys, AreThoseNamesAloneAndNotTheirNeighbours) {
+TEST_F(PersistentKeyValueStoreReservedKeys, AreThoseNamesAloneAndNotTheirNeighbours) {
   open();
   for (const std::string key : {"manifest_v1.sqlit", "manifest_v1.sqlite-", "manifest_v1.sqlite-walnut",
                                 "Manifest_v1.sqlite", "_cellar_extended_attribute"}) {
@@ -95,7 +95,7 @@ TEST_F(ReservedKeys, AreThoseNamesAloneAndNotTheirNeighbours) {
 
 // --- Hostile keys ---
 
-TEST_F(HostileKeys, ThatNameADirectoryFailAndLeaveNothing) {
+TEST_F(PersistentKeyValueStoreHostileKeys, ThatNameADirectoryFailAndLeaveNothing) {
   open();
   directory.write("store/sub/file", "kept");
   for (const std::string key : {"", ".", "..", "sub", "sub/"}) {
@@ -111,7 +111,7 @@ TEST_F(HostileKeys, ThatNameADirectoryFailAndLeaveNothing) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(HostileKeys, WithASlashAddressFilesBelow) {
+TEST_F(PersistentKeyValueStoreHostileKeys, WithASlashAddressFilesBelow) {
   open();
   const Written refused = watch(store->store("a/b", bytesOf("value")));
   settle();
@@ -125,7 +125,7 @@ TEST_F(HostileKeys, WithASlashAddressFilesBelow) {
   EXPECT_FALSE(directory.exists("store/a/b"));
 }
 
-TEST_F(HostileKeys, WithTwoDotsReachOutsideTheStore) {
+TEST_F(PersistentKeyValueStoreHostileKeys, WithTwoDotsReachOutsideTheStore) {
   open();
   directory.write("neighbour/secret", "value");
   put("../neighbour/secret", "replaced");
@@ -134,7 +134,7 @@ TEST_F(HostileKeys, WithTwoDotsReachOutsideTheStore) {
   EXPECT_FALSE(directory.exists("neighbour/secret"));
 }
 
-TEST_F(HostileKeys, ThatAreTooLongForAFileNameFailAndTheLongestWorks) {
+TEST_F(PersistentKeyValueStoreHostileKeys, ThatAreTooLongForAFileNameFailAndTheLongestWorks) {
   open();
   const std::string longest(255, 'x');
   put(longest, "value");
@@ -149,7 +149,7 @@ TEST_F(HostileKeys, ThatAreTooLongForAFileNameFailAndTheLongestWorks) {
   EXPECT_EQ(rowsOnDisk().size(), 1U);
 }
 
-TEST_F(HostileKeys, ThatAreNotUtf8Work) {
+TEST_F(PersistentKeyValueStoreHostileKeys, ThatAreNotUtf8Work) {
   open();
   const std::string key = "\xff\xfe\x80'; DROP TABLE LarderManifest; --%s\n";
   put(key, "value");
@@ -160,7 +160,7 @@ TEST_F(HostileKeys, ThatAreNotUtf8Work) {
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(HostileKeys, WithAZeroByteLeaveOtherKeysAndTheManifestAlone) {
+TEST_F(PersistentKeyValueStoreHostileKeys, WithAZeroByteLeaveOtherKeysAndTheManifestAlone) {
   open();
   put("a", "1");
   watch(store->store(std::string("a\0b", 3), bytesOf("other")));
@@ -174,7 +174,7 @@ TEST_F(HostileKeys, WithAZeroByteLeaveOtherKeysAndTheManifestAlone) {
 
 // --- A store that has gone ---
 
-TEST_F(AGoneStore, FulfilsWhatWaitsOnItsWorkQueueAndDoesNothing) {
+TEST_F(PersistentKeyValueStoreGone, FulfilsWhatWaitsOnItsWorkQueueAndDoesNothing) {
   openWatched();
   put("key", "value");
   manifest->clearTrace();
@@ -192,7 +192,7 @@ TEST_F(AGoneStore, FulfilsWhatWaitsOnItsWorkQueueAndDoesNothing) {
   EXPECT_THAT(accesses(), IsEmpty());
 }
 
-TEST_F(AGoneStore, FulfilsInlineWritesAndWritesNothing) {
+TEST_F(PersistentKeyValueStoreGone, FulfilsInlineWritesAndWritesNothing) {
   options.inlineData = true;
   openWatched();
   const Written written = watch(store->store("key", bytesOf("x")));
@@ -202,7 +202,7 @@ TEST_F(AGoneStore, FulfilsInlineWritesAndWritesNothing) {
   EXPECT_THAT(keysInMedium(), IsEmpty());
 }
 
-TEST_F(AGoneStore, LeavesNoProvisionalRecordOfAWriteThatHasNotBegun) {
+TEST_F(PersistentKeyValueStoreGone, LeavesNoProvisionalRecordOfAWriteThatHasNotBegun) {
   open();
   bool called = false;
   const Written written = watch(store->store("key", nullptr, [&](const std::string&) {
@@ -218,7 +218,7 @@ TEST_F(AGoneStore, LeavesNoProvisionalRecordOfAWriteThatHasNotBegun) {
   EXPECT_FALSE(called);
 }
 
-TEST_F(AGoneStore, AnswersAFetchThatWaitsForItsFileWithNothing) {
+TEST_F(PersistentKeyValueStoreGone, AnswersAFetchThatWaitsForItsFileWithNothing) {
   open();
   put("key", "value");
   const Fetched fetched = watch(store->fetch("key"));
@@ -230,7 +230,7 @@ TEST_F(AGoneStore, AnswersAFetchThatWaitsForItsFileWithNothing) {
   EXPECT_THAT(files->trace(), IsEmpty());
 }
 
-TEST_F(AGoneStore, IsKeptAliveByATaskThatRuns) {
+TEST_F(PersistentKeyValueStoreGone, IsKeptAliveByATaskThatRuns) {
   open();
   const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
     store.reset();
@@ -243,7 +243,7 @@ TEST_F(AGoneStore, IsKeptAliveByATaskThatRuns) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(AGoneStore, LoadsNothingAndTellsNoSize) {
+TEST_F(PersistentKeyValueStoreGone, LoadsNothingAndTellsNoSize) {
   openWatchedUnloaded();
   store.reset();
   settle();
@@ -257,7 +257,7 @@ TEST_F(AGoneStore, LoadsNothingAndTellsNoSize) {
   EXPECT_THAT(sizes, IsEmpty());
 }
 
-TEST_F(AGoneStore, CancelsItsTimer) {
+TEST_F(PersistentKeyValueStoreGone, CancelsItsTimer) {
   openWatched();
   ManualExecutor& queue = work();
   EXPECT_THAT(queue.armedDelays(), ElementsAre(300 * kSecond));
@@ -267,7 +267,7 @@ TEST_F(AGoneStore, CancelsItsTimer) {
 
 // --- Queues that fail ---
 
-TEST_F(AFailingQueue, ThatDropsItsTasksBreaksTheirPromises) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatDropsItsTasksBreaksTheirPromises) {
   open();
   put("key", "value");
   const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))), watch(store->removeItem("key")),
@@ -282,7 +282,7 @@ TEST_F(AFailingQueue, ThatDropsItsTasksBreaksTheirPromises) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(AFailingQueue, ThatDropsTheReadingBreaksTheFetch) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatDropsTheReadingBreaksTheFetch) {
   open();
   put("key", "value");
   const Fetched fetched = watch(store->fetch("key"));
@@ -292,7 +292,7 @@ TEST_F(AFailingQueue, ThatDropsTheReadingBreaksTheFetch) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(AFailingQueue, ThatDropsAWriteLeavesNoRecordWithoutAFile) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatDropsAWriteLeavesNoRecordWithoutAFile) {
   open();
   const Written written = watch(store->store("key", bytesOf("value")));
   ASSERT_TRUE(work().runNext());
@@ -303,7 +303,7 @@ TEST_F(AFailingQueue, ThatDropsAWriteLeavesNoRecordWithoutAFile) {
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(AFailingQueue, ThatDroppedAWriteOnceDoesNotCostALaterValueOfTheKey) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatDroppedAWriteOnceDoesNotCostALaterValueOfTheKey) {
   open();
   watch(store->store("key", bytesOf("first")));
   ASSERT_TRUE(work().runNext());
@@ -313,7 +313,7 @@ TEST_F(AFailingQueue, ThatDroppedAWriteOnceDoesNotCostALaterValueOfTheKey) {
   EXPECT_EQ(get("key"), "second");
 }
 
-TEST_F(AFailingQueue, ThatDroppedAWriteOnceDoesNotKeepALaterRemovalFromTheFile) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatDroppedAWriteOnceDoesNotKeepALaterRemovalFromTheFile) {
   open();
   watch(store->store("key", bytesOf("first")));
   ASSERT_TRUE(work().runNext());
@@ -324,7 +324,7 @@ TEST_F(AFailingQueue, ThatDroppedAWriteOnceDoesNotKeepALaterRemovalFromTheFile) 
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(AFailingQueue, ThatTakesNoWorkFailsTheFuturesAndThrowsNothing) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatTakesNoWorkFailsTheFuturesAndThrowsNothing) {
   open();
   put("key", "value");
   work().throwOnDispatch(true);
@@ -338,7 +338,7 @@ TEST_F(AFailingQueue, ThatTakesNoWorkFailsTheFuturesAndThrowsNothing) {
   EXPECT_EQ(contents(), (Contents{{"key", "value"}}));
 }
 
-TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsAFirstWriteAndLeavesAMiss) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatTakesNoFileWorkFailsAFirstWriteAndLeavesAMiss) {
   open();
   file().throwOnDispatch(true);
   const Written written = watch(store->store("key", bytesOf("x")));
@@ -351,7 +351,7 @@ TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsAFirstWriteAndLeavesAMiss) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsAnOverwriteAndLeavesNoFileWithoutARecord) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatTakesNoFileWorkFailsAnOverwriteAndLeavesNoFileWithoutARecord) {
   open();
   put("key", "old");
   file().throwOnDispatch(true);
@@ -362,7 +362,7 @@ TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsAnOverwriteAndLeavesNoFileWithoutA
   EXPECT_EQ(valueFiles().size(), rowsOnDisk().size());
 }
 
-TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsTheFetch) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatTakesNoFileWorkFailsTheFetch) {
   open();
   put("key", "value");
   file().throwOnDispatch(true);
@@ -373,7 +373,7 @@ TEST_F(AFailingQueue, ThatTakesNoFileWorkFailsTheFetch) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(AFailingQueue, ThatTakesNoEvictionLeavesNoFileWithoutARecord) {
+TEST_F(PersistentKeyValueStoreFailingQueue, ThatTakesNoEvictionLeavesNoFileWithoutARecord) {
   options.capacity = 1;
   open();
   put("old", "value");

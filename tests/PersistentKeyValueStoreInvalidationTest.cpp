@@ -71,7 +71,7 @@ class AnyOrderQueues : public test::ManualQueueFactory {
   };
 };
 
-class Invalidation : public KeyValueStoreFixture {
+class PersistentKeyValueStoreInvalidation : public KeyValueStoreFixture {
  protected:
   // Whoever puts something on the file queue finds it done.
   void runFilesAtOnce() const {
@@ -79,7 +79,7 @@ class Invalidation : public KeyValueStoreFixture {
   }
 };
 
-TEST_F(Invalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {
+TEST_F(PersistentKeyValueStoreInvalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {
   openWatched();
   watch(store->store("key", bytesOf("value")));
   work().runAll();
@@ -92,7 +92,7 @@ TEST_F(Invalidation, WithAFutureIsDoneWhenTheFileQueueHasGotSoFar) {
   EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 0U);
 }
 
-TEST_F(Invalidation, BlocksUntilARemovalThatIsUnderWayHasDeletedItsFile) {
+TEST_F(PersistentKeyValueStoreInvalidation, BlocksUntilARemovalThatIsUnderWayHasDeletedItsFile) {
   openWatched();
   put("key", "value");
   Latch barrierIsSet(1);
@@ -113,7 +113,7 @@ TEST_F(Invalidation, BlocksUntilARemovalThatIsUnderWayHasDeletedItsFile) {
 }
 
 // An invalidation may come between a task's last look and its turn on the file queue; another store has the paths then.
-TEST_F(Invalidation, LeavesNothingToTasksThatComeAfterItsBarrier) {
+TEST_F(PersistentKeyValueStoreInvalidation, LeavesNothingToTasksThatComeAfterItsBarrier) {
   openWatched();
   put("key", "value");
   const auto late = std::make_shared<AnyOrderQueues>();
@@ -137,7 +137,7 @@ TEST_F(Invalidation, LeavesNothingToTasksThatComeAfterItsBarrier) {
   EXPECT_THAT(valueFiles(), ElementsAre("key"));
 }
 
-TEST_F(Invalidation, BetweenABatchAndItsFilesLeavesThemToWhoInvalidates) {
+TEST_F(PersistentKeyValueStoreInvalidation, BetweenABatchAndItsFilesLeavesThemToWhoInvalidates) {
   openWatched();
   put("key", "value");
   const auto takeItThenInvalidate = [this]() -> std::vector<DiskCacheItem> {
@@ -151,7 +151,7 @@ TEST_F(Invalidation, BetweenABatchAndItsFilesLeavesThemToWhoInvalidates) {
   EXPECT_EQ(valueFile("key"), "value");
 }
 
-TEST_F(Invalidation, ASecondTimeIsDoneAtOnce) {
+TEST_F(PersistentKeyValueStoreInvalidation, ASecondTimeIsDoneAtOnce) {
   open();
   const Written first = watch(store->invalidateWithFuture());
   const Written second = watch(store->invalidateWithFuture());
@@ -162,7 +162,7 @@ TEST_F(Invalidation, ASecondTimeIsDoneAtOnce) {
   EXPECT_EQ(told(first), "<done>");
 }
 
-TEST_F(Invalidation, BlocksUntilTheWritesThatAreUnderWayAreFinishedThenSilencesTheManifest) {
+TEST_F(PersistentKeyValueStoreInvalidation, BlocksUntilTheWritesThatAreUnderWayAreFinishedThenSilencesTheManifest) {
   openWatched();
   const Written written = watch(store->store("key", bytesOf("value")));
   work().runAll();
@@ -186,7 +186,7 @@ TEST_F(Invalidation, BlocksUntilTheWritesThatAreUnderWayAreFinishedThenSilencesT
   EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
 }
 
-TEST_F(Invalidation, ASecondBlockingCallReturnsAtOnceAndSilencesNothing) {
+TEST_F(PersistentKeyValueStoreInvalidation, ASecondBlockingCallReturnsAtOnceAndSilencesNothing) {
   openWatched();
   Latch barrierIsSet(1);
   file().onDispatch = [&] { barrierIsSet.countDown(); };
@@ -200,7 +200,7 @@ TEST_F(Invalidation, ASecondBlockingCallReturnsAtOnceAndSilencesNothing) {
   EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
 }
 
-TEST_F(Invalidation, WithoutWaitingSilencesTheManifestWhenTheFileQueueHasGotSoFar) {
+TEST_F(PersistentKeyValueStoreInvalidation, WithoutWaitingSilencesTheManifestWhenTheFileQueueHasGotSoFar) {
   openWatched();
   const Written written = watch(store->store("key", bytesOf("value")));
   work().runAll();
@@ -218,7 +218,7 @@ TEST_F(Invalidation, WithoutWaitingSilencesTheManifestWhenTheFileQueueHasGotSoFa
   EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
 }
 
-TEST_F(Invalidation, RefusesWhatWaitsOnTheWorkQueueAndItHasNoEffect) {
+TEST_F(PersistentKeyValueStoreInvalidation, RefusesWhatWaitsOnTheWorkQueueAndItHasNoEffect) {
   openWatched();
   put("key", "value");
   const std::vector<Written> written = {watch(store->store("new", bytesOf("x"))), watch(store->removeItem("key")),
@@ -239,7 +239,7 @@ TEST_F(Invalidation, RefusesWhatWaitsOnTheWorkQueueAndItHasNoEffect) {
   EXPECT_THAT(accesses(), IsEmpty());
 }
 
-TEST_F(Invalidation, RefusesInlineWritesThatWait) {
+TEST_F(PersistentKeyValueStoreInvalidation, RefusesInlineWritesThatWait) {
   options.inlineData = true;
   openWatched();
   const Written written = watch(store->store("key", bytesOf("x")));
@@ -249,7 +249,7 @@ TEST_F(Invalidation, RefusesInlineWritesThatWait) {
   EXPECT_THAT(keysInMedium(), IsEmpty());
 }
 
-TEST_F(Invalidation, FinishesAWriteAndAReadingThatAreOnTheFileQueue) {
+TEST_F(PersistentKeyValueStoreInvalidation, FinishesAWriteAndAReadingThatAreOnTheFileQueue) {
   open();
   put("key", "value");
   const Written written = watch(store->store("new", bytesOf("12345")));
@@ -264,7 +264,7 @@ TEST_F(Invalidation, FinishesAWriteAndAReadingThatAreOnTheFileQueue) {
   EXPECT_THAT(rowsOnDisk(), Contains("new new 5 0 1000000 1000000 -"));
 }
 
-TEST_F(Invalidation, CancelsTheTimerAndArmsNoOther) {
+TEST_F(PersistentKeyValueStoreInvalidation, CancelsTheTimerAndArmsNoOther) {
   openWatched();
   put("key", "value");
   clock.advance(1001);
@@ -278,7 +278,7 @@ TEST_F(Invalidation, CancelsTheTimerAndArmsNoOther) {
   EXPECT_THAT(work().armedDelays(), IsEmpty());
 }
 
-TEST_F(Invalidation, OfARealManifestLeavesNoTimerAtAll) {
+TEST_F(PersistentKeyValueStoreInvalidation, OfARealManifestLeavesNoTimerAtAll) {
   open();
   EXPECT_EQ(work().armedDelays().size(), 2U);
   runFilesAtOnce();
@@ -288,7 +288,7 @@ TEST_F(Invalidation, OfARealManifestLeavesNoTimerAtAll) {
   EXPECT_THAT(work().armedDelays(), IsEmpty());
 }
 
-TEST_F(Invalidation, BeforeLoadingLoadsNothingAndArmsNothing) {
+TEST_F(PersistentKeyValueStoreInvalidation, BeforeLoadingLoadsNothingAndArmsNothing) {
   openWatchedUnloaded();
   watch(store->invalidateWithFuture());
   settle();
@@ -296,7 +296,7 @@ TEST_F(Invalidation, BeforeLoadingLoadsNothingAndArmsNothing) {
   EXPECT_THAT(work().armedDelays(), IsEmpty());
 }
 
-TEST_F(Invalidation, CreatesNoManifest) {
+TEST_F(PersistentKeyValueStoreInvalidation, CreatesNoManifest) {
   openUnloaded();
   runFilesAtOnce();
   store->invalidate();
@@ -304,7 +304,7 @@ TEST_F(Invalidation, CreatesNoManifest) {
   EXPECT_THAT(directory.names("store"), IsEmpty());
 }
 
-TEST_F(Invalidation, StartsNoExpiry) {
+TEST_F(PersistentKeyValueStoreInvalidation, StartsNoExpiry) {
   openWatched();
   watch(store->invalidateWithFuture());
   manifest->clearTrace();
@@ -315,7 +315,7 @@ TEST_F(Invalidation, StartsNoExpiry) {
   EXPECT_THAT(work().armedDelays(), IsEmpty());
 }
 
-TEST_F(Invalidation, EndsADeletionBetweenItsBatches) {
+TEST_F(PersistentKeyValueStoreInvalidation, EndsADeletionBetweenItsBatches) {
   options.batchSize = 1;
   openWatched();
   putMany(3);
@@ -328,7 +328,7 @@ TEST_F(Invalidation, EndsADeletionBetweenItsBatches) {
   EXPECT_EQ(valueFiles().size(), 2U);  // the files of the batch that was taken are gone
 }
 
-TEST_F(Invalidation, LeavesTheFilesAndWritesNothingMore) {
+TEST_F(PersistentKeyValueStoreInvalidation, LeavesTheFilesAndWritesNothingMore) {
   open();
   put("key", "value");
   runFilesAtOnce();
@@ -339,7 +339,7 @@ TEST_F(Invalidation, LeavesTheFilesAndWritesNothingMore) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(Invalidation, WhoseStoreGoesBeforeAWriteBeginsLeavesNoRecordWithoutAFile) {
+TEST_F(PersistentKeyValueStoreInvalidation, WhoseStoreGoesBeforeAWriteBeginsLeavesNoRecordWithoutAFile) {
   open();
   const Written written = watch(store->store("key", bytesOf("value")));
   work().runAll();
@@ -351,7 +351,7 @@ TEST_F(Invalidation, WhoseStoreGoesBeforeAWriteBeginsLeavesNoRecordWithoutAFile)
   EXPECT_EQ(valueFiles().size(), rowsOnDisk().size());
 }
 
-TEST_F(Invalidation, OfAShutDownFileQueueReturnsAndSilencesTheManifest) {
+TEST_F(PersistentKeyValueStoreInvalidation, OfAShutDownFileQueueReturnsAndSilencesTheManifest) {
   openWatched();
   file().onDispatch = [&queue = file()] { queue.dropAll(); };
   store->invalidate();
@@ -359,7 +359,7 @@ TEST_F(Invalidation, OfAShutDownFileQueueReturnsAndSilencesTheManifest) {
   EXPECT_THROW(store->throwIfInvalid(), InvalidatedException);
 }
 
-TEST_F(Invalidation, OfAFileQueueThatTakesNothingRefusesWorkAndSilencesTheManifest) {
+TEST_F(PersistentKeyValueStoreInvalidation, OfAFileQueueThatTakesNothingRefusesWorkAndSilencesTheManifest) {
   openWatched();
   file().throwOnDispatch(true);
   EXPECT_NO_THROW(store->invalidate());
@@ -367,7 +367,7 @@ TEST_F(Invalidation, OfAFileQueueThatTakesNothingRefusesWorkAndSilencesTheManife
   EXPECT_EQ(manifest->calls(ManifestCall::Invalidate), 1U);
 }
 
-TEST_F(Invalidation, FromWithinAWriterLetsThatWriteFinish) {
+TEST_F(PersistentKeyValueStoreInvalidation, FromWithinAWriterLetsThatWriteFinish) {
   openWatched();
   Written barrier;
   const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
@@ -410,7 +410,7 @@ class InterruptedQueues final : public TaskQueueFactory {
   std::shared_ptr<AsyncExecutor> createWorkQueue() override { return work; }
 };
 
-TEST_F(Invalidation, BetweenARecordAndItsFileLeavesNoRecordWithoutAFile) {
+TEST_F(PersistentKeyValueStoreInvalidation, BetweenARecordAndItsFileLeavesNoRecordWithoutAFile) {
   open();
   put("old", "value");
   close();
@@ -436,7 +436,7 @@ TEST_F(Invalidation, BetweenARecordAndItsFileLeavesNoRecordWithoutAFile) {
   EXPECT_EQ(rowsOnDisk().size(), 1U);
 }
 
-TEST_F(Invalidation, RacesWithOperationsOfManyThreads) {
+TEST_F(PersistentKeyValueStoreInvalidation, RacesWithOperationsOfManyThreads) {
   open();
   std::atomic<bool> stop{false};
   std::thread workThread([&] {

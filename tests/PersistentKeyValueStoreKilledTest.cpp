@@ -22,7 +22,7 @@ using test::watch;
 using testing::HasSubstr;
 using testing::StartsWith;
 
-class AKilledStore : public test::KeyValueStoreFixture {
+class PersistentKeyValueStoreKilled : public test::KeyValueStoreFixture {
  protected:
   // What the next process would find, had this one been killed now.
   void killNow() {
@@ -46,7 +46,7 @@ class AKilledStore : public test::KeyValueStoreFixture {
   }
 };
 
-TEST_F(AKilledStore, HasEveryValueThatWasAcknowledged) {
+TEST_F(PersistentKeyValueStoreKilled, HasEveryValueThatWasAcknowledged) {
   open();
   put("key", "value");
   put("key", "new");
@@ -58,7 +58,7 @@ TEST_F(AKilledStore, HasEveryValueThatWasAcknowledged) {
   EXPECT_EQ(get("gone"), "<miss>");
 }
 
-TEST_F(AKilledStore, BeforeTheFileOfAFirstWriteAnswersWithAnErrorUntilTheKeyIsStoredOrRemoved) {
+TEST_F(PersistentKeyValueStoreKilled, BeforeTheFileOfAFirstWriteAnswersWithAnErrorUntilTheKeyIsStoredOrRemoved) {
   open();
   killBefore(Operation::WriteFile);
   put("key", "value");
@@ -69,7 +69,7 @@ TEST_F(AKilledStore, BeforeTheFileOfAFirstWriteAnswersWithAnErrorUntilTheKeyIsSt
   EXPECT_EQ(get("key"), "new");
 }
 
-TEST_F(AKilledStore, BeforeTheFileOfAnOverwriteStillHasTheOldValue) {
+TEST_F(PersistentKeyValueStoreKilled, BeforeTheFileOfAnOverwriteStillHasTheOldValue) {
   open();
   put("key", "old");
   killBefore(Operation::WriteFile);
@@ -79,7 +79,7 @@ TEST_F(AKilledStore, BeforeTheFileOfAnOverwriteStillHasTheOldValue) {
   EXPECT_EQ(get("key"), "old");
 }
 
-TEST_F(AKilledStore, InTheMidstOfAnOverwriteHasAPartOfTheNewValue) {
+TEST_F(PersistentKeyValueStoreKilled, InTheMidstOfAnOverwriteHasAPartOfTheNewValue) {
   open();
   put("key", "old");
   const auto written = watch(store->store("key", nullptr, [this](const std::string& path) {
@@ -94,7 +94,7 @@ TEST_F(AKilledStore, InTheMidstOfAnOverwriteHasAPartOfTheNewValue) {
   EXPECT_EQ(get("key"), "ne");
 }
 
-TEST_F(AKilledStore, BetweenAnInlineRecordAndItsBytesHasLostTheOldValueAndAnswersWithAnError) {
+TEST_F(PersistentKeyValueStoreKilled, BetweenAnInlineRecordAndItsBytesHasLostTheOldValueAndAnswersWithAnError) {
   options.inlineData = true;
   open();
   put("key", "old");
@@ -113,7 +113,7 @@ TEST_F(AKilledStore, BetweenAnInlineRecordAndItsBytesHasLostTheOldValueAndAnswer
   EXPECT_EQ(get("key"), "newer");
 }
 
-TEST_F(AKilledStore, BetweenTheRecordAndTheFileOfARemovalLeavesAFileThatNobodyDeletes) {
+TEST_F(PersistentKeyValueStoreKilled, BetweenTheRecordAndTheFileOfARemovalLeavesAFileThatNobodyDeletes) {
   open();
   put("key", "value");
   killBefore(Operation::DeleteFile);
@@ -126,7 +126,7 @@ TEST_F(AKilledStore, BetweenTheRecordAndTheFileOfARemovalLeavesAFileThatNobodyDe
 }
 
 // Harsh, and described: the record of a first write stands before its file does.
-TEST_F(AKilledStore, AfterThatAndInAFirstWriteOfTheKeyHasTheRemovedValueAgain) {
+TEST_F(PersistentKeyValueStoreKilled, AfterThatAndInAFirstWriteOfTheKeyHasTheRemovedValueAgain) {
   open();
   put("key", "value");
   killBefore(Operation::DeleteFile);
@@ -140,7 +140,7 @@ TEST_F(AKilledStore, AfterThatAndInAFirstWriteOfTheKeyHasTheRemovedValueAgain) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(AKilledStore, LoadsTheSizeThatItsManifestHas) {
+TEST_F(PersistentKeyValueStoreKilled, LoadsTheSizeThatItsManifestHas) {
   open();
   put("a", "12345");
   put("b", "123");
@@ -152,7 +152,7 @@ TEST_F(AKilledStore, LoadsTheSizeThatItsManifestHas) {
 }
 
 // Locked, not damaged: for a write that makes no difference.
-TEST_F(AKilledStore, WhoseManifestSomebodyElseHoldsIsPurgedByAWriteAndFailsNoRead) {
+TEST_F(PersistentKeyValueStoreKilled, WhoseManifestSomebodyElseHoldsIsPurgedByAWriteAndFailsNoRead) {
   open();
   put("key", "value");
   sqlite3* other = nullptr;
@@ -168,7 +168,7 @@ TEST_F(AKilledStore, WhoseManifestSomebodyElseHoldsIsPurgedByAWriteAndFailsNoRea
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(AKilledStore, WhoseFileIsCutShortOrReplacedBehindItGivesWhatIsThere) {
+TEST_F(PersistentKeyValueStoreKilled, WhoseFileIsCutShortOrReplacedBehindItGivesWhatIsThere) {
   open();
   put("short", "value");
   put("other", "value");
@@ -178,7 +178,7 @@ TEST_F(AKilledStore, WhoseFileIsCutShortOrReplacedBehindItGivesWhatIsThere) {
   EXPECT_EQ(get("other"), "something else");
 }
 
-TEST_F(AKilledStore, WhoseDirectoryMayNotBeWrittenFailsWritesAndKeepsWhatItHas) {
+TEST_F(PersistentKeyValueStoreKilled, WhoseDirectoryMayNotBeWrittenFailsWritesAndKeepsWhatItHas) {
   open();
   put("key", "value");
   files->failAlways(Operation::WriteFile, EACCES);

@@ -59,15 +59,15 @@ class MaintenanceFixture : public KeyValueStoreFixture {
   }
 };
 
-class Expiry : public MaintenanceFixture {};
-class Capacity : public MaintenanceFixture {};
-class Clearing : public MaintenanceFixture {};
-class DeletingInBatches : public MaintenanceFixture {};
-class SizeReport : public MaintenanceFixture {};
+class PersistentKeyValueStoreExpiry : public MaintenanceFixture {};
+class PersistentKeyValueStoreCapacity : public MaintenanceFixture {};
+class PersistentKeyValueStoreClearing : public MaintenanceFixture {};
+class PersistentKeyValueStoreDeletingInBatches : public MaintenanceFixture {};
+class PersistentKeyValueStoreSizeReport : public MaintenanceFixture {};
 
 // --- Expiry ---
 
-TEST_F(Expiry, KeepsAnItemThatWasUsedExactlyAtTheCutoff) {
+TEST_F(PersistentKeyValueStoreExpiry, KeepsAnItemThatWasUsedExactlyAtTheCutoff) {
   open();
   put("key", "value");
   clock.set(kStart + 1000);
@@ -76,7 +76,7 @@ TEST_F(Expiry, KeepsAnItemThatWasUsedExactlyAtTheCutoff) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(Expiry, TakesAnItemThatWasUsedASecondBeforeTheCutoffWithItsFile) {
+TEST_F(PersistentKeyValueStoreExpiry, TakesAnItemThatWasUsedASecondBeforeTheCutoffWithItsFile) {
   open();
   put("key", "value");
   clock.set(kStart + 1001);
@@ -88,7 +88,7 @@ TEST_F(Expiry, TakesAnItemThatWasUsedASecondBeforeTheCutoffWithItsFile) {
   EXPECT_EQ(rowsOnDisk().size(), 1U);
 }
 
-TEST_F(Expiry, GoesByTheLastUseAndNotByTheDateOfWriting) {
+TEST_F(PersistentKeyValueStoreExpiry, GoesByTheLastUseAndNotByTheDateOfWriting) {
   open();
   put("used", "value");
   put("idle", "value");
@@ -100,7 +100,7 @@ TEST_F(Expiry, GoesByTheLastUseAndNotByTheDateOfWriting) {
   EXPECT_THAT(store->getAllKeys(), ElementsAre("used"));
 }
 
-TEST_F(Expiry, ComesAnHourAfterTheLastOne) {
+TEST_F(PersistentKeyValueStoreExpiry, ComesAnHourAfterTheLastOne) {
   open();
   ASSERT_TRUE(fire(300));
   EXPECT_THAT(work().armedDelays(), Not(Contains(3600 * kSecond)));  // only when the cycle is through
@@ -111,7 +111,7 @@ TEST_F(Expiry, ComesAnHourAfterTheLastOne) {
   EXPECT_THAT(work().armedDelays(), UnorderedElementsAre(120 * kSecond, 3600 * kSecond));
 }
 
-TEST_F(Expiry, WithAStaleAgeBeyondTheClockTakesNothing) {
+TEST_F(PersistentKeyValueStoreExpiry, WithAStaleAgeBeyondTheClockTakesNothing) {
   options.staleAge = kStart + 1;
   openWatched();
   put("key", "value");
@@ -123,7 +123,7 @@ TEST_F(Expiry, WithAStaleAgeBeyondTheClockTakesNothing) {
   EXPECT_THAT(store->getAllKeys(), UnorderedElementsAre("key", "ancient"));
 }
 
-TEST_F(Expiry, CutsAtZeroWhenTheStaleAgeIsTheClockAndAboveItWhenItIsLess) {
+TEST_F(PersistentKeyValueStoreExpiry, CutsAtZeroWhenTheStaleAgeIsTheClockAndAboveItWhenItIsLess) {
   options.staleAge = kStart;
   openWatched();
   ASSERT_TRUE(fire(300));
@@ -136,7 +136,7 @@ TEST_F(Expiry, CutsAtZeroWhenTheStaleAgeIsTheClockAndAboveItWhenItIsLess) {
   EXPECT_THAT(manifest->trace(), ElementsAre("pruneOldEntries 1 50"));
 }
 
-TEST_F(Expiry, FollowsAnOverriddenStaleAgeFromTheNextCycleOn) {
+TEST_F(PersistentKeyValueStoreExpiry, FollowsAnOverriddenStaleAgeFromTheNextCycleOn) {
   open();
   put("key", "value");
   clock.advance(500);
@@ -150,7 +150,7 @@ TEST_F(Expiry, FollowsAnOverriddenStaleAgeFromTheNextCycleOn) {
   EXPECT_THAT(store->getAllKeys(), IsEmpty());
 }
 
-TEST_F(Expiry, WithTheSmallestAndTheLargestStaleAgeGoesOn) {
+TEST_F(PersistentKeyValueStoreExpiry, WithTheSmallestAndTheLargestStaleAgeGoesOn) {
   open();
   put("key", "value");
   store->overrideConfiguration(std::numeric_limits<long>::min());
@@ -164,7 +164,7 @@ TEST_F(Expiry, WithTheSmallestAndTheLargestStaleAgeGoesOn) {
   EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
 }
 
-TEST_F(Expiry, ReportsTheSizeBeforeAndAfter) {
+TEST_F(PersistentKeyValueStoreExpiry, ReportsTheSizeBeforeAndAfter) {
   open();
   put("key", "value");
   sizes.clear();
@@ -174,7 +174,7 @@ TEST_F(Expiry, ReportsTheSizeBeforeAndAfter) {
   EXPECT_THAT(sizes, ElementsAre(5U, 0U));
 }
 
-TEST_F(Expiry, TakesFiftyAtATimeAndWaitsForTheirFiles) {
+TEST_F(PersistentKeyValueStoreExpiry, TakesFiftyAtATimeAndWaitsForTheirFiles) {
   openWatched();
   putMany(101);
   clock.advance(1001);
@@ -205,7 +205,7 @@ TEST_F(Expiry, TakesFiftyAtATimeAndWaitsForTheirFiles) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(Expiry, OfInlineItemsDeletesNoFile) {
+TEST_F(PersistentKeyValueStoreExpiry, OfInlineItemsDeletesNoFile) {
   options.inlineData = true;
   openWatched();
   put("key", "value");
@@ -218,7 +218,7 @@ TEST_F(Expiry, OfInlineItemsDeletesNoFile) {
   EXPECT_THAT(files->trace(), IsEmpty());
 }
 
-TEST_F(Expiry, ThatFailsLogsAndComesAgainInAnHour) {
+TEST_F(PersistentKeyValueStoreExpiry, ThatFailsLogsAndComesAgainInAnHour) {
   openWatched();
   manifest->failNext(ManifestCall::PruneOldEntries, unwritable);
   const LogCapture log;
@@ -229,7 +229,7 @@ TEST_F(Expiry, ThatFailsLogsAndComesAgainInAnHour) {
   EXPECT_THAT(work().armedDelays(), ElementsAre(3600 * kSecond));
 }
 
-TEST_F(Expiry, WhoseFilesCannotBeDeletedLogsEachAndIsNoFailure) {
+TEST_F(PersistentKeyValueStoreExpiry, WhoseFilesCannotBeDeletedLogsEachAndIsNoFailure) {
   open();
   put("a", "1");
   put("b", "2");
@@ -245,7 +245,7 @@ TEST_F(Expiry, WhoseFilesCannotBeDeletedLogsEachAndIsNoFailure) {
   EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
 }
 
-TEST_F(Expiry, ReplacesTheTimerThatIsArmed) {
+TEST_F(PersistentKeyValueStoreExpiry, ReplacesTheTimerThatIsArmed) {
   openWatched();
   store->scheduleStaleRemoval(10);
   EXPECT_THAT(work().armedDelays(), ElementsAre(10 * kSecond));
@@ -254,7 +254,7 @@ TEST_F(Expiry, ReplacesTheTimerThatIsArmed) {
   EXPECT_EQ(work().companions(), 0U);
 }
 
-TEST_F(Expiry, TakesAnyDelay) {
+TEST_F(PersistentKeyValueStoreExpiry, TakesAnyDelay) {
   openWatched();
   for (const long delay : {0L, -1L, std::numeric_limits<long>::max(), std::numeric_limits<long>::min()}) {
     store->scheduleStaleRemoval(delay);
@@ -264,7 +264,7 @@ TEST_F(Expiry, TakesAnyDelay) {
   EXPECT_THAT(work().armedDelays(), ElementsAre(-kSecond));
 }
 
-TEST_F(Expiry, LoadsFirstWhenTheFirstLoadingFailed) {
+TEST_F(PersistentKeyValueStoreExpiry, LoadsFirstWhenTheFirstLoadingFailed) {
   manifest.reset();
   openWatchedUnloaded();
   manifest->failNext(ManifestCall::Load, unwritable);
@@ -276,7 +276,7 @@ TEST_F(Expiry, LoadsFirstWhenTheFirstLoadingFailed) {
   EXPECT_EQ(manifest->calls(ManifestCall::Load), 2U);
 }
 
-TEST_F(Expiry, WhoseLoadingFailsAgainLogsAndComesAgain) {
+TEST_F(PersistentKeyValueStoreExpiry, WhoseLoadingFailsAgainLogsAndComesAgain) {
   openWatchedUnloaded();
   manifest->failNext(ManifestCall::Load, unwritable);
   manifest->failNext(ManifestCall::Load, unwritable);
@@ -287,7 +287,7 @@ TEST_F(Expiry, WhoseLoadingFailsAgainLogsAndComesAgain) {
   EXPECT_THAT(work().armedDelays(), ElementsAre(3600 * kSecond));
 }
 
-TEST_F(Expiry, IsArmedThoughTheFirstLoadingCouldNotEvenPurge) {
+TEST_F(PersistentKeyValueStoreExpiry, IsArmedThoughTheFirstLoadingCouldNotEvenPurge) {
   openWatchedUnloaded();
   manifest->failNext(ManifestCall::Load, corrupted);
   files->failNext(Operation::CreateDirectory, ENOSPC);
@@ -295,7 +295,7 @@ TEST_F(Expiry, IsArmedThoughTheFirstLoadingCouldNotEvenPurge) {
   EXPECT_THAT(work().armedDelays(), ElementsAre(300 * kSecond));
 }
 
-TEST_F(Expiry, ComesAgainThoughTheQueueTookNoWork) {
+TEST_F(PersistentKeyValueStoreExpiry, ComesAgainThoughTheQueueTookNoWork) {
   options.onSizeChanged = nullptr;
   openWatched();
   work().throwOnDispatch(true);
@@ -308,7 +308,7 @@ TEST_F(Expiry, ComesAgainThoughTheQueueTookNoWork) {
   EXPECT_THAT(work().armedDelays(), ElementsAre(3600 * kSecond));
 }
 
-TEST_F(Expiry, ComesAgainThoughTheQueueDroppedItsDeletions) {
+TEST_F(PersistentKeyValueStoreExpiry, ComesAgainThoughTheQueueDroppedItsDeletions) {
   open();
   put("key", "value");
   clock.advance(1001);
@@ -321,7 +321,7 @@ TEST_F(Expiry, ComesAgainThoughTheQueueDroppedItsDeletions) {
   EXPECT_THAT(work().armedDelays(), Contains(3600 * kSecond));
 }
 
-TEST_F(Expiry, ThatWaitsWhenItsStoreGoesDoesNothing) {
+TEST_F(PersistentKeyValueStoreExpiry, ThatWaitsWhenItsStoreGoesDoesNothing) {
   openWatched();
   put("key", "value");
   clock.advance(1001);
@@ -335,7 +335,7 @@ TEST_F(Expiry, ThatWaitsWhenItsStoreGoesDoesNothing) {
 
 // --- Capacity ---
 
-TEST_F(Capacity, OfThreeEvictsExactlyTheOldestForTheFourthBeforeItIsRecorded) {
+TEST_F(PersistentKeyValueStoreCapacity, OfThreeEvictsExactlyTheOldestForTheFourthBeforeItIsRecorded) {
   options.capacity = 3;
   openWatched();
   for (const char* key : {"a", "b", "c"}) {
@@ -357,7 +357,7 @@ TEST_F(Capacity, OfThreeEvictsExactlyTheOldestForTheFourthBeforeItIsRecorded) {
   EXPECT_THAT(valueFiles(), ElementsAre("b", "c", "d"));
 }
 
-TEST_F(Capacity, EvictsWhatWasUsedLeastRecently) {
+TEST_F(PersistentKeyValueStoreCapacity, EvictsWhatWasUsedLeastRecently) {
   options.capacity = 2;
   open();
   put("a", "1");
@@ -369,7 +369,7 @@ TEST_F(Capacity, EvictsWhatWasUsedLeastRecently) {
   EXPECT_EQ(contents(), (Contents{{"a", "1"}, {"c", "3"}}));
 }
 
-TEST_F(Capacity, EvictsAlsoWhenItOverwrites) {
+TEST_F(PersistentKeyValueStoreCapacity, EvictsAlsoWhenItOverwrites) {
   options.capacity = 2;
   open();
   put("a", "1");
@@ -381,7 +381,7 @@ TEST_F(Capacity, EvictsAlsoWhenItOverwrites) {
   EXPECT_THAT(valueFiles(), ElementsAre("b"));
 }
 
-TEST_F(Capacity, MayEvictTheVeryItemThatIsOverwritten) {
+TEST_F(PersistentKeyValueStoreCapacity, MayEvictTheVeryItemThatIsOverwritten) {
   options.capacity = 1;
   open();
   put("a", "1");
@@ -398,7 +398,7 @@ TEST_F(Capacity, MayEvictTheVeryItemThatIsOverwritten) {
   EXPECT_EQ(contents(), (Contents{{"a", "4"}}));
 }
 
-TEST_F(Capacity, OfZeroHoldsTheLastItemAlone) {
+TEST_F(PersistentKeyValueStoreCapacity, OfZeroHoldsTheLastItemAlone) {
   options.capacity = 0;
   openWatched();
   put("a", "1");
@@ -409,21 +409,21 @@ TEST_F(Capacity, OfZeroHoldsTheLastItemAlone) {
   EXPECT_THAT(valueFiles(), ElementsAre("b"));
 }
 
-TEST_F(Capacity, AbsentNeverEvicts) {
+TEST_F(PersistentKeyValueStoreCapacity, AbsentNeverEvicts) {
   openWatched();
   putMany(60);
   EXPECT_EQ(manifest->calls(ManifestCall::PruneOldestItem), 0U);
   EXPECT_EQ(store->getAllKeys().size(), 60U);
 }
 
-TEST_F(Capacity, BeyondThirtyTwoBitsNeverEvicts) {
+TEST_F(PersistentKeyValueStoreCapacity, BeyondThirtyTwoBitsNeverEvicts) {
   options.capacity = std::uint64_t{1} << 32U;
   openWatched();
   putMany(3);
   EXPECT_EQ(manifest->calls(ManifestCall::PruneOldestItem), 0U);
 }
 
-TEST_F(Capacity, FarExceededIsWorkedOffOneItemAWrite) {
+TEST_F(PersistentKeyValueStoreCapacity, FarExceededIsWorkedOffOneItemAWrite) {
   open();
   putMany(5);
   close();
@@ -437,7 +437,7 @@ TEST_F(Capacity, FarExceededIsWorkedOffOneItemAWrite) {
   EXPECT_EQ(valueFiles().size(), 5U);
 }
 
-TEST_F(Capacity, OfInlineItemsEvictsWithoutDeletingAFile) {
+TEST_F(PersistentKeyValueStoreCapacity, OfInlineItemsEvictsWithoutDeletingAFile) {
   options.capacity = 1;
   options.inlineData = true;
   openWatched();
@@ -450,7 +450,7 @@ TEST_F(Capacity, OfInlineItemsEvictsWithoutDeletingAFile) {
   EXPECT_EQ(contents(), (Contents{{"b", "2"}}));
 }
 
-TEST_F(Capacity, WhoseEvictedFileCannotBeDeletedLogsAndStoresAllTheSame) {
+TEST_F(PersistentKeyValueStoreCapacity, WhoseEvictedFileCannotBeDeletedLogsAndStoresAllTheSame) {
   options.capacity = 1;
   open();
   put("a", "1");
@@ -464,7 +464,7 @@ TEST_F(Capacity, WhoseEvictedFileCannotBeDeletedLogsAndStoresAllTheSame) {
   EXPECT_EQ(get("b"), "2");
 }
 
-TEST_F(Capacity, EvictsAWriteThatIsStillOnItsWayWithoutATrace) {
+TEST_F(PersistentKeyValueStoreCapacity, EvictsAWriteThatIsStillOnItsWayWithoutATrace) {
   options.capacity = 1;
   open();
   const Written first = watch(store->store("a", bytesOf("1")));
@@ -481,7 +481,7 @@ TEST_F(Capacity, EvictsAWriteThatIsStillOnItsWayWithoutATrace) {
 
 // --- Clearing ---
 
-TEST_F(Clearing, TakesEveryItemOfNoSizeToo) {
+TEST_F(PersistentKeyValueStoreClearing, TakesEveryItemOfNoSizeToo) {
   open();
   put("empty", "");
   put("key", "value");
@@ -492,7 +492,7 @@ TEST_F(Clearing, TakesEveryItemOfNoSizeToo) {
   EXPECT_EQ(sizes.back(), 0U);
 }
 
-TEST_F(Clearing, TakesEmptyItemsAloneToo) {
+TEST_F(PersistentKeyValueStoreClearing, TakesEmptyItemsAloneToo) {
   open();
   put("a", "");
   put("b", "");
@@ -501,7 +501,7 @@ TEST_F(Clearing, TakesEmptyItemsAloneToo) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(Clearing, OfAnEmptyStoreSucceedsAfterOneEmptyBatchAndReportsTheSize) {
+TEST_F(PersistentKeyValueStoreClearing, OfAnEmptyStoreSucceedsAfterOneEmptyBatchAndReportsTheSize) {
   open();
   store->clear(onSuccess(), onError());
   EXPECT_EQ(ending, "");
@@ -512,7 +512,7 @@ TEST_F(Clearing, OfAnEmptyStoreSucceedsAfterOneEmptyBatchAndReportsTheSize) {
   EXPECT_THAT(sizes, ElementsAre(0U));
 }
 
-TEST_F(Clearing, TakesABatchAtATime) {
+TEST_F(PersistentKeyValueStoreClearing, TakesABatchAtATime) {
   options.batchSize = 2;
   openWatched();
   putMany(5);
@@ -528,7 +528,7 @@ TEST_F(Clearing, TakesABatchAtATime) {
   EXPECT_EQ(ending, "<done>");
 }
 
-TEST_F(Clearing, TakesWhatWasStoredBeforeItAndIsStillOnItsWay) {
+TEST_F(PersistentKeyValueStoreClearing, TakesWhatWasStoredBeforeItAndIsStillOnItsWay) {
   open();
   put("old", "value");
   const Written first = watch(store->store("new", bytesOf("1")));
@@ -544,7 +544,7 @@ TEST_F(Clearing, TakesWhatWasStoredBeforeItAndIsStillOnItsWay) {
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(Clearing, LeavesWhatIsStoredAfterIt) {
+TEST_F(PersistentKeyValueStoreClearing, LeavesWhatIsStoredAfterIt) {
   open();
   put("old", "value");
   put("kept", "old value");
@@ -558,7 +558,7 @@ TEST_F(Clearing, LeavesWhatIsStoredAfterIt) {
   EXPECT_EQ(contents(), (Contents{{"kept", "new"}, {"empty", ""}}));
 }
 
-TEST_F(Clearing, LeavesWhatIsStoredBetweenItsBatches) {
+TEST_F(PersistentKeyValueStoreClearing, LeavesWhatIsStoredBetweenItsBatches) {
   options.batchSize = 1;
   open();
   putMany(4);
@@ -571,7 +571,7 @@ TEST_F(Clearing, LeavesWhatIsStoredBetweenItsBatches) {
   EXPECT_EQ(contents(), (Contents{{"key0", "new"}, {"key1", "new"}, {"key2", "new"}, {"key3", "new"}}));
 }
 
-TEST_F(Clearing, TwiceAtOnceSucceedsTwice) {
+TEST_F(PersistentKeyValueStoreClearing, TwiceAtOnceSucceedsTwice) {
   options.batchSize = 1;
   open();
   putMany(5);
@@ -582,7 +582,7 @@ TEST_F(Clearing, TwiceAtOnceSucceedsTwice) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(Clearing, AgainTakesWhatTheFirstOneLeft) {
+TEST_F(PersistentKeyValueStoreClearing, AgainTakesWhatTheFirstOneLeft) {
   options.batchSize = 1;
   open();
   putMany(3);
@@ -596,7 +596,7 @@ TEST_F(Clearing, AgainTakesWhatTheFirstOneLeft) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(Clearing, OfInlineItemsDeletesNoFile) {
+TEST_F(PersistentKeyValueStoreClearing, OfInlineItemsDeletesNoFile) {
   options.inlineData = true;
   openWatched();
   put("key", "value");
@@ -608,7 +608,7 @@ TEST_F(Clearing, OfInlineItemsDeletesNoFile) {
   EXPECT_THAT(files->trace(), IsEmpty());
 }
 
-TEST_F(Clearing, LoadsTheManifestWhenThatHasNotBeenDone) {
+TEST_F(PersistentKeyValueStoreClearing, LoadsTheManifestWhenThatHasNotBeenDone) {
   open();
   put("key", "value");
   close();
@@ -619,7 +619,7 @@ TEST_F(Clearing, LoadsTheManifestWhenThatHasNotBeenDone) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(Clearing, TellsWhenTheManifestFails) {
+TEST_F(PersistentKeyValueStoreClearing, TellsWhenTheManifestFails) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::PruneToSize, unwritable);
@@ -628,7 +628,7 @@ TEST_F(Clearing, TellsWhenTheManifestFails) {
   EXPECT_EQ(clear(), "<done>");
 }
 
-TEST_F(Clearing, DeletesTheFilesOfThoseThatWentBeforeTheManifestFailed) {
+TEST_F(PersistentKeyValueStoreClearing, DeletesTheFilesOfThoseThatWentBeforeTheManifestFailed) {
   openWatched();
   for (const char* key : {"a", "b", "c"}) put(key, "");
   int removals = 0;
@@ -640,7 +640,7 @@ TEST_F(Clearing, DeletesTheFilesOfThoseThatWentBeforeTheManifestFailed) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(Clearing, WithoutCallbacksClears) {
+TEST_F(PersistentKeyValueStoreClearing, WithoutCallbacksClears) {
   openWatched();
   put("key", "value");
   store->clear(nullptr, nullptr);
@@ -653,7 +653,7 @@ TEST_F(Clearing, WithoutCallbacksClears) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(Clearing, OfAnInvalidatedStoreIsRefused) {
+TEST_F(PersistentKeyValueStoreClearing, OfAnInvalidatedStoreIsRefused) {
   open();
   put("key", "value");
   watch(store->invalidateWithFuture());
@@ -663,7 +663,7 @@ TEST_F(Clearing, OfAnInvalidatedStoreIsRefused) {
 
 // A clear takes the records batch by batch, but a write on its way is called off at once: its record must not stand
 // there without a file until its batch comes.
-class ClearingInBatches : public Clearing {
+class PersistentKeyValueStoreClearingInBatches : public PersistentKeyValueStoreClearing {
  protected:
   void SetUp() override {
     options.batchSize = 1;
@@ -680,26 +680,26 @@ class ClearingInBatches : public Clearing {
   }
 };
 
-TEST_F(ClearingInBatches, LetsAKeyBeRemovedMeanwhile) {
+TEST_F(PersistentKeyValueStoreClearingInBatches, LetsAKeyBeRemovedMeanwhile) {
   EXPECT_EQ(drop("queued"), "<done>");
   EXPECT_EQ(ending, "<done>");
   EXPECT_THAT(store->getAllKeys(), IsEmpty());
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(ClearingInBatches, LetsAWriteThatWasCalledOffBeAMiss) {
+TEST_F(PersistentKeyValueStoreClearingInBatches, LetsAWriteThatWasCalledOffBeAMiss) {
   EXPECT_EQ(store->fetchModificationDate("queued"), std::nullopt);
   EXPECT_EQ(get("queued"), "<miss>");
   EXPECT_EQ(ending, "<done>");
 }
 
-TEST_F(ClearingInBatches, LeavesNoRecordWithoutAFileToAProcessThatIsKilledMeanwhile) {
+TEST_F(PersistentKeyValueStoreClearingInBatches, LeavesNoRecordWithoutAFileToAProcessThatIsKilledMeanwhile) {
   for (const std::string& key : store->getAllKeys()) EXPECT_TRUE(directory.exists("store/" + key)) << key;
 }
 
 // --- Deleting in batches ---
 
-TEST_F(DeletingInBatches, DeletesBatchAfterBatchOnTheQueuesOfEach) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, DeletesBatchAfterBatchOnTheQueuesOfEach) {
   open();
   for (const char* name : {"a", "b", "c"}) directory.write(std::string("store/") + name, "x");
   store->deleteFilesInBatches(yielding({{itemOf("a"), itemOf("b")}, {itemOf("c")}}), onSuccess(), onError());
@@ -718,7 +718,7 @@ TEST_F(DeletingInBatches, DeletesBatchAfterBatchOnTheQueuesOfEach) {
   EXPECT_THAT(sizes, ElementsAre(0U));
 }
 
-TEST_F(DeletingInBatches, SkipsInlineItems) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, SkipsInlineItems) {
   open();
   for (const char* name : {"a", "b"}) directory.write(std::string("store/") + name, "x");
   store->deleteFilesInBatches(yielding({{itemOf("a", true), itemOf("b")}, {itemOf("a", true)}}), onSuccess(),
@@ -728,7 +728,7 @@ TEST_F(DeletingInBatches, SkipsInlineItems) {
   EXPECT_THAT(valueFiles(), ElementsAre("a"));
 }
 
-TEST_F(DeletingInBatches, LogsAFileThatCannotBeDeletedAndGoesOn) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, LogsAFileThatCannotBeDeletedAndGoesOn) {
   open();
   for (const char* name : {"a", "c"}) directory.write(std::string("store/") + name, "x");
   const LogCapture log;
@@ -740,7 +740,7 @@ TEST_F(DeletingInBatches, LogsAFileThatCannotBeDeletedAndGoesOn) {
               ElementsAre(testing::StartsWith("Failed to delete file at \"" + pathOf("gone") + "\" domain: ")));
 }
 
-TEST_F(DeletingInBatches, EndsWithAnyOtherFailureAfterTheFilesBefore) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, EndsWithAnyOtherFailureAfterTheFilesBefore) {
   open();
   for (const char* name : {"a", "b", "c"}) directory.write(std::string("store/") + name, "x");
   files->onCall = [this](Operation operation, const std::string& path) {
@@ -758,14 +758,14 @@ TEST_F(DeletingInBatches, EndsWithAnyOtherFailureAfterTheFilesBefore) {
   EXPECT_THAT(errorLines(log), IsEmpty());
 }
 
-TEST_F(DeletingInBatches, EndsWithWhatTheProviderThrows) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, EndsWithWhatTheProviderThrows) {
   open();
   store->deleteFilesInBatches([]() -> const Batch { throw std::out_of_range("No batch."); }, onSuccess(), onError());
   settle();
   EXPECT_EQ(ending, "<error> No batch.");
 }
 
-TEST_F(DeletingInBatches, EndsWithAnErrorWhenTheFileQueueDropsABatch) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, EndsWithAnErrorWhenTheFileQueueDropsABatch) {
   open();
   store->deleteFilesInBatches(yielding({{itemOf("a")}}), onSuccess(), onError());
   work().runAll();
@@ -775,7 +775,7 @@ TEST_F(DeletingInBatches, EndsWithAnErrorWhenTheFileQueueDropsABatch) {
   EXPECT_THAT(ending, testing::StartsWith("<error> "));
 }
 
-TEST_F(DeletingInBatches, EndsWithAnErrorWhenTheFileQueueTakesNone) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, EndsWithAnErrorWhenTheFileQueueTakesNone) {
   open();
   file().throwOnDispatch(true);
   store->deleteFilesInBatches(yielding({{itemOf("a")}}), onSuccess(), onError());
@@ -783,7 +783,7 @@ TEST_F(DeletingInBatches, EndsWithAnErrorWhenTheFileQueueTakesNone) {
   EXPECT_EQ(ending, "<error> The queue takes no tasks.");
 }
 
-TEST_F(DeletingInBatches, LetsProviderAndCallbacksCallTheStoreAgain) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, LetsProviderAndCallbacksCallTheStoreAgain) {
   open();
   put("key", "value");
   Batch batch = {itemOf("key")};
@@ -811,7 +811,7 @@ TEST_F(DeletingInBatches, LetsProviderAndCallbacksCallTheStoreAgain) {
   EXPECT_EQ(get("after"), "1");
 }
 
-TEST_F(DeletingInBatches, LetsAnErrorCallbackCallTheStoreAgain) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, LetsAnErrorCallbackCallTheStoreAgain) {
   open();
   store->deleteFilesInBatches([]() -> const Batch { throw std::runtime_error("No batch."); }, nullptr,
                               [&](const std::exception&) {
@@ -823,7 +823,7 @@ TEST_F(DeletingInBatches, LetsAnErrorCallbackCallTheStoreAgain) {
   EXPECT_EQ(ending, "<done>");
 }
 
-TEST_F(DeletingInBatches, WhoseStoreGoesCallsNothing) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, WhoseStoreGoesCallsNothing) {
   open();
   directory.write("store/a", "x");
   bool asked = false;
@@ -845,7 +845,7 @@ TEST_F(DeletingInBatches, WhoseStoreGoesCallsNothing) {
   EXPECT_EQ(ending, "");
 }
 
-TEST_F(DeletingInBatches, OneBatchIsDeletedInOrderOnTheFileQueue) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, OneBatchIsDeletedInOrderOnTheFileQueue) {
   open();
   for (const char* name : {"a", "b"}) directory.write(std::string("store/") + name, "x");
   files->clearTrace();
@@ -856,7 +856,7 @@ TEST_F(DeletingInBatches, OneBatchIsDeletedInOrderOnTheFileQueue) {
   EXPECT_EQ(told(deleted), "<done>");
 }
 
-TEST_F(DeletingInBatches, AnEmptyBatchIsDoneWhenTheFileQueueHasGotSoFar) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, AnEmptyBatchIsDoneWhenTheFileQueueHasGotSoFar) {
   open();
   const Written deleted = watch(store->deleteBatch({}));
   EXPECT_TRUE(deleted->isPending());
@@ -864,7 +864,7 @@ TEST_F(DeletingInBatches, AnEmptyBatchIsDoneWhenTheFileQueueHasGotSoFar) {
   EXPECT_EQ(told(deleted), "<done>");
 }
 
-TEST_F(DeletingInBatches, OneBatchThatTheQueueDoesNotTakeIsAFailedFuture) {
+TEST_F(PersistentKeyValueStoreDeletingInBatches, OneBatchThatTheQueueDoesNotTakeIsAFailedFuture) {
   open();
   file().throwOnDispatch(true);
   EXPECT_EQ(told(watch(store->deleteBatch({pathOf("a")}))), "<error> The queue takes no tasks.");
@@ -872,7 +872,7 @@ TEST_F(DeletingInBatches, OneBatchThatTheQueueDoesNotTakeIsAFailedFuture) {
 
 // --- Size report ---
 
-TEST_F(SizeReport, ComesAfterEachWriteAndEachDeletionRunAndNeverInBetween) {
+TEST_F(PersistentKeyValueStoreSizeReport, ComesAfterEachWriteAndEachDeletionRunAndNeverInBetween) {
   open();
   put("a", "12345");
   put("b", "123");
@@ -883,7 +883,7 @@ TEST_F(SizeReport, ComesAfterEachWriteAndEachDeletionRunAndNeverInBetween) {
   EXPECT_THAT(sizes, ElementsAre(5U, 8U, 0U));
 }
 
-TEST_F(SizeReport, TellsTheSizeOfTheMomentItWasAskedFor) {
+TEST_F(PersistentKeyValueStoreSizeReport, TellsTheSizeOfTheMomentItWasAskedFor) {
   open();
   watch(store->store("a", bytesOf("12345")));
   work().runAll();
@@ -893,7 +893,7 @@ TEST_F(SizeReport, TellsTheSizeOfTheMomentItWasAskedFor) {
   EXPECT_THAT(sizes, ElementsAre(5U, 8U));
 }
 
-TEST_F(SizeReport, IsSilentBeforeLoading) {
+TEST_F(PersistentKeyValueStoreSizeReport, IsSilentBeforeLoading) {
   openUnloaded();
   work().dropAll();
   store->reportSize();
@@ -901,7 +901,7 @@ TEST_F(SizeReport, IsSilentBeforeLoading) {
   EXPECT_THAT(sizes, IsEmpty());
 }
 
-TEST_F(SizeReport, MayCallTheStoreAgain) {
+TEST_F(PersistentKeyValueStoreSizeReport, MayCallTheStoreAgain) {
   int calls = 0;
   options.onSizeChanged = [&](unsigned int) {
     if (++calls > 3) return;

@@ -70,14 +70,14 @@ class RecoveryFixture : public KeyValueStoreFixture {
   }
 };
 
-class ADamagedManifest : public RecoveryFixture {};
-class ADamagedDatabase : public RecoveryFixture {};
-class AFullDisk : public RecoveryFixture {};
-class AVanishedDirectory : public RecoveryFixture {};
+class PersistentKeyValueStoreDamagedManifest : public RecoveryFixture {};
+class PersistentKeyValueStoreDamagedDatabase : public RecoveryFixture {};
+class PersistentKeyValueStoreFullDisk : public RecoveryFixture {};
+class PersistentKeyValueStoreVanishedDirectory : public RecoveryFixture {};
 
 // --- Each operation that meets the damage ---
 
-TEST_F(ADamagedManifest, FoundByTheProvisionalRecordPurgesAndWritesNoFile) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByTheProvisionalRecordPurgesAndWritesNoFile) {
   openWatched();
   put("old", "value");
   manifest->failNext(ManifestCall::SetItem, corrupted);
@@ -89,7 +89,7 @@ TEST_F(ADamagedManifest, FoundByTheProvisionalRecordPurgesAndWritesNoFile) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, ThatIsOnlyUnwritableAtTheProvisionalRecordPurgesToo) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, ThatIsOnlyUnwritableAtTheProvisionalRecordPurgesToo) {
   openWatched();
   put("old", "value");
   manifest->failNext(ManifestCall::SetItem, unwritable);
@@ -100,7 +100,7 @@ TEST_F(ADamagedManifest, ThatIsOnlyUnwritableAtTheProvisionalRecordPurgesToo) {
   expectPurged(log, unwritable);
 }
 
-TEST_F(ADamagedManifest, FoundByTheRealRecordPurgesAndTakesTheFileAlong) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByTheRealRecordPurgesAndTakesTheFileAlong) {
   for (const auto& error : {corrupted, ManifestCorruptedException("Another.", 26)}) {
     SCOPED_TRACE(error.what());
     openWatched();
@@ -119,7 +119,7 @@ TEST_F(ADamagedManifest, FoundByTheRealRecordPurgesAndTakesTheFileAlong) {
   }
 }
 
-TEST_F(ADamagedManifest, ThatIsOnlyUnwritableAtTheRealRecordPurgesToo) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, ThatIsOnlyUnwritableAtTheRealRecordPurgesToo) {
   openWatched();
   const Written written = watch(store->store("key", bytesOf("value")));
   work().runAll();
@@ -130,7 +130,7 @@ TEST_F(ADamagedManifest, ThatIsOnlyUnwritableAtTheRealRecordPurgesToo) {
   expectPurged(log, unwritable);
 }
 
-TEST_F(ADamagedManifest, FoundByAnInlineWritePurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByAnInlineWritePurges) {
   options.inlineData = true;
   for (const ManifestCall call : {ManifestCall::SetItem, ManifestCall::SetInlineData}) {
     for (const ManifestPersistenceException& error : {ManifestPersistenceException(corrupted), unwritable}) {
@@ -155,7 +155,7 @@ TEST_F(ADamagedManifest, FoundByAnInlineWritePurges) {
   }
 }
 
-TEST_F(ADamagedManifest, FoundByAnEvictionPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByAnEvictionPurges) {
   options.capacity = 1;
   openWatched();
   put("old", "value");
@@ -167,7 +167,7 @@ TEST_F(ADamagedManifest, FoundByAnEvictionPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByALookUpIsAMissAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByALookUpIsAMissAndPurges) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::GetItem, corrupted);
@@ -177,7 +177,7 @@ TEST_F(ADamagedManifest, FoundByALookUpIsAMissAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByNotingTheUseDeliversTheValueAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByNotingTheUseDeliversTheValueAndPurges) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::UpdateLastAccessDate, corrupted);
@@ -186,7 +186,7 @@ TEST_F(ADamagedManifest, FoundByNotingTheUseDeliversTheValueAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByReadingAnInlineValueIsAMissAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByReadingAnInlineValueIsAMissAndPurges) {
   options.inlineData = true;
   openWatched();
   put("key", "value");
@@ -196,7 +196,7 @@ TEST_F(ADamagedManifest, FoundByReadingAnInlineValueIsAMissAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByUpdatingTheAccessDateIsDoneAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByUpdatingTheAccessDateIsDoneAndPurges) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::UpdateLastAccessDate, corrupted);
@@ -207,7 +207,7 @@ TEST_F(ADamagedManifest, FoundByUpdatingTheAccessDateIsDoneAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByAskingForADateIsEmptyAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByAskingForADateIsEmptyAndPurges) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::GetModificationDate, corrupted);
@@ -216,7 +216,7 @@ TEST_F(ADamagedManifest, FoundByAskingForADateIsEmptyAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByTheLookUpOfARemovalIsDoneAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByTheLookUpOfARemovalIsDoneAndPurges) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::GetItem, corrupted);
@@ -225,7 +225,7 @@ TEST_F(ADamagedManifest, FoundByTheLookUpOfARemovalIsDoneAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByARemovalItselfIsDoneAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByARemovalItselfIsDoneAndPurges) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::RemoveItem, corrupted);
@@ -234,7 +234,7 @@ TEST_F(ADamagedManifest, FoundByARemovalItselfIsDoneAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByTheRemovalOfAWriteInFlightIsDoneAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByTheRemovalOfAWriteInFlightIsDoneAndPurges) {
   openWatched();
   const Written written = watch(store->store("key", bytesOf("value")));
   const Written removed = watch(store->removeItem("key"));
@@ -248,7 +248,7 @@ TEST_F(ADamagedManifest, FoundByTheRemovalOfAWriteInFlightIsDoneAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundAfterAFailedWriteLeavesTheWritersErrorAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundAfterAFailedWriteLeavesTheWritersErrorAndPurges) {
   openWatched();
   put("old", "value");
   const Written written =
@@ -260,7 +260,7 @@ TEST_F(ADamagedManifest, FoundAfterAFailedWriteLeavesTheWritersErrorAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByClearingIsDoneAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByClearingIsDoneAndPurges) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::PruneToSize, corrupted);
@@ -269,7 +269,7 @@ TEST_F(ADamagedManifest, FoundByClearingIsDoneAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByAWriteTakesAnEarlierOneOfItsKeyAlong) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByAWriteTakesAnEarlierOneOfItsKeyAlong) {
   openWatched();
   const Written earlier = watch(store->store("key", bytesOf("earlier")));
   ASSERT_TRUE(work().runNext());
@@ -283,7 +283,7 @@ TEST_F(ADamagedManifest, FoundByAWriteTakesAnEarlierOneOfItsKeyAlong) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByAFetchThatLostItsFileToARemovalIsAMissAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByAFetchThatLostItsFileToARemovalIsAMissAndPurges) {
   openWatched();
   put("key", "value");
   const Fetched fetched = watch(store->fetch("key"));
@@ -297,7 +297,7 @@ TEST_F(ADamagedManifest, FoundByAFetchThatLostItsFileToARemovalIsAMissAndPurges)
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByClearingCallsQueuedWritesOff) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByClearingCallsQueuedWritesOff) {
   openWatched();
   const Written written = watch(store->store("key", bytesOf("value")));
   ASSERT_TRUE(work().runNext());
@@ -308,7 +308,7 @@ TEST_F(ADamagedManifest, FoundByClearingCallsQueuedWritesOff) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByClearingWhatHasNoSizeIsDoneAndPurges) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByClearingWhatHasNoSizeIsDoneAndPurges) {
   openWatched();
   put("key", "");
   manifest->failNext(ManifestCall::RemoveItem, corrupted);
@@ -317,7 +317,7 @@ TEST_F(ADamagedManifest, FoundByClearingWhatHasNoSizeIsDoneAndPurges) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByExpiryPurgesAndExpiryComesAgain) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByExpiryPurgesAndExpiryComesAgain) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::PruneOldEntries, corrupted);
@@ -328,7 +328,7 @@ TEST_F(ADamagedManifest, FoundByExpiryPurgesAndExpiryComesAgain) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, FoundByLoadingPurgesAndExpiryIsArmed) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, FoundByLoadingPurgesAndExpiryIsArmed) {
   directory.write("store/old", "left over");
   openWatchedUnloaded();
   manifest->failNext(ManifestCall::Load, corrupted);
@@ -338,7 +338,7 @@ TEST_F(ADamagedManifest, FoundByLoadingPurgesAndExpiryIsArmed) {
   expectPurged(log, corrupted);
 }
 
-TEST_F(ADamagedManifest, PurgesInTheDescribedOrder) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgesInTheDescribedOrder) {
   openWatched();
   put("key", "value");
   keepJournal();
@@ -349,7 +349,7 @@ TEST_F(ADamagedManifest, PurgesInTheDescribedOrder) {
   EXPECT_EQ(trashQueues->runAll(), 1U);
 }
 
-TEST_F(ADamagedManifest, PurgeTakesAnyLarderExceptionAsItsReason) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgeTakesAnyLarderExceptionAsItsReason) {
   openWatched();
   const FileUtilsIoException reason(5, "Whatever.");
   const LogCapture log;
@@ -357,7 +357,7 @@ TEST_F(ADamagedManifest, PurgeTakesAnyLarderExceptionAsItsReason) {
   EXPECT_THAT(errorLines(log), ElementsAre(purgeLine(reason)));
 }
 
-TEST_F(ADamagedManifest, PurgedTwiceInARowWorksOn) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgedTwiceInARowWorksOn) {
   openWatched();
   put("key", "value");
   store->handleCorruptedManifest(corrupted);
@@ -368,7 +368,7 @@ TEST_F(ADamagedManifest, PurgedTwiceInARowWorksOn) {
   EXPECT_THAT(valueFiles(), ElementsAre("after"));
 }
 
-TEST_F(ADamagedManifest, PurgesARealStoreDownToAFreshDatabase) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgesARealStoreDownToAFreshDatabase) {
   open();
   put("key", "value");
   store->handleCorruptedManifest(corrupted);
@@ -378,7 +378,7 @@ TEST_F(ADamagedManifest, PurgesARealStoreDownToAFreshDatabase) {
   EXPECT_EQ(contents(), (Contents{{"after", "works"}}));
 }
 
-TEST_F(ADamagedManifest, PurgedWhileAFetchWaitsForItsFileMakesThatAMiss) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgedWhileAFetchWaitsForItsFileMakesThatAMiss) {
   openWatched();
   put("key", "value");
   const Fetched fetched = watch(store->fetch("key"));
@@ -388,7 +388,7 @@ TEST_F(ADamagedManifest, PurgedWhileAFetchWaitsForItsFileMakesThatAMiss) {
   EXPECT_EQ(told(fetched), "<miss>");
 }
 
-TEST_F(ADamagedManifest, PurgedWhileAWriteWaitsStillTakesThatWrite) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgedWhileAWriteWaitsStillTakesThatWrite) {
   openWatched();
   const Written written = watch(store->store("key", bytesOf("value")));
   work().runAll();
@@ -401,7 +401,7 @@ TEST_F(ADamagedManifest, PurgedWhileAWriteWaitsStillTakesThatWrite) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(ADamagedManifest, PurgedWhileWritesWaitStaysWithinItsCapacity) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgedWhileWritesWaitStaysWithinItsCapacity) {
   options.capacity = 2;
   openWatched();
   for (const std::string key : {"a", "b"}) watch(store->store(key, bytesOf("value")));
@@ -414,7 +414,7 @@ TEST_F(ADamagedManifest, PurgedWhileWritesWaitStaysWithinItsCapacity) {
   EXPECT_EQ(valueFiles(), keysInMedium());
 }
 
-TEST_F(ADamagedManifest, PurgedByARunningWriterLeavesTheValueWholeOrAbsent) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgedByARunningWriterLeavesTheValueWholeOrAbsent) {
   for (const bool writesFirst : {true, false}) {
     openWatched();
     put("old", "value");
@@ -436,7 +436,7 @@ TEST_F(ADamagedManifest, PurgedByARunningWriterLeavesTheValueWholeOrAbsent) {
   }
 }
 
-TEST_F(ADamagedManifest, PurgedByAWriterThatThenThrowsLeavesNothing) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgedByAWriterThatThenThrowsLeavesNothing) {
   openWatched();
   const Written written = watch(store->store("key", nullptr, [&](const std::string& path) -> unsigned int {
     store->handleCorruptedManifest(corrupted);
@@ -449,7 +449,7 @@ TEST_F(ADamagedManifest, PurgedByAWriterThatThenThrowsLeavesNothing) {
   EXPECT_THAT(keysInMedium(), IsEmpty());
 }
 
-TEST_F(ADamagedManifest, PurgedByARunningWriterLeavesANewerWriteOfTheKeyItsValue) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, PurgedByARunningWriterLeavesANewerWriteOfTheKeyItsValue) {
   openWatched();
   const Written first = watch(store->store("key", nullptr, [&](const std::string& path) {
     watch(store->store("key", bytesOf("newer")));
@@ -464,7 +464,7 @@ TEST_F(ADamagedManifest, PurgedByARunningWriterLeavesANewerWriteOfTheKeyItsValue
   EXPECT_THAT(valueFiles(), ElementsAre("key"));
 }
 
-TEST_F(ADamagedManifest, ThatCannotEvenBeReplacedFailsTheOperationAndHealsLater) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, ThatCannotEvenBeReplacedFailsTheOperationAndHealsLater) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::GetItem, corrupted);
@@ -476,7 +476,7 @@ TEST_F(ADamagedManifest, ThatCannotEvenBeReplacedFailsTheOperationAndHealsLater)
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(ADamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextOperation) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextOperation) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::SetItem, unwritable);
@@ -491,7 +491,7 @@ TEST_F(ADamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextOperat
   EXPECT_EQ(get("key"), "newer");
 }
 
-TEST_F(ADamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextWrite) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextWrite) {
   openWatched();
   manifest->failNext(ManifestCall::SetItem, unwritable);
   files->failNext(Operation::CreateDirectory, ENOSPC);
@@ -501,7 +501,7 @@ TEST_F(ADamagedManifest, WhoseDirectoryCannotBeMadeAgainYetIsMadeByTheNextWrite)
   EXPECT_EQ(get("key"), "new");
 }
 
-TEST_F(ADamagedManifest, WhoseDirectoryCannotBeCollectedIsEmptiedAllTheSame) {
+TEST_F(PersistentKeyValueStoreDamagedManifest, WhoseDirectoryCannotBeCollectedIsEmptiedAllTheSame) {
   openWatched();
   put("key", "value");
   trash->refuses = true;
@@ -514,7 +514,7 @@ TEST_F(ADamagedManifest, WhoseDirectoryCannotBeCollectedIsEmptiedAllTheSame) {
 
 // --- Real databases ---
 
-TEST_F(ADamagedDatabase, ThatIsNoDatabaseIsReplacedWhenTheStoreOpensTogetherWithAllFiles) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, ThatIsNoDatabaseIsReplacedWhenTheStoreOpensTogetherWithAllFiles) {
   directory.write("store/manifest_v1.sqlite", sizedGarbage());
   directory.write("store/old", "value");
   open();
@@ -526,7 +526,7 @@ TEST_F(ADamagedDatabase, ThatIsNoDatabaseIsReplacedWhenTheStoreOpensTogetherWith
   EXPECT_EQ(contents(), (Contents{{"key", "value"}}));
 }
 
-TEST_F(ADamagedDatabase, OfAnotherProgramIsReplacedWhenTheStoreOpens) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, OfAnotherProgramIsReplacedWhenTheStoreOpens) {
   directory.makeDirectory("store");
   sqlite3* database = nullptr;
   ASSERT_EQ(sqlite3_open(pathOf("manifest_v1.sqlite").c_str(), &database), SQLITE_OK);
@@ -540,7 +540,7 @@ TEST_F(ADamagedDatabase, OfAnotherProgramIsReplacedWhenTheStoreOpens) {
   EXPECT_EQ(rowsOnDisk().size(), 1U);
 }
 
-TEST_F(ADamagedDatabase, IsMetByTheFirstOperationJustAsWell) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, IsMetByTheFirstOperationJustAsWell) {
   directory.write("store/manifest_v1.sqlite", sizedGarbage());
   openUnloaded();
   EXPECT_EQ(store->fetchModificationDate("key"), std::nullopt);
@@ -549,7 +549,7 @@ TEST_F(ADamagedDatabase, IsMetByTheFirstOperationJustAsWell) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(ADamagedDatabase, ThatCannotBeReplacedThrowsAndIsTriedAgain) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, ThatCannotBeReplacedThrowsAndIsTriedAgain) {
   directory.write("store/manifest_v1.sqlite", sizedGarbage());
   openUnloaded();
   work().dropAll();
@@ -561,7 +561,7 @@ TEST_F(ADamagedDatabase, ThatCannotBeReplacedThrowsAndIsTriedAgain) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(ADamagedDatabase, WithDamagedPagesIsPurgedByLoadingAndTheStoreWorks) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, WithDamagedPagesIsPurgedByLoadingAndTheStoreWorks) {
   open();
   fill();
   close();
@@ -576,7 +576,7 @@ TEST_F(ADamagedDatabase, WithDamagedPagesIsPurgedByLoadingAndTheStoreWorks) {
   EXPECT_EQ(contents(), (Contents{{"key", "value"}}));
 }
 
-TEST_F(ADamagedDatabase, CutShortNeverFailsAnOperation) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, CutShortNeverFailsAnOperation) {
   open();
   fill();
   close();
@@ -604,7 +604,7 @@ TEST_F(ADamagedDatabase, CutShortNeverFailsAnOperation) {
   }
 }
 
-TEST_F(ADamagedDatabase, BeforeLoadingNeverFailsAnOperation) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, BeforeLoadingNeverFailsAnOperation) {
   open();
   fill();
   close();
@@ -617,7 +617,7 @@ TEST_F(ADamagedDatabase, BeforeLoadingNeverFailsAnOperation) {
   EXPECT_EQ(get("key5"), "new");
 }
 
-TEST_F(ADamagedDatabase, BeforeLoadingNeverFailsARemoval) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, BeforeLoadingNeverFailsARemoval) {
   open();
   fill();
   close();
@@ -629,7 +629,7 @@ TEST_F(ADamagedDatabase, BeforeLoadingNeverFailsARemoval) {
   EXPECT_EQ(get("key5"), "new");
 }
 
-TEST_F(ADamagedDatabase, BeforeLoadingNeverFailsAWrite) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, BeforeLoadingNeverFailsAWrite) {
   open();
   fill();
   close();
@@ -643,7 +643,7 @@ TEST_F(ADamagedDatabase, BeforeLoadingNeverFailsAWrite) {
   EXPECT_EQ(get("key5"), "newer");
 }
 
-TEST_F(ADamagedDatabase, InWhosePlaceADirectoryStandsFailsEachOperationUntilItIsRemoved) {
+TEST_F(PersistentKeyValueStoreDamagedDatabase, InWhosePlaceADirectoryStandsFailsEachOperationUntilItIsRemoved) {
   directory.makeDirectory("store/manifest_v1.sqlite");
   openUnloaded();
   EXPECT_ANY_THROW(work().runNext());
@@ -659,7 +659,7 @@ TEST_F(ADamagedDatabase, InWhosePlaceADirectoryStandsFailsEachOperationUntilItIs
 
 // --- A full disk ---
 
-TEST_F(AFullDisk, FailsTheFirstWriteLeavesAMissAndKeepsTheOthers) {
+TEST_F(PersistentKeyValueStoreFullDisk, FailsTheFirstWriteLeavesAMissAndKeepsTheOthers) {
   open();
   put("kept", "value");
   files->tearNextWrite(2, ENOSPC);
@@ -675,7 +675,7 @@ TEST_F(AFullDisk, FailsTheFirstWriteLeavesAMissAndKeepsTheOthers) {
   EXPECT_EQ(contents(), (Contents{{"kept", "value"}, {"key", "value"}}));
 }
 
-TEST_F(AFullDisk, HalfwayThroughAnOverwriteLeavesAMissAndNotHalfAValue) {
+TEST_F(PersistentKeyValueStoreFullDisk, HalfwayThroughAnOverwriteLeavesAMissAndNotHalfAValue) {
   open();
   put("key", "old value");
   files->tearNextWrite(2, ENOSPC);
@@ -687,7 +687,7 @@ TEST_F(AFullDisk, HalfwayThroughAnOverwriteLeavesAMissAndNotHalfAValue) {
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(AFullDisk, WhereNotEvenTheHalfCanBeTakenAwaySaysSoOnceAndFailsWithTheFirstReason) {
+TEST_F(PersistentKeyValueStoreFullDisk, WhereNotEvenTheHalfCanBeTakenAwaySaysSoOnceAndFailsWithTheFirstReason) {
   open();
   files->tearNextWrite(2, ENOSPC);
   files->failNext(Operation::DeleteFile, EIO);
@@ -701,7 +701,7 @@ TEST_F(AFullDisk, WhereNotEvenTheHalfCanBeTakenAwaySaysSoOnceAndFailsWithTheFirs
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(AFullDisk, WhereTheRecordCannotBeTakenAwayFailsWithTheFirstReason) {
+TEST_F(PersistentKeyValueStoreFullDisk, WhereTheRecordCannotBeTakenAwayFailsWithTheFirstReason) {
   openWatched();
   files->tearNextWrite(2, ENOSPC);
   manifest->failNext(ManifestCall::RemoveItem, unwritable);
@@ -715,7 +715,7 @@ TEST_F(AFullDisk, WhereTheRecordCannotBeTakenAwayFailsWithTheFirstReason) {
 
 // --- A directory that vanishes ---
 
-TEST_F(AVanishedDirectory, FailsWritesAndReadsAndIsBackAfterARestart) {
+TEST_F(PersistentKeyValueStoreVanishedDirectory, FailsWritesAndReadsAndIsBackAfterARestart) {
   open();
   put("key", "value");
   std::filesystem::remove_all(storePath());
@@ -731,7 +731,7 @@ TEST_F(AVanishedDirectory, FailsWritesAndReadsAndIsBackAfterARestart) {
 }
 
 // As a phone does that is short of space, while the application runs.
-TEST_F(AVanishedDirectory, EmptiedUnderneathTakesNewValuesButForgetsThemAtARestart) {
+TEST_F(PersistentKeyValueStoreVanishedDirectory, EmptiedUnderneathTakesNewValuesButForgetsThemAtARestart) {
   open();
   put("key", "value");
   for (const std::string& name : directory.names("store")) std::filesystem::remove(pathOf(name));
@@ -746,7 +746,7 @@ TEST_F(AVanishedDirectory, EmptiedUnderneathTakesNewValuesButForgetsThemAtAResta
   EXPECT_EQ(get("new"), "newer");
 }
 
-TEST_F(AVanishedDirectory, IsClearedAndExpiredWithoutAnError) {
+TEST_F(PersistentKeyValueStoreVanishedDirectory, IsClearedAndExpiredWithoutAnError) {
   open();
   put("key", "value");
   std::filesystem::remove_all(storePath());

@@ -51,20 +51,20 @@ using testing::IsEmpty;
 
 using Loader = PersistentKeyValueStore::Loader;
 
-class CreatingAStore : public KeyValueStoreFixture {};
-class StoringAValue : public KeyValueStoreFixture {};
-class FetchingAValue : public KeyValueStoreFixture {};
-class FetchingTheFirst : public KeyValueStoreFixture {};
-class RemovingAValue : public KeyValueStoreFixture {};
-class AskingForDates : public KeyValueStoreFixture {};
-class StoringInline : public KeyValueStoreFixture {
+class PersistentKeyValueStoreCreating : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreStoring : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreFetching : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreFetchingTheFirst : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreRemoving : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreAskingForDates : public KeyValueStoreFixture {};
+class PersistentKeyValueStoreStoringInline : public KeyValueStoreFixture {
  protected:
   void SetUp() override { options.inlineData = true; }
 };
 
 // --- Creating ---
 
-TEST_F(CreatingAStore, MakesItsDirectoryAndTheOnesAboveIt) {
+TEST_F(PersistentKeyValueStoreCreating, MakesItsDirectoryAndTheOnesAboveIt) {
   const std::string path = directory.file("a/b/store");
   const PersistentKeyValueStore made(path, "", "larder", std::nullopt, 10, false, queues, nullptr, trash, nullptr,
                                      nullptr, nullptr, files, nullptr, 50);
@@ -73,7 +73,7 @@ TEST_F(CreatingAStore, MakesItsDirectoryAndTheOnesAboveIt) {
   EXPECT_EQ(queues->workQueueCount(), 1U);
 }
 
-TEST_F(CreatingAStore, WithoutOptionsTakesEachArgumentInItsPlace) {
+TEST_F(PersistentKeyValueStoreCreating, WithoutOptionsTakesEachArgumentInItsPlace) {
   store = PersistentKeyValueStore::createPersistentKeyValueStore(storePath(), directory.file("temporary"), "larder", 3,
                                                                  1000, true, queues, trash, reporter, nullptr, files,
                                                                  options.onSizeChanged, 2);
@@ -98,12 +98,12 @@ TEST_F(CreatingAStore, WithoutOptionsTakesEachArgumentInItsPlace) {
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(CreatingAStore, ThrowsWhatCreatingTheDirectoryThrows) {
+TEST_F(PersistentKeyValueStoreCreating, ThrowsWhatCreatingTheDirectoryThrows) {
   files->failNext(Operation::CreateDirectory, EROFS);
   EXPECT_THROW(openUnloaded(), FileUtilsIoException);
 }
 
-TEST_F(CreatingAStore, TouchesNoManifestOnTheCallersThread) {
+TEST_F(PersistentKeyValueStoreCreating, TouchesNoManifestOnTheCallersThread) {
   openUnloaded();
   EXPECT_THAT(directory.names("store"), IsEmpty());
   EXPECT_EQ(work().pending(), 1U);
@@ -113,7 +113,7 @@ TEST_F(CreatingAStore, TouchesNoManifestOnTheCallersThread) {
   EXPECT_EQ(file().pending(), 0U);
 }
 
-TEST_F(CreatingAStore, LoadsOnceAndArmsTheFirstExpiryInFiveMinutes) {
+TEST_F(PersistentKeyValueStoreCreating, LoadsOnceAndArmsTheFirstExpiryInFiveMinutes) {
   openWatchedUnloaded();
   EXPECT_THAT(work().armedDelays(), IsEmpty());
   settle();
@@ -123,13 +123,13 @@ TEST_F(CreatingAStore, LoadsOnceAndArmsTheFirstExpiryInFiveMinutes) {
   EXPECT_THAT(file().armedDelays(), IsEmpty());
 }
 
-TEST_F(CreatingAStore, IsNotPrunableAndSaysSoWhenAskedToPrune) {
+TEST_F(PersistentKeyValueStoreCreating, IsNotPrunableAndSaysSoWhenAskedToPrune) {
   open();
   EXPECT_FALSE(store->isPrunable());
   EXPECT_THROW(store->pruneBackToNormal(nullptr, nullptr, false), std::logic_error);
 }
 
-TEST_F(CreatingAStore, KeepsThePathsItWasGiven) {
+TEST_F(PersistentKeyValueStoreCreating, KeepsThePathsItWasGiven) {
   open();
   EXPECT_EQ(store->path, storePath());
   EXPECT_EQ(store->getFilePath("name"), storePath() + "/name");
@@ -138,14 +138,14 @@ TEST_F(CreatingAStore, KeepsThePathsItWasGiven) {
   EXPECT_FALSE(directory.exists("temporary"));
 }
 
-TEST_F(CreatingAStore, UsesTheManifestItIsGivenAndMakesNoOther) {
+TEST_F(PersistentKeyValueStoreCreating, UsesTheManifestItIsGivenAndMakesNoOther) {
   openWatched();
   EXPECT_EQ(store->getManifest(), manifest);
   put("key", "value");
   EXPECT_THAT(directory.names("store"), ElementsAre("key"));
 }
 
-TEST_F(CreatingAStore, MakesOneManifestHoweverOftenItIsAskedFor) {
+TEST_F(PersistentKeyValueStoreCreating, MakesOneManifestHoweverOftenItIsAskedFor) {
   openUnloaded();
   const auto first = store->getManifest();
   EXPECT_NE(first, nullptr);
@@ -153,7 +153,7 @@ TEST_F(CreatingAStore, MakesOneManifestHoweverOftenItIsAskedFor) {
   EXPECT_EQ(store->getManifest(), first);
 }
 
-TEST_F(CreatingAStore, FromADefinitionDeletesInBatchesOfFiftyFromFiveMinutesOn) {
+TEST_F(PersistentKeyValueStoreCreating, FromADefinitionDeletesInBatchesOfFiftyFromFiveMinutesOn) {
   const PKVSDefinition definition("larder", "manager", false, false, 0, std::nullopt, false, 100);
   const auto made = definition.createStore(
       storePath(), directory.file("temporary"), queues, trash, reporter, files,
@@ -175,7 +175,7 @@ TEST_F(CreatingAStore, FromADefinitionDeletesInBatchesOfFiftyFromFiveMinutesOn) 
   EXPECT_THAT(work().armedDelays(), testing::Contains(3600 * kSecond));
 }
 
-TEST_F(CreatingAStore, FromADefinitionTakesOverCapacityAndInlineData) {
+TEST_F(PersistentKeyValueStoreCreating, FromADefinitionTakesOverCapacityAndInlineData) {
   const PKVSDefinition definition("larder", "manager", false, false, 0, 1, true, 100);
   const auto made = definition.createStore(storePath(), "", queues, trash, nullptr, files, nullptr,
                                            PruneStrategyIdentifier::Null, nullptr);
@@ -187,7 +187,7 @@ TEST_F(CreatingAStore, FromADefinitionTakesOverCapacityAndInlineData) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST(StaleAgeOf, KeepsSecondsAndNeverTurnsNegative) {
+TEST(PersistentKeyValueStoreStaleAgeOf, KeepsSecondsAndNeverTurnsNegative) {
   EXPECT_EQ(staleAgeOf(0), 0);
   EXPECT_EQ(staleAgeOf(100), 100);
   EXPECT_GT(staleAgeOf(std::numeric_limits<std::uint32_t>::max()), 0);
@@ -195,14 +195,14 @@ TEST(StaleAgeOf, KeepsSecondsAndNeverTurnsNegative) {
 
 // --- Storing ---
 
-TEST_F(StoringAValue, IsFetchedAgain) {
+TEST_F(PersistentKeyValueStoreStoring, IsFetchedAgain) {
   open();
   put("key", "value");
   EXPECT_EQ(get("key"), "value");
   EXPECT_EQ(valueFile("key"), "value");
 }
 
-TEST_F(StoringAValue, IsFoundAgainAfterARestart) {
+TEST_F(PersistentKeyValueStoreStoring, IsFoundAgainAfterARestart) {
   open();
   put("key", "value");
   put("empty", "");
@@ -210,13 +210,13 @@ TEST_F(StoringAValue, IsFoundAgainAfterARestart) {
   EXPECT_EQ(contents(), (Contents{{"key", "value"}, {"empty", ""}}));
 }
 
-TEST_F(StoringAValue, WritesARowWithTheKeyAsFileNameAndTheDatesOfNow) {
+TEST_F(PersistentKeyValueStoreStoring, WritesARowWithTheKeyAsFileNameAndTheDatesOfNow) {
   open();
   put("key", "value");
   EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 0 1000000 1000000 -"));
 }
 
-TEST_F(StoringAValue, DoesNothingOnTheCallersThread) {
+TEST_F(PersistentKeyValueStoreStoring, DoesNothingOnTheCallersThread) {
   openWatched();
   keepJournal();
   const Written written = watch(store->store("key", bytesOf("value")));
@@ -226,7 +226,7 @@ TEST_F(StoringAValue, DoesNothingOnTheCallersThread) {
   EXPECT_TRUE(written->isPending());
 }
 
-TEST_F(StoringAValue, RecordsProvisionallyThenWritesTheFileThenRecordsTheSize) {
+TEST_F(PersistentKeyValueStoreStoring, RecordsProvisionallyThenWritesTheFileThenRecordsTheSize) {
   openWatched();
   keepJournal();
   const Written written = watch(store->store("key", bytesOf("value")));
@@ -245,7 +245,7 @@ TEST_F(StoringAValue, RecordsProvisionallyThenWritesTheFileThenRecordsTheSize) {
   EXPECT_THAT(takeJournal(), IsEmpty());
 }
 
-TEST_F(StoringAValue, DatesBothRecordsWithTheirOwnNow) {
+TEST_F(PersistentKeyValueStoreStoring, DatesBothRecordsWithTheirOwnNow) {
   openWatched();
   const Written written = watch(store->store("key", bytesOf("value")));
   clock.set(2'000'000);
@@ -266,7 +266,7 @@ TEST_F(StoringAValue, DatesBothRecordsWithTheirOwnNow) {
   EXPECT_EQ(real.lastAccessDate, 3'000'000);
 }
 
-TEST_F(StoringAValue, KeepsTheMetadataInBothRecords) {
+TEST_F(PersistentKeyValueStoreStoring, KeepsTheMetadataInBothRecords) {
   class Metadata final : public DiskCacheItem::ExtendedMetadata {
    public:
     std::vector<unsigned char> serialize() const override { return {1}; }
@@ -281,7 +281,7 @@ TEST_F(StoringAValue, KeepsTheMetadataInBothRecords) {
   EXPECT_EQ(medium->rows().at("key").item.extendedMetadata, metadata);
 }
 
-TEST_F(StoringAValue, CopiesTheBytesAtTheCall) {
+TEST_F(PersistentKeyValueStoreStoring, CopiesTheBytesAtTheCall) {
   open();
   Bytes data = bytesOf("value");
   const Written written = watch(store->store("key", data));
@@ -291,7 +291,7 @@ TEST_F(StoringAValue, CopiesTheBytesAtTheCall) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(StoringAValue, WhereAFifoLiesFailsAndLeavesAMiss) {
+TEST_F(PersistentKeyValueStoreStoring, WhereAFifoLiesFailsAndLeavesAMiss) {
   const test::Watchdog watchdog(60);
   open();
   ASSERT_EQ(mkfifo(pathOf("key").c_str(), 0600), 0);
@@ -302,7 +302,7 @@ TEST_F(StoringAValue, WhereAFifoLiesFailsAndLeavesAMiss) {
   EXPECT_EQ(get("key"), "<miss>");
 }
 
-TEST_F(StoringAValue, OverwritesTheFileInPlaceAndReplacesTheRow) {
+TEST_F(PersistentKeyValueStoreStoring, OverwritesTheFileInPlaceAndReplacesTheRow) {
   open();
   put("key", "a long value");
   std::filesystem::create_hard_link(pathOf("key"), directory.file("same file"));
@@ -316,14 +316,14 @@ TEST_F(StoringAValue, OverwritesTheFileInPlaceAndReplacesTheRow) {
   EXPECT_THAT(valueFiles(), ElementsAre("key"));
 }
 
-TEST_F(StoringAValue, ChangesTheReportedTotalByTheDifferenceWhenItOverwrites) {
+TEST_F(PersistentKeyValueStoreStoring, ChangesTheReportedTotalByTheDifferenceWhenItOverwrites) {
   open();
   put("key", "a long value");
   put("key", "short");
   EXPECT_THAT(sizes, ElementsAre(12U, 5U));
 }
 
-TEST_F(StoringAValue, OfAWriterRecordsTheSizeTheWriterReturns) {
+TEST_F(PersistentKeyValueStoreStoring, OfAWriterRecordsTheSizeTheWriterReturns) {
   open();
   std::string path;
   const Written written = watch(store->store("key", nullptr, [&](const std::string& filePath) {
@@ -338,7 +338,7 @@ TEST_F(StoringAValue, OfAWriterRecordsTheSizeTheWriterReturns) {
   EXPECT_THAT(sizes, ElementsAre(77U));
 }
 
-TEST_F(StoringAValue, CallsTheWriterOnTheFileQueueWithNoLockHeld) {
+TEST_F(PersistentKeyValueStoreStoring, CallsTheWriterOnTheFileQueueWithNoLockHeld) {
   open();
   bool called = false;
   const Written written = watch(store->store("key", nullptr, [&](const std::string& filePath) {
@@ -354,7 +354,7 @@ TEST_F(StoringAValue, CallsTheWriterOnTheFileQueueWithNoLockHeld) {
   EXPECT_EQ(told(written), "<done>");
 }
 
-TEST_F(StoringAValue, NeedsNoManifestThatCanTellWhatItReplaces) {
+TEST_F(PersistentKeyValueStoreStoring, NeedsNoManifestThatCanTellWhatItReplaces) {
   for (const bool inlineData : {false, true}) {
     options.inlineData = inlineData;
     openWatched();
@@ -367,7 +367,7 @@ TEST_F(StoringAValue, NeedsNoManifestThatCanTellWhatItReplaces) {
   }
 }
 
-TEST_F(StoringAValue, WithoutAWriterFailsAndLeavesAMiss) {
+TEST_F(PersistentKeyValueStoreStoring, WithoutAWriterFailsAndLeavesAMiss) {
   open();
   const Written written = watch(store->store("key", nullptr, nullptr));
   settle();
@@ -376,7 +376,7 @@ TEST_F(StoringAValue, WithoutAWriterFailsAndLeavesAMiss) {
   EXPECT_THAT(rowsOnDisk(), IsEmpty());
 }
 
-TEST_F(StoringAValue, WorksWithoutReporterAndSizeCallback) {
+TEST_F(PersistentKeyValueStoreStoring, WorksWithoutReporterAndSizeCallback) {
   reporter = nullptr;
   options.onSizeChanged = nullptr;
   open();
@@ -388,7 +388,7 @@ TEST_F(StoringAValue, WorksWithoutReporterAndSizeCallback) {
   EXPECT_EQ(told(used), "<done>");
 }
 
-TEST_F(StoringAValue, BeforeTheManifestIsLoadedWorksAndReportsNoSize) {
+TEST_F(PersistentKeyValueStoreStoring, BeforeTheManifestIsLoadedWorksAndReportsNoSize) {
   openWatchedUnloaded();
   work().dropAll();  // the loading never comes
   put("key", "value");
@@ -399,7 +399,7 @@ TEST_F(StoringAValue, BeforeTheManifestIsLoadedWorksAndReportsNoSize) {
 
 // --- Fetching ---
 
-TEST_F(FetchingAValue, OfAnUnknownKeyIsAMissThatTouchesNoFile) {
+TEST_F(PersistentKeyValueStoreFetching, OfAnUnknownKeyIsAMissThatTouchesNoFile) {
   openWatched();
   keepJournal();
   EXPECT_EQ(get("key"), "<miss>");
@@ -407,7 +407,7 @@ TEST_F(FetchingAValue, OfAnUnknownKeyIsAMissThatTouchesNoFile) {
   EXPECT_THAT(accesses(), ElementsAre("1 key 0 0"));
 }
 
-TEST_F(FetchingAValue, LooksUpOnTheWorkQueueAndReadsOnTheFileQueue) {
+TEST_F(PersistentKeyValueStoreFetching, LooksUpOnTheWorkQueueAndReadsOnTheFileQueue) {
   openWatched();
   put("key", "value");
   keepJournal();
@@ -424,7 +424,7 @@ TEST_F(FetchingAValue, LooksUpOnTheWorkQueueAndReadsOnTheFileQueue) {
   EXPECT_EQ(work().pending() + file().pending(), 0U);
 }
 
-TEST_F(FetchingAValue, TellsTheKeyAndWhenItWasStored) {
+TEST_F(PersistentKeyValueStoreFetching, TellsTheKeyAndWhenItWasStored) {
   open();
   put("key", "value");
   clock.advance(70);
@@ -435,7 +435,7 @@ TEST_F(FetchingAValue, TellsTheKeyAndWhenItWasStored) {
   EXPECT_EQ((*fetched->value)->modificationDate, kStart);
 }
 
-TEST_F(FetchingAValue, ReportsOneHitWithAgeAndSize) {
+TEST_F(PersistentKeyValueStoreFetching, ReportsOneHitWithAgeAndSize) {
   open();
   put("key", "value");
   clock.advance(70);
@@ -443,7 +443,7 @@ TEST_F(FetchingAValue, ReportsOneHitWithAgeAndSize) {
   EXPECT_THAT(accesses(), ElementsAre("0 key 70 5"));
 }
 
-TEST_F(FetchingAValue, ReportsAnAgeBeyondWhatLongHoldsAsTheGreatestAndNeverAsANegativeOne) {
+TEST_F(PersistentKeyValueStoreFetching, ReportsAnAgeBeyondWhatLongHoldsAsTheGreatestAndNeverAsANegativeOne) {
   open();
   clock.set(std::numeric_limits<std::int32_t>::min());  // what a date after 2038 is read as
   put("key", "value");
@@ -454,7 +454,7 @@ TEST_F(FetchingAValue, ReportsAnAgeBeyondWhatLongHoldsAsTheGreatestAndNeverAsANe
   EXPECT_THAT(accesses(), ElementsAre("0 key " + std::to_string(reported) + " 5"));
 }
 
-TEST_F(FetchingAValue, ReportsBeforeTheFileIsRead) {
+TEST_F(PersistentKeyValueStoreFetching, ReportsBeforeTheFileIsRead) {
   open();
   put("key", "value");
   watch(store->fetch("key"));
@@ -465,7 +465,7 @@ TEST_F(FetchingAValue, ReportsBeforeTheFileIsRead) {
   EXPECT_EQ(accesses().size(), 1U);
 }
 
-TEST_F(FetchingAValue, CountsAsAUseOfTheItem) {
+TEST_F(PersistentKeyValueStoreFetching, CountsAsAUseOfTheItem) {
   openWatched();
   put("key", "value");
   clock.advance(70);
@@ -474,7 +474,7 @@ TEST_F(FetchingAValue, CountsAsAUseOfTheItem) {
   EXPECT_EQ(manifest->getItem("key")->modificationDate, kStart);
 }
 
-TEST_F(FetchingAValue, WithAReaderGivesWhatTheReaderReturns) {
+TEST_F(PersistentKeyValueStoreFetching, WithAReaderGivesWhatTheReaderReturns) {
   open();
   put("key", "value");
   std::string path;
@@ -487,7 +487,7 @@ TEST_F(FetchingAValue, WithAReaderGivesWhatTheReaderReturns) {
   EXPECT_EQ(path, pathOf("key"));
 }
 
-TEST_F(FetchingAValue, WithAReaderThatThrowsFailsWithThatAndIsNoUse) {
+TEST_F(PersistentKeyValueStoreFetching, WithAReaderThatThrowsFailsWithThatAndIsNoUse) {
   openWatched();
   put("key", "value");
   const Fetched fetched =
@@ -498,7 +498,7 @@ TEST_F(FetchingAValue, WithAReaderThatThrowsFailsWithThatAndIsNoUse) {
   EXPECT_EQ(manifest->calls(ManifestCall::UpdateLastAccessDate), 0U);
 }
 
-TEST_F(FetchingAValue, WithALoaderPassesTheItemThePathAndEmptyBytes) {
+TEST_F(PersistentKeyValueStoreFetching, WithALoaderPassesTheItemThePathAndEmptyBytes) {
   open();
   put("key", "value");
   std::shared_ptr<const DiskCacheItem> seen;
@@ -519,7 +519,7 @@ TEST_F(FetchingAValue, WithALoaderPassesTheItemThePathAndEmptyBytes) {
   EXPECT_EQ(path, pathOf("key"));
 }
 
-TEST_F(FetchingAValue, WithALoaderThatRefusesIsAMissAndNoUse) {
+TEST_F(PersistentKeyValueStoreFetching, WithALoaderThatRefusesIsAMissAndNoUse) {
   openWatched();
   put("key", "value");
   const Fetched fetched =
@@ -533,7 +533,7 @@ TEST_F(FetchingAValue, WithALoaderThatRefusesIsAMissAndNoUse) {
   EXPECT_THAT(accesses(), ElementsAre("0 key 0 5"));  // the item was there
 }
 
-TEST_F(FetchingAValue, CallsTheLoaderWithNoLockHeld) {
+TEST_F(PersistentKeyValueStoreFetching, CallsTheLoaderWithNoLockHeld) {
   open();
   put("key", "value");
   const Fetched fetched = watch(
@@ -545,7 +545,7 @@ TEST_F(FetchingAValue, CallsTheLoaderWithNoLockHeld) {
   EXPECT_EQ(told(fetched), "value");
 }
 
-TEST_F(FetchingAValue, WhoseFileVanishedBehindTheStoreIsTheErrorOfReading) {
+TEST_F(PersistentKeyValueStoreFetching, WhoseFileVanishedBehindTheStoreIsTheErrorOfReading) {
   open();
   put("key", "value");
   std::filesystem::remove(pathOf("key"));
@@ -556,7 +556,7 @@ TEST_F(FetchingAValue, WhoseFileVanishedBehindTheStoreIsTheErrorOfReading) {
   EXPECT_THAT(store->getAllKeys(), ElementsAre("key"));
 }
 
-TEST_F(FetchingAValue, WhoseFileIsAFifoIsTheErrorOfReadingUntilTheKeyIsRemoved) {
+TEST_F(PersistentKeyValueStoreFetching, WhoseFileIsAFifoIsTheErrorOfReadingUntilTheKeyIsRemoved) {
   const test::Watchdog watchdog(60);
   open();
   put("key", "value");
@@ -568,7 +568,7 @@ TEST_F(FetchingAValue, WhoseFileIsAFifoIsTheErrorOfReadingUntilTheKeyIsRemoved) 
   EXPECT_EQ(get("key"), "other");
 }
 
-TEST_F(FetchingAValue, WhoseFileIsTakenByALaterRemovalIsAMiss) {
+TEST_F(PersistentKeyValueStoreFetching, WhoseFileIsTakenByALaterRemovalIsAMiss) {
   open();
   put("key", "value");
   const Fetched fetched = watch(store->fetch("key"));
@@ -579,7 +579,7 @@ TEST_F(FetchingAValue, WhoseFileIsTakenByALaterRemovalIsAMiss) {
   EXPECT_EQ(told(removed), "<done>");
 }
 
-TEST_F(FetchingAValue, WhoseFileIsTakenByALaterRemovalAndWrittenAnewIsAMissAndNoError) {
+TEST_F(PersistentKeyValueStoreFetching, WhoseFileIsTakenByALaterRemovalAndWrittenAnewIsAMissAndNoError) {
   open();
   put("key", "value");
   const Fetched fetched = watch(store->fetch("key"));
@@ -591,7 +591,7 @@ TEST_F(FetchingAValue, WhoseFileIsTakenByALaterRemovalAndWrittenAnewIsAMissAndNo
   EXPECT_EQ(get("key"), "new");
 }
 
-TEST_F(FetchingAValue, CompletesAPendingWriteOfTheKeyFirst) {
+TEST_F(PersistentKeyValueStoreFetching, CompletesAPendingWriteOfTheKeyFirst) {
   open();
   watch(store->store("key", bytesOf("value")));
   const Fetched fetched = watch(store->fetch("key"));
@@ -599,7 +599,7 @@ TEST_F(FetchingAValue, CompletesAPendingWriteOfTheKeyFirst) {
   EXPECT_EQ(told(fetched), "value");
 }
 
-TEST_F(FetchingAValue, BeforeTheManifestIsLoadedReadsTheOneRecord) {
+TEST_F(PersistentKeyValueStoreFetching, BeforeTheManifestIsLoadedReadsTheOneRecord) {
   open();
   put("key", "value");
   close();
@@ -609,7 +609,7 @@ TEST_F(FetchingAValue, BeforeTheManifestIsLoadedReadsTheOneRecord) {
   EXPECT_FALSE(store->getManifest()->isLoaded());
 }
 
-TEST_F(FetchingAValue, FailsWithWhatTheManifestThrowsWhenItIsNotDamaged) {
+TEST_F(PersistentKeyValueStoreFetching, FailsWithWhatTheManifestThrowsWhenItIsNotDamaged) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::GetItem, unwritable);
@@ -619,7 +619,7 @@ TEST_F(FetchingAValue, FailsWithWhatTheManifestThrowsWhenItIsNotDamaged) {
 
 // --- readValue ---
 
-TEST_F(FetchingAValue, ReadValueReadsTheFileOfAnOrdinaryItem) {
+TEST_F(PersistentKeyValueStoreFetching, ReadValueReadsTheFileOfAnOrdinaryItem) {
   open();
   const std::string path = directory.write("elsewhere", "bytes");
   const auto item = std::make_shared<DiskCacheItem>("key", "key", 5, false, 0, 0, nullptr);
@@ -629,7 +629,7 @@ TEST_F(FetchingAValue, ReadValueReadsTheFileOfAnOrdinaryItem) {
   EXPECT_THROW(store->readValue(item, directory.file("nowhere"), value), FileUtilsIoException);
 }
 
-TEST_F(FetchingAValue, ReadValueReadsTheManifestForAnInlineItem) {
+TEST_F(PersistentKeyValueStoreFetching, ReadValueReadsTheManifestForAnInlineItem) {
   options.inlineData = true;
   openWatched();
   put("key", "value");
@@ -639,7 +639,7 @@ TEST_F(FetchingAValue, ReadValueReadsTheManifestForAnInlineItem) {
   EXPECT_EQ(textOf(value), "value");
 }
 
-TEST_F(FetchingAValue, ReadValueOfADamagedManifestPurgesAndRefuses) {
+TEST_F(PersistentKeyValueStoreFetching, ReadValueOfADamagedManifestPurgesAndRefuses) {
   options.inlineData = true;
   openWatched();
   put("key", "value");
@@ -654,7 +654,7 @@ TEST_F(FetchingAValue, ReadValueOfADamagedManifestPurgesAndRefuses) {
 
 // --- The first of several ---
 
-TEST_F(FetchingTheFirst, OfNoKeysIsAMissThatReportsNothingAndAsksNothing) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, OfNoKeysIsAMissThatReportsNothingAndAsksNothing) {
   openWatched();
   keepJournal();
   const Fetched fetched = watch(store->fetchFirst({}, answering("x")));
@@ -664,7 +664,7 @@ TEST_F(FetchingTheFirst, OfNoKeysIsAMissThatReportsNothingAndAsksNothing) {
   EXPECT_THAT(events->events(), IsEmpty());
 }
 
-TEST_F(FetchingTheFirst, OfUnknownKeysAsksForAllAndReportsOneMissOfTheFirst) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, OfUnknownKeysAsksForAllAndReportsOneMissOfTheFirst) {
   openWatched();
   keepJournal();
   const Fetched fetched = watch(store->fetchFirst({"a", "b", "c"}, answering("x")));
@@ -674,7 +674,7 @@ TEST_F(FetchingTheFirst, OfUnknownKeysAsksForAllAndReportsOneMissOfTheFirst) {
   EXPECT_THAT(accesses(), ElementsAre("1 a 0 0"));
 }
 
-TEST_F(FetchingTheFirst, StopsAtTheFirstKeyThatIsThereAndNamesIt) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, StopsAtTheFirstKeyThatIsThereAndNamesIt) {
   openWatched();
   put("b", "bee");
   put("c", "sea");
@@ -695,7 +695,7 @@ TEST_F(FetchingTheFirst, StopsAtTheFirstKeyThatIsThereAndNamesIt) {
   EXPECT_THAT(accesses(), ElementsAre("0 b 9 3"));
 }
 
-TEST_F(FetchingTheFirst, OfKeysInAnotherOrderFindsAnotherOne) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, OfKeysInAnotherOrderFindsAnotherOne) {
   open();
   put("b", "bee");
   put("c", "sea");
@@ -705,7 +705,7 @@ TEST_F(FetchingTheFirst, OfKeysInAnotherOrderFindsAnotherOne) {
   EXPECT_EQ((*fetched->value)->key, "c");
 }
 
-TEST_F(FetchingTheFirst, EndsTheSearchAsAMissWhenTheManifestIsDamaged) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, EndsTheSearchAsAMissWhenTheManifestIsDamaged) {
   openWatched();
   put("b", "bee");
   keepJournal();
@@ -719,7 +719,7 @@ TEST_F(FetchingTheFirst, EndsTheSearchAsAMissWhenTheManifestIsDamaged) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
-TEST_F(FetchingTheFirst, PurgesOnceHoweverManyKeysThereAre) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, PurgesOnceHoweverManyKeysThereAre) {
   openWatched();
   for (int i = 0; i < 3; ++i) manifest->failNext(ManifestCall::GetItem, corrupted);
   const LogCapture log;
@@ -730,7 +730,7 @@ TEST_F(FetchingTheFirst, PurgesOnceHoweverManyKeysThereAre) {
   EXPECT_EQ(trash->collected().size(), 1U);
 }
 
-TEST_F(FetchingTheFirst, DoesNotGoOnToTheNextKeyWhenTheLoaderRefuses) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, DoesNotGoOnToTheNextKeyWhenTheLoaderRefuses) {
   open();
   put("a", "1");
   put("b", "2");
@@ -745,7 +745,7 @@ TEST_F(FetchingTheFirst, DoesNotGoOnToTheNextKeyWhenTheLoaderRefuses) {
   EXPECT_EQ(calls, 1);
 }
 
-TEST_F(FetchingTheFirst, OfTheSameKeyTwiceIsLikeOnce) {
+TEST_F(PersistentKeyValueStoreFetchingTheFirst, OfTheSameKeyTwiceIsLikeOnce) {
   open();
   put("a", "1");
   const Fetched fetched = watch(store->fetchFirst({"a", "a"}, answering("x")));
@@ -756,7 +756,7 @@ TEST_F(FetchingTheFirst, OfTheSameKeyTwiceIsLikeOnce) {
 
 // --- Removing ---
 
-TEST_F(RemovingAValue, TakesRecordAndFileOnTheWorkQueue) {
+TEST_F(PersistentKeyValueStoreRemoving, TakesRecordAndFileOnTheWorkQueue) {
   openWatched();
   put("key", "value");
   keepJournal();
@@ -768,7 +768,7 @@ TEST_F(RemovingAValue, TakesRecordAndFileOnTheWorkQueue) {
   EXPECT_EQ(file().pending(), 0U);
 }
 
-TEST_F(RemovingAValue, IsAMissAtOnceAndAfterARestart) {
+TEST_F(PersistentKeyValueStoreRemoving, IsAMissAtOnceAndAfterARestart) {
   open();
   put("key", "value");
   put("other", "kept");
@@ -779,14 +779,14 @@ TEST_F(RemovingAValue, IsAMissAtOnceAndAfterARestart) {
   EXPECT_THAT(valueFiles(), ElementsAre("other"));
 }
 
-TEST_F(RemovingAValue, ThatIsNotThereSucceedsAndTouchesNothing) {
+TEST_F(PersistentKeyValueStoreRemoving, ThatIsNotThereSucceedsAndTouchesNothing) {
   openWatched();
   keepJournal();
   EXPECT_EQ(drop("key"), "<done>");
   EXPECT_THAT(takeJournal(), ElementsAre("getItem key"));
 }
 
-TEST_F(RemovingAValue, TwiceSucceedsTwice) {
+TEST_F(PersistentKeyValueStoreRemoving, TwiceSucceedsTwice) {
   open();
   put("key", "value");
   const Written first = watch(store->removeItem("key"));
@@ -796,7 +796,7 @@ TEST_F(RemovingAValue, TwiceSucceedsTwice) {
   EXPECT_EQ(told(second), "<done>");
 }
 
-TEST_F(RemovingAValue, WhoseFileHasVanishedFailsButTakesTheRecord) {
+TEST_F(PersistentKeyValueStoreRemoving, WhoseFileHasVanishedFailsButTakesTheRecord) {
   open();
   put("key", "value");
   std::filesystem::remove(pathOf("key"));
@@ -807,7 +807,7 @@ TEST_F(RemovingAValue, WhoseFileHasVanishedFailsButTakesTheRecord) {
   EXPECT_EQ(drop("key"), "<done>");
 }
 
-TEST_F(RemovingAValue, ThatTheManifestCannotForgetFailsAndKeepsTheFile) {
+TEST_F(PersistentKeyValueStoreRemoving, ThatTheManifestCannotForgetFailsAndKeepsTheFile) {
   openWatched();
   put("key", "value");
   manifest->failNext(ManifestCall::RemoveItem, unwritable);
@@ -817,12 +817,12 @@ TEST_F(RemovingAValue, ThatTheManifestCannotForgetFailsAndKeepsTheFile) {
 
 // --- Dates ---
 
-TEST_F(AskingForDates, OfAnUnknownKeyIsEmpty) {
+TEST_F(PersistentKeyValueStoreAskingForDates, OfAnUnknownKeyIsEmpty) {
   open();
   EXPECT_EQ(store->fetchModificationDate("key"), std::nullopt);
 }
 
-TEST_F(AskingForDates, GivesWhenTheValueWasStoredAndIsNoUseAndNoEvent) {
+TEST_F(PersistentKeyValueStoreAskingForDates, GivesWhenTheValueWasStoredAndIsNoUseAndNoEvent) {
   openWatched();
   put("key", "value");
   clock.advance(50);
@@ -831,7 +831,7 @@ TEST_F(AskingForDates, GivesWhenTheValueWasStoredAndIsNoUseAndNoEvent) {
   EXPECT_THAT(accesses(), IsEmpty());
 }
 
-TEST_F(AskingForDates, BeforeTheManifestIsLoadedReadsTheOneRecord) {
+TEST_F(PersistentKeyValueStoreAskingForDates, BeforeTheManifestIsLoadedReadsTheOneRecord) {
   open();
   put("key", "value");
   close();
@@ -840,7 +840,7 @@ TEST_F(AskingForDates, BeforeTheManifestIsLoadedReadsTheOneRecord) {
   EXPECT_FALSE(store->getManifest()->isLoaded());
 }
 
-TEST_F(AskingForDates, UpdatingTheAccessDateReportsAHitOfTheKeyAloneAndMovesTheDate) {
+TEST_F(PersistentKeyValueStoreAskingForDates, UpdatingTheAccessDateReportsAHitOfTheKeyAloneAndMovesTheDate) {
   openWatched();
   put("key", "value");
   clock.advance(50);
@@ -854,7 +854,7 @@ TEST_F(AskingForDates, UpdatingTheAccessDateReportsAHitOfTheKeyAloneAndMovesTheD
   EXPECT_EQ(file().pending(), 0U);
 }
 
-TEST_F(AskingForDates, UpdatingTheAccessDateOfAnUnknownKeyIsNoError) {
+TEST_F(PersistentKeyValueStoreAskingForDates, UpdatingTheAccessDateOfAnUnknownKeyIsNoError) {
   open();
   const Written used = watch(store->updateLastAccessDate("key"));
   settle();
@@ -863,7 +863,7 @@ TEST_F(AskingForDates, UpdatingTheAccessDateOfAnUnknownKeyIsNoError) {
   EXPECT_THAT(store->getAllKeys(), IsEmpty());
 }
 
-TEST_F(AskingForDates, KeysBeforeLoadingAreRefused) {
+TEST_F(PersistentKeyValueStoreAskingForDates, KeysBeforeLoadingAreRefused) {
   openUnloaded();
   EXPECT_THROW(store->getAllKeys(), DiskCacheManifestException);
   settle();
@@ -872,7 +872,7 @@ TEST_F(AskingForDates, KeysBeforeLoadingAreRefused) {
 
 // --- Inline ---
 
-TEST_F(StoringInline, KeepsTheBytesInTheRowAndMakesNoFile) {
+TEST_F(PersistentKeyValueStoreStoringInline, KeepsTheBytesInTheRowAndMakesNoFile) {
   open();
   put("key", "value");
   EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 1 1000000 1000000 value"));
@@ -882,7 +882,7 @@ TEST_F(StoringInline, KeepsTheBytesInTheRowAndMakesNoFile) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(StoringInline, RecordsTheItemThenTheBytesOnTheWorkQueueAndReportsTheSize) {
+TEST_F(PersistentKeyValueStoreStoringInline, RecordsTheItemThenTheBytesOnTheWorkQueueAndReportsTheSize) {
   openWatched();
   keepJournal();
   const Written written = watch(store->store("key", bytesOf("value")));
@@ -895,7 +895,7 @@ TEST_F(StoringInline, RecordsTheItemThenTheBytesOnTheWorkQueueAndReportsTheSize)
   EXPECT_THAT(sizes, ElementsAre(5U));
 }
 
-TEST_F(StoringInline, OfNothingIsAnEmptyValueAndNoMiss) {
+TEST_F(PersistentKeyValueStoreStoringInline, OfNothingIsAnEmptyValueAndNoMiss) {
   open();
   put("key", "");
   EXPECT_EQ(get("key"), "");
@@ -903,7 +903,7 @@ TEST_F(StoringInline, OfNothingIsAnEmptyValueAndNoMiss) {
   EXPECT_EQ(get("key"), "");
 }
 
-TEST_F(StoringInline, ReplacesTheValue) {
+TEST_F(PersistentKeyValueStoreStoringInline, ReplacesTheValue) {
   open();
   put("key", "a long value");
   put("key", "short");
@@ -912,7 +912,7 @@ TEST_F(StoringInline, ReplacesTheValue) {
   EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 5 1 1000000 1000000 short"));
 }
 
-TEST_F(StoringInline, KeepsBytesOfEveryKind) {
+TEST_F(PersistentKeyValueStoreStoringInline, KeepsBytesOfEveryKind) {
   open();
   const std::string value("a\0b\xff\n\0", 6);
   put("key", value);
@@ -920,7 +920,7 @@ TEST_F(StoringInline, KeepsBytesOfEveryKind) {
   EXPECT_EQ(get("key"), value);
 }
 
-TEST_F(StoringInline, IsReadOnTheFileQueue) {
+TEST_F(PersistentKeyValueStoreStoringInline, IsReadOnTheFileQueue) {
   openWatched();
   put("key", "value");
   keepJournal();
@@ -932,7 +932,7 @@ TEST_F(StoringInline, IsReadOnTheFileQueue) {
   EXPECT_EQ(told(fetched), "value");
 }
 
-TEST_F(StoringInline, RefusesAWriterAtOnceAndNeverCallsIt) {
+TEST_F(PersistentKeyValueStoreStoringInline, RefusesAWriterAtOnceAndNeverCallsIt) {
   openWatched();
   keepJournal();
   bool called = false;
@@ -948,7 +948,7 @@ TEST_F(StoringInline, RefusesAWriterAtOnceAndNeverCallsIt) {
   EXPECT_THAT(takeJournal(), IsEmpty());
 }
 
-TEST_F(StoringInline, RemovesWithoutDeletingAFile) {
+TEST_F(PersistentKeyValueStoreStoringInline, RemovesWithoutDeletingAFile) {
   openWatched();
   put("key", "value");
   directory.write("store/key", "a file that is not the store's");
@@ -958,7 +958,7 @@ TEST_F(StoringInline, RemovesWithoutDeletingAFile) {
   EXPECT_EQ(get("key"), "<miss>");
 }
 
-TEST_F(StoringInline, RemovedBetweenLookingUpAndReadingIsAMiss) {
+TEST_F(PersistentKeyValueStoreStoringInline, RemovedBetweenLookingUpAndReadingIsAMiss) {
   open();
   put("key", "value");
   const Fetched fetched = watch(store->fetch("key"));
@@ -968,14 +968,14 @@ TEST_F(StoringInline, RemovedBetweenLookingUpAndReadingIsAMiss) {
   EXPECT_EQ(told(fetched), "<miss>");
 }
 
-TEST_F(StoringInline, WhoseBytesVanishedBehindTheStoreIsAMissAndNoEmptyValue) {
+TEST_F(PersistentKeyValueStoreStoringInline, WhoseBytesVanishedBehindTheStoreIsAMissAndNoEmptyValue) {
   openWatched();
   put("key", "value");
   medium->change([](auto& rows) { rows.clear(); });
   EXPECT_EQ(get("key"), "<miss>");
 }
 
-TEST_F(StoringInline, OverwrittenWhileItIsReadIsReadWhole) {
+TEST_F(PersistentKeyValueStoreStoringInline, OverwrittenWhileItIsReadIsReadWhole) {
   openWatched();
   put("key", "old");
   std::promise<void> read;
@@ -1000,7 +1000,7 @@ TEST_F(StoringInline, OverwrittenWhileItIsReadIsReadWhole) {
   EXPECT_THAT(told(fetched), testing::AnyOf("old", "new"));
 }
 
-TEST_F(StoringInline, TakesAnyKey) {
+TEST_F(PersistentKeyValueStoreStoringInline, TakesAnyKey) {
   open();
   const std::vector<std::string> keys = {"",
                                          ".",
@@ -1023,7 +1023,7 @@ TEST_F(StoringInline, TakesAnyKey) {
 // --- After invalidation ---
 
 // Not what a queue is meant to do, but no lock is held around what it is given.
-TEST_F(CreatingAStore, OnQueuesThatRunEverythingAtOnceWorks) {
+TEST_F(PersistentKeyValueStoreCreating, OnQueuesThatRunEverythingAtOnceWorks) {
   for (const bool inlineData : {false, true}) {
     options.inlineData = inlineData;
     openUnloaded();
@@ -1041,7 +1041,7 @@ TEST_F(CreatingAStore, OnQueuesThatRunEverythingAtOnceWorks) {
   }
 }
 
-TEST_F(CreatingAStore, AfterInvalidationEveryOperationIsRefused) {
+TEST_F(PersistentKeyValueStoreCreating, AfterInvalidationEveryOperationIsRefused) {
   open();
   put("key", "value");
   file().onDispatch = [this] { file().runAll(); };
@@ -1065,7 +1065,7 @@ TEST_F(CreatingAStore, AfterInvalidationEveryOperationIsRefused) {
   EXPECT_EQ(valueFile("key"), "value");
 }
 
-TEST_F(StoringInline, AfterInvalidationIsRefusedWithAWriterToo) {
+TEST_F(PersistentKeyValueStoreStoringInline, AfterInvalidationIsRefusedWithAWriterToo) {
   open();
   file().onDispatch = [this] { file().runAll(); };
   store->invalidate();

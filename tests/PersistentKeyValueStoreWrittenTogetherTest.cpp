@@ -37,7 +37,7 @@ using test::Written;
 using testing::ElementsAre;
 using testing::IsEmpty;
 
-class WrittenTogether : public KeyValueStoreFixture {
+class PersistentKeyValueStoreWrittenTogether : public KeyValueStoreFixture {
  protected:
   void SetUp() override {
     openWatched();
@@ -88,7 +88,7 @@ class WrittenTogether : public KeyValueStoreFixture {
   Latch mayGoOn{1};
 };
 
-TEST_F(WrittenTogether, TheFilesComeFirstAndThenTheRecordsEachOnce) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, TheFilesComeFirstAndThenTheRecordsEachOnce) {
   const Written one = write("one");
   const Written two = write("two");
   const Written three = write("three");
@@ -107,7 +107,7 @@ TEST_F(WrittenTogether, TheFilesComeFirstAndThenTheRecordsEachOnce) {
   EXPECT_EQ(store->operationCounts().stores, 3U);
 }
 
-TEST_F(WrittenTogether, AloneWithTheManifestEachTaskWritesItsOwn) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, AloneWithTheManifestEachTaskWritesItsOwn) {
   write("one");
   const Written two = write("two");
   work().runAll();
@@ -116,7 +116,7 @@ TEST_F(WrittenTogether, AloneWithTheManifestEachTaskWritesItsOwn) {
   EXPECT_EQ(told(two), "<pending>");
 }
 
-TEST_F(WrittenTogether, NotMoreThanThirtyTwo) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotMoreThanThirtyTwo) {
   write("one");
   write("two");
   for (int number = 3; number <= 40; ++number) write("key" + std::to_string(number));
@@ -130,7 +130,7 @@ TEST_F(WrittenTogether, NotMoreThanThirtyTwo) {
   EXPECT_EQ(sizes.size(), 40U);
 }
 
-TEST_F(WrittenTogether, NoMoreAfterAMebibyte) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NoMoreAfterAMebibyte) {
   const Written one = watch(store->store("one", nullptr, writing("one", (1 << 20) - 3)));
   const Written two = write("two");
   const Written three = write("three");
@@ -142,7 +142,7 @@ TEST_F(WrittenTogether, NoMoreAfterAMebibyte) {
   EXPECT_EQ(told(three), "<done>");
 }
 
-TEST_F(WrittenTogether, NotTwoOfOneKey) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotTwoOfOneKey) {
   write("one");
   write("two");
   const Written first = watch(store->store("key", bytesOf("first")));
@@ -155,7 +155,7 @@ TEST_F(WrittenTogether, NotTwoOfOneKey) {
   EXPECT_EQ(get("key"), "second");
 }
 
-TEST_F(WrittenTogether, NotPastAFetch) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotPastAFetch) {
   put("key", "old");
   write("one");
   write("two");
@@ -169,7 +169,7 @@ TEST_F(WrittenTogether, NotPastAFetch) {
   EXPECT_EQ(get("key"), "key");
 }
 
-TEST_F(WrittenTogether, AFetchOfNothingStandsInNobodysWay) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, AFetchOfNothingStandsInNobodysWay) {
   write("one");
   const Fetched between = watch(store->fetch("nothing"));
   write("two");
@@ -178,7 +178,7 @@ TEST_F(WrittenTogether, AFetchOfNothingStandsInNobodysWay) {
   EXPECT_THAT(written, ElementsAre("one", "two"));
 }
 
-TEST_F(WrittenTogether, NotPastTheRemovalOfAWrite) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotPastTheRemovalOfAWrite) {
   write("one");
   write("two");
   const Written called = write("key");
@@ -194,7 +194,7 @@ TEST_F(WrittenTogether, NotPastTheRemovalOfAWrite) {
   EXPECT_EQ(get("key"), "key");
 }
 
-TEST_F(WrittenTogether, NotPastTheDeletionOfStaleFiles) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotPastTheDeletionOfStaleFiles) {
   put("key", "old");
   clock.advance(2000);
   write("one");
@@ -210,7 +210,7 @@ TEST_F(WrittenTogether, NotPastTheDeletionOfStaleFiles) {
   EXPECT_EQ(get("key"), "key");
 }
 
-TEST_F(WrittenTogether, NotPastADeletionThatSomebodyElseProvides) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotPastADeletionThatSomebodyElseProvides) {
   put("key", "old");
   write("one");
   write("two");
@@ -233,7 +233,7 @@ TEST_F(WrittenTogether, NotPastADeletionThatSomebodyElseProvides) {
   EXPECT_EQ(get("key"), "key");
 }
 
-TEST_F(WrittenTogether, NotPastTheDeletionOfABatch) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotPastTheDeletionOfABatch) {
   put("key", "old");
   write("one");
   write("two");
@@ -249,7 +249,7 @@ TEST_F(WrittenTogether, NotPastTheDeletionOfABatch) {
   EXPECT_EQ(get("key"), "key");
 }
 
-TEST_F(WrittenTogether, NotPastAnEviction) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotPastAnEviction) {
   close();
   options.capacity = 3;
   SetUp();
@@ -268,7 +268,7 @@ TEST_F(WrittenTogether, NotPastAnEviction) {
 }
 
 // It may take its time, or wait for what was stored before.
-TEST_F(WrittenTogether, NotByAWriterOfTheHosts) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, NotByAWriterOfTheHosts) {
   const Written one = write("one");
   write("two");
   bool isOneThere = false;
@@ -285,7 +285,7 @@ TEST_F(WrittenTogether, NotByAWriterOfTheHosts) {
   EXPECT_EQ(get("key"), "value");
 }
 
-TEST_F(WrittenTogether, AFileThatCannotBeWrittenFailsAlone) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, AFileThatCannotBeWrittenFailsAlone) {
   write("one");
   write("two");
   const Written failed = write("key");
@@ -300,7 +300,7 @@ TEST_F(WrittenTogether, AFileThatCannotBeWrittenFailsAlone) {
   EXPECT_THAT(valueFiles(), ElementsAre("last", "one", "two"));
 }
 
-TEST_F(WrittenTogether, ACallbackThatThrowsHarmsNoOther) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, ACallbackThatThrowsHarmsNoOther) {
   store->store("one", bytesOf("one")).then(nullptr, [](std::future<void>&) {
     throw std::runtime_error("The callback gave up.");
   });
@@ -320,7 +320,7 @@ TEST_F(WrittenTogether, ACallbackThatThrowsHarmsNoOther) {
   EXPECT_THAT(valueFiles(), ElementsAre("last", "one", "two"));
 }
 
-TEST_F(WrittenTogether, AReportThatFindsNoQueueFailsItsWrite) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, AReportThatFindsNoQueueFailsItsWrite) {
   const Written one = write("one");
   const Written two = write("two");
   work().runAll();
@@ -337,7 +337,7 @@ TEST_F(WrittenTogether, AReportThatFindsNoQueueFailsItsWrite) {
   EXPECT_EQ(contents(), (Contents{{"one", "one"}, {"two", "two"}}));
 }
 
-TEST_F(WrittenTogether, ARemovalWhileTheFilesAreWrittenTakesThemAway) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, ARemovalWhileTheFilesAreWrittenTakesThemAway) {
   write("one");
   write("two");
   Written removed;
@@ -353,7 +353,7 @@ TEST_F(WrittenTogether, ARemovalWhileTheFilesAreWrittenTakesThemAway) {
   EXPECT_THAT(valueFiles(), ElementsAre("one", "two"));
 }
 
-TEST_F(WrittenTogether, ARecordThatCannotBeWrittenPurgesTheStoreAndAllThatWereOnTheirWay) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, ARecordThatCannotBeWrittenPurgesTheStoreAndAllThatWereOnTheirWay) {
   const Written one = write("one");
   const Written two = write("two");
   const Written three = write("three");
@@ -370,7 +370,7 @@ TEST_F(WrittenTogether, ARecordThatCannotBeWrittenPurgesTheStoreAndAllThatWereOn
   EXPECT_EQ(contents(), (Contents{{"key", "value"}}));
 }
 
-TEST_F(WrittenTogether, TheStoreMayGoBeforeTheTasksThatHaveNothingLeftToDo) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, TheStoreMayGoBeforeTheTasksThatHaveNothingLeftToDo) {
   write("one");
   const Written two = write("two");
   runFirstOfFiles();
@@ -380,7 +380,7 @@ TEST_F(WrittenTogether, TheStoreMayGoBeforeTheTasksThatHaveNothingLeftToDo) {
   EXPECT_EQ(told(two), "<done>");
 }
 
-TEST_F(WrittenTogether, AQueueMayDropTheTasksThatHaveNothingLeftToDo) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, AQueueMayDropTheTasksThatHaveNothingLeftToDo) {
   write("one");
   const Written two = write("two");
   runFirstOfFiles();
@@ -390,7 +390,7 @@ TEST_F(WrittenTogether, AQueueMayDropTheTasksThatHaveNothingLeftToDo) {
 }
 
 // The file queue refuses the task of a write that an earlier one's task has begun, and ended, meanwhile.
-TEST_F(WrittenTogether, AWriteThatIsDoneStaysDoneThoughItsOwnTaskIsRefused) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, AWriteThatIsDoneStaysDoneThoughItsOwnTaskIsRefused) {
   Latch isAtTwo(1);
   Latch threeIsBegun(1);
   write("one");
@@ -421,7 +421,7 @@ TEST_F(WrittenTogether, AWriteThatIsDoneStaysDoneThoughItsOwnTaskIsRefused) {
   EXPECT_EQ(contents(), (Contents{{"one", "one"}, {"two", "two"}, {"three", "three"}}));
 }
 
-TEST_F(WrittenTogether, TheNextWriteMayHaveBeenDropped) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, TheNextWriteMayHaveBeenDropped) {
   write("one");
   write("two");
   const Written dropped = watch(store->store("key", bytesOf("value")));
@@ -436,7 +436,7 @@ TEST_F(WrittenTogether, TheNextWriteMayHaveBeenDropped) {
 }
 
 // Whoever lets go of a write last takes it back, and that may be who begins the next one just now.
-TEST_F(WrittenTogether, AWriteMayBeDroppedWhileTheNextBegins) {
+TEST_F(PersistentKeyValueStoreWrittenTogether, AWriteMayBeDroppedWhileTheNextBegins) {
   std::atomic<bool> begins{false};
   manifest->onCall = [&](ManifestCall, const std::string& text) { begins = begins || text == "setItem two 0"; };
   for (int round = 0; round < 1000; ++round) {

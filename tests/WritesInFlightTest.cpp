@@ -142,7 +142,7 @@ TEST(WritesInFlight, ThatLoseTheirRecordsAreDiscardedIfTheyRunAndGoOnWithoutOthe
 
 // --- In one breath ---
 
-class InOneBreath : public KeyValueStoreFixture {
+class PersistentKeyValueStoreInOneBreath : public KeyValueStoreFixture {
  protected:
   Written putting(const std::string& key, const std::string& value) const {
     return watch(store->store(key, bytesOf(value)));
@@ -171,7 +171,7 @@ class InOneBreath : public KeyValueStoreFixture {
   }
 };
 
-TEST_F(InOneBreath, StoredAndRemovedIsGone) {
+TEST_F(PersistentKeyValueStoreInOneBreath, StoredAndRemovedIsGone) {
   open();
   const Written written = putting("key", "value");
   const Written removed = watch(store->removeItem("key"));
@@ -181,7 +181,7 @@ TEST_F(InOneBreath, StoredAndRemovedIsGone) {
   expectNothingOf("key");
 }
 
-TEST_F(InOneBreath, RemovedAndStoredIsThere) {
+TEST_F(PersistentKeyValueStoreInOneBreath, RemovedAndStoredIsThere) {
   open();
   put("key", "old");
   const Written removed = watch(store->removeItem("key"));
@@ -191,7 +191,7 @@ TEST_F(InOneBreath, RemovedAndStoredIsThere) {
   EXPECT_EQ(get("key"), "new");
 }
 
-TEST_F(InOneBreath, StoredRemovedAndStoredHoldsTheLastValue) {
+TEST_F(PersistentKeyValueStoreInOneBreath, StoredRemovedAndStoredHoldsTheLastValue) {
   open();
   putting("key", "first");
   const Written removed = watch(store->removeItem("key"));
@@ -205,7 +205,7 @@ TEST_F(InOneBreath, StoredRemovedAndStoredHoldsTheLastValue) {
   EXPECT_EQ(contents(), (Contents{{"key", "last"}}));
 }
 
-TEST_F(InOneBreath, TheRemovalOfAWriteOnItsWayIsDoneWhenItsFileIsGone) {
+TEST_F(PersistentKeyValueStoreInOneBreath, TheRemovalOfAWriteOnItsWayIsDoneWhenItsFileIsGone) {
   open();
   put("key", "old");
   putting("key", "new");
@@ -219,7 +219,7 @@ TEST_F(InOneBreath, TheRemovalOfAWriteOnItsWayIsDoneWhenItsFileIsGone) {
   EXPECT_EQ(told(removed), "<done>");
 }
 
-TEST_F(InOneBreath, ARevokedWriteNeverCallsItsWriter) {
+TEST_F(PersistentKeyValueStoreInOneBreath, ARevokedWriteNeverCallsItsWriter) {
   open();
   bool called = false;
   const Written written = watch(store->store("key", nullptr, [&](const std::string&) {
@@ -232,7 +232,7 @@ TEST_F(InOneBreath, ARevokedWriteNeverCallsItsWriter) {
   EXPECT_EQ(told(written), "<done>");
 }
 
-TEST_F(InOneBreath, TwoWritesOfAKeyLeaveTheLater) {
+TEST_F(PersistentKeyValueStoreInOneBreath, TwoWritesOfAKeyLeaveTheLater) {
   open();
   const Written first = putting("key", "first");
   const Written second = putting("key", "second");
@@ -243,7 +243,7 @@ TEST_F(InOneBreath, TwoWritesOfAKeyLeaveTheLater) {
   EXPECT_THAT(rowsOnDisk(), ElementsAre("key key 6 0 1000000 1000000 -"));
 }
 
-TEST_F(InOneBreath, AFetchBetweenTwoWritesGivesTheValueBetween) {
+TEST_F(PersistentKeyValueStoreInOneBreath, AFetchBetweenTwoWritesGivesTheValueBetween) {
   open();
   putting("key", "first");
   const Fetched between = watch(store->fetch("key"));
@@ -253,7 +253,7 @@ TEST_F(InOneBreath, AFetchBetweenTwoWritesGivesTheValueBetween) {
   EXPECT_EQ(get("key"), "second");
 }
 
-TEST_F(InOneBreath, RemovedByTheRunningWriterItselfIsGone) {
+TEST_F(PersistentKeyValueStoreInOneBreath, RemovedByTheRunningWriterItselfIsGone) {
   open();
   Written removed;
   const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
@@ -269,7 +269,7 @@ TEST_F(InOneBreath, RemovedByTheRunningWriterItselfIsGone) {
   expectNothingOf("key");
 }
 
-TEST_F(InOneBreath, ClearedByTheRunningWriterItselfIsGone) {
+TEST_F(PersistentKeyValueStoreInOneBreath, ClearedByTheRunningWriterItselfIsGone) {
   open();
   put("other", "value");
   const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
@@ -285,7 +285,7 @@ TEST_F(InOneBreath, ClearedByTheRunningWriterItselfIsGone) {
   expectNothingOf("key");
 }
 
-TEST_F(InOneBreath, StoredAnewByTheRunningWriterItselfHoldsTheNewValue) {
+TEST_F(PersistentKeyValueStoreInOneBreath, StoredAnewByTheRunningWriterItselfHoldsTheNewValue) {
   open();
   const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
     putting("key", "new");
@@ -298,7 +298,7 @@ TEST_F(InOneBreath, StoredAnewByTheRunningWriterItselfHoldsTheNewValue) {
   EXPECT_EQ(contents(), (Contents{{"key", "new"}}));
 }
 
-TEST_F(InOneBreath, RemovedAndStoredAnewByTheRunningWriterHoldsTheNewValue) {
+TEST_F(PersistentKeyValueStoreInOneBreath, RemovedAndStoredAnewByTheRunningWriterHoldsTheNewValue) {
   open();
   const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
     watch(store->removeItem("key"));
@@ -315,7 +315,7 @@ TEST_F(InOneBreath, RemovedAndStoredAnewByTheRunningWriterHoldsTheNewValue) {
 
 // --- Writers that fail ---
 
-TEST_F(InOneBreath, AFirstWriteThatFailsLeavesNothing) {
+TEST_F(PersistentKeyValueStoreInOneBreath, AFirstWriteThatFailsLeavesNothing) {
   for (const std::optional<std::string>& half : {std::optional<std::string>(), std::optional<std::string>("ha")}) {
     open();
     const Written written = failing("key", half);
@@ -327,7 +327,7 @@ TEST_F(InOneBreath, AFirstWriteThatFailsLeavesNothing) {
   }
 }
 
-TEST_F(InOneBreath, AnOverwriteThatFailsLeavesAMiss) {
+TEST_F(PersistentKeyValueStoreInOneBreath, AnOverwriteThatFailsLeavesAMiss) {
   for (const std::optional<std::string>& half : {std::optional<std::string>(), std::optional<std::string>("ha")}) {
     open();
     put("key", "old");
@@ -339,7 +339,7 @@ TEST_F(InOneBreath, AnOverwriteThatFailsLeavesAMiss) {
   }
 }
 
-TEST_F(InOneBreath, AWriteThatFailsLeavesANewerOneItsValue) {
+TEST_F(PersistentKeyValueStoreInOneBreath, AWriteThatFailsLeavesANewerOneItsValue) {
   open();
   put("key", "old");
   const Written failed = failing("key", "half");
@@ -354,7 +354,7 @@ TEST_F(InOneBreath, AWriteThatFailsLeavesANewerOneItsValue) {
   EXPECT_EQ(contents(), (Contents{{"key", "newer"}}));
 }
 
-TEST_F(InOneBreath, ANewerWriteThatFailsTakesTheOlderValueAlong) {
+TEST_F(PersistentKeyValueStoreInOneBreath, ANewerWriteThatFailsTakesTheOlderValueAlong) {
   open();
   putting("key", "older");
   const Written failed = failing("key", std::nullopt);
@@ -363,7 +363,7 @@ TEST_F(InOneBreath, ANewerWriteThatFailsTakesTheOlderValueAlong) {
   expectNothingOf("key");
 }
 
-TEST_F(InOneBreath, AWriterMayThrowAnything) {
+TEST_F(PersistentKeyValueStoreInOneBreath, AWriterMayThrowAnything) {
   open();
   const Written written =
       watch(store->store("key", nullptr, [](const std::string&) -> unsigned int { throw 42; }));  // NOLINT
@@ -372,7 +372,7 @@ TEST_F(InOneBreath, AWriterMayThrowAnything) {
   expectNothingOf("key");
 }
 
-TEST_F(InOneBreath, AWriterThatMakesNoFileLeavesARecordWhoseFetchFailsAndThatCanBeReplaced) {
+TEST_F(PersistentKeyValueStoreInOneBreath, AWriterThatMakesNoFileLeavesARecordWhoseFetchFailsAndThatCanBeReplaced) {
   open();
   const Written written = watch(store->store("key", nullptr, [](const std::string&) { return 3U; }));
   settle();
@@ -655,7 +655,7 @@ class Interleaving {
   std::shared_ptr<DiskCache> store_;
 };
 
-class InEveryOrder : public KeyValueStoreFixture {
+class PersistentKeyValueStoreInEveryOrder : public KeyValueStoreFixture {
  protected:
   // Runs the script in every order there is and checks each; the number of orders.
   std::size_t perform(const Scenario& scenario) {
@@ -711,45 +711,47 @@ class InEveryOrder : public KeyValueStoreFixture {
   const Contents oldB = {{"b", "old"}};
 };
 
-TEST_F(InEveryOrder, ThereAreAsManyOrdersAsThereAreWaysToMerge) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, ThereAreAsManyOrdersAsThereAreWaysToMerge) {
   EXPECT_EQ(perform({"A", none, std::nullopt}), 1U);
   EXPECT_EQ(perform({"AA", none, std::nullopt}), 5U);
   EXPECT_EQ(perform({"AAA", none, std::nullopt}), 42U);
 }
 
-TEST_F(InEveryOrder, TwoOperationsLeaveWhatTheySay) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, TwoOperationsLeaveWhatTheySay) {
   performAll(scripts("ABFabghCP", 2), {none, oldA, oldB, {{"a", "old"}, {"b", "old"}}});
 }
 
-TEST_F(InEveryOrder, ThreeOperationsLeaveWhatTheySay) { performAll(scripts("ABFabgCP", 3), {none, oldA, oldB}); }
+TEST_F(PersistentKeyValueStoreInEveryOrder, ThreeOperationsLeaveWhatTheySay) {
+  performAll(scripts("ABFabgCP", 3), {none, oldA, oldB});
+}
 
-TEST_F(InEveryOrder, EvictingInBetweenLeavesNoHalves) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, EvictingInBetweenLeavesNoHalves) {
   performAll(scripts("ABag", 3), {none, oldA, oldB}, 1);
   performAll({"AFB", "FAB", "BFA", "BAF"}, {none, oldA, oldB}, 1);
 }
 
-TEST_F(InEveryOrder, LongerScriptsLeaveWhatTheySay) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, LongerScriptsLeaveWhatTheySay) {
   performAll({"AaAa", "AaAg", "AgaA", "AFAa", "FAFA", "ACAg"}, {oldA});
 }
 
-TEST_F(InEveryOrder, AStoreThatGoesLeavesNoRecordWithoutAFile) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, AStoreThatGoesLeavesNoRecordWithoutAFile) {
   performAll(scripts("ABFaCP", 2), {none, oldA, oldB}, std::nullopt, "X");
   performAll(scripts("AB", 2), {none, oldB}, 1, "X");
 }
 
-TEST_F(InEveryOrder, AFileQueueThatDropsWhatWaitsLosesNoOlderValue) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, AFileQueueThatDropsWhatWaitsLosesNoOlderValue) {
   performAll(scripts("ABFaCP", 2), {none, oldA, oldB}, std::nullopt, "D");
   performAll({"AADg", "ADA", "ADa", "AaDA", "AFDA", "FADA", "ACDA", "ADX", "DAX"}, {oldA});
   performAll(scripts("AB", 2), {none, oldB}, 1, "D");
 }
 
-TEST_F(InEveryOrder, AFileQueueThatRefusesLosesNoOlderValue) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, AFileQueueThatRefusesLosesNoOlderValue) {
   performAll(scripts("ABFaCP", 2), {none, oldA, oldB}, std::nullopt, "R");
   performAll({"RA", "RAg", "ARA", "RAA", "ARa", "FRA", "ARC", "ARX"}, {none, oldA});
   performAll(scripts("AB", 2), {none, oldB}, 1, "R");
 }
 
-TEST_F(InEveryOrder, AnInvalidatedStoreLeavesNoHalves) {
+TEST_F(PersistentKeyValueStoreInEveryOrder, AnInvalidatedStoreLeavesNoHalves) {
   performAll(scripts("ABFagCP", 2), {none, oldA, oldB}, std::nullopt, "I");
   performAll(scripts("AB", 2), {none, oldB}, 1, "I");
 }
