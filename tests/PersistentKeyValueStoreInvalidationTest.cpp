@@ -381,6 +381,35 @@ TEST_F(PersistentKeyValueStoreInvalidation, FromWithinAWriterLetsThatWriteFinish
   EXPECT_EQ(medium->rows().at("key").item.size, 5U);
 }
 
+// The writer's record evicts an item, whose file is deleted behind the barrier that the writer has queued.
+TEST_F(PersistentKeyValueStoreInvalidation, FromWithinAWriterDeletesNoFileOfTheNextStoreAtThePath) {
+  options.capacity = 1;
+  open();
+  const Written written = watch(store->store("key", nullptr, [&](const std::string& path) {
+    files->writeFile(path, bytesOf("value"));
+    store->invalidateSoon();
+    return 5U;
+  }));
+  work().runAll();
+  store->handleCorruptedManifest(LarderException("Rotten.", "domain", 11));  // so that the final record makes room
+  store->getManifest()->setItem({"next", "next", 1, false, 0, 0, nullptr});
+  directory.write("store/next", "of the next store");
+  settle();
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(store->operationCounts().evictions, 1U);
+  EXPECT_EQ(directory.read("store/next"), "of the next store");
+}
+
+TEST_F(PersistentKeyValueStoreInvalidation, RefusesAnEviction) {
+  options.capacity = 1;
+  open();
+  put("key", "value");
+  store->invalidateSoon();
+  settle();
+  EXPECT_THROW(store->removeOldestItemIfOverMaxCapacity(), InvalidatedException);
+  EXPECT_EQ(directory.read("store/key"), "value");
+}
+
 // A file queue on which something else gets in between a write's record and its task.
 class InterruptedQueue final : public AsyncExecutor {
  public:

@@ -9,7 +9,8 @@
 #include <iterator>
 #include <map>
 #include <string>
-#include <vector>
+
+#include "support/Bytes.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 
@@ -22,7 +23,7 @@ class ManifestOnDisk {
     std::string filename;
     std::uint32_t size = 0;
     bool isInline = false;
-    std::vector<unsigned char> inlineData;
+    Bytes inlineData;
     std::int64_t modificationDate = 0;
     std::int64_t lastAccessDate = 0;
   };
@@ -44,7 +45,6 @@ class ManifestOnDisk {
         "SELECT key, filename, size, has_inline_data, inline_data, modification_date, last_access_date "
         "FROM LarderManifest";
     EXPECT_EQ(sqlite3_prepare_v2(database_, sql, -1, &statement, nullptr), SQLITE_OK) << sqlite3_errmsg(database_);
-    using Bytes = std::vector<unsigned char>;
     while (statement != nullptr && sqlite3_step(statement) == SQLITE_ROW) {
       const auto bytes = [&](int column) {
         const auto* begin = static_cast<const unsigned char*>(sqlite3_column_blob(statement, column));
