@@ -104,6 +104,19 @@ std::string withFile(const std::string& message, const std::shared_ptr<sqlite3>&
   return message + " (" + fileOf(database) + ")";
 }
 
+std::string textOf(int resultCode, const std::string& message) {
+  return "SQLite Error #" + std::to_string(resultCode) + ": " + message;
+}
+
+// Throws nothing to log it, not even to catch it again: the cursor may be destroyed because of another exception, and
+// 32-bit ARM programs do not survive that when the library was optimised at link time.
+void logUnfinalized(const std::shared_ptr<sqlite3>& database, int resultCode) {
+  const std::string text = textOf(resultCode, withFile(sqlite3_errmsg(database.get()), database));
+  LOG(ERROR) << "Could not finalize sqlite3 statement: "
+             << (isCorruption(resultCode) ? SQLiteStoreCorruptedException(text, resultCode).what()
+                                          : SQLiteStoreException(text, resultCode).what());
+}
+
 bool isPresent(const std::string& path, struct stat& status) { return ::stat(path.c_str(), &status) == 0; }
 
 // Opening or reading it may wait for somebody else, who need not ever come.
@@ -203,9 +216,8 @@ std::vector<SQLiteStoreColumn> columnsDeclaredBy(const std::string& createTable)
 
 void throwSQLiteException(int resultCode, const std::string& message) {
   if (isSuccess(resultCode)) return;
-  const std::string text = "SQLite Error #" + std::to_string(resultCode) + ": " + message;
-  if (isCorruption(resultCode)) throw SQLiteStoreCorruptedException(text, resultCode);
-  throw SQLiteStoreException(text, resultCode);
+  if (isCorruption(resultCode)) throw SQLiteStoreCorruptedException(textOf(resultCode, message), resultCode);
+  throw SQLiteStoreException(textOf(resultCode, message), resultCode);
 }
 
 void throwIfSQLiteError(const std::shared_ptr<sqlite3>& database, int resultCode) {
@@ -238,12 +250,12 @@ void SQLiteStoreCursor::finalize() noexcept {
   sqlite3_stmt* const statement = std::exchange(statement_, nullptr);
   IdleStatements* const idle = idleStatementsOf(database_);
   const int resultCode = idle != nullptr ? sqlite3_reset(statement) : sqlite3_finalize(statement);
-  try {
-    throwIfSQLiteError(database_, resultCode);
-    if (idle != nullptr) idle->put(statement);
-  } catch (const std::exception& exception) {
-    LOG(ERROR) << "Could not finalize sqlite3 statement: " << exception.what();
-    if (idle != nullptr) sqlite3_finalize(statement);
+  if (!isSuccess(resultCode)) logUnfinalized(database_, resultCode);
+  if (idle == nullptr) return;
+  if (isSuccess(resultCode)) {
+    idle->put(statement);
+  } else {
+    sqlite3_finalize(statement);
   }
 }
 
