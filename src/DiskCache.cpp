@@ -25,8 +25,8 @@ DiskCacheOptions optionsOf(const std::string& directory, const std::string& temp
 
 }  // namespace
 
-std::shared_ptr<DiskCache> DiskCache::create(DiskCacheOptions options, const StoreServices& services) {
-  auto cache = std::make_shared<DiskCache>(std::move(options), services);
+std::shared_ptr<DiskCache> DiskCache::create(const DiskCacheOptions& options, const StoreServices& services) {
+  auto cache = std::make_shared<DiskCache>(options, services);
   cache->loadManifest();
   return cache;
 }
@@ -60,7 +60,7 @@ DiskCache::DiskCache(const std::string& directory, const std::string& temporaryD
                 {std::move(taskQueueFactory), std::move(trashCollector), std::move(fileUtils),
                  std::move(analyticsReporter)}) {}
 
-DiskCache::DiskCache(DiskCacheOptions options, const StoreServices& services)
+DiskCache::DiskCache(const DiskCacheOptions& options, const StoreServices& services)
     : PersistentKeyValueStore(static_cast<const KeyValueStoreOptions&>(options), services),
       normalSize_(options.normalSize),
       survivalSize_(options.survivalSize) {}

@@ -17,7 +17,7 @@ namespace velmora::mobile::xplat::cellar {
 class CELLAR_EXPORT DiskCache : public PersistentKeyValueStore {
  public:
   // As `PersistentKeyValueStore::create`.
-  static std::shared_ptr<DiskCache> create(DiskCacheOptions options, const StoreServices& services);
+  static std::shared_ptr<DiskCache> create(const DiskCacheOptions& options, const StoreServices& services);
 
   // The same, with each option as a parameter.
   static std::shared_ptr<DiskCache> createDiskCache(
@@ -30,7 +30,7 @@ class CELLAR_EXPORT DiskCache : public PersistentKeyValueStore {
       std::function<void(unsigned int)> sizeChangedCallback, unsigned int batchSize);
 
   // As the two above, but loads nothing. The store must be owned by a shared pointer.
-  DiskCache(DiskCacheOptions options, const StoreServices& services);
+  DiskCache(const DiskCacheOptions& options, const StoreServices& services);
   DiskCache(const std::string& directory, const std::string& temporaryDirectoryPath, const std::string& name,
             std::optional<std::uint64_t> capacity, long staleAge, unsigned int normalSize, unsigned int survivalSize,
             bool inlineData, std::shared_ptr<TaskQueueFactory> taskQueueFactory,

@@ -63,8 +63,8 @@ std::shared_ptr<Store> DiskCacheDefinition::createStore(
   options.extendedMetadataFactory = ExtendedMetadataFactoryFactory(metadataFactory);
   options.pruneStrategy = PruneStrategyFactory(
       pruneStrategyOverride == PruneStrategyIdentifier::Null ? pruneStrategy : pruneStrategyOverride);
-  return DiskCache::create(std::move(options), {std::move(taskQueueFactory), std::move(trashCollector),
-                                                std::move(fileUtils), std::move(analyticsReporter)});
+  return DiskCache::create(options, {std::move(taskQueueFactory), std::move(trashCollector), std::move(fileUtils),
+                                     std::move(analyticsReporter)});
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -197,8 +197,8 @@ void StoreManagerImpl::pruneStoresIfNecessary() {
 std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() {
   const std::lock_guard<std::mutex> lock(mutex_);
   const StoreManagerDefinition& definition = common_.definition();
-  if (pruneInProgress_)
-    noteIfRoundIsOver(lock);  // a store that is destroyed in the middle of its prune does not say so
+  // A store that is destroyed in the middle of its prune does not say so.
+  if (pruneInProgress_) noteIfRoundIsOver(lock);
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
   const auto nextPruneTime = lastPruneTime_ + definition.pruneInterval;
   if (lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};

@@ -62,8 +62,8 @@ bool StoreManifest::purge(const StoreLock& lock, const LarderException& error) {
   context_.throwIfClosed();
   {
     const auto claimsAreHeld = writes_.holdClaims();
-    if (!context_.trash->collectPath(context_.options.directory) && context_.files->pathExists(context_.manifestPath))
-      return false;
+    const bool isCollected = context_.trash->collectPath(context_.options.directory);
+    if (!isCollected && context_.files->pathExists(context_.manifestPath)) return false;
     writes_.detachRecords(claimsAreHeld);
     isPurgePending_ = true;
     finishPurge(lock);
