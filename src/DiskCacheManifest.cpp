@@ -30,6 +30,8 @@ std::optional<ReplacedItem> DiskCacheManifestInterface::replaceItem(const DiskCa
   return std::nullopt;
 }
 
+bool DiskCacheManifestInterface::changeTogether(const std::function<void()>& /*changes*/) { return false; }
+
 std::shared_ptr<DiskCacheManifest> DiskCacheManifest::createDiskCacheManifest(
     const std::string& path, std::shared_ptr<AsyncExecutor> executor, std::shared_ptr<ExtendedMetadataFactory> factory,
     std::shared_ptr<PruneStrategyBase> strategy) {
@@ -102,8 +104,43 @@ std::optional<ReplacedItem> DiskCacheManifest::replaceItem(const DiskCacheItem& 
   return replaced;
 }
 
-void DiskCacheManifest::set(const ItemsLock& /*lock*/, const DiskCacheItem& item) {
+bool DiskCacheManifest::changeTogether(const std::function<void()>& changes) {
+  const ItemsLock lock(itemsMutex_);
+  if (!loaded_) return false;
+  formers_.emplace();
+  bool haveChanged = false;
+  try {
+    haveChanged = persistence_->performTogether(changes);
+  } catch (...) {  // whoever makes the changes one by one finds out for which of them it matters
+    takeBackChanges(lock);
+  }
+  formers_.reset();
+  return haveChanged;
+}
+
+// To be called before a record in memory changes.
+void DiskCacheManifest::noteFormer(const ItemsLock& /*lock*/, const std::string& key) {
+  if (!formers_) return;
+  const ManifestRecord* const record = records_->find(key);
+  const auto date = pendingAccessDates_.find(key);
+  formers_->push_back({key, record == nullptr ? nullptr : std::make_unique<DiskCacheItem>(record->item()),
+                       date == pendingAccessDates_.end() ? std::nullopt : std::make_optional(date->second)});
+}
+
+void DiskCacheManifest::takeBackChanges(const ItemsLock& /*lock*/) {
+  for (auto former = formers_->rbegin(); former != formers_->rend(); ++former) {
+    if (former->item != nullptr) {
+      records_->store(*former->item);
+    } else if (const ManifestRecord* const record = records_->find(former->key)) {
+      records_->remove(*record);
+    }
+    if (former->accessDate) pendingAccessDates_[former->key] = *former->accessDate;
+  }
+}
+
+void DiskCacheManifest::set(const ItemsLock& lock, const DiskCacheItem& item) {
   persistence_->setItem(item);
+  noteFormer(lock, item.key);
   pendingAccessDates_.erase(item.key);
   records_->store(item);
 }
@@ -161,14 +198,19 @@ std::optional<std::int32_t> DiskCacheManifest::getModificationDate(const std::st
 }
 
 void DiskCacheManifest::removeItem(const std::string& key) {
-  const std::lock_guard<std::mutex> loadLock(loadMutex_);
-  const ItemsLock lock(itemsMutex_);
-  const ManifestRecord* const record = records_->find(key);
-  if (record != nullptr) {
-    remove(lock, *record);
-  } else if (!loaded_) {
-    persistence_->removeItem(key);
+  const auto removeIt = [&](const ItemsLock& lock) {
+    if (const ManifestRecord* const record = records_->find(key)) {
+      remove(lock, *record);
+    } else if (!loaded_) {
+      persistence_->removeItem(key);
+    }
+  };
+  {
+    const ItemsLock lock(itemsMutex_);
+    if (loaded_) return removeIt(lock);
   }
+  const std::lock_guard<std::mutex> loadLock(loadMutex_);
+  removeIt(ItemsLock(itemsMutex_));
 }
 
 std::vector<unsigned char> DiskCacheManifest::getInlineData(const std::string& key) {
@@ -181,27 +223,33 @@ std::vector<unsigned char> DiskCacheManifest::getInlineData(const std::string& k
 void DiskCacheManifest::setInlineData(const std::string& key, const std::vector<unsigned char>& data) {
   const ItemsLock lock(itemsMutex_);
   persistence_->setInlineData(key, data);
-  if (findOrRead(lock, key) != nullptr) records_->setHasInlineData(key, true);
+  if (findOrRead(lock, key) == nullptr) return;
+  noteFormer(lock, key);
+  records_->setHasInlineData(key, true);
 }
 
 void DiskCacheManifest::removeInlineData(const std::string& key) {
   const ItemsLock lock(itemsMutex_);
   persistence_->removeInlineData(key);
-  if (findOrRead(lock, key) != nullptr) records_->setHasInlineData(key, false);
+  if (findOrRead(lock, key) == nullptr) return;
+  noteFormer(lock, key);
+  records_->setHasInlineData(key, false);
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneToSize(std::uint32_t size, std::uint32_t count) {
   const ItemsLock lock(itemsMutex_);
   if (!loaded_ || records_->totalSize() <= size) return {};
-  return prune(lock, records_->byStrategy(), count,
-               [&](const ManifestRecord&) { return records_->totalSize() > size; });
+  return prune(
+      lock, [&] { return records_->byStrategy(); }, count,
+      [&](const ManifestRecord&) { return records_->totalSize() > size; });
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneOldEntries(long date, std::uint32_t count) {
   const ItemsLock lock(itemsMutex_);
   if (!loaded_) return {};
-  return prune(lock, records_->leastRecentlyUsed(), count,
-               [&](const ManifestRecord& record) { return record.lastAccessDate < date; });
+  return prune(
+      lock, [&] { return records_->leastRecentlyUsed(); }, count,
+      [&](const ManifestRecord& record) { return record.lastAccessDate < date; });
 }
 
 std::unique_ptr<DiskCacheItem> DiskCacheManifest::pruneOldestItem() {
@@ -242,30 +290,50 @@ const ManifestRecord* DiskCacheManifest::findOrRead(const ItemsLock& /*lock*/, c
 }
 
 // The persistence first: when it fails, nothing has changed.
-DiskCacheItem DiskCacheManifest::remove(const ItemsLock& /*lock*/, const ManifestRecord& record) {
+DiskCacheItem DiskCacheManifest::remove(const ItemsLock& lock, const ManifestRecord& record) {
   const std::string key(record.key());
   persistence_->removeItem(key);
+  noteFormer(lock, key);
   pendingAccessDates_.erase(key);
   return records_->remove(record);
 }
 
-// Removes records as `next` yields them, at most `count`, up to the first that may not go.
-template <class MayGo>
-std::vector<DiskCacheItem> DiskCacheManifest::prune(const ItemsLock& lock,
-                                                    const std::function<const ManifestRecord*()>& next,
-                                                    std::uint32_t count, MayGo mayGo) {
+// Removes records in the order, at most `count`, up to the first that may not go: together, or, where that fails, as
+// far as one by one gets.
+template <class Order, class MayGo>
+std::vector<DiskCacheItem> DiskCacheManifest::prune(const ItemsLock& lock, Order order, std::uint32_t count,
+                                                    MayGo mayGo) {
   std::vector<DiskCacheItem> removed;
-  while (removed.size() < count) {
+  std::exception_ptr failure;  // of a strategy that is the host's
+  Next next = order();
+  if (!changeTogether([&] { failure = removeInOrder(lock, next, count, mayGo, removed); })) {
+    removed.clear();
+    next = order();  // the records in memory may be others now
     try {
-      const ManifestRecord* const record = next();  // by a strategy that may be the host's
-      if (record == nullptr || !mayGo(*record)) break;
-      removed.push_back(remove(lock, *record));
+      failure = removeInOrder(lock, next, count, mayGo, removed);
     } catch (...) {
       if (removed.empty()) throw;
-      break;  // the files of those that went must go too; the next call meets the failure at its first item
     }
   }
+  // Otherwise the files of those that went must go too; the next call meets the failure at its first item.
+  if (removed.empty() && failure != nullptr) std::rethrow_exception(failure);
   return removed;
+}
+
+template <class MayGo> std::exception_ptr DiskCacheManifest::removeInOrder(const ItemsLock& lock, const Next& next,
+                                                                           std::uint32_t count, MayGo mayGo,
+                                                                           std::vector<DiskCacheItem>& removed) {
+  while (removed.size() < count) {
+    const ManifestRecord* record = nullptr;
+    try {
+      record = next();
+    } catch (...) {
+      return std::current_exception();
+    }
+    if (record == nullptr || !mayGo(*record)) break;
+    removed.push_back(remove(lock, *record));
+  }
+  return nullptr;
 }
 
 // Some hosts' timers repeat and some fire once. Replacing the handle each time does right by both.

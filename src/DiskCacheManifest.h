@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <exception>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -55,6 +56,11 @@ class CELLAR_EXPORT DiskCacheManifestInterface : public std::enable_shared_from_
   // As `setItem`, and returns what it has replaced; empty when the manifest does not tell, as here. A store then takes
   // what lies in the key's place for its value when it has to take a write back.
   virtual std::optional<ReplacedItem> replaceItem(const DiskCacheItem& item, bool withInlineData);
+
+  // Runs `changes`, which call operations of this manifest, so that they take effect together. False when nothing has
+  // changed, or all of it was taken back: because this manifest cannot do it, as here, or because one of the changes,
+  // or their completion, has failed. They can then be made one by one. Other threads' operations wait. Not nested.
+  virtual bool changeTogether(const std::function<void()>& changes);
 
   // A weak pointer to this manifest as a T; empty when it is not owned by a shared pointer, or no T.
   template <class T> std::weak_ptr<T> weak_from_this() { return std::dynamic_pointer_cast<T>(weak_from_this().lock()); }
@@ -140,6 +146,9 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   // Does not tell when the record has to be read from disk and cannot be read.
   std::optional<ReplacedItem> replaceItem(const DiskCacheItem& item, bool withInlineData) override;
 
+  // Only once it is loaded, and if the persistence can do it.
+  bool changeTogether(const std::function<void()>& changes) override;
+
   std::uint32_t size() override;   // total bytes of the items in memory
   std::uint32_t count() override;  // number of items in memory
   bool isLoaded() override;
@@ -147,17 +156,28 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
  private:
   using AccessDates = std::unordered_map<std::string, std::int32_t>;
 
-  using ItemsLock = std::lock_guard<std::mutex>;  // of the items mutex
+  using ItemsLock = std::lock_guard<std::recursive_mutex>;  // of the items mutex
+  using Next = std::function<const ManifestRecord*()>;
 
+  // What a key had in memory before a change.
+  struct Former {
+    std::string key;
+    std::unique_ptr<DiskCacheItem> item;     // null: none
+    std::optional<std::int32_t> accessDate;  // that waits to be written
+  };
+
+  void noteFormer(const ItemsLock& lock, const std::string& key);
+  void takeBackChanges(const ItemsLock& lock);
   void set(const ItemsLock& lock, const DiskCacheItem& item);
   std::optional<ReplacedItem> whatIsReplaced(const ItemsLock& lock, const std::string& key, bool withInlineData);
   const ManifestRecord* findOrRead(const ItemsLock& lock, const std::string& key);
   DiskCacheItem remove(const ItemsLock& lock, const ManifestRecord& record);
   bool hasAccessDate(const ItemsLock& lock, const std::string& key, std::int32_t date) const;
   bool isFlushDue(const ItemsLock& lock) const;
-  template <class MayGo> std::vector<DiskCacheItem> prune(const ItemsLock& lock,
-                                                          const std::function<const ManifestRecord*()>& next,
-                                                          std::uint32_t count, MayGo mayGo);
+  template <class Order, class MayGo>
+  std::vector<DiskCacheItem> prune(const ItemsLock& lock, Order order, std::uint32_t count, MayGo mayGo);
+  template <class MayGo> std::exception_ptr removeInOrder(const ItemsLock& lock, const Next& next, std::uint32_t count,
+                                                          MayGo mayGo, std::vector<DiskCacheItem>& removed);
 
   void armFlushTimer();
   void flush();
@@ -168,11 +188,12 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   const std::unique_ptr<ManifestPersistence> persistence_;
   const std::shared_ptr<AsyncExecutor> executor_;
 
-  std::mutex loadMutex_;   // keeps load, clear and removal apart; taken before itemsMutex_
-  std::mutex itemsMutex_;  // guards the below
+  std::mutex loadMutex_;             // keeps load, clear and removal apart; taken before itemsMutex_
+  std::recursive_mutex itemsMutex_;  // guards the below; also held around changes that are made together
   const std::unique_ptr<ManifestRecords> records_;
   bool loaded_ = false;
   bool invalidated_ = false;
+  std::optional<std::vector<Former>> formers_;  // of the changes that are being made together
   AccessDates pendingAccessDates_;
   std::weak_ptr<AccessDates> queuedAccessDates_;  // those of the flush on the executor; empty once it runs
   bool hasFlushFailed_ = false;                   // then pending dates wait for the timer

@@ -4,4 +4,6 @@ namespace velmora::mobile::xplat::cellar {
 
 ManifestPersistence::~ManifestPersistence() = default;
 
+bool ManifestPersistence::performTogether(const std::function<void()>& /*operations*/) { return false; }
+
 }  // namespace velmora::mobile::xplat::cellar

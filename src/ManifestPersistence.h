@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
@@ -48,6 +49,12 @@ class CELLAR_EXPORT ManifestPersistence {
 
   // Drops the value and the mark; the record stays.
   virtual void removeInlineData(const std::string& key) = 0;
+
+  // Runs `operations`, which call this persistence, so that they take effect together: all of them when it returns
+  // true, none when it throws, be it what they have thrown or that they could not be completed. Other threads'
+  // operations wait. False, and nothing was run, when this persistence cannot do it, as here, or has been invalidated.
+  // Not nested.
+  virtual bool performTogether(const std::function<void()>& operations);
 
  protected:
   ManifestPersistence() = default;

@@ -11,6 +11,7 @@
 #include "keyvalue/BatchRemoval.h"
 #include "keyvalue/Clearing.h"
 #include "keyvalue/FileQueue.h"
+#include "keyvalue/GroupCommit.h"
 #include "keyvalue/InlineWriter.h"
 #include "keyvalue/ItemRemover.h"
 #include "keyvalue/Rollback.h"
@@ -20,6 +21,7 @@
 #include "keyvalue/ValueFetcher.h"
 #include "keyvalue/ValueFiles.h"
 #include "keyvalue/ValueWriter.h"
+#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -28,17 +30,19 @@ namespace velmora::mobile::xplat::cellar {
 struct PersistentKeyValueStore::Parts {
   StoreContext context;
   WritesInFlight writes;
+  WorkQueue workQueue{context};
   FileQueue fileQueue{context.fileQueue};
   ValueFiles files{context};
   StoreManifest manifest{context, writes};
+  GroupCommit groupCommit{context, manifest, workQueue};
   Rollback rollback{context, manifest, writes, files};
-  ItemRemover remover{context, manifest, writes, fileQueue, files};
-  BatchRemoval batches{context, manifest, writes, fileQueue, files};
+  ItemRemover remover{context, manifest, writes, workQueue, fileQueue, files, groupCommit};
+  BatchRemoval batches{context, manifest, writes, workQueue, fileQueue, files};
   Clearing clearing{context, manifest, writes, batches};
   StaleItemRemoval staleItems{context, manifest, batches};
-  ValueFetcher fetcher{context, manifest, writes, fileQueue, files};
-  ValueWriter writer{context, manifest, writes, fileQueue, files, remover, clearing, rollback};
-  InlineWriter inlineWriter{context, manifest, writes, files, remover, clearing, rollback};
+  ValueFetcher fetcher{context, manifest, writes, workQueue, fileQueue, files};
+  ValueWriter writer{context, manifest, writes, workQueue, fileQueue, files, remover, clearing, rollback, groupCommit};
+  InlineWriter inlineWriter{context, manifest, writes, workQueue, files, remover, clearing, rollback, groupCommit};
 
   Parts(Store& store, KeyValueStoreOptions options, const StoreServices& services)
       : context(store, std::move(options), services) {}
@@ -151,21 +155,7 @@ bool PersistentKeyValueStore::readValue(std::shared_ptr<const DiskCacheItem> ite
   return parts_->fetcher.readValue(*item, filePath, value);
 }
 
-Future<void> PersistentKeyValueStore::removeItem(const std::string& key) {
-  const auto promise = std::make_shared<Promise<void>>();
-  Future<void> future = promise->getFuture();
-  ItemRemover& remover = parts_->remover;
-  parts_->context.dispatchWork(
-      KeyRange(key), *promise,
-      [weakRemover = parts_->context.weak(remover), operation = parts_->context.operation, key, promise] {
-        if (const auto self = weakRemover.lock()) {
-          self->remove(key, promise);
-        } else {
-          promise->setValue();
-        }
-      });
-  return future;
-}
+Future<void> PersistentKeyValueStore::removeItem(const std::string& key) { return parts_->remover.remove(key); }
 
 void PersistentKeyValueStore::clear(std::function<void()> onSuccess,
                                     std::function<void(const std::exception&)> onError) {
@@ -182,17 +172,7 @@ std::optional<std::int32_t> PersistentKeyValueStore::fetchModificationDate(const
 }
 
 Future<void> PersistentKeyValueStore::updateLastAccessDate(const std::string& key) {
-  const auto promise = std::make_shared<Promise<void>>();
-  Future<void> future = promise->getFuture();
-  ValueFetcher& fetcher = parts_->fetcher;
-  parts_->context.dispatchWork(
-      KeyRange(key), *promise,
-      [weakFetcher = parts_->context.weak(fetcher), operation = parts_->context.operation, key, promise] {
-        settle(*promise, [&] {
-          if (const auto self = weakFetcher.lock()) self->updateLastAccessDate(key);
-        });
-      });
-  return future;
+  return parts_->fetcher.updateLastAccessDate(key);
 }
 
 // --- Maintenance ---

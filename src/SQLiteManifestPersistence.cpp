@@ -112,10 +112,10 @@ std::unique_ptr<SQLiteStore> SQLiteManifestPersistence::openStore() const {
 
 template <class Operation> auto SQLiteManifestPersistence::perform(Operation operation) const {
   using Result = decltype(operation());
-  const std::lock_guard<std::mutex> lock(mutex_);
+  const std::lock_guard<std::recursive_mutex> lock(mutex_);
   if (invalidated_) return Result();
   return translatingExceptions([&] {
-    if (isReadOnly_) reopen();
+    if (mustReopen_) reopen();
     try {
       return operation();
     } catch (const SQLiteStoreException& exception) {
@@ -135,7 +135,7 @@ void SQLiteManifestPersistence::handleReadOnly(const SQLiteStoreException& excep
   if (file.seekg(kWriterVersionOffset) && file.get() > kLatestWriterVersion) {
     throw SQLiteStoreCorruptedException(exception.description(), kFoundByOurselves);
   }
-  isReadOnly_ = true;
+  mustReopen_ = true;
 }
 
 // The old connection takes SQLite's companion files along when it closes, so the new one must not have made its own by
@@ -143,7 +143,7 @@ void SQLiteManifestPersistence::handleReadOnly(const SQLiteStoreException& excep
 void SQLiteManifestPersistence::reopen() const {
   store_ = openStore();
   initializeDatabase(*store_);
-  isReadOnly_ = false;
+  mustReopen_ = false;
 }
 
 void SQLiteManifestPersistence::clearItems() {
@@ -207,7 +207,7 @@ std::vector<std::unique_ptr<DiskCacheItem>> SQLiteManifestPersistence::getItemsL
 }
 
 void SQLiteManifestPersistence::invalidate() {
-  const std::lock_guard<std::mutex> lock(mutex_);
+  const std::lock_guard<std::recursive_mutex> lock(mutex_);
   store_.reset();
   invalidated_ = true;
 }
@@ -247,6 +247,38 @@ void SQLiteManifestPersistence::removeInlineData(const std::string& key) {
     cursor.bind<std::string>(1, key);
     cursor.next();
   });
+}
+
+bool SQLiteManifestPersistence::performTogether(const std::function<void()>& operations) {
+  const std::lock_guard<std::recursive_mutex> lock(mutex_);
+  const auto run = [this](const char* statement) {
+    return perform([&] {
+      store_->cursor(statement).next();
+      return true;
+    });
+  };
+  // At once for writing: one that begins by reading could find later that another connection has written meanwhile.
+  if (!run("BEGIN IMMEDIATE;")) return false;
+  try {
+    operations();
+    run("COMMIT;");
+  } catch (...) {
+    rollBack();
+    throw;
+  }
+  return true;
+}
+
+// SQLite has ended the transaction itself after most failures of the medium; then there is nothing to roll back.
+void SQLiteManifestPersistence::rollBack() noexcept {
+  constexpr int kNoTransaction = 1;
+  try {
+    store_->exec("ROLLBACK;");
+  } catch (const SQLiteStoreException& exception) {
+    mustReopen_ = exception.code() != kNoTransaction;
+  } catch (...) {
+    mustReopen_ = true;
+  }
 }
 
 void SQLiteManifestPersistence::setSize(const std::string& key, std::uint32_t size) {

@@ -21,6 +21,7 @@
 // alone; triggers and views are not run.
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -69,6 +70,9 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   void setInlineData(const std::string& key, const std::vector<unsigned char>& data) override;
   void removeInlineData(const std::string& key) override;
 
+  // In a transaction.
+  bool performTogether(const std::function<void()>& operations) override;
+
   // Corrects the size of a record that is there already; everything else of it stays, an inline value too.
   void setSize(const std::string& key, std::uint32_t size);
 
@@ -77,16 +81,20 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
 
   std::unique_ptr<SQLiteStore> openStore() const;
   void reopen() const;
+  void rollBack() noexcept;
   void handleReadOnly(const SQLiteStoreException& exception) const;
   std::unique_ptr<DiskCacheItem> itemInRowOf(SQLiteStoreCursor& cursor) const;
   std::vector<std::unique_ptr<DiskCacheItem>> itemsOf(SQLiteStoreCursor& cursor) const;
 
   const std::string path_;
-  mutable std::mutex mutex_;  // held by every operation from its beginning to its end; guards the three below
+  // Held by every operation from its beginning to its end, and around those that are performed together; guards the
+  // three below.
+  mutable std::recursive_mutex mutex_;
   bool invalidated_ = false;
   mutable std::unique_ptr<SQLiteStore> store_;  // null once invalidated
-  // SQLite opens what may not be written just now for reading only; the next operation opens it again.
-  mutable bool isReadOnly_ = false;
+  // The next operation opens the database again: SQLite opens what may not be written just now for reading only, and a
+  // transaction that cannot be rolled back ends with its connection.
+  mutable bool mustReopen_ = false;
   const std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory_;
   const SQLiteStoreFactory storeFactory_;
 };

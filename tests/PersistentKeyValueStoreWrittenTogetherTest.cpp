@@ -257,6 +257,7 @@ TEST_F(PersistentKeyValueStoreWrittenTogether, NotPastAnEviction) {
   clock.advance(1);
   write("one");
   write("two");
+  work().runAll();
   write("three");  // evicts "key"
   const Written anew = write("key");
   runFirstOfFiles();
@@ -359,6 +360,7 @@ TEST_F(PersistentKeyValueStoreWrittenTogether, ARecordThatCannotBeWrittenPurgesT
   const Written three = write("three");
   work().runAll();
   manifest->failNext(ManifestCall::SetItem, unwritable);
+  manifest->failNext(ManifestCall::SetItem, unwritable);  // by itself, too
   runFirstOfFiles();
   settle();
   EXPECT_EQ(told(one), "<done>");

@@ -1041,7 +1041,9 @@ class InterleavedSequence {
     }
     script_.say("the file queue refuses for a while");
     files.throwOnDispatch(true);
+    const auto interruption = std::exchange(session_->files->interruption, nullptr);  // deletions hold a lock now
     pump(1 + script_.below(3));
+    session_->files->interruption = interruption;
     files.throwOnDispatch(false);
   }
 

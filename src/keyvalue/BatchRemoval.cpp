@@ -5,6 +5,7 @@
 #include "keyvalue/FileQueue.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
+#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -28,8 +29,8 @@ BatchRemoval::Items BatchRemoval::evict(const Prune& prune) {
 
 void BatchRemoval::run(Provider provider, OnSuccess onSuccess, OnError onError) {
   auto countedProvider = [operation = context_.operation, provider = std::move(provider)] { return provider(); };
-  context_.workQueue->dispatch([weakThis = context_.weak(*this), countedProvider = std::move(countedProvider),
-                                onSuccess = std::move(onSuccess), onError = std::move(onError)] {
+  workQueue_.dispatch([weakThis = context_.weak(*this), countedProvider = std::move(countedProvider),
+                       onSuccess = std::move(onSuccess), onError = std::move(onError)] {
     if (const auto self = weakThis.lock()) self->step(countedProvider, onSuccess, onError);
   });
 }

@@ -15,6 +15,7 @@ class DiskCacheManifestInterface;
 class FileQueue;
 class StoreManifest;
 class ValueFiles;
+class WorkQueue;
 class WritesInFlight;
 
 // Removes items batch by batch: their records on the work queue, then their files on the file queue, then the next
@@ -29,9 +30,14 @@ class BatchRemoval {
   // Takes items out of the manifest.
   using Prune = std::function<Items(const StoreLock& lock, DiskCacheManifestInterface& manifest)>;
 
-  BatchRemoval(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, FileQueue& fileQueue,
-               ValueFiles& files)
-      : context_(context), manifest_(manifest), writes_(writes), fileQueue_(fileQueue), files_(files) {}
+  BatchRemoval(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, WorkQueue& workQueue,
+               FileQueue& fileQueue, ValueFiles& files)
+      : context_(context),
+        manifest_(manifest),
+        writes_(writes),
+        workQueue_(workQueue),
+        fileQueue_(fileQueue),
+        files_(files) {}
 
   // A batch for `run`. Takes the mutex; a damaged manifest purges the store and yields an empty batch.
   Items take(const Prune& prune);
@@ -55,6 +61,7 @@ class BatchRemoval {
   StoreContext& context_;
   StoreManifest& manifest_;
   WritesInFlight& writes_;
+  WorkQueue& workQueue_;
   FileQueue& fileQueue_;
   ValueFiles& files_;
 };

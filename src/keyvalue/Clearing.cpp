@@ -85,23 +85,35 @@ Clearing::Items Clearing::takeNext(const StoreLock& lock, Clear& clear) {
 }
 
 // What is stored from here on is in `storedSince`, so one look at all keys is enough.
-Clearing::Items Clearing::takeAllBut(const StoreLock& /*lock*/, Clear& clear) {
+Clearing::Items Clearing::takeAllBut(const StoreLock& lock, Clear& clear) {
+  if (!clear.keysLeft) clear.keysLeft = manifest_.get()->getAllKeys();
+  auto& keys = *clear.keysLeft;
   Items items;
-  const auto manifest = manifest_.get();
-  if (!clear.keysLeft) clear.keysLeft = manifest->getAllKeys();
-  for (auto& keys = *clear.keysLeft; !keys.empty() && items.size() < context_.options.batchSize; keys.pop_back()) {
-    const std::string& key = keys.back();
-    const auto item = clear.storedSince.count(key) > 0 ? nullptr : manifest->getItem(key);
-    if (item == nullptr) continue;
-    try {
-      manifest->removeItem(key);
-    } catch (const ManifestPersistenceException&) {
-      if (items.empty()) throw;
-      break;  // the files of those that are removed must be deleted too
+  std::size_t left = keys.size();
+  const auto takeBatch = [&] {
+    for (; left > 0 && items.size() < context_.options.batchSize; --left) {
+      if (clear.storedSince.count(keys[left - 1]) == 0) takeItem(keys[left - 1], items);
     }
-    items.push_back(*item);
+  };
+  if (!manifest_.changeTogether(lock, takeBatch)) {
+    left = keys.size();
+    items.clear();
+    try {
+      takeBatch();
+    } catch (const ManifestPersistenceException&) {
+      if (items.empty()) throw;  // otherwise the files of those that are removed must be deleted too
+    }
   }
+  keys.resize(left);
   return items;
+}
+
+void Clearing::takeItem(const std::string& key, Items& items) {
+  const auto manifest = manifest_.get();
+  const auto item = manifest->getItem(key);
+  if (item == nullptr) return;
+  manifest->removeItem(key);
+  items.push_back(*item);
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -32,6 +32,7 @@ class Clearing {
   Items begin(const StoreLock& lock, const std::shared_ptr<Clear>& clear);
   Items takeNext(const StoreLock& lock, Clear& clear);
   Items takeAllBut(const StoreLock& lock, Clear& clear);
+  void takeItem(const std::string& key, Items& items);
   Items cancelWrites(const StoreLock& lock);
 
   StoreContext& context_;

@@ -2,12 +2,12 @@
 
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <utility>
 #include <vector>
 
 #include "Future.h"
 #include "executor/AsyncExecutor.h"
+#include "keyvalue/Chain.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -26,19 +26,13 @@ class FileQueue {
   Future<void> run(std::function<void()> task);  // fulfilled with what the task does or throws
   void dispatchWrite(const std::shared_ptr<FileWrite>& write, std::function<void()> task);
 
-  // What is dispatched from now on does not overtake what is there.
-  void closeGroup();
-
   // The write right behind the last of the group; null when there is none, when it may not be written early, or when
   // its key is one of theirs, for which each write has to be over before the next begins.
   std::shared_ptr<FileWrite> next(const std::vector<std::shared_ptr<FileWrite>>& group);
 
  private:
-  std::shared_ptr<FileWrite> append(const std::shared_ptr<FileWrite>& write);
-
   const std::shared_ptr<AsyncExecutor> queue_;
-  std::mutex mutex_;               // guards the one below, and `next` of writes
-  std::weak_ptr<FileWrite> last_;  // null once another task is behind it
+  Chain<FileWrite> writes_;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

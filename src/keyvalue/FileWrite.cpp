@@ -15,4 +15,12 @@ DiskCacheItem FileWrite::record() const {
   return {key, key, size, false, date, date, extendedMetadata};
 }
 
+void FileWrite::runAlone() { owner.lock()->begin(shared_from_this()); }
+
+void FileWrite::change(const StoreLock& lock) { owner.lock()->change(lock, *this); }
+
+void FileWrite::note(const StoreLock& lock) { owner.lock()->note(lock, *this); }
+
+void FileWrite::finish() { owner.lock()->dispatch(shared_from_this()); }
+
 }  // namespace velmora::mobile::xplat::cellar

@@ -8,8 +8,11 @@
 #include <utility>
 
 #include "DiskCacheItem.h"
+#include "DiskCacheManifest.h"
 #include "Future.h"
 #include "PersistentKeyValueStore.h"
+#include "keyvalue/Chain.h"
+#include "keyvalue/ManifestChange.h"
 #include "keyvalue/StoreContext.h"
 #include "keyvalue/WritesInFlight.h"
 
@@ -18,7 +21,10 @@ namespace velmora::mobile::xplat::cellar {
 class ValueWriter;
 
 // A write of a file, on its way through the queues.
-struct FileWrite : WritesInFlight::Write {
+struct FileWrite final : WritesInFlight::Write,
+                         ManifestChange,
+                         Chain<FileWrite>::Link,
+                         std::enable_shared_from_this<FileWrite> {
   using State = WritesInFlight::State;
 
   const std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
@@ -28,12 +34,15 @@ struct FileWrite : WritesInFlight::Write {
   const Token operation;
   Promise<void> promise;
 
-  std::weak_ptr<FileWrite> next;  // the write right behind on the file queue; guarded by FileQueue
+  // What its provisional record has replaced, and what was evicted for it.
+  std::optional<ReplacedItem> replaced;
+  std::unique_ptr<DiskCacheItem> evicted;
 
   // What has come of it, for the task of the file queue.
   unsigned int size = 0;
-  bool leavesFile = false;             // that has to be deleted
-  std::optional<std::uint32_t> total;  // of all items with this one, to report
+  std::optional<DiskCacheItem> finalRecord;  // once the manifest has it
+  bool leavesFile = false;                   // that has to be deleted
+  std::optional<std::uint32_t> total;        // of all items with this one, to report
   std::exception_ptr failure;
 
   FileWrite(std::string key_, std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata_,
@@ -49,10 +58,16 @@ struct FileWrite : WritesInFlight::Write {
   FileWrite& operator=(const FileWrite&) = delete;
 
   // Rolls back a write that was dropped. Takes the store's mutex: a write must not be released by who holds it.
-  ~FileWrite();
+  ~FileWrite() override;
 
   // As the manifest has it from now on.
   DiskCacheItem record() const;
+
+  // As a change, run by who holds the store.
+  void runAlone() override;
+  void change(const StoreLock& lock) override;
+  void note(const StoreLock& lock) override;
+  void finish() override;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

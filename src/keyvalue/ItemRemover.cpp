@@ -1,57 +1,134 @@
 #include "keyvalue/ItemRemover.h"
 
+#include <exception>
+#include <mutex>
 #include <optional>
+#include <utility>
 
 #include "FileUtils.h"
 #include "LarderException.h"
 #include "keyvalue/FileQueue.h"
+#include "keyvalue/GroupCommit.h"
+#include "keyvalue/ManifestChange.h"
 #include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
+#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
 
-void ItemRemover::remove(const std::string& key, const std::shared_ptr<Promise<void>>& promise) {
-  bool isOver = false;
+// A removal, on its way through the queues.
+struct ItemRemover::Removal final : ManifestChange, std::enable_shared_from_this<Removal> {
+  const std::string key;
+  const std::weak_ptr<ItemRemover> owner;
+  const Token operation;
+  Promise<void> promise;
+
+  std::unique_ptr<DiskCacheItem> item;  // that was removed
+  bool isLeftToWrite = false;           // a write that is on its way deletes the file
+  std::exception_ptr failure;
+
+  Removal(std::string key_, std::weak_ptr<ItemRemover> owner_, Token operation_)
+      : key(std::move(key_)), owner(std::move(owner_)), operation(std::move(operation_)) {}
+
+  // Whoever runs a removal holds the store.
+  void runAlone() override { owner.lock()->removeAlone(*this); }
+  void change(const StoreLock& lock) override { owner.lock()->removeRecord(lock, *this); }
+  void note(const StoreLock& lock) override { owner.lock()->noteRemoved(lock, *this); }
+  void deleteFile() override { owner.lock()->deleteFile(*this); }
+  void finish() override { owner.lock()->fulfil(*this); }
+};
+
+Future<void> ItemRemover::remove(const std::string& key) {
+  const auto removal = std::make_shared<Removal>(key, context_.weak(*this), context_.operation);
+  Future<void> future = removal->promise.getFuture();
+  workQueue_.dispatchChange(KeyRange(removal->key), removal, [removal] {
+    if (const auto self = removal->owner.lock()) {
+      self->groupCommit_.run(removal);
+    } else if (removal->take()) {
+      removal->promise.setValue();
+    }
+  });
+  return future;
+}
+
+void ItemRemover::removeAlone(Removal& removal) {
   try {
-    isOver = removeNow(key, promise);
+    const std::lock_guard<std::mutex> removing(context_.removalMutex);
+    {
+      const StoreLock lock = context_.lock();
+      context_.throwIfInvalid();
+      removal.item = manifest_.lookUp(lock, KeyRange(removal.key));
+      const auto removeIt = [&] { manifest_.get()->removeItem(removal.key); };
+      if (removal.item != nullptr && !manifest_.purgingIfDamaged(lock, removeIt)) removal.item.reset();
+      noteRemoved(lock, removal);
+    }
+    deleteFile(removal);
   } catch (...) {
-    return promise->setException(std::current_exception());
+    removal.failure = std::current_exception();
   }
-  if (isOver) promise->setValue();
+  fulfil(removal);
 }
 
-// False when a write that is on its way is left to delete the file: the promise is kept when the file queue has got
-// past it.
-bool ItemRemover::removeNow(const std::string& key, const std::shared_ptr<Promise<void>>& promise) {
-  const std::lock_guard<std::mutex> removal(removalMutex_);
-  std::optional<std::string> path;
-  {
-    const StoreLock lock = context_.lock();
-    context_.throwIfInvalid();
-    const auto item = manifest_.lookUp(lock, KeyRange(key));
-    if (item != nullptr && manifest_.purgingIfDamaged(lock, [&] { manifest_.get()->removeItem(key); })) {
-      path = files_.fileOf(*item);
-    }
-    if (writes_.revoke(key)) {
-      fileQueue_.dispatch([promise] { promise->setValue(); });
-      return false;
-    }
-  }
-  if (path) context_.files->deleteFile(*path);
-  return true;
-}
-
-void ItemRemover::evictOldestIfFull(const StoreLock& /*lock*/) {
+void ItemRemover::removeRecord(const StoreLock& /*lock*/, Removal& removal) {
   const auto manifest = manifest_.get();
+  removal.item = manifest->getItem(removal.key);
+  if (removal.item != nullptr) manifest->removeItem(removal.key);
+}
+
+void ItemRemover::noteRemoved(const StoreLock& /*lock*/, Removal& removal) {
+  removal.isLeftToWrite = writes_.revoke(removal.key);
+}
+
+void ItemRemover::deleteFile(Removal& removal) {
+  if (removal.item == nullptr || removal.isLeftToWrite) return;
+  try {
+    if (const auto path = files_.fileOf(*removal.item)) context_.files->deleteFile(*path);
+  } catch (...) {
+    removal.failure = std::current_exception();
+  }
+}
+
+// Where a write is left to delete the file, the promise is kept when the file queue has got past it.
+void ItemRemover::fulfil(Removal& removal) {
+  if (removal.failure != nullptr) return removal.promise.setException(removal.failure);
+  if (!removal.isLeftToWrite) return removal.promise.setValue();
+  try {
+    fileQueue_.dispatch([self = removal.shared_from_this()] { self->promise.setValue(); });
+  } catch (...) {
+    removal.promise.setException(std::current_exception());
+  }
+}
+
+void ItemRemover::evictOldestIfFull(const StoreLock& lock) {
+  const auto item = takeOldestIfFull(lock);
+  if (item != nullptr) discard(*item);
+}
+
+std::unique_ptr<DiskCacheItem> ItemRemover::takeOldestIfFull(const StoreLock& /*lock*/) {
   const auto& capacity = context_.options.capacity;
-  if (!capacity || manifest->count() < *capacity) return;
-  const auto item = manifest->pruneOldestItem();
+  if (!capacity) return nullptr;
+  const auto manifest = manifest_.get();
+  return manifest->count() < *capacity ? nullptr : manifest->pruneOldestItem();
+}
+
+// A file queue that refuses the deletion refuses the write, too, that the item was evicted for.
+void ItemRemover::noteEvicted(const StoreLock& /*lock*/, const DiskCacheItem* item) {
   if (item == nullptr) return;
+  try {
+    discard(*item);
+  } catch (const std::exception& error) {
+    errorLine(__LINE__).stream() << "Store \"" << context_.options.name << "\" deleted the file of evicted \""
+                                 << item->key << "\" on its work queue: " << error.what();
+  }
+}
+
+// The file of an evicted item, whose record is gone.
+void ItemRemover::discard(const DiskCacheItem& item) {
   StoreContext::count(context_.evictions);
-  const auto path = files_.fileOf(*item);
-  if (!path || writes_.revoke(item->key)) return;
+  const auto path = files_.fileOf(item);
+  if (!path || writes_.revoke(item.key)) return;
   const auto deleteIt = [weakContext = context_.weak(context_), deletion = context_.fileDeletion, path = *path] {
     const auto context = weakContext.lock();
     if (context == nullptr || context->isClosed) return;  // the path may be another store's by now
@@ -64,7 +141,7 @@ void ItemRemover::evictOldestIfFull(const StoreLock& /*lock*/) {
   try {
     fileQueue_.dispatch(deleteIt);
   } catch (...) {
-    deleteIt();  // its record is gone already
+    deleteIt();
     throw;
   }
 }
@@ -75,6 +152,6 @@ bool ItemRemover::makeRoom(const StoreLock& lock) {
   return !context_.options.capacity || manifest_.purgingIfUnwritable(lock, [&] { evictOldestIfFull(lock); });
 }
 
-void ItemRemover::finish() { const std::lock_guard<std::mutex> removal(removalMutex_); }
+void ItemRemover::finish() { const std::lock_guard<std::mutex> removing(context_.removalMutex); }
 
 }  // namespace velmora::mobile::xplat::cellar

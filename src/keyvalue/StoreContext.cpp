@@ -5,7 +5,6 @@
 #include "FileUtils.h"
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
-#include "keyvalue/ReservedKeys.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -40,14 +39,6 @@ void StoreContext::throwIfInvalid() const {
 
 void StoreContext::throwIfClosed() const {
   if (isClosed) throwIfInvalid();
-}
-
-void StoreContext::dispatchWork(KeyRange keys, std::function<void()> task) {
-  throwIfInvalid();
-  if (!options.inlineData) {
-    for (const std::string& key : keys) throwIfReserved(key);
-  }
-  workQueue->dispatch(std::move(task));
 }
 
 }  // namespace velmora::mobile::xplat::cellar

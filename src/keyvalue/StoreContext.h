@@ -3,7 +3,6 @@
 #include <atomic>
 #include <cstdint>
 #include <exception>
-#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -13,7 +12,6 @@
 #include "Store.h"
 #include "StoreOptions.h"
 #include "executor/TaskQueueFactory.h"
-#include "keyvalue/KeyRange.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -41,7 +39,7 @@ using Token = std::shared_ptr<const char>;
 
 // What the parts of a key-value store share: what it was made from, its mutex, and how far its life has come.
 //
-// Locks are taken in this order: that of a removal (ItemRemover), the store's, then one of those that are held for a
+// Locks are taken in this order: that of removals, the store's, then one of those that are held for a
 // moment (WritesInFlight, FileQueue, the creation of the manifest).
 class StoreContext {
  public:
@@ -58,6 +56,7 @@ class StoreContext {
   const std::shared_ptr<AsyncExecutor> fileQueue;
   const std::shared_ptr<AsyncExecutor> workQueue;
 
+  std::mutex removalMutex;  // held until what is removed has no file any more: invalidation waits for it
   std::mutex mutex;
 
   std::atomic<bool> isInvalidated{false};  // set with the mutex held
@@ -88,18 +87,7 @@ class StoreContext {
     return std::shared_ptr<Part>(store_.weak_from_this().lock(), &part);
   }
 
-  // Hands the task of an operation on these keys to the work queue, or fails the promise with the reason why not.
-  template <class T> void dispatchWork(KeyRange keys, Promise<T>& promise, std::function<void()> task) {
-    try {
-      dispatchWork(keys, std::move(task));
-    } catch (...) {
-      promise.setException(std::current_exception());
-    }
-  }
-
  private:
-  void dispatchWork(KeyRange keys, std::function<void()> task);
-
   Store& store_;
 };
 

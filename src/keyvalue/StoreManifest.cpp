@@ -58,6 +58,10 @@ std::unique_ptr<DiskCacheItem> StoreManifest::lookUp(const StoreLock& lock, KeyR
   return item;
 }
 
+bool StoreManifest::changeTogether(const StoreLock& /*lock*/, const std::function<void()>& changes) {
+  return isCreated_ && !isPurgePending_ && manifest_->changeTogether(changes);
+}
+
 bool StoreManifest::purge(const StoreLock& lock, const LarderException& error) {
   context_.throwIfClosed();
   {

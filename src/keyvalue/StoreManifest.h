@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -53,6 +54,9 @@ class StoreManifest {
       return false;
     }
   }
+
+  // Makes the changes in one transaction. False when nothing has changed: they can be made one by one then.
+  bool changeTogether(const StoreLock& lock, const std::function<void()>& changes);
 
   // Moves the directory to the trash and begins again. False, and nothing has changed, when the directory cannot be
   // collected: what the old manifest says would be back at the next start. Throws once the store is closed.

@@ -12,6 +12,7 @@
 #include "keyvalue/ReservedKeys.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
+#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -47,7 +48,7 @@ Future<ValueFetcher::Fetched> ValueFetcher::fetchFirst(std::vector<std::string> 
   const auto fetch =
       std::make_shared<Fetch>(std::move(keys), std::move(loader), context_.weak(*this), context_.operation);
   Future<Fetched> future = fetch->promise.getFuture();
-  context_.dispatchWork(KeyRange(fetch->keys), fetch->promise, [fetch] {
+  workQueue_.dispatch(KeyRange(fetch->keys), fetch->promise, [fetch] {
     if (const auto self = fetch->fetcher.lock()) {
       self->find(fetch);
     } else {
@@ -144,7 +145,19 @@ std::optional<std::int32_t> ValueFetcher::modificationDate(const std::string& ke
   return date;
 }
 
-void ValueFetcher::updateLastAccessDate(const std::string& key) {
+Future<void> ValueFetcher::updateLastAccessDate(const std::string& key) {
+  const auto promise = std::make_shared<Promise<void>>();
+  Future<void> future = promise->getFuture();
+  workQueue_.dispatch(KeyRange(key), *promise,
+                      [weakThis = context_.weak(*this), operation = context_.operation, key, promise] {
+                        settle(*promise, [&] {
+                          if (const auto self = weakThis.lock()) self->noteAccess(key);
+                        });
+                      });
+  return future;
+}
+
+void ValueFetcher::noteAccess(const std::string& key) {
   context_.throwIfInvalid();
   if (context_.analytics != nullptr) {
     const PersistentKeyValueStoreEventBuilder event(Hit::Found, context_.options.name, key);

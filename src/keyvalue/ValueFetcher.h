@@ -16,6 +16,7 @@ namespace velmora::mobile::xplat::cellar {
 class FileQueue;
 class StoreManifest;
 class ValueFiles;
+class WorkQueue;
 class WritesInFlight;
 
 // Looks items up, on the work queue, and reads their values, on the file queue.
@@ -24,9 +25,14 @@ class ValueFetcher {
   using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
   using Loader = PersistentKeyValueStore::Loader;
 
-  ValueFetcher(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, FileQueue& fileQueue,
-               ValueFiles& files)
-      : context_(context), manifest_(manifest), writes_(writes), fileQueue_(fileQueue), files_(files) {}
+  ValueFetcher(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, WorkQueue& workQueue,
+               FileQueue& fileQueue, ValueFiles& files)
+      : context_(context),
+        manifest_(manifest),
+        writes_(writes),
+        workQueue_(workQueue),
+        fileQueue_(fileQueue),
+        files_(files) {}
 
   Future<Fetched> fetchFirst(std::vector<std::string> keys, Loader loader);
 
@@ -35,7 +41,7 @@ class ValueFetcher {
 
   std::optional<std::int32_t> modificationDate(const std::string& key);
 
-  void updateLastAccessDate(const std::string& key);  // on the work queue
+  Future<void> updateLastAccessDate(const std::string& key);
 
  private:
   struct Fetch;
@@ -43,11 +49,13 @@ class ValueFetcher {
   void find(const std::shared_ptr<Fetch>& fetch);
   void load(Fetch& fetch);
   bool hasLostItem(const DiskCacheItem& item);
+  void noteAccess(const std::string& key);
   void reportAccess(const DiskCacheItem* item, const std::string& key);
 
   StoreContext& context_;
   StoreManifest& manifest_;
   WritesInFlight& writes_;
+  WorkQueue& workQueue_;
   FileQueue& fileQueue_;
   ValueFiles& files_;
 };

@@ -7,10 +7,12 @@
 
 #include "keyvalue/Clearing.h"
 #include "keyvalue/FileQueue.h"
+#include "keyvalue/GroupCommit.h"
 #include "keyvalue/ItemRemover.h"
 #include "keyvalue/Rollback.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
+#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -29,10 +31,10 @@ Future<void> ValueWriter::store(const std::string& key,
   const auto write = std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer), isGroupable,
                                                  context_.weak(*this), context_.operation);
   Future<void> future = write->promise.getFuture();
-  context_.dispatchWork(KeyRange(write->key), write->promise, [write] {
+  workQueue_.dispatchChange(KeyRange(write->key), write, [write] {
     if (const auto self = write->owner.lock()) {
-      self->begin(write);
-    } else {
+      self->groupCommit_.run(write);
+    } else if (write->take()) {
       write->promise.setValue();
     }
   });
@@ -42,22 +44,37 @@ Future<void> ValueWriter::store(const std::string& key,
 void ValueWriter::begin(const std::shared_ptr<FileWrite>& write) {
   bool hasBegun = false;
   try {
-    {
-      const StoreLock lock = context_.lock();
-      context_.throwIfInvalid();
-      hasBegun = beginRecord(lock, *write);
-    }
-    if (hasBegun) dispatch(write);
+    const StoreLock lock = context_.lock();
+    context_.throwIfInvalid();
+    hasBegun = beginRecord(lock, *write);
   } catch (...) {
-    // The task of an earlier write may have it by now, though the queue has refused its own.
-    if (writes_.claim(*write)) write->promise.setException(std::current_exception());
-    return;
+    return write->promise.setException(std::current_exception());
   }
-  if (!hasBegun) write->promise.setValue();  // the store was purged instead
+  if (hasBegun) return dispatch(write);
+  write->promise.setValue();  // the store was purged instead
+}
+
+void ValueWriter::change(const StoreLock& lock, FileWrite& write) {
+  write.evicted = remover_.takeOldestIfFull(lock);
+  setProvisionalRecord(write);
+}
+
+void ValueWriter::note(const StoreLock& lock, FileWrite& write) {
+  remover_.noteEvicted(lock, write.evicted.get());
+  noteProvisionalRecord(lock, write);
 }
 
 // A queue that takes no task drops the write: its end takes the record away again.
 void ValueWriter::dispatch(const std::shared_ptr<FileWrite>& write) {
+  try {
+    handToFileQueue(write);
+  } catch (...) {
+    // The task of an earlier write may have it by now, though the queue has refused its own.
+    if (writes_.claim(*write)) write->promise.setException(std::current_exception());
+  }
+}
+
+void ValueWriter::handToFileQueue(const std::shared_ptr<FileWrite>& write) {
   fileQueue_.dispatchWrite(write, [write] {
     if (const auto self = write->owner.lock()) {
       if (self->writes_.claim(*write)) self->commitGroup(write);
@@ -67,20 +84,27 @@ void ValueWriter::dispatch(const std::shared_ptr<FileWrite>& write) {
   });
 }
 
-// Puts a provisional record into the manifest. False when the store had to be purged instead.
+// False when the store had to be purged instead.
 bool ValueWriter::beginRecord(const StoreLock& lock, FileWrite& write) {
-  std::optional<ReplacedItem> replaced;
-  const auto setRecord = [&] { replaced = manifest_.get()->replaceItem(write.record(), true); };
-  if (!remover_.makeRoom(lock) || !manifest_.purgingIfUnwritable(lock, setRecord)) {
+  if (!remover_.makeRoom(lock) || !manifest_.purgingIfUnwritable(lock, [&] { setProvisionalRecord(write); })) {
     writes_.revoke(write.key);  // an earlier value must not take the place of this one
     return false;
   }
+  noteProvisionalRecord(lock, write);
+  return true;
+}
+
+void ValueWriter::setProvisionalRecord(FileWrite& write) {
+  write.replaced = manifest_.get()->replaceItem(write.record(), true);
+}
+
+void ValueWriter::noteProvisionalRecord(const StoreLock& lock, FileWrite& write) {
+  auto replaced = std::exchange(write.replaced, std::nullopt);
   auto settled = replaced ? SettledValue{std::move(replaced->item), std::move(replaced->inlineData)}
                           : SettledValue{nullptr, {}, true};
   const bool isDueToBeCleared = clearing_.noteStored(lock, write.key);
   if (isDueToBeCleared && !settled.isPlainMiss()) settled = SettledValue::lost();
   writes_.begin(write, std::move(settled));
-  return true;
 }
 
 // Writes a file, and then its record. To wait for the manifest would cost two switches between threads for each write:
@@ -96,6 +120,7 @@ void ValueWriter::commitGroup(const std::shared_ptr<FileWrite>& first) {
     extendGroup(group);
     lock.lock();
   }
+  setFinalRecords(lock, group);
   for (const auto& write : group) recordWritten(lock, *write);
   for (const auto& write : group) reportTotal(*write);  // together, so that the work queue's thread is woken once
   lock.unlock();
@@ -149,6 +174,30 @@ unsigned int ValueWriter::runWriter(FileWrite& write) {
   }
 }
 
+// Those of the writes that have come about, in one transaction. Where that fails, `recordWritten` sets them one by one.
+void ValueWriter::setFinalRecords(const StoreLock& lock, const Group& group) {
+  if (group.size() == 1) return;
+  Group written;
+  for (const auto& write : group) {
+    const bool isWritten = write->failure == nullptr && write->state == FileWrite::State::Writing && write->hasRecord;
+    if (isWritten) written.push_back(write);
+  }
+  const auto setAll = [&] {
+    for (const auto& write : written) {
+      setFinalRecord(*write);
+      write->total = manifest_.totalToReport();
+    }
+  };
+  if (manifest_.changeTogether(lock, setAll)) return;
+  for (const auto& write : written) write->finalRecord.reset();
+}
+
+void ValueWriter::setFinalRecord(FileWrite& write) {
+  DiskCacheItem record = write.record();
+  manifest_.get()->setItem(record);
+  write.finalRecord = std::move(record);
+}
+
 void ValueWriter::recordWritten(const StoreLock& lock, FileWrite& write) {
   if (write.failure != nullptr) return;
   if (write.state == FileWrite::State::Discarded) {
@@ -159,21 +208,24 @@ void ValueWriter::recordWritten(const StoreLock& lock, FileWrite& write) {
   }
   const bool othersAreInFlight = writes_.end(write);
   try {
-    const DiskCacheItem record = write.record();
-    const auto setRecord = [&] {
-      if (!write.hasRecord) remover_.evictOldestIfFull(lock);
-      manifest_.get()->setItem(record);
-      StoreContext::count(context_.stores);
-    };
-    if (manifest_.purgingIfUnwritable(lock, setRecord) && othersAreInFlight) {
-      writes_.settle(write.key, {std::make_unique<DiskCacheItem>(record)});
-    }
+    if (!write.finalRecord) setFinalRecordAlone(lock, write);
   } catch (...) {
     write.failure = std::current_exception();
     write.leavesFile = true;
     rollback_.discardRecord(lock, write.key, othersAreInFlight);
     return;
   }
+  if (!write.finalRecord) return;
+  StoreContext::count(context_.stores);
+  if (othersAreInFlight) writes_.settle(write.key, {std::make_unique<DiskCacheItem>(std::move(*write.finalRecord))});
+}
+
+// The store may have to be purged instead.
+void ValueWriter::setFinalRecordAlone(const StoreLock& lock, FileWrite& write) {
+  manifest_.purgingIfUnwritable(lock, [&] {
+    if (!write.hasRecord) remover_.evictOldestIfFull(lock);
+    setFinalRecord(write);
+  });
   noteTotal(write);
 }
 

@@ -138,6 +138,9 @@ class FaultyManifest final : public DiskCacheManifestInterface {
     enter(ManifestCall::SetItem, "setItem " + item.key + " " + std::to_string(item.size));
     return real().replaceItem(item, withInlineData);
   }
+  bool changeTogether(const std::function<void()>& changes) override {
+    return cannotReplace ? DiskCacheManifestInterface::changeTogether(changes) : real().changeTogether(changes);
+  }
 
  private:
   DiskCacheManifestInterface& real() {

@@ -31,6 +31,9 @@ class MemoryMedium {
   // Called at the end of each operation that has not failed, with no lock held.
   std::function<void(const std::string& operation, const std::string& key)> onCall;
 
+  // Whether its persistences have transactions. To be set before other threads use it.
+  bool canPerformTogether = true;
+
   void put(const DiskCacheItem& item, const Bytes& inlineData = {}) {
     change([&](Rows& rows) { rows[item.key] = {item, inlineData}; });
   }
@@ -67,6 +70,11 @@ class MemoryMedium {
   void forgetCalls() {
     const std::lock_guard<std::mutex> lock(mutex_);
     calls_.clear();
+  }
+
+  void noteCall(const std::string& operation) {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    calls_.emplace_back(operation, "");
   }
 
   // The operation fails from its n-th call from now on (0: the next).
@@ -164,6 +172,21 @@ class MemoryPersistence final : public ManifestPersistence {
       row.item.hasInlineData = false;
       row.inlineData.clear();
     });
+  }
+
+  // Operations of its own: "begin", "commit" and "roll back", of which the last does not fail.
+  bool performTogether(const std::function<void()>& operations) override {
+    if (isSilent_ || !medium_->canPerformTogether) return false;
+    Rows before = perform("begin", "", [](Rows& rows) { return rows; });
+    try {
+      operations();
+      perform("commit", "", [](Rows& rows) { return rows.size(); });
+    } catch (...) {
+      medium_->change([&](Rows& rows) { rows = std::move(before); });
+      medium_->noteCall("roll back");
+      throw;
+    }
+    return true;
   }
 
  private:
