@@ -4,6 +4,7 @@
 #include <limits>
 #include <map>
 #include <stdexcept>
+#include <vector>
 
 #include <cellar/AnalyticsEventReporter.h>
 #include <cellar/DiskCache.h>
@@ -60,13 +61,17 @@ class CacheScenario : public Scenario {
     runQueues();
   }
 
-  void storeAll() {
+  // So many at a time wait on the queues.
+  void storeAll(std::size_t outstanding = 1) {
     Bytes value = valueOf(kSize);
+    std::vector<Future<void>> futures;
     for (std::size_t number = 0; number < kOperations; ++number) {
       stamp(value, number);
-      Future<void> future = cache_->store(keyOf(number), value);
+      futures.push_back(cache_->store(keyOf(number), value));
+      if (futures.size() < outstanding && number + 1 < kOperations) continue;
       runQueues();
-      future.get();
+      for (auto& future : futures) future.get();
+      futures.clear();
     }
   }
 
@@ -81,14 +86,20 @@ constexpr std::uint32_t kNoLimit = std::numeric_limits<std::uint32_t>::max();
 
 class Stores : public CacheScenario {
  public:
-  explicit Stores(const std::string& directory) : CacheScenario(directory, 0, kNoLimit) { load(); }
-  void run() override { storeAll(); }
+  Stores(const std::string& directory, std::size_t outstanding)
+      : CacheScenario(directory, 0, kNoLimit), outstanding_(outstanding) {
+    load();
+  }
+  void run() override { storeAll(outstanding_); }
   void verify() override {
     for (std::size_t number = 0; number < kOperations; ++number) {
       throwUnlessValue(readFile(directory() + "/" + keyOf(number), kSize), kSize, number);
     }
     throwUnless(cache().getManifest()->count() == kOperations, "not every store has a record");
   }
+
+ private:
+  const std::size_t outstanding_;
 };
 
 class Fetches : public CacheScenario {
@@ -173,7 +184,9 @@ using Create = std::function<std::unique_ptr<Scenario>(const std::string& direct
 
 const std::map<std::string, Create>& scenarios() {
   static const std::map<std::string, Create> all = {
-      {"1,000 stores", [](const std::string& directory) { return std::make_unique<Stores>(directory); }},
+      {"1,000 stores", [](const std::string& directory) { return std::make_unique<Stores>(directory, 1); }},
+      {"1,000 stores, 32 at a time",
+       [](const std::string& directory) { return std::make_unique<Stores>(directory, 32); }},
       {"1,000 fetches", [](const std::string& directory) { return std::make_unique<Fetches>(directory); }},
       {"a prune of 10,000", [](const std::string& directory) { return std::make_unique<Prune>(directory); }},
       {"a load of 10,000", [](const std::string& directory) { return std::make_unique<Load>(directory); }},

@@ -27,6 +27,8 @@ constexpr const char* kPut =
     "VALUES  (?1, ?2, ?3, ?4, ?5, ?6, ?7);";
 constexpr const char* kPutValue =
     "UPDATE   LarderManifest SET   has_inline_data = 1,  inline_data = ?2 WHERE   key = ?1;";
+constexpr const char* kBegin = "BEGIN IMMEDIATE;";
+constexpr const char* kCommit = "COMMIT;";
 constexpr const char* kRemove = "DELETE FROM LarderManifest WHERE key = ?1;";
 
 void bindRecord(Statement& statement, const std::string& key, std::size_t size, std::int32_t date) {
@@ -44,15 +46,33 @@ ManifestLowerBound::ManifestLowerBound(const std::string& directory) : database_
   database_.exec(kScript);
 }
 
+void ManifestLowerBound::inTransaction(const std::function<void()>& writes) {
+  keepsStatements_ = true;
+  statement(kBegin).next();
+  writes();
+  statement(kCommit).next();
+}
+
+// Prepared, or reset.
+Statement& ManifestLowerBound::statement(const char* sql) {
+  auto& statement = statements_[sql];
+  if (statement == nullptr || !keepsStatements_) {
+    statement = nullptr;
+    statement = std::make_unique<Statement>(database_, sql);
+  } else {
+    statement->reset();
+  }
+  return *statement;
+}
+
 void ManifestLowerBound::put(const std::string& key, std::size_t size, std::int32_t date) {
-  Statement statement(database_, kPut);
-  bindRecord(statement, key, size, date);
-  statement.next();
+  Statement& put = statement(kPut);
+  bindRecord(put, key, size, date);
+  put.next();
 }
 
 void ManifestLowerBound::putValue(const std::string& key, const Bytes& value) {
-  Statement statement(database_, kPutValue);
-  statement.text(1, key).blob(2, value).next();
+  statement(kPutValue).text(1, key).blob(2, value).next();
 }
 
 Bytes ManifestLowerBound::value(const std::string& key) {
@@ -61,7 +81,7 @@ Bytes ManifestLowerBound::value(const std::string& key) {
   return statement.blob(0);
 }
 
-void ManifestLowerBound::remove(const std::string& key) { Statement(database_, kRemove).text(1, key).next(); }
+void ManifestLowerBound::remove(const std::string& key) { statement(kRemove).text(1, key).next(); }
 
 void ManifestLowerBound::fill(std::size_t count, std::size_t size) {
   database_.exec("PRAGMA cache_size = -500000");  // in KiB: all of it

@@ -2,6 +2,9 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
 #include <string>
 
 #include "lower_bounds/SQLite.h"
@@ -14,6 +17,9 @@ class ManifestLowerBound {
  public:
   explicit ManifestLowerBound(const std::string& directory);
 
+  // Runs `writes` in one transaction. From the first of them on, statements are kept.
+  void inTransaction(const std::function<void()>& writes);
+
   void put(const std::string& key, std::size_t size, std::int32_t date);
   void putValue(const std::string& key, const Bytes& value);  // of a record that is there
   Bytes value(const std::string& key);
@@ -25,7 +31,11 @@ class ManifestLowerBound {
   Database& database() { return database_; }
 
  private:
+  Statement& statement(const char* sql);
+
   Database database_;
+  bool keepsStatements_ = false;
+  std::map<const char*, std::unique_ptr<Statement>> statements_;
 };
 
 // The access date of an item of `fill`: later ones were used later, all of them long ago.
