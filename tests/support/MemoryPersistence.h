@@ -82,6 +82,16 @@ class MemoryMedium {
     const std::lock_guard<std::mutex> lock(mutex_);
     failures_[operation] = after;
   }
+  // Only its n-th call from now on fails.
+  void failOnce(const std::string& operation, int after) {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    failures_[operation] = after;
+    failsOnce_ = true;
+  }
+  std::size_t failures() const {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    return failed_;
+  }
   void heal() {
     const std::lock_guard<std::mutex> lock(mutex_);
     failures_.clear();
@@ -104,6 +114,8 @@ class MemoryMedium {
     const auto failure = failures_.find(operation);
     if (failure == failures_.end() || failure->second-- > 0) return;
     failure->second = 0;
+    ++failed_;
+    if (std::exchange(failsOnce_, false)) failures_.erase(failure);
     throw ManifestPersistenceException("The medium is full.", 13);
   }
 
@@ -111,6 +123,8 @@ class MemoryMedium {
   Rows rows_;
   std::vector<std::pair<std::string, std::string>> calls_;
   std::map<std::string, int> failures_;
+  bool failsOnce_ = false;
+  std::size_t failed_ = 0;
 };
 
 // Thread-safe. Leaves its medium alone once it has been invalidated.
