@@ -19,6 +19,7 @@ bool isOlder(const Ledger::Key& key, const Ledger::Bytes& found) {
 }  // namespace
 
 void Ledger::note(const Record& record) {
+  if (record.operation == Record::Operation::Group) return noteGroup(record);
   if (record.kind == Record::Kind::Done) ++acknowledged;
   if (record.kind == Record::Kind::Failed) ++failed;
   if (record.kind == Record::Kind::Dropped) ++dropped;
@@ -38,6 +39,15 @@ void Ledger::note(const Record& record) {
     if (!isIt) continue;
     (record.kind == Record::Kind::Done ? attempt.isAcknowledged : attempt.hasFailed) = true;
     return;
+  }
+}
+
+void Ledger::noteGroup(const Record& record) {
+  if (record.kind == Record::Kind::Begun) {
+    ++groups;
+    ++groupsUnderWay;
+  } else {
+    --groupsUnderWay;
   }
 }
 

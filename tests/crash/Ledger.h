@@ -45,6 +45,8 @@ class Ledger {
   std::size_t acknowledged = 0;
   std::size_t failed = 0;
   std::size_t dropped = 0;
+  std::size_t groups = 0;
+  std::size_t groupsUnderWay = 0;  // of the present worker; to be set back for the next
 
  private:
   struct State {
@@ -68,6 +70,7 @@ class Ledger {
   // The states that may be found: the last acknowledged one and then what was wanted after it.
   static std::vector<State> possible(const History& history);
 
+  void noteGroup(const Record& record);
   void noteClear(const Record& record);
   void noteShortage(const Record& record);
 

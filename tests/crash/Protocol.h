@@ -43,10 +43,11 @@ constexpr bool finishesAll(Ending ending) { return ending == Ending::AtRest || e
 
 // What the worker tells through the pipe, in whole records: before it asks for an operation and when that is done.
 // `Dropped`: its promise was broken, so that it has not begun. A clear has no key, and its number for a version. During
-// a shortage nothing can be opened, so that operations fail.
+// a shortage nothing can be opened, so that operations fail. A group is several operations in one transaction, from the
+// beginning of that to its end.
 struct Record {
   enum class Kind : std::uint8_t { Ready, Begun, Done, Failed, Dropped };
-  enum class Operation : std::uint8_t { Store, Remove, Fetch, Clear, Shortage };
+  enum class Operation : std::uint8_t { Store, Remove, Fetch, Clear, Shortage, Group };
 
   Kind kind;
   Operation operation;

@@ -1,5 +1,6 @@
 #include "crash/Worker.h"
 
+#include <sqlite3.h>
 #include <sys/resource.h>
 #include <unistd.h>
 
@@ -83,6 +84,42 @@ PersistentKeyValueStore::Writer pieceByPiece(std::vector<unsigned char> value) {
   };
 }
 
+void tell(int pipe, const Record& record) {
+  // Less than a pipe takes in one piece. A parent that has gone takes this process along.
+  if (::write(pipe, &record, sizeof record) != static_cast<ssize_t>(sizeof record)) std::_Exit(3);
+}
+
+// Tells of each transaction of several statements, on every database that is opened from now on.
+class GroupTeller {
+ public:
+  explicit GroupTeller(int pipe) {
+    pipe_ = pipe;
+    sqlite3_auto_extension(reinterpret_cast<void (*)()>(&watch));
+  }
+
+ private:
+  static int watch(sqlite3* database, char** /*error*/, const sqlite3_api_routines* /*routines*/) {
+    return sqlite3_trace_v2(database, SQLITE_TRACE_PROFILE, &statementHasRun, database);
+  }
+
+  static int statementHasRun(unsigned int /*kind*/, void* database, void* statement, void* /*nanoseconds*/) {
+    const std::string text = sqlite3_sql(static_cast<sqlite3_stmt*>(statement));
+    const bool isInTransaction = sqlite3_get_autocommit(static_cast<sqlite3*>(database)) == 0;
+    Record record{};
+    record.operation = Record::Operation::Group;
+    if (text == "BEGIN IMMEDIATE;" && isInTransaction) {
+      record.kind = Record::Kind::Begun;
+      tell(pipe_, record);
+    } else if ((text == "COMMIT;" || text == "ROLLBACK;") && !isInTransaction) {
+      record.kind = Record::Kind::Done;
+      tell(pipe_, record);
+    }
+    return 0;
+  }
+
+  static inline int pipe_ = -1;
+};
+
 bool hasOwnQueues(Ending ending) { return ending == Ending::ShutDown || ending == Ending::LetGo; }
 
 std::unique_ptr<host::Host> startHost(const Task& task, std::shared_ptr<TaskQueueFactory> queues) {
@@ -98,6 +135,7 @@ class Worker {
  public:
   explicit Worker(const Task& task)
       : task_(task),
+        groups_(task.pipe),
         queues_(hasOwnQueues(task.ending) ? std::make_shared<host::ThreadQueueFactory>() : nullptr),
         host_(startHost(task, queues_)),
         trash_(host_->trash()),
@@ -127,10 +165,7 @@ class Worker {
   }
 
  private:
-  void tell(const Record& record) const {
-    // Less than a pipe takes in one piece. A parent that has gone takes this process along.
-    if (::write(task_.pipe, &record, sizeof record) != static_cast<ssize_t>(sizeof record)) std::_Exit(3);
-  }
+  void tell(const Record& record) const { crash::tell(task_.pipe, record); }
 
   void stopAsking() {
     stops_ = true;
@@ -264,6 +299,7 @@ class Worker {
   }
 
   const Task task_;
+  const GroupTeller groups_;                          // before any database is opened
   std::shared_ptr<host::ThreadQueueFactory> queues_;  // the application's own, or null
   std::unique_ptr<host::Host> host_;
   const std::shared_ptr<TrashCollector> trash_;

@@ -120,11 +120,13 @@ class Tormentor {
     if (endings_ % kEndingsPerRoot == 0) changeRoot();
     const Ending ending = closes_ ? drawClosing() : Ending::Killed;
     const std::size_t droppedBefore = ledger_.dropped;
+    ledger_.groupsUnderWay = 0;
     const Child child = start({root_, random_(), ledger_.lastVersion(), ending, -1, -1});
     Listener listener(child.pipe, ledger_);
     letItWork(listener);
     if (listener.isReady() && oneIn(8)) intrude(root_, child.process, findings_);
     closes_ ? close(child, listener) : kill(child, listener);
+    if (ledger_.groupsUnderWay > 0) ++inGroups_;
     if (finishesAll(ending) && ledger_.dropped > droppedBefore)
       blame(nameOf(ending) + std::string(", what was asked for was dropped"));
     ++endings_;
@@ -137,6 +139,7 @@ class Tormentor {
     acknowledged_ += ledger_.acknowledged;
     failed_ += ledger_.failed;
     dropped_ += ledger_.dropped;
+    groups_ += ledger_.groups;
     if (findings_.faults.empty()) std::filesystem::remove_all(root_);
   }
 
@@ -147,6 +150,8 @@ class Tormentor {
   std::size_t acknowledged() const { return acknowledged_; }
   std::size_t failed() const { return failed_; }
   std::size_t dropped() const { return dropped_; }
+  std::size_t groups() const { return groups_; }
+  std::size_t inGroups() const { return inGroups_; }
   const std::string& root() const { return root_; }
 
  private:
@@ -218,6 +223,8 @@ class Tormentor {
   std::size_t acknowledged_ = 0;
   std::size_t failed_ = 0;
   std::size_t dropped_ = 0;
+  std::size_t groups_ = 0;
+  std::size_t inGroups_ = 0;  // ended in the middle of one
 };
 
 int conclude(const Tormentor& tormentor, std::uint64_t seed, double seconds) {
@@ -229,6 +236,8 @@ int conclude(const Tormentor& tormentor, std::uint64_t seed, double seconds) {
             << " a second\n"
             << tormentor.acknowledged() << " operations acknowledged, " << tormentor.failed() << " failed, "
             << tormentor.dropped() << " dropped\n"
+            << tormentor.groups() << " groups in one transaction, " << tormentor.inGroups() << " of the "
+            << tormentor.noun() << " in the middle of one\n"
             << findings.hostsRefused << " second hosts refused, " << findings.sessionsEnded << " sessions ended\n"
             << findings.intact << " values as they were acknowledged, " << findings.evicted
             << " evicted or never stored\ncaught in the middle:";
