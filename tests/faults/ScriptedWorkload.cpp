@@ -178,6 +178,7 @@ const std::vector<ScriptedWorkload::Step>& ScriptedWorkload::script() {
       {"restart", &ScriptedWorkload::restart},
       {"fetch all", &ScriptedWorkload::fetchAll},
       {"fill again", &ScriptedWorkload::fillAgain},
+      {"change at once", &ScriptedWorkload::changeAtOnce},
       {"close in the middle", &ScriptedWorkload::closeInTheMiddle},
       {"let go in the middle", &ScriptedWorkload::letGoInTheMiddle},
   };
@@ -378,6 +379,18 @@ void ScriptedWorkload::fillAgain() {
   put("settings", "d", 3);
   put("notes", "b", 3);
   drop("letters", "b");
+}
+
+// Two writes and a removal share a transaction.
+void ScriptedWorkload::changeAtOnce() {
+  for (const char* name : {"letters", "settings"}) {
+    if (!has(name)) continue;
+    const Asked overwritten = ask(name, "a", 6);
+    const Asked added = ask(name, "f", 6);
+    drop(name, "d");
+    take(overwritten);
+    take(added);
+  }
 }
 
 // The process ends while writes wait for the file queue. What has not begun by then has not happened.

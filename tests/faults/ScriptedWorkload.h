@@ -94,6 +94,7 @@ class ScriptedWorkload {
   void invalidate();
   void fetchAll();
   void fillAgain();
+  void changeAtOnce();
   void closeInTheMiddle();
   void letGoInTheMiddle();
 
