@@ -104,15 +104,22 @@ std::optional<ReplacedItem> DiskCacheManifest::replaceItem(const DiskCacheItem& 
   return replaced;
 }
 
+// What a key had in memory before a change.
+struct DiskCacheManifest::Former {
+  std::string key;
+  std::optional<ManifestRecords::Copy> record;
+  std::optional<std::int32_t> accessDate;  // that waits to be written
+};
+
 bool DiskCacheManifest::changeTogether(const std::function<void()>& changes) {
   const ItemsLock lock(itemsMutex_);
   if (!loaded_) return false;
-  formers_.emplace();
+  formers_ = std::make_unique<std::vector<Former>>();
   bool haveChanged = false;
   try {
     haveChanged = persistence_->performTogether(changes);
   } catch (...) {  // whoever makes the changes one by one finds out for which of them it matters
-    takeBackChanges(lock);
+    takeBackChanges(lock, *std::exchange(formers_, nullptr));
   }
   formers_.reset();
   return haveChanged;
@@ -120,17 +127,18 @@ bool DiskCacheManifest::changeTogether(const std::function<void()>& changes) {
 
 // To be called before a record in memory changes.
 void DiskCacheManifest::noteFormer(const ItemsLock& /*lock*/, const std::string& key) {
-  if (!formers_) return;
-  const ManifestRecord* const record = records_->find(key);
+  if (formers_ == nullptr) return;
+  Former former{key, std::nullopt, std::nullopt};
+  if (const ManifestRecord* const record = records_->find(key)) former.record = records_->copyOf(*record);
   const auto date = pendingAccessDates_.find(key);
-  formers_->push_back({key, record == nullptr ? nullptr : std::make_unique<DiskCacheItem>(record->item()),
-                       date == pendingAccessDates_.end() ? std::nullopt : std::make_optional(date->second)});
+  if (date != pendingAccessDates_.end()) former.accessDate = date->second;
+  formers_->push_back(std::move(former));
 }
 
-void DiskCacheManifest::takeBackChanges(const ItemsLock& /*lock*/) {
-  for (auto former = formers_->rbegin(); former != formers_->rend(); ++former) {
-    if (former->item != nullptr) {
-      records_->store(*former->item);
+void DiskCacheManifest::takeBackChanges(const ItemsLock& /*lock*/, const std::vector<Former>& formers) {
+  for (auto former = formers.rbegin(); former != formers.rend(); ++former) {
+    if (former->record) {
+      records_->restore(*former->record);
     } else if (const ManifestRecord* const record = records_->find(former->key)) {
       records_->remove(*record);
     }
@@ -156,7 +164,8 @@ std::optional<ReplacedItem> DiskCacheManifest::whatIsReplaced(const ItemsLock& l
   } catch (const ManifestCorruptedException&) {
     throw;
   } catch (const ManifestPersistenceException&) {
-    return std::nullopt;  // not being able to read must not keep the item from being written
+    if (formers_ != nullptr) throw;  // what has failed within a transaction may have ended it
+    return std::nullopt;             // not being able to read must not keep the item from being written
   }
 }
 
@@ -303,37 +312,43 @@ DiskCacheItem DiskCacheManifest::remove(const ItemsLock& lock, const ManifestRec
 template <class Order, class MayGo>
 std::vector<DiskCacheItem> DiskCacheManifest::prune(const ItemsLock& lock, Order order, std::uint32_t count,
                                                     MayGo mayGo) {
-  std::vector<DiskCacheItem> removed;
-  std::exception_ptr failure;  // of a strategy that is the host's
+  if (count == 0) return {};
   Next next = order();
-  if (!changeTogether([&] { failure = removeInOrder(lock, next, count, mayGo, removed); })) {
-    removed.clear();
-    next = order();  // the records in memory may be others now
-    try {
-      failure = removeInOrder(lock, next, count, mayGo, removed);
-    } catch (...) {
-      if (removed.empty()) throw;
-    }
+  const ManifestRecord* first = next();
+  if (first == nullptr || !mayGo(*first)) return {};
+  std::vector<DiskCacheItem> removed;
+  bool wasTried = false;
+  const auto removeTogether = [&] {
+    wasTried = true;
+    removeInOrder(lock, first, next, count, mayGo, removed);
+  };
+  if (changeTogether(removeTogether)) return removed;
+  removed.clear();
+  if (wasTried) {  // the records in memory may be others now
+    next = order();
+    first = next();
   }
-  // Otherwise the files of those that went must go too; the next call meets the failure at its first item.
-  if (removed.empty() && failure != nullptr) std::rethrow_exception(failure);
+  try {
+    removeInOrder(lock, first, next, count, mayGo, removed);
+  } catch (...) {
+    if (removed.empty()) throw;  // otherwise the files of those that went must go too
+  }
   return removed;
 }
 
-template <class MayGo> std::exception_ptr DiskCacheManifest::removeInOrder(const ItemsLock& lock, const Next& next,
-                                                                           std::uint32_t count, MayGo mayGo,
-                                                                           std::vector<DiskCacheItem>& removed) {
-  while (removed.size() < count) {
-    const ManifestRecord* record = nullptr;
+// From `record` on.
+template <class MayGo> void DiskCacheManifest::removeInOrder(const ItemsLock& lock, const ManifestRecord* record,
+                                                             const Next& next, std::uint32_t count, MayGo mayGo,
+                                                             std::vector<DiskCacheItem>& removed) {
+  while (record != nullptr && mayGo(*record)) {
+    removed.push_back(remove(lock, *record));
+    if (removed.size() == count) return;
     try {
       record = next();
-    } catch (...) {
-      return std::current_exception();
+    } catch (...) {  // of a strategy that is the host's: the next call meets it at its first item
+      return;
     }
-    if (record == nullptr || !mayGo(*record)) break;
-    removed.push_back(remove(lock, *record));
   }
-  return nullptr;
 }
 
 // Some hosts' timers repeat and some fire once. Replacing the handle each time does right by both.

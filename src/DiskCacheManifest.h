@@ -1,7 +1,6 @@
 #pragma once
 
 #include <cstdint>
-#include <exception>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -159,15 +158,10 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   using ItemsLock = std::lock_guard<std::recursive_mutex>;  // of the items mutex
   using Next = std::function<const ManifestRecord*()>;
 
-  // What a key had in memory before a change.
-  struct Former {
-    std::string key;
-    std::unique_ptr<DiskCacheItem> item;     // null: none
-    std::optional<std::int32_t> accessDate;  // that waits to be written
-  };
+  struct Former;
 
   void noteFormer(const ItemsLock& lock, const std::string& key);
-  void takeBackChanges(const ItemsLock& lock);
+  void takeBackChanges(const ItemsLock& lock, const std::vector<Former>& formers);
   void set(const ItemsLock& lock, const DiskCacheItem& item);
   std::optional<ReplacedItem> whatIsReplaced(const ItemsLock& lock, const std::string& key, bool withInlineData);
   const ManifestRecord* findOrRead(const ItemsLock& lock, const std::string& key);
@@ -176,8 +170,8 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   bool isFlushDue(const ItemsLock& lock) const;
   template <class Order, class MayGo>
   std::vector<DiskCacheItem> prune(const ItemsLock& lock, Order order, std::uint32_t count, MayGo mayGo);
-  template <class MayGo> std::exception_ptr removeInOrder(const ItemsLock& lock, const Next& next, std::uint32_t count,
-                                                          MayGo mayGo, std::vector<DiskCacheItem>& removed);
+  template <class MayGo> void removeInOrder(const ItemsLock& lock, const ManifestRecord* record, const Next& next,
+                                            std::uint32_t count, MayGo mayGo, std::vector<DiskCacheItem>& removed);
 
   void armFlushTimer();
   void flush();
@@ -193,7 +187,7 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   const std::unique_ptr<ManifestRecords> records_;
   bool loaded_ = false;
   bool invalidated_ = false;
-  std::optional<std::vector<Former>> formers_;  // of the changes that are being made together
+  std::unique_ptr<std::vector<Former>> formers_;  // of the changes that are being made together; null otherwise
   AccessDates pendingAccessDates_;
   std::weak_ptr<AccessDates> queuedAccessDates_;  // those of the flush on the executor; empty once it runs
   bool hasFlushFailed_ = false;                   // then pending dates wait for the timer

@@ -17,6 +17,8 @@ namespace {
 
 // SQLite's number for writing through a connection that it could open for reading only.
 constexpr int kReadOnly = 8;
+// And for a statement that was not carried out because another one had failed.
+constexpr int kAbort = 4;
 
 constexpr const char* tableName = "LarderManifest";
 
@@ -115,10 +117,12 @@ template <class Operation> auto SQLiteManifestPersistence::perform(Operation ope
   const std::lock_guard<std::recursive_mutex> lock(mutex_);
   if (invalidated_) return Result();
   return translatingExceptions([&] {
+    if (transaction_ == Transaction::Failed) throw ManifestPersistenceException("The transaction has failed.", kAbort);
     if (mustReopen_) reopen();
     try {
       return operation();
     } catch (const SQLiteStoreException& exception) {
+      if (transaction_ == Transaction::Open) transaction_ = Transaction::Failed;
       if (exception.code() == kReadOnly) handleReadOnly(exception);
       throw;
     }
@@ -259,23 +263,27 @@ bool SQLiteManifestPersistence::performTogether(const std::function<void()>& ope
   };
   // At once for writing: one that begins by reading could find later that another connection has written meanwhile.
   if (!run("BEGIN IMMEDIATE;")) return false;
+  transaction_ = Transaction::Open;
   try {
     operations();
-    run("COMMIT;");
+    if (!run("COMMIT;")) throw ManifestPersistenceException("The transaction has lost its database.", kAbort);
   } catch (...) {
     rollBack();
     throw;
   }
+  transaction_ = Transaction::None;
   return true;
 }
 
 // SQLite has ended the transaction itself after most failures of the medium; then there is nothing to roll back.
 void SQLiteManifestPersistence::rollBack() noexcept {
   constexpr int kNoTransaction = 1;
+  transaction_ = Transaction::None;
+  if (store_ == nullptr) return;
   try {
     store_->exec("ROLLBACK;");
   } catch (const SQLiteStoreException& exception) {
-    mustReopen_ = exception.code() != kNoTransaction;
+    if (exception.code() != kNoTransaction) mustReopen_ = true;
   } catch (...) {
     mustReopen_ = true;
   }

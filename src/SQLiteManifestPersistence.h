@@ -88,13 +88,16 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
 
   const std::string path_;
   // Held by every operation from its beginning to its end, and around those that are performed together; guards the
-  // three below.
+  // four below.
   mutable std::recursive_mutex mutex_;
   bool invalidated_ = false;
   mutable std::unique_ptr<SQLiteStore> store_;  // null once invalidated
   // The next operation opens the database again: SQLite opens what may not be written just now for reading only, and a
   // transaction that cannot be rolled back ends with its connection.
   mutable bool mustReopen_ = false;
+  // Whether operations are being performed together, and one of them has failed: SQLite may have ended the transaction.
+  enum class Transaction : std::uint8_t { None, Open, Failed };
+  mutable Transaction transaction_ = Transaction::None;
   const std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory_;
   const SQLiteStoreFactory storeFactory_;
 };

@@ -353,6 +353,19 @@ TEST_F(GroupCommit, AQueueThatDropsTheTasksLeavesWhatWasDone) {
   EXPECT_EQ(contents(), (Contents{{"old", "value"}, {"one", "value"}, {"two", "value"}}));
 }
 
+TEST_F(GroupCommit, ARemovalBehindAWriteThatIsRefusedDeletesTheFileBeforeItIsTold) {
+  store("one");
+  const Written old = store("old", "newer");
+  const Written removed = remove("old");
+  file().throwOnDispatch(true);
+  work().runNext();
+  file().throwOnDispatch(false);
+  EXPECT_THAT(told(old), testing::StartsWith("<error>"));
+  EXPECT_THAT(valueFiles(), IsEmpty());
+  settle();
+  EXPECT_THAT(contents(), IsEmpty());
+}
+
 TEST_F(GroupCommit, AFileQueueThatRefusesTakesAllOfThemBack) {
   const Written one = store("one");
   const Written old = store("old", "newer");
@@ -474,6 +487,40 @@ TEST_F(GroupCommit, AHostsMetadataThatThrowsFailsItsWriteAlone) {
   EXPECT_EQ(told(broken), "<error> No bytes.");
   EXPECT_EQ(told(two), "<done>");
   EXPECT_EQ(contents(), (Contents{{"one", "value"}, {"two", "value"}}));
+}
+
+// Nothing of what evictions, or their being taken back, have done to the order of eviction is left.
+TEST_F(GroupCommit, ThatFailsLeavesTheOrderOfEvictionAsItWas) {
+  options.capacity = 3;
+  close();
+  openWatched();
+  clear();
+  for (const char* key : {"a", "b", "c"}) put(key, "value");  // within one second
+  medium->failOnce("commit", 0);
+  store("d");
+  store("e");
+  settle();
+  EXPECT_EQ(rollBacks(), 1U);
+  EXPECT_EQ(contents(), (Contents{{"c", "value"}, {"d", "value"}, {"e", "value"}}));
+}
+
+// A read that may fail on its own would end the transaction unnoticed.
+TEST_F(GroupCommit, AReadThatFailsInItIsNotPassedOver) {
+  options.inlineData = true;
+  close();
+  openWatched();
+  put("inline", "value");
+  options.inlineData = false;
+  close();
+  openWatched();
+  const Written written = store("inline", "newer");
+  const Written removed = remove("old");
+  medium->failOnce("getInlineData", 0);
+  work().runNext();
+  EXPECT_EQ(rollBacks(), 1U);
+  settle();
+  EXPECT_THAT(allTold({written, removed}), Each("<done>"));
+  EXPECT_EQ(contents(), (Contents{{"inline", "newer"}}));
 }
 
 // --- Final records, prunes and clears ---

@@ -366,6 +366,7 @@ TEST_F(PersistentKeyValueStoreWrittenTogether, ARecordThatCannotBeWrittenPurgesT
   EXPECT_EQ(told(one), "<done>");
   EXPECT_EQ(told(two), "<done>");
   EXPECT_EQ(told(three), "<done>");
+  EXPECT_EQ(sizes.back(), 0U);
   EXPECT_THAT(contents(), IsEmpty());
   EXPECT_THAT(valueFiles(), IsEmpty());
   put("key", "value");

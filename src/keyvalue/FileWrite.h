@@ -1,7 +1,6 @@
 #pragma once
 
 #include <cstdint>
-#include <exception>
 #include <memory>
 #include <optional>
 #include <string>
@@ -43,7 +42,6 @@ struct FileWrite final : WritesInFlight::Write,
   std::optional<DiskCacheItem> finalRecord;  // once the manifest has it
   bool leavesFile = false;                   // that has to be deleted
   std::optional<std::uint32_t> total;        // of all items with this one, to report
-  std::exception_ptr failure;
 
   FileWrite(std::string key_, std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata_,
             PersistentKeyValueStore::Writer writer_, bool isGroupable_, std::weak_ptr<ValueWriter> owner_,

@@ -34,7 +34,9 @@ void GroupCommit::run(const std::shared_ptr<ManifestChange>& change) {
 }
 
 GroupCommit::Group GroupCommit::groupBehind(const std::shared_ptr<ManifestChange>& first) {
-  Group group = {first};
+  Group group;
+  group.reserve(kMaxGroupSize);
+  group.push_back(first);
   std::size_t bytes = first->bytes();
   while (group.size() < kMaxGroupSize) {
     auto next = workQueue_.next(*group.back());
@@ -44,6 +46,14 @@ GroupCommit::Group GroupCommit::groupBehind(const std::shared_ptr<ManifestChange
     group.push_back(std::move(next));
   }
   return group;
+}
+
+void GroupCommit::note(const StoreLock& lock, ManifestChange& change) {
+  try {
+    change.note(lock);
+  } catch (...) {
+    change.failure = std::current_exception();
+  }
 }
 
 // False when nothing has changed.
@@ -56,7 +66,7 @@ bool GroupCommit::commit(const Group& group) {
       for (const auto& change : group) change->change(lock);
     };
     if (!manifest_.changeTogether(lock, changeAll)) return false;
-    for (const auto& change : group) change->note(lock);
+    for (const auto& change : group) note(lock, *change);
   }
   for (const auto& change : group) change->deleteFile();
   return true;

@@ -28,6 +28,7 @@ class GroupCommit {
 
   Group groupBehind(const std::shared_ptr<ManifestChange>& first);
   bool commit(const Group& group);
+  static void note(const StoreLock& lock, ManifestChange& change);
 
   StoreContext& context_;
   StoreManifest& manifest_;

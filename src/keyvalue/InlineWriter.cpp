@@ -49,6 +49,7 @@ struct InlineWriter::Value final : ManifestChange, std::enable_shared_from_this<
     const auto writer = owner.lock();
     evicted = writer->remover_.takeOldestIfFull(lock);
     writer->setRow(*this);
+    total = writer->manifest_.totalToReport();
   }
   void note(const StoreLock& lock) override {
     const auto writer = owner.lock();
@@ -81,8 +82,8 @@ void InlineWriter::writeAlone(Value& value) {
       noteRow(lock, value);
     } else {
       writes_.revoke(value.key);
-      value.total = manifest_.totalToReport();
     }
+    value.total = manifest_.totalToReport();
   } catch (...) {
     return value.promise.setException(std::current_exception());
   }
@@ -107,7 +108,6 @@ void InlineWriter::setRow(Value& value) {
   value.replaced =
       manifest->replaceItem({value.key, value.key, size, false, date, date, value.extendedMetadata}, false);
   manifest->setInlineData(value.key, value.data);
-  value.total = manifest_.totalToReport();
 }
 
 void InlineWriter::noteRow(const StoreLock& lock, Value& value) {
@@ -117,6 +117,7 @@ void InlineWriter::noteRow(const StoreLock& lock, Value& value) {
 }
 
 void InlineWriter::fulfil(Value& value) {
+  if (value.failure != nullptr) return value.promise.setException(value.failure);
   try {
     if (value.total) manifest_.dispatchReport(*value.total);
   } catch (...) {

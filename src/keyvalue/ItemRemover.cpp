@@ -27,7 +27,6 @@ struct ItemRemover::Removal final : ManifestChange, std::enable_shared_from_this
 
   std::unique_ptr<DiskCacheItem> item;  // that was removed
   bool isLeftToWrite = false;           // a write that is on its way deletes the file
-  std::exception_ptr failure;
 
   Removal(std::string key_, std::weak_ptr<ItemRemover> owner_, Token operation_)
       : key(std::move(key_)), owner(std::move(owner_)), operation(std::move(operation_)) {}
@@ -83,6 +82,7 @@ void ItemRemover::noteRemoved(const StoreLock& /*lock*/, Removal& removal) {
 
 void ItemRemover::deleteFile(Removal& removal) {
   if (removal.item == nullptr || removal.isLeftToWrite) return;
+  if (context_.isClosed) return;  // the path may be another store's by now
   try {
     if (const auto path = files_.fileOf(*removal.item)) context_.files->deleteFile(*path);
   } catch (...) {
@@ -118,9 +118,9 @@ void ItemRemover::noteEvicted(const StoreLock& /*lock*/, const DiskCacheItem* it
   if (item == nullptr) return;
   try {
     discard(*item);
-  } catch (const std::exception& error) {
+  } catch (...) {
     errorLine(__LINE__).stream() << "Store \"" << context_.options.name << "\" deleted the file of evicted \""
-                                 << item->key << "\" on its work queue: " << error.what();
+                                 << item->key << "\" on its work queue: the file queue takes no tasks.";
   }
 }
 

@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstddef>
+#include <exception>
 
 #include "keyvalue/Chain.h"
 #include "keyvalue/StoreContext.h"
@@ -29,14 +30,16 @@ class ManifestChange : public Chain<ManifestChange>::Link {
   // The statements, within the transaction. When it throws, the whole transaction is rolled back.
   virtual void change(const StoreLock& lock) = 0;
 
-  // The transaction is complete. Does not throw, and delivers nothing.
+  // The transaction is complete. Delivers nothing. What it throws becomes the failure.
   virtual void note(const StoreLock& lock) = 0;
 
   // Deletes the file of what was removed, on this thread. Does not throw. An invalidation waits for it.
   virtual void deleteFile() {}
 
-  // The rest, with no lock held: hands on, or fulfils the promise.
+  // The rest, with no lock held: hands on, or fulfils the promise, with the failure if there is one.
   virtual void finish() = 0;
+
+  std::exception_ptr failure;
 
  private:
   std::atomic<bool> isTaken_{false};

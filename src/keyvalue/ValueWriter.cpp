@@ -61,16 +61,24 @@ void ValueWriter::change(const StoreLock& lock, FileWrite& write) {
 
 void ValueWriter::note(const StoreLock& lock, FileWrite& write) {
   remover_.noteEvicted(lock, write.evicted.get());
-  noteProvisionalRecord(lock, write);
+  try {
+    noteProvisionalRecord(lock, write);
+  } catch (...) {
+    rollback_.tryToRestore(lock, write.key, SettledValue::lost());
+    throw;
+  }
 }
 
-// A queue that takes no task drops the write: its end takes the record away again.
+// A queue that takes no task refuses the write: its record is taken away again.
 void ValueWriter::dispatch(const std::shared_ptr<FileWrite>& write) {
+  if (write->failure != nullptr) return write->promise.setException(write->failure);
   try {
     handToFileQueue(write);
   } catch (...) {
     // The task of an earlier write may have it by now, though the queue has refused its own.
-    if (writes_.claim(*write)) write->promise.setException(std::current_exception());
+    if (!writes_.claim(*write)) return;
+    rollback_.end(*write);  // before a removal behind it is told to be over
+    write->promise.setException(std::current_exception());
   }
 }
 
@@ -176,12 +184,12 @@ unsigned int ValueWriter::runWriter(FileWrite& write) {
 
 // Those of the writes that have come about, in one transaction. Where that fails, `recordWritten` sets them one by one.
 void ValueWriter::setFinalRecords(const StoreLock& lock, const Group& group) {
-  if (group.size() == 1) return;
   Group written;
   for (const auto& write : group) {
     const bool isWritten = write->failure == nullptr && write->state == FileWrite::State::Writing && write->hasRecord;
     if (isWritten) written.push_back(write);
   }
+  if (written.size() < 2) return;
   const auto setAll = [&] {
     for (const auto& write : written) {
       setFinalRecord(*write);
@@ -189,7 +197,10 @@ void ValueWriter::setFinalRecords(const StoreLock& lock, const Group& group) {
     }
   };
   if (manifest_.changeTogether(lock, setAll)) return;
-  for (const auto& write : written) write->finalRecord.reset();
+  for (const auto& write : written) {
+    write->finalRecord.reset();
+    write->total.reset();
+  }
 }
 
 void ValueWriter::setFinalRecord(FileWrite& write) {
@@ -202,6 +213,7 @@ void ValueWriter::recordWritten(const StoreLock& lock, FileWrite& write) {
   if (write.failure != nullptr) return;
   if (write.state == FileWrite::State::Discarded) {
     write.leavesFile = true;
+    write.total.reset();
     const auto settled = writes_.drop(write);
     if (settled && settled->isReplaced) rollback_.discardRecord(lock, write.key, false);
     return;

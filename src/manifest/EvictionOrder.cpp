@@ -54,6 +54,12 @@ void EvictionOrder::removed(const ManifestRecord& record) {
   moveDown(last.record->*place_);
 }
 
+void EvictionOrder::setTurn(const ManifestRecord& record, std::uint32_t turn) {
+  heap_[record.*place_].turn = turn;
+  moveUp(record.*place_);
+  moveDown(record.*place_);
+}
+
 void EvictionOrder::allChanged() {
   for (Entry& entry : heap_) entry.date = dateOf_(*entry.record);
   if (heap_.size() < 2) return;

@@ -35,6 +35,10 @@ class EvictionOrder {
   void changed(const ManifestRecord& record);
   void removed(const ManifestRecord& record);
 
+  // The record's turn among those of its date; for one that was removed and has come back.
+  std::uint32_t turnOf(const ManifestRecord& record) const { return heap_[record.*place_].turn; }
+  void setTurn(const ManifestRecord& record, std::uint32_t turn);
+
   // To be called when other dates have become earlier as well.
   void allChanged();
 

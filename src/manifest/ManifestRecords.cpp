@@ -118,6 +118,16 @@ DiskCacheItem ManifestRecords::remove(const ManifestRecord& record) {
   return item;
 }
 
+ManifestRecords::Copy ManifestRecords::copyOf(const ManifestRecord& record) const {
+  return {record.item(), byAccessDate_.turnOf(record), isVideoStrategy_ ? byVideoPriority_.turnOf(record) : 0};
+}
+
+void ManifestRecords::restore(const Copy& copy) {
+  const ManifestRecord* const record = store(copy.item);
+  byAccessDate_.setTurn(*record, copy.turnByAccessDate);
+  if (isVideoStrategy_) byVideoPriority_.setTurn(*record, copy.turnByPriority);
+}
+
 void ManifestRecords::leaveOrders(const ManifestRecord& record) {
   totalSize_ -= record.size;
   byAccessDate_.removed(record);

@@ -40,6 +40,16 @@ class ManifestRecords {
   void setHasInlineData(const std::string& key, bool hasInlineData);
 
   DiskCacheItem remove(const ManifestRecord& record);
+
+  // A record as it is now, and that it is so again, among those of the same date too.
+  struct Copy {
+    DiskCacheItem item;
+    std::uint32_t turnByAccessDate;
+    std::uint32_t turnByPriority;
+  };
+  Copy copyOf(const ManifestRecord& record) const;
+  void restore(const Copy& copy);
+
   void clear();
   void reserve(std::size_t count);
 

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 
 #include "manifest/EvictionOrder.h"
 
@@ -25,6 +26,8 @@ class VideoEvictionOrder {
   void added(ManifestRecord& record);
   void changed(const ManifestRecord& record);
   void removed(const ManifestRecord& record);
+  std::uint32_t turnOf(const ManifestRecord& record) const { return order_.turnOf(record); }
+  void setTurn(const ManifestRecord& record, std::uint32_t turn) { order_.setTurn(record, turn); }
   void clear();
 
  private:
