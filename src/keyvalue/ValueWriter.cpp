@@ -229,7 +229,10 @@ void ValueWriter::recordWritten(const StoreLock& lock, FileWrite& write) {
   }
   if (!write.finalRecord) return;
   StoreContext::count(context_.stores);
-  if (othersAreInFlight) writes_.settle(write.key, {std::make_unique<DiskCacheItem>(std::move(*write.finalRecord))});
+  if (!othersAreInFlight) return;
+  SettledValue settled;
+  settled.record = std::make_unique<DiskCacheItem>(std::move(*write.finalRecord));
+  writes_.settle(write.key, std::move(settled));
 }
 
 // The store may have to be purged instead.
