@@ -12,6 +12,7 @@
 #include "benchmarks/Benchmarks.h"
 #include "support/Context.h"
 #include "support/Memory.h"
+#include "support/OtherPrograms.h"
 #include "support/Recording.h"
 #include "support/Stopwatch.h"
 
@@ -20,10 +21,12 @@ namespace {
 namespace bench = velmora::mobile::xplat::cellar::bench;
 
 constexpr std::size_t kWarmedAtTheStart = std::size_t{1} << 30U;
+constexpr double kMostOfOthers = 0.2;  // of one processor
 constexpr std::size_t kKept = std::size_t{1} << 28U;
 
 struct Arguments {
   bool quick = false;
+  bool evenIfBusy = false;
   std::vector<std::string> places;
   std::vector<std::string> benchmarks;
   std::string results;
@@ -50,6 +53,11 @@ void record(const Arguments& arguments, const bench::Report& report) {
   if (!arguments.summary.empty()) bench::recordSummaries(report, arguments.summary);
 }
 
+std::string busyText(const std::string& benchmark, const bench::OtherPrograms& others) {
+  return "other programs used " + std::to_string(static_cast<int>(others.share() * 100)) + " % of a processor while '" +
+         benchmark + "' was measured: its figures are not reported (--even-if-busy)";
+}
+
 void run(const Arguments& arguments) {
   bench::warmMemory(kWarmedAtTheStart);
   bench::keepMemory(kKept);
@@ -57,13 +65,17 @@ void run(const Arguments& arguments) {
   std::vector<bench::Place> places;
   for (const auto& place : arguments.places) places.push_back(placeOf(place));
   bench::Manifests manifests(places.back());
-  if (arguments.quick) places.resize(1);
+  const bool isOneTopic = !arguments.benchmarks.empty() && arguments.document.empty();
+  if (arguments.quick || isOneTopic) places.resize(1);  // so that a topic takes less than a minute
   const bench::Context context{arguments.quick, places, report, manifests};
   for (const auto& benchmark : bench::benchmarks()) {
     if (!isWanted(arguments, benchmark.name)) continue;
     const bench::Stopwatch watch;
+    const bench::OtherPrograms others;
     report.begin(benchmark.name, benchmark.title);
     benchmark.measure(context);
+    if (!arguments.evenIfBusy && others.share() > kMostOfOthers)
+      throw std::runtime_error(busyText(benchmark.name, others));
     std::cout << "\n" << benchmark.title << "\n\n" << bench::tableText(report.sections().back()) << std::flush;
     std::cerr << benchmark.name << ": " << watch.microseconds() / 1e6 << " s\n";
     record(arguments, report);
@@ -76,6 +88,7 @@ int main(int argc, char** argv) {
   Arguments arguments;
   CLI::App app("Benchmarks of the library");
   app.add_flag("--quick", arguments.quick, "Fewer and smaller measurements");
+  app.add_flag("--even-if-busy", arguments.evenIfBusy, "Report although other programs took part of the processors");
   app.add_option("--place", arguments.places, "NAME:DIRECTORY to measure in")->required();
   app.add_option("--results", arguments.results, "The file for the results, as JSON")->required();
   app.add_option("--plots", arguments.plots, "A directory for gnuplot scripts");

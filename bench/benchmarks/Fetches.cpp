@@ -155,8 +155,8 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
         name, [competitor = std::make_shared<CompetitorFetches>(place, what, open)] { return competitor->measure(); });
   }
   Figures figures = interleaved(place, contestants, context.scaled(5, 3), what.size * kOutstanding);
-  const double outstanding = figures.extract("64").mapped();
-  const double single = figures.extract("1").mapped();
+  const Figure outstanding = figures.extract("64").mapped();
+  const Figure single = figures.extract("1").mapped();
   figures["ours"] = outstanding;
   const std::string name = sizeName(what.size) + what.note;
   context.report.add(Row{name + ", 64 outstanding", place.name, cpuName(pinned), "us", figures, what.outstandingGoals});

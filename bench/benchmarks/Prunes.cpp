@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <stdexcept>
 #include <string>
+#include <utility>
 
 #include <cellar/DiskCacheManifest.h>
 
@@ -17,10 +18,13 @@ namespace velmora::mobile::xplat::cellar::bench {
 
 namespace {
 
+using Removal = void (StoreUnderTest::*)();
+
 struct Case {
   std::size_t items;
   std::size_t pruned;
   std::size_t files;  // of the first items; the others are records only, because a million files take minutes to make
+  Removal remove = &StoreUnderTest::prune;
 };
 
 void throwUnlessPruned(const std::string& directory, std::size_t filesBefore, const Case& what) {
@@ -42,7 +46,7 @@ double measureOurs(const Context& context, const Place& place, const Case& what)
   StoreUnderTest store(directory, options);
   settle(directory);
   const Stopwatch watch;
-  store.prune();
+  (store.*what.remove)();
   const double result = watch.microseconds() / static_cast<double>(what.pruned);
   if (store->getManifest()->count() != what.items - what.pruned) throw std::runtime_error("not as many were pruned");
   throwUnlessPruned(directory, what.files, what);
@@ -78,7 +82,17 @@ void measureDown(const Context& context, const Place& place) {
   const Case what{items, items / 10 * 9, items};
   const Figures figures = measureCase(context, place, what, context.scaled(3, 1));
   const std::string name = countName(items) + " items down to " + countName(items / 10);
-  context.report.add(Row{name, place.name, cpuName(false), "us an item", figures, {{"lower bound", 1.1}}});
+  context.report.add(Row{name, place.name, cpuName(false), "us an item", figures, {{"lower bound", 0.6}}});
+}
+
+void measureAll(const Context& context, const Place& place) {
+  const std::size_t items = context.scaled<std::size_t>(40'000, 5'000);
+  for (const auto& [name, remove] : {std::pair<std::string, Removal>("clearing ", &StoreUnderTest::clear),
+                                     std::pair<std::string, Removal>("expiring ", &StoreUnderTest::expireAll)}) {
+    const Figures figures = measureCase(context, place, {items, items, items, remove}, context.scaled(3, 1));
+    context.report.add(Row{
+        name + countName(items) + " items", place.name, cpuName(false), "us an item", figures, {{"lower bound", 0.6}}});
+  }
 }
 
 void measureGrowth(const Context& context, const Place& place) {
@@ -106,6 +120,7 @@ void measureGrowth(const Context& context, const Place& place) {
 
 void measurePrunes(const Context& context) {
   measureDown(context, context.places.front());
+  measureAll(context, context.places.front());
   for (const Place& place : context.places) measureGrowth(context, place);
 }
 

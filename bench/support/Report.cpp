@@ -14,8 +14,8 @@ namespace velmora::mobile::xplat::cellar::bench {
 namespace {
 
 constexpr const char* kFastest = "fastest competitor";
-const std::vector<std::string> kContestants = {"ours",    "lower bound", "LevelDB", "LMDB",
-                                               "RocksDB", "SQLite",      "du",      "rm -rf"};
+const std::vector<std::string> kContestants = {"ours",    "lower bound", "in groups", "LevelDB", "LMDB",
+                                               "RocksDB", "SQLite",      "du",        "rm -rf"};
 
 std::string formatted(double value) {
   char text[32];
@@ -24,11 +24,22 @@ std::string formatted(double value) {
   return text;
 }
 
+// With the quartiles, where there are several measurements.
+std::string withQuartiles(const Figure& figure) {
+  if (figure.lowerQuartile == figure.upperQuartile) return formatted(figure);
+  return formatted(figure) + " (" + formatted(figure.lowerQuartile) + "-" + formatted(figure.upperQuartile) + ")";
+}
+
+nlohmann::ordered_json jsonOf(const Figure& figure) {
+  return {{"median", figure.median}, {"quartiles", {figure.lowerQuartile, figure.upperQuartile}}};
+}
+
 double comparedWith(const Row& row, const Goal& goal) {
   if (goal.against != kFastest) return row.figures.at(goal.against);
   double fastest = std::numeric_limits<double>::max();
   for (const auto& [name, figure] : row.figures) {
-    if (name != "ours" && name != "lower bound") fastest = std::min(fastest, figure);
+    if (name == "ours" || name == "lower bound" || name == "in groups") continue;
+    fastest = std::min<double>(fastest, figure);
   }
   return fastest;
 }
@@ -54,12 +65,16 @@ Cells titlesOf(const Report::Section& section) {
   return titles;
 }
 
-Cells figureCells(const Report::Section& section, const Row& row) {
+using Format = std::string (*)(const Figure& figure);
+
+std::string medianAlone(const Figure& figure) { return formatted(figure); }
+
+Cells figureCells(const Report::Section& section, const Row& row, Format format) {
   Cells cells;
   for (const auto& contestant : kContestants) {
     if (!contains(section, contestant)) continue;
     const auto figure = row.figures.find(contestant);
-    cells.push_back(figure == row.figures.end() ? "" : formatted(figure->second));
+    cells.push_back(figure == row.figures.end() ? "" : format(figure->second));
   }
   return cells;
 }
@@ -71,7 +86,7 @@ Cells verdictCells(const Row& row, const Goal& goal) {
 
 // A row with several goals has a line for each, the figures only in the first.
 std::vector<Cells> linesOf(const Report::Section& section, const Row& row) {
-  const Cells figures = figureCells(section, row);
+  const Cells figures = figureCells(section, row, withQuartiles);
   Cells first = {row.what, row.where, row.cpus, row.unit};
   first.insert(first.end(), figures.begin(), figures.end());
   std::vector<Cells> lines;
@@ -111,12 +126,12 @@ bool isInSummary(const Report::Section& section, const Row& row) {
 }
 
 nlohmann::ordered_json jsonOf(const Row& row) {
-  nlohmann::ordered_json json = {
-      {"what", row.what}, {"where", row.where}, {"on", row.cpus}, {"unit", row.unit}, {"figures", row.figures}};
+  nlohmann::ordered_json json = {{"what", row.what}, {"where", row.where}, {"on", row.cpus}, {"unit", row.unit}};
+  for (const auto& [name, figure] : row.figures) json["figures"][name] = jsonOf(figure);
   for (const Goal& goal : row.goals) {
     json["goals"].push_back({{"against", goal.against},
                              {"limit", goal.limit},
-                             {"ratio", goal.against.empty() ? row.figures.at("ours") : ratioOf(row, goal)},
+                             {"ratio", goal.against.empty() ? row.figures.at("ours").median : ratioOf(row, goal)},
                              {"met", isMet(row, goal)}});
   }
   return json;
@@ -141,7 +156,7 @@ nlohmann::ordered_json Report::json() const {
 double ratioOf(const Row& row, const Goal& goal) { return row.figures.at("ours") / comparedWith(row, goal); }
 
 bool isMet(const Row& row, const Goal& goal) {
-  const double measured = goal.against.empty() ? row.figures.at("ours") : ratioOf(row, goal);
+  const double measured = goal.against.empty() ? row.figures.at("ours").median : ratioOf(row, goal);
   return measured <= goal.limit;
 }
 
@@ -174,7 +189,7 @@ std::string summaryMarkdown(const Report::Section& section) {
   for (const Row& row : section.rows) {
     if (!isInSummary(section, row)) continue;
     lines.push_back({row.what, row.unit});
-    for (auto& cell : figureCells(section, row)) lines.back().push_back(std::move(cell));
+    for (auto& cell : figureCells(section, row, medianAlone)) lines.back().push_back(std::move(cell));
   }
   return markdown(titles, lines);
 }

@@ -33,9 +33,9 @@ Figures interleaved(const Place& place, const Contestants& contestants, int repe
       samples[name].push_back(measure());
     }
   }
-  Figures medians;
-  for (const auto& [name, values] : samples) medians[name] = median(values);
-  return medians;
+  Figures figures;
+  for (const auto& [name, values] : samples) figures[name] = Figure(values);
+  return figures;
 }
 
 }  // namespace velmora::mobile::xplat::cellar::bench

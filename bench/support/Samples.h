@@ -17,9 +17,24 @@ double median(std::vector<double> samples);
 
 // Who takes part in a comparison, by name, and what measures it once.
 using Contestants = std::vector<std::pair<std::string, std::function<double()>>>;
-using Figures = std::map<std::string, double>;
 
-// The median of `repetitions` measurements of each contestant. They alternate, and each round begins with another one,
+// What has been measured several times; a number on its own has no quartiles.
+struct Figure {
+  double median = 0;
+  double lowerQuartile = 0;
+  double upperQuartile = 0;
+
+  Figure() = default;
+  Figure(double value) : median(value), lowerQuartile(value), upperQuartile(value) {}
+  explicit Figure(const std::vector<double>& samples)
+      : median(bench::median(samples)),
+        lowerQuartile(quantile(samples, 0.25)),
+        upperQuartile(quantile(samples, 0.75)) {}
+  operator double() const { return median; }
+};
+using Figures = std::map<std::string, Figure>;
+
+// `repetitions` measurements of each contestant. They alternate, and each round begins with another one,
 // so that other activity of the machine affects all of them. `bytes`: what a measurement writes to the place and reads;
 // that much memory is warmed before.
 Figures interleaved(const Place& place, const Contestants& contestants, int repetitions, std::size_t bytes);

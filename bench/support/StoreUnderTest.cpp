@@ -29,6 +29,16 @@ std::shared_ptr<DiskCache> createCache(const std::string& directory, const Store
   return cache;
 }
 
+// Starts what ends with one of two callbacks, and waits for it.
+template <class Start> void awaitEnd(Start start) {
+  std::promise<void> done;
+  start([&] { done.set_value(); },
+        [&](const std::exception& error) {
+          done.set_exception(std::make_exception_ptr(std::runtime_error(error.what())));
+        });
+  done.get_future().get();
+}
+
 }  // namespace
 
 StoreUnderTest::StoreUnderTest(const std::string& directory, const StoreOptions& options)
@@ -46,13 +56,17 @@ void StoreUnderTest::settle() {
 }
 
 void StoreUnderTest::prune() {
-  std::promise<void> done;
-  cache_->pruneBackToNormal([&] { done.set_value(); },
-                            [&](const std::exception& error) {
-                              done.set_exception(std::make_exception_ptr(std::runtime_error(error.what())));
-                            },
-                            false);
-  done.get_future().get();
+  awaitEnd([&](auto onSuccess, auto onError) { cache_->pruneBackToNormal(onSuccess, onError, false); });
+}
+
+void StoreUnderTest::clear() {
+  awaitEnd([&](auto onSuccess, auto onError) { cache_->clear(onSuccess, onError); });
+}
+
+void StoreUnderTest::expireAll() {
+  cache_->overrideConfiguration(0);
+  cache_->startStaleItemRemoval();
+  settle();
 }
 
 void StoreUnderTest::verify(std::size_t count, std::size_t size) {

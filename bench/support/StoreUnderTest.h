@@ -39,6 +39,10 @@ class StoreUnderTest {
   // Prunes down to the normal size and waits for the end.
   void prune();
 
+  // The same until nothing is left.
+  void clear();
+  void expireAll();
+
   // Throws unless the store has the first `count` items.
   void verify(std::size_t count, std::size_t size);
 
