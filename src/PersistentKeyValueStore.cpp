@@ -36,13 +36,13 @@ struct PersistentKeyValueStore::Parts {
   StoreManifest manifest{context, writes};
   GroupCommit groupCommit{context, manifest, workQueue};
   Rollback rollback{context, manifest, writes, files};
-  ItemRemover remover{context, manifest, writes, workQueue, fileQueue, files, groupCommit};
+  ItemRemover remover{context, manifest, writes, fileQueue, files, groupCommit};
   BatchRemoval batches{context, manifest, writes, workQueue, fileQueue, files};
   Clearing clearing{context, manifest, writes, batches};
   StaleItemRemoval staleItems{context, manifest, batches};
   ValueFetcher fetcher{context, manifest, writes, workQueue, fileQueue, files};
-  ValueWriter writer{context, manifest, writes, workQueue, fileQueue, files, remover, clearing, rollback, groupCommit};
-  InlineWriter inlineWriter{context, manifest, writes, workQueue, files, remover, clearing, rollback, groupCommit};
+  ValueWriter writer{context, manifest, writes, fileQueue, files, remover, clearing, rollback, groupCommit};
+  InlineWriter inlineWriter{context, manifest, writes, files, remover, clearing, rollback, groupCommit};
 
   Parts(Store& store, KeyValueStoreOptions options, const StoreServices& services)
       : context(store, std::move(options), services) {}

@@ -6,7 +6,6 @@
 #include <utility>
 
 #include "keyvalue/StoreManifest.h"
-#include "keyvalue/WorkQueue.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -18,6 +17,7 @@ constexpr std::size_t kMaxGroupBytes = std::size_t{128} << 10U;  // a first chan
 
 }  // namespace
 
+// The task of a change. Does nothing when an earlier one has run it.
 void GroupCommit::run(const std::shared_ptr<ManifestChange>& change) {
   if (!change->take()) return;
   const Group group = groupBehind(change);

@@ -3,13 +3,15 @@
 #include <memory>
 #include <vector>
 
+#include "Future.h"
+#include "keyvalue/KeyRange.h"
 #include "keyvalue/ManifestChange.h"
 #include "keyvalue/StoreContext.h"
+#include "keyvalue/WorkQueue.h"
 
 namespace velmora::mobile::xplat::cellar {
 
 class StoreManifest;
-class WorkQueue;
 
 // Runs changes of the manifest on the work queue. The first of several that wait there also does the manifest work of
 // those behind it, in one transaction: a statement in a transaction takes a quarter of the time of one on its own.
@@ -20,12 +22,24 @@ class GroupCommit {
   GroupCommit(StoreContext& context, StoreManifest& manifest, WorkQueue& workQueue)
       : context_(context), manifest_(manifest), workQueue_(workQueue) {}
 
-  // The task of a change. Does nothing when an earlier one has run it.
-  void run(const std::shared_ptr<ManifestChange>& change);
+  // Hands the change to the work queue. It has a key, a promise, and a weak pointer to its owner, which is a part of
+  // the same store; when that is gone, the promise is fulfilled and nothing done.
+  template <class Change> Future<void> submit(const std::shared_ptr<Change>& change) {
+    Future<void> future = change->promise.getFuture();
+    workQueue_.dispatchChange(KeyRange(change->key), change, [this, change] {
+      if (const auto owner = change->owner.lock()) {  // whoever locks it keeps this alive, too
+        run(change);
+      } else if (change->take()) {
+        change->promise.setValue();
+      }
+    });
+    return future;
+  }
 
  private:
   using Group = std::vector<std::shared_ptr<ManifestChange>>;
 
+  void run(const std::shared_ptr<ManifestChange>& change);
   Group groupBehind(const std::shared_ptr<ManifestChange>& first);
   bool commit(const Group& group);
   static void note(const StoreLock& lock, ManifestChange& change);

@@ -13,7 +13,6 @@
 #include "keyvalue/Rollback.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
-#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -61,17 +60,8 @@ struct InlineWriter::Value final : ManifestChange, std::enable_shared_from_this<
 
 Future<void> InlineWriter::store(const std::string& key, std::vector<unsigned char> data,
                                  std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata) {
-  const auto value = std::make_shared<Value>(key, std::move(data), std::move(extendedMetadata), context_.weak(*this),
-                                             context_.operation);
-  Future<void> future = value->promise.getFuture();
-  workQueue_.dispatchChange(KeyRange(value->key), value, [value] {
-    if (const auto self = value->owner.lock()) {
-      self->groupCommit_.run(value);
-    } else if (value->take()) {
-      value->promise.setValue();
-    }
-  });
-  return future;
+  return groupCommit_.submit(std::make_shared<Value>(key, std::move(data), std::move(extendedMetadata),
+                                                     context_.weak(*this), context_.operation));
 }
 
 void InlineWriter::writeAlone(Value& value) {

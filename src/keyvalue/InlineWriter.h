@@ -17,20 +17,17 @@ class ItemRemover;
 class Rollback;
 class StoreManifest;
 class ValueFiles;
-class WorkQueue;
 class WritesInFlight;
 struct ReplacedItem;
 
 // Writes values into the manifest, record and bytes one after the other, on the work queue.
 class InlineWriter {
  public:
-  InlineWriter(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, WorkQueue& workQueue,
-               ValueFiles& files, ItemRemover& remover, Clearing& clearing, Rollback& rollback,
-               GroupCommit& groupCommit)
+  InlineWriter(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, ValueFiles& files,
+               ItemRemover& remover, Clearing& clearing, Rollback& rollback, GroupCommit& groupCommit)
       : context_(context),
         manifest_(manifest),
         writes_(writes),
-        workQueue_(workQueue),
         files_(files),
         remover_(remover),
         clearing_(clearing),
@@ -54,7 +51,6 @@ class InlineWriter {
   StoreContext& context_;
   StoreManifest& manifest_;
   WritesInFlight& writes_;
-  WorkQueue& workQueue_;
   ValueFiles& files_;
   ItemRemover& remover_;
   Clearing& clearing_;

@@ -13,7 +13,6 @@
 #include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
-#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -40,16 +39,7 @@ struct ItemRemover::Removal final : ManifestChange, std::enable_shared_from_this
 };
 
 Future<void> ItemRemover::remove(const std::string& key) {
-  const auto removal = std::make_shared<Removal>(key, context_.weak(*this), context_.operation);
-  Future<void> future = removal->promise.getFuture();
-  workQueue_.dispatchChange(KeyRange(removal->key), removal, [removal] {
-    if (const auto self = removal->owner.lock()) {
-      self->groupCommit_.run(removal);
-    } else if (removal->take()) {
-      removal->promise.setValue();
-    }
-  });
-  return future;
+  return groupCommit_.submit(std::make_shared<Removal>(key, context_.weak(*this), context_.operation));
 }
 
 void ItemRemover::removeAlone(Removal& removal) {

@@ -13,18 +13,16 @@ class FileQueue;
 class GroupCommit;
 class StoreManifest;
 class ValueFiles;
-class WorkQueue;
 class WritesInFlight;
 
 // Removes single items: the one of a key, and the one used least recently.
 class ItemRemover {
  public:
-  ItemRemover(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, WorkQueue& workQueue,
-              FileQueue& fileQueue, ValueFiles& files, GroupCommit& groupCommit)
+  ItemRemover(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, FileQueue& fileQueue,
+              ValueFiles& files, GroupCommit& groupCommit)
       : context_(context),
         manifest_(manifest),
         writes_(writes),
-        workQueue_(workQueue),
         fileQueue_(fileQueue),
         files_(files),
         groupCommit_(groupCommit) {}
@@ -59,7 +57,6 @@ class ItemRemover {
   StoreContext& context_;
   StoreManifest& manifest_;
   WritesInFlight& writes_;
-  WorkQueue& workQueue_;
   FileQueue& fileQueue_;
   ValueFiles& files_;
   GroupCommit& groupCommit_;

@@ -12,7 +12,6 @@
 #include "keyvalue/Rollback.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
-#include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -30,15 +29,7 @@ Future<void> ValueWriter::store(const std::string& key,
                                 PersistentKeyValueStore::Writer writer, bool isGroupable) {
   const auto write = std::make_shared<FileWrite>(key, std::move(extendedMetadata), std::move(writer), isGroupable,
                                                  context_.weak(*this), context_.operation);
-  Future<void> future = write->promise.getFuture();
-  workQueue_.dispatchChange(KeyRange(write->key), write, [write] {
-    if (const auto self = write->owner.lock()) {
-      self->groupCommit_.run(write);
-    } else if (write->take()) {
-      write->promise.setValue();
-    }
-  });
-  return future;
+  return groupCommit_.submit(write);
 }
 
 void ValueWriter::begin(const std::shared_ptr<FileWrite>& write) {

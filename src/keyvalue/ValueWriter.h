@@ -17,20 +17,17 @@ class ItemRemover;
 class Rollback;
 class StoreManifest;
 class ValueFiles;
-class WorkQueue;
 class WritesInFlight;
 
 // Writes values into files: a provisional record on the work queue, then the file and its final record on the file
 // queue.
 class ValueWriter {
  public:
-  ValueWriter(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, WorkQueue& workQueue,
-              FileQueue& fileQueue, ValueFiles& files, ItemRemover& remover, Clearing& clearing, Rollback& rollback,
-              GroupCommit& groupCommit)
+  ValueWriter(StoreContext& context, StoreManifest& manifest, WritesInFlight& writes, FileQueue& fileQueue,
+              ValueFiles& files, ItemRemover& remover, Clearing& clearing, Rollback& rollback, GroupCommit& groupCommit)
       : context_(context),
         manifest_(manifest),
         writes_(writes),
-        workQueue_(workQueue),
         fileQueue_(fileQueue),
         files_(files),
         remover_(remover),
@@ -72,7 +69,6 @@ class ValueWriter {
   StoreContext& context_;
   StoreManifest& manifest_;
   WritesInFlight& writes_;
-  WorkQueue& workQueue_;
   FileQueue& fileQueue_;
   ValueFiles& files_;
   ItemRemover& remover_;
