@@ -8,9 +8,11 @@
 #include <system_error>
 #include <utility>
 
-#include "AttributeStore.h"
 #include "Format.h"
 #include "InputError.h"
+#include "LarderException.h"
+#include "storage/StoreFiles.h"
+#include "storage/UntouchedFiles.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -18,121 +20,79 @@ namespace fs = std::filesystem;
 
 namespace {
 
-// Files beyond which a directory is not searched any further.
-constexpr std::size_t kMostLookedAt = 4 * SourceFiles::kMostFiles;
-
-// All files that there are to choose from.
-class Reader {
- public:
-  Reader(const fs::path& directory, const fs::path& without) : directory_(directory), without_(without) {}
-
-  SourceFiles read() {
-    std::error_code error;
-    const std::vector<fs::directory_entry> entries = sortedEntries(directory_, error);
-    if (error) throw InputError("cannot read DIRECTORY '" + directory_.string() + "': " + error.message());
-    take(entries);
-    return std::move(source_);
-  }
-
- private:
-  static std::vector<fs::directory_entry> sortedEntries(const fs::path& directory, std::error_code& error) {
-    std::vector<fs::directory_entry> entries;
-    for (fs::directory_iterator entry(directory, error); !error && entry != fs::directory_iterator();) {
-      entries.push_back(*entry);
-      entry.increment(error);
-    }
-    std::sort(entries.begin(), entries.end());
-    return entries;
-  }
-
-  void take(const std::vector<fs::directory_entry>& entries) {
-    for (const fs::directory_entry& entry : entries) {
-      if (source_.files.size() == kMostLookedAt) {
-        source_.isPart = true;
-        return;
-      }
-      takeEntry(entry);
-    }
-  }
-
-  void takeEntry(const fs::directory_entry& entry) {
-    if (entry.path().filename() == AttributeStore::fileName) return;  // belongs to the library in every store
-    std::error_code error;
-    const fs::file_status status = entry.symlink_status(error);
-    if (fs::is_directory(status)) return takeDirectory(entry.path());
-    if (fs::is_regular_file(status)) takeFile(entry.path());
-  }
-
-  void takeDirectory(const fs::path& path) {
-    std::error_code error;
-    if (fs::equivalent(path, without_, error)) return;
-    error.clear();
-    const std::vector<fs::directory_entry> entries = sortedEntries(path, error);
-    if (error) ++source_.unreadable;
-    take(entries);
-  }
-
-  void takeFile(const fs::path& path) {
-    std::error_code error;
-    const std::uint64_t size = fs::file_size(path, error);
-    if (error || access(path.c_str(), R_OK) != 0) {
-      ++source_.unreadable;
-    } else {
-      source_.files.push_back({path.string(), path.lexically_relative(directory_).string(), size});
-    }
-  }
-
-  const fs::path directory_;
-  const fs::path without_;
-  SourceFiles source_;
-};
-
-// In their order, none of more than `largest` bytes, as far as number and bytes allow.
-SourceFiles take(const SourceFiles& found, std::uint64_t largest) {
-  SourceFiles taken;
-  taken.unreadable = found.unreadable;
-  for (const SourceFiles::File& file : found.files) {
-    if (taken.files.size() == SourceFiles::kMostFiles) break;
-    if (file.size > largest || taken.bytes + file.size > SourceFiles::kMostBytes) continue;
-    taken.bytes += file.size;
-    taken.files.push_back(file);
-  }
-  taken.isPart = found.isPart || taken.files.size() < found.files.size();
-  return taken;
-}
-
-// Tries smaller and smaller files until there are enough, and settles for the largest ones that give the most.
-SourceFiles choose(const SourceFiles& found) {
-  const std::size_t enough = std::min(found.files.size(), SourceFiles::kMostFiles);
-  SourceFiles best = take(found, SourceFiles::kMostBytes);
-  for (std::uint64_t largest = SourceFiles::kMostBytes / 2; largest > 0 && best.files.size() < enough; largest /= 2) {
-    SourceFiles next = take(found, largest);
-    if (next.files.size() > best.files.size()) best = std::move(next);
-  }
-  return best;
-}
-
 void requireDirectory(const std::string& directory) {
   std::error_code error;
-  const fs::file_status status = fs::status(directory, error);
-  if (status.type() == fs::file_type::not_found) throw InputError("DIRECTORY '" + directory + "' does not exist");
-  if (error) throw InputError("cannot read DIRECTORY '" + directory + "': " + error.message());
-  if (!fs::is_directory(status)) throw InputError("DIRECTORY '" + directory + "' is not a directory");
+  const fs::directory_iterator entries(directory, error);
+  const std::string quoted = "DIRECTORY '" + directory + "'";
+  if (error == std::errc::no_such_file_or_directory) throw InputError(quoted + " does not exist");
+  if (error == std::errc::not_a_directory) throw InputError(quoted + " is not a directory");
+  if (error) throw InputError("cannot read " + quoted + ": " + error.message());
 }
 
-Bytes beginningOf(const SourceFiles::File& file, std::uint64_t bytes) {
-  Bytes contents(static_cast<std::size_t>(std::min(file.size, bytes)));
-  std::ifstream in(file.path, std::ios::binary);
-  in.read(reinterpret_cast<char*>(contents.data()), static_cast<std::streamsize>(contents.size()));
-  contents.resize(static_cast<std::size_t>(in.gcount()));
-  return contents;
+// Lists the files of a tree by name, up to the number that may be taken.
+class Search {
+ public:
+  Search(const std::string& directory, const std::string& without) : directory_(directory), without_(without) {}
+
+  // `below` is empty, or ends in a "/".
+  void searchDirectory(const std::string& below) {
+    std::error_code ignored;
+    if (fs::equivalent(directory_ + "/" + below, without_, ignored)) return;
+    try {
+      for (const Entry& entry : listUntouched(directory_ + "/" + below)) look(below, entry);
+    } catch (const FileUtilsIoException&) {
+      ++found_.unreadable;
+    }
+  }
+
+  SourceFiles found() { return std::move(found_); }
+
+ private:
+  void look(const std::string& below, const Entry& entry) {
+    if (found_.isPart) return;
+    if (entry.type == Entry::Type::Directory) searchDirectory(below + entry.name + "/");
+    // The library has attributes of its own in every store.
+    if (entry.type == Entry::Type::File && !isAttributesFile(entry)) take(below + entry.name, entry.size);
+  }
+
+  void take(const std::string& name, std::uint64_t size) {
+    const std::string path = directory_ + "/" + name;
+    if (found_.files.size() == SourceFiles::kMostFiles) {
+      found_.isPart = true;
+    } else if (access(path.c_str(), R_OK) != 0) {
+      ++found_.unreadable;
+    } else {
+      found_.files.push_back({path, name, size});
+    }
+  }
+
+  const std::string directory_;
+  const std::string without_;
+  SourceFiles found_;
+};
+
+void leaveOutLargest(SourceFiles& source) {
+  using File = SourceFiles::File;
+  std::sort(source.files.begin(), source.files.end(), [](const File& a, const File& b) { return a.size < b.size; });
+  const auto isTooMuch = [&](const File& file) {
+    if (source.bytes + file.size > SourceFiles::kMostBytes) return true;
+    source.bytes += file.size;
+    return false;
+  };
+  const auto firstOut = std::find_if(source.files.begin(), source.files.end(), isTooMuch);
+  source.isPart = source.isPart || firstOut != source.files.end();
+  source.files.erase(firstOut, source.files.end());
+  std::sort(source.files.begin(), source.files.end(), [](const File& a, const File& b) { return a.name < b.name; });
 }
 
 }  // namespace
 
 SourceFiles readSourceFiles(const std::string& directory, const std::string& without) {
   requireDirectory(directory);
-  SourceFiles source = choose(Reader(directory, without).read());
+  Search search(directory, without);
+  search.searchDirectory("");
+  SourceFiles source = search.found();
+  leaveOutLargest(source);
   if (!source.files.empty()) return source;
   if (source.isPart) {
     throw InputError("DIRECTORY '" + directory + "' holds only files of more than " +
@@ -142,15 +102,18 @@ SourceFiles readSourceFiles(const std::string& directory, const std::string& wit
   throw InputError("DIRECTORY '" + directory + "' holds no files");
 }
 
-Bytes contentsOf(const SourceFiles::File& file) { return beginningOf(file, file.size); }
+Bytes contentsOf(const SourceFiles::File& file, std::uint64_t most) {
+  Bytes contents(static_cast<std::size_t>(std::min(file.size, most)));
+  std::ifstream in(file.path, std::ios::binary);
+  in.read(reinterpret_cast<char*>(contents.data()), static_cast<std::streamsize>(contents.size()));
+  contents.resize(static_cast<std::size_t>(in.gcount()));
+  return contents;
+}
 
 Bytes pictureOf(const SourceFiles::File& file, std::size_t bytes) {
-  Bytes picture = beginningOf(file, bytes);
+  Bytes picture = contentsOf(file, bytes);
   if (picture.empty()) picture.push_back(' ');
-  for (std::size_t size = picture.size(); size < bytes; size = picture.size()) {
-    picture.resize(std::min(bytes, 2 * size));
-    std::copy_n(picture.begin(), picture.size() - size, picture.begin() + static_cast<std::ptrdiff_t>(size));
-  }
+  for (std::size_t i = 0; picture.size() < bytes; ++i) picture.push_back(picture[i]);
   return picture;
 }
 

@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <limits>
 #include <string>
 #include <vector>
 
@@ -25,17 +26,17 @@ struct SourceFiles {
   bool isPart = false;           // there is more than was taken
 };
 
-// The readable regular files under `directory`, in the order of their names, so that every run takes the same ones.
-// Where there are more than may be taken, large ones are left out for the sake of the number. Links inside it are not
-// followed, and `without` (the demonstration's own directory, should it lie there) is left out. Throws `InputError`
-// when the directory is missing, cannot be read or gives no files.
+// The readable regular files under `directory`, in the order of their names: the first ones where there are too many,
+// and without the largest of these where they have too many bytes. So every run takes the same ones. Links inside it
+// are not followed, and `without` (the demonstration's own directory, should it lie there) is left out. Throws
+// `InputError` when the directory is missing, cannot be read or gives no files.
 SourceFiles readSourceFiles(const std::string& directory, const std::string& without);
 
 using Bytes = std::vector<unsigned char>;
 
-// The bytes of a file, no more than it had when it was listed: special file systems have files that never end. One that
-// has become unreadable or shorter since counts as far as it can be read.
-Bytes contentsOf(const SourceFiles::File& file);
+// The first bytes of a file, no more than it had when it was listed: special file systems have files that never end.
+// One that has become unreadable or shorter since counts as far as it can be read.
+Bytes contentsOf(const SourceFiles::File& file, std::uint64_t most = std::numeric_limits<std::uint64_t>::max());
 
 // A picture of `bytes` bytes, made by repeating the content of the file, blank when that is empty.
 Bytes pictureOf(const SourceFiles::File& file, std::size_t bytes);
