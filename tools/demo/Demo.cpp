@@ -1,13 +1,13 @@
 #include "demo/Demo.h"
 
-#include <fcntl.h>
 #include <sys/file.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdlib>
+#include <cstdio>
 #include <filesystem>
+#include <memory>
+#include <optional>
 #include <system_error>
 
 #include "Console.h"
@@ -16,6 +16,7 @@
 #include "Stopwatch.h"
 #include "demo/SourceFiles.h"
 #include "demo/Story.h"
+#include "storage/TemporaryFolder.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -23,72 +24,20 @@ namespace fs = std::filesystem;
 
 namespace {
 
+// The file in a root that says that a demonstration may clear it.
 constexpr const char* kMarker = ".cellar-demo";
+
+struct CloseFile {
+  void operator()(std::FILE* file) const { (void)std::fclose(file); }
+};
+using Marker = std::unique_ptr<std::FILE, CloseFile>;
 
 [[noreturn]] void refuse(const fs::path& root, const std::string& reason) {
   throw InputError("cannot use '" + root.string() + "' as the root: " + reason);
 }
 
-std::string makeTemporaryDirectory() {
-  std::string path = (fs::temp_directory_path() / "cellar-demo-XXXXXX").string();
-  if (mkdtemp(path.data()) == nullptr) refuse(path, std::generic_category().message(errno));
-  return path;
-}
-
-std::string makeDirectory(const std::string& path) {
-  std::error_code error;
-  fs::create_directories(path, error);
-  if (error) refuse(path, error.message());
-  if (!fs::exists(fs::path(path) / kMarker) && !fs::is_empty(path, error)) {
-    refuse(path, error ? error.message() : "it is not empty, and no earlier demo made it");
-  }
-  return fs::canonical(path).string();
-}
-
-// The directory that a demonstration has to itself while it runs. A directory of the user's that is neither empty nor
-// marked as one of ours is never touched.
-class DemoRoot {
- public:
-  // Takes `path`, created if need be, and clears what an earlier demonstration left there; an empty `path` is a fresh
-  // temporary directory that goes away at the end. Throws `InputError` when the directory cannot be had or belongs to
-  // something else.
-  explicit DemoRoot(const std::string& path);
-  ~DemoRoot();
-  DemoRoot(const DemoRoot&) = delete;
-  DemoRoot& operator=(const DemoRoot&) = delete;
-
-  const std::string& path() const;  // absolute
-  bool isTemporary() const;
-
-  // Throws `InputError` when `directory` lies in here, where it would be cleared.
-  static void requireOutside(const std::string& root, const std::string& directory);
-
- private:
-  void lock();
-  void clear() const;
-
-  const bool isTemporary_;
-  const std::string path_;
-  int lock_ = -1;  // file descriptor of the marker, locked
-};
-
-DemoRoot::DemoRoot(const std::string& path)
-    : isTemporary_(path.empty()), path_(isTemporary_ ? makeTemporaryDirectory() : makeDirectory(path)) {
-  lock();
-  clear();
-}
-
-DemoRoot::~DemoRoot() {
-  std::error_code ignored;
-  if (isTemporary_) fs::remove_all(path_, ignored);
-  if (lock_ >= 0) close(lock_);
-}
-
-const std::string& DemoRoot::path() const { return path_; }
-
-bool DemoRoot::isTemporary() const { return isTemporary_; }
-
-void DemoRoot::requireOutside(const std::string& root, const std::string& directory) {
+// The directory would be cleared with the root.
+void requireOutside(const std::string& root, const std::string& directory) {
   if (root.empty()) return;
   std::error_code error;
   const fs::path outer = fs::weakly_canonical(root, error);
@@ -98,64 +47,69 @@ void DemoRoot::requireOutside(const std::string& root, const std::string& direct
   if (isInside) refuse(root, "DIRECTORY '" + directory + "' lies in it and would be cleared");
 }
 
-void DemoRoot::lock() {
-  const std::string marker = (fs::path(path_) / kMarker).string();
-  lock_ = open(marker.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-  if (lock_ < 0) refuse(path_, std::generic_category().message(errno));
-  if (flock(lock_, LOCK_EX | LOCK_NB) != 0) {
-    close(lock_);
-    refuse(path_, "another demo is running there");
-  }
+// A directory of the user's that is neither empty nor marked as one of ours is never touched. Returns the absolute
+// path.
+std::string makeRoot(const std::string& path) {
+  std::error_code error;
+  fs::create_directories(path, error);
+  if (error) refuse(path, error.message());
+  const bool isOurs = fs::exists(fs::path(path) / kMarker) || fs::is_empty(path, error);
+  if (!isOurs) refuse(path, error ? error.message() : "it is not empty, and no earlier demo made it");
+  return fs::canonical(path).string();
 }
 
-void DemoRoot::clear() const {
+// Nobody else can lock the root while the marker is open.
+Marker lockRoot(const std::string& root) {
+  Marker marker(std::fopen((root + "/" + kMarker).c_str(), "ae"));
+  if (marker == nullptr) refuse(root, std::generic_category().message(errno));
+  if (flock(fileno(marker.get()), LOCK_EX | LOCK_NB) != 0) refuse(root, "another demo is running there");
+  return marker;
+}
+
+void clearRoot(const std::string& root) {
   try {
-    for (const fs::directory_entry& entry : fs::directory_iterator(path_)) {
+    for (const fs::directory_entry& entry : fs::directory_iterator(root)) {
       if (entry.path().filename() != kMarker) fs::remove_all(entry.path());
     }
   } catch (const fs::filesystem_error& error) {
-    close(lock_);
-    refuse(path_, error.code().message());
+    refuse(root, error.code().message());
   }
 }
 
-// What the stores take on disk beside the files themselves: directories, attributes, manifests, pictures, videos.
-constexpr std::uint64_t kSpareBytes = 160U << 20U;
-
 // Every file is copied into a directory and stored by key; where there are but a few, each store gets one of them.
-std::uint64_t neededBytes(const SourceFiles& source) {
-  constexpr std::size_t few = 10;
-  return source.bytes * (source.files.size() < few ? few : 2) + kSpareBytes;
-}
-
 void requireSpace(const SourceFiles& source, const std::string& root) {
-  const std::uint64_t needed = neededBytes(source);
+  constexpr std::uint64_t spare = 160U << 20U;  // for directories, attributes, manifests, pictures, videos
+  const std::uint64_t needed = source.bytes * (source.files.size() < 10 ? 10 : 2) + spare;
   const std::uint64_t available = fs::space(root).available;
   if (available >= needed) return;
   throw InputError("the demo needs " + formatSize(needed) + " in '" + root + "', and only " + formatSize(available) +
                    " are free");
 }
 
-void introduce(Console& console, const DemoOptions& options, const SourceFiles& source, const DemoRoot& root) {
+void introduce(Console& console, const std::string& directory, const SourceFiles& source, const std::string& stores) {
   console.heading("A day in the life of an application's storage");
   std::string files = formatFiles({source.files.size(), source.bytes});
   if (source.isPart) files += " of more";
   if (source.unreadable > 0) files += ", " + formatCount(source.unreadable) + " unreadable left out";
-  console.line("files from   " + options.directory + " (" + files + ")");
-  console.line("stores under " + root.path() + (root.isTemporary() ? " (removed at the end)" : ""));
+  console.line("files from   " + directory + " (" + files + ")");
+  console.line("stores under " + stores);
 }
 
 }  // namespace
 
 bool runDemo(const DemoOptions& options, Console& console) {
   const Stopwatch watch;
-  DemoRoot::requireOutside(options.root, options.directory);
+  requireOutside(options.root, options.directory);
   const SourceFiles source = readSourceFiles(options.directory, options.root);
-  const DemoRoot root(options.root);
-  requireSpace(source, root.path());
-  introduce(console, options, source, root);
+  std::optional<TemporaryFolder> temporary;
+  if (options.root.empty()) temporary.emplace("cellar-demo");
+  const std::string root = temporary ? temporary->path() : makeRoot(options.root);
+  const Marker marker = lockRoot(root);
+  clearRoot(root);
+  requireSpace(source, root);
+  introduce(console, options.directory, source, root + (temporary ? " (removed at the end)" : ""));
 
-  Story story(console, source, root.path());
+  Story story(console, source, root);
   story.play();
   const bool isGood = story.failed() == 0;
   console.verdict((isGood ? "PASSED: " : "FAILED: ") + formatCount(story.passed(), "check", "checks") + " passed, " +

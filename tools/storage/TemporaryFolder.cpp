@@ -11,10 +11,10 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-std::string makeFolder() {
+std::string makeFolder(const std::string& name) {
   std::error_code error;
   const std::filesystem::path parent = std::filesystem::temp_directory_path(error);
-  std::string path = (parent / "cellar-XXXXXX").string();
+  std::string path = (parent / (name + "-XXXXXX")).string();
   if (error || mkdtemp(path.data()) == nullptr) {
     throw InputError("cannot create the temporary directory '" + path +
                      "': " + (error ? error.message() : std::generic_category().message(errno)));
@@ -24,7 +24,7 @@ std::string makeFolder() {
 
 }  // namespace
 
-TemporaryFolder::TemporaryFolder() : path_(makeFolder()) {}
+TemporaryFolder::TemporaryFolder(const std::string& name) : path_(makeFolder(name)) {}
 
 TemporaryFolder::~TemporaryFolder() {
   std::error_code ignored;

@@ -4,11 +4,11 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// An empty temporary directory, removed with its contents by the destructor. Throws `InputError` if it cannot be
-// created.
+// An empty temporary directory, removed with its contents by the destructor. Its name begins with `name`. Throws
+// `InputError` if it cannot be created.
 class TemporaryFolder {
  public:
-  TemporaryFolder();
+  explicit TemporaryFolder(const std::string& name = "cellar");
   ~TemporaryFolder();
   TemporaryFolder(const TemporaryFolder&) = delete;
   TemporaryFolder& operator=(const TemporaryFolder&) = delete;
