@@ -2,7 +2,6 @@
 
 #include <sys/file.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <filesystem>
@@ -27,28 +26,20 @@ namespace {
 // The file in a root that says that a demonstration may clear it.
 constexpr const char* kMarker = ".cellar-demo";
 
-struct CloseFile {
-  void operator()(std::FILE* file) const { (void)std::fclose(file); }
-};
-using Marker = std::unique_ptr<std::FILE, CloseFile>;
+using Marker = std::unique_ptr<std::FILE, int (*)(std::FILE*)>;
 
 [[noreturn]] void refuse(const fs::path& root, const std::string& reason) {
   throw InputError("cannot use '" + root.string() + "' as the root: " + reason);
 }
 
-// The directory would be cleared with the root.
 void requireOutside(const std::string& root, const std::string& directory) {
-  if (root.empty()) return;
   std::error_code error;
-  const fs::path outer = fs::weakly_canonical(root, error);
-  const fs::path inner = fs::weakly_canonical(directory, error);
-  if (error) return;  // whatever is wrong with them shows when they are used
-  const bool isInside = std::mismatch(outer.begin(), outer.end(), inner.begin(), inner.end()).first == outer.end();
-  if (isInside) refuse(root, "DIRECTORY '" + directory + "' lies in it and would be cleared");
+  const fs::path below = root.empty() ? "" : fs::relative(directory, root, error);
+  if (error || below.empty() || *below.begin() == "..") return;  // an error shows when the two are used
+  refuse(root, "DIRECTORY '" + directory + "' lies in it and would be cleared");
 }
 
-// A directory of the user's that is neither empty nor marked as one of ours is never touched. Returns the absolute
-// path.
+// The absolute path. A directory that is neither empty nor marked as one of ours is never touched.
 std::string makeRoot(const std::string& path) {
   std::error_code error;
   fs::create_directories(path, error);
@@ -60,20 +51,18 @@ std::string makeRoot(const std::string& path) {
 
 // Nobody else can lock the root while the marker is open.
 Marker lockRoot(const std::string& root) {
-  Marker marker(std::fopen((root + "/" + kMarker).c_str(), "ae"));
+  Marker marker(std::fopen((root + "/" + kMarker).c_str(), "ae"), std::fclose);
   if (marker == nullptr) refuse(root, std::generic_category().message(errno));
   if (flock(fileno(marker.get()), LOCK_EX | LOCK_NB) != 0) refuse(root, "another demo is running there");
   return marker;
 }
 
 void clearRoot(const std::string& root) {
-  try {
-    for (const fs::directory_entry& entry : fs::directory_iterator(root)) {
-      if (entry.path().filename() != kMarker) fs::remove_all(entry.path());
-    }
-  } catch (const fs::filesystem_error& error) {
-    refuse(root, error.code().message());
+  std::error_code error;
+  for (const fs::directory_entry& entry : fs::directory_iterator(root, error)) {
+    if (entry.path().filename() != kMarker && !error) fs::remove_all(entry.path(), error);
   }
+  if (error) refuse(root, error.message());
 }
 
 // Every file is copied into a directory and stored by key; where there are but a few, each store gets one of them.

@@ -6,7 +6,6 @@
 #include <filesystem>
 #include <fstream>
 #include <system_error>
-#include <utility>
 
 #include "Format.h"
 #include "InputError.h"
@@ -29,77 +28,59 @@ void requireDirectory(const std::string& directory) {
   if (error) throw InputError("cannot read " + quoted + ": " + error.message());
 }
 
-// Lists the files of a tree by name, up to the number that may be taken.
-class Search {
- public:
-  Search(const std::string& directory, const std::string& without) : directory_(directory), without_(without) {}
+void take(SourceFiles& source, const SourceFiles::File& file) {
+  if (source.files.size() == SourceFiles::kMostFiles) {
+    source.isPart = true;
+  } else if (access(file.path.c_str(), R_OK) != 0) {
+    ++source.unreadable;
+  } else {
+    source.files.push_back(file);
+  }
+}
 
-  // `below` is empty, or ends in a "/".
-  void searchDirectory(const std::string& below) {
-    std::error_code ignored;
-    if (fs::equivalent(directory_ + "/" + below, without_, ignored)) return;
-    try {
-      for (const Entry& entry : listUntouched(directory_ + "/" + below)) look(below, entry);
-    } catch (const FileUtilsIoException&) {
-      ++found_.unreadable;
+// Takes the files of a tree by name, up to the number that may be taken. `below` is empty, or ends in a "/".
+void takeTree(SourceFiles& source, const std::string& root, const std::string& below, const std::string& without) {
+  const std::string directory = root + "/" + below;
+  std::error_code ignored;
+  if (source.isPart || fs::equivalent(directory, without, ignored)) return;
+  try {
+    for (const Entry& entry : listUntouched(directory)) {
+      if (isAttributesFile(entry)) continue;  // the library has one of its own in every store
+      const std::string name = below + entry.name;
+      if (entry.type == Entry::Type::Directory) takeTree(source, root, name + "/", without);
+      if (entry.type == Entry::Type::File) take(source, {directory + entry.name, name, entry.size});
     }
+  } catch (const FileUtilsIoException&) {
+    ++source.unreadable;
   }
-
-  SourceFiles found() { return std::move(found_); }
-
- private:
-  void look(const std::string& below, const Entry& entry) {
-    if (found_.isPart) return;
-    if (entry.type == Entry::Type::Directory) searchDirectory(below + entry.name + "/");
-    // The library has attributes of its own in every store.
-    if (entry.type == Entry::Type::File && !isAttributesFile(entry)) take(below + entry.name, entry.size);
-  }
-
-  void take(const std::string& name, std::uint64_t size) {
-    const std::string path = directory_ + "/" + name;
-    if (found_.files.size() == SourceFiles::kMostFiles) {
-      found_.isPart = true;
-    } else if (access(path.c_str(), R_OK) != 0) {
-      ++found_.unreadable;
-    } else {
-      found_.files.push_back({path, name, size});
-    }
-  }
-
-  const std::string directory_;
-  const std::string without_;
-  SourceFiles found_;
-};
+}
 
 void leaveOutLargest(SourceFiles& source) {
-  using File = SourceFiles::File;
-  std::sort(source.files.begin(), source.files.end(), [](const File& a, const File& b) { return a.size < b.size; });
-  const auto isTooMuch = [&](const File& file) {
-    if (source.bytes + file.size > SourceFiles::kMostBytes) return true;
-    source.bytes += file.size;
-    return false;
+  std::vector<SourceFiles::File>& files = source.files;
+  const auto sortBy = [&](auto member) {
+    std::sort(files.begin(), files.end(), [&](const auto& a, const auto& b) { return a.*member < b.*member; });
   };
-  const auto firstOut = std::find_if(source.files.begin(), source.files.end(), isTooMuch);
-  source.isPart = source.isPart || firstOut != source.files.end();
-  source.files.erase(firstOut, source.files.end());
-  std::sort(source.files.begin(), source.files.end(), [](const File& a, const File& b) { return a.name < b.name; });
+  sortBy(&SourceFiles::File::size);
+  for (const SourceFiles::File& file : files) source.bytes += file.size;
+  for (; source.bytes > SourceFiles::kMostBytes; files.pop_back()) {
+    source.bytes -= files.back().size;
+    source.isPart = true;
+  }
+  sortBy(&SourceFiles::File::name);
 }
 
 }  // namespace
 
 SourceFiles readSourceFiles(const std::string& directory, const std::string& without) {
   requireDirectory(directory);
-  Search search(directory, without);
-  search.searchDirectory("");
-  SourceFiles source = search.found();
+  SourceFiles source;
+  takeTree(source, directory, "", without);
   leaveOutLargest(source);
   if (!source.files.empty()) return source;
-  if (source.isPart) {
-    throw InputError("DIRECTORY '" + directory + "' holds only files of more than " +
-                     formatSize(SourceFiles::kMostBytes));
-  }
-  if (source.unreadable > 0) throw InputError("nothing in DIRECTORY '" + directory + "' can be read");
-  throw InputError("DIRECTORY '" + directory + "' holds no files");
+  const std::string quoted = "DIRECTORY '" + directory + "'";
+  if (source.isPart) throw InputError(quoted + " holds only files of more than " + formatSize(SourceFiles::kMostBytes));
+  if (source.unreadable > 0) throw InputError("nothing in " + quoted + " can be read");
+  throw InputError(quoted + " holds no files");
 }
 
 Bytes contentsOf(const SourceFiles::File& file, std::uint64_t most) {
