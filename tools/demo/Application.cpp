@@ -1,10 +1,7 @@
 #include "demo/Application.h"
 
-#include <glog/logging.h>
-
 #include <chrono>
-#include <fstream>
-#include <mutex>
+#include <stdexcept>
 #include <utility>
 
 #include "StoreManager.h"
@@ -13,48 +10,24 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-namespace {
-
-constexpr std::chrono::minutes kPatience(1);
-constexpr long kNoLazyWork = 86400;  // seconds: the demonstration asks for every store itself
-
-}  // namespace
-
-// Takes the log of the process in the place of the terminal. Any thread.
-class Application::Log : private google::LogSink {
- public:
-  explicit Log(const std::string& file) : file_(file) { google::AddLogSink(this); }
-  ~Log() override { google::RemoveLogSink(this); }
-  Log(const Log&) = delete;
-  Log& operator=(const Log&) = delete;
-
-  std::vector<std::string> takeErrors() {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    return std::exchange(errors_, {});
-  }
-
- private:
-  using google::LogSink::send;
-  void send(google::LogSeverity severity, const char* /*path*/, const char* file, int line,
-            const google::LogMessageTime& /*time*/, const char* message, std::size_t length) override {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    const std::string text(message, length);
-    file_ << google::LogSeverityNames[severity] << ' ' << file << ':' << line << ' ' << text << std::endl;
-    if (severity >= google::GLOG_ERROR) errors_.push_back(text);
-  }
-
-  std::mutex mutex_;  // guards the two below
-  std::vector<std::string> errors_;
-  std::ofstream file_;
-};
-
 Application::Application(const std::string& root)
-    : root_(root), events_(root + "/analytics.jsonl"), log_(std::make_unique<Log>(root + "/log.txt")) {}
+    : root_(root), events_(root + "/analytics.jsonl"), configuration_(kMediaAppConfiguration), log_(root + "/log.txt") {
+  google::AddLogSink(this);
+  const JsonValue document = JsonValue::parse(kMediaAppConfiguration);
+  for (const auto& [name, manager] : document.items()) {
+    for (const auto& [identifier, ignored] : manager.at("stores").items()) {
+      stores_.push_back(configuration_.getStore(identifier));
+      (stores_.back()->isManaged ? withKeys_ : unmanaged_).insert(identifier);
+    }
+  }
+}
 
-Application::~Application() = default;
+Application::~Application() {
+  stop();
+  google::RemoveLogSink(this);
+}
 
 void Application::launch(const std::string& release, const std::string& user) {
-  stop();
   release_ = release;
   user_ = user;
   host::HostOptions options;
@@ -63,33 +36,13 @@ void Application::launch(const std::string& release, const std::string& user) {
   options.versionTag = release;
   options.localeFirstTag = "en";
   options.localeSecondTag = "US";
-  options.lazyDelaySeconds = kNoLazyWork;
+  options.lazyDelaySeconds = 86400;  // never: the demonstration asks for every store itself
   options.analytics = std::make_unique<host::JsonLinesAnalytics>(events_);
   host_ = std::make_unique<host::Host>(std::move(options));
-  stores_.clear();
-  const JsonValue document = JsonValue::parse(kMediaAppConfiguration);
-  for (const auto& [name, manager] : document.items()) {
-    for (const auto& [identifier, ignored] : manager.at("stores").items()) {
-      stores_.push_back(host_->configuration()->getStore(identifier));
-    }
-  }
 }
 
 void Application::openStores() {
   for (const auto& store : stores_) host_->store<Store>(store->name, user_);
-}
-
-void Application::stop() {
-  if (host_ != nullptr) settle();
-  host_.reset();
-}
-
-const StoreDefinition& Application::definition(const std::string& store) const {
-  return *host_->configuration()->getStore(store);
-}
-
-bool Application::belongsToSession(const StoreDefinition& store) const {
-  return host_->configuration()->getManager(store.managerName)->sessionScoped;
 }
 
 std::string Application::pathOf(const std::string& store) { return host_->store<Store>(store, user_)->path; }
@@ -98,18 +51,33 @@ std::shared_ptr<PersistentKeyValueStore> Application::values(const std::string& 
   return host_->store<PersistentKeyValueStore>(store, user_);
 }
 
-bool Application::settle() {
+void Application::settle() {
   const auto threads = std::dynamic_pointer_cast<host::ThreadQueueFactory>(host_->queues());
-  return threads->drain(kPatience);
+  if (!threads->drain(std::chrono::minutes(1))) throw std::runtime_error("the work in the background does not end");
 }
 
-std::vector<JsonValue> Application::events() const {
-  std::vector<JsonValue> events;
+std::map<std::string, std::vector<JsonValue>> Application::events() const {
+  std::map<std::string, std::vector<JsonValue>> payloads;
   std::ifstream in(events_);
-  for (std::string line; std::getline(in, line);) events.push_back(JsonValue::parse(line));
-  return events;
+  for (std::string line; std::getline(in, line);) {
+    const JsonValue event = JsonValue::parse(line);
+    payloads[event.at("event").get<std::string>()].push_back(event.at("payload"));
+  }
+  return payloads;
 }
 
-std::vector<std::string> Application::takeErrors() { return log_->takeErrors(); }
+std::vector<std::string> Application::takeErrors() {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  return std::exchange(errors_, {});
+}
+
+// Any thread.
+void Application::send(google::LogSeverity severity, const char* /*path*/, const char* file, int line,
+                       const google::LogMessageTime& /*time*/, const char* message, std::size_t length) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  const std::string text(message, length);
+  log_ << google::LogSeverityNames[severity] << ' ' << file << ':' << line << ' ' << text << std::endl;
+  if (severity >= google::GLOG_ERROR) errors_.push_back(text);
+}
 
 }  // namespace velmora::mobile::xplat::cellar::tools

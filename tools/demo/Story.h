@@ -2,8 +2,8 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <map>
-#include <optional>
 #include <string>
 #include <vector>
 
@@ -21,7 +21,8 @@ class Console;
 class Story {
  public:
   // `root` is absolute; `console` and `source` outlive this.
-  Story(Console& console, const SourceFiles& source, const std::string& root);
+  Story(Console& console, const SourceFiles& source, const std::string& root)
+      : console_(console), source_(source), root_(root), app_(root) {}
 
   // All scenes, up to the first that cannot be played to its end, and then tables of what has come of it.
   void play();
@@ -30,34 +31,24 @@ class Story {
   std::size_t failed() const { return failed_; }
 
  private:
-  // A value on its way into a store: a source file as it is, or a picture made of it.
-  struct Value {
-    std::string key;
-    std::size_t file;              // its number
-    std::size_t pictureBytes = 0;  // 0: the file as it is
-    std::optional<int> second{};   // of the video that it is a chunk of
-  };
-  // What the application has noted of a value that it has stored.
+  static constexpr std::size_t kPicture = 256U << 10U;
+  static constexpr std::size_t kSmallPicture = 4U << 10U;
+
   struct Note {
     std::uint64_t bytes;
     std::size_t digest;
   };
-  // What has come of the requests to a store with keys.
-  struct Requests {
-    std::size_t stored = 0;
+  // What the application has noted of a store.
+  struct Record {
+    std::map<std::string, Note> contents;  // what it should hold, by key or by the name of the file
+    TreeSize fullest;
+    std::size_t stored = 0;  // values; and what has come of the requests for them
     std::size_t hits = 0;
     std::size_t misses = 0;
-  };
-  using Values = std::map<std::string, std::vector<Value>>;  // by store
-  using Notes = std::map<std::string, Note>;                 // by key
-  struct Scene {
-    const char* title;
-    void (Story::*play)();
   };
 
   // --- The scenes (Scenes.cpp) ---
 
-  static const std::vector<Scene>& scenes();
   void startFirst();
   void fillDirectories();
   void measure();
@@ -77,51 +68,50 @@ class Story {
 
   // --- What they are made of ---
 
-  bool playScene(const Scene& scene);
+  bool playScene(const std::string& title, void (Story::*scene)());
   void start(const std::string& release, const std::string& user);
-  void restart();
-  void fillEmptyDirectories(std::size_t mostFiles, std::uint64_t coversPercent);
-  void copyFile(const std::string& path, const Bytes& contents);
-  Values placeFiles() const;
-  void store(const std::string& store, const std::vector<Value>& values);
-  void fetch(const std::string& store, const std::vector<std::string>& keys);
-  std::size_t fetchAll();
-  std::size_t dropMissing(const std::string& store);
-  void forget(const StoreDefinition& store);
+  void restart() { start(app_.release(), app_.user()); }
+  void fillEmptyDirectories(std::size_t mostFiles, std::size_t covers);
+  void writeFile(const std::string& store, const std::string& name, const Bytes& contents);
+  std::size_t storeFiles();
+  void storeUntilOver(std::uint64_t limit, const std::string& store);
+  TreeSize forget(const std::string& store);
   TreeSize forgetSession();
-  void storeUntilOver(std::uint64_t limit, const std::string& store, std::uint64_t others);
+  std::size_t forgetMissing(const std::string& store);
+
+  // Both are finished, and what is fetched is checked, by `finishRequests` at the latest.
+  void store(const std::string& store, const std::string& key, const Bytes& contents);
+  void fetch(const std::string& store, const std::string& key);
+  void addRequest(std::function<void()> finish);
+  void finishRequests();
 
   // --- Checks ---
 
-  void check(const std::string& what, bool isTrue);
-  void check(const std::string& what, std::uint64_t expected, std::uint64_t found);
-  void fail(const std::string& what, const std::string& expected, const std::string& found);
-  void checkResult(const std::string& store, const std::string& key, const PersistentKeyValueStore::FetchResult* found);
+  void check(const std::string& what, const std::string& expected, const std::string& found);
+  void check(const std::string& what, bool isTrue) { check(what, "yes", isTrue ? "yes" : "no"); }
+  void check(const std::string& what, std::uint64_t expected, std::uint64_t found) {
+    check(what, std::to_string(expected), std::to_string(found));
+  }
+  void checkFetched(const std::string& store, const std::string& key,
+                    const PersistentKeyValueStore::FetchResult* found);
   void checkEverything();
-  void checkGone(const std::vector<std::string>& directories);
-  void checkEvents(const std::string& type, const std::map<std::string, std::uint64_t>& sizes);
+  void checkDirectories();
+  void checkEvents(const std::string& type, const std::multimap<std::string, std::uint64_t>& sizes);
 
   // --- What is known ---
 
+  void noteFullest();
   TreeSize sizeOf(const std::string& store);  // as noted
   std::vector<std::string> keysOf(const std::string& store);
-  std::vector<JsonValue> eventsNamed(const std::string& name) const;
-  std::vector<std::string> sessionDirectories();
-  std::size_t requests(std::size_t Requests::*which) const;
-  Bytes contentsOf(const Value& value) const;
-  std::string below(const std::string& path) const;
-  void noteSizes();
   void printStores();
-  void printEvents();
+  void printEvents() const;
 
   Console& console_;
   const SourceFiles& source_;
   const std::string root_;
   Application app_;
-  std::map<std::string, TreeSize> directories_;  // by store: what the unmanaged ones should hold
-  std::map<std::string, Notes> notes_;           // by store: what those with keys should hold
-  std::map<std::string, Requests> requests_;     // by store with keys
-  std::map<std::string, TreeSize> fullest_;      // by store
+  std::map<std::string, Record> records_;        // by store
+  std::vector<std::function<void()>> underWay_;  // waits for a request and checks what has come of it
   std::size_t passed_ = 0;
   std::size_t failed_ = 0;
 };
