@@ -117,16 +117,24 @@ template <class Operation> auto SQLiteManifestPersistence::perform(Operation ope
   const std::lock_guard<std::recursive_mutex> lock(mutex_);
   if (invalidated_) return Result();
   return translatingExceptions([&] {
-    if (transaction_ == Transaction::Failed) throw ManifestPersistenceException("The transaction has failed.", kAbort);
-    if (mustReopen_) reopen();
+    prepare();
     try {
       return operation();
     } catch (const SQLiteStoreException& exception) {
-      if (transaction_ == Transaction::Open) transaction_ = Transaction::Failed;
-      if (exception.code() == kReadOnly) handleReadOnly(exception);
+      handleFailure(exception);
       throw;
     }
   });
+}
+
+void SQLiteManifestPersistence::prepare() const {
+  if (transaction_ == Transaction::Failed) throw SQLiteStoreException("The transaction has failed.", kAbort);
+  if (mustReopen_) reopen();
+}
+
+void SQLiteManifestPersistence::handleFailure(const SQLiteStoreException& exception) const {
+  if (transaction_ == Transaction::Open) transaction_ = Transaction::Failed;
+  if (exception.code() == kReadOnly) handleReadOnly(exception);
 }
 
 // Either the file could not be opened for writing when it was opened, or it says itself that it must never be written:

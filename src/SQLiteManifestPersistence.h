@@ -80,6 +80,8 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   template <class Operation> auto perform(Operation operation) const;
 
   std::unique_ptr<SQLiteStore> openStore() const;
+  void prepare() const;
+  void handleFailure(const SQLiteStoreException& exception) const;
   void reopen() const;
   void rollBack() noexcept;
   void handleReadOnly(const SQLiteStoreException& exception) const;
