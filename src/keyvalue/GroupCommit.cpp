@@ -20,6 +20,7 @@ constexpr std::size_t kMaxGroupBytes = std::size_t{128} << 10U;  // a first chan
 // The task of a change. Does nothing when an earlier one has run it.
 void GroupCommit::run(const std::shared_ptr<ManifestChange>& change) {
   if (!change->take()) return;
+  if (workQueue_.next(*change) == nullptr) return change->runAlone();
   const Group group = groupBehind(change);
   const bool isCommitted = group.size() > 1 && commit(group);
   std::exception_ptr failure;  // of a callback: the executor's affair, but not the other changes'
