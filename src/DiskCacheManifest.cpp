@@ -10,6 +10,7 @@
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
 #include "manifest/ManifestRecords.h"
+#include "manifest/ManifestUndo.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -104,46 +105,23 @@ std::optional<ReplacedItem> DiskCacheManifest::replaceItem(const DiskCacheItem& 
   return replaced;
 }
 
-// What a key had in memory before a change.
-struct DiskCacheManifest::Former {
-  std::string key;
-  std::optional<ManifestRecords::Copy> record;
-  std::optional<std::int32_t> accessDate;  // that waits to be written
-};
-
 bool DiskCacheManifest::changeTogether(const std::function<void()>& changes) {
   const ItemsLock lock(itemsMutex_);
   if (!loaded_) return false;
-  formers_ = std::make_unique<std::vector<Former>>();
+  undo_ = std::make_unique<ManifestUndo>();
   bool haveChanged = false;
   try {
     haveChanged = persistence_->performTogether(changes);
   } catch (...) {  // whoever makes the changes one by one finds out for which of them it matters
-    takeBackChanges(lock, *std::exchange(formers_, nullptr));
+    std::exchange(undo_, nullptr)->takeBack(*records_, pendingAccessDates_);
   }
-  formers_.reset();
+  undo_.reset();
   return haveChanged;
 }
 
 // To be called before a record in memory changes.
 void DiskCacheManifest::noteFormer(const ItemsLock& /*lock*/, const std::string& key) {
-  if (formers_ == nullptr) return;
-  Former former{key, std::nullopt, std::nullopt};
-  if (const ManifestRecord* const record = records_->find(key)) former.record = records_->copyOf(*record);
-  const auto date = pendingAccessDates_.find(key);
-  if (date != pendingAccessDates_.end()) former.accessDate = date->second;
-  formers_->push_back(std::move(former));
-}
-
-void DiskCacheManifest::takeBackChanges(const ItemsLock& /*lock*/, const std::vector<Former>& formers) {
-  for (auto former = formers.rbegin(); former != formers.rend(); ++former) {
-    if (former->record) {
-      records_->restore(*former->record);
-    } else if (const ManifestRecord* const record = records_->find(former->key)) {
-      records_->remove(*record);
-    }
-    if (former->accessDate) pendingAccessDates_[former->key] = *former->accessDate;
-  }
+  if (undo_ != nullptr) undo_->note(key, *records_, pendingAccessDates_);
 }
 
 void DiskCacheManifest::set(const ItemsLock& lock, const DiskCacheItem& item) {
@@ -164,8 +142,8 @@ std::optional<ReplacedItem> DiskCacheManifest::whatIsReplaced(const ItemsLock& l
   } catch (const ManifestCorruptedException&) {
     throw;
   } catch (const ManifestPersistenceException&) {
-    if (formers_ != nullptr) throw;  // what has failed within a transaction may have ended it
-    return std::nullopt;             // not being able to read must not keep the item from being written
+    if (undo_ != nullptr) throw;  // what has failed within a transaction may have ended it
+    return std::nullopt;          // not being able to read must not keep the item from being written
   }
 }
 

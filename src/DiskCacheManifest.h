@@ -20,6 +20,7 @@ namespace velmora::mobile::xplat::cellar {
 class ExtendedMetadataFactory;
 class ManifestRecord;
 class ManifestRecords;
+class ManifestUndo;
 
 // The record that another one has replaced, null if there was none, and its inline value if that was asked for.
 struct CELLAR_EXPORT ReplacedItem {
@@ -158,10 +159,7 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   using ItemsLock = std::lock_guard<std::recursive_mutex>;  // of the items mutex
   using Next = std::function<const ManifestRecord*()>;
 
-  struct Former;
-
   void noteFormer(const ItemsLock& lock, const std::string& key);
-  void takeBackChanges(const ItemsLock& lock, const std::vector<Former>& formers);
   void set(const ItemsLock& lock, const DiskCacheItem& item);
   std::optional<ReplacedItem> whatIsReplaced(const ItemsLock& lock, const std::string& key, bool withInlineData);
   const ManifestRecord* findOrRead(const ItemsLock& lock, const std::string& key);
@@ -187,7 +185,7 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   const std::unique_ptr<ManifestRecords> records_;
   bool loaded_ = false;
   bool invalidated_ = false;
-  std::unique_ptr<std::vector<Former>> formers_;  // of the changes that are being made together; null otherwise
+  std::unique_ptr<ManifestUndo> undo_;  // of the changes that are being made together; null otherwise
   AccessDates pendingAccessDates_;
   std::weak_ptr<AccessDates> queuedAccessDates_;  // those of the flush on the executor; empty once it runs
   bool hasFlushFailed_ = false;                   // then pending dates wait for the timer
