@@ -258,11 +258,11 @@ class StoreUse {
     }
   }
 
-  // A manifest that cannot be opened fails each operation for as long as that is so.
+  // A manifest that cannot be opened fails each operation for as long as that is so. A link to one that can is in use.
   void clearTheManifestsPlace() {
     for (const char* companion : {"", "-wal", "-shm", "-journal"}) {
       const std::filesystem::path path = directory_.path + "/manifest_v1.sqlite" + companion;
-      if (!std::filesystem::is_regular_file(std::filesystem::symlink_status(path))) std::filesystem::remove_all(path);
+      if (!std::filesystem::is_regular_file(path)) std::filesystem::remove_all(path);
     }
   }
 
