@@ -66,7 +66,7 @@ void run(const Arguments& arguments) {
   for (const auto& place : arguments.places) places.push_back(placeOf(place));
   bench::Manifests manifests(places.back());
   const bool isOneTopic = !arguments.benchmarks.empty() && arguments.document.empty();
-  if (arguments.quick || isOneTopic) places.resize(1);  // so that a topic takes less than a minute
+  if (arguments.quick || isOneTopic) places.resize(1);  // a topic is for a quick look
   const bench::Context context{arguments.quick, places, report, manifests};
   for (const auto& benchmark : bench::benchmarks()) {
     if (!isWanted(arguments, benchmark.name)) continue;

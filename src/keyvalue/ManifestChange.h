@@ -33,7 +33,8 @@ class ManifestChange : public Chain<ManifestChange>::Link {
   // The transaction is complete. Delivers nothing. What it throws becomes the failure.
   virtual void note(const StoreLock& lock) = 0;
 
-  // Deletes the file of what was removed, on this thread. Does not throw. An invalidation waits for it.
+  // Deletes the file of what was removed, on this thread, unless the store is closed by then. Does not throw. An
+  // invalidation that blocks waits for it.
   virtual void deleteFile() {}
 
   // The rest, with no lock held: hands on, or fulfils the promise, with the failure if there is one.
