@@ -62,7 +62,7 @@ trap 'exit 143' TERM
 
 # ---- packages -----------------------------------------------------------------------------------------------------------
 
-build_packages=(g++ cmake ninja-build ccache git libsqlite3-dev libgoogle-glog-dev nlohmann-json3-dev
+build_packages=(g++ cmake ninja-build ccache git libsqlite3-dev zlib1g-dev libgoogle-glog-dev nlohmann-json3-dev
   libgtest-dev libgmock-dev libcli11-dev libjs-chart.js)
 
 # Prints those of the named packages that are not installed.

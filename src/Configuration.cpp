@@ -192,6 +192,13 @@ PruneStrategyIdentifier parsePruneStrategy(const string& text) {
   throw std::invalid_argument("Invalid prune '" + text + "', use null, lru or video_download.");
 }
 
+Durability parseDurability(const string& text) {
+  if (text == "relaxed") return Durability::Relaxed;
+  if (text == "safe") return Durability::Safe;
+  if (text == "synced") return Durability::Synced;
+  throw std::invalid_argument("Invalid durability '" + text + "', use relaxed, safe or synced.");
+}
+
 // Anything but an integer counts as absent.
 std::optional<std::int64_t> readCapacity(const Node& store) {
   const Node* member = store.find("capacity");
@@ -219,17 +226,19 @@ std::shared_ptr<const StoreDefinition> readStore(const string& managerName, cons
   const auto inlineData = read<bool>(store, "inline_data", false);
   const std::uint32_t staleAge = parseDuration(read<string>(store, "stale_age", kDefaultStaleAge));
   if (type == StoreDefinition::Type::PKVS) {
+    const auto durability = parseDurability(read<string>(store, "durability", "relaxed"));
     return std::make_shared<const PKVSDefinition>(name, managerName, localeSensitive, hasVersion, version,
-                                                  readCapacity(store), inlineData, staleAge);
+                                                  readCapacity(store), inlineData, staleAge, durability);
   }
 
   const std::uint32_t lruSizeLimit = parseSize(read<string>(store, "lru_size_limit", "0MB"));
   const std::uint32_t survivalSize = parseSize(read<string>(store, "survival_size", "0MB"));
   const auto metadataFactory = parseMetadataFactory(read<string>(store, "metadata_factory", "null"));
   const auto pruneStrategy = parsePruneStrategy(read<string>(store, "prune_strategy", "null"));
+  const auto durability = parseDurability(read<string>(store, "durability", "relaxed"));
   return std::make_shared<const DiskCacheDefinition>(name, managerName, localeSensitive, hasVersion, version,
                                                      readCapacity(store), staleAge, inlineData, lruSizeLimit,
-                                                     survivalSize, metadataFactory, pruneStrategy);
+                                                     survivalSize, metadataFactory, pruneStrategy, durability);
 }
 
 }  // namespace
@@ -255,18 +264,19 @@ UnmanagedStoreDefinition::UnmanagedStoreDefinition(const string& name_, const st
 
 PKVSDefinition::PKVSDefinition(const string& name_, const string& managerName_, bool localeSensitive_, bool hasVersion_,
                                unsigned int version_, std::optional<std::int64_t> capacity_, bool inlineData_,
-                               std::uint32_t staleAge_)
+                               std::uint32_t staleAge_, Durability durability_)
     : StoreDefinition(Type::PKVS, name_, managerName_, localeSensitive_, hasVersion_, version_, 0, false, true),
       capacity(capacity_),
       inlineData(inlineData_),
-      staleAge(staleAge_) {}
+      staleAge(staleAge_),
+      durability(durability_) {}
 
 DiskCacheDefinition::DiskCacheDefinition(const string& name_, const string& managerName_, bool localeSensitive_,
                                          bool hasVersion_, unsigned int version_, std::optional<std::int64_t> capacity_,
                                          std::uint32_t staleAge_, bool inlineData_, std::uint32_t lruSizeLimit_,
                                          std::uint32_t survivalSize_,
                                          ExtendedMetadataFactoryIdentifier metadataFactory_,
-                                         PruneStrategyIdentifier pruneStrategy_)
+                                         PruneStrategyIdentifier pruneStrategy_, Durability durability_)
     : StoreDefinition(Type::DiskCache, name_, managerName_, localeSensitive_, hasVersion_, version_, lruSizeLimit_,
                       true, true),
       capacity(capacity_),
@@ -275,7 +285,8 @@ DiskCacheDefinition::DiskCacheDefinition(const string& name_, const string& mana
       lruSizeLimit(lruSizeLimit_),
       survivalSize(survivalSize_),
       metadataFactory(metadataFactory_),
-      pruneStrategy(pruneStrategy_) {}
+      pruneStrategy(pruneStrategy_),
+      durability(durability_) {}
 
 Configuration::Configuration(const string& json) {
   const Node document = parseDocument(json);

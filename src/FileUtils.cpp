@@ -102,6 +102,38 @@ bool isConcatenation(std::string_view whole, std::string_view first, std::string
          whole.substr(first.size()) == second;
 }
 
+// A descriptor that is closed on every way out.
+class Descriptor {
+ public:
+  Descriptor(const string& path, int flags) : descriptor_(openDescriptor(path, flags)) {}
+  ~Descriptor() {
+    if (descriptor_ != -1) (void)::close(descriptor_);
+  }
+  Descriptor(const Descriptor&) = delete;
+  Descriptor& operator=(const Descriptor&) = delete;
+
+  int get() const { return descriptor_; }
+
+  // Closing may be what writes the last bytes, so it can fail for want of space.
+  void close() {
+    if (::close(std::exchange(descriptor_, -1)) != 0) throwSystemError("Could not close file", errno);
+  }
+
+ private:
+  int descriptor_;
+};
+
+void writeAll(const Descriptor& file, const std::vector<unsigned char>& data) {
+  for (std::size_t written = 0; written < data.size();) {
+    const auto count = ::write(file.get(), data.data() + written, data.size() - written);
+    if (count >= 0) {
+      written += static_cast<std::size_t>(count);
+    } else if (errno != EINTR) {
+      throwSystemError("File write failed", errno);
+    }
+  }
+}
+
 // A directory stream that is closed on every way out.
 class DirectoryStream {
  public:
@@ -302,6 +334,31 @@ std::vector<string> FileUtils::listOtherEntries(const string& path) {
     if (!isListed) paths.push_back(combinePath(path, entry->d_name));
   }
   return paths;
+}
+
+void FileUtils::createFile(const string& path, const std::vector<unsigned char>& data) {
+  Descriptor file(path, O_WRONLY | O_CREAT | O_EXCL);
+  try {
+    writeAll(file, data);
+    file.close();
+  } catch (...) {
+    (void)std::remove(path.c_str());
+    throw;
+  }
+}
+
+void FileUtils::sync(const string& path) {
+  const Descriptor file(path, O_RDONLY);
+  if (::fsync(file.get()) != 0) throwSystemError("Could not sync file", errno);
+}
+
+std::vector<string> FileUtils::listFiles(const string& path) {
+  std::vector<string> names;
+  DirectoryStream directory(::opendir(path.c_str()));
+  while (const dirent* entry = directory.next()) {
+    if (entry->d_type == DT_REG) names.emplace_back(entry->d_name);
+  }
+  return names;
 }
 
 }  // namespace velmora::mobile::xplat::cellar

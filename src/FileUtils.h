@@ -90,6 +90,16 @@ class CELLAR_EXPORT FileUtils {
   // The full paths of what `listDirectory` leaves out: fifos, sockets, devices, and entries whose type the file system
   // does not tell. None for what is not a directory, a link among them, and for one that cannot be read.
   virtual std::vector<std::string> listOtherEntries(const std::string& path);
+
+  // Creates a file that is not there yet: code `EEXIST` if something is, a dangling link too. When it fails in the
+  // middle, what was written is removed again as far as possible.
+  virtual void createFile(const std::string& path, const std::vector<unsigned char>& data);
+
+  // Waits until what a file contains, or the names in a directory, are on the medium and outlive a power cut.
+  virtual void sync(const std::string& path);
+
+  // The bare names of the regular files in a directory, in the file system's order. Looks at none of them.
+  virtual std::vector<std::string> listFiles(const std::string& path);
 };
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -7,6 +7,7 @@
 #include <string>
 #include <unordered_map>
 
+#include "Durability.h"
 #include "Export.h"
 #include "executor/TaskQueueFactory.h"
 
@@ -81,7 +82,8 @@ class CELLAR_EXPORT UnmanagedStoreDefinition : public StoreDefinition {
 class CELLAR_EXPORT PKVSDefinition : public StoreDefinition {
  public:
   PKVSDefinition(const std::string& name, const std::string& managerName, bool localeSensitive, bool hasVersion,
-                 unsigned int version, std::optional<std::int64_t> capacity, bool inlineData, std::uint32_t staleAge);
+                 unsigned int version, std::optional<std::int64_t> capacity, bool inlineData, std::uint32_t staleAge,
+                 Durability durability = Durability::Relaxed);
 
   std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,
                                      std::shared_ptr<TaskQueueFactory> taskQueueFactory,
@@ -95,6 +97,7 @@ class CELLAR_EXPORT PKVSDefinition : public StoreDefinition {
   const std::optional<std::int64_t> capacity;  // items; absent: no limit
   const bool inlineData;                       // values live in the manifest instead of in files
   const std::uint32_t staleAge;                // seconds without access after which an item expires
+  const Durability durability;
 };
 
 // A key-value store with a size limit. Its `maxSize` is `lruSizeLimit`.
@@ -103,7 +106,8 @@ class CELLAR_EXPORT DiskCacheDefinition : public StoreDefinition {
   DiskCacheDefinition(const std::string& name, const std::string& managerName, bool localeSensitive, bool hasVersion,
                       unsigned int version, std::optional<std::int64_t> capacity, std::uint32_t staleAge,
                       bool inlineData, std::uint32_t lruSizeLimit, std::uint32_t survivalSize,
-                      ExtendedMetadataFactoryIdentifier metadataFactory, PruneStrategyIdentifier pruneStrategy);
+                      ExtendedMetadataFactoryIdentifier metadataFactory, PruneStrategyIdentifier pruneStrategy,
+                      Durability durability = Durability::Relaxed);
 
   std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,
                                      std::shared_ptr<TaskQueueFactory> taskQueueFactory,
@@ -121,6 +125,7 @@ class CELLAR_EXPORT DiskCacheDefinition : public StoreDefinition {
   const std::uint32_t survivalSize;            // bytes that a prune leaves when the device is short of space
   const ExtendedMetadataFactoryIdentifier metadataFactory;
   const PruneStrategyIdentifier pruneStrategy;
+  const Durability durability;
 };
 
 // One configured manager: a directory in an area, holding stores.

@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 
+#include "Durability.h"
 #include "executor/TaskQueueFactory.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -14,6 +15,7 @@ class AnalyticsEventReporter;
 class DiskCacheManifestInterface;
 class ExtendedMetadataFactory;
 class FileUtils;
+class IncidentReporter;
 class PruneStrategyBase;
 class TrashCollector;
 
@@ -22,7 +24,8 @@ struct StoreServices {
   std::shared_ptr<TaskQueueFactory> queues;
   std::shared_ptr<TrashCollector> trash;
   std::shared_ptr<FileUtils> files;
-  std::shared_ptr<AnalyticsEventReporter> analytics;  // null: nothing is reported
+  std::shared_ptr<AnalyticsEventReporter> analytics;    // null: nothing is reported
+  std::shared_ptr<const IncidentReporter> incidents{};  // null: incidents are only logged
 };
 
 struct KeyValueStoreOptions {
@@ -46,6 +49,9 @@ struct KeyValueStoreOptions {
   std::shared_ptr<DiskCacheManifestInterface> manifest;              // null: one in the directory, created on first use
   std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory;  // null: metadata is not read back
   std::shared_ptr<PruneStrategyBase> pruneStrategy;                  // null: least recently used first
+
+  // A safe or synced store keeps its own manifest: with one of yours its creation throws `std::invalid_argument`.
+  Durability durability = Durability::Relaxed;
 };
 
 struct DiskCacheOptions : KeyValueStoreOptions {

@@ -43,6 +43,12 @@ const char* nameOf(Operation operation) {
       return "isSymLink";
     case Operation::ListOtherEntries:
       return "listOtherEntries";
+    case Operation::CreateFile:
+      return "createFile";
+    case Operation::Sync:
+      return "sync";
+    case Operation::ListFiles:
+      return "listFiles";
   }
   return "";
 }
@@ -118,7 +124,7 @@ std::vector<unsigned char> FaultyFileUtils::readFile(const std::string& path) {
 }
 
 void FaultyFileUtils::writeFile(const std::string& path, const std::vector<unsigned char>& data) {
-  const std::optional<Failure> failure = failureOfWrite(path, data.size());
+  const std::optional<Failure> failure = failureOfWrite(Operation::WriteFile, path, data.size());
   if (!failure) return FileUtils::writeFile(path, data);
   if (failure->bytesWritten) {
     const auto length = static_cast<std::ptrdiff_t>(*failure->bytesWritten);
@@ -184,6 +190,26 @@ std::vector<std::string> FaultyFileUtils::listOtherEntries(const std::string& pa
   return FileUtils::listOtherEntries(path);
 }
 
+void FaultyFileUtils::createFile(const std::string& path, const std::vector<unsigned char>& data) {
+  const std::optional<Failure> failure = failureOfWrite(Operation::CreateFile, path, data.size());
+  if (!failure) return FileUtils::createFile(path, data);
+  if (failure->bytesWritten) {
+    const auto length = static_cast<std::ptrdiff_t>(*failure->bytesWritten);
+    FileUtils::createFile(path, {data.begin(), data.begin() + length});
+  }
+  fail(failure->errnoCode);
+}
+
+void FaultyFileUtils::sync(const std::string& path) {
+  failIfChosen(Operation::Sync, path);
+  FileUtils::sync(path);
+}
+
+std::vector<std::string> FaultyFileUtils::listFiles(const std::string& path) {
+  failIfChosen(Operation::ListFiles, path);
+  return FileUtils::listFiles(path);
+}
+
 void FaultyFileUtils::failIfChosen(Operation operation, const std::string& path, const std::string& rest) {
   const std::optional<int> failure = failureOf(operation, path, rest);
   if (failure) fail(*failure);
@@ -216,8 +242,9 @@ std::optional<int> FaultyFileUtils::nextFailure(const std::lock_guard<std::mutex
   return std::nullopt;
 }
 
-std::optional<FaultyFileUtils::Failure> FaultyFileUtils::failureOfWrite(const std::string& path, std::size_t length) {
-  const std::optional<int> failure = failureOf(Operation::WriteFile, path);
+std::optional<FaultyFileUtils::Failure> FaultyFileUtils::failureOfWrite(Operation operation, const std::string& path,
+                                                                        std::size_t length) {
+  const std::optional<int> failure = failureOf(operation, path);
   const std::lock_guard<std::mutex> lock(mutex_);
   if (failure) return Failure{*failure, tearsFailingWrites_ ? std::make_optional(length / 2) : std::nullopt};
   if (!tear_) return std::nullopt;

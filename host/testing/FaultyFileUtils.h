@@ -31,6 +31,9 @@ enum class Operation {
   ListDirectory,
   IsSymLink,
   ListOtherEntries,
+  CreateFile,
+  Sync,
+  ListFiles,
 };
 
 // The real file system; records every call, and makes chosen ones fail before they change anything. A failing operation
@@ -56,10 +59,10 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
   // The n-th call from now fails, whatever it is; 1 is the next. Replaces an earlier `failNth` that is still pending.
   void failNth(std::size_t n, int errnoCode);
 
-  // From now on a failing `writeFile` writes the first half of the data.
+  // From now on a failing `writeFile` or `createFile` writes the first half of the data.
   void tearFailingWrites(bool tears);
 
-  // The next `writeFile` writes only the first `bytes` bytes and then fails, as on a disk that fills up.
+  // The next of these two writes only the first `bytes` bytes and then fails, as on a disk that fills up.
   void tearNextWrite(std::size_t bytes, int errnoCode);
 
   // From now on nothing fails. The recorded calls remain.
@@ -91,6 +94,9 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
   std::vector<FileUtils::Info> listDirectory(const std::string& path) override;
   bool isSymLink(const std::string& path) override;
   std::vector<std::string> listOtherEntries(const std::string& path) override;
+  void createFile(const std::string& path, const std::vector<unsigned char>& data) override;
+  void sync(const std::string& path) override;
+  std::vector<std::string> listFiles(const std::string& path) override;
 
  private:
   struct Failure {
@@ -101,7 +107,7 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
   void failIfChosen(Operation operation, const std::string& path, const std::string& rest = "");
   std::optional<int> failureOf(Operation operation, const std::string& path, const std::string& rest = "");
   std::optional<int> nextFailure(const std::lock_guard<std::mutex>& lock, Operation operation, const std::string& path);
-  std::optional<Failure> failureOfWrite(const std::string& path, std::size_t length);
+  std::optional<Failure> failureOfWrite(Operation operation, const std::string& path, std::size_t length);
 
   mutable std::mutex mutex_;  // guards everything below
   std::vector<std::pair<Operation, std::string>> calls_;

@@ -1,9 +1,9 @@
-#include "host/FileNames.h"
+#include "FileNames.h"
 
 #include <cstddef>
 #include <stdexcept>
 
-namespace velmora::mobile::xplat::cellar::host {
+namespace velmora::mobile::xplat::cellar {
 
 namespace {
 
@@ -62,4 +62,4 @@ std::string decodeFileName(const std::string& name) {
   return bytes;
 }
 
-}  // namespace velmora::mobile::xplat::cellar::host
+}  // namespace velmora::mobile::xplat::cellar
