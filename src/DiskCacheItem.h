@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -43,6 +44,9 @@ struct CELLAR_EXPORT DiskCacheItem {
   std::int32_t modificationDate = 0;                   // seconds since the Unix epoch
   std::int32_t lastAccessDate = 0;                     // seconds since the Unix epoch
   std::shared_ptr<ExtendedMetadata> extendedMetadata;  // may be empty; not to be changed once a store has the item
+
+  // Of key and value, for an item that a safe store has written.
+  std::optional<std::uint32_t> checksum;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

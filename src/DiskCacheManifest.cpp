@@ -11,6 +11,7 @@
 #include "SQLiteManifestPersistence.h"
 #include "manifest/ManifestRecords.h"
 #include "manifest/ManifestUndo.h"
+#include "manifest/StoreTime.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -18,8 +19,6 @@ namespace {
 
 constexpr std::int64_t kFlushIntervalNanoseconds = 120'000'000'000;
 constexpr std::size_t kMaxPendingAccessDates = 512;
-
-std::int32_t now() { return static_cast<std::int32_t>(Clock::now()); }
 
 }  // namespace
 
@@ -33,6 +32,23 @@ std::optional<ReplacedItem> DiskCacheManifestInterface::replaceItem(const DiskCa
 
 bool DiskCacheManifestInterface::changeTogether(const std::function<void()>& /*changes*/) { return false; }
 
+void DiskCacheManifestInterface::storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData) {
+  setItem(item);
+  if (inlineData != nullptr) setInlineData(item.key, *inlineData);
+}
+
+void DiskCacheManifestInterface::changeTogetherOrThrow(const std::function<void()>& changes) { changes(); }
+
+std::int64_t DiskCacheManifestInterface::currentDate() { return Clock::now(); }
+
+bool DiskCacheManifestInterface::hasMoved() { return false; }
+
+bool DiskCacheManifestInterface::isSound() { return true; }
+
+void DiskCacheManifestInterface::release() {}
+
+void DiskCacheManifestInterface::reload() { load(); }
+
 std::shared_ptr<DiskCacheManifest> DiskCacheManifest::createDiskCacheManifest(
     const std::string& path, std::shared_ptr<AsyncExecutor> executor, std::shared_ptr<ExtendedMetadataFactory> factory,
     std::shared_ptr<PruneStrategyBase> strategy) {
@@ -44,9 +60,15 @@ std::shared_ptr<DiskCacheManifest> DiskCacheManifest::createDiskCacheManifest(
 DiskCacheManifest::DiskCacheManifest(std::unique_ptr<ManifestPersistence> persistence,
                                      std::shared_ptr<AsyncExecutor> executor,
                                      std::shared_ptr<PruneStrategyBase> strategy)
+    : DiskCacheManifest(std::move(persistence), std::move(executor), std::move(strategy), Durability::Relaxed) {}
+
+DiskCacheManifest::DiskCacheManifest(std::unique_ptr<ManifestPersistence> persistence,
+                                     std::shared_ptr<AsyncExecutor> executor,
+                                     std::shared_ptr<PruneStrategyBase> strategy, Durability durability)
     : persistence_(std::move(persistence)),
       executor_(std::move(executor)),
-      records_(std::make_unique<ManifestRecords>(std::move(strategy))) {}
+      records_(std::make_unique<ManifestRecords>(std::move(strategy))),
+      time_(durability == Durability::Relaxed ? nullptr : std::make_unique<StoreTime>()) {}
 
 DiskCacheManifest::~DiskCacheManifest() {
   try {
@@ -75,6 +97,7 @@ void DiskCacheManifest::load() {
       records_->reserve(records.size());
       for (auto& record : records) {
         if (records_->find(record->key) == nullptr) records_->store(*record);
+        if (time_ != nullptr) time_->noteDateOf(*record);
         record.reset();  // so that the two forms of all records are never in memory together
       }
       loaded_ = true;
@@ -106,17 +129,66 @@ std::optional<ReplacedItem> DiskCacheManifest::replaceItem(const DiskCacheItem& 
 }
 
 bool DiskCacheManifest::changeTogether(const std::function<void()>& changes) {
+  try {
+    return change(changes);
+  } catch (...) {  // whoever makes the changes one by one finds out for which of them it matters
+    return false;
+  }
+}
+
+void DiskCacheManifest::changeTogetherOrThrow(const std::function<void()>& changes) {
+  if (!change(changes)) changes();
+}
+
+bool DiskCacheManifest::change(const std::function<void()>& changes) {
   const ItemsLock lock(itemsMutex_);
   if (!loaded_) return false;
   undo_ = std::make_unique<ManifestUndo>();
   bool haveChanged = false;
   try {
     haveChanged = persistence_->performTogether(changes);
-  } catch (...) {  // whoever makes the changes one by one finds out for which of them it matters
+  } catch (...) {
     std::exchange(undo_, nullptr)->takeBack(*records_, pendingAccessDates_);
+    throw;
   }
   undo_.reset();
   return haveChanged;
+}
+
+void DiskCacheManifest::storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData) {
+  const ItemsLock lock(itemsMutex_);
+  persistence_->storeItem(item, inlineData);
+  noteFormer(lock, item.key);
+  pendingAccessDates_.erase(item.key);
+  records_->store(item);
+}
+
+std::int32_t DiskCacheManifest::now(const ItemsLock& /*lock*/) {
+  return static_cast<std::int32_t>(time_ == nullptr ? Clock::now() : time_->now());
+}
+
+std::int64_t DiskCacheManifest::currentDate() {
+  const ItemsLock lock(itemsMutex_);
+  return time_ == nullptr ? Clock::now() : time_->now();
+}
+
+bool DiskCacheManifest::hasMoved() { return persistence_->hasMoved(); }
+
+bool DiskCacheManifest::isSound() { return persistence_->isSound(); }
+
+void DiskCacheManifest::release() { persistence_->release(); }
+
+void DiskCacheManifest::reload() {
+  {
+    const std::lock_guard<std::mutex> loadLock(loadMutex_);
+    const ItemsLock lock(itemsMutex_);
+    const auto records = persistence_->getAllItems();
+    records_->clear();
+    pendingAccessDates_.clear();
+    for (const auto& record : records) records_->store(*record);
+    loaded_ = true;
+  }
+  armFlushTimer();
 }
 
 // To be called before a record in memory changes.
@@ -158,7 +230,7 @@ void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
   {
     const ItemsLock lock(itemsMutex_);
     if (findOrRead(lock, key) == nullptr) return;
-    const std::int32_t date = now();
+    const std::int32_t date = now(lock);
     records_->setLastAccessDate(key, date);
     pendingAccessDates_[key] = date;
     if (!isFlushDue(lock)) return;
@@ -273,7 +345,9 @@ const ManifestRecord* DiskCacheManifest::findOrRead(const ItemsLock& /*lock*/, c
   const ManifestRecord* const record = records_->find(key);
   if (record != nullptr || loaded_) return record;
   const auto item = persistence_->getItem(key);
-  return item == nullptr ? nullptr : records_->store(*item);
+  if (item == nullptr) return nullptr;
+  if (time_ != nullptr) time_->noteDateOf(*item);
+  return records_->store(*item);
 }
 
 // The persistence first: when it fails, nothing has changed.

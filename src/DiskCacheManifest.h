@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "DiskCacheItem.h"
+#include "Durability.h"
 #include "Export.h"
 #include "ManifestPersistence.h"
 #include "PruneStrategy.h"
@@ -21,6 +22,7 @@ class ExtendedMetadataFactory;
 class ManifestRecord;
 class ManifestRecords;
 class ManifestUndo;
+class StoreTime;
 
 // The record that another one has replaced, null if there was none, and its inline value if that was asked for.
 struct CELLAR_EXPORT ReplacedItem {
@@ -62,6 +64,29 @@ class CELLAR_EXPORT DiskCacheManifestInterface : public std::enable_shared_from_
   // or their completion, has failed. They can then be made one by one. Other threads' operations wait. Not nested.
   virtual bool changeTogether(const std::function<void()>& changes);
 
+  // As `setItem`, with the item's checksum and its inline value; null: it has none.
+  virtual void storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData);
+
+  // As `changeTogether`, once this manifest is loaded, but throws what has failed. Here the changes are made one by
+  // one.
+  virtual void changeTogetherOrThrow(const std::function<void()>& changes);
+
+  // By which items are dated and expire, in seconds since the Unix epoch: the time on the clock, as here, unless that
+  // cannot be right.
+  virtual std::int64_t currentDate();
+
+  // Whether somebody has removed or replaced what the records are kept in.
+  virtual bool hasMoved();
+
+  // Whether nothing is found wrong with it when all of it is read. Here: true.
+  virtual bool isSound();
+
+  // Lets go of what the records are kept in, until the next operation.
+  virtual void release();
+
+  // Reads all records again, from what is there by now. Those in memory are dropped.
+  virtual void reload();
+
   // A weak pointer to this manifest as a T; empty when it is not owned by a shared pointer, or no T.
   template <class T> std::weak_ptr<T> weak_from_this() { return std::dynamic_pointer_cast<T>(weak_from_this().lock()); }
   using std::enable_shared_from_this<DiskCacheManifestInterface>::weak_from_this;
@@ -90,6 +115,11 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   // Over any persistence. The manifest must be owned by a shared pointer.
   DiskCacheManifest(std::unique_ptr<ManifestPersistence> persistence, std::shared_ptr<AsyncExecutor> executor,
                     std::shared_ptr<PruneStrategyBase> strategy);
+
+  // The same for a store of that durability: in a safe or synced one dates never go backwards, and a clock that cannot
+  // be right is not believed.
+  DiskCacheManifest(std::unique_ptr<ManifestPersistence> persistence, std::shared_ptr<AsyncExecutor> executor,
+                    std::shared_ptr<PruneStrategyBase> strategy, Durability durability);
   ~DiskCacheManifest() override;
   DiskCacheManifest(const DiskCacheManifest&) = delete;
   DiskCacheManifest& operator=(const DiskCacheManifest&) = delete;
@@ -149,6 +179,14 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   // Only once it is loaded, and if the persistence can do it.
   bool changeTogether(const std::function<void()>& changes) override;
 
+  void storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData) override;
+  void changeTogetherOrThrow(const std::function<void()>& changes) override;
+  std::int64_t currentDate() override;
+  bool hasMoved() override;
+  bool isSound() override;
+  void release() override;
+  void reload() override;
+
   std::uint32_t size() override;   // total bytes of the items in memory
   std::uint32_t count() override;  // number of items in memory
   bool isLoaded() override;
@@ -159,6 +197,8 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   using ItemsLock = std::lock_guard<std::recursive_mutex>;  // of the items mutex
   using Next = std::function<const ManifestRecord*()>;
 
+  std::int32_t now(const ItemsLock& lock);
+  bool change(const std::function<void()>& changes);
   void noteFormer(const ItemsLock& lock, const std::string& key);
   void set(const ItemsLock& lock, const DiskCacheItem& item);
   std::optional<ReplacedItem> whatIsReplaced(const ItemsLock& lock, const std::string& key, bool withInlineData);
@@ -183,6 +223,7 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   std::mutex loadMutex_;             // keeps load, clear and removal apart; taken before itemsMutex_
   std::recursive_mutex itemsMutex_;  // guards the below; also held around changes that are made together
   const std::unique_ptr<ManifestRecords> records_;
+  const std::unique_ptr<StoreTime> time_;  // null: the clock is believed
   bool loaded_ = false;
   bool invalidated_ = false;
   std::unique_ptr<ManifestUndo> undo_;  // of the changes that are being made together; null otherwise

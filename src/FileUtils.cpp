@@ -347,6 +347,17 @@ void FileUtils::createFile(const string& path, const std::vector<unsigned char>&
   }
 }
 
+void FileUtils::readPieces(const string& path,
+                           const std::function<void(const unsigned char* bytes, std::size_t count)>& consume) {
+  constexpr std::size_t kPiece = std::size_t{64} << 10U;
+  File file = File::forReading(path);
+  throwUnlessRegular(file);
+  (void)std::setvbuf(file.get(), nullptr, _IONBF, 0);
+  std::vector<unsigned char> piece(kPiece);
+  while (const std::size_t count = std::fread(piece.data(), 1, piece.size(), file.get())) consume(piece.data(), count);
+  if (std::ferror(file.get()) != 0) throwSystemError("File read failed", errno);
+}
+
 void FileUtils::sync(const string& path) {
   const Descriptor file(path, O_RDONLY);
   if (::fsync(file.get()) != 0) throwSystemError("Could not sync file", errno);

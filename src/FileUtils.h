@@ -1,5 +1,7 @@
 #pragma once
 
+#include <cstddef>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -94,6 +96,10 @@ class CELLAR_EXPORT FileUtils {
   // Creates a file that is not there yet: code `EEXIST` if something is, a dangling link too. When it fails in the
   // middle, what was written is removed again as far as possible.
   virtual void createFile(const std::string& path, const std::vector<unsigned char>& data);
+
+  // The bytes of a regular file, piece by piece. Otherwise as `readFile`.
+  virtual void readPieces(const std::string& path,
+                          const std::function<void(const unsigned char* bytes, std::size_t count)>& consume);
 
   // Waits until what a file contains, or the names in a directory, are on the medium and outlive a power cut.
   virtual void sync(const std::string& path);

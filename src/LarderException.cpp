@@ -32,6 +32,15 @@ SQLiteStoreException::SQLiteStoreException(const std::string& message, int code)
 SQLiteStoreCorruptedException::SQLiteStoreCorruptedException(const std::string& message, int code)
     : SQLiteStoreException(message, code) {}
 
+DamagedValueException::DamagedValueException(const std::string& store, const std::string& key)
+    : LarderException("The value of '" + key + "' in store '" + store + "' is damaged.", "QZDamagedValueErrorDomain",
+                      0),
+      store_(store),
+      key_(key) {}
+
+const std::string& DamagedValueException::store() const noexcept { return store_; }
+const std::string& DamagedValueException::key() const noexcept { return key_; }
+
 InvalidatedException::InvalidatedException(const std::string& message)
     : LarderException(message, "QZInvalidatedExceptionErrorDomain", 0) {}
 
@@ -45,6 +54,7 @@ ManifestPersistenceException::~ManifestPersistenceException() = default;
 ManifestCorruptedException::~ManifestCorruptedException() = default;
 SQLiteStoreException::~SQLiteStoreException() = default;
 SQLiteStoreCorruptedException::~SQLiteStoreCorruptedException() = default;
+DamagedValueException::~DamagedValueException() = default;
 InvalidatedException::~InvalidatedException() = default;
 
 }  // namespace velmora::mobile::xplat::cellar

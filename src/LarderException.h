@@ -78,6 +78,21 @@ class CELLAR_EXPORT SQLiteStoreCorruptedException : public SQLiteStoreException 
   ~SQLiteStoreCorruptedException() override;
 };
 
+// A value whose bytes are not those that were stored. Code 0.
+class CELLAR_EXPORT DamagedValueException : public LarderException {
+ public:
+  // "The value of '" + key + "' in store '" + store + "' is damaged."
+  DamagedValueException(const std::string& store, const std::string& key);
+  ~DamagedValueException() override;
+
+  const std::string& store() const noexcept;
+  const std::string& key() const noexcept;
+
+ private:
+  std::string store_;
+  std::string key_;
+};
+
 // Work was asked of a store that has been invalidated. Code 0.
 class CELLAR_EXPORT InvalidatedException : public LarderException {
  public:

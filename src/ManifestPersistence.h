@@ -56,6 +56,19 @@ class CELLAR_EXPORT ManifestPersistence {
   // Not nested.
   virtual bool performTogether(const std::function<void()>& operations);
 
+  // Replaces the whole record of the item's key, its checksum and its inline value (null: none) included. Here in two
+  // operations, and without the checksum.
+  virtual void storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData);
+
+  // Whether the medium is not the one any more that its path leads to: somebody has removed or replaced it.
+  virtual bool hasMoved() const;
+
+  // Whether nothing is found wrong with the medium when all of it is read. Here: true.
+  virtual bool isSound() const;
+
+  // Lets go of the medium until the next operation.
+  virtual void release();
+
  protected:
   ManifestPersistence() = default;
   ManifestPersistence(const ManifestPersistence&) = default;

@@ -2,25 +2,29 @@
 
 #include <glog/logging.h>
 
+#include <functional>
 #include <future>
 #include <stdexcept>
 #include <utility>
 
-#include "FileUtils.h"
 #include "LarderException.h"
 #include "keyvalue/BatchRemoval.h"
 #include "keyvalue/Clearing.h"
 #include "keyvalue/FileQueue.h"
 #include "keyvalue/GroupCommit.h"
-#include "keyvalue/InlineWriter.h"
+#include "keyvalue/InPlaceWrites.h"
 #include "keyvalue/ItemRemover.h"
+#include "keyvalue/Leftovers.h"
+#include "keyvalue/Purge.h"
+#include "keyvalue/ReplacingWrites.h"
 #include "keyvalue/Rollback.h"
+#include "keyvalue/Salvage.h"
 #include "keyvalue/StaleItemRemoval.h"
 #include "keyvalue/StoreContext.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFetcher.h"
 #include "keyvalue/ValueFiles.h"
-#include "keyvalue/ValueWriter.h"
+#include "keyvalue/VersionedFiles.h"
 #include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
@@ -30,10 +34,10 @@ namespace velmora::mobile::xplat::cellar {
 struct PersistentKeyValueStore::Parts {
   StoreContext context;
   WritesInFlight writes;
-  WorkQueue workQueue{context};
   FileQueue fileQueue{context.fileQueue};
+  WorkQueue workQueue{context, fileQueue};
   ValueFiles files{context};
-  StoreManifest manifest{context, writes};
+  StoreManifest manifest{context};
   GroupCommit groupCommit{context, manifest, workQueue};
   Rollback rollback{context, manifest, writes, files};
   ItemRemover remover{context, manifest, writes, fileQueue, files, groupCommit};
@@ -41,11 +45,32 @@ struct PersistentKeyValueStore::Parts {
   Clearing clearing{context, manifest, writes, batches};
   StaleItemRemoval staleItems{context, manifest, batches};
   ValueFetcher fetcher{context, manifest, writes, workQueue, fileQueue, files};
-  ValueWriter writer{context, manifest, writes, fileQueue, files, remover, clearing, rollback, groupCommit};
-  InlineWriter inlineWriter{context, manifest, writes, files, remover, clearing, rollback, groupCommit};
+
+  // What its durability decides.
+  std::unique_ptr<VersionedFiles> versions{};  // null in a relaxed store, and the next one too
+  std::unique_ptr<Leftovers> leftovers{};
+  std::unique_ptr<ManifestRecovery> recovery{};
+  std::unique_ptr<WritePath> writePath{};
 
   Parts(Store& store, KeyValueStoreOptions options, const StoreServices& services)
-      : context(store, std::move(options), services) {}
+      : context(store, std::move(options), services) {
+    context.isSafe() ? makeSafe() : makeRelaxed();
+    manifest.setRecovery(*recovery);
+  }
+
+  void makeRelaxed() {
+    recovery = std::make_unique<Purge>(context, manifest, writes);
+    writePath = std::make_unique<InPlaceWrites>(context, manifest, writes, fileQueue, files, remover, clearing,
+                                                rollback, groupCommit);
+  }
+
+  void makeSafe() {
+    versions = std::make_unique<VersionedFiles>(context);
+    leftovers = std::make_unique<Leftovers>(context, manifest, fileQueue, files, *versions);
+    recovery = std::make_unique<Salvage>(context, manifest, *versions);
+    writePath = std::make_unique<ReplacingWrites>(context, manifest, workQueue, fileQueue, files, *versions, remover,
+                                                  clearing, groupCommit);
+  }
 };
 
 // --- Creation ---
@@ -90,9 +115,11 @@ PersistentKeyValueStore::PersistentKeyValueStore(KeyValueStoreOptions options, c
 PersistentKeyValueStore::~PersistentKeyValueStore() { parts_->rollback.endAll(parts_->context.lock()); }
 
 void PersistentKeyValueStore::loadManifest() {
-  StaleItemRemoval& staleItems = parts_->staleItems;
-  parts_->context.workQueue->dispatch([weakItems = parts_->context.weak(staleItems)] {
-    if (const auto items = weakItems.lock()) items->loadThenArm();
+  parts_->context.workQueue->dispatch([weakThis = weak_from_this<PersistentKeyValueStore>()] {
+    const auto self = weakThis.lock();
+    if (self == nullptr) return;
+    self->parts_->staleItems.loadThenArm();
+    if (self->parts_->leftovers != nullptr) self->parts_->leftovers->remove();
   });
 }
 
@@ -100,13 +127,7 @@ void PersistentKeyValueStore::loadManifest() {
 
 Future<void> PersistentKeyValueStore::store(const std::string& key, const std::vector<unsigned char>& data,
                                             std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata) {
-  if (parts_->context.options.inlineData) return parts_->inlineWriter.store(key, data, std::move(extendedMetadata));
-  auto writeValue = [files = parts_->context.files,
-                     value = std::make_shared<const std::vector<unsigned char>>(data)](const std::string& filePath) {
-    files->writeFile(filePath, *value);
-    return static_cast<unsigned int>(value->size());
-  };
-  return parts_->writer.store(key, std::move(extendedMetadata), std::move(writeValue), true);
+  return parts_->writePath->store(key, data, std::move(extendedMetadata));
 }
 
 Future<void> PersistentKeyValueStore::store(const std::string& key,
@@ -119,16 +140,11 @@ Future<void> PersistentKeyValueStore::store(const std::string& key,
     promise.setException(std::make_exception_ptr(unsupported));
     return future;
   }
-  // A host's writer may take its time, or wait for an earlier store.
-  return parts_->writer.store(key, std::move(extendedMetadata), std::move(writer), false);
+  return parts_->writePath->store(key, std::move(writer), std::move(extendedMetadata));
 }
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetch(const std::string& key) {
-  // The loader runs from a task that holds the store.
-  return fetch(key, [&fetcher = parts_->fetcher](const std::shared_ptr<const DiskCacheItem>& item,
-                                                 const std::string& filePath, std::vector<unsigned char>& value) {
-    return fetcher.readValue(*item, filePath, value);
-  });
+  return parts_->fetcher.fetchFirst(std::vector<std::string>(1, key), nullptr);
 }
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetch(const std::string& key,
@@ -142,11 +158,12 @@ Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValue
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetch(const std::string& key,
                                                                                              Loader loader) {
-  return parts_->fetcher.fetchFirst(std::vector<std::string>(1, key), std::move(loader));
+  return fetchFirst(std::vector<std::string>(1, key), std::move(loader));
 }
 
 Future<std::unique_ptr<PersistentKeyValueStore::FetchResult>> PersistentKeyValueStore::fetchFirst(
     const std::vector<std::string>& keys, Loader loader) {
+  if (!loader) loader = [](const auto&...) -> bool { throw std::bad_function_call(); };
   return parts_->fetcher.fetchFirst(keys, std::move(loader));
 }
 
@@ -218,7 +235,7 @@ Future<void> PersistentKeyValueStore::deleteBatch(const std::vector<std::string>
 void PersistentKeyValueStore::handleCorruptedManifest(const LarderException& error) {
   const StoreLock lock = parts_->context.lock();
   throwIfInvalid();
-  if (!parts_->manifest.purge(lock, error)) throw LarderException(error.description(), error.domain(), error.code());
+  parts_->manifest.recover(lock, error);
 }
 
 void PersistentKeyValueStore::reportSize() { parts_->manifest.reportSize(); }

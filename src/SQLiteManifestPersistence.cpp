@@ -1,5 +1,6 @@
 #include "SQLiteManifestPersistence.h"
 
+#include <algorithm>
 #include <array>
 #include <cstddef>
 #include <cstdint>
@@ -9,6 +10,7 @@
 
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
+#include "manifest/Schema.h"
 #include "manifest/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -20,22 +22,7 @@ constexpr int kReadOnly = 8;
 // And for a statement that was not carried out because another one had failed.
 constexpr int kAbort = 4;
 
-constexpr const char* tableName = "LarderManifest";
-
-constexpr const char* createTable =
-    "PRAGMA journal_mode = WAL;"
-    "PRAGMA synchronous = NORMAL;"
-    "CREATE TABLE IF NOT EXISTS LarderManifest ("
-    "key               TEXT,   "
-    "filename          TEXT,   "
-    "size              INTEGER,   "
-    "has_inline_data   BOOLEAN,   "
-    "inline_data       BLOB,   "
-    "modification_date INTEGER,   "
-    "last_access_date  INTEGER,   "
-    "extended_manifest BLOB,   "
-    "PRIMARY KEY(key));"
-    "CREATE INDEX IF NOT EXISTS last_access_date_idx   ON LarderManifest(last_access_date);";
+constexpr const char* chooseJournal = "PRAGMA journal_mode = WAL;PRAGMA synchronous = NORMAL;";
 
 struct ExpectedColumn {
   const char* name;
@@ -50,6 +37,7 @@ constexpr std::array<ExpectedColumn, 7> firstVersionColumns = {{{"key", "TEXT"},
                                                                 {"modification_date", "INTEGER"},
                                                                 {"last_access_date", "INTEGER"}}};
 constexpr ExpectedColumn metadataColumn = {"extended_manifest", "BLOB"};
+constexpr const char* checksumColumn = "checksum";
 
 void checkColumn(const std::vector<SQLiteStoreColumn>& columns, std::size_t position, const ExpectedColumn& expected) {
   const bool matches =
@@ -57,10 +45,11 @@ void checkColumn(const std::vector<SQLiteStoreColumn>& columns, std::size_t posi
   if (!matches) throw SQLiteStoreCorruptedException("Invalid schema.", -1);
 }
 
-void initializeDatabase(SQLiteStore& store) {
-  throwIfTableCallsFunctions(store, tableName);
-  store.exec(createTable);
-  const auto columns = store.info(tableName);
+// Brings the table to the latest version, or refuses it.
+void initializeTable(SQLiteStore& store) {
+  throwIfTableCallsFunctions(store, kManifestTable);
+  store.exec(std::string(chooseJournal) + kCreateManifestTable);
+  const auto columns = store.info(kManifestTable);
   for (std::size_t position = 0; position < firstVersionColumns.size(); ++position) {
     checkColumn(columns, position, firstVersionColumns[position]);
   }
@@ -69,6 +58,13 @@ void initializeDatabase(SQLiteStore& store) {
     return;
   }
   checkColumn(columns, firstVersionColumns.size(), metadataColumn);
+}
+
+void addChecksums(SQLiteStore& store) {
+  const auto columns = store.info(kManifestTable);
+  const auto isChecksum = [](const SQLiteStoreColumn& column) { return column.name == checksumColumn; };
+  if (std::any_of(columns.begin(), columns.end(), isChecksum)) return;
+  store.exec(kAddChecksums);
 }
 
 // The layers above know the manifest's exceptions and nothing of SQLite.
@@ -87,6 +83,19 @@ void bindDate(SQLiteStoreCursor& cursor, int index, std::int64_t date) {
   cursor.bind<unsigned long long>(index, static_cast<unsigned long long>(date));
 }
 
+// The first seven parameters.
+void bindItem(SQLiteStoreCursor& cursor, const DiskCacheItem& item) {
+  cursor.bind<std::string>(1, item.key);
+  cursor.bind<std::string>(2, item.filename);
+  cursor.bind<unsigned long long>(3, item.size);
+  cursor.bind<bool>(4, item.hasInlineData);
+  bindDate(cursor, 5, item.modificationDate);
+  bindDate(cursor, 6, item.lastAccessDate);
+  if (item.extendedMetadata != nullptr) {
+    cursor.bind<std::vector<unsigned char>>(7, item.extendedMetadata->serialize());
+  }
+}
+
 std::int32_t dateIn(SQLiteStoreCursor& cursor, int column) {
   return static_cast<std::int32_t>(cursor.get<unsigned long long>(column));
 }
@@ -95,10 +104,11 @@ std::int32_t dateIn(SQLiteStoreCursor& cursor, int column) {
 
 SQLiteManifestPersistence::SQLiteManifestPersistence(const std::string& path,
                                                      std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory,
-                                                     SQLiteStoreFactory storeFactory)
+                                                     SQLiteStoreFactory storeFactory, Durability durability)
     : path_(path),
       extendedMetadataFactory_(std::move(extendedMetadataFactory)),
-      storeFactory_(std::move(storeFactory)) {
+      storeFactory_(std::move(storeFactory)),
+      durability_(durability) {
   translatingExceptions([this] {
     store_ = openStore();
     initializeDatabase(*store_);
@@ -110,6 +120,13 @@ SQLiteManifestPersistence::~SQLiteManifestPersistence() = default;
 std::unique_ptr<SQLiteStore> SQLiteManifestPersistence::openStore() const {
   if (storeFactory_) return storeFactory_(path_);
   return SQLiteStore::createEnsuredSQLiteStore(path_, nullptr);
+}
+
+void SQLiteManifestPersistence::initializeDatabase(SQLiteStore& store) const {
+  if (hasChecksums()) store.exec("PRAGMA busy_timeout = 1000");
+  initializeTable(store);
+  if (hasChecksums()) addChecksums(store);
+  if (durability_ == Durability::Synced) store.exec("PRAGMA synchronous = FULL");
 }
 
 template <class Operation> auto SQLiteManifestPersistence::perform(Operation operation) const {
@@ -158,6 +175,36 @@ void SQLiteManifestPersistence::reopen() const {
   mustReopen_ = false;
 }
 
+void SQLiteManifestPersistence::release() {
+  const std::lock_guard<std::recursive_mutex> lock(mutex_);
+  if (invalidated_) return;
+  store_.reset();
+  mustReopen_ = true;
+}
+
+bool SQLiteManifestPersistence::hasMoved() const {
+  const std::lock_guard<std::recursive_mutex> lock(mutex_);
+  return store_ != nullptr && store_->hasMoved();
+}
+
+bool SQLiteManifestPersistence::isSound() const {
+  try {
+    return perform([this] {
+      SQLiteStoreCursor cursor = store_->cursor("PRAGMA integrity_check(1);");
+      return cursor.next() && cursor.get<std::string>(0) == "ok";
+    });
+  } catch (const ManifestCorruptedException&) {
+    return false;
+  }
+}
+
+std::string SQLiteManifestPersistence::selectItems(const char* condition) const {
+  std::string statement =
+      "SELECT  key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest ";
+  if (hasChecksums()) statement += ",  checksum,  checksum IS NOT NULL ";
+  return statement + "FROM LarderManifest" + condition;
+}
+
 void SQLiteManifestPersistence::clearItems() {
   perform([this] { reopen(); });
 }
@@ -168,24 +215,29 @@ void SQLiteManifestPersistence::setItem(const DiskCacheItem& item) {
         "INSERT OR REPLACE INTO LarderManifest("
         "key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest )"
         "VALUES  (?1, ?2, ?3, ?4, ?5, ?6, ?7);");
-    cursor.bind<std::string>(1, item.key);
-    cursor.bind<std::string>(2, item.filename);
-    cursor.bind<unsigned long long>(3, item.size);
-    cursor.bind<bool>(4, item.hasInlineData);
-    bindDate(cursor, 5, item.modificationDate);
-    bindDate(cursor, 6, item.lastAccessDate);
-    if (item.extendedMetadata != nullptr) {
-      cursor.bind<std::vector<unsigned char>>(7, item.extendedMetadata->serialize());
-    }
+    bindItem(cursor, item);
+    cursor.next();
+  });
+}
+
+void SQLiteManifestPersistence::storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData) {
+  if (!hasChecksums()) return ManifestPersistence::storeItem(item, inlineData);
+  perform([&] {
+    SQLiteStoreCursor cursor = store_->cursor(
+        "INSERT OR REPLACE INTO LarderManifest("
+        "key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest,  "
+        "inline_data,  checksum )"
+        "VALUES  (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9);");
+    bindItem(cursor, item);
+    if (inlineData != nullptr) cursor.bind<std::vector<unsigned char>>(8, *inlineData);
+    if (item.checksum) cursor.bind<unsigned long long>(9, *item.checksum);
     cursor.next();
   });
 }
 
 std::unique_ptr<DiskCacheItem> SQLiteManifestPersistence::getItem(const std::string& key) const {
   return perform([&] {
-    SQLiteStoreCursor cursor = store_->cursor(
-        "SELECT  key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest "
-        "FROM LarderManifest WHERE key = ?1;");
+    SQLiteStoreCursor cursor = store_->cursor(selectItems(" WHERE key = ?1;"));
     cursor.bind<std::string>(1, key);
     return cursor.next() ? itemInRowOf(cursor) : nullptr;
   });
@@ -210,9 +262,7 @@ void SQLiteManifestPersistence::updateLastAccessDate(const std::string& key, lon
 
 std::vector<std::unique_ptr<DiskCacheItem>> SQLiteManifestPersistence::getItemsLastAccessedBefore(long date) const {
   return perform([&] {
-    SQLiteStoreCursor cursor = store_->cursor(
-        "SELECT  key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest "
-        "FROM LarderManifest WHERE last_access_date < ?1;");
+    SQLiteStoreCursor cursor = store_->cursor(selectItems(" WHERE last_access_date < ?1;"));
     bindDate(cursor, 1, date);
     return itemsOf(cursor);
   });
@@ -226,9 +276,7 @@ void SQLiteManifestPersistence::invalidate() {
 
 std::vector<std::unique_ptr<DiskCacheItem>> SQLiteManifestPersistence::getAllItems() const {
   return perform([this] {
-    SQLiteStoreCursor cursor = store_->cursor(
-        "SELECT  key,  filename,  size,  has_inline_data,  modification_date,  last_access_date,  extended_manifest "
-        "FROM LarderManifest;");
+    SQLiteStoreCursor cursor = store_->cursor(selectItems(";"));
     return itemsOf(cursor);
   });
 }
@@ -317,6 +365,9 @@ std::unique_ptr<DiskCacheItem> SQLiteManifestPersistence::itemInRowOf(SQLiteStor
   if (extendedMetadataFactory_ != nullptr) {
     item->extendedMetadata = extendedMetadataFactory_->getExtendedMetadata();
     item->extendedMetadata->deserialize(cursor.get<std::vector<unsigned char>>(6));
+  }
+  if (hasChecksums() && cursor.get<bool>(8)) {
+    item->checksum = static_cast<std::uint32_t>(cursor.get<unsigned long long>(7));
   }
   return item;
 }

@@ -16,7 +16,11 @@
 //   +-------------------+---------+------------------------------------------------------------------+
 //
 // The first version of the table ended with last_access_date: opening such a database adds the last column and keeps
-// every row. A table whose columns differ in name, type or order in any other way is foreign and is refused, and so is
+// every row. A safe store adds one more behind all others, which other stores leave alone:
+//
+//   | checksum          | INTEGER | of key and value, or NULL: the value is not checked                    |
+//
+// A table whose columns differ in name, type or order in any other way is foreign and is refused, and so is
 // one that calls functions: in a check, a default value, a generated column or an index. Columns beyond these are left
 // alone; triggers and views are not run.
 
@@ -28,6 +32,7 @@
 #include <vector>
 
 #include "DiskCacheItem.h"
+#include "Durability.h"
 #include "Export.h"
 #include "ManifestPersistence.h"
 #include "SQLiteStore.h"
@@ -48,9 +53,10 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
  public:
   // Opens the database at `path`, creating file and table when they are missing. Without a metadata factory, metadata
   // is written but not read back. An empty store factory means SQLiteStore::createEnsuredSQLiteStore, which tries for
-  // about 120 ms. Throws what every operation throws.
+  // about 120 ms. Throws what every operation throws. That of a safe or synced store has checksums and waits for
+  // another connection's lock, about a second at most; that of a synced one syncs each change.
   SQLiteManifestPersistence(const std::string& path, std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory,
-                            SQLiteStoreFactory storeFactory);
+                            SQLiteStoreFactory storeFactory, Durability durability = Durability::Relaxed);
   ~SQLiteManifestPersistence() override;
 
   SQLiteManifestPersistence(const SQLiteManifestPersistence&) = delete;
@@ -73,13 +79,25 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   // In a transaction.
   bool performTogether(const std::function<void()>& operations) override;
 
+  // In one statement. The checksum is kept by that of a safe or synced store.
+  void storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData) override;
+
+  bool hasMoved() const override;
+  bool isSound() const override;
+
+  // Closes the database.
+  void release() override;
+
   // Corrects the size of a record that is there already; everything else of it stays, an inline value too.
   void setSize(const std::string& key, std::uint32_t size);
 
  private:
   template <class Operation> auto perform(Operation operation) const;
 
+  bool hasChecksums() const { return durability_ != Durability::Relaxed; }
+  std::string selectItems(const char* condition) const;
   std::unique_ptr<SQLiteStore> openStore() const;
+  void initializeDatabase(SQLiteStore& store) const;
   void prepare() const;
   void handleFailure(const SQLiteStoreException& exception) const;
   void reopen() const;
@@ -102,6 +120,7 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   mutable Transaction transaction_ = Transaction::None;
   const std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory_;
   const SQLiteStoreFactory storeFactory_;
+  const Durability durability_;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -345,4 +345,10 @@ std::vector<SQLiteStoreColumn> SQLiteStore::info(const std::string& table) {
   return columnsDeclaredBy(tables.get<std::string>(0));
 }
 
+bool SQLiteStore::hasMoved() {
+  int hasMoved = 0;
+  const int resultCode = sqlite3_file_control(database_.get(), "main", SQLITE_FCNTL_HAS_MOVED, &hasMoved);
+  return resultCode == SQLITE_OK && hasMoved != 0;
+}
+
 }  // namespace velmora::mobile::xplat::cellar

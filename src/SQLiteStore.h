@@ -116,6 +116,9 @@ class CELLAR_EXPORT SQLiteStore {
   // case-sensitive here). Only columns declared as INTEGER, REAL, TEXT, BOOLEAN or BLOB, in capitals, are found.
   virtual std::vector<SQLiteStoreColumn> info(const std::string& table);
 
+  // Whether the path leads to another file by now, or to none.
+  virtual bool hasMoved();
+
  private:
   std::string path_;
   std::shared_ptr<sqlite3> database_;

@@ -45,6 +45,8 @@ const char* nameOf(Operation operation) {
       return "listOtherEntries";
     case Operation::CreateFile:
       return "createFile";
+    case Operation::ReadPieces:
+      return "readPieces";
     case Operation::Sync:
       return "sync";
     case Operation::ListFiles:
@@ -198,6 +200,12 @@ void FaultyFileUtils::createFile(const std::string& path, const std::vector<unsi
     FileUtils::createFile(path, {data.begin(), data.begin() + length});
   }
   fail(failure->errnoCode);
+}
+
+void FaultyFileUtils::readPieces(const std::string& path,
+                                 const std::function<void(const unsigned char* bytes, std::size_t count)>& consume) {
+  failIfChosen(Operation::ReadPieces, path);
+  FileUtils::readPieces(path, consume);
 }
 
 void FaultyFileUtils::sync(const std::string& path) {

@@ -32,6 +32,7 @@ enum class Operation {
   IsSymLink,
   ListOtherEntries,
   CreateFile,
+  ReadPieces,
   Sync,
   ListFiles,
 };
@@ -95,6 +96,8 @@ class CELLAR_EXPORT FaultyFileUtils : public FileUtils {
   bool isSymLink(const std::string& path) override;
   std::vector<std::string> listOtherEntries(const std::string& path) override;
   void createFile(const std::string& path, const std::vector<unsigned char>& data) override;
+  void readPieces(const std::string& path,
+                  const std::function<void(const unsigned char* bytes, std::size_t count)>& consume) override;
   void sync(const std::string& path) override;
   std::vector<std::string> listFiles(const std::string& path) override;
 

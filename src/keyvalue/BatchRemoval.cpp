@@ -14,7 +14,7 @@ BatchRemoval::Items BatchRemoval::take(const Prune& prune) {
   const StoreLock lock = context_.lock();
   context_.throwIfInvalid();
   Items items;
-  if (!manifest_.purgingIfDamaged(lock, [&] { items = prune(lock, *manifest_.get()); })) return {};
+  if (!manifest_.recoveringFromDamage(lock, [&] { items = prune(lock, *manifest_.get()); })) return {};
   for (DiskCacheItem& item : items) {
     if (writes_.revoke(item.key)) item.filename.clear();  // its file is left to that write
   }
@@ -29,8 +29,8 @@ BatchRemoval::Items BatchRemoval::evict(const Prune& prune) {
 
 void BatchRemoval::run(Provider provider, OnSuccess onSuccess, OnError onError) {
   auto countedProvider = [operation = context_.operation, provider = std::move(provider)] { return provider(); };
-  workQueue_.dispatch([weakThis = context_.weak(*this), countedProvider = std::move(countedProvider),
-                       onSuccess = std::move(onSuccess), onError = std::move(onError)] {
+  workQueue_.dispatchBehindAll([weakThis = context_.weak(*this), countedProvider = std::move(countedProvider),
+                                onSuccess = std::move(onSuccess), onError = std::move(onError)] {
     if (const auto self = weakThis.lock()) self->step(countedProvider, onSuccess, onError);
   });
 }

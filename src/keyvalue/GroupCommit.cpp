@@ -5,6 +5,7 @@
 #include <mutex>
 #include <utility>
 
+#include "LarderException.h"
 #include "keyvalue/StoreManifest.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -16,6 +17,10 @@ constexpr std::size_t kMaxGroupSize = 32;
 constexpr std::size_t kMaxGroupBytes = std::size_t{128} << 10U;  // a first change that has more runs alone
 
 }  // namespace
+
+std::exception_ptr GroupCommit::storeIsGone() {
+  return std::make_exception_ptr(InvalidatedException("Store has been released."));
+}
 
 // The task of a change. Does nothing when an earlier one has run it.
 void GroupCommit::run(const std::shared_ptr<ManifestChange>& change) {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <exception>
+#include <functional>
 #include <memory>
 #include <vector>
 
@@ -23,21 +25,33 @@ class GroupCommit {
       : context_(context), manifest_(manifest), workQueue_(workQueue) {}
 
   // Hands the change to the work queue. It has a key, a promise, and a weak pointer to its owner, which is a part of
-  // the same store; when that is gone, the promise is fulfilled and nothing done.
+  // the same store; when that is gone, nothing is done, and the promise is fulfilled, but not that of a safe store.
   template <class Change> Future<void> submit(const std::shared_ptr<Change>& change) {
     Future<void> future = change->promise.getFuture();
-    workQueue_.dispatchChange(KeyRange(change->key), change, [this, change] {
-      if (const auto owner = change->owner.lock()) {  // whoever locks it keeps this alive, too
-        run(change);
-      } else if (change->take()) {
-        change->promise.setValue();
-      }
-    });
+    workQueue_.dispatchChange(KeyRange(change->key), change, taskOf(change));
     return future;
   }
 
+  // The same for a change that has just come from the file queue.
+  template <class Change> void submitHere(const std::shared_ptr<Change>& change) {
+    workQueue_.dispatchChangeHere(change, taskOf(change));
+  }
+
+  // Of an operation on a safe store that was released before.
+  static std::exception_ptr storeIsGone();
+
  private:
   using Group = std::vector<std::shared_ptr<ManifestChange>>;
+
+  template <class Change> std::function<void()> taskOf(const std::shared_ptr<Change>& change) {
+    return [this, change, isSafe = context_.isSafe()] {
+      if (const auto owner = change->owner.lock()) {  // whoever locks it keeps this alive, too
+        run(change);
+      } else if (change->take()) {
+        isSafe ? change->promise.setException(storeIsGone()) : change->promise.setValue();
+      }
+    };
+  }
 
   void run(const std::shared_ptr<ManifestChange>& change);
   Group groupBehind(const std::shared_ptr<ManifestChange>& first);

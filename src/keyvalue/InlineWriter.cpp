@@ -84,7 +84,7 @@ void InlineWriter::writeAlone(Value& value) {
 bool InlineWriter::writeRow(const StoreLock& lock, Value& value) {
   value.replaced.reset();
   try {
-    return remover_.makeRoom(lock) && manifest_.purgingIfUnwritable(lock, [&] { setRow(value); });
+    return remover_.makeRoom(lock) && manifest_.recoveringFromFailedWrite(lock, [&] { setRow(value); });
   } catch (...) {
     if (value.replaced) takeBack(lock, value.key, std::move(*value.replaced));
     throw;

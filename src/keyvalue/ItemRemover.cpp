@@ -50,7 +50,7 @@ void ItemRemover::removeAlone(Removal& removal) {
       context_.throwIfInvalid();
       removal.item = manifest_.lookUp(lock, KeyRange(removal.key));
       const auto removeIt = [&] { manifest_.get()->removeItem(removal.key); };
-      if (removal.item != nullptr && !manifest_.purgingIfDamaged(lock, removeIt)) removal.item.reset();
+      if (removal.item != nullptr && !manifest_.recoveringFromDamage(lock, removeIt)) removal.item.reset();
       noteRemoved(lock, removal);
     }
     deleteFile(removal);
@@ -96,11 +96,13 @@ void ItemRemover::evictOldestIfFull(const StoreLock& lock) {
   if (item != nullptr) discard(*item);
 }
 
-std::unique_ptr<DiskCacheItem> ItemRemover::takeOldestIfFull(const StoreLock& /*lock*/) {
+bool ItemRemover::isFull(const StoreLock& /*lock*/) {
   const auto& capacity = context_.options.capacity;
-  if (!capacity) return nullptr;
-  const auto manifest = manifest_.get();
-  return manifest->count() < *capacity ? nullptr : manifest->pruneOldestItem();
+  return capacity && manifest_.get()->count() >= *capacity;
+}
+
+std::unique_ptr<DiskCacheItem> ItemRemover::takeOldestIfFull(const StoreLock& lock) {
+  return isFull(lock) ? manifest_.get()->pruneOldestItem() : nullptr;
 }
 
 // A file queue that refuses the deletion refuses the write, too, that the item was evicted for.
@@ -138,8 +140,8 @@ void ItemRemover::discard(const DiskCacheItem& item) {
 
 bool ItemRemover::makeRoom(const StoreLock& lock) {
   manifest_.get();  // one that cannot be opened now fails this operation, and purges nothing
-  manifest_.finishPurge(lock);
-  return !context_.options.capacity || manifest_.purgingIfUnwritable(lock, [&] { evictOldestIfFull(lock); });
+  manifest_.prepareReading(lock);
+  return !context_.options.capacity || manifest_.recoveringFromFailedWrite(lock, [&] { evictOldestIfFull(lock); });
 }
 
 void ItemRemover::finish() { const std::lock_guard<std::mutex> removing(context_.removalMutex); }

@@ -33,6 +33,9 @@ class ItemRemover {
   // Evicts the item used least recently if the store is at its capacity.
   void evictOldestIfFull(const StoreLock& lock);
 
+  // Whether there is no room for another item.
+  bool isFull(const StoreLock& lock);
+
   // The same in steps: its record, null when the store has room, and then, when it is gone for good, the rest. The
   // second does not throw.
   std::unique_ptr<DiskCacheItem> takeOldestIfFull(const StoreLock& lock);

@@ -15,7 +15,7 @@ void Rollback::end(FileWrite& write) {
     const auto settled = writes_.drop(write);
     if (!settled) return;
     hasStrayFile = settled->hasStrayFile;
-    manifest_.purgingIfDamaged(lock, [&] { restore(write.key, *settled); });
+    manifest_.recoveringFromDamage(lock, [&] { restore(write.key, *settled); });
   } catch (const std::exception& error) {
     logLostRecord(write.key, error);
   }

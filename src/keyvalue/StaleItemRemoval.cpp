@@ -4,7 +4,6 @@
 #include <optional>
 #include <utility>
 
-#include "Clock.h"
 #include "keyvalue/BatchRemoval.h"
 #include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
@@ -18,8 +17,7 @@ constexpr long kInterval = 3600;   // seconds
 constexpr std::uint64_t kNanosecondsPerSecond = 1'000'000'000;
 
 // The time before which what was used last is stale.
-long cutoffOf(long staleAge) {
-  const std::int64_t now = Clock::now();
+long cutoffOf(std::int64_t now, long staleAge) {
   if (staleAge > now) return 0;
   return static_cast<long>(static_cast<std::uint64_t>(now) - static_cast<std::uint64_t>(staleAge));
 }
@@ -80,12 +78,12 @@ void StaleItemRemoval::start() {
 std::optional<long> StaleItemRemoval::prepare() {
   const StoreLock lock = context_.lock();
   if (context_.isInvalidated) return std::nullopt;
-  manifest_.purgingIfDamaged(lock, [&] {
+  manifest_.recoveringFromDamage(lock, [&] {
     const auto manifest = manifest_.get();
     if (!manifest->isLoaded()) manifest->load();
   });
   manifest_.reportSize();
-  return cutoffOf(staleAge_);
+  return cutoffOf(manifest_.get()->currentDate(), staleAge_);
 }
 
 }  // namespace velmora::mobile::xplat::cellar

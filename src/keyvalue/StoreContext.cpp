@@ -1,6 +1,7 @@
 #include "keyvalue/StoreContext.h"
 
 #include <algorithm>
+#include <stdexcept>
 
 #include "FileUtils.h"
 #include "LarderException.h"
@@ -10,7 +11,10 @@ namespace velmora::mobile::xplat::cellar {
 
 namespace {
 
-KeyValueStoreOptions inRange(KeyValueStoreOptions options) {
+KeyValueStoreOptions checked(KeyValueStoreOptions options) {
+  if (options.durability != Durability::Relaxed && options.manifest != nullptr) {
+    throw std::invalid_argument("Store '" + options.name + "' cannot be safe with a manifest of the host's own.");
+  }
   options.batchSize = std::max(options.batchSize, 1U);
   return options;
 }
@@ -24,10 +28,11 @@ std::string pathOfManifest(const KeyValueStoreOptions& options, FileUtils& files
 }  // namespace
 
 StoreContext::StoreContext(Store& store, KeyValueStoreOptions storeOptions, const StoreServices& services)
-    : options(inRange(std::move(storeOptions))),
+    : options(checked(std::move(storeOptions))),
       files(services.files),
       trash(services.trash),
       analytics(services.analytics),
+      incidents(services.incidents),
       manifestPath(pathOfManifest(options, *files)),
       fileQueue(services.queues->createQueue()),
       workQueue(services.queues->createWorkQueue()),
@@ -35,6 +40,10 @@ StoreContext::StoreContext(Store& store, KeyValueStoreOptions storeOptions, cons
 
 void StoreContext::throwIfInvalid() const {
   if (isInvalidated) throw InvalidatedException("Store has been invalidated.");
+}
+
+void StoreContext::report(Incident incident) const {
+  if (incidents != nullptr) incidents->report(std::move(incident));
 }
 
 void StoreContext::throwIfClosed() const {

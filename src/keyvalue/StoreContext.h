@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "Future.h"
+#include "Incident.h"
 #include "Store.h"
 #include "StoreOptions.h"
 #include "executor/TaskQueueFactory.h"
@@ -52,6 +53,7 @@ class StoreContext {
   const std::shared_ptr<FileUtils> files;
   const std::shared_ptr<TrashCollector> trash;
   const std::shared_ptr<AnalyticsEventReporter> analytics;  // may be null
+  const std::shared_ptr<const IncidentReporter> incidents;  // may be null
   const std::string manifestPath;
   const std::shared_ptr<AsyncExecutor> fileQueue;
   const std::shared_ptr<AsyncExecutor> workQueue;
@@ -81,6 +83,12 @@ class StoreContext {
 
   void throwIfInvalid() const;
   void throwIfClosed() const;
+
+  bool isCache() const { return store_.isPrunable(); }
+  bool isSafe() const { return options.durability != Durability::Relaxed; }
+
+  // Tells the host, on one of its queues, if it wants to know.
+  void report(Incident incident) const;
 
   // For the tasks of a part: whoever locks it keeps the store alive.
   template <class Part> std::weak_ptr<Part> weak(Part& part) const {

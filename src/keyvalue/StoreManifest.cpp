@@ -1,93 +1,77 @@
 #include "keyvalue/StoreManifest.h"
 
-#include "FileUtils.h"
-#include "TrashCollector.h"
-#include "keyvalue/StoreLog.h"
-#include "keyvalue/WritesInFlight.h"
+#include <exception>
+#include <utility>
+
+#include "SQLiteManifestPersistence.h"
 
 namespace velmora::mobile::xplat::cellar {
 
-namespace {
-
-// Whether the file cannot become a manifest that works, however often it is opened: it is damaged, or holds a table of
-// another program's that the manifest's own statements do not fit.
 bool isNotAManifest(const ManifestPersistenceException& error) {
   constexpr int kStatementDoesNotFit = 1;
   return dynamic_cast<const ManifestCorruptedException*>(&error) != nullptr || error.code() == kStatementDoesNotFit;
 }
 
-}  // namespace
-
-StoreManifest::StoreManifest(StoreContext& context, WritesInFlight& writes)
-    : context_(context), writes_(writes), manifest_(context.options.manifest) {}
+StoreManifest::StoreManifest(StoreContext& context) : context_(context), manifest_(context.options.manifest) {}
 
 std::shared_ptr<DiskCacheManifestInterface> StoreManifest::get() {
   if (isCreated_) return manifest_;
   const std::lock_guard<std::mutex> lock(creationMutex_);
-  if (manifest_ == nullptr) {
-    try {
-      manifest_ = open();
-    } catch (const ManifestPersistenceException& error) {
-      if (!isNotAManifest(error)) throw;
-      context_.trash->collectPath(context_.options.directory);
-      context_.files->createDirectory(context_.options.directory, true);
-      manifest_ = open();
-      logPurge(error);
-    }
-  }
+  if (manifest_ == nullptr) manifest_ = openRecovering();
   isCreated_ = true;
   return manifest_;
 }
 
+std::shared_ptr<DiskCacheManifestInterface> StoreManifest::openRecovering() {
+  std::optional<ManifestPersistenceException> failure;
+  for (int attempt = 0;; ++attempt) {
+    try {
+      recovery_->prepareOpening();
+      auto manifest = open();
+      if (failure) recovery_->noteOpened(*failure);
+      return manifest;
+    } catch (const ManifestPersistenceException& error) {
+      recovery_->recoverOpening(error, attempt);
+      failure = error;
+    }
+  }
+}
+
 std::shared_ptr<DiskCacheManifestInterface> StoreManifest::open() {
-  return DiskCacheManifest::createDiskCacheManifest(context_.manifestPath, context_.workQueue,
-                                                    context_.options.extendedMetadataFactory,
-                                                    context_.options.pruneStrategy);
+  const auto& options = context_.options;
+  auto persistence = std::make_unique<SQLiteManifestPersistence>(context_.manifestPath, options.extendedMetadataFactory,
+                                                                 SQLiteStoreFactory(), options.durability);
+  return std::make_shared<DiskCacheManifest>(std::move(persistence), context_.workQueue, options.pruneStrategy,
+                                             options.durability);
 }
 
 void StoreManifest::load(const StoreLock& lock) {
-  purgingIfDamaged(lock, [&] { get()->load(); });
+  recoveringFromDamage(lock, [&] { get()->load(); });
 }
 
 std::unique_ptr<DiskCacheItem> StoreManifest::lookUp(const StoreLock& lock, KeyRange keys) {
   std::unique_ptr<DiskCacheItem> item;
-  purgingIfDamaged(lock, [&] {
-    finishPurge(lock);
+  recoveringFromDamage(lock, [&] {
+    recovery_->prepareReading(lock);
     for (auto key = keys.begin(); key != keys.end() && item == nullptr; ++key) item = get()->getItem(*key);
   });
   return item;
 }
 
-bool StoreManifest::changeTogether(const StoreLock& /*lock*/, const std::function<void()>& changes) {
-  return isCreated_ && !isPurgePending_ && manifest_->changeTogether(changes);
-}
-
-bool StoreManifest::purge(const StoreLock& lock, const LarderException& error) {
-  context_.throwIfClosed();
-  {
-    const auto claimsAreHeld = writes_.holdClaims();
-    const bool isCollected = context_.trash->collectPath(context_.options.directory);
-    if (!isCollected && context_.files->pathExists(context_.manifestPath)) return false;
-    writes_.detachRecords(claimsAreHeld);
-    isPurgePending_ = true;
-    finishPurge(lock);
+bool StoreManifest::changeTogether(const StoreLock& lock, const std::function<void()>& changes) {
+  if (!isCreated_ || !recovery_->isReady()) return false;
+  try {
+    recovery_->prepareChange(lock);
+  } catch (const std::exception&) {
+    return false;
   }
-  logPurge(error);
-  return true;
+  return manifest_->changeTogether(changes);
 }
 
-void StoreManifest::finishPurge(const StoreLock& /*lock*/) {
-  if (!isPurgePending_) return;
-  context_.files->createDirectory(context_.options.directory, true);
-  const auto manifest = get();
-  manifest->clear();
-  manifest->load();
-  isPurgePending_ = false;
-}
-
-void StoreManifest::logPurge(const LarderException& error) const {
-  errorLine(__LINE__).stream() << "Store \"" << context_.options.name << "\" purged due to corrupted manifest. "
-                               << error.what();
+void StoreManifest::recover(const StoreLock& lock, const LarderException& error) {
+  constexpr int kForSure = 1;
+  if (recovery_->recoverFromDamage(lock, error, kForSure) != Outcome::NotRecovered) return;
+  throw LarderException(error.description(), error.domain(), error.code());
 }
 
 std::optional<std::uint32_t> StoreManifest::totalToReport() {

@@ -10,60 +10,72 @@
 #include "DiskCacheManifest.h"
 #include "LarderException.h"
 #include "keyvalue/KeyRange.h"
+#include "keyvalue/ManifestRecovery.h"
 #include "keyvalue/StoreContext.h"
 
 namespace velmora::mobile::xplat::cellar {
 
-class WritesInFlight;
-
-// The manifest of a store: opened on first use, and replaced by an empty one together with all files when it is damaged
-// (a purge). One that cannot be opened fails the operation at hand, and is opened again by the next one.
+// The manifest of a store: opened on first use. One that cannot be opened fails the operation at hand, and is opened
+// again by the next one. What is done about a damaged one is the recovery's business.
 class StoreManifest {
  public:
-  StoreManifest(StoreContext& context, WritesInFlight& writes);
+  using Outcome = ManifestRecovery::Outcome;
 
-  // Any thread. A file that is not a manifest purges the store.
+  explicit StoreManifest(StoreContext& context);
+
+  // To be called once, before any use.
+  void setRecovery(ManifestRecovery& recovery) { recovery_ = &recovery; }
+
+  // Any thread. A file that is not a manifest is recovered from.
   std::shared_ptr<DiskCacheManifestInterface> get();
+
+  // The same, but null before the manifest is opened.
+  std::shared_ptr<DiskCacheManifestInterface> opened() const { return isCreated_ ? manifest_ : nullptr; }
 
   // Reads all records.
   void load(const StoreLock& lock);
 
-  // The record of the first key that has one; null for a miss, and when looking for it purged the store.
+  // The record of the first key that has one; null for a miss, and when looking for it emptied the store.
   std::unique_ptr<DiskCacheItem> lookUp(const StoreLock& lock, KeyRange keys);
 
-  // Runs what uses the manifest. A damaged one purges the store: false then. Throws what else goes wrong, and the
-  // damage itself when the store cannot be purged.
-  template <class Operation> bool purgingIfDamaged(const StoreLock& lock, Operation operation) {
-    try {
-      operation();
-      return true;
-    } catch (const ManifestCorruptedException& error) {
-      if (!purge(lock, error)) throw;
-      return false;
+  // Runs what uses the manifest, again when it was damaged and could be recovered. False when the store has been
+  // emptied instead. Throws what else goes wrong, and the damage itself when nothing can be done about it.
+  template <class Operation> bool recoveringFromDamage(const StoreLock& lock, Operation operation) {
+    for (int attempt = 0;; ++attempt) {
+      try {
+        operation();
+        return true;
+      } catch (const ManifestCorruptedException& error) {
+        const Outcome outcome = recovery_->recoverFromDamage(lock, error, attempt);
+        if (outcome == Outcome::NotRecovered) throw;
+        if (outcome == Outcome::Emptied) return false;
+      }
     }
   }
 
-  // The same for what writes a value's record: a manifest that cannot be written purges too, unless it is only that it
-  // could not be opened for writing, which is true for the moment.
-  template <class Operation> bool purgingIfUnwritable(const StoreLock& lock, Operation operation) {
-    try {
-      operation();
-      return true;
-    } catch (const ManifestPersistenceException& error) {
-      if (error.code() == kReadOnly || !purge(lock, error)) throw;
-      return false;
+  // The same for what writes a value's record.
+  template <class Operation> bool recoveringFromFailedWrite(const StoreLock& lock, Operation operation) {
+    for (int attempt = 0;; ++attempt) {
+      try {
+        operation();
+        return true;
+      } catch (const ManifestPersistenceException& error) {
+        const Outcome outcome = recovery_->recoverFromFailedWrite(lock, error, attempt);
+        if (outcome == Outcome::NotRecovered) throw;
+        if (outcome == Outcome::Emptied) return false;
+      }
     }
   }
 
   // Makes the changes in one transaction. False when nothing has changed: they can be made one by one then.
   bool changeTogether(const StoreLock& lock, const std::function<void()>& changes);
 
-  // Moves the directory to the trash and begins again. False, and nothing has changed, when the directory cannot be
-  // collected: what the old manifest says would be back at the next start. Throws once the store is closed.
-  bool purge(const StoreLock& lock, const LarderException& error);
+  // The manifest is about to be read, or changed, without one of the above.
+  void prepareReading(const StoreLock& lock) { recovery_->prepareReading(lock); }
+  void prepareChange(const StoreLock& lock) { recovery_->prepareChange(lock); }
 
-  // The second half of a purge. On a full disk it can fail; the next operation then tries it again.
-  void finishPurge(const StoreLock& lock);
+  // As if an operation had found it damaged by `error`. Throws when nothing can be done about it.
+  void recover(const StoreLock& lock, const LarderException& error);
 
   // The total bytes of all items; empty when nobody wants to know it, and before the manifest is loaded. Any thread.
   std::optional<std::uint32_t> totalToReport();
@@ -76,18 +88,19 @@ class StoreManifest {
   void close();
 
  private:
-  static constexpr int kReadOnly = 8;  // the code of a write to a manifest that could be opened for reading only
-
+  std::shared_ptr<DiskCacheManifestInterface> openRecovering();
   std::shared_ptr<DiskCacheManifestInterface> open();
-  void logPurge(const LarderException& error) const;
 
   StoreContext& context_;
-  WritesInFlight& writes_;
-  bool isPurgePending_ = false;  // the directory has gone to the trash, and no new one is there; guarded by the store's
+  ManifestRecovery* recovery_ = nullptr;
 
   std::mutex creationMutex_;  // guards the creation of the manifest
   std::atomic<bool> isCreated_{false};
   std::shared_ptr<DiskCacheManifestInterface> manifest_;
 };
+
+// Whether the file cannot become a manifest that works, however often it is opened: it is damaged, or holds a table of
+// another program's that the manifest's own statements do not fit.
+bool isNotAManifest(const ManifestPersistenceException& error);
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -1,6 +1,7 @@
 #include "keyvalue/ValueFetcher.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <exception>
 #include <limits>
 #include <utility>
@@ -8,8 +9,11 @@
 #include "AnalyticsEventReporter.h"
 #include "Clock.h"
 #include "FileUtils.h"
+#include "LarderException.h"
+#include "base/Checksum.h"
 #include "keyvalue/FileQueue.h"
 #include "keyvalue/ReservedKeys.h"
+#include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
 #include "keyvalue/WorkQueue.h"
@@ -92,15 +96,42 @@ void ValueFetcher::load(Fetch& fetch) {
     context_.throwIfClosed();
     auto fetched = std::make_unique<PersistentKeyValueStore::FetchResult>(
         PersistentKeyValueStore::FetchResult{item->key, {}, item->modificationDate});
-    if (fetch.loader(item, files_.pathOf(item->filename), fetched->value)) {
+    if (load(fetch, files_.pathOf(item->filename), fetched->value)) {
       const StoreLock lock = context_.lock();
-      manifest_.purgingIfDamaged(lock, [&] { manifest_.get()->updateLastAccessDate(item->key); });
+      manifest_.recoveringFromDamage(lock, [&] { manifest_.get()->updateLastAccessDate(item->key); });
       result = std::move(fetched);
     }
   } catch (...) {
-    if (context_.isClosed || !hasLostItem(*item)) return fetch.promise.setException(std::current_exception());
+    const auto failure = std::current_exception();
+    if (context_.isClosed || !isMiss(*item, failure)) return fetch.promise.setException(failure);
   }
   fetch.promise.setValue(std::move(result));
+}
+
+// What a host's own loader is given has been checked before.
+bool ValueFetcher::load(Fetch& fetch, const std::string& path, std::vector<unsigned char>& value) {
+  const DiskCacheItem& item = *fetch.item;
+  if (!fetch.loader) return readValue(item, path, value);
+  if (item.checksum) {
+    std::vector<unsigned char> inlineValue;
+    const bool isThere = item.hasInlineData ? readValue(item, path, inlineValue) : checkFile(item, path);
+    if (!isThere) return false;
+  }
+  return fetch.loader(fetch.item, path, value);
+}
+
+bool ValueFetcher::isMiss(const DiskCacheItem& item, const std::exception_ptr& failure) {
+  if (hasLostItem(item)) return true;
+  if (!context_.isSafe() || !context_.isCache()) return false;
+  try {
+    std::rethrow_exception(failure);
+  } catch (const FileUtilsIoException& error) {
+    if (error.code() != ENOENT) return false;
+    drop(item);  // a cache does without a file that somebody has removed
+    return true;
+  } catch (...) {
+    return false;
+  }
 }
 
 // Whether the store itself has taken the item away since it was looked up: removed it, or removed it and stored it
@@ -108,38 +139,89 @@ void ValueFetcher::load(Fetch& fetch) {
 bool ValueFetcher::hasLostItem(const DiskCacheItem& item) {
   try {
     const StoreLock lock = context_.lock();
-    if (manifest_.lookUp(lock, KeyRange(item.key)) == nullptr) return true;
+    manifest_.prepareChange(lock);
+    const auto current = manifest_.lookUp(lock, KeyRange(item.key));
+    if (current == nullptr) return true;
+    if (context_.isSafe()) return current->filename != item.filename;
     return writes_.contains(item.key) && !context_.files->pathExists(files_.pathOf(item.filename));
   } catch (const std::exception&) {
     return false;
   }
 }
 
+// A value that is not what it should be is read once more: the fault may lie in the reading.
 bool ValueFetcher::readValue(const DiskCacheItem& item, const std::string& path, std::vector<unsigned char>& value) {
-  if (!item.hasInlineData) {
-    value = context_.files->readFile(path);
-    return true;
+  std::optional<std::uint32_t> checksum = item.checksum;
+  for (int attempt = 0; attempt < 2; ++attempt) {
+    if (item.hasInlineData) {
+      if (!readInlineValue(item.key, value, checksum)) return false;
+    } else {
+      value = context_.files->readFile(path);
+    }
+    if (!checksum || Checksum::of(item.key, value) == *checksum) return true;
+    if (attempt == 0) manifest_.get()->release();
   }
-  const StoreLock lock = context_.lock();  // record and value are written one after the other
+  value.clear();
+  return handleDamage(item);
+}
+
+// Record and value are read together: both may have been replaced.
+bool ValueFetcher::readInlineValue(const std::string& key, std::vector<unsigned char>& value,
+                                   std::optional<std::uint32_t>& checksum) {
+  const StoreLock lock = context_.lock();
   bool isThere = false;
-  manifest_.purgingIfDamaged(lock, [&] {
+  manifest_.recoveringFromDamage(lock, [&] {
     const auto manifest = manifest_.get();
-    value = manifest->getInlineData(item.key);
+    value = manifest->getInlineData(key);
     isThere = !value.empty();
-    if (isThere) return;
-    const auto current = manifest->getItem(item.key);
-    isThere = current != nullptr && current->size == 0;  // an empty value, not one that has vanished
+    if (isThere && !checksum) return;
+    const auto current = manifest->getItem(key);
+    isThere = current != nullptr && (isThere || checksum || current->size == 0);  // not one that has vanished
+    checksum = isThere ? current->checksum : std::nullopt;
   });
   return isThere;
 }
 
+bool ValueFetcher::checkFile(const DiskCacheItem& item, const std::string& path) {
+  for (int attempt = 0; attempt < 2; ++attempt) {
+    Checksum checksum(item.key);
+    context_.files->readPieces(path,
+                               [&](const unsigned char* bytes, std::size_t count) { checksum.add(bytes, count); });
+    if (checksum.value() == *item.checksum) return true;
+  }
+  return handleDamage(item);
+}
+
+// A cache does without the item: false, for a miss.
+bool ValueFetcher::handleDamage(const DiskCacheItem& item) {
+  const DamagedValueException error(context_.options.name, item.key);
+  errorLine(__LINE__).stream() << error.description();
+  context_.report({Incident::Kind::DamagedValue, context_.options.name, item.key, error.description()});
+  if (!context_.isCache()) throw error;
+  drop(item);
+  return false;
+}
+
+// Unless it has been stored again.
+void ValueFetcher::drop(const DiskCacheItem& item) {
+  {
+    const StoreLock lock = context_.lock();
+    const auto manifest = manifest_.get();
+    const auto current = manifest->getItem(item.key);
+    if (current == nullptr || current->filename != item.filename || current->checksum != item.checksum) return;
+    manifest_.recoveringFromDamage(lock, [&] { manifest->removeItem(item.key); });
+  }
+  const auto path = files_.fileOf(item);
+  if (path && context_.files->pathExists(*path)) files_.deleteAll({*path});
+}
+
 std::optional<std::int32_t> ValueFetcher::modificationDate(const std::string& key) {
-  if (!context_.options.inlineData) throwIfReserved(key);
+  if (!context_.options.inlineData && !context_.isSafe()) throwIfReserved(key);
   const StoreLock lock = context_.lock();  // no purge and no invalidation comes in between
   context_.throwIfInvalid();
   std::optional<std::int32_t> date;
-  manifest_.purgingIfDamaged(lock, [&] {
-    manifest_.finishPurge(lock);
+  manifest_.recoveringFromDamage(lock, [&] {
+    manifest_.prepareReading(lock);
     date = manifest_.get()->getModificationDate(key);
   });
   return date;
@@ -164,7 +246,7 @@ void ValueFetcher::noteAccess(const std::string& key) {
     context_.analytics->reportEvent(event.get());
   }
   const StoreLock lock = context_.lock();
-  manifest_.purgingIfDamaged(lock, [&] { manifest_.get()->updateLastAccessDate(key); });
+  manifest_.recoveringFromDamage(lock, [&] { manifest_.get()->updateLastAccessDate(key); });
 }
 
 // A hit carries the item found; a miss, the key that was looked for first.

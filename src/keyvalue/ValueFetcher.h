@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <exception>
 #include <memory>
 #include <optional>
 #include <string>
@@ -34,9 +35,10 @@ class ValueFetcher {
         fileQueue_(fileQueue),
         files_(files) {}
 
+  // Without a loader (empty) the value is read as it is.
   Future<Fetched> fetchFirst(std::vector<std::string> keys, Loader loader);
 
-  // The loader of a plain fetch.
+  // What a plain fetch does.
   bool readValue(const DiskCacheItem& item, const std::string& path, std::vector<unsigned char>& value);
 
   std::optional<std::int32_t> modificationDate(const std::string& key);
@@ -48,6 +50,13 @@ class ValueFetcher {
 
   void find(const std::shared_ptr<Fetch>& fetch);
   void load(Fetch& fetch);
+  bool load(Fetch& fetch, const std::string& path, std::vector<unsigned char>& value);
+  bool readInlineValue(const std::string& key, std::vector<unsigned char>& value,
+                       std::optional<std::uint32_t>& checksum);
+  bool checkFile(const DiskCacheItem& item, const std::string& path);
+  bool handleDamage(const DiskCacheItem& item);
+  void drop(const DiskCacheItem& item);
+  bool isMiss(const DiskCacheItem& item, const std::exception_ptr& failure);
   bool hasLostItem(const DiskCacheItem& item);
   void noteAccess(const std::string& key);
   void reportAccess(const DiskCacheItem* item, const std::string& key);

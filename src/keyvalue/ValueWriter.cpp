@@ -85,7 +85,7 @@ void ValueWriter::handToFileQueue(const std::shared_ptr<FileWrite>& write) {
 
 // False when the store had to be purged instead.
 bool ValueWriter::beginRecord(const StoreLock& lock, FileWrite& write) {
-  if (!remover_.makeRoom(lock) || !manifest_.purgingIfUnwritable(lock, [&] { setProvisionalRecord(write); })) {
+  if (!remover_.makeRoom(lock) || !manifest_.recoveringFromFailedWrite(lock, [&] { setProvisionalRecord(write); })) {
     writes_.revoke(write.key);  // an earlier value must not take the place of this one
     return false;
   }
@@ -228,7 +228,7 @@ void ValueWriter::recordWritten(const StoreLock& lock, FileWrite& write) {
 
 // The store may have to be purged instead.
 void ValueWriter::setFinalRecordAlone(const StoreLock& lock, FileWrite& write) {
-  manifest_.purgingIfUnwritable(lock, [&] {
+  manifest_.recoveringFromFailedWrite(lock, [&] {
     if (!write.hasRecord) remover_.evictOldestIfFull(lock);
     setFinalRecord(write);
   });

@@ -2,6 +2,7 @@
 
 #include <string>
 
+#include "keyvalue/FileQueue.h"
 #include "keyvalue/ReservedKeys.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -13,9 +14,31 @@ void WorkQueue::dispatch(std::function<void()> task) {
   changes_.cut();
 }
 
+void WorkQueue::dispatchBehindAll(std::function<void()> task) {
+  if (ahead_.isEmpty()) return dispatch(std::move(task));
+  detourTo(KeyRange(std::vector<std::string>()), task, [this, task] { dispatch(task); });
+}
+
+void WorkQueue::append(const std::shared_ptr<ManifestChange>& change, std::function<void()> task) {
+  changes_.append(change);
+  context_.workQueue->dispatch(std::move(task));
+}
+
+// A task finds out for itself that the store is gone.
+void WorkQueue::detourTo(KeyRange keys, std::function<void()> task, std::function<void()> dispatchIt) {
+  fileQueue_.dispatch([weakThis = context_.weak(*this), passage = ahead_.enter(keys), task = std::move(task),
+                       dispatchIt = std::move(dispatchIt)] {
+    if (const auto self = weakThis.lock()) {
+      dispatchIt();
+    } else {
+      task();
+    }
+  });
+}
+
 void WorkQueue::throwIfRefused(KeyRange keys) const {
   context_.throwIfInvalid();
-  if (context_.options.inlineData) return;
+  if (context_.options.inlineData || context_.isSafe()) return;
   for (const std::string& key : keys) throwIfReserved(key);
 }
 

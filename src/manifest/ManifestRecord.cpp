@@ -21,6 +21,8 @@ ManifestRecord::Owner ManifestRecord::create(const DiskCacheItem& item) {
   record->modificationDate = item.modificationDate;
   record->lastAccessDate = item.lastAccessDate;
   record->extendedMetadata = item.extendedMetadata;
+  record->hasChecksum = item.checksum.has_value();
+  record->checksum = item.checksum.value_or(0);
   return record;
 }
 
@@ -38,6 +40,7 @@ void ManifestRecord::copyTo(DiskCacheItem& item) const {
   item.modificationDate = modificationDate;
   item.lastAccessDate = lastAccessDate;
   item.extendedMetadata = extendedMetadata;
+  item.checksum = hasChecksum ? std::make_optional(checksum) : std::nullopt;
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -19,7 +19,7 @@ class ManifestRecord {
   };
   using Owner = std::unique_ptr<ManifestRecord, Deleter>;
 
-  static constexpr std::uint32_t kLongestKey = (1U << 31U) - 1;  // bytes
+  static constexpr std::uint32_t kLongestKey = (1U << 30U) - 1;  // bytes
 
   // Throws `std::length_error` for a key that is longer.
   static Owner create(const DiskCacheItem& item);
@@ -34,20 +34,22 @@ class ManifestRecord {
   std::uint32_t size = 0;
   std::int32_t modificationDate = 0;
   std::int32_t lastAccessDate = 0;
+  std::uint32_t checksum = 0;  // if it has one
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
 
   std::uint32_t accessDateIndex = 0;  // kept by the two orders of eviction
   std::uint32_t priorityIndex = 0;
 
  private:
-  const std::uint32_t keyLength_ : 31;
+  const std::uint32_t keyLength_ : 30;
 
  public:
-  bool hasInlineData : 1;  // beside the length, where it takes no room of its own
+  bool hasInlineData : 1;  // beside the length, where they take no room of their own
+  bool hasChecksum : 1;
 
  private:
   explicit ManifestRecord(std::uint32_t keyLength) noexcept
-      : keyLength_(keyLength & kLongestKey), hasInlineData(false) {}
+      : keyLength_(keyLength & kLongestKey), hasInlineData(false), hasChecksum(false) {}
   ~ManifestRecord() = default;
 
   std::unique_ptr<const std::string> filename_;  // null: the same as the key

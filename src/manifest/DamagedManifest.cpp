@@ -1,0 +1,150 @@
+#include "manifest/DamagedManifest.h"
+
+#include <algorithm>
+#include <cstdint>
+#include <limits>
+#include <memory>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "LarderException.h"
+#include "SQLiteStore.h"
+#include "manifest/Schema.h"
+#include "manifest/SchemaFunctions.h"
+
+namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+using Bytes = std::vector<unsigned char>;
+
+constexpr int kStatementDoesNotFit = 1;  // SQLite's code for a statement that names what is not there
+
+bool isDamage(const SQLiteStoreException& error) {
+  return dynamic_cast<const SQLiteStoreCorruptedException*>(&error) != nullptr || error.code() == kStatementDoesNotFit;
+}
+
+std::optional<Bytes> bytesIn(SQLiteStoreCursor& cursor, int column, bool isNull) {
+  return isNull ? std::nullopt : std::make_optional(cursor.get<Bytes>(column));
+}
+
+ManifestRow rowIn(SQLiteStoreCursor& cursor) {
+  ManifestRow row;
+  row.item.key = cursor.get<std::string>(1);
+  row.item.filename = cursor.get<std::string>(2);
+  row.item.size = static_cast<std::uint32_t>(cursor.get<unsigned long long>(3));
+  row.item.hasInlineData = cursor.get<bool>(4);
+  row.item.modificationDate = static_cast<std::int32_t>(cursor.get<unsigned long long>(5));
+  row.item.lastAccessDate = static_cast<std::int32_t>(cursor.get<unsigned long long>(6));
+  row.inlineData = bytesIn(cursor, 7, !cursor.get<bool>(10));
+  row.metadata = bytesIn(cursor, 8, !cursor.get<bool>(11));
+  if (cursor.get<bool>(12)) row.item.checksum = static_cast<std::uint32_t>(cursor.get<unsigned long long>(9));
+  return row;
+}
+
+// Of a column, or NULL where the table has none of that name.
+std::string expressionFor(const std::string& name, const std::vector<SQLiteStoreColumn>& columns) {
+  const auto isIt = [&](const SQLiteStoreColumn& column) { return column.name == name; };
+  return std::any_of(columns.begin(), columns.end(), isIt) ? name : "NULL";
+}
+
+std::string selectRowsOf(const std::vector<SQLiteStoreColumn>& columns) {
+  const std::string inlineData = expressionFor("inline_data", columns);
+  const std::string metadata = expressionFor("extended_manifest", columns);
+  const std::string checksum = expressionFor("checksum", columns);
+  return "SELECT rowid, key, filename, size, has_inline_data, modification_date, last_access_date, " + inlineData +
+         ", " + metadata + ", " + checksum + ", " + inlineData + " IS NOT NULL, " + metadata + " IS NOT NULL, " +
+         checksum + " IS NOT NULL FROM LarderManifest WHERE rowid >= ?1 ORDER BY rowid";
+}
+
+class Reading {
+ public:
+  Reading(SQLiteStore& store, const std::function<void(ManifestRow&&)>& consume)
+      : store_(store), selectRows_(selectRowsOf(store.info(kManifestTable))), consume_(consume) {}
+
+  void readAll() {
+    for (bool isOver = false; !isOver;) {
+      try {
+        readOn();
+        isOver = true;
+      } catch (const SQLiteStoreException& error) {
+        if (!isDamage(error)) throw;
+        isOver = !skipDamage();
+      }
+    }
+  }
+
+ private:
+  static constexpr std::int64_t kLastRow = std::numeric_limits<std::int64_t>::max();
+
+  // From the row that is next up to the first that cannot be read.
+  void readOn() {
+    SQLiteStoreCursor cursor = store_.cursor(selectRows_);
+    bindRow(cursor, next_);
+    while (cursor.next()) {
+      const auto number = static_cast<std::int64_t>(cursor.get<unsigned long long>(0));
+      if (number == kLastRow) return;
+      next_ = number + 1;
+      consume_(rowIn(cursor));
+    }
+  }
+
+  // A damaged page takes a range of rows with it: finds its end, doubling the distance and then halving it. False when
+  // there is none.
+  bool skipDamage() {
+    if (std::exchange(failedAt_, next_) != next_ && canRead(next_)) return true;  // the damage was in the last row
+    std::int64_t damaged = next_;
+    std::int64_t distance = 1;
+    while (distance < kLastRow - damaged && !canRead(damaged + distance)) {
+      damaged += distance;
+      distance *= 2;
+    }
+    if (distance >= kLastRow - damaged) return false;
+    std::int64_t readable = damaged + distance;
+    while (readable - damaged > 1) {
+      const std::int64_t middle = damaged + (readable - damaged) / 2;
+      (canRead(middle) ? readable : damaged) = middle;
+    }
+    next_ = readable;
+    return true;
+  }
+
+  bool canRead(std::int64_t row) {
+    try {
+      SQLiteStoreCursor cursor =
+          store_.cursor("SELECT key FROM LarderManifest WHERE rowid >= ?1 ORDER BY rowid LIMIT 1");
+      bindRow(cursor, row);
+      cursor.next();
+      return true;
+    } catch (const SQLiteStoreException& error) {
+      if (!isDamage(error)) throw;
+      return false;
+    }
+  }
+
+  static void bindRow(SQLiteStoreCursor& cursor, std::int64_t row) {
+    cursor.bind<unsigned long long>(1, static_cast<unsigned long long>(row));
+  }
+
+  SQLiteStore& store_;
+  const std::string selectRows_;
+  const std::function<void(ManifestRow&&)>& consume_;
+  std::int64_t next_ = 0;  // rows are numbered from 1 on
+  std::int64_t failedAt_ = -1;
+};
+
+}  // namespace
+
+void readDamagedManifest(const std::string& path, const std::function<void(ManifestRow&&)>& consume) {
+  try {
+    SQLiteStore store(path);
+    throwIfTableCallsFunctions(store, kManifestTable);
+    Reading(store, consume).readAll();
+  } catch (const SQLiteStoreException& error) {
+    if (!isDamage(error)) throw;
+  }
+}
+
+}  // namespace velmora::mobile::xplat::cellar
