@@ -24,6 +24,7 @@ template <class Definition> void setOptions(KeyValueStoreOptions& options, const
   options.capacity = definition.capacity;
   options.staleAge = staleAgeOf(definition.staleAge);
   options.inlineData = definition.inlineData;
+  options.durability = definition.durability;
   options.onSizeChanged = std::move(sizeChangedCallback);
 }
 

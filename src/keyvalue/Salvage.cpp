@@ -25,15 +25,18 @@ namespace {
 
 const std::string kQuarantine = "quarantine";
 
-// A file without a byte is a database to SQLite, and an empty one.
-bool isEmptyFile(const std::string& path) {
+// Throws when it cannot be told: what is only out of reach at the moment must not be taken for missing.
+std::filesystem::file_type typeOf(const std::string& path) {
   std::error_code error;
-  return std::filesystem::is_regular_file(path, error) && std::filesystem::file_size(path, error) == 0;
+  const auto type = std::filesystem::symlink_status(path, error).type();
+  if (type != std::filesystem::file_type::none) return type;
+  throw FileUtilsIoException(error.value(), "Could not look for \"" + path + "\": " + error.message());
 }
 
 bool isFileWithBytes(const std::string& path) {
+  if (typeOf(path) != std::filesystem::file_type::regular) return false;
   std::error_code error;
-  return std::filesystem::is_regular_file(path, error) && !isEmptyFile(path);
+  return std::filesystem::file_size(path, error) > 0;
 }
 
 }  // namespace
@@ -55,8 +58,10 @@ Salvage::Salvage(StoreContext& context, StoreManifest& manifest, VersionedFiles&
 
 void Salvage::prepareOpening() {
   if (isThere(salvagedName_)) putInPlace();
-  const bool isMissing = !isThere(kManifestFileName) || isEmptyFile(context_.manifestPath);
-  if (isMissing && !files_.found().empty()) salvage("The manifest is missing.");
+  // A file without a byte is a database to SQLite, and an empty one.
+  const bool isEmpty =
+      typeOf(context_.manifestPath) == std::filesystem::file_type::regular && !isFileWithBytes(context_.manifestPath);
+  if ((isEmpty || !isThere(kManifestFileName)) && !files_.found().empty()) salvage("The manifest is missing.");
 }
 
 void Salvage::recoverOpening(const ManifestPersistenceException& error, int attempt) {
@@ -212,7 +217,9 @@ void Salvage::report(const Yield& yield, const std::string& reason) {
        std::to_string(yield.unreadable.size()) + " files that are not what their names say: " + pathOf(kQuarantine)});
 }
 
-bool Salvage::isThere(const std::string& name) const { return context_.files->pathExists(pathOf(name)); }
+bool Salvage::isThere(const std::string& name) const {
+  return typeOf(pathOf(name)) != std::filesystem::file_type::not_found;
+}
 
 std::string Salvage::pathOf(const std::string& name) const {
   return context_.files->combinePath(context_.options.directory, name);

@@ -14,6 +14,7 @@
 #include <map>
 #include <ostream>
 #include <string>
+#include <tuple>
 #include <utility>
 
 #include "faults/ScriptedWorkload.h"
@@ -56,8 +57,14 @@ using Places = std::map<std::string, Place>;
 // A statement that changes the manifest, by its first word.
 bool isWrite(const std::string& place) { return place == "INSERT" || place == "UPDATE" || place == "DELETE"; }
 
-class FaultInjection : public testing::Test {
+std::string nameOf(Durability durability) {
+  return durability == Durability::Relaxed ? "Relaxed" : durability == Durability::Safe ? "Safe" : "Synced";
+}
+
+class FaultSweep : public testing::Test {
  protected:
+  Durability durability = Durability::Relaxed;
+
   // Runs the workload again and again, with the n-th call failing in the n-th run, until a run has no fault.
   void sweep(const Faults& faults) {
     const std::size_t descriptors = openDescriptors();
@@ -80,11 +87,12 @@ class FaultInjection : public testing::Test {
   }
 
   // Only where the manifest is written may one fault cost a store; or where SQLite was shown damage.
-  static void lookAt(const Places& places, ScriptedWorkload::FaultMode mode) {
+  void lookAt(const Places& places, ScriptedWorkload::FaultMode mode) const {
     for (const auto& [name, place] : places) {
       std::cout << "  in " << name << ": " << place.runsWithDiscards << " of " << place.runs
                 << " runs had a store discarded\n";
-      if (isWrite(name) || mode == ScriptedWorkload::FaultMode::SilentLoss) continue;
+      const bool mayDiscard = isWrite(name) || mode == ScriptedWorkload::FaultMode::SilentLoss;
+      if (mayDiscard && durability == Durability::Relaxed) continue;
       EXPECT_EQ(place.runsWithDiscards, 0U) << name;
     }
   }
@@ -97,10 +105,10 @@ class FaultInjection : public testing::Test {
   }
 
   // The number of faults met.
-  static std::size_t live(const Faults& faults, std::size_t n, Places& places) {
+  std::size_t live(const Faults& faults, std::size_t n, Places& places) const {
     const Watchdog watchdog(kPatience);
     const TemporaryDirectory directory(quickPlace());
-    ScriptedWorkload workload(directory.path(), faults.mode);
+    ScriptedWorkload workload(directory.path(), faults.mode, durability);
     faults.plan(workload, n);
     for (std::size_t step = 0; step < ScriptedWorkload::stepCount() && !HasFailure(); ++step) workload.step(step);
     const std::size_t met = workload.vfs.failures() + workload.files->failures();
@@ -135,21 +143,26 @@ class FaultInjection : public testing::Test {
   }
 };
 
-TEST_F(FaultInjection, TheLifeItselfMeetsNoTrouble) {
+class FaultInjection : public FaultSweep, public testing::WithParamInterface<Durability> {
+ protected:
+  FaultInjection() { durability = GetParam(); }
+};
+
+TEST_P(FaultInjection, TheLifeItselfMeetsNoTrouble) {
   Faults none;
   none.plan = [](ScriptedWorkload&, std::size_t) {};
   Places places;
   EXPECT_EQ(live(none, 1, places), 0U);
 }
 
-TEST_F(FaultInjection, AFileOperationThatFailsOnce) { sweepFiles("file operation, EIO", EIO, false, 1); }
+TEST_P(FaultInjection, AFileOperationThatFailsOnce) { sweepFiles("file operation, EIO", EIO, false, 1); }
 
-TEST_F(FaultInjection, AFileOperationThatFindsNoSpaceOnceAndWritesTorn) {
+TEST_P(FaultInjection, AFileOperationThatFindsNoSpaceOnceAndWritesTorn) {
   sweepFiles("file operation, ENOSPC, torn", ENOSPC, true, 3);
 }
 
 // From the n-th file operation on the disk takes nothing more, from nobody.
-TEST_F(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
+TEST_P(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
   Faults faults;
   faults.name = "a full disk from the n-th file operation on";
   faults.stride = 11;
@@ -167,7 +180,7 @@ TEST_F(FaultInjection, ADiskThatIsFullFromOneMomentOn) {
   sweep(faults);
 }
 
-TEST_F(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
+TEST_P(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
   Faults faults;
   faults.name = "a dead disk from the n-th file operation on";
   faults.stride = 11;
@@ -192,7 +205,7 @@ TEST_F(FaultInjection, ADiskThatIsDeadFromOneMomentOn) {
 }
 
 // No manifest can be opened from one step on, for one step or for several, as when descriptors or rights are missing.
-TEST_F(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
+TEST_P(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
   const std::size_t last = ScriptedWorkload::stepCount() - 1;
   std::size_t met = 0;
   for (std::size_t first = 0; first <= last && !HasFailure(); ++first) {
@@ -201,7 +214,7 @@ TEST_F(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
                                        std::to_string(length) + " from step " + std::to_string(first));
       const Watchdog watchdog(kPatience);
       const TemporaryDirectory directory(quickPlace());
-      ScriptedWorkload workload(directory.path(), ScriptedWorkload::FaultMode::ManifestClosed);
+      ScriptedWorkload workload(directory.path(), ScriptedWorkload::FaultMode::ManifestClosed, durability);
       for (std::size_t step = 0; step <= last && !HasFailure(); ++step) {
         if (step == first) workload.vfs.failFromNth(VfsCall::Open, 1, SQLITE_CANTOPEN);
         workload.step(step);
@@ -217,7 +230,7 @@ TEST_F(FaultInjection, AManifestThatCannotBeOpenedForAWhileCostsNothing) {
 }
 
 // What a purge leaves when it cannot take the old manifest away must not undo what is acknowledged after it.
-TEST_F(FaultInjection, AManifestThatCannotBeWrittenBesideATrashThatTakesNothing) {
+TEST_P(FaultInjection, AManifestThatCannotBeWrittenBesideATrashThatTakesNothing) {
   Faults faults;
   faults.name = "no writing and no collecting from the n-th file operation on";
   faults.stride = 11;
@@ -232,6 +245,10 @@ TEST_F(FaultInjection, AManifestThatCannotBeWrittenBesideATrashThatTakesNothing)
   sweep(faults);
 }
 
+INSTANTIATE_TEST_SUITE_P(Files, FaultInjection,
+                         testing::Values(Durability::Relaxed, Durability::Safe, Durability::Synced),
+                         [](const auto& parameter) { return nameOf(parameter.param); });
+
 struct DatabaseFault {
   const char* name;
   VfsCall call;
@@ -242,10 +259,14 @@ struct DatabaseFault {
 
 void PrintTo(const DatabaseFault& fault, std::ostream* out) { *out << fault.name; }
 
-class DatabaseFaultInjection : public FaultInjection, public testing::WithParamInterface<DatabaseFault> {};
+class DatabaseFaultInjection : public FaultSweep,
+                               public testing::WithParamInterface<std::tuple<Durability, DatabaseFault>> {
+ protected:
+  DatabaseFaultInjection() { durability = std::get<0>(GetParam()); }
+};
 
 TEST_P(DatabaseFaultInjection, ACallThatFailsOnce) {
-  const DatabaseFault& fault = GetParam();
+  const DatabaseFault& fault = std::get<1>(GetParam());
   Faults faults;
   faults.name = fault.name;
   faults.stride = fault.stride;
@@ -259,22 +280,25 @@ TEST_P(DatabaseFaultInjection, ACallThatFailsOnce) {
 
 INSTANTIATE_TEST_SUITE_P(
     SQLite, DatabaseFaultInjection,
-    testing::Values(DatabaseFault{"OpenCannot", VfsCall::Open, SQLITE_CANTOPEN, 1, false},
-                    DatabaseFault{"ReadFails", VfsCall::Read, SQLITE_IOERR_READ, 2, false},
-                    DatabaseFault{"ReadIsShort", VfsCall::Read, SQLITE_IOERR_SHORT_READ, 2, false},
-                    DatabaseFault{"WriteFails", VfsCall::Write, SQLITE_IOERR_WRITE, 7, false},
-                    DatabaseFault{"WriteFindsNoSpaceAndIsTorn", VfsCall::Write, SQLITE_FULL, 7, true},
-                    DatabaseFault{"TruncateFails", VfsCall::Truncate, SQLITE_IOERR_TRUNCATE, 1, false},
-                    DatabaseFault{"SyncFails", VfsCall::Sync, SQLITE_IOERR_FSYNC, 1, false},
-                    DatabaseFault{"FileSizeFails", VfsCall::FileSize, SQLITE_IOERR_FSTAT, 2, false},
-                    DatabaseFault{"LockIsBusy", VfsCall::Lock, SQLITE_BUSY, 1, false},
-                    DatabaseFault{"LockFails", VfsCall::Lock, SQLITE_IOERR_LOCK, 1, false},
-                    DatabaseFault{"DeleteFails", VfsCall::Delete, SQLITE_IOERR_DELETE, 1, false},
-                    DatabaseFault{"AccessFails", VfsCall::Access, SQLITE_IOERR_ACCESS, 1, false},
-                    DatabaseFault{"MapSharedMemoryFails", VfsCall::MapSharedMemory, SQLITE_IOERR_SHMMAP, 1, false},
-                    DatabaseFault{"LockSharedMemoryIsBusy", VfsCall::LockSharedMemory, SQLITE_BUSY, 7, false},
-                    DatabaseFault{"LockSharedMemoryFails", VfsCall::LockSharedMemory, SQLITE_IOERR_SHMLOCK, 7, false}),
-    [](const auto& fault) { return fault.param.name; });
+    testing::Combine(
+        testing::Values(Durability::Relaxed, Durability::Safe),
+        testing::Values(DatabaseFault{"OpenCannot", VfsCall::Open, SQLITE_CANTOPEN, 1, false},
+                        DatabaseFault{"ReadFails", VfsCall::Read, SQLITE_IOERR_READ, 2, false},
+                        DatabaseFault{"ReadIsShort", VfsCall::Read, SQLITE_IOERR_SHORT_READ, 2, false},
+                        DatabaseFault{"WriteFails", VfsCall::Write, SQLITE_IOERR_WRITE, 7, false},
+                        DatabaseFault{"WriteFindsNoSpaceAndIsTorn", VfsCall::Write, SQLITE_FULL, 7, true},
+                        DatabaseFault{"TruncateFails", VfsCall::Truncate, SQLITE_IOERR_TRUNCATE, 1, false},
+                        DatabaseFault{"SyncFails", VfsCall::Sync, SQLITE_IOERR_FSYNC, 1, false},
+                        DatabaseFault{"FileSizeFails", VfsCall::FileSize, SQLITE_IOERR_FSTAT, 2, false},
+                        DatabaseFault{"LockIsBusy", VfsCall::Lock, SQLITE_BUSY, 1, false},
+                        DatabaseFault{"LockFails", VfsCall::Lock, SQLITE_IOERR_LOCK, 1, false},
+                        DatabaseFault{"DeleteFails", VfsCall::Delete, SQLITE_IOERR_DELETE, 1, false},
+                        DatabaseFault{"AccessFails", VfsCall::Access, SQLITE_IOERR_ACCESS, 1, false},
+                        DatabaseFault{"MapSharedMemoryFails", VfsCall::MapSharedMemory, SQLITE_IOERR_SHMMAP, 1, false},
+                        DatabaseFault{"LockSharedMemoryIsBusy", VfsCall::LockSharedMemory, SQLITE_BUSY, 7, false},
+                        DatabaseFault{"LockSharedMemoryFails", VfsCall::LockSharedMemory, SQLITE_IOERR_SHMLOCK, 7,
+                                      false})),
+    [](const auto& parameter) { return nameOf(std::get<0>(parameter.param)) + std::get<1>(parameter.param).name; });
 
 }  // namespace
 }  // namespace velmora::mobile::xplat::cellar::test

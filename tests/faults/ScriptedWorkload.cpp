@@ -43,6 +43,18 @@ const char* const kConfiguration = R"({
   }
 })";
 
+std::string configurationOf(Durability durability) {
+  std::string text = kConfiguration;
+  if (durability == Durability::Relaxed) return text;
+  const std::string before = "\"stale_age\"";
+  const std::string key =
+      durability == Durability::Safe ? "\"durability\": \"safe\", " : "\"durability\": \"synced\", ";
+  for (auto at = text.find(before); at != std::string::npos; at = text.find(before, at + key.size() + 1)) {
+    text.insert(at, key);
+  }
+  return text;
+}
+
 const std::vector<std::string> kStores = {"letters", "settings", "recent", "thumbs", "notes"};
 
 // How the line begins that tells of a purge.
@@ -93,13 +105,13 @@ struct ScriptedWorkload::Process {
   std::map<std::string, std::string> paths;  // of all stores that were ever opened
   std::shared_ptr<UnmanagedStore> web;
 
-  Process(const std::string& root, const std::shared_ptr<FileUtils>& files) {
+  Process(const std::string& root, const std::shared_ptr<FileUtils>& files, Durability durability) {
     const auto reporter = recordingReporter(events);
     trash = std::make_shared<RecordingTrashCollector>(root + "/trash", files, reporter, trashQueues);
     const auto attributes = std::make_shared<AttributeStore>(files);
     sizes = std::make_shared<DiskSizeCalculator>(files, attributes, reporter);
     lazyWork = LazyDispatcher::createLazyDispatcher(queues, 10);
-    const auto configuration = std::make_shared<const Configuration>(kConfiguration);
+    const auto configuration = std::make_shared<const Configuration>(configurationOf(durability));
     const auto locations = std::make_shared<Locations>(root);
     const auto names = std::make_shared<StoreDirectoryNameBuilderFactory>("250", "US", "en");
     const auto factory = [&](bool servesSessionScoped) {
@@ -187,7 +199,8 @@ const std::vector<ScriptedWorkload::Step>& ScriptedWorkload::script() {
 
 std::size_t ScriptedWorkload::stepCount() { return script().size(); }
 
-ScriptedWorkload::ScriptedWorkload(const std::string& root, FaultMode mode) : root_(root), mode_(mode) {}
+ScriptedWorkload::ScriptedWorkload(const std::string& root, FaultMode mode, Durability durability)
+    : root_(root), mode_(mode), durability_(durability), isSafe_(durability != Durability::Relaxed) {}
 
 ScriptedWorkload::~ScriptedWorkload() { end(); }
 
@@ -214,7 +227,7 @@ std::string quickPlace() {
 // --- The script ---
 
 void ScriptedWorkload::start() {
-  process_ = std::make_unique<Process>(root_, files);
+  process_ = std::make_unique<Process>(root_, files, durability_);
   purges_.clear();
   for (const std::string& name : kStores) linesBeforeStart_[name] = purgeLines(lineOf(name));
   mayThrow_ = true;
@@ -465,6 +478,7 @@ void ScriptedWorkload::take(const Asked& asked) {
   if (!asked.written->hasSucceeded()) ++complaints_;
   if (mode_ == FaultMode::ManifestClosed) return;
   remembered.values.insert(asked.value);
+  if (isSafe_) return;  // the former value stays, unless this one turns up in the manifest's log
   remembered.mayBeMissing = true;
   if (mode_ != FaultMode::OneFault) remembered.mayFail = remembered.mayBeTorn = true;
 }
@@ -473,6 +487,10 @@ void ScriptedWorkload::take(const Asked& asked) {
 void ScriptedWorkload::forget(const Asked& asked) {
   Remembered& remembered = memory_[asked.store][asked.key];
   remembered.everWritten.insert(asked.value);
+  if (isSafe_) {  // where there is no manifest, its file may be found, and is a whole value
+    if (faults() > 0) remembered.values.insert(asked.value);
+    return;
+  }
   if (isInTrouble || faults() > asked.faultsBefore) remembered.mayBeMissing = remembered.mayFail = true;
 }
 
@@ -561,7 +579,7 @@ void ScriptedWorkload::expectNewWorkSucceeds() {
 }
 
 void ScriptedWorkload::expectDatabasesAreSound() {
-  if (mode_ == FaultMode::SilentLoss) return;  // SQLite could not know, and has gone on from what it read
+  if (mode_ == FaultMode::SilentLoss && !isSafe_) return;  // SQLite could not know, and has gone on from what it read
   for (const auto& [name, opened] : process_->stores) {
     sqlite3* database = nullptr;
     const std::string path = opened->path + "/manifest_v1.sqlite";
@@ -611,7 +629,7 @@ void ScriptedWorkload::notePurges() {
   for (const std::string& name : kStores) {
     const std::size_t now = purges(name);
     const bool isPurged = now != std::exchange(purges_[name], now);
-    const bool isHarmed = isPurged || (mode_ == FaultMode::SilentLoss && faults() > 0);
+    const bool isHarmed = isPurged || (mode_ == FaultMode::SilentLoss && !isSafe_ && faults() > 0);
     if (isHarmed) mayGo(name);
     if (!isHarmed || mode_ == FaultMode::OneFault) continue;
     for (auto& [key, remembered] : memory_[name]) remembered.mayFail = true;

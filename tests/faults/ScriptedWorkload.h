@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "Durability.h"
 #include "host/testing/ManualClock.h"
 #include "support/FaultyVfs.h"
 #include "support/KeyValueStoreFixture.h"
@@ -41,8 +42,9 @@ class ScriptedWorkload {
     SilentLoss,      // the database is cut short under SQLite: values may vanish without a word, but none may be wrong
   };
 
-  // Under `root`.
-  ScriptedWorkload(const std::string& root, FaultMode mode);
+  // Under `root`, with stores of that durability: of safe ones no value may be lost, whatever fails, and none is
+  // discarded.
+  ScriptedWorkload(const std::string& root, FaultMode mode, Durability durability = Durability::Relaxed);
   ScriptedWorkload(const ScriptedWorkload&) = delete;
   ScriptedWorkload& operator=(const ScriptedWorkload&) = delete;
   ~ScriptedWorkload();
@@ -126,6 +128,8 @@ class ScriptedWorkload {
 
   const std::string root_;
   const FaultMode mode_;
+  const Durability durability_;
+  const bool isSafe_;
   ManualClock clock_{2'000'000'000};
   ShortPauses pauses_;
   LogCapture log_;
