@@ -43,7 +43,7 @@ class DiskRecord {
   // The directory that holds an entry has been synced.
   void syncedParentOf(const std::string& path);
 
-  // A file that SQLite has opened, from now on told of each write. Null if it is no file of this tree.
+  // A file that SQLite has opened, from now on told of each write. Null if it is not a file of this tree.
   NodePtr openedAsDatabase(const std::string& path);
 
   // The file of that name is not one that outlives a power cut.
