@@ -4,6 +4,8 @@
 
 #include <exception>
 #include <iterator>
+#include <string_view>
+#include <unordered_set>
 #include <utility>
 
 #include "Clock.h"
@@ -19,6 +21,14 @@ namespace {
 
 constexpr std::int64_t kFlushIntervalNanoseconds = 120'000'000'000;
 constexpr std::size_t kMaxPendingAccessDates = 512;
+
+// A key with two rows has a damaged index, by which its former row was not found when it was replaced.
+void throwIfAmbiguous(const std::vector<std::unique_ptr<DiskCacheItem>>& records) {
+  std::unordered_set<std::string_view> keys;
+  keys.reserve(records.size());
+  for (const auto& record : records) keys.insert(record->key);
+  if (keys.size() < records.size()) throw ManifestCorruptedException("There are two rows for a key.", -1);
+}
 
 }  // namespace
 
@@ -46,6 +56,10 @@ bool DiskCacheManifestInterface::hasMoved() { return false; }
 bool DiskCacheManifestInterface::isSound() { return true; }
 
 void DiskCacheManifestInterface::release() {}
+
+void DiskCacheManifestInterface::suspend() {}
+
+void DiskCacheManifestInterface::resume() {}
 
 void DiskCacheManifestInterface::reload() { load(); }
 
@@ -92,6 +106,7 @@ void DiskCacheManifest::load() {
   {
     const std::lock_guard<std::mutex> loadLock(loadMutex_);
     auto records = persistence_->getAllItems();
+    if (time_ != nullptr) throwIfAmbiguous(records);
     const ItemsLock lock(itemsMutex_);
     if (!loaded_) {
       records_->reserve(records.size());
@@ -178,14 +193,22 @@ bool DiskCacheManifest::isSound() { return persistence_->isSound(); }
 
 void DiskCacheManifest::release() { persistence_->release(); }
 
+void DiskCacheManifest::suspend() { persistence_->suspend(); }
+
+void DiskCacheManifest::resume() { persistence_->resume(); }
+
 void DiskCacheManifest::reload() {
   {
     const std::lock_guard<std::mutex> loadLock(loadMutex_);
     const ItemsLock lock(itemsMutex_);
+    persistence_->resume();
     const auto records = persistence_->getAllItems();
     records_->clear();
     pendingAccessDates_.clear();
-    for (const auto& record : records) records_->store(*record);
+    for (const auto& record : records) {
+      records_->store(*record);
+      if (time_ != nullptr) time_->noteDateOf(*record);
+    }
     loaded_ = true;
   }
   armFlushTimer();

@@ -84,6 +84,10 @@ class CELLAR_EXPORT DiskCacheManifestInterface : public std::enable_shared_from_
   // Lets go of what the records are kept in, until the next operation.
   virtual void release();
 
+  // The same until `resume` or `reload`: what would have to be read or written fails meanwhile.
+  virtual void suspend();
+  virtual void resume();
+
   // Reads all records again, from what is there by now. Those in memory are dropped.
   virtual void reload();
 
@@ -185,6 +189,8 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   bool hasMoved() override;
   bool isSound() override;
   void release() override;
+  void suspend() override;
+  void resume() override;
   void reload() override;
 
   std::uint32_t size() override;   // total bytes of the items in memory

@@ -159,6 +159,13 @@ class DirectoryStream {
   DIR* stream_;
 };
 
+// Some file systems do not tell in the directory itself.
+bool isRegular(const DirectoryStream& directory, const dirent& entry) {
+  if (entry.d_type != DT_UNKNOWN) return entry.d_type == DT_REG;
+  struct stat status {};
+  return ::fstatat(directory.descriptor(), entry.d_name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode);
+}
+
 // Opens a directory to empty it: whatever has become of the path meanwhile, a link is not followed.
 DIR* openUnlessLink(const string& path) {
   const int descriptor = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
@@ -366,9 +373,12 @@ void FileUtils::sync(const string& path) {
 std::vector<string> FileUtils::listFiles(const string& path) {
   std::vector<string> names;
   DirectoryStream directory(::opendir(path.c_str()));
+  errno = 0;
   while (const dirent* entry = directory.next()) {
-    if (entry->d_type == DT_REG) names.emplace_back(entry->d_name);
+    if (isRegular(directory, *entry)) names.emplace_back(entry->d_name);
+    errno = 0;
   }
+  if (errno != 0) throwSystemError("Could not read directory", errno);
   return names;
 }
 

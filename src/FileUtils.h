@@ -104,7 +104,7 @@ class CELLAR_EXPORT FileUtils {
   // Waits until what a file contains, or the names in a directory, are on the medium and outlive a power cut.
   virtual void sync(const std::string& path);
 
-  // The bare names of the regular files in a directory, in the file system's order. Looks at none of them.
+  // The bare names of the regular files in a directory, in the file system's order.
   virtual std::vector<std::string> listFiles(const std::string& path);
 };
 

@@ -15,6 +15,10 @@ bool ManifestPersistence::isSound() const { return true; }
 
 void ManifestPersistence::release() {}
 
+void ManifestPersistence::suspend() {}
+
+void ManifestPersistence::resume() {}
+
 bool ManifestPersistence::performTogether(const std::function<void()>& /*operations*/) { return false; }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -69,6 +69,10 @@ class CELLAR_EXPORT ManifestPersistence {
   // Lets go of the medium until the next operation.
   virtual void release();
 
+  // The same until `resume`: operations fail meanwhile.
+  virtual void suspend();
+  virtual void resume();
+
  protected:
   ManifestPersistence() = default;
   ManifestPersistence(const ManifestPersistence&) = default;

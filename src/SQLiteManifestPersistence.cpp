@@ -4,8 +4,11 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <filesystem>
 #include <fstream>
 #include <ios>
+#include <system_error>
+#include <type_traits>
 #include <utility>
 
 #include "ExtendedMetadata.h"
@@ -21,6 +24,17 @@ namespace {
 constexpr int kReadOnly = 8;
 // And for a statement that was not carried out because another one had failed.
 constexpr int kAbort = 4;
+// And for a database that another connection has locked.
+constexpr int kBusy = 5;
+
+constexpr const char* beForbearing = "PRAGMA busy_timeout = 1000";
+
+// Links are followed, as SQLite does. True when it cannot be told.
+bool isThere(const std::string& path) {
+  std::error_code error;
+  const auto size = std::filesystem::file_size(path, error);
+  return error ? error != std::errc::no_such_file_or_directory && error != std::errc::not_a_directory : size > 0;
+}
 
 constexpr const char* chooseJournal = "PRAGMA journal_mode = WAL;PRAGMA synchronous = NORMAL;";
 
@@ -123,10 +137,21 @@ std::unique_ptr<SQLiteStore> SQLiteManifestPersistence::openStore() const {
 }
 
 void SQLiteManifestPersistence::initializeDatabase(SQLiteStore& store) const {
-  if (hasChecksums()) store.exec("PRAGMA busy_timeout = 1000");
+  if (hasChecksums()) store.exec(beForbearing);
   initializeTable(store);
   if (hasChecksums()) addChecksums(store);
   if (durability_ == Durability::Synced) store.exec("PRAGMA synchronous = FULL");
+}
+
+template <class Operation> auto SQLiteManifestPersistence::withPatience(Operation operation) const {
+  if constexpr (std::is_void_v<decltype(operation())>) {
+    operation();
+    setPatience(true);
+  } else {
+    auto result = operation();
+    setPatience(true);
+    return result;
+  }
 }
 
 template <class Operation> auto SQLiteManifestPersistence::perform(Operation operation) const {
@@ -136,7 +161,7 @@ template <class Operation> auto SQLiteManifestPersistence::perform(Operation ope
   return translatingExceptions([&] {
     prepare();
     try {
-      return operation();
+      return withPatience(operation);
     } catch (const SQLiteStoreException& exception) {
       handleFailure(exception);
       throw;
@@ -146,11 +171,23 @@ template <class Operation> auto SQLiteManifestPersistence::perform(Operation ope
 
 void SQLiteManifestPersistence::prepare() const {
   if (transaction_ == Transaction::Failed) throw SQLiteStoreException("The transaction has failed.", kAbort);
-  if (mustReopen_) reopen();
+  if (isSuspended_) throw SQLiteStoreException("The manifest is being replaced.", kBusy);
+  if (!mustReopen_) return;
+  // To SQLite a file that is missing, or has no bytes, is an empty database.
+  if (hasChecksums() && !isThere(path_)) throw SQLiteStoreCorruptedException("The manifest is missing.", -1);
+  reopen();
+}
+
+// Waits for another connection's lock again as soon as one was had.
+void SQLiteManifestPersistence::setPatience(bool isPatient) const {
+  if (!hasChecksums() || waitsForLocks_ == isPatient || store_ == nullptr) return;
+  store_->exec(isPatient ? beForbearing : "PRAGMA busy_timeout = 0");
+  waitsForLocks_ = isPatient;
 }
 
 void SQLiteManifestPersistence::handleFailure(const SQLiteStoreException& exception) const {
   if (transaction_ == Transaction::Open) transaction_ = Transaction::Failed;
+  if (exception.code() == kBusy) setPatience(false);
   if (exception.code() == kReadOnly) handleReadOnly(exception);
 }
 
@@ -171,6 +208,7 @@ void SQLiteManifestPersistence::handleReadOnly(const SQLiteStoreException& excep
 // then: it is opened before, because opening can fail, but used only afterwards.
 void SQLiteManifestPersistence::reopen() const {
   store_ = openStore();
+  waitsForLocks_ = true;
   initializeDatabase(*store_);
   mustReopen_ = false;
 }
@@ -182,9 +220,21 @@ void SQLiteManifestPersistence::release() {
   mustReopen_ = true;
 }
 
+void SQLiteManifestPersistence::suspend() {
+  const std::lock_guard<std::recursive_mutex> lock(mutex_);
+  release();
+  isSuspended_ = true;
+}
+
+void SQLiteManifestPersistence::resume() {
+  const std::lock_guard<std::recursive_mutex> lock(mutex_);
+  isSuspended_ = false;
+}
+
 bool SQLiteManifestPersistence::hasMoved() const {
   const std::lock_guard<std::recursive_mutex> lock(mutex_);
-  return store_ != nullptr && store_->hasMoved();
+  if (invalidated_) return false;
+  return store_ == nullptr ? !isThere(path_) : store_->hasMoved();
 }
 
 bool SQLiteManifestPersistence::isSound() const {

@@ -87,12 +87,16 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
 
   // Closes the database.
   void release() override;
+  void suspend() override;
+  void resume() override;
 
   // Corrects the size of a record that is there already; everything else of it stays, an inline value too.
   void setSize(const std::string& key, std::uint32_t size);
 
  private:
   template <class Operation> auto perform(Operation operation) const;
+  template <class Operation> auto withPatience(Operation operation) const;
+  void setPatience(bool isPatient) const;
 
   bool hasChecksums() const { return durability_ != Durability::Relaxed; }
   std::string selectItems(const char* condition) const;
@@ -107,14 +111,16 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   std::vector<std::unique_ptr<DiskCacheItem>> itemsOf(SQLiteStoreCursor& cursor) const;
 
   const std::string path_;
-  // Held by every operation from its beginning to its end, and around those that are performed together; guards the
-  // four below.
+  // Held by every operation from its beginning to its end, and around those that are performed together; guards what
+  // follows.
   mutable std::recursive_mutex mutex_;
   bool invalidated_ = false;
   mutable std::unique_ptr<SQLiteStore> store_;  // null once invalidated
   // The next operation opens the database again: SQLite opens what may not be written just now for reading only, and a
   // transaction that cannot be rolled back ends with its connection.
   mutable bool mustReopen_ = false;
+  bool isSuspended_ = false;
+  mutable bool waitsForLocks_ = true;  // not again for one that was waited for in vain
   // Whether operations are being performed together, and one of them has failed: SQLite may have ended the transaction.
   enum class Transaction : std::uint8_t { None, Open, Failed };
   mutable Transaction transaction_ = Transaction::None;

@@ -563,6 +563,131 @@ TEST_F(SafeStore, KeepsItsManifestAnewWhenADirectoryLiesInItsPlace) {
   EXPECT_TRUE(std::filesystem::exists(pathOf("quarantine/manifest_v1.sqlite/deep")));
 }
 
+// One failure in the middle of a salvage, at each operation on files: nothing is lost, here or after a restart.
+TEST_F(SafeStore, FinishesASalvageThatFailsInTheMiddle) {
+  for (std::size_t n = 1; n < 200; ++n) {
+    SCOPED_TRACE(n);
+    open();
+    put("a", "1");
+    put("b", "2");
+    for (const char* suffix : {"", "-wal", "-shm"}) std::filesystem::remove(manifestPath() + suffix);
+    const std::size_t before = files->failures();
+    files->failNth(n, EIO);
+    const Written written = watch(store->store("c", bytesOf("3")));
+    settle();
+    const bool hasFailed = files->failures() > before;
+    files->heal();
+    put("d", "4");
+    Contents expected{{"a", "1"}, {"b", "2"}, {"d", "4"}};
+    if (written->hasSucceeded()) expected["c"] = "3";
+    EXPECT_EQ(contents(), expected);
+    reopen();
+    EXPECT_EQ(contents(), expected);
+    reopen();
+    EXPECT_THAT(valueFiles(), SizeIs(expected.size() + (std::filesystem::exists(pathOf("quarantine")) ? 1 : 0)));
+    close();
+    std::filesystem::remove_all(storePath());
+    if (!hasFailed) return;
+  }
+  FAIL() << "The salvage never ended.";
+}
+
+TEST_F(SafeStore, SalvagesWhenAnEmptyFileTakesThePlaceOfItsManifest) {
+  open();
+  put("a", "1");
+  for (const char* suffix : {"", "-wal", "-shm"}) std::filesystem::remove(manifestPath() + suffix);
+  std::ofstream(manifestPath()).close();
+  put("b", "2");
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"a", "1"}, {"b", "2"}}));
+}
+
+TEST_F(SafeStore, ContinuesWithTheManifestThatSomebodyPutsInThePlaceOfItsOwn) {
+  open();
+  put("a", "1");
+  close();
+  std::filesystem::copy(storePath(), directory.file("backup"), std::filesystem::copy_options::recursive);
+  open();
+  put("b", "2");
+  std::filesystem::remove_all(storePath());
+  std::filesystem::rename(directory.file("backup"), storePath());
+  put("c", "3");
+  EXPECT_EQ(contents(), (Contents{{"a", "1"}, {"c", "3"}}));
+  reopen();
+  EXPECT_EQ(contents(), (Contents{{"a", "1"}, {"c", "3"}}));
+}
+
+// --- What earlier runs have left ---
+
+TEST_F(SafeStore, TakesNoFileForLeftBehindThatIsReplacedWhileItLooks) {
+  open();
+  put("a", "old");
+  close();
+  openUnloaded();
+  const Written written = watch(store->store("a", bytesOf("new")));
+  file().runAll();
+  work().runAll();
+  EXPECT_TRUE(written->hasSucceeded());
+  file().runNext();
+  work().runAll();
+  settle();
+  EXPECT_EQ(get("a"), "new");
+  reopen();
+  EXPECT_EQ(get("a"), "new");
+  EXPECT_THAT(valueFiles(), SizeIs(1));
+}
+
+TEST_F(SafeStore, DeletesNoFileThatIsWrittenAgainUnderItsOwnName) {
+  open();
+  put("a", "1");
+  close();
+  std::filesystem::remove(pathOf(onlyFile()));
+  openUnloaded();
+  const Written written = watch(store->store("a", bytesOf("1")));
+  settle();
+  EXPECT_TRUE(written->hasSucceeded());
+  EXPECT_EQ(get("a"), "1");
+}
+
+TEST_F(SafeStore, KeepsTheFilesOfARelaxedStoreThatAreNamedLikeItsOwn) {
+  options.durability = Durability::Relaxed;
+  open();
+  for (const char* key : {"main.12345.abcdef12", "main", "x.1.00000000.part", "quarantine"}) put(key, key);
+  close();
+  options.durability = Durability::Safe;
+  open();
+  for (const char* key : {"main.12345.abcdef12", "main", "x.1.00000000.part", "quarantine"}) EXPECT_EQ(get(key), key);
+  close();
+  damageManifest();
+  open();
+  EXPECT_EQ(get("main.12345.abcdef12"), "<miss>") << "It is not known to be a value.";
+  put("new", "value");
+  EXPECT_EQ(get("new"), "value");
+}
+
+TEST_F(SafeStore, AdoptsWhatARecordOfAPowerCutHasLost) {
+  open();
+  put("a", "old");
+  const std::string old = onlyFile();
+  close();
+  std::filesystem::copy(manifestPath(), directory.file("former manifest"));
+  open();
+  put("a", "new");
+  close();
+  std::filesystem::rename(directory.file("former manifest"), manifestPath());
+  ASSERT_FALSE(std::filesystem::exists(pathOf(old)));
+  open();
+  EXPECT_EQ(get("a"), "new");
+}
+
+TEST_F(SafeStore, RemovesAnItemWhoseFileSomebodyHasRemoved) {
+  open();
+  put("a", "1");
+  std::filesystem::remove(pathOf(onlyFile()));
+  EXPECT_EQ(drop("a"), "<done>");
+  EXPECT_THAT(store->getAllKeys(), IsEmpty());
+}
+
 // --- Changing over ---
 
 TEST_F(SafeStore, KeepsEveryValueWhenDurabilityIsSwitchedOnAndOff) {
@@ -634,6 +759,24 @@ TEST_F(SafeStore, LetsItemsExpire) {
   store->startStaleItemRemoval();
   settle();
   EXPECT_EQ(contents(), (Contents{{"new", "2"}}));
+}
+
+TEST_F(SafeStore, LetsNothingExpireByADateThatLiesAhead) {
+  clock.set(kStart * 1700);
+  options.durability = Durability::Relaxed;
+  options.staleAge = 30L * 86400;
+  open();
+  put("a", "1");
+  put("b", "2");
+  clock.set(k2038);
+  EXPECT_EQ(get("a"), "1");
+  close();
+  clock.set(kStart * 1700 + 60);
+  options.durability = Durability::Safe;
+  open();
+  store->startStaleItemRemoval();
+  settle();
+  EXPECT_EQ(contents(), (Contents{{"a", "1"}, {"b", "2"}}));
 }
 
 // --- Synced ---

@@ -13,6 +13,7 @@ namespace velmora::mobile::xplat::cellar {
 BatchRemoval::Items BatchRemoval::take(const Prune& prune) {
   const StoreLock lock = context_.lock();
   context_.throwIfInvalid();
+  manifest_.prepareChange(lock);
   Items items;
   if (!manifest_.recoveringFromDamage(lock, [&] { items = prune(lock, *manifest_.get()); })) return {};
   for (DiskCacheItem& item : items) {
@@ -29,10 +30,11 @@ BatchRemoval::Items BatchRemoval::evict(const Prune& prune) {
 
 void BatchRemoval::run(Provider provider, OnSuccess onSuccess, OnError onError) {
   auto countedProvider = [operation = context_.operation, provider = std::move(provider)] { return provider(); };
-  workQueue_.dispatchBehindAll([weakThis = context_.weak(*this), countedProvider = std::move(countedProvider),
-                                onSuccess = std::move(onSuccess), onError = std::move(onError)] {
+  const auto begin = [weakThis = context_.weak(*this), countedProvider = std::move(countedProvider),
+                      onSuccess = std::move(onSuccess), onError] {
     if (const auto self = weakThis.lock()) self->step(countedProvider, onSuccess, onError);
-  });
+  };
+  workQueue_.dispatchBehindAll(begin, onError);
 }
 
 void BatchRemoval::step(const Provider& provider, const OnSuccess& onSuccess, const OnError& onError) {

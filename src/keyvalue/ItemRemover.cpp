@@ -48,6 +48,7 @@ void ItemRemover::removeAlone(Removal& removal) {
     {
       const StoreLock lock = context_.lock();
       context_.throwIfInvalid();
+      manifest_.prepareChange(lock);
       removal.item = manifest_.lookUp(lock, KeyRange(removal.key));
       const auto removeIt = [&] { manifest_.get()->removeItem(removal.key); };
       if (removal.item != nullptr && !manifest_.recoveringFromDamage(lock, removeIt)) removal.item.reset();
@@ -74,7 +75,7 @@ void ItemRemover::deleteFile(Removal& removal) {
   if (removal.item == nullptr || removal.isLeftToWrite) return;
   if (context_.isClosed) return;  // the path may be another store's by now
   try {
-    if (const auto path = files_.fileOf(*removal.item)) context_.files->deleteFile(*path);
+    if (const auto path = files_.fileOf(*removal.item)) files_.deleteOne(*path);
   } catch (...) {
     removal.failure = std::current_exception();
   }

@@ -33,68 +33,90 @@ void Leftovers::list() {
   }
 }
 
-void Leftovers::removeAmong(const Files& files, std::vector<std::string> leftovers) {
+void Leftovers::removeAmong(const Files& files, std::vector<std::string> unfinished) {
   try {
     const StoreLock lock = context_.lock();
     if (context_.isInvalidated || !manifest_.get()->isLoaded()) return;
-    const Files unknown = withoutRecord(*manifest_.get(), files, leftovers);
-    if (unknown.empty() || manifest_.get()->isSound()) {
+    const auto named = namesInRecords();
+    std::vector<std::string> leftovers;
+    for (std::string& name : unfinished) {
+      if (named.count(name) == 0) leftovers.push_back(std::move(name));
+    }
+    const Files unknown = withoutRecord(named, files, leftovers);
+    if (unknown.empty() || isManifestSound()) {
       for (const auto& file : unknown) leftovers.push_back(file.name);
     } else {
       manifest_.recover(lock, ManifestCorruptedException("There are files without a record.", 0));
       for (auto file = unknown.rbegin(); file != unknown.rend(); ++file) {
         const bool isLatest = file->version.key && manifest_.get()->getItem(*file->version.key) == nullptr;
-        if (isLatest) adopt(*manifest_.get(), *file);
+        if (isLatest) adopt(*file);
       }
     }
+    deleteFiles(leftovers);
   } catch (const std::exception& error) {
     errorLine(__LINE__).stream() << "Store \"" << context_.options.name
-                                 << "\" could not tell which files were left behind: " << error.what();
-    return;
+                                 << "\" could not remove files that were left behind: " << error.what();
   }
-  deleteFiles(leftovers);
+}
+
+std::unordered_set<std::string> Leftovers::namesInRecords() {
+  const auto manifest = manifest_.get();
+  std::unordered_set<std::string> names;
+  for (const std::string& key : manifest->getAllKeys()) {
+    const auto item = manifest->getItem(key);
+    if (const auto version = VersionedName::parse(item->filename)) versions_.noteNumber(version->number);
+    names.insert(item->filename);
+  }
+  return names;
+}
+
+// Looked at once more before it is taken for damaged: the fault may lie in the reading.
+bool Leftovers::isManifestSound() {
+  const auto manifest = manifest_.get();
+  if (manifest->isSound()) return true;
+  manifest->release();
+  return manifest->isSound();
 }
 
 // Of the files that no record names, those whose key has a record with another file are superseded. The rest, whose
 // key has none, is returned. A record whose own file is missing gets the latest one that there is.
-Leftovers::Files Leftovers::withoutRecord(DiskCacheManifestInterface& manifest, const Files& files,
+Leftovers::Files Leftovers::withoutRecord(const std::unordered_set<std::string>& named, const Files& files,
                                           std::vector<std::string>& superseded) {
-  std::unordered_set<std::string> present;
-  for (const auto& file : files) present.insert(file.name);
-  std::unordered_set<std::string> named;  // by the records of keys that are too long for a file name
-  for (const std::string& key : manifest.getAllKeys()) {
-    const auto version = VersionedName::parse(manifest.getItem(key)->filename);
-    if (version && !version->key) named.insert(manifest.getItem(key)->filename);
-  }
+  const auto manifest = manifest_.get();
   Files unknown;
   for (auto file = files.rbegin(); file != files.rend(); ++file) {  // the latest first
     if (named.count(file->name) > 0) continue;
-    const auto item = file->version.key ? manifest.getItem(*file->version.key) : nullptr;
+    const auto item = file->version.key ? manifest->getItem(*file->version.key) : nullptr;
     if (item == nullptr) {
       unknown.insert(unknown.begin(), *file);
-    } else if (item->filename != file->name) {
-      const bool isMissing =
-          !item->hasInlineData && VersionedName::parse(item->filename) && present.count(item->filename) == 0;
-      if (!isMissing || !adopt(manifest, *file)) superseded.push_back(file->name);
+    } else if (item->filename != file->name && (hasItsFile(*item) || !adopt(*file))) {
+      superseded.push_back(file->name);
     }
   }
   return unknown;
 }
 
-// False for a file that is not intact.
-bool Leftovers::adopt(DiskCacheManifestInterface& manifest, const VersionedFiles::Found& file) {
+bool Leftovers::hasItsFile(const DiskCacheItem& item) const {
+  return item.hasInlineData || !VersionedName::parse(item.filename) || versions_.exists(item.filename);
+}
+
+// False for a file that is not intact, or not there any more.
+bool Leftovers::adopt(const VersionedFiles::Found& file) {
+  if (!versions_.exists(file.name)) return false;
   const auto size = versions_.sizeIfIntact(file);
   if (!size) return false;
-  const auto date = static_cast<std::int32_t>(manifest.currentDate());
+  const auto manifest = manifest_.get();
+  const auto date = static_cast<std::int32_t>(manifest->currentDate());
   DiskCacheItem item(*file.version.key, file.name, *size, false, date, date, nullptr);
   item.checksum = file.version.checksum;
-  manifest.storeItem(item, nullptr);
+  manifest->storeItem(item, nullptr);
   return true;
 }
 
 void Leftovers::deleteFiles(const std::vector<std::string>& names) {
   if (names.empty()) return;
   std::vector<std::string> paths;
+  paths.reserve(names.size());
   for (const std::string& name : names) paths.push_back(files_.pathOf(name));
   fileQueue_.dispatch([weakThis = context_.weak(*this), deletion = context_.fileDeletion, paths = std::move(paths)] {
     const auto self = weakThis.lock();

@@ -2,6 +2,7 @@
 
 #include <memory>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include "keyvalue/StoreContext.h"
@@ -9,7 +10,6 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-class DiskCacheManifestInterface;
 class FileQueue;
 class StoreManifest;
 class ValueFiles;
@@ -30,9 +30,13 @@ class Leftovers {
   using Files = std::vector<VersionedFiles::Found>;
 
   void list();
-  void removeAmong(const Files& files, std::vector<std::string> leftovers);
-  Files withoutRecord(DiskCacheManifestInterface& manifest, const Files& files, std::vector<std::string>& superseded);
-  bool adopt(DiskCacheManifestInterface& manifest, const VersionedFiles::Found& file);
+  void removeAmong(const Files& files, std::vector<std::string> unfinished);
+  std::unordered_set<std::string> namesInRecords();
+  bool isManifestSound();
+  Files withoutRecord(const std::unordered_set<std::string>& named, const Files& files,
+                      std::vector<std::string>& superseded);
+  bool hasItsFile(const DiskCacheItem& item) const;
+  bool adopt(const VersionedFiles::Found& file);
   void deleteFiles(const std::vector<std::string>& names);
 
   StoreContext& context_;

@@ -1,5 +1,7 @@
 #include "keyvalue/ReplacingWrites.h"
 
+#include <algorithm>
+#include <array>
 #include <cstdint>
 #include <exception>
 #include <optional>
@@ -23,6 +25,19 @@ namespace {
 // How many files share one sync of their directory, and how far they may get ahead of their records.
 constexpr std::size_t kMaxGroupSize = 32;
 constexpr std::uint64_t kMaxGroupBytes = 1 << 20;
+
+// Whether a record that could not be written may have been written nevertheless.
+bool mayBeInLog(const std::exception_ptr& failure) {
+  constexpr std::array<int, 4> kBeforeWriting = {5, 6, 8,
+                                                 14};  // SQLite's codes for locked, read-only, cannot be opened
+  try {
+    std::rethrow_exception(failure);
+  } catch (const ManifestPersistenceException& error) {
+    return std::find(kBeforeWriting.begin(), kBeforeWriting.end(), error.code()) == kBeforeWriting.end();
+  } catch (...) {
+    return false;
+  }
+}
 
 }  // namespace
 
@@ -137,18 +152,24 @@ void ReplacingWrites::writeFile(Write& write) {
   }
 }
 
+// A sync that has failed is not tried again: the system may have given up the data, and say that all is well.
 void ReplacingWrites::sync(const Writes& writes) {
-  std::vector<std::string> names;
-  for (const auto& write : writes) {
-    if (write->failure == nullptr) names.push_back(write->filename);
-  }
-  if (names.empty()) return;
-  try {
-    versions_.sync(names);
-  } catch (...) {
+  const auto ofEach = [&](const auto& work) {
     for (const auto& write : writes) {
-      if (write->failure == nullptr) write->failure = std::current_exception();
+      if (write->failure == nullptr) work(*write);
     }
+  };
+  ofEach([&](Write& write) {
+    try {
+      versions_.sync(write.filename);
+    } catch (...) {
+      write.failure = std::current_exception();
+    }
+  });
+  try {
+    versions_.syncDirectory();
+  } catch (...) {
+    ofEach([failure = std::current_exception()](Write& write) { write.failure = failure; });
   }
 }
 
@@ -193,7 +214,9 @@ void ReplacingWrites::noteReplaced(const StoreLock& lock, Write& write) {
   StoreContext::count(context_.stores);
   clearing_.noteStored(lock, write.key);
   if (write.replaced != nullptr) {
-    if (auto path = files_.fileOf(*write.replaced)) write.filesToDelete.push_back(std::move(*path));
+    const bool isItsOwn = write.replaced->filename == write.filename;  // of a record whose file had been removed
+    if (auto path = isItsOwn ? std::nullopt : files_.fileOf(*write.replaced))
+      write.filesToDelete.push_back(std::move(*path));
   }
   // The log of the manifest has gone on since: what had failed before is not in it.
   for (std::string& path : doubtfulFiles_) write.filesToDelete.push_back(std::move(path));
@@ -214,22 +237,14 @@ void ReplacingWrites::fulfil(Write& write) {
   write.promise.setValue();
 }
 
-// When the medium has failed, the row may be in the manifest's log all the same, and be found there at the next start:
+// When writing the manifest has failed, the row may be in its log all the same, and be found there at the next start:
 // the file stays until the log has gone on.
 void ReplacingWrites::giveUpFile(const Write& write) {
-  constexpr int kInputOutputError = 10;  // SQLite's code
   if (write.filename.empty() || write.isRecorded) return;
   const std::string path = files_.pathOf(write.filename);
-  try {
-    std::rethrow_exception(write.failure);
-  } catch (const ManifestPersistenceException& error) {
-    if (error.code() == kInputOutputError) {
-      const StoreLock lock = context_.lock();
-      return doubtfulFiles_.push_back(path);
-    }
-  } catch (...) {
-  }
-  deleteFiles({path});
+  if (!mayBeInLog(write.failure)) return deleteFiles({path});
+  const StoreLock lock = context_.lock();
+  doubtfulFiles_.push_back(path);
 }
 
 // Behind the fetches that read them. What is not deleted is removed at the next start.

@@ -8,7 +8,6 @@
 #include <unordered_set>
 #include <utility>
 
-#include "Clock.h"
 #include "FileUtils.h"
 #include "Incident.h"
 #include "LarderException.h"
@@ -18,6 +17,7 @@
 #include "keyvalue/VersionedFiles.h"
 #include "manifest/DamagedManifest.h"
 #include "manifest/NewManifest.h"
+#include "manifest/StoreTime.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -25,16 +25,8 @@ namespace {
 
 const std::string kQuarantine = "quarantine";
 
-// Throws when it cannot be told: what is only out of reach at the moment must not be taken for missing.
-std::filesystem::file_type typeOf(const std::string& path) {
-  std::error_code error;
-  const auto type = std::filesystem::symlink_status(path, error).type();
-  if (type != std::filesystem::file_type::none) return type;
-  throw FileUtilsIoException(error.value(), "Could not look for \"" + path + "\": " + error.message());
-}
-
 bool isFileWithBytes(const std::string& path) {
-  if (typeOf(path) != std::filesystem::file_type::regular) return false;
+  if (typeOfFile(path) != std::filesystem::file_type::regular) return false;
   std::error_code error;
   return std::filesystem::file_size(path, error) > 0;
 }
@@ -58,10 +50,15 @@ Salvage::Salvage(StoreContext& context, StoreManifest& manifest, VersionedFiles&
 
 void Salvage::prepareOpening() {
   if (isThere(salvagedName_)) putInPlace();
-  // A file without a byte is a database to SQLite, and an empty one.
-  const bool isEmpty =
-      typeOf(context_.manifestPath) == std::filesystem::file_type::regular && !isFileWithBytes(context_.manifestPath);
-  if ((isEmpty || !isThere(kManifestFileName)) && !files_.found().empty()) salvage("The manifest is missing.");
+  if (isThere(newName_)) removeUnfinished();
+  if (isMissing() && !files_.found().empty()) salvage("The manifest is missing.");
+}
+
+// A file without a byte is a database to SQLite, and an empty one.
+bool Salvage::isMissing() const {
+  const auto type = typeOfFile(context_.manifestPath);
+  return type == std::filesystem::file_type::not_found ||
+         (type == std::filesystem::file_type::regular && !isFileWithBytes(context_.manifestPath));
 }
 
 void Salvage::recoverOpening(const ManifestPersistenceException& error, int attempt) {
@@ -77,7 +74,7 @@ ManifestRecovery::Outcome Salvage::recoverFromDamage(const StoreLock& /*lock*/, 
   context_.throwIfClosed();
   const auto manifest = manifest_.opened();
   if (attempt >= kMostAttempts || manifest == nullptr) return Outcome::NotRecovered;
-  if (attempt == 0) {
+  if (attempt == 0 && !isUnderWay_) {
     manifest->release();
   } else {
     salvage(error.what());
@@ -90,39 +87,67 @@ ManifestRecovery::Outcome Salvage::recoverFromFailedWrite(const StoreLock& lock,
   return isNotAManifest(error) ? recoverFromDamage(lock, error, attempt) : Outcome::NotRecovered;
 }
 
-void Salvage::prepareChange(const StoreLock& /*lock*/) {
+void Salvage::prepareReading(const StoreLock& /*lock*/) {
+  if (isUnderWay_) finish();
+}
+
+void Salvage::prepareChange(const StoreLock& lock) {
+  prepareReading(lock);
   const auto manifest = manifest_.opened();
   if (manifest == nullptr || !manifest->hasMoved()) return;
   context_.throwIfClosed();
-  if (!isThere(kManifestFileName)) return salvage("The manifest has vanished.");
+  if (isMissing()) return salvage("The manifest has vanished.");
   manifest->release();
   manifest->reload();
   errorLine(__LINE__).stream() << "Store \"" << context_.options.name
                                << "\" continues with the manifest that somebody has put in the place of its own.";
 }
 
+// Once the new manifest is complete there is no way back: what fails from then on is tried again by the next operation,
+// and until then nothing is written to the old one.
 void Salvage::salvage(const std::string& reason) {
+  if (isUnderWay_) return finish();
   const auto manifest = manifest_.opened();
-  if (manifest != nullptr) manifest->release();
-  files_.takeStock();
-  context_.files->createDirectory(context_.options.directory, true);
-  if (isThere(newName_)) context_.files->deleteFile(pathOf(newName_));
+  if (manifest != nullptr) manifest->suspend();
   Yield yield;
+  try {
+    makeNew(manifest.get(), yield);
+    isUnderWay_ = true;
+    context_.files->rename(pathOf(newName_), pathOf(salvagedName_));
+  } catch (...) {
+    isUnderWay_ = false;
+    if (manifest != nullptr) manifest->resume();
+    throw;
+  }
+  report(yield, reason);
+  finish();
+}
+
+void Salvage::finish() {
+  if (isThere(salvagedName_)) putInPlace();
+  if (const auto manifest = manifest_.opened()) manifest->reload();
+  isUnderWay_ = false;
+}
+
+void Salvage::makeNew(DiskCacheManifestInterface* records, Yield& yield) {
+  files_.takeStock();
+  files_.createDirectory();
+  if (isThere(newName_)) removeUnfinished();
   {
     NewManifest rows(pathOf(newName_));
-    if (manifest != nullptr && manifest->isLoaded()) {
-      keepRecords(*manifest, rows, yield);
+    if (records != nullptr && records->isLoaded()) {
+      keepRecords(*records, rows, yield);
     } else {
       keepWhatIsThere(rows, yield);
     }
     rows.complete();
   }
-  context_.files->rename(pathOf(newName_), pathOf(salvagedName_));
-  context_.files->sync(context_.options.directory);
   for (const std::string& name : yield.unreadable) quarantine(name);
-  putInPlace();
-  if (manifest != nullptr) manifest->reload();
-  report(yield, reason);
+}
+
+void Salvage::removeUnfinished() {
+  if (typeOfFile(pathOf(newName_)) == std::filesystem::file_type::directory) return quarantine(newName_);
+  context_.files->deleteFile(pathOf(newName_));
 }
 
 // Those in memory are all there are. The manifest is needed for inline values, and for metadata that nobody has read.
@@ -155,11 +180,13 @@ void Salvage::keepRecords(DiskCacheManifestInterface& records, NewManifest& rows
 void Salvage::keepWhatIsThere(NewManifest& rows, Yield& yield) {
   std::unordered_set<std::string> kept;
   std::unordered_set<std::string> named;
+  StoreTime time;
   const auto keep = [&](ManifestRow&& row) {
     const auto version = VersionedName::parse(row.item.filename);
-    const bool isOthers = version && version->key && *version->key != row.item.key;
+    const bool isOthers = row.item.checksum && version && version->key && *version->key != row.item.key;
     if (row.item.hasInlineData ? !row.inlineData : isOthers || !isThere(row.item.filename)) return;
     rows.add(row);
+    time.noteDateOf(row.item);
     kept.insert(row.item.key);
     named.insert(row.item.filename);
   };
@@ -167,7 +194,7 @@ void Salvage::keepWhatIsThere(NewManifest& rows, Yield& yield) {
   yield.kept = kept.size();
 
   auto files = files_.found();
-  const auto now = static_cast<std::int32_t>(Clock::now());
+  const auto now = static_cast<std::int32_t>(time.now());
   for (auto file = files.rbegin(); file != files.rend(); ++file) {  // the latest of a key first
     const auto& key = file->version.key;
     if (named.count(file->name) > 0 || (key && kept.count(*key) > 0)) continue;
@@ -190,13 +217,23 @@ void Salvage::putInPlace() {
     const std::string name = std::string(kManifestFileName) + suffix;
     if (isThere(name)) quarantine(name);
   }
+  context_.files->sync(context_.options.directory);
   context_.files->rename(pathOf(salvagedName_), context_.manifestPath);
   context_.files->sync(context_.options.directory);
 }
 
-void Salvage::quarantine(const std::string& name) {
-  const std::string directory = pathOf(kQuarantine);
+// A relaxed store may have had a file of that name.
+std::string Salvage::quarantineDirectory() {
+  std::string directory = pathOf(kQuarantine);
+  for (int i = 1; context_.files->pathExists(directory) && !context_.files->isDirectory(directory); ++i) {
+    directory = pathOf(kQuarantine) + "." + std::to_string(i);
+  }
   context_.files->createDirectory(directory, false);
+  return directory;
+}
+
+void Salvage::quarantine(const std::string& name) {
+  const std::string directory = quarantineDirectory();
   std::string place = context_.files->combinePath(directory, name);
   for (int i = 1; context_.files->pathExists(place); ++i) {
     place = context_.files->combinePath(directory, name + "." + std::to_string(i));
@@ -218,7 +255,7 @@ void Salvage::report(const Yield& yield, const std::string& reason) {
 }
 
 bool Salvage::isThere(const std::string& name) const {
-  return typeOf(pathOf(name)) != std::filesystem::file_type::not_found;
+  return typeOfFile(pathOf(name)) != std::filesystem::file_type::not_found;
 }
 
 std::string Salvage::pathOf(const std::string& name) const {

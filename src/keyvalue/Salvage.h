@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <string>
 #include <vector>
 
@@ -31,8 +32,13 @@ class Salvage final : public ManifestRecovery {
   Outcome recoverFromFailedWrite(const StoreLock& lock, const ManifestPersistenceException& error,
                                  int attempt) override;
 
-  // Goes on with what is there when somebody has removed or replaced the manifest.
+  // Finishes a salvage that has failed in the middle.
+  void prepareReading(const StoreLock& lock) override;
+
+  // The same. Goes on with what is there when somebody has removed or replaced the manifest.
   void prepareChange(const StoreLock& lock) override;
+
+  bool isReady() const override { return !isUnderWay_; }
 
   // Puts it where nobody finds it by mistake, and nothing deletes it. Throws when it cannot be moved.
   void quarantine(const std::string& name);
@@ -41,6 +47,11 @@ class Salvage final : public ManifestRecovery {
   struct Yield;
 
   void salvage(const std::string& reason);
+  void finish();
+  void makeNew(DiskCacheManifestInterface* records, Yield& yield);
+  void removeUnfinished();
+  bool isMissing() const;
+  std::string quarantineDirectory();
   void keepRecords(DiskCacheManifestInterface& records, NewManifest& rows, Yield& yield);
   void keepWhatIsThere(NewManifest& rows, Yield& yield);
   void putInPlace();
@@ -53,6 +64,7 @@ class Salvage final : public ManifestRecovery {
   VersionedFiles& files_;
   const std::string newName_;
   const std::string salvagedName_;
+  std::atomic<bool> isUnderWay_{false};  // the new manifest is complete, but not in use yet
 };
 
 }  // namespace velmora::mobile::xplat::cellar

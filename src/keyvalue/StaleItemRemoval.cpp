@@ -1,9 +1,11 @@
 #include "keyvalue/StaleItemRemoval.h"
 
+#include <algorithm>
 #include <cstdint>
 #include <optional>
 #include <utility>
 
+#include "Clock.h"
 #include "keyvalue/BatchRemoval.h"
 #include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
@@ -83,7 +85,7 @@ std::optional<long> StaleItemRemoval::prepare() {
     if (!manifest->isLoaded()) manifest->load();
   });
   manifest_.reportSize();
-  return cutoffOf(manifest_.get()->currentDate(), staleAge_);
+  return cutoffOf(std::min(manifest_.get()->currentDate(), Clock::now()), staleAge_);
 }
 
 }  // namespace velmora::mobile::xplat::cellar

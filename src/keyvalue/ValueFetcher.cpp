@@ -16,6 +16,7 @@
 #include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
+#include "keyvalue/VersionedName.h"
 #include "keyvalue/WorkQueue.h"
 #include "keyvalue/WritesInFlight.h"
 
@@ -112,7 +113,7 @@ void ValueFetcher::load(Fetch& fetch) {
 bool ValueFetcher::load(Fetch& fetch, const std::string& path, std::vector<unsigned char>& value) {
   const DiskCacheItem& item = *fetch.item;
   if (!fetch.loader) return readValue(item, path, value);
-  if (item.checksum) {
+  if (checksumOf(item)) {
     std::vector<unsigned char> inlineValue;
     const bool isThere = item.hasInlineData ? readValue(item, path, inlineValue) : checkFile(item, path);
     if (!isThere) return false;
@@ -149,9 +150,16 @@ bool ValueFetcher::hasLostItem(const DiskCacheItem& item) {
   }
 }
 
+// Of a file whose record has lost it, the name has it still.
+std::optional<std::uint32_t> ValueFetcher::checksumOf(const DiskCacheItem& item) const {
+  if (item.checksum || item.hasInlineData || !context_.isSafe()) return item.checksum;
+  const auto version = VersionedName::parse(item.filename);
+  return version && version->key == item.key ? std::make_optional(version->checksum) : std::nullopt;
+}
+
 // A value that is not what it should be is read once more: the fault may lie in the reading.
 bool ValueFetcher::readValue(const DiskCacheItem& item, const std::string& path, std::vector<unsigned char>& value) {
-  std::optional<std::uint32_t> checksum = item.checksum;
+  std::optional<std::uint32_t> checksum = checksumOf(item);
   for (int attempt = 0; attempt < 2; ++attempt) {
     if (item.hasInlineData) {
       if (!readInlineValue(item.key, value, checksum)) return false;
@@ -187,7 +195,7 @@ bool ValueFetcher::checkFile(const DiskCacheItem& item, const std::string& path)
     Checksum checksum(item.key);
     context_.files->readPieces(path,
                                [&](const unsigned char* bytes, std::size_t count) { checksum.add(bytes, count); });
-    if (checksum.value() == *item.checksum) return true;
+    if (checksum.value() == *checksumOf(item)) return true;
   }
   return handleDamage(item);
 }

@@ -53,6 +53,7 @@ class ValueFetcher {
   bool load(Fetch& fetch, const std::string& path, std::vector<unsigned char>& value);
   bool readInlineValue(const std::string& key, std::vector<unsigned char>& value,
                        std::optional<std::uint32_t>& checksum);
+  std::optional<std::uint32_t> checksumOf(const DiskCacheItem& item) const;
   bool checkFile(const DiskCacheItem& item, const std::string& path);
   bool handleDamage(const DiskCacheItem& item);
   void drop(const DiskCacheItem& item);

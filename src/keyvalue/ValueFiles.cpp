@@ -1,5 +1,7 @@
 #include "keyvalue/ValueFiles.h"
 
+#include <cerrno>
+
 #include "FileUtils.h"
 #include "LarderException.h"
 #include "keyvalue/ReservedKeys.h"
@@ -21,10 +23,18 @@ bool ValueFiles::exists(const std::string& key) const {
   return context_.files->pathExists(path) && !context_.files->isDirectory(path);
 }
 
+void ValueFiles::deleteOne(const std::string& path) const {
+  try {
+    context_.files->deleteFile(path);
+  } catch (const FileUtilsIoException& error) {
+    if (!context_.isSafe() || error.code() != ENOENT) throw;
+  }
+}
+
 void ValueFiles::deleteAll(const std::vector<std::string>& paths) const {
   for (const std::string& path : paths) {
     try {
-      context_.files->deleteFile(path);
+      deleteOne(path);
     } catch (const LarderException& error) {
       errorLine(__LINE__).stream() << "Failed to delete file at \"" << path << "\" " << error.what();
     }

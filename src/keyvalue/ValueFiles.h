@@ -23,6 +23,9 @@ class ValueFiles {
   // Whether a file lies in the key's place.
   bool exists(const std::string& key) const;
 
+  // In a safe store, one that somebody else has deleted is deleted. Throws what deleting it throws.
+  void deleteOne(const std::string& path) const;
+
   // One that cannot be deleted is one error line.
   void deleteAll(const std::vector<std::string>& paths) const;
 

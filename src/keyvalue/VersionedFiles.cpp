@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <exception>
+#include <system_error>
 #include <utility>
 
 #include "FileUtils.h"
@@ -23,13 +24,29 @@ std::optional<VersionedName> parseUnfinished(const std::string& name) {
   return VersionedName::parse(name.substr(0, length));
 }
 
+// Some file systems cannot.
+void syncOrGiveUp(FileUtils& files, const std::string& path) {
+  try {
+    files.sync(path);
+  } catch (const FileUtilsIoException& error) {
+    if (error.code() != EINVAL) throw;
+  }
+}
+
 }  // namespace
+
+std::filesystem::file_type typeOfFile(const std::string& path) {
+  std::error_code error;
+  const auto type = std::filesystem::symlink_status(path, error).type();
+  if (type != std::filesystem::file_type::none) return type;
+  throw FileUtilsIoException(error.value(), "Could not look for \"" + path + "\": " + error.message());
+}
 
 void VersionedFiles::takeStock() {
   const std::lock_guard<std::mutex> lock(mutex_);
   if (hasTakenStock_) return;
   createDirectory();
-  for (const std::string& name : context_.files->listFiles(context_.options.directory)) {
+  for (const std::string& name : namesInDirectory()) {
     auto version = VersionedName::parse(name);
     if (!version) version = parseUnfinished(name);
     if (version) next_ = std::max(next_, version->number + 1);
@@ -45,10 +62,29 @@ void VersionedFiles::createDirectory() {
   if (context_.options.durability != Durability::Synced) return;
   try {
     for (std::string path = directory; !path.empty(); path = context_.files->parentPath(path)) {
-      context_.files->sync(path);
+      syncOrGiveUp(*context_.files, path);
     }
   } catch (const FileUtilsIoException& error) {
-    if (error.code() != EACCES && error.code() != EPERM && error.code() != EINVAL && error.code() != EROFS) throw;
+    if (error.code() != EACCES && error.code() != EPERM && error.code() != EROFS) throw;
+  }
+}
+
+void VersionedFiles::noteNumber(std::uint64_t number) {
+  const std::lock_guard<std::mutex> lock(mutex_);
+  next_ = std::max(next_, number + 1);
+}
+
+bool VersionedFiles::exists(const std::string& name) const {
+  return typeOfFile(pathOf(name)) != std::filesystem::file_type::not_found;
+}
+
+// None when somebody has removed it.
+std::vector<std::string> VersionedFiles::namesInDirectory() const {
+  try {
+    return context_.files->listFiles(context_.options.directory);
+  } catch (const FileUtilsIoException& error) {
+    if (error.code() != ENOENT) throw;
+    return {};
   }
 }
 
@@ -93,18 +129,15 @@ VersionedFiles::Written VersionedFiles::write(const std::string& key, const Pers
   }
 }
 
-void VersionedFiles::sync(const std::vector<std::string>& names) {
-  for (const std::string& name : names) {
-    context_.files->sync(pathOf(name));
-  }
-  context_.files->sync(context_.options.directory);
-}
+void VersionedFiles::sync(const std::string& name) { context_.files->sync(pathOf(name)); }
+
+void VersionedFiles::syncDirectory() { syncOrGiveUp(*context_.files, context_.options.directory); }
 
 std::vector<VersionedFiles::Found> VersionedFiles::found() {
   takeStock();
   const std::lock_guard<std::mutex> lock(mutex_);
   std::vector<Found> files;
-  for (std::string& name : context_.files->listFiles(context_.options.directory)) {
+  for (std::string& name : namesInDirectory()) {
     auto version = VersionedName::parse(name);
     if (version && version->number < firstOwn_) files.push_back({std::move(name), std::move(*version)});
   }
@@ -117,7 +150,7 @@ std::vector<std::string> VersionedFiles::unfinished() {
   takeStock();
   const std::lock_guard<std::mutex> lock(mutex_);
   std::vector<std::string> names;
-  for (const std::string& name : context_.files->listFiles(context_.options.directory)) {
+  for (const std::string& name : namesInDirectory()) {
     const auto version = parseUnfinished(name);
     if (version && version->number < firstOwn_) names.push_back(name);
   }

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <filesystem>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -39,8 +40,18 @@ class VersionedFiles {
   Written write(const std::string& key, const std::vector<unsigned char>& value);
   Written write(const std::string& key, const PersistentKeyValueStore::Writer& writer);
 
-  // Makes files that were written, and their names, outlive a power cut.
-  void sync(const std::vector<std::string>& names);
+  // A record names a file of that number: those to come are greater.
+  void noteNumber(std::uint64_t number);
+
+  // Throws when it cannot be told at the moment.
+  bool exists(const std::string& name) const;
+
+  // The store's own, which somebody may have removed. In a synced store it outlives a power cut.
+  void createDirectory();
+
+  // Makes a file that was written, and the names of all, outlive a power cut.
+  void sync(const std::string& name);
+  void syncDirectory();
 
   // What is in the directory now of what was there at start.
   std::vector<Found> found();
@@ -56,7 +67,7 @@ class VersionedFiles {
 
  private:
   std::uint64_t nextNumber();
-  void createDirectory();
+  std::vector<std::string> namesInDirectory() const;
   std::string pathOf(const std::string& name) const;
 
   StoreContext& context_;
@@ -65,5 +76,9 @@ class VersionedFiles {
   std::uint64_t next_ = 1;      // number
   std::uint64_t firstOwn_ = 1;  // that this object gives out
 };
+
+// Links are not followed. Throws when it cannot be told: what is only out of reach at the moment must not be taken for
+// missing.
+std::filesystem::file_type typeOfFile(const std::string& path);
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -16,7 +16,7 @@ constexpr std::size_t kLongestKeyPart = 200;  // bytes; the name then has at mos
 constexpr std::size_t kCutKey = 60;           // bytes of a longer key; each is encoded as three at most
 constexpr char kCutMark = '~';                // which no encoded key contains
 constexpr std::size_t kChecksumDigits = 8;
-constexpr std::size_t kMostNumberDigits = 19;
+constexpr std::size_t kMostNumberDigits = 16;  // a store that writes all the time has centuries
 
 std::string keyPartOf(const std::string& key) {
   try {
@@ -67,11 +67,12 @@ std::optional<VersionedName> VersionedName::parse(const std::string& name) {
   VersionedName result{std::nullopt, *number, static_cast<std::uint32_t>(*checksum)};
   const bool isCut = keyPart.back() == kCutMark;
   if (isCut) keyPart.pop_back();
-  const auto key = decoded(keyPart);
-  if (!key) return std::nullopt;
-  if (isCut) return result;
-  result.key = key;
-  return format(*key, *number, result.checksum) == name ? std::make_optional(std::move(result)) : std::nullopt;
+  auto key = decoded(keyPart);
+  if (!key || (isCut && key->size() != kCutKey)) return std::nullopt;
+  const std::string wholeKey = isCut ? *key + std::string(kLongestKeyPart, 'x') : *key;
+  if (format(wholeKey, *number, result.checksum) != name) return std::nullopt;
+  if (!isCut) result.key = std::move(key);
+  return result;
 }
 
 }  // namespace velmora::mobile::xplat::cellar

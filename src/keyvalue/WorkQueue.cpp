@@ -14,9 +14,15 @@ void WorkQueue::dispatch(std::function<void()> task) {
   changes_.cut();
 }
 
-void WorkQueue::dispatchBehindAll(std::function<void()> task) {
+void WorkQueue::dispatchBehindAll(std::function<void()> task, std::function<void(const std::exception&)> onRefused) {
   if (ahead_.isEmpty()) return dispatch(std::move(task));
-  detourTo(KeyRange(std::vector<std::string>()), task, [this, task] { dispatch(task); });
+  detourTo(KeyRange(std::vector<std::string>()), task, [this, task, onRefused = std::move(onRefused)] {
+    try {
+      dispatch(task);
+    } catch (const std::exception& error) {
+      if (onRefused) onRefused(error);
+    }
+  });
 }
 
 void WorkQueue::append(const std::shared_ptr<ManifestChange>& change, std::function<void()> task) {

@@ -26,8 +26,9 @@ class WorkQueue {
   // Throws what the host's queue throws.
   void dispatch(std::function<void()> task);
 
-  // The same, behind everything that was called before.
-  void dispatchBehindAll(std::function<void()> task);
+  // The same, behind everything that was called before. `onRefused` is called instead of throwing when that becomes
+  // clear only later.
+  void dispatchBehindAll(std::function<void()> task, std::function<void(const std::exception&)> onRefused);
 
   // Hands over the task of an operation on these keys, or fails the promise with the reason why not.
   template <class T> void dispatch(KeyRange keys, Promise<T>& promise, std::function<void()> task) {

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <exception>
 #include <limits>
 #include <memory>
 #include <optional>
@@ -59,6 +60,11 @@ std::string selectRowsOf(const std::vector<SQLiteStoreColumn>& columns) {
          checksum + " IS NOT NULL FROM LarderManifest WHERE rowid >= ?1 ORDER BY rowid";
 }
 
+// What the consumer of a row has thrown, which is no damage.
+struct ConsumerFailure {
+  std::exception_ptr failure;
+};
+
 class Reading {
  public:
   Reading(SQLiteStore& store, const std::function<void(ManifestRow&&)>& consume)
@@ -86,8 +92,17 @@ class Reading {
     while (cursor.next()) {
       const auto number = static_cast<std::int64_t>(cursor.get<unsigned long long>(0));
       if (number == kLastRow) return;
+      if (number < next_) continue;  // out of order, and read before
       next_ = number + 1;
-      consume_(rowIn(cursor));
+      consume(rowIn(cursor));
+    }
+  }
+
+  void consume(ManifestRow&& row) {
+    try {
+      consume_(std::move(row));
+    } catch (...) {
+      throw ConsumerFailure{std::current_exception()};
     }
   }
 
@@ -142,6 +157,8 @@ void readDamagedManifest(const std::string& path, const std::function<void(Manif
     SQLiteStore store(path);
     throwIfTableCallsFunctions(store, kManifestTable);
     Reading(store, consume).readAll();
+  } catch (const ConsumerFailure& error) {
+    std::rethrow_exception(error.failure);
   } catch (const SQLiteStoreException& error) {
     if (!isDamage(error)) throw;
   }

@@ -5,8 +5,8 @@
 namespace velmora::mobile::xplat::cellar {
 
 NewManifest::NewManifest(const std::string& path) : store_(path) {
-  // Without a log: there is nothing to go back to, and no other file that would have to be renamed with it.
-  store_.exec("PRAGMA journal_mode = OFF; PRAGMA synchronous = FULL; BEGIN");
+  // Without a log on disk: there is nothing to go back to, and no other file that would have to be renamed with it.
+  store_.exec("PRAGMA journal_mode = MEMORY; PRAGMA synchronous = FULL; BEGIN");
   store_.exec(kCreateManifestTable);
   store_.exec(kAddChecksums);
 }
