@@ -17,6 +17,7 @@ class AnalyticsEventReporter;
 class FileUtils;
 class Store;
 class TrashCollector;
+struct StoreServices;
 
 // Where a manager's directory lives; the host says which directory each area is.
 enum class Area : int { Caches = 0, Documents = 1, Shared = 2 };
@@ -48,6 +49,14 @@ class CELLAR_EXPORT StoreDefinition {
                                              PruneStrategyIdentifier pruneStrategy,
                                              std::shared_ptr<const StoreDefinition> definition) const = 0;
 
+  // The same with all services of the manager, its incidents among them: what managers call. A definition that
+  // overrides only the one above is called through it, and its stores report no incidents.
+  virtual std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,
+                                             const StoreServices& services,
+                                             std::function<void(unsigned int)> sizeChangedCallback,
+                                             PruneStrategyIdentifier pruneStrategy,
+                                             std::shared_ptr<const StoreDefinition> definition) const;
+
   const Type type;
   const std::string name;         // names the store's directory; the store's identifier unless configured otherwise
   const std::string managerName;  // the manager whose "stores" holds this store
@@ -68,6 +77,7 @@ class CELLAR_EXPORT UnmanagedStoreDefinition : public StoreDefinition {
   UnmanagedStoreDefinition(const std::string& name, const std::string& managerName, bool localeSensitive,
                            bool hasVersion, unsigned int version, unsigned int maxSize, bool isCache);
 
+  using StoreDefinition::createStore;
   std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,
                                      std::shared_ptr<TaskQueueFactory> taskQueueFactory,
                                      std::shared_ptr<TrashCollector> trashCollector,
@@ -93,6 +103,11 @@ class CELLAR_EXPORT PKVSDefinition : public StoreDefinition {
                                      std::function<void(unsigned int)> sizeChangedCallback,
                                      PruneStrategyIdentifier pruneStrategy,
                                      std::shared_ptr<const StoreDefinition> definition) const override;
+  std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,
+                                     const StoreServices& services,
+                                     std::function<void(unsigned int)> sizeChangedCallback,
+                                     PruneStrategyIdentifier pruneStrategy,
+                                     std::shared_ptr<const StoreDefinition> definition) const override;
 
   const std::optional<std::int64_t> capacity;  // items; absent: no limit
   const bool inlineData;                       // values live in the manifest instead of in files
@@ -114,6 +129,11 @@ class CELLAR_EXPORT DiskCacheDefinition : public StoreDefinition {
                                      std::shared_ptr<TrashCollector> trashCollector,
                                      std::shared_ptr<AnalyticsEventReporter> analyticsReporter,
                                      std::shared_ptr<FileUtils> fileUtils,
+                                     std::function<void(unsigned int)> sizeChangedCallback,
+                                     PruneStrategyIdentifier pruneStrategy,
+                                     std::shared_ptr<const StoreDefinition> definition) const override;
+  std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,
+                                     const StoreServices& services,
                                      std::function<void(unsigned int)> sizeChangedCallback,
                                      PruneStrategyIdentifier pruneStrategy,
                                      std::shared_ptr<const StoreDefinition> definition) const override;

@@ -26,9 +26,20 @@ template <class Definition> void setOptions(KeyValueStoreOptions& options, const
   options.inlineData = definition.inlineData;
   options.durability = definition.durability;
   options.onSizeChanged = std::move(sizeChangedCallback);
+  options.durability = definition.durability;
 }
 
 }  // namespace
+
+std::shared_ptr<Store> StoreDefinition::createStore(const std::string& storePath,
+                                                    const std::string& temporaryDirectoryPath,
+                                                    const StoreServices& services,
+                                                    std::function<void(unsigned int)> sizeChangedCallback,
+                                                    PruneStrategyIdentifier pruneStrategy,
+                                                    std::shared_ptr<const StoreDefinition> definition) const {
+  return createStore(storePath, temporaryDirectoryPath, services.queues, services.trash, services.analytics,
+                     services.files, std::move(sizeChangedCallback), pruneStrategy, std::move(definition));
+}
 
 std::shared_ptr<Store> UnmanagedStoreDefinition::createStore(
     const std::string& storePath, const std::string& /*temporaryDirectoryPath*/,
@@ -43,12 +54,23 @@ std::shared_ptr<Store> PKVSDefinition::createStore(
     const std::string& storePath, const std::string& temporaryDirectoryPath,
     std::shared_ptr<TaskQueueFactory> taskQueueFactory, std::shared_ptr<TrashCollector> trashCollector,
     std::shared_ptr<AnalyticsEventReporter> analyticsReporter, std::shared_ptr<FileUtils> fileUtils,
-    std::function<void(unsigned int)> sizeChangedCallback, PruneStrategyIdentifier /*pruneStrategy*/,
-    std::shared_ptr<const StoreDefinition> /*definition*/) const {
+    std::function<void(unsigned int)> sizeChangedCallback, PruneStrategyIdentifier pruneStrategy,
+    std::shared_ptr<const StoreDefinition> definition) const {
+  const StoreServices services{std::move(taskQueueFactory), std::move(trashCollector), std::move(fileUtils),
+                               std::move(analyticsReporter)};
+  return createStore(storePath, temporaryDirectoryPath, services, std::move(sizeChangedCallback), pruneStrategy,
+                     std::move(definition));
+}
+
+std::shared_ptr<Store> PKVSDefinition::createStore(const std::string& storePath,
+                                                   const std::string& temporaryDirectoryPath,
+                                                   const StoreServices& services,
+                                                   std::function<void(unsigned int)> sizeChangedCallback,
+                                                   PruneStrategyIdentifier /*pruneStrategy*/,
+                                                   std::shared_ptr<const StoreDefinition> /*definition*/) const {
   KeyValueStoreOptions options;
   setOptions(options, *this, storePath, temporaryDirectoryPath, std::move(sizeChangedCallback));
-  return PersistentKeyValueStore::create(std::move(options), {std::move(taskQueueFactory), std::move(trashCollector),
-                                                              std::move(fileUtils), std::move(analyticsReporter)});
+  return PersistentKeyValueStore::create(std::move(options), services);
 }
 
 std::shared_ptr<Store> DiskCacheDefinition::createStore(
@@ -56,7 +78,19 @@ std::shared_ptr<Store> DiskCacheDefinition::createStore(
     std::shared_ptr<TaskQueueFactory> taskQueueFactory, std::shared_ptr<TrashCollector> trashCollector,
     std::shared_ptr<AnalyticsEventReporter> analyticsReporter, std::shared_ptr<FileUtils> fileUtils,
     std::function<void(unsigned int)> sizeChangedCallback, PruneStrategyIdentifier pruneStrategyOverride,
-    std::shared_ptr<const StoreDefinition> /*definition*/) const {
+    std::shared_ptr<const StoreDefinition> definition) const {
+  const StoreServices services{std::move(taskQueueFactory), std::move(trashCollector), std::move(fileUtils),
+                               std::move(analyticsReporter)};
+  return createStore(storePath, temporaryDirectoryPath, services, std::move(sizeChangedCallback), pruneStrategyOverride,
+                     std::move(definition));
+}
+
+std::shared_ptr<Store> DiskCacheDefinition::createStore(const std::string& storePath,
+                                                        const std::string& temporaryDirectoryPath,
+                                                        const StoreServices& services,
+                                                        std::function<void(unsigned int)> sizeChangedCallback,
+                                                        PruneStrategyIdentifier pruneStrategyOverride,
+                                                        std::shared_ptr<const StoreDefinition> /*definition*/) const {
   DiskCacheOptions options;
   setOptions(options, *this, storePath, temporaryDirectoryPath, std::move(sizeChangedCallback));
   options.normalSize = lruSizeLimit;
@@ -64,8 +98,7 @@ std::shared_ptr<Store> DiskCacheDefinition::createStore(
   options.extendedMetadataFactory = ExtendedMetadataFactoryFactory(metadataFactory);
   options.pruneStrategy = PruneStrategyFactory(
       pruneStrategyOverride == PruneStrategyIdentifier::Null ? pruneStrategy : pruneStrategyOverride);
-  return DiskCache::create(options, {std::move(taskQueueFactory), std::move(trashCollector), std::move(fileUtils),
-                                     std::move(analyticsReporter)});
+  return DiskCache::create(options, services);
 }
 
 }  // namespace velmora::mobile::xplat::cellar

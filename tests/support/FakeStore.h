@@ -163,6 +163,7 @@ class FakeStoreDefinition final : public StoreDefinition {
   FakeStoreDefinition(const std::string& name_, std::shared_ptr<FakeStores> stores)
       : FakeStoreDefinition(name_, std::move(stores), Options()) {}
 
+  using StoreDefinition::createStore;
   std::shared_ptr<Store> createStore(const std::string& storePath, const std::string& temporaryDirectoryPath,
                                      std::shared_ptr<TaskQueueFactory> taskQueueFactory,
                                      std::shared_ptr<TrashCollector> trashCollector,
