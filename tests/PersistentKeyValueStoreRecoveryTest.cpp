@@ -8,12 +8,14 @@
 #include <cstddef>
 #include <filesystem>
 #include <fstream>
+#include <memory>
 #include <optional>
 #include <stdexcept>
 #include <string>
 #include <system_error>
 #include <vector>
 
+#include "Configuration.h"
 #include "DiskCacheManifest.h"
 #include "LarderException.h"
 #include "PersistentKeyValueStore.h"
@@ -74,6 +76,65 @@ class PersistentKeyValueStoreDamagedManifest : public RecoveryFixture {};
 class PersistentKeyValueStoreDamagedDatabase : public RecoveryFixture {};
 class PersistentKeyValueStoreFullDisk : public RecoveryFixture {};
 class PersistentKeyValueStoreVanishedDirectory : public RecoveryFixture {};
+
+// --- What is reported of it ---
+
+class PersistentKeyValueStoreIncidents : public RecoveryFixture {
+ protected:
+  static std::string purged(const std::string& line) { return "StorePurged larder: " + line; }
+
+  // A database that is none.
+  void writeGarbage() const { directory.write("store/manifest_v1.sqlite", sizedGarbage()); }
+
+  void openFrom(const StoreDefinition& definition) {
+    store = std::dynamic_pointer_cast<PersistentKeyValueStore>(definition.createStore(
+        storePath(), directory.file("temporary"), services(), nullptr, PruneStrategyIdentifier::Null, nullptr));
+    ASSERT_NE(store, nullptr);
+    settle();
+  }
+};
+
+TEST_F(PersistentKeyValueStoreIncidents, TellOfAPurgeInTheMidstOfAnOperation) {
+  openWatched();
+  put("old", "value");
+  manifest->failNext(ManifestCall::SetItem, corrupted);
+  const Written written = watch(store->store("key", bytesOf("value")));
+  settle();
+  EXPECT_EQ(incidents.queue->pending(), 1U);
+  EXPECT_THAT(incidents.take(), ElementsAre(purged(purgeLine(corrupted))));
+  put("after", "works");
+  EXPECT_THAT(incidents.take(), IsEmpty());
+}
+
+TEST_F(PersistentKeyValueStoreIncidents, TellOfAPurgeAsTheManifestIsOpened) {
+  writeGarbage();
+  const LogCapture log;
+  open();
+  ASSERT_THAT(errorLines(log), testing::SizeIs(1));
+  EXPECT_THAT(incidents.take(), ElementsAre(purged(errorLines(log)[0])));
+}
+
+TEST_F(PersistentKeyValueStoreIncidents, AreNoneOfAPurgeThatDidNotComeAbout) {
+  openWatched();
+  put("old", "value");
+  directory.write("store/manifest_v1.sqlite", "in the way");
+  trash->refuses = true;
+  manifest->failNext(ManifestCall::SetItem, corrupted);
+  const Written written = watch(store->store("key", bytesOf("value")));
+  settle();
+  EXPECT_THAT(incidents.take(), IsEmpty());
+}
+
+TEST_F(PersistentKeyValueStoreIncidents, OfAStoreFromADefinitionAreReportedToItsServices) {
+  writeGarbage();
+  openFrom(PKVSDefinition("larder", "manager", false, false, 0, std::nullopt, false, 100));
+  EXPECT_THAT(incidents.take(), testing::SizeIs(1));
+  close();
+  writeGarbage();
+  openFrom(DiskCacheDefinition("larder", "manager", false, false, 0, std::nullopt, 100, false, 55, 25,
+                               ExtendedMetadataFactoryIdentifier::Null, PruneStrategyIdentifier::LRU));
+  EXPECT_THAT(incidents.take(), testing::SizeIs(1));
+}
 
 // --- Each operation that meets the damage ---
 

@@ -2,6 +2,7 @@
 
 #include "DiskCacheManifest.h"
 #include "FileUtils.h"
+#include "Incident.h"
 #include "LarderException.h"
 #include "TrashCollector.h"
 #include "keyvalue/StoreLog.h"
@@ -51,8 +52,10 @@ void Purge::prepareReading(const StoreLock& /*lock*/) {
 }
 
 void Purge::log(const LarderException& error) const {
-  errorLine(__LINE__).stream() << "Store \"" << context_.options.name << "\" purged due to corrupted manifest. "
-                               << error.what();
+  const std::string& name = context_.options.name;
+  const std::string text = "Store \"" + name + "\" purged due to corrupted manifest. " + error.what();
+  errorLine(__LINE__).stream() << text;
+  context_.report({Incident::Kind::StorePurged, name, "", text});
 }
 
 }  // namespace velmora::mobile::xplat::cellar

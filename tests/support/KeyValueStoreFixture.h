@@ -29,6 +29,7 @@
 #include "host/testing/RecordingAnalytics.h"
 #include "support/Bytes.h"
 #include "support/FaultyManifest.h"
+#include "support/IncidentLog.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 #include "support/MemoryPersistence.h"
@@ -182,7 +183,7 @@ class KeyValueStoreFixture : public testing::Test {
     openWatched();
   }
 
-  StoreServices services() const { return {queues, trash, files, reporter}; }
+  StoreServices services() const { return {queues, trash, files, reporter, incidents.reporter}; }
 
   // --- The queues of the latest store ---
 
@@ -342,6 +343,7 @@ class KeyValueStoreFixture : public testing::Test {
   std::shared_ptr<FaultyFileUtils> files = std::make_shared<FaultyFileUtils>();
   std::shared_ptr<EventLog> events = std::make_shared<EventLog>();
   std::shared_ptr<AnalyticsEventReporter> reporter = recordingReporter(events);
+  IncidentLog incidents;
   std::shared_ptr<ManualQueueFactory> trashQueues = std::make_shared<ManualQueueFactory>();
   std::shared_ptr<RecordingTrashCollector> trash = std::make_shared<RecordingTrashCollector>(
       directory.file("trash"), std::make_shared<FileUtils>(), nullptr, trashQueues);
