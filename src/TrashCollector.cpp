@@ -11,15 +11,18 @@
 #include <cstdio>
 #include <exception>
 #include <mutex>
+#include <optional>
 #include <random>
 #include <set>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "AnalyticsEventReporter.h"
 #include "Clock.h"
 #include "FileUtils.h"
 #include "Future.h"
+#include "Incident.h"
 #include "LarderException.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -44,10 +47,15 @@ class TrashCollector::Trash {
   Trash(const std::string& path, const std::shared_ptr<FileUtils>& fileUtils)
       : path_(path), fileUtils_(fileUtils), random_(static_cast<std::uint64_t>(Clock::now())) {}
 
-  // One pass: until the trash is empty, what is left in it cannot be deleted, or the pass is interrupted. Never throws
-  // for a failed file operation. Called from within a pass, by a file layer that collects something on a queue that
-  // runs tasks at once, it leaves that to the pass.
-  void collect();
+  // One pass, which is reported if it fails in a new way. Called from within a pass, by a file layer that collects
+  // something on a queue that runs tasks at once, it leaves that to the pass.
+  void collect() {
+    if (passThread_ == std::this_thread::get_id()) return;
+    const std::optional<std::string> failure = pass();
+    if (failure && incidents_ != nullptr) incidents_->report({Incident::Kind::TrashStuck, path_, "", *failure});
+  }
+
+  void setIncidents(std::shared_ptr<const IncidentReporter> incidents) { incidents_ = std::move(incidents); }
 
   // A path in the trash that nothing has yet.
   std::string freeEntry() {
@@ -92,6 +100,23 @@ class TrashCollector::Trash {
  private:
   class Pass;
 
+  // How a pass has failed.
+  struct Failure {
+    std::string text;
+    std::set<std::string> stuck;  // the entries that it could not delete
+  };
+
+  // Until the trash is empty, what is left in it cannot be deleted, or the pass is interrupted. Never throws for a
+  // failed file operation. Returns the line in the log if it fails in another way than the passes before it.
+  std::optional<std::string> pass();
+
+  // Whether nobody has been told.
+  bool isNews(const Failure& failure) const {
+    const std::set<std::string>& stuck = failure.stuck;
+    return !lastFailure_ || lastFailure_->text != failure.text ||
+           !std::includes(lastFailure_->stuck.begin(), lastFailure_->stuck.end(), stuck.begin(), stuck.end());
+  }
+
   // While there is one, the trash directory stays.
   class Move {
    public:
@@ -125,7 +150,9 @@ class TrashCollector::Trash {
 
   const std::string path_;
   const std::shared_ptr<FileUtils> fileUtils_;
-  std::mutex passMutex_;  // held by a pass: two at once would take each other's files away
+  std::shared_ptr<const IncidentReporter> incidents_;
+  std::mutex passMutex_;                // held by a pass: two at once would take each other's files away
+  std::optional<Failure> lastFailure_;  // guarded by passMutex_; what has been told since a pass ended well
   std::atomic<std::thread::id> passThread_{};
   std::recursive_mutex moveMutex_;  // held where a move begins, and while the directory is removed; recursive because a
                                     // substituted file layer may collect something then
@@ -159,6 +186,8 @@ class TrashCollector::Trash::Pass {
     fileUtils_.deleteFile(trash_.path_);
     return true;
   }
+
+  const std::set<std::string>& stuck() const { return stuck_; }
 
  private:
   using Entries = std::vector<FileUtils::Info>;
@@ -270,18 +299,25 @@ class TrashCollector::Trash::Pass {
   std::exception_ptr failure_;   // of the first of them
 };
 
-void TrashCollector::Trash::collect() {
-  if (passThread_ == std::this_thread::get_id()) return;
+std::optional<std::string> TrashCollector::Trash::pass() {
   const std::lock_guard<std::mutex> lock(passMutex_);
   passThread_ = std::this_thread::get_id();
+  std::optional<std::string> news;
+  Pass pass(*this);
   try {
-    Pass pass(*this);
     while (running_ && fileUtils_->pathExists(path_) && pass.deleteTrash()) {
     }
+    if (running_) lastFailure_.reset();
   } catch (const std::exception& error) {
-    LOG(ERROR) << "Cannot collect trash. " << error.what();
+    const Failure failure{std::string("Cannot collect trash. ") + error.what(), pass.stuck()};
+    LOG(ERROR) << failure.text;
+    if (isNews(failure)) {
+      news = failure.text;
+      lastFailure_ = failure;
+    }
   }
   passThread_ = std::thread::id();
+  return news;
 }
 
 TrashCollector::TrashCollector(const std::string& trashPath, const std::shared_ptr<FileUtils>& fileUtils,
@@ -336,6 +372,10 @@ bool TrashCollector::removeFilesWithFilter(const std::string& path,
     LOG(ERROR) << "Cannot collect path. " << error.what();
     return false;
   }
+}
+
+void TrashCollector::setIncidents(std::shared_ptr<const IncidentReporter> incidents) {
+  trash_->setIncidents(std::move(incidents));
 }
 
 // Waits for everything queued so far; what a pass still had to do is left to the caller's own.

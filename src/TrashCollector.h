@@ -11,6 +11,7 @@ namespace velmora::mobile::xplat::cellar {
 
 class AnalyticsEventReporter;
 class FileUtils;
+class IncidentReporter;
 
 // Makes directory trees vanish at once and frees their space later. The trash is a directory on the same file system as
 // what is collected; it exists only while there is something in it. Shared by all managers and stores; any thread may
@@ -50,6 +51,11 @@ class CELLAR_EXPORT TrashCollector {
   // only when all its contents went and the filter accepts it too. True when `path` itself was deleted. An exception,
   // the filter's own included, leaves that entry where it is.
   virtual bool removeFilesWithFilter(const std::string& path, const std::function<bool(const std::string&)>& filter);
+
+  // Reports `TrashStuck` to `incidents`, which may be null, when a pass ends with an error: the name is the path of the
+  // trash directory. Passes that meet the same error at the same entries, or some of them, report it once, until one
+  // ends without an error. To be called before several threads use the collector.
+  void setIncidents(std::shared_ptr<const IncidentReporter> incidents);
 
  private:
   class Trash;

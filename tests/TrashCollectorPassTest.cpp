@@ -21,6 +21,7 @@
 
 #include "TrashCollector.h"
 #include "host/testing/FaultyFileUtils.h"
+#include "support/IncidentLog.h"
 #include "support/TrashFixture.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -171,6 +172,89 @@ TEST_F(TrashCollectorPass, OfAnEmptyingCountsWhatItDeletesBesideAStuckEntry) {
   EXPECT_EQ(reportedCount(), 4U);  // the tree with its two files, and the attempt
   EXPECT_THAT(trashed(), ElementsAre("stuck"));
   EXPECT_EQ(log_.errorCount(), 1U);
+}
+
+// --- What is reported of it ---
+
+class TrashCollectorIncidents : public TrashCollectorPass {
+ protected:
+  TrashCollectorIncidents() { collector_->setIncidents(incidents_.reporter); }
+
+  string stuck(int code, const string& text) const { return "TrashStuck " + trashPath() + ": " + logged(code, text); }
+  string busy() const { return stuck(EBUSY, "Device or resource busy"); }
+
+  void makeStuck(const string& name, int code = EBUSY) {
+    directory_.write("cache/trash/" + name, "");
+    files_->failPath(Operation::DeleteFile, entry(name), code);
+  }
+
+  test::IncidentLog incidents_;
+};
+
+TEST_F(TrashCollectorIncidents, TellOfAPassThatEndsWithAnErrorOnceWhileTheErrorLasts) {
+  makeStuck("a");
+  pass();
+  EXPECT_EQ(incidents_.queue->pending(), 1U);
+  EXPECT_THAT(incidents_.take(), ElementsAre(busy()));
+  pass();
+  empty();
+  EXPECT_THAT(incidents_.take(), IsEmpty());
+  EXPECT_EQ(log_.errorCount(), 3U);
+}
+
+TEST_F(TrashCollectorIncidents, TellOfTheSameErrorAgainAfterAPassWithoutOne) {
+  for (int i = 0; i < 2; ++i) {
+    makeStuck("a");
+    pass();
+    EXPECT_THAT(incidents_.take(), ElementsAre(busy()));
+    files_->heal();
+    pass();
+    EXPECT_THAT(incidents_.take(), IsEmpty());
+  }
+}
+
+TEST_F(TrashCollectorIncidents, TellOfAnotherErrorAndOfAnotherEntryButNotOfFewer) {
+  makeStuck("a");
+  pass();
+  EXPECT_THAT(incidents_.take(), ElementsAre(busy()));
+  makeStuck("b");
+  pass();
+  EXPECT_THAT(incidents_.take(), ElementsAre(busy()));
+  files_->heal();
+  files_->failPath(Operation::DeleteFile, entry("b"), EBUSY);
+  pass();
+  EXPECT_THAT(trashed(), ElementsAre("b"));
+  EXPECT_THAT(incidents_.take(), IsEmpty());
+  files_->failPath(Operation::DeleteFile, entry("b"), EACCES);
+  pass();
+  EXPECT_THAT(incidents_.take(), ElementsAre(stuck(EACCES, "Permission denied")));
+}
+
+TEST_F(TrashCollectorIncidents, TellOfALinkInThePlaceOfTheTrash) {
+  directory_.makeDirectory("outside");
+  link("cache/trash", directory_.file("outside"));
+  for (int i = 0; i < 2; ++i) empty();
+  EXPECT_THAT(incidents_.take(), ElementsAre(stuck(0, "Trash directory \"" + trashPath() + "\" is a link")));
+}
+
+TEST_F(TrashCollectorIncidents, AreNoneOfPathsThatCannotBeCollected) {
+  EXPECT_FALSE(collector_->collectPath(directory_.file("missing")));
+  EXPECT_THAT(incidents_.take(), IsEmpty());
+}
+
+TEST_F(TrashCollectorIncidents, AreToldWithoutALockSoThatTheHandlerMayEmptyTheTrash) {
+  makeStuck("a");
+  incidents_.runAtOnce();
+  incidents_.onIncident = [&](const Incident&) {
+    files_->heal();
+    collector_->emptyAllTrash();
+  };
+  const auto other = makeCollectorWithoutQueue();
+  other->setIncidents(incidents_.reporter);
+  collector_ = other;
+  collector_->emptyAllTrash();
+  EXPECT_FALSE(directory_.exists("cache/trash"));
+  EXPECT_THAT(incidents_.take(), ElementsAre(busy()));
 }
 
 // --- Entries that no listing shows ---
