@@ -4,6 +4,7 @@
 
 #include <cstdlib>
 #include <mutex>
+#include <utility>
 
 #include "StoreManagerImpl.h"
 
@@ -37,9 +38,24 @@ StoreManager::StoreManager(const std::string& parentPath, const StoreManagerDefi
                            const std::shared_ptr<FileUtils>& fileUtils,
                            const std::shared_ptr<AttributeStore>& attributeStore,
                            const std::shared_ptr<LazyDispatcher>& lazyDispatcher, bool runMaintenance)
+    : StoreManager(parentPath, definition, forceCleanse, nameBuilder, trashCollector, taskQueueFactory,
+                   diskSizeCalculator, analyticsReporter, fileUtils, attributeStore, lazyDispatcher, runMaintenance,
+                   nullptr) {}
+
+StoreManager::StoreManager(const std::string& parentPath, const StoreManagerDefinition& definition, bool forceCleanse,
+                           const std::shared_ptr<StoreDirectoryNameBuilder>& nameBuilder,
+                           const std::shared_ptr<TrashCollector>& trashCollector,
+                           const std::shared_ptr<TaskQueueFactory>& taskQueueFactory,
+                           const std::shared_ptr<DiskSizeCalculator>& diskSizeCalculator,
+                           const std::shared_ptr<AnalyticsEventReporter>& analyticsReporter,
+                           const std::shared_ptr<FileUtils>& fileUtils,
+                           const std::shared_ptr<AttributeStore>& attributeStore,
+                           const std::shared_ptr<LazyDispatcher>& lazyDispatcher, bool runMaintenance,
+                           std::shared_ptr<const IncidentReporter> incidents)
     : impl_(std::make_shared<StoreManagerImpl>(parentPath, definition, nameBuilder, trashCollector, taskQueueFactory,
                                                diskSizeCalculator, analyticsReporter, fileUtils, attributeStore,
                                                lazyDispatcher, runMaintenance)) {
+  impl_->setIncidents(std::move(incidents));
   if (runMaintenance) {
     impl_->cleanseIfNecessary(forceCleanse);
     impl_->startCleanup();

@@ -13,6 +13,7 @@ namespace velmora::mobile::xplat::cellar {
 
 class AttributeStore;
 class DiskSizeCalculator;
+class IncidentReporter;
 class LazyDispatcher;
 class StoreDirectoryNameBuilder;
 class StoreManagerImpl;
@@ -48,6 +49,18 @@ class CELLAR_EXPORT StoreManager {
                const std::shared_ptr<AnalyticsEventReporter>& analyticsReporter,
                const std::shared_ptr<FileUtils>& fileUtils, const std::shared_ptr<AttributeStore>& attributeStore,
                const std::shared_ptr<LazyDispatcher>& lazyDispatcher, bool runMaintenance);
+
+  // The same. The manager and its stores report incidents to `incidents`, which may be null; so does this, when it
+  // discards the data because of the file system's size.
+  StoreManager(const std::string& parentPath, const StoreManagerDefinition& definition, bool forceCleanse,
+               const std::shared_ptr<StoreDirectoryNameBuilder>& nameBuilder,
+               const std::shared_ptr<TrashCollector>& trashCollector,
+               const std::shared_ptr<TaskQueueFactory>& taskQueueFactory,
+               const std::shared_ptr<DiskSizeCalculator>& diskSizeCalculator,
+               const std::shared_ptr<AnalyticsEventReporter>& analyticsReporter,
+               const std::shared_ptr<FileUtils>& fileUtils, const std::shared_ptr<AttributeStore>& attributeStore,
+               const std::shared_ptr<LazyDispatcher>& lazyDispatcher, bool runMaintenance,
+               std::shared_ptr<const IncidentReporter> incidents);
   ~StoreManager();
   StoreManager(const StoreManager&) = delete;
   StoreManager& operator=(const StoreManager&) = delete;

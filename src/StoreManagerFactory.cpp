@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "Configuration.h"
+#include "Incident.h"
 #include "PathLocations.h"
 #include "StoreDirectoryNameBuilder.h"
 #include "StoreManager.h"
@@ -40,6 +41,7 @@ StoreManagerFactory::~StoreManagerFactory() = default;
 std::shared_ptr<StoreManager> StoreManagerFactory::managerForIdentifier(const std::string& managerName,
                                                                         const std::string& sessionKey,
                                                                         bool runMaintenance) {
+  const IncidentDeferral deferral;  // who asks for this manager meanwhile waits for the promise
   std::promise<std::shared_ptr<StoreManager>> promise;
   std::shared_future<std::shared_ptr<StoreManager>> future;
   {
@@ -83,6 +85,7 @@ std::shared_ptr<StoreManager> StoreManagerFactory::managerForStoreIdentifier(con
 }
 
 void StoreManagerFactory::invalidate() {
+  const IncidentDeferral deferral;
   const std::lock_guard<std::recursive_mutex> invalidation(invalidationMutex_);
   decltype(managers_) managers;
   {
@@ -112,7 +115,11 @@ std::shared_ptr<StoreManager> StoreManagerFactory::buildManager(const std::strin
                                                 : nameBuilderFactory_->createStoreDirectoryNameBuilder();
   return std::make_shared<StoreManager>(parentPath, *definition, StoreManager::forceCleanseOnInit(), nameBuilder,
                                         trashCollector_, taskQueueFactory_, diskSizeCalculator_, analyticsReporter_,
-                                        fileUtils_, attributeStore_, lazyDispatcher_, runMaintenance);
+                                        fileUtils_, attributeStore_, lazyDispatcher_, runMaintenance, incidents_);
+}
+
+void StoreManagerFactory::setIncidents(std::shared_ptr<const IncidentReporter> incidents) {
+  incidents_ = std::move(incidents);
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -21,6 +21,7 @@ class AttributeStore;
 class Configuration;
 class DiskSizeCalculator;
 class FileUtils;
+class IncidentReporter;
 class LazyDispatcher;
 class StoreDirectoryNameBuilderFactory;
 class StoreManager;
@@ -74,6 +75,11 @@ class CELLAR_EXPORT StoreManagerFactory : public session::Invalidatable {
   // building threw makes this throw `std::future_error` (broken promise), and the managers after it stay valid.
   void invalidate() override;
 
+  // Where managers that are built afterwards, and their stores, report incidents; null, as at first: nowhere. To be
+  // called before several threads use the factory. The handler may ask for a manager: even a queue that runs tasks at
+  // once calls it only when the building, or the invalidation, is over. The trash collector has a setter of its own.
+  void setIncidents(std::shared_ptr<const IncidentReporter> incidents);
+
  private:
   std::shared_ptr<StoreManager> buildManager(const std::string& managerName, const std::string& sessionKey,
                                              bool runMaintenance);
@@ -90,6 +96,7 @@ class CELLAR_EXPORT StoreManagerFactory : public session::Invalidatable {
   const std::shared_ptr<TrashCollector> trashCollector_;
   const std::function<std::string(const std::string&)> sessionTagMapper_;
   const bool servesSessionScoped_;
+  std::shared_ptr<const IncidentReporter> incidents_;
 
   std::recursive_mutex invalidationMutex_;  // held by an invalidation, within which another may begin
 

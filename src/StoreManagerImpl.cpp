@@ -9,6 +9,7 @@
 #include "Clock.h"
 #include "DiskSizeCalculator.h"
 #include "FileUtils.h"
+#include "Incident.h"
 #include "LarderException.h"
 #include "LazyDispatcher.h"
 #include "Store.h"
@@ -111,27 +112,33 @@ bool StoreManagerImpl::isValid() { return common_.isValid(); }
 
 void StoreManagerImpl::cleanseIfNecessary(bool force) {
   if (!fileUtils_->pathExists(common_.managerPath())) return;
-  const bool isTooSmall = isFileSystemTooSmall();
-  if (force || isTooSmall) common_.trashDirectories(common_.parentPath(), {common_.managerDirectoryName()}, {});
+  const std::string reason = whyFileSystemIsTooSmall();
+  if (!force && reason.empty()) return;
+  const bool isDiscarded = trashCollector_->collectPath(common_.managerPath());
+  if (force || !isDiscarded || incidents_ == nullptr) return;
+  incidents_->report({Incident::Kind::ManagerDiscarded, common_.managerPath(), "", reason});
 }
 
-// Logs it: what is discarded for it may be the only copy.
-bool StoreManagerImpl::isFileSystemTooSmall() {
+// Empty if it is not. Logs it: what is discarded for it may be the only copy.
+std::string StoreManagerImpl::whyFileSystemIsTooSmall() {
   const std::string& path = common_.managerPath();
   try {
     const std::int64_t size = fileUtils_->getDiskSpace(path).total;
-    if (size >= kCleanseMinimumFreeSizeTrash) return false;
-    LOG(ERROR) << "Discarding manager directory \"" << path << "\": its file system of " << size
-               << " bytes is smaller than the limit of " << kCleanseMinimumFreeSizeTrash << " bytes.";
-    return true;
+    if (size >= kCleanseMinimumFreeSizeTrash) return "";
+    std::string reason = "Discarding manager directory \"" + path + "\": its file system of " + std::to_string(size) +
+                         " bytes is smaller than the limit of " + std::to_string(kCleanseMinimumFreeSizeTrash) +
+                         " bytes.";
+    LOG(ERROR) << reason;
+    return reason;
   } catch (const LarderException& error) {
     LOG(ERROR) << "Could not read disk space: " << error.what();
-    return false;
+    return "";
   }
 }
 
 void StoreManagerImpl::startCleanup() {
   queue_->dispatch([self = shared_from_this()] {
+    const IncidentDeferral deferral;
     // One that comes late would take the next session's directories for stale.
     const std::lock_guard<std::recursive_mutex> lock(self->cleanupMutex_);
     if (!self->isValid()) return;
@@ -273,6 +280,11 @@ void StoreManagerImpl::reportEventToAnalytics(const std::string& storeName, Stor
                                               unsigned int currentSize, unsigned int maxSize) {
   if (analyticsReporter_ == nullptr) return;
   analyticsReporter_->reportEvent(StoreManagerEvent(type, storeName, currentSize, maxSize));
+}
+
+void StoreManagerImpl::setIncidents(std::shared_ptr<const IncidentReporter> incidents) {
+  incidents_ = incidents;
+  common_.setIncidents(std::move(incidents));
 }
 
 }  // namespace velmora::mobile::xplat::cellar

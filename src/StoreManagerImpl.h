@@ -99,6 +99,11 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   void reportEventToAnalytics(const std::string& storeName, StoreManagerEvent::Type type, unsigned int currentSize,
                               unsigned int maxSize);
 
+  // As the common core's. `cleanseIfNecessary` reports `ManagerDiscarded`, with the path of the manager's directory as
+  // the name, when the directory was moved to the trash because of its file system's size: not when it was forced, and
+  // not when it could not be moved.
+  void setIncidents(std::shared_ptr<const IncidentReporter> incidents);
+
  private:
   struct PruneRequest;
 
@@ -106,7 +111,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
                                 const std::shared_ptr<const StoreDefinition>& definition);
   void createAllStores();
   std::vector<PruneRequest> beginPruneRound();
-  bool isFileSystemTooSmall();
+  std::string whyFileSystemIsTooSmall();
   bool isInSurvivalMode() const;
   void noteIfRoundIsOver(const std::lock_guard<std::mutex>& lock);
   void startPruning(const PruneRequest& request);
@@ -127,6 +132,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   const std::shared_ptr<TrashCollector> trashCollector_;
   StoreManagerImplCommon common_;
   const std::shared_ptr<AsyncExecutor> queue_;
+  std::shared_ptr<const IncidentReporter> incidents_;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

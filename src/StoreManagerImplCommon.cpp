@@ -9,13 +9,30 @@
 
 #include "AttributeStore.h"
 #include "FileUtils.h"
+#include "Incident.h"
 #include "JsonValue.h"
 #include "LarderException.h"
 #include "Store.h"
 #include "StoreDirectoryNameBuilder.h"
+#include "StoreOptions.h"
 #include "TrashCollector.h"
 
 namespace velmora::mobile::xplat::cellar {
+
+namespace {
+
+// What the exception that is being handled says.
+std::string currentExceptionText() {
+  try {
+    throw;
+  } catch (const std::exception& error) {
+    return error.what();
+  } catch (...) {
+    return "unknown exception";
+  }
+}
+
+}  // namespace
 
 const std::string StoreManagerImplCommon::TemporaryDirectoryName = "tmp";
 const std::string StoreManagerImplCommon::TrashOnStartupKey = "trash_on_start_up";
@@ -68,7 +85,12 @@ std::shared_ptr<Store> StoreManagerImplCommon::getStore(const std::string& ident
     return createStore(identifier, item, std::move(taskQueueFactory), std::move(trashCollector),
                        std::move(analyticsReporter), std::move(sizeChangedCallback), pruneStrategy);
   } catch (...) {
-    isValid() ? noteFailure(*item) : abandon(*item);
+    if (isValid()) {
+      noteFailure(*item);
+      reportFailure(identifier);
+    } else {
+      abandon(*item);
+    }
     throw;
   }
 }
@@ -84,6 +106,15 @@ void StoreManagerImplCommon::noteFailure(Item& item) {
     item.hasFailed = item.getStore() == nullptr;
   }
   item.condition.notify_all();
+}
+
+// Called where the exception is handled.
+void StoreManagerImplCommon::reportFailure(const std::string& identifier) const {
+  const auto found = definition_.stores.find(identifier);
+  if (incidents_ == nullptr || found == definition_.stores.end() || found->second == nullptr) return;
+  const std::string& name = found->second->name;
+  incidents_->report(
+      {Incident::Kind::CreationFailed, name, "", "Could not create store \"" + name + "\": " + currentExceptionText()});
 }
 
 // The directory was removed under the creator. Whoever waits for the store gets what later callers get: none.
@@ -116,8 +147,9 @@ std::shared_ptr<Store> StoreManagerImplCommon::createStore(const std::string& id
     abandon(*item);  // the next manager of this directory may be opening the same files by now
     return nullptr;
   }
-  auto store = storeDefinition->createStore(storePath, temporaryDirectoryPath_, std::move(taskQueueFactory),
-                                            std::move(trashCollector), std::move(analyticsReporter), fileUtils_,
+  const StoreServices services{std::move(taskQueueFactory), std::move(trashCollector), fileUtils_,
+                               std::move(analyticsReporter), incidents_};
+  auto store = storeDefinition->createStore(storePath, temporaryDirectoryPath_, services,
                                             std::move(sizeChangedCallback), pruneStrategy, storeDefinition);
   {
     const std::lock_guard<std::mutex> lock(item->mutex);
@@ -287,5 +319,9 @@ const std::string& StoreManagerImplCommon::parentPath() const { return parentPat
 const std::string& StoreManagerImplCommon::managerPath() const { return managerPath_; }
 const std::string& StoreManagerImplCommon::managerDirectoryName() const { return managerDirectoryName_; }
 const std::string& StoreManagerImplCommon::getTemporaryDirectory() const { return temporaryDirectoryPath_; }
+
+void StoreManagerImplCommon::setIncidents(std::shared_ptr<const IncidentReporter> incidents) {
+  incidents_ = std::move(incidents);
+}
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -16,6 +16,7 @@
 namespace velmora::mobile::xplat::cellar {
 
 class AttributeStore;
+class IncidentReporter;
 class StoreDirectoryNameBuilder;
 
 // What the lite and the full manager share: one manager's directory tree and its stores, each created once and handed
@@ -133,6 +134,12 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   const std::string& managerDirectoryName() const;
   const std::string& getTemporaryDirectory() const;
 
+  // Where the manager, and the stores that it creates afterwards, report incidents; null, as at first: nowhere. To be
+  // called before several threads use the manager. `CreationFailed` is reported once for each attempt to create a store
+  // that throws, with the exception's text. Not for an identifier that the manager does not have, nor once the manager
+  // is invalid: that takes the directory away from under the creator.
+  void setIncidents(std::shared_ptr<const IncidentReporter> incidents);
+
  private:
   using StoreMap = std::unordered_map<std::string, std::shared_ptr<Item>>;
 
@@ -141,6 +148,7 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   void discard(StoreMap slots);
   static void abandon(Item& item);
   static void noteFailure(Item& item);
+  void reportFailure(const std::string& identifier) const;
   static std::shared_ptr<Store> releaseOwnership(Item& item);
   bool isClosed();
   bool isMarkedForTrashing(const std::string& storePath);
@@ -154,6 +162,7 @@ class CELLAR_EXPORT StoreManagerImplCommon {
   const std::string managerDirectoryName_;
   const std::string managerPath_;
   const std::string temporaryDirectoryPath_;
+  std::shared_ptr<const IncidentReporter> incidents_;
 
   std::mutex mutex_;  // guards all below
   StoreMap stores_;   // by identifier; emptied by invalidation, which parts manager and stores

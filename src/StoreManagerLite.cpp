@@ -1,6 +1,7 @@
 #include "StoreManagerLite.h"
 
 #include <stdexcept>
+#include <utility>
 
 #include "StoreManagerImplCommon.h"
 
@@ -32,5 +33,9 @@ std::shared_ptr<Store> StoreManagerLite::getStoreImpl(const std::string& identif
 void StoreManagerLite::invalidate() { common_->invalidate(); }
 
 bool StoreManagerLite::isValid() { return common_->isValid(); }
+
+void StoreManagerLite::setIncidents(std::shared_ptr<const IncidentReporter> incidents) {
+  common_->setIncidents(std::move(incidents));
+}
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -9,6 +9,7 @@
 namespace velmora::mobile::xplat::cellar {
 
 class AttributeStore;
+class IncidentReporter;
 class StoreDirectoryNameBuilder;
 class StoreManagerImplCommon;
 
@@ -36,6 +37,10 @@ class CELLAR_EXPORT StoreManagerLite {
   void invalidate();
 
   bool isValid();
+
+  // Where stores that could not be created are reported, as `CreationFailed`; null, as at first: nowhere. To be called
+  // before several threads use the manager.
+  void setIncidents(std::shared_ptr<const IncidentReporter> incidents);
 
  private:
   const std::unique_ptr<StoreManagerImplCommon> common_;

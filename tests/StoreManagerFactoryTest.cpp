@@ -21,6 +21,7 @@
 #include "PathLocations.h"
 #include "StoreManager.h"
 #include "support/Barrier.h"
+#include "support/IncidentLog.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 #include "support/Watchdog.h"
@@ -231,6 +232,37 @@ TEST_F(StoreManagerFactoryTest, AManagerBuiltWhileTheFlagIsSetIsCleansed) {
   StoreManager::setForceCleanseOnInit(false);
   get("b");
   EXPECT_TRUE(directory.exists("areas/1/_store_/value"));
+}
+
+TEST_F(StoreManagerFactoryTest, ManagersReportIncidentsWhereTheFactorySays) {
+  test::IncidentLog incidents;
+  define("a", {{"thumbs", fake("thumbs")}});
+  define("b", {}, true, Area::Documents);
+  build();
+  files->total = 1;
+  get("b");
+  factory_->setIncidents(incidents.reporter);
+  const auto manager = get("a");
+  ASSERT_EQ(incidents.queue->pending(), 1U);
+  EXPECT_EQ(incidents.take().at(0).rfind("ManagerDiscarded " + directory.file("areas/0/_store_") + ": ", 0), 0U);
+  stores->onCreate = [](const string&, const auto&) { throw FileUtilsIoException(EIO, "no luck"); };
+  EXPECT_THROW(manager->getStoreImpl("thumbs", PruneStrategyIdentifier::Null), FileUtilsIoException);
+  EXPECT_EQ(incidents.take().size(), 1U);
+}
+
+TEST_F(StoreManagerFactoryTest, AHandlerThatIsCalledAtOnceMayAskForTheManagerThatReports) {
+  const test::Watchdog watchdog(60);
+  test::IncidentLog incidents;
+  std::shared_ptr<StoreManager> heard;
+  incidents.runAtOnce();
+  incidents.onIncident = [&](const Incident&) { heard = factory_->managerForIdentifier("a"); };
+  define("a");
+  build();
+  factory_->setIncidents(incidents.reporter);
+  files->total = 1;
+  const auto manager = get("a");
+  ASSERT_NE(heard, nullptr);
+  EXPECT_EQ(heard, manager);
 }
 
 // Requests that fail

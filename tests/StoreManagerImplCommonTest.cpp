@@ -18,6 +18,7 @@
 #include "LarderException.h"
 #include "PersistentKeyValueStore.h"
 #include "support/Barrier.h"
+#include "support/IncidentLog.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 #include "support/Watchdog.h"
@@ -87,6 +88,21 @@ class StoreManagerImplCommonTest : public testing::Test, protected test::Manager
 };
 
 class StoreManagerImplCommonInvalidation : public StoreManagerImplCommonTest {};
+
+class StoreManagerImplCommonIncidents : public StoreManagerImplCommonTest {
+ protected:
+  void buildReporting(Stores definitions) {
+    build(std::move(definitions));
+    common_->setIncidents(incidents_.reporter);
+    common_->retryFailedCreations();
+  }
+
+  static string failed(const string& name) {
+    return "CreationFailed " + name + ": Could not create store \"" + name + "\": ";
+  }
+
+  test::IncidentLog incidents_;
+};
 
 // Construction
 
@@ -318,6 +334,71 @@ TEST_F(StoreManagerImplCommonTest, AManagerThatRetriesThrowsForAnUnknownIdentifi
   build({});
   common_->retryFailedCreations();
   for (int i = 0; i < 2; ++i) EXPECT_THROW(get("b"), std::logic_error);
+}
+
+TEST_F(StoreManagerImplCommonIncidents, TellOfEachAttemptToCreateAStoreThatThrows) {
+  int attempts = 0;
+  stores->onCreate = [&](const string&, const auto&) {
+    if (++attempts == 1) throw FileUtilsIoException(EIO, "no luck");
+    if (attempts == 2) throw 2;  // NOLINT: a definition is free to
+  };
+  buildReporting({{"id", fake("thumbs")}});
+  EXPECT_THROW(get("id"), FileUtilsIoException);
+  EXPECT_EQ(incidents_.take(), std::vector<string>{failed("thumbs") + ioFailure(EIO, "no luck")});
+  EXPECT_THROW(get("id"), int);
+  EXPECT_EQ(incidents_.take(), std::vector<string>{failed("thumbs") + "unknown exception"});
+  EXPECT_NE(get("id"), nullptr);
+  EXPECT_TRUE(incidents_.take().empty());
+}
+
+TEST_F(StoreManagerImplCommonIncidents, TellOfADirectoryThatCannotBeCreated) {
+  buildReporting({{"a", fake("a")}, {"b", fake("b")}});
+  files->failPath(Operation::CreateDirectory, managerPath() + "/a_250_v1", ENOSPC);
+  EXPECT_THROW(get("a"), FileUtilsIoException);
+  EXPECT_NE(get("b"), nullptr);
+  EXPECT_EQ(incidents_.take(), std::vector<string>{failed("a") + ioFailure(ENOSPC, "No space left on device")});
+}
+
+TEST_F(StoreManagerImplCommonIncidents, TellOfNoStoreThatTheManagerDoesNotHave) {
+  buildReporting({});
+  EXPECT_THROW(get("b"), std::logic_error);
+  EXPECT_TRUE(incidents_.take().empty());
+}
+
+TEST_F(StoreManagerImplCommonIncidents, TellOfNoCreationThatAnInvalidationHasTakenTheDirectoryFrom) {
+  stores->onCreate = [&](const string&, const auto&) {
+    common_->invalidate();
+    throw FileUtilsIoException(ENOENT, "gone");
+  };
+  buildReporting({{"a", fake("a")}});
+  EXPECT_THROW(get("a"), FileUtilsIoException);
+  EXPECT_TRUE(incidents_.take().empty());
+}
+
+TEST_F(StoreManagerImplCommonIncidents, AreToldWithoutALockSoThatTheHandlerMayAskForTheStore) {
+  incidents_.runAtOnce();
+  incidents_.onIncident = [&](const Incident&) { EXPECT_NE(get("a"), nullptr); };
+  int attempts = 0;
+  stores->onCreate = [&](const string&, const auto&) {
+    if (++attempts == 1) throw FileUtilsIoException(EIO, "no luck");
+  };
+  buildReporting({{"a", fake("a")}});
+  EXPECT_THROW(get("a"), FileUtilsIoException);
+  EXPECT_EQ(attempts, 2);
+}
+
+TEST_F(StoreManagerImplCommonIncidents, OfAStoreReachTheReporterOfItsManager) {
+  buildReporting(
+      {{"letters", std::make_shared<PKVSDefinition>("letters", "media", false, false, 1U, std::nullopt, false, 100U)}});
+  directory.write(inManager("letters_250_v1/manifest_v1.sqlite"), string(20'000, 'G'));
+  EXPECT_NE(get("letters"), nullptr);
+  queues->runAll();
+  const std::vector<string> told = incidents_.take();
+  ASSERT_EQ(told.size(), 1U);
+  EXPECT_EQ(told[0].rfind("StorePurged letters: Store \"letters\" purged due to corrupted manifest. ", 0), 0U)
+      << told[0];
+  for (const auto& queue : queues->all()) queue->onDispatch = [&queue = *queue] { queue.runAll(); };
+  common_->invalidate();
 }
 
 TEST_F(StoreManagerImplCommonTest, OfThoseWhoWaitForACreationThatFailsOneTriesAgainAndTheOthersGetItsStore) {

@@ -21,6 +21,7 @@
 #include "LazyDispatcher.h"
 #include "host/testing/ManualClock.h"
 #include "support/Barrier.h"
+#include "support/IncidentLog.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 #include "support/Watchdog.h"
@@ -1064,6 +1065,94 @@ TEST_F(StoreManagerImplTest, ADiskThatCannotBeLookedAtIsCleansedOnlyWhenForced) 
   EXPECT_TRUE(log_.contains(ioFailure(EIO)));
   EXPECT_NO_THROW(manager_->cleanseIfNecessary(true));
   EXPECT_EQ(trash->collected(), Texts{managerPath()});
+}
+
+class StoreManagerImplIncidents : public StoreManagerImplTest {
+ protected:
+  void buildReporting(Stores definitions = {}) {
+    build(manager(std::move(definitions)));
+    manager_->setIncidents(incidents_.reporter);
+  }
+
+  string discarded() const {
+    return "ManagerDiscarded " + managerPath() + ": Discarding manager directory \"" + managerPath() +
+           "\": its file system of 78643199 bytes is smaller than the limit of 78643200 bytes.";
+  }
+
+  test::IncidentLog incidents_;
+};
+
+TEST_F(StoreManagerImplIncidents, TellOfAManagerThatIsDiscardedForTheSizeOfItsFileSystem) {
+  buildReporting();
+  files->total = 78643199;
+  manager_->cleanseIfNecessary(false);
+  EXPECT_EQ(incidents_.queue->pending(), 1U);
+  EXPECT_EQ(incidents_.take(), Texts{discarded()});
+}
+
+TEST_F(StoreManagerImplIncidents, TellOfNoManagerThatStays) {
+  buildReporting();
+  manager_->cleanseIfNecessary(false);
+  files->failNext(Operation::GetDiskSpace, EIO);
+  manager_->cleanseIfNecessary(false);
+  files->total = 78643199;
+  trash->refuses = true;
+  manager_->cleanseIfNecessary(false);
+  EXPECT_TRUE(directory.exists("area/_store_1"));
+  EXPECT_TRUE(incidents_.take().empty());
+}
+
+TEST_F(StoreManagerImplIncidents, TellOfNoManagerWhoseDiscardingIsForced) {
+  for (const long long total : {78643200LL, 78643199LL}) {
+    buildReporting();
+    files->total = total;
+    manager_->cleanseIfNecessary(true);
+    EXPECT_FALSE(directory.exists("area/_store_1"));
+  }
+  EXPECT_TRUE(incidents_.take().empty());
+}
+
+TEST_F(StoreManagerImplIncidents, AreToldWithoutALockSoThatTheHandlerMayUseTheManager) {
+  incidents_.runAtOnce();
+  incidents_.onIncident = [&](const Incident&) { EXPECT_NE(get("a"), nullptr); };
+  buildReporting({{"a", fake("a")}});
+  files->total = 78643199;
+  manager_->cleanseIfNecessary(false);
+  EXPECT_EQ(incidents_.take(), Texts{discarded()});
+  EXPECT_EQ(stores->createdNames(), Texts{"a"});
+}
+
+TEST_F(StoreManagerImplIncidents, TellOfAStoreThatCannotBeCreatedOnRequestOrInTheBackground) {
+  createDispatcher();
+  stores->onCreate = [](const string&, const auto&) { throw FileUtilsIoException(EIO, "no luck"); };
+  buildReporting({{"a", fake("a")}});
+  manager_->retryFailedCreations();
+  EXPECT_THROW(get("a"), FileUtilsIoException);
+  manager_->initAllStoresLazy();
+  dispatcher_->dispatchNow();
+  queues->workQueue(0)->runAll();
+  const string line = "CreationFailed a: Could not create store \"a\": domain: QZLarderIoErrorErrorDomain; code: " +
+                      std::to_string(EIO) + "; description: no luck .";
+  EXPECT_EQ(incidents_.take(), (Texts{line, line}));
+}
+
+TEST_F(StoreManagerImplIncidents, OfTheTrashAreToldWhenTheCleaningUpIsOver) {
+  const test::Watchdog watchdog(60);
+  incidents_.runAtOnce();
+  incidents_.onIncident = [&](const Incident&) {
+    files->heal();
+    // Invalidating waits for a clean-up of another thread.
+    std::thread([&] { manager_->invalidate(); }).join();
+  };
+  buildReporting();
+  trash->setIncidents(incidents_.reporter);
+  trashQueues->queue(0)->onDispatch = [&] { trashQueues->queue(0)->runAll(); };
+  directory.write("area/_store_1/old_1_v1/value", "bytes");
+  files->failAlways(Operation::DeleteFile, EBUSY);
+  manager_->startCleanup();
+  settle();
+  EXPECT_EQ(incidents_.take().size(), 1U);
+  EXPECT_FALSE(manager_->isValid());
 }
 
 // Cleaning up, measuring

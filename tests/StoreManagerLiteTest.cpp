@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <functional>
 #include <memory>
 #include <stdexcept>
@@ -9,8 +10,10 @@
 #include <utility>
 #include <vector>
 
+#include "LarderException.h"
 #include "Store.h"
 #include "support/Barrier.h"
+#include "support/IncidentLog.h"
 #include "support/LogCapture.h"
 #include "support/ManagerServices.h"
 
@@ -70,6 +73,15 @@ TEST_F(StoreManagerLiteTest, AnOversizedCacheIsLeftAlone) {
   lite_->getStoreImpl("a");
   EXPECT_TRUE(directory.exists("area/_store_1/a_250_v1/file"));
   EXPECT_TRUE(sizes->fetched().empty());
+}
+
+TEST_F(StoreManagerLiteTest, TellsOfAStoreThatCannotBeCreated) {
+  const test::IncidentLog incidents;
+  build({{"a", unmanaged("a")}}).setIncidents(incidents.reporter);
+  files->failPath(test::Operation::CreateDirectory, areaPath() + "/_store_1/a_250_v1", EIO);
+  EXPECT_THROW(lite_->getStoreImpl("a"), FileUtilsIoException);
+  EXPECT_THROW(lite_->getStoreImpl("x"), std::logic_error);
+  EXPECT_EQ(incidents.queue->runAll(), 1U);
 }
 
 TEST_F(StoreManagerLiteTest, StoresGetNoServicesAndTheNullStrategy) {
