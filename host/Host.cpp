@@ -109,6 +109,7 @@ class Host::Request {
   const std::shared_ptr<const StoreManagerDefinition> definition;
 
  private:
+  const IncidentDeferral deferral_;  // a handler may make requests of its own
   Host& host_;
   Scope& scope_;
 };
@@ -180,7 +181,10 @@ Host::Host(HostOptions options)
       attributes_(std::make_shared<AttributeStore>(fileUtils_)),
       sizes_(std::make_shared<DiskSizeCalculator>(fileUtils_, attributes_, analytics_)),
       lazyWork_(LazyDispatcher::createLazyDispatcher(taskQueueFactory_, options.lazyDelaySeconds)),
-      measuringQueue_(taskQueueFactory_->createWorkQueue()) {
+      measuringQueue_(taskQueueFactory_->createWorkQueue()),
+      incidentGate_(gateFor(std::move(options.onIncident))),
+      incidents_(reporterThrough(incidentGate_, *taskQueueFactory_)) {
+  trash_->setIncidents(incidents_);
   sizes_->exclude(AttributeStore::fileName);
   sizes_->setAnalytics(analytics_ != nullptr);
 }
@@ -189,14 +193,21 @@ Host::Host(const std::string& configuration, const std::string& root) : Host(pla
 
 Host::~Host() {
   lazyWork_->willBeTriggeredExternally();
-  if (threads_ == nullptr) return;
+  const bool haveThreadsEnded = endThreads();  // if not, the patience is used up
+  closeIncidentGate(haveThreadsEnded ? shutDownPatience_ : std::chrono::seconds(0));
+}
+
+// False when they were left behind.
+bool Host::endThreads() {
+  if (threads_ == nullptr) return true;
   threads_->refuseNewWork();
   if (threads_->drain(shutDownPatience_)) {
     threads_->shutDown();
-  } else {
-    LOG(ERROR) << "Host destroyed with work pending; its threads were detached.";
-    threads_->abandon();
+    return true;
   }
+  LOG(ERROR) << "Host destroyed with work pending; its threads were detached.";
+  threads_->abandon();
+  return false;
 }
 
 std::shared_ptr<StoreManager> Host::manager(const std::string& name, const std::optional<std::string>& sessionKey) {
@@ -232,6 +243,7 @@ std::shared_ptr<StoreManager> Host::managerIn(const Request& request, const std:
 std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definition, const std::string& sessionKey) {
   StoreManagerFactory factory(definition.sessionScoped, analytics_, attributes_, configuration_, sizes_, fileUtils_,
                               lazyWork_, locations_, nameBuilders_, taskQueueFactory_, trash_, sessionTagMapper_);
+  factory.setIncidents(incidents_);
   auto manager = factory.managerForIdentifier(definition.name, sessionKey, runMaintenance_);
   manager->retryFailedCreations();
   return manager;

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include <cellar/Export.h>
+#include <cellar/Incident.h>
 #include <cellar/StoreManager.h>
 #include <cellar/XAnalytics.h>
 #include <cellar/executor/TaskQueueFactory.h>
@@ -60,6 +61,20 @@ struct HostOptions {
   // Whether the host locks its root with a `RootLock` until it is destroyed. Without the lock you must make sure that
   // no other host uses the root, in this process or another: they would lose each other's values.
   bool lockRoot = true;
+
+  // Called for each `Incident`: something that nobody has asked for has happened to stored data. Empty: incidents are
+  // only logged. It runs on a queue of its own, one call at a time: a slow one delays further incidents and the end of
+  // the host, nothing else. It may use the host and its stores, except `logOut` and `invalidate`, which throw on the
+  // host's own threads. What it throws is one error line in the log.
+  //
+  // No lock is held during a call. Queues of your own that run tasks at once call it on the thread that reports: of a
+  // manager, and of a store that could not be created, when the request to the host is over; of a store's values, and
+  // of the trash, perhaps within an operation of a store, so it must not use stores then.
+  //
+  // What is reported before the host is destroyed is handed over before the destructor returns, unless the queues came
+  // with the options: what still waits there is dropped. The destructor waits for a call that is under way for
+  // `shutDownPatience` at most, and not for one that it runs in. No call begins after it has returned.
+  std::function<void(const Incident& incident)> onIncident;
 };
 
 // A session that has data on disk.
@@ -188,6 +203,7 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   class Request;
   class Ending;
   class Discarding;
+  class IncidentGate;
 
   std::shared_ptr<Store> getStore(const std::string& identifier, const std::optional<std::string>& sessionKey);
   std::shared_ptr<StoreManager> managerIn(const Request& request, const std::optional<std::string>& sessionKey);
@@ -201,6 +217,11 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   bool holds(const std::string& area, const std::string& name) const;
   std::vector<std::string> directoriesIn(const std::string& area) const;
   std::optional<std::string> keyOf(const std::string& tag) const;
+  static std::shared_ptr<IncidentGate> gateFor(std::function<void(const Incident&)> handler);
+  static std::shared_ptr<const IncidentReporter> reporterThrough(const std::shared_ptr<IncidentGate>& gate,
+                                                                 TaskQueueFactory& queues);
+  void closeIncidentGate(std::chrono::seconds patience);
+  bool endThreads();
 
   const std::shared_ptr<const Configuration> configuration_;
   const std::shared_ptr<FileUtils> fileUtils_;
@@ -219,6 +240,8 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<DiskSizeCalculator> sizes_;
   const std::shared_ptr<LazyDispatcher> lazyWork_;
   const std::shared_ptr<AsyncExecutor> measuringQueue_;
+  const std::shared_ptr<IncidentGate> incidentGate_;         // null: nobody is told of incidents
+  const std::shared_ptr<const IncidentReporter> incidents_;  // null with the gate
 
   std::mutex mutex_;                 // guards everything below; not held while other objects are called
   std::condition_variable changed_;  // a scope's requests, its end, or that of a discarding

@@ -14,7 +14,8 @@ struct CELLAR_EXPORT TaskQueueFactory {
   // A serial queue for file work: writing and deleting value files, emptying the trash, maintenance of a manager.
   virtual std::shared_ptr<AsyncExecutor> createQueue() = 0;
 
-  // A serial queue for manifest work and for the creation of stores in the background.
+  // A serial queue for manifest work, for the creation of stores in the background, and for a host's handler of
+  // incidents.
   virtual std::shared_ptr<AsyncExecutor> createWorkQueue() = 0;
 };
 
