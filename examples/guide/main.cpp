@@ -33,6 +33,9 @@ std::unique_ptr<cellar::host::Host> openHost(const std::string& configuration, c
   options.root = data + "/storage";
   options.versionTag = "1";  // a release with another tag starts with empty stores
   options.analytics = std::make_unique<cellar::host::JsonLinesAnalytics>(data + "/analytics.jsonl");
+  options.onIncident = [](const cellar::Incident& incident) {
+    std::cerr << "storage: " << incident.name << ": " << incident.description << '\n';  // called on a queue of its own
+  };
   return std::make_unique<cellar::host::Host>(std::move(options));
 }
 // GUIDE open: end

@@ -73,6 +73,7 @@ std::map<std::string, Section> readPage() {
   std::map<std::string, Section> sections;
   Section* section = nullptr;
   for (const std::string& line : linesOf(std::ifstream(CELLAR_SOURCE_DIR "/docs/events.md"))) {
+    if (line.rfind("## ", 0) == 0) section = nullptr;
     if (line.rfind("## `", 0) == 0) section = &sections[line.substr(4, line.find('`', 4) - 4)];
     if (section == nullptr) continue;
     section->text += line + "\n";
