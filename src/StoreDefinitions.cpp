@@ -26,7 +26,6 @@ template <class Definition> void setOptions(KeyValueStoreOptions& options, const
   options.inlineData = definition.inlineData;
   options.durability = definition.durability;
   options.onSizeChanged = std::move(sizeChangedCallback);
-  options.durability = definition.durability;
 }
 
 }  // namespace
