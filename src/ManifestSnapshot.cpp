@@ -95,6 +95,17 @@ void copyInto(FileUtils& fileUtils, const std::string& copy, const std::string& 
   if (files.journal) fileUtils.writeFile(copy + kJournalSuffix, *files.journal);
 }
 
+// The callers of a snapshot know the manifest's exceptions and nothing of SQLite.
+template <class Action> auto translatingExceptions(Action action) {
+  try {
+    return action();
+  } catch (const SQLiteStoreCorruptedException& error) {
+    throw ManifestCorruptedException(error.description(), error.code());
+  } catch (const SQLiteStoreException& error) {
+    throw ManifestPersistenceException(error.description(), error.code());
+  }
+}
+
 // By key, of the records that have one.
 std::unordered_map<std::string, std::uint64_t> inlineSizesIn(const std::string& path) {
   std::unordered_map<std::string, std::uint64_t> sizes;
@@ -133,23 +144,37 @@ ManifestSnapshot::~ManifestSnapshot() { removeOwnDirectory(*fileUtils_, director
 
 std::vector<ManifestSnapshot::Record> ManifestSnapshot::records(
     std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory) const {
-  const SQLiteManifestPersistence manifest(path_, std::move(extendedMetadataFactory), nullptr);
+  // Opened as a safe store's, a manifest without checksums would get a column for them.
+  const Durability durability = hasChecksums() ? Durability::Safe : Durability::Relaxed;
+  const SQLiteManifestPersistence manifest(path_, std::move(extendedMetadataFactory), nullptr, durability);
   auto items = manifest.getAllItems();
   std::vector<Record> records;
   records.reserve(items.size());
-  try {
-    const auto inlineSizes = inlineSizesIn(path_);
-    for (auto& item : items) {
-      const auto inlineSize = inlineSizes.find(item->key);
-      records.push_back({std::move(*item), std::nullopt});
-      if (inlineSize != inlineSizes.end()) records.back().inlineSize = inlineSize->second;
-    }
-  } catch (const SQLiteStoreCorruptedException& error) {
-    throw ManifestCorruptedException(error.description(), error.code());
-  } catch (const SQLiteStoreException& error) {
-    throw ManifestPersistenceException(error.description(), error.code());
+  const auto inlineSizes = translatingExceptions([this] { return inlineSizesIn(path_); });
+  for (auto& item : items) {
+    const auto inlineSize = inlineSizes.find(item->key);
+    records.push_back({std::move(*item), std::nullopt});
+    if (inlineSize != inlineSizes.end()) records.back().inlineSize = inlineSize->second;
   }
   return records;
+}
+
+bool ManifestSnapshot::hasChecksums() const {
+  return translatingExceptions([this] {
+    SQLiteStore store(path_);
+    const auto columns = store.info("LarderManifest");
+    return std::any_of(columns.begin(), columns.end(), [](const auto& column) { return column.name == "checksum"; });
+  });
+}
+
+void ManifestSnapshot::forEachInlineValue(const std::function<void(const std::string&, const Bytes&)>& onValue) const {
+  translatingExceptions([&] {
+    SQLiteStore store(path_);
+    if (store.info("LarderManifest").empty()) return;
+    SQLiteStoreCursor cursor =
+        store.cursor("SELECT key, inline_data FROM LarderManifest WHERE inline_data IS NOT NULL;");
+    while (cursor.next()) onValue(cursor.get<std::string>(0), cursor.get<Bytes>(1));
+  });
 }
 
 std::vector<std::string> ManifestSnapshot::integrityErrors() const {

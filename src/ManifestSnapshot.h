@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -16,7 +17,7 @@ class FileUtils;
 
 // What the manifest of a store's directory says, without opening the store: for tools that look at a directory, not for
 // applications. The manifest is copied, with the write-ahead log beside it, and only the copy is ever opened: nothing
-// in the store's directory is written, created, locked or checkpointed, no value is read and no access date moves.
+// in the store's directory is written, created, locked or checkpointed, no other file is read and no access date moves.
 //
 // A store may be running meanwhile. The snapshot then holds what had been committed at one moment; access dates that
 // still wait in the store's memory are not in it. One thread at a time.
@@ -25,7 +26,7 @@ class CELLAR_EXPORT ManifestSnapshot {
   static const std::string manifestName;  // "manifest_v1.sqlite", in a store's directory
 
   struct CELLAR_EXPORT Record {
-    DiskCacheItem item;
+    DiskCacheItem item;                       // with the checksum that a safe store has given it
     std::optional<std::uint64_t> inlineSize;  // bytes of the value in the manifest; empty when there is none
   };
 
@@ -43,6 +44,15 @@ class CELLAR_EXPORT ManifestSnapshot {
   // Every record, in no order. Without a metadata factory (null) metadata is left out. Throws
   // `ManifestPersistenceException` for what `integrityErrors` finds. Not an error: an empty file.
   std::vector<Record> records(std::shared_ptr<ExtendedMetadataFactory> extendedMetadataFactory) const;
+
+  // Whether the manifest has the column for checksums, which a safe or synced store adds and every store then keeps.
+  // Throws as `records`.
+  bool hasChecksums() const;
+
+  // Calls `onValue` with each value that is in the manifest, in no order, on this thread. What it throws passes
+  // through. Throws as `records`. Not an error: a table that does not exist.
+  void forEachInlineValue(
+      const std::function<void(const std::string& key, const std::vector<unsigned char>& value)>& onValue) const;
 
   // What SQLite's integrity check, or opening the manifest as a store does, finds wrong with it, a line each; empty for
   // a sound one.

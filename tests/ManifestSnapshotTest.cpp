@@ -10,6 +10,8 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <optional>
+#include <stdexcept>
 #include <string>
 #include <utility>
 #include <vector>
@@ -97,6 +99,45 @@ TEST_F(ManifestSnapshotTest, HasEveryRecordWithoutItsValue) {
   manifest.reset();
   EXPECT_THAT(records(),
               UnorderedElementsAre("file file 7 0 10 20 -", "inline inline 3 1 11 21 3", "empty empty 0 1 12 22 0"));
+}
+
+TEST_F(ManifestSnapshotTest, HasTheChecksumsOfASafeStore) {
+  openManifest();
+  EXPECT_FALSE(take()->hasChecksums());
+  EXPECT_EQ(take()->records(nullptr).size(), 0U);
+  const std::vector<unsigned char> value = {1, 2, 3};
+  {
+    SQLiteManifestPersistence manifest(manifestPath(), nullptr, nullptr, Durability::Safe);
+    DiskCacheItem item("checked", "checked", 3, true, 10, 20, nullptr);
+    item.checksum = 0xfedcba98;
+    manifest.storeItem(item, &value);
+    manifest.setItem({"unchecked", "unchecked", 1, false, 10, 20, nullptr});
+  }
+  const auto snapshot = take();
+  EXPECT_TRUE(snapshot->hasChecksums());
+  std::map<std::string, std::optional<std::uint32_t>> checksums;
+  for (const auto& record : snapshot->records(nullptr)) checksums[record.item.key] = record.item.checksum;
+  EXPECT_THAT(checksums, ElementsAre(std::pair("checked", 0xfedcba98U), std::pair("unchecked", std::nullopt)));
+}
+
+TEST_F(ManifestSnapshotTest, ReadsInlineValues) {
+  auto manifest = openManifest();
+  manifest->setItem({"file", "file", 7, false, 10, 20, nullptr});
+  manifest->setItem({"inline", "inline", 3, false, 11, 21, nullptr});
+  manifest->setInlineData("inline", {1, 2, 3});
+  std::map<std::string, std::vector<unsigned char>> values;
+  const auto snapshot = take();
+  snapshot->forEachInlineValue([&](const std::string& key, const auto& value) { values[key] = value; });
+  EXPECT_THAT(values, ElementsAre(std::pair(std::string("inline"), std::vector<unsigned char>{1, 2, 3})));
+  EXPECT_THROW(snapshot->forEachInlineValue([](const auto&, const auto&) { throw std::length_error("full"); }),
+               std::length_error);
+}
+
+TEST_F(ManifestSnapshotTest, OfAnEmptyFileHasNoChecksumsAndNoInlineValues) {
+  directory_.write("store/manifest_v1.sqlite", "");
+  const auto snapshot = take();
+  EXPECT_FALSE(snapshot->hasChecksums());
+  snapshot->forEachInlineValue([](const auto& key, const auto&) { ADD_FAILURE() << key; });
 }
 
 TEST_F(ManifestSnapshotTest, HasWhatARunningStoreHasCommittedAndNotYetCheckpointed) {
