@@ -189,6 +189,30 @@ TEST(CheckWarnings, AManagerThatNeverPrunesIsNamedIfItHasWhatNeedsPruning) {
       IsEmpty());
 }
 
+// --- Durability ---
+
+TEST(CheckWarnings, ARelaxedKeyValueStoreAmongTheDocumentsIsNamed) {
+  const auto inArea = [](const std::string& area, const std::string& members) {
+    return warningsOf(R"({"m": {"max_size": "3GB", "area": ")" + area + R"(", "stores": {"s": {)" + members + "}}}}");
+  };
+  const std::string warning =
+      "/m/stores/s/durability: is relaxed: a kill may damage a value, and a damaged manifest or a full disk loses all "
+      "of them; use 'safe' for values that exist nowhere else";
+  EXPECT_THAT(inArea("documents", R"("type": "pkvs")"), ElementsAre(warning));
+  EXPECT_THAT(inArea("documents", R"("type": "pkvs", "durability": "relaxed")"), ElementsAre(warning));
+  EXPECT_THAT(inArea("documents", R"("type": "pkvs", "durability": "safe")"), IsEmpty());
+  EXPECT_THAT(inArea("documents", R"("type": "pkvs", "durability": "synced")"), IsEmpty());
+  EXPECT_THAT(inArea("documents", R"("type": "disk_cache", "lru_size_limit": "1MB")"), IsEmpty());
+  EXPECT_THAT(inArea("documents", R"("type": "unmanaged")"), IsEmpty());
+  EXPECT_THAT(inArea("caches", R"("type": "pkvs")"), IsEmpty());
+  EXPECT_THAT(inArea("shared", R"("type": "pkvs")"), IsEmpty());
+}
+
+TEST(CheckWarnings, AnUnmanagedStoreIgnoresDurability) {
+  EXPECT_THAT(ofStore(R"("type": "unmanaged", "durability": "safe")"),
+              ElementsAre("/m/stores/s/durability: stores of type unmanaged ignore this key"));
+}
+
 // --- Names ---
 
 TEST(CheckWarnings, ANameThatCannotBeAFileNameIsNamed) {
@@ -244,6 +268,17 @@ TEST(CheckFaults, EachIsNamedWithItsPlaceInTheParsersWords) {
                   "/m/stores/b: has no 'type', use unmanaged, pkvs or disk_cache",
                   "/m/stores/c/stale_age: Invalid unit 'hour', use minutes, hours, days or years.",
                   "/m/stores/d: a store must be an object", "/n: a manager must be an object"));
+}
+
+TEST(CheckFaults, ADurabilityThatDoesNotExistIsNamedInTheParsersWords) {
+  const auto ofType = [](const std::string& type, const std::string& durability) {
+    return faultsOf(R"({"m": {"stores": {"s": {"type": ")" + type + R"(", "durability": )" + durability + "}}}}");
+  };
+  for (const char* const type : {"pkvs", "disk_cache"}) {
+    EXPECT_THAT(ofType(type, R"("save")"), ElementsAre("/m/stores/s/durability: Invalid durability 'save', use "
+                                                       "relaxed, safe or synced."));
+    EXPECT_THAT(ofType(type, "true"), ElementsAre("/m/stores/s/durability: type must be string, but is boolean"));
+  }
 }
 
 TEST(CheckFaults, IdentifiersThatAreMetTwiceAreNamedWithTheirPlace) {
@@ -315,8 +350,8 @@ TEST(CheckReport, FillsInEveryDefault) {
   CheckResult result;
   result.file = "storage.json";
   const ConfigurationDocument document =
-      parseConfigurationDocument(R"({"m": {"stores": {"c": {"type": "disk_cache"}, "k": {"type": "pkvs"},
-                                     "u": {"type": "unmanaged"}}}})");
+      parseConfigurationDocument(R"({"m": {"stores": {"c": {"type": "disk_cache"}, "k": {"type": "pkvs",
+                                     "durability": "synced"}, "u": {"type": "unmanaged"}}}})");
   result.resolved = resolve(document, {"250", "en", "US", "Alice"});
   std::ostringstream out;
   Console console(out, false, false);
@@ -326,9 +361,9 @@ m
   caches/_store_%41lice, a session's; limit 20.0 MB, pruned at most every 1 hour
   c: disk_cache in c_250_v1
       pruned to 0 B, to 0 B when space is short; strategy null, metadata null
-      any number of items, stale after 50 years, a file for each value
+      any number of items, stale after 50 years, a file for each value, relaxed
   k: pkvs in k_250_v1
-      any number of items, stale after 50 years, a file for each value
+      any number of items, stale after 50 years, a file for each value, synced
   u: unmanaged in u_250_v1
       no cache: never emptied
 
@@ -341,7 +376,8 @@ TEST(CheckReport, ForMachinesHasBytesAndSeconds) {
   CheckResult result;
   const ConfigurationDocument document = parseConfigurationDocument(
       R"({"m": {"area": "shared", "max_size": "1KB", "session_scoped": false, "prune_interval": "2 days",
-          "stores": {"s": {"type": "disk_cache", "lru_size_limit": "3KB", "capacity": 7, "locale_sensitive": true}}}})");
+          "stores": {"s": {"type": "disk_cache", "lru_size_limit": "3KB", "capacity": 7, "locale_sensitive": true,
+                 "durability": "safe"}}}})");
   result.resolved = resolve(document, {"250", "en", "US", ""});
   result.warnings = findWarnings(document, result.resolved);
   const OrderedJson json = checkAsJson(result);
@@ -351,6 +387,7 @@ TEST(CheckReport, ForMachinesHasBytesAndSeconds) {
   EXPECT_EQ(manager.at("prune_interval"), 172800);
   EXPECT_EQ(manager.at("stores").at(0).at("lru_size_limit"), 3072);
   EXPECT_EQ(manager.at("stores").at(0).at("capacity"), 7);
+  EXPECT_EQ(manager.at("stores").at(0).at("durability"), "safe");
   EXPECT_EQ(manager.at("stores").at(0).at("directory"), "s_en_US_250_v1");
   EXPECT_EQ(json.at("warnings").at(0).at("kind"), "over_manager_limit");
   EXPECT_EQ(json.at("warnings").at(0).at("path"), "/m/max_size");

@@ -6,6 +6,7 @@
 #include "Configuration.h"
 #include "Console.h"
 #include "Format.h"
+#include "storage/ConfiguredStores.h"
 #include "storage/Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -33,21 +34,22 @@ std::string textOf(const std::optional<std::int64_t>& capacity) {
   return "at most " + formatCount(static_cast<std::uint64_t>(*capacity), "item", "items");
 }
 
-std::string placeOfValues(bool inlineData) { return inlineData ? "values in the manifest" : "a file for each value"; }
+// What key-value stores and disk caches have in common.
+template <class Definition> std::string rulesOfItems(const Definition& store) {
+  return textOf(store.capacity) + ", stale after " + formatDuration(store.staleAge) + ", " +
+         (store.inlineData ? "values in the manifest" : "a file for each value") + ", " +
+         durabilityName(store.durability);
+}
 
 using Lines = std::vector<std::string>;
 
-Lines rulesOf(const PKVSDefinition& store) {
-  return {textOf(store.capacity) + ", stale after " + formatDuration(store.staleAge) + ", " +
-          placeOfValues(store.inlineData)};
-}
+Lines rulesOf(const PKVSDefinition& store) { return {rulesOfItems(store)}; }
 
 Lines rulesOf(const DiskCacheDefinition& store) {
   return {"pruned to " + formatSize(store.lruSizeLimit) + ", to " + formatSize(store.survivalSize) +
               " when space is short; strategy " + strategyName(store.pruneStrategy) + ", metadata " +
               factoryName(store.metadataFactory),
-          textOf(store.capacity) + ", stale after " + formatDuration(store.staleAge) + ", " +
-              placeOfValues(store.inlineData)};
+          rulesOfItems(store)};
 }
 
 Lines rulesOf(const StoreDefinition& store) {
@@ -113,6 +115,7 @@ OrderedJson asJson(const ResolvedStore& store) {
     json["inline_data"] = values.inlineData;
     json["stale_age"] = values.staleAge;
     json["capacity"] = asJson(values.capacity);
+    json["durability"] = durabilityName(values.durability);
   } else {
     const auto& cache = static_cast<const DiskCacheDefinition&>(definition);
     json["inline_data"] = cache.inlineData;
@@ -122,6 +125,7 @@ OrderedJson asJson(const ResolvedStore& store) {
     json["metadata_factory"] = factoryName(cache.metadataFactory);
     json["prune_strategy"] = strategyName(cache.pruneStrategy);
     json["capacity"] = asJson(cache.capacity);
+    json["durability"] = durabilityName(cache.durability);
   }
   return json;
 }

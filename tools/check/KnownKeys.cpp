@@ -53,9 +53,9 @@ const Keys& keysOfStores(const std::string& type) {
   };
   static const std::map<std::string, Keys> keys = {
       {"unmanaged", with({"is_cache", "max_size"})},
-      {"pkvs", with({"inline_data", "stale_age", "capacity"})},
+      {"pkvs", with({"inline_data", "stale_age", "capacity", "durability"})},
       {"disk_cache", with({"inline_data", "stale_age", "lru_size_limit", "survival_size", "metadata_factory",
-                           "prune_strategy", "capacity"})}};
+                           "prune_strategy", "capacity", "durability"})}};
   return keys.at(type);
 }
 

@@ -44,6 +44,15 @@ void warnOfLimits(const ResolvedStore& store, Diagnostics& findings) {
   }
 }
 
+// What lies in the documents area exists nowhere else.
+void warnOfDurability(const ResolvedManager& manager, const ResolvedStore& store, Diagnostics& findings) {
+  if (manager.definition->area != Area::Documents || store.definition->type != StoreDefinition::Type::PKVS) return;
+  if (static_cast<const PKVSDefinition&>(*store.definition).durability != Durability::Relaxed) return;
+  findings.push_back({"durability", memberPointer(store.pointer, "durability"),
+                      "is relaxed: a kill may damage a value, and a damaged manifest or a full disk loses all of them; "
+                      "use 'safe' for values that exist nowhere else"});
+}
+
 void warnOfFileName(const ResolvedStore& store, Diagnostics& findings) {
   const std::string& name = store.definition->name;
   const std::string place = name == store.identifier ? store.pointer : memberPointer(store.pointer, "name");
@@ -139,6 +148,7 @@ Diagnostics findWarnings(const ConfigurationDocument& document, const ResolvedCo
     for (const ResolvedStore& store : manager.stores) {
       warnOfStoreKeys(store.pointer, written.at("stores").at(store.identifier), findings);
       warnOfLimits(store, findings);
+      warnOfDurability(manager, store, findings);
       warnOfFileName(store, findings);
     }
     namesakes.lookAt(manager, findings);

@@ -81,6 +81,18 @@ ConfiguredStore ConfiguredStores::find(const ManagerPlace& place, const std::str
   return found;
 }
 
+std::string durabilityName(Durability durability) {
+  switch (durability) {
+    case Durability::Safe:
+      return "safe";
+    case Durability::Synced:
+      return "synced";
+    case Durability::Relaxed:
+      break;
+  }
+  return "relaxed";
+}
+
 VersionedName::VersionedName(const std::string& directoryName) : stem(directoryName) {
   const auto mark = directoryName.rfind("_v");
   if (mark == std::string::npos || mark + 2 == directoryName.size()) return;

@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "Configuration.h"
+#include "Durability.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -38,6 +39,9 @@ class ConfiguredStores {
  private:
   std::vector<std::shared_ptr<const StoreManagerDefinition>> managers_;
 };
+
+// "relaxed", "safe" or "synced", as it is written in a configuration.
+std::string durabilityName(Durability durability);
 
 // "thumbs_250" and 2 for "thumbs_250_v2"; the whole name and no number for one without a version.
 struct VersionedName {
