@@ -279,7 +279,8 @@ TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
       keysOf(document["managers"][0]["stores"][0]),
       "path directory identifier kind leftover damages items recorded_bytes files file_bytes inline_bytes "
       "held_bytes manifest_bytes allocated_bytes limit_bytes survival_bytes capacity stale_age fill oldest_access "
-      "newest_access stale_items stale_bytes items_to_prune bytes_to_prune next_to_go largest ages sizes ");
+      "newest_access stale_items stale_bytes items_to_prune bytes_to_prune next_to_go largest ages sizes durability "
+      "quarantined_files quarantined_bytes ");
   EXPECT_EQ(keysOf(document["managers"][0]["stores"][0]["largest"][0]), "key bytes last_access inline ");
 }
 

@@ -61,13 +61,17 @@ void measureFiles(const StorePlace& place, const StoreContext& context, StoreSur
     if (entry.type != Entry::Type::File) return;
     context.onFile(entry.size);
     if (isAttributesFile(entry)) return;
-    if (place.hasManifest && isManifestFile(path)) {
+    const bool isInterim = path == newManifestName() || path == salvagedManifestName();
+    if (place.hasManifest && (isManifestFile(path) || isInterim)) {
       store.manifestBytes += entry.size;
-      return;
+    } else if (place.hasManifest && isInStoreQuarantine(path)) {
+      ++store.quarantinedFiles;
+      store.quarantinedBytes += entry.size;
+    } else {
+      ++store.files;
+      store.fileBytes += entry.size;
+      values.push_back({path, entry.size, entry.modified, false});
     }
-    ++store.files;
-    store.fileBytes += entry.size;
-    values.push_back({path, entry.size, entry.modified, false});
   });
 }
 
@@ -162,10 +166,12 @@ void useDefinition(const StoreDefinition& definition, StoreSurvey& store) {
     store.limitBytes = cache->lruSizeLimit;
     store.survivalBytes = cache->survivalSize;
     store.staleAge = cache->staleAge;
+    store.durability = durabilityName(cache->durability);
     if (cache->capacity) store.capacity = static_cast<std::uint64_t>(*cache->capacity);
   } else if (const auto* keyValue = dynamic_cast<const PKVSDefinition*>(&definition)) {
     store.kind = StoreKind::KeyValue;
     store.staleAge = keyValue->staleAge;
+    store.durability = durabilityName(keyValue->durability);
     if (keyValue->capacity) store.capacity = static_cast<std::uint64_t>(*keyValue->capacity);
   } else if (definition.maxSize > 0) {
     store.limitBytes = definition.maxSize;
@@ -197,6 +203,7 @@ StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configur
     useFiles(values, context, store);
     return store;
   }
+  if (store.durability.empty() && snapshot.hasChecksums()) store.durability = "checksums";
   const auto* const cache = dynamic_cast<const DiskCacheDefinition*>(configured.definition.get());
   const auto metadata = cache != nullptr ? ExtendedMetadataFactoryFactory(cache->metadataFactory) : nullptr;
   useRecords(snapshot.records(metadata), cache, context, store);

@@ -65,6 +65,10 @@ struct StoreSurvey {
   std::vector<Bucket> ages;
   std::vector<Bucket> sizes;
 
+  std::string durability;              // by the configuration; else "checksums" when there are some, or empty
+  std::uint64_t quarantinedFiles = 0;  // that a safe store could not use, in its own directory: not values
+  std::uint64_t quarantinedBytes = 0;
+
   std::uint64_t heldBytes() const { return fileBytes + inlineBytes; }  // of values
 };
 

@@ -63,6 +63,9 @@ Json asJson(const StoreSurvey& store) {
   json["largest"] = asJson(store.largest);
   json["ages"] = asJson(store.ages);
   json["sizes"] = asJson(store.sizes);
+  json["durability"] = orNull(store.durability);
+  json["quarantined_files"] = store.quarantinedFiles;
+  json["quarantined_bytes"] = store.quarantinedBytes;
   return json;
 }
 

@@ -112,12 +112,14 @@ class Printer {
                  {"Full", Align::Right},
                  {"Oldest use", Align::Right},
                  {"Last use", Align::Right},
-                 {"Stale", Align::Right}});
+                 {"Stale", Align::Right},
+                 {"Durability", Align::Left}});
     for (const StoreSurvey& store : manager.stores) {
       table.addRow({printable(store.name), kindOf(store), formatCount(store.items), sizeOrNothing(store.recordedBytes),
                     formatSize(store.heldBytes()), formatSize(store.allocatedBytes), limitOf(store),
                     percent(fillOf(store)), age(store.oldestAccess), age(store.newestAccess),
-                    store.staleItems ? formatCount(*store.staleItems) : "-"});
+                    store.staleItems ? formatCount(*store.staleItems) : "-",
+                    store.durability.empty() ? "-" : store.durability});
     }
     console_.raw(table.text());
     for (const StoreSurvey& store : manager.stores) printItems(store);
@@ -137,6 +139,10 @@ class Printer {
   void printItems(const StoreSurvey& store) {
     for (const std::string& damage : store.damages) {
       console_.bad(printable(store.name) + ": the manifest is damaged: " + printable(damage));
+    }
+    if (store.quarantinedFiles > 0) {
+      console_.bad(printable(store.name) + ": " + formatCount(store.quarantinedFiles, "file", "files") + " (" +
+                   formatSize(store.quarantinedBytes) + ") in quarantine, which the store could not use");
     }
     if (store.largest.empty()) return;
     console_.raw("\n");

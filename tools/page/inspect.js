@@ -56,6 +56,8 @@ function storeFigures(store, at) {
   if (store.oldest_access !== null) add("Oldest use", "oldest_access", formatAge(store.oldest_access));
   if (store.newest_access !== null) add("Last use", "newest_access", formatAge(store.newest_access));
   if (store.stale_items !== null) add("Stale", "stale_items", formatCount(store.stale_items));
+  if (store.durability !== null) list.append(make("dt", { textContent: "Durability" }), make("dd", { textContent: store.durability }));
+  if (store.quarantined_bytes) add("In quarantine", "quarantined_bytes", formatSize(store.quarantined_bytes));
   if (store.items_to_prune) add("A prune would remove", "items_to_prune", formatCount(store.items_to_prune));
   return list;
 }

@@ -23,6 +23,14 @@ void walk(const std::string& directory, const std::string& prefix, const OnEntry
 
 }  // namespace
 
+const char* const kStoreQuarantine = "quarantine";
+
+std::string newManifestName() { return ManifestSnapshot::manifestName + "-new"; }
+
+std::string salvagedManifestName() { return ManifestSnapshot::manifestName + "-salvaged"; }
+
+bool isInStoreQuarantine(const std::string& below) { return below.rfind(std::string(kStoreQuarantine) + "/", 0) == 0; }
+
 bool isManifestFile(const std::string& name) {
   return std::any_of(kSuffixes.begin(), kSuffixes.end(),
                      [&](const char* suffix) { return name == ManifestSnapshot::manifestName + suffix; });

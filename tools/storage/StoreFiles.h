@@ -10,6 +10,15 @@ namespace velmora::mobile::xplat::cellar::tools {
 // Whether a file of that name (below the store's directory) is the manifest or one of SQLite's files beside it.
 bool isManifestFile(const std::string& name);
 
+// The manifest that a safe store makes in the place of a damaged one: while it is being made, and while it is complete
+// but not in its place.
+std::string newManifestName();
+std::string salvagedManifestName();
+
+// The directory within a safe store's into which it moves what it cannot use, and whether a file is in it.
+extern const char* const kStoreQuarantine;
+bool isInStoreQuarantine(const std::string& below);
+
 // Whether it is the file of a directory's attributes.
 bool isAttributesFile(const Entry& entry);
 
