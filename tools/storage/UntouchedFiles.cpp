@@ -106,19 +106,25 @@ std::uint64_t allocatedBy(const std::string& path) {
 }
 
 std::vector<unsigned char> UntouchedFiles::readFile(const std::string& path) {
+  std::vector<unsigned char> bytes;
+  readPieces(path, [&bytes](const unsigned char* piece, std::size_t count) {
+    bytes.insert(bytes.end(), piece, piece + count);
+  });
+  return bytes;
+}
+
+void UntouchedFiles::readPieces(const std::string& path,
+                                const std::function<void(const unsigned char* bytes, std::size_t count)>& consume) {
   const Descriptor file(path);
   if (!file.isRegularFile()) throw FileUtilsIoException(EINVAL, "cannot read '" + path + "': not a regular file");
-  std::vector<unsigned char> bytes;
   constexpr std::size_t step = std::size_t{1} << 16U;
-  for (std::size_t size = 0;;) {
-    bytes.resize(size + step);
-    const ssize_t count = read(file.get(), bytes.data() + size, step);
+  std::vector<unsigned char> piece(step);
+  for (;;) {
+    const ssize_t count = read(file.get(), piece.data(), step);
     if (count < 0 && errno == EINTR) continue;
     if (count < 0) fail(path);
-    size += static_cast<std::size_t>(count);
-    if (count > 0) continue;
-    bytes.resize(size);
-    return bytes;
+    if (count == 0) return;
+    consume(piece.data(), static_cast<std::size_t>(count));
   }
 }
 

@@ -1,6 +1,8 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -33,6 +35,8 @@ std::uint64_t allocatedBy(const std::string& path);
 class UntouchedFiles final : public FileUtils {
  public:
   std::vector<unsigned char> readFile(const std::string& path) override;
+  void readPieces(const std::string& path,
+                  const std::function<void(const unsigned char* bytes, std::size_t count)>& consume) override;
 };
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -13,8 +13,15 @@ struct Finding {
     InterruptedWrite,  // a provisional record, with or without a file
     SizeDiffers,
     InlineValueMissing,
+    DamagedValue,     // it is there, but its checksum differs
+    UnreadableValue,  // so that nobody knows whether it is damaged
     FileWithoutRecord,
+    SupersededFile,  // of a safe store: without a record, and its key has another value
+    UnfinishedFile,  // of a safe store: its writer was killed
     DamagedManifest,
+    UnfinishedManifest,  // a safe store was killed while it made it,
+    InterruptedSalvage,  // or before it put it in place
+    Quarantine,          // of a safe store: what it could not use
     DamagedAttributes
   };
 
@@ -24,7 +31,11 @@ struct Finding {
   std::uint64_t recorded = 0;  // bytes
   std::uint64_t actual = 0;    // bytes
   bool hasFile = false;        // of a record
-  std::string detail = {};     // what the database or the parser says
+  bool isSafe = false;         // the store keeps checksums
+  std::string detail = {};     // what the database, the parser or the system says
+  std::string file =
+      {};  // of a record without its file: another one with a value of the key; of a damaged value: its file
+  std::uint64_t files = 0;  // in a quarantine
 };
 
 using Findings = std::vector<Finding>;

@@ -3,6 +3,7 @@
 #include <filesystem>
 #include <utility>
 
+#include "FileUtils.h"
 #include "storage/Layout.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -24,11 +25,21 @@ fs::path freePath(const fs::path& wanted) {
 Quarantine::Quarantine(std::string base) : base_(std::move(base)) {}
 
 std::string Quarantine::take(const std::string& path) const {
+  std::string target = placeFor(path);
+  fs::rename(path, target);
+  return target;
+}
+
+std::string Quarantine::keep(const std::string& path, const std::vector<unsigned char>& bytes) const {
+  std::string target = placeFor(path);
+  FileUtils().createFile(target, bytes);
+  return target;
+}
+
+std::string Quarantine::placeFor(const std::string& path) const {
   const fs::path wanted = fs::path(base_) / kQuarantineName / fs::path(path).lexically_relative(base_);
   fs::create_directories(wanted.parent_path());
-  const fs::path target = freePath(wanted);
-  fs::rename(path, target);
-  return target.string();
+  return freePath(wanted).string();
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -15,7 +16,13 @@ class Quarantine {
   // `std::filesystem::filesystem_error`.
   std::string take(const std::string& path) const;
 
+  // Writes bytes into a file there, as if it had been moved from `path`; returns its path. Throws the same, and
+  // `FileUtilsIoException`.
+  std::string keep(const std::string& path, const std::vector<unsigned char>& bytes) const;
+
  private:
+  std::string placeFor(const std::string& path) const;
+
   const std::string base_;
 };
 

@@ -1,12 +1,16 @@
 #include "verify/Repair.h"
 
+#include <filesystem>
+#include <stdexcept>
 #include <utility>
 
+#include "FileNames.h"
 #include "Format.h"
 #include "ManifestSnapshot.h"
 #include "SQLiteManifestPersistence.h"
 #include "storage/Layout.h"
 #include "storage/Printable.h"
+#include "storage/SafeFiles.h"
 #include "storage/StoreFiles.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -18,14 +22,28 @@ Repair::~Repair() = default;
 std::string Repair::fix(const Finding& finding) {
   switch (finding.kind) {
     case Finding::Kind::RecordWithoutFile:
+      return finding.file.empty() ? removeRecord(finding) : nameFile(finding);
     case Finding::Kind::InlineValueMissing:
       return removeRecord(finding);
     case Finding::Kind::InterruptedWrite:
       return finding.hasFile ? correctSize(finding) : removeRecord(finding);
     case Finding::Kind::SizeDiffers:
       return correctSize(finding);
+    case Finding::Kind::DamagedValue:
+      return quarantineValue(finding);
+    case Finding::Kind::SupersededFile:
+    case Finding::Kind::UnfinishedFile:
+    case Finding::Kind::UnfinishedManifest:
+      return removeFile(finding);
     case Finding::Kind::DamagedManifest:
+      if (finding.isSafe) throw std::runtime_error("the store salvages it at its next start");
       return quarantineStore(finding);
+    case Finding::Kind::InterruptedSalvage:
+      throw std::runtime_error("the store puts it in its place at its next start");
+    case Finding::Kind::UnreadableValue:
+      throw std::runtime_error("it may be readable later");
+    case Finding::Kind::Quarantine:
+      throw std::runtime_error("look at what is in it, and remove it yourself");
     case Finding::Kind::FileWithoutRecord:
     case Finding::Kind::DamagedAttributes:
       break;
@@ -36,7 +54,8 @@ std::string Repair::fix(const Finding& finding) {
 SQLiteManifestPersistence& Repair::manifestOf(const Finding& finding) {
   if (manifest_ == nullptr) {
     const std::string path = finding.directory + "/" + ManifestSnapshot::manifestName;
-    manifest_ = std::make_unique<SQLiteManifestPersistence>(path, nullptr, nullptr);
+    const Durability durability = finding.isSafe ? Durability::Safe : Durability::Relaxed;
+    manifest_ = std::make_unique<SQLiteManifestPersistence>(path, nullptr, nullptr, durability);
   }
   return *manifest_;
 }
@@ -46,6 +65,19 @@ std::string Repair::removeRecord(const Finding& finding) {
   return "record removed";
 }
 
+// As a safe store does itself when it starts.
+std::string Repair::nameFile(const Finding& finding) {
+  const auto name = parseSafeFileName(finding.file);
+  const auto item = manifestOf(finding).getItem(finding.name);
+  if (!name || item == nullptr) throw std::runtime_error("the record has changed meanwhile");
+  item->filename = finding.file;
+  item->size = static_cast<std::uint32_t>(finding.actual);
+  item->checksum = name->checksum;
+  manifestOf(finding).storeItem(*item, nullptr);
+  return "file recorded";
+}
+
+// The checksum of the record remains true: a value that does not have it is never given a size.
 std::string Repair::correctSize(const Finding& finding) {
   manifestOf(finding).setSize(finding.name, static_cast<std::uint32_t>(finding.actual));
   return "size recorded";
@@ -54,6 +86,25 @@ std::string Repair::correctSize(const Finding& finding) {
 std::string Repair::quarantineFile(const Finding& finding) {
   const std::string now = quarantine_.take(finding.directory + "/" + finding.name);
   return "moved to " + printable(relativeTo(root_, now));
+}
+
+// Of a write that was never acknowledged, or of a value that another one has replaced.
+std::string Repair::removeFile(const Finding& finding) const {
+  std::filesystem::remove(std::filesystem::path(finding.directory) / finding.name);
+  return "file removed";
+}
+
+// What is left of it, and then its record.
+std::string Repair::quarantineValue(const Finding& finding) {
+  std::string now;
+  if (finding.hasFile) {
+    if (finding.file.rfind("..", 0) == 0) throw std::runtime_error("its file is outside of the store's directory");
+    now = quarantine_.take(finding.directory + "/" + finding.file);
+  } else {
+    now = quarantine_.keep(finding.directory + "/" + encodeFileName(finding.name),
+                           manifestOf(finding).getInlineData(finding.name));
+  }
+  return "moved to " + printable(relativeTo(root_, now)) + ", " + removeRecord(finding);
 }
 
 // It is no longer known which values its files contain: they are kept together with it.

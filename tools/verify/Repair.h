@@ -28,8 +28,11 @@ class Repair {
  private:
   SQLiteManifestPersistence& manifestOf(const Finding& finding);
   std::string removeRecord(const Finding& finding);
+  std::string nameFile(const Finding& finding);
   std::string correctSize(const Finding& finding);
+  std::string removeFile(const Finding& finding) const;
   std::string quarantineFile(const Finding& finding);
+  std::string quarantineValue(const Finding& finding);
   std::string quarantineStore(const Finding& finding);
 
   const std::string root_;

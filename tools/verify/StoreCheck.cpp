@@ -1,13 +1,20 @@
 #include "verify/StoreCheck.h"
 
+#include <algorithm>
+#include <cstddef>
 #include <filesystem>
 #include <memory>
 #include <optional>
+#include <unordered_map>
 #include <unordered_set>
+#include <utility>
+#include <vector>
 
 #include "JsonValue.h"
+#include "LarderException.h"
 #include "ManifestSnapshot.h"
 #include "storage/Layout.h"
+#include "storage/SafeFiles.h"
 #include "storage/StoreFiles.h"
 #include "storage/UntouchedFiles.h"
 
@@ -27,74 +34,189 @@ std::optional<std::uint64_t> sizeOfValue(const std::string& directory, const std
   return error ? std::nullopt : std::make_optional<std::uint64_t>(size);
 }
 
+// A damaged manifest cannot always tell that it is a safe store's, but what lies beside it can.
+bool looksSafe(const std::string& directory) {
+  const auto entries = listUntouched(directory);
+  return std::any_of(entries.begin(), entries.end(), [](const Entry& entry) {
+    return entry.type == Entry::Type::Directory ? entry.name == kStoreQuarantine
+                                                : parseSafeFileName(entry.name).has_value();
+  });
+}
+
+// Reads nothing of a damaged manifest.
+bool hasChecksums(const ManifestSnapshot& snapshot) {
+  try {
+    return snapshot.hasChecksums();
+  } catch (const ManifestPersistenceException&) {
+    return false;
+  }
+}
+
 class StoreCheck {
  public:
   StoreCheck(const std::string& directory, OnFile onFile) : directory_(directory), onFile_(std::move(onFile)) {}
 
   Findings check(const ManifestSnapshot& snapshot) {
+    isSafe_ = hasChecksums(snapshot);
     const auto damages = snapshot.integrityErrors();
     if (!damages.empty()) {
+      isSafe_ = isSafe_ || looksSafe(directory_);
       Finding finding = make(Finding::Kind::DamagedManifest, ManifestSnapshot::manifestName);
       finding.detail = damages.front();
-      findings_.push_back(finding);
-      return std::move(findings_);
+      return {finding};
+    }
+    if (isSafe_) {
+      snapshot.forEachInlineValue([this](const std::string& key, const std::vector<unsigned char>& value) {
+        inlineChecksums_[key] = checksumOf(key, value);
+      });
     }
     for (const auto& record : snapshot.records(nullptr)) {
+      const auto before = findings_.size();
       record.item.hasInlineData ? checkInline(record) : checkFile(record.item);
+      if (isSafe_ && findings_.size() == before) soundKeys_.insert(record.item.key);
     }
     findStrays();
     return std::move(findings_);
   }
 
  private:
-  Finding make(Finding::Kind kind, const std::string& name) const { return {kind, directory_, name}; }
+  using Kind = Finding::Kind;
 
-  void add(Finding::Kind kind, const DiskCacheItem& item, std::optional<std::uint64_t> actual) {
+  Finding make(Kind kind, const std::string& name) const {
+    Finding finding{kind, directory_, name};
+    finding.isSafe = isSafe_;
+    return finding;
+  }
+
+  void add(Kind kind, const std::string& name, std::uint64_t actual) {
+    Finding finding = make(kind, name);
+    finding.actual = actual;
+    findings_.push_back(finding);
+  }
+
+  Finding& add(Kind kind, const DiskCacheItem& item, std::optional<std::uint64_t> actual) {
     Finding finding = make(kind, item.key);
     finding.recorded = item.size;
     finding.actual = actual.value_or(0);
     finding.hasFile = actual.has_value();
-    findings_.push_back(finding);
+    return findings_.emplace_back(std::move(finding));
   }
 
   // An empty value is one that is there: what has no bytes but should have some has lost them.
   void checkInline(const ManifestSnapshot::Record& record) {
+    const DiskCacheItem& item = record.item;
     const std::uint64_t actual = record.inlineSize.value_or(0);
-    if (actual == record.item.size) return;
-    if (actual == 0) {
-      add(Finding::Kind::InlineValueMissing, record.item, std::nullopt);
-    } else {
-      add(Finding::Kind::SizeDiffers, record.item, actual);
+    if (actual == 0 && item.size > 0) {
+      add(Kind::InlineValueMissing, item, std::nullopt);
+    } else if (item.checksum && *item.checksum != inlineChecksum(item.key)) {
+      add(Kind::DamagedValue, item, std::nullopt).actual = actual;
+    } else if (actual != item.size) {
+      add(Kind::SizeDiffers, item, actual);
     }
   }
 
+  std::uint32_t inlineChecksum(const std::string& key) const {
+    const auto found = inlineChecksums_.find(key);
+    return found == inlineChecksums_.end() ? checksumOf(key, {}) : found->second;
+  }
+
   void checkFile(const DiskCacheItem& item) {
-    using Kind = Finding::Kind;
     const std::string below = (fs::path(".") / fs::path(item.filename).relative_path()).lexically_normal().string();
     const auto actual = sizeOfValue(directory_, below);
     if (actual) valueFiles_.insert(below);
-    const bool isProvisional = item.size == 0;
-    if (!actual) return add(isProvisional ? Kind::InterruptedWrite : Kind::RecordWithoutFile, item, actual);
+    const bool isProvisional = item.size == 0 && !item.checksum;
+    if (!actual) {
+      if (!isProvisional && isSafe_) withoutFile_[item.key] = findings_.size();
+      add(isProvisional ? Kind::InterruptedWrite : Kind::RecordWithoutFile, item, actual);
+      return;
+    }
+    if (item.checksum && !checkContent(item, below, *actual)) return;
     // Sizes are recorded in 32 bits, and wrap.
     if (static_cast<std::uint32_t>(*actual) == item.size) return;
     add(isProvisional ? Kind::InterruptedWrite : Kind::SizeDiffers, item, actual);
   }
 
+  // Whether it has the checksum of its record.
+  bool checkContent(const DiskCacheItem& item, const std::string& below, std::uint64_t actual) {
+    try {
+      if (checksumOfFile(item.key, directory_ + "/" + below) == *item.checksum) return true;
+      add(Kind::DamagedValue, item, actual).file = below;
+    } catch (const FileUtilsIoException& error) {
+      add(Kind::UnreadableValue, item, actual).detail = error.description();
+    }
+    return false;
+  }
+
   void findStrays() {
-    walkTree(directory_, [this](const std::string& below, const Entry& entry) {
+    Finding quarantine = make(Kind::Quarantine, kStoreQuarantine);
+    walkTree(directory_, [&](const std::string& below, const Entry& entry) {
       if (entry.type == Entry::Type::Directory) return;
       onFile_(entry.size);
       if (isManifestFile(below) || isAttributesFile(entry) || valueFiles_.count(below) > 0) return;
-      Finding finding = make(Finding::Kind::FileWithoutRecord, below);
-      finding.actual = entry.size;
-      findings_.push_back(finding);
+      if (isInStoreQuarantine(below)) {
+        ++quarantine.files;
+        quarantine.actual += entry.size;
+      } else if (!isSafe_ || !takeForSafe(below, entry)) {
+        add(Kind::FileWithoutRecord, below, entry.size);
+      }
     });
+    if (quarantine.files > 0) findings_.push_back(std::move(quarantine));
+  }
+
+  // Whether a safe store has left it: unfinished, or as the file of a key whose value is another one or will be this.
+  bool takeForSafe(const std::string& below, const Entry& entry) {
+    if (below == newManifestName()) {
+      add(Kind::UnfinishedManifest, below, entry.size);
+      return true;
+    }
+    const auto name = entry.type == Entry::Type::File ? parseSafeFileName(below) : std::nullopt;
+    if (!name) return false;
+    if (name->isUnfinished) {
+      add(Kind::UnfinishedFile, below, entry.size);
+      return true;
+    }
+    if (!name->key) return false;
+    if (soundKeys_.count(*name->key) > 0) {
+      add(Kind::SupersededFile, below, entry.size);
+      return true;
+    }
+    const auto record = withoutFile_.find(*name->key);
+    return record != withoutFile_.end() && offerFor(findings_[record->second], *name, entry);
+  }
+
+  // Of several files the one that was written last; the others are files without a record.
+  bool offerFor(Finding& finding, const SafeFileName& name, const Entry& entry) {
+    if (!isIntact(name, entry)) return false;
+    if (!finding.file.empty()) {
+      if (parseSafeFileName(finding.file)->number > name.number) return false;
+      const std::string earlier = finding.file;
+      const std::uint64_t size = finding.actual;
+      finding.file = entry.name;
+      finding.actual = entry.size;
+      add(Kind::FileWithoutRecord, earlier, size);
+      return true;
+    }
+    finding.file = entry.name;
+    finding.actual = entry.size;
+    return true;
+  }
+
+  bool isIntact(const SafeFileName& name, const Entry& entry) const {
+    try {
+      return checksumOfFile(*name.key, directory_ + "/" + entry.name) == name.checksum;
+    } catch (const FileUtilsIoException&) {
+      return false;
+    }
   }
 
   const std::string directory_;
   const OnFile onFile_;
   Findings findings_;
-  std::unordered_set<std::string> valueFiles_;  // below the directory
+  bool isSafe_ = false;                                             // or was: the manifest has checksums
+  std::unordered_set<std::string> valueFiles_;                      // below the directory
+  std::unordered_map<std::string, std::uint32_t> inlineChecksums_;  // of a safe store, by key
+  std::unordered_set<std::string> soundKeys_;                       // of a safe store
+  std::unordered_map<std::string, std::size_t> withoutFile_;        // findings of a safe store, by key
 };
 
 bool isJson(const std::string& path) {
@@ -105,6 +227,10 @@ bool isJson(const std::string& path) {
 }  // namespace
 
 Findings checkStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile) {
+  // Until it is in its place, the present one says little of the files.
+  if (fs::is_regular_file(fs::path(place.path) / salvagedManifestName())) {
+    return {{Finding::Kind::InterruptedSalvage, place.path, salvagedManifestName()}};
+  }
   if (!place.hasManifest) return {};
   const ManifestSnapshot snapshot(place.path, temporaryDirectory, std::make_shared<UntouchedFiles>());
   return StoreCheck(place.path, onFile).check(snapshot);

@@ -59,12 +59,14 @@ void addVerifyCommand(CLI::App& app, int& status) {
       ->required();
   verify->add_flag("--repair", options->repair, "Repair what is found, without losing a value");
   verify->footer(
-      "Each finding is one line: records without a file, files without a record, sizes that differ, traces of "
-      "interrupted\n"
-      "writes, damaged manifests, attributes that are not JSON. Without --repair nothing is changed.\n\n"
+      "Each finding is one line: records without a file, files without a record, sizes that differ, values that do\n"
+      "not have their checksum, traces of interrupted writes, damaged manifests, attributes that are not JSON.\n"
+      "Without --repair nothing is changed.\n\n"
       "--repair gives a record the size of its file, and removes a record without a value. A file without a record\n"
-      "is moved to \"_cellar_quarantine\" beside the managers' directories, and so is a damaged manifest with all\n"
-      "files of its store, which then starts empty. Only records are deleted.\n"
+      "is moved to \"_cellar_quarantine\" beside the managers' directories, and so is a damaged value, and a damaged\n"
+      "manifest with all files of its store, which then starts empty. Of a safe store, files of earlier values and\n"
+      "unfinished ones are deleted; a damaged manifest is left to the store, which salvages it, and its directory\n"
+      "\"quarantine\" to you. Of other stores only records are deleted.\n"
       "Stop the application first: a running store must not be repaired, and a write in progress looks like a\n"
       "finding.\n\n"
       "Exit status: 0 when nothing was found or everything is repaired, 1 when something remains, 2 for usage and\n"
