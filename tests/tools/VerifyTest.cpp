@@ -1,9 +1,12 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <cstdint>
 #include <filesystem>
 #include <string>
 #include <vector>
+
+#include <cellar/SQLiteManifestPersistence.h>
 
 #include "storage/Layout.h"
 #include "tools/StoredData.h"
@@ -43,6 +46,17 @@ class Verifying : public testing::Test {
     data_.putRecord(kThumbs, {key, key, size, false, StoredData::kNow, StoredData::kNow, nullptr});
   }
 
+  // As a safe store writes it, but for the checksum, which is another one.
+  void recordWithChecksum(const std::string& key, const std::string& value) {
+    const std::string name = key + ".1.00000000";
+    DiskCacheItem item(key, name, static_cast<std::uint32_t>(value.size()), false, 1, 1, nullptr);
+    item.checksum = 0;
+    const std::string path = data_.path(kInline + "/manifest_v1.sqlite");
+    data_.makeStore(kInline);
+    SQLiteManifestPersistence(path, nullptr, nullptr, Durability::Safe).storeItem(item, nullptr);
+    data_.putFile(kInline + "/" + name, value);
+  }
+
   std::string contentOf(const std::string& below) const { return data_.directory().read("root/" + below); }
   bool exists(const std::string& below) const { return data_.directory().exists("root/" + below); }
 
@@ -68,10 +82,12 @@ TEST_F(Verifying, ChangesNothingWithoutRepair) {
   record("lost", 4);
   data_.killWhileWriting(kThumbs, "half");
   data_.putFile(kManager + "/web_v1/_cellar_extended_attributes", "{");
+  recordWithChecksum("damaged", "value");
   data_.makeReadingVisible();
   const auto before = data_.trace();
-  EXPECT_EQ(findings().size(), 4U);
+  EXPECT_EQ(findings().size(), 5U);
   EXPECT_EQ(data_.trace(), before);
+  EXPECT_THAT(findings(kInline), ElementsAre("damaged value: 'damaged' (5 bytes) does not have its checksum"));
 }
 
 TEST_F(Verifying, RemovesARecordWithoutAFile) {
