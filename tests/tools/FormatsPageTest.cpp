@@ -13,9 +13,11 @@
 #include <cellar/AttributeStore.h>
 #include <cellar/Configuration.h>
 #include <cellar/DiskSizeCalculator.h>
+#include <cellar/Durability.h>
 #include <cellar/ExtendedMetadata.h>
 #include <cellar/FileUtils.h>
 #include <cellar/ManifestSnapshot.h>
+#include <cellar/SQLiteManifestPersistence.h>
 #include <cellar/StoreDirectoryNameBuilder.h>
 #include <cellar/StoreManagerImplCommon.h>
 #include <cellar/TrashCollector.h>
@@ -23,12 +25,12 @@
 #include "host/testing/ManualQueue.h"
 #include "storage/Layout.h"
 #include "storage/StoreFiles.h"
-#include "tools/StoredData.h"
+#include "support/KeyValueStoreFixture.h"
+#include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
-using test::StoredData;
 using testing::HasSubstr;
 using testing::MatchesRegex;
 
@@ -45,11 +47,13 @@ std::string storeName(bool localeSensitive, bool hasVersion, const std::string& 
   return StoreDirectoryNameBuilder("250", "US", "en").buildStoreName(store);
 }
 
-TEST(FormatsPage, NamesTheColumnsOfTheManifestInTheirOrder) {
-  StoredData data;
-  data.makeStore("store");
+// The columns of the manifest that a store of this durability makes, as the page has them.
+std::vector<std::string> columnsOf(Durability durability) {
+  const test::TemporaryDirectory directory;
+  const std::string path = directory.file(ManifestSnapshot::manifestName);
+  { const SQLiteManifestPersistence manifest(path, nullptr, nullptr, durability); }
   sqlite3* database = nullptr;
-  ASSERT_EQ(sqlite3_open(data.path("store/" + ManifestSnapshot::manifestName).c_str(), &database), SQLITE_OK);
+  EXPECT_EQ(sqlite3_open(path.c_str(), &database), SQLITE_OK);
   std::vector<std::string> rows;
   const auto collect = [](void* target, int, char** values, char**) {
     static_cast<std::vector<std::string>*>(target)->push_back(rowOf(values[1], values[2]));
@@ -57,7 +61,13 @@ TEST(FormatsPage, NamesTheColumnsOfTheManifestInTheirOrder) {
   };
   EXPECT_EQ(sqlite3_exec(database, "PRAGMA table_info(LarderManifest)", collect, &rows, nullptr), SQLITE_OK);
   sqlite3_close(database);
-  ASSERT_EQ(rows.size(), 8U);
+  return rows;
+}
+
+TEST(FormatsPage, NamesTheColumnsOfTheManifestInTheirOrder) {
+  const auto rows = columnsOf(Durability::Safe);
+  ASSERT_EQ(rows.size(), 9U);
+  EXPECT_EQ(columnsOf(Durability::Relaxed), std::vector<std::string>(rows.begin(), rows.end() - 1));
   const std::string text = page();
   std::size_t place = 0;
   for (const std::string& row : rows) {
@@ -65,6 +75,52 @@ TEST(FormatsPage, NamesTheColumnsOfTheManifestInTheirOrder) {
     ASSERT_NE(found, std::string::npos) << row;
     place = found;
   }
+}
+
+class FormatsPageOfASafeStore : public test::KeyValueStoreFixture {
+ protected:
+  FormatsPageOfASafeStore() {
+    options.durability = Durability::Safe;
+    open();
+  }
+
+  // The only file after a value was written.
+  std::string fileOf(const std::string& key, const std::string& value) {
+    put(key, value);
+    return valueFiles().size() == 1 ? valueFiles().front() : "there are " + std::to_string(valueFiles().size());
+  }
+};
+
+TEST_F(FormatsPageOfASafeStore, NamesItsFiles) {
+  const std::string text = page();
+  for (int i = 1; i < 17; ++i) put("letter one", "a draft");
+  const std::string name = fileOf("letter one", "Dear Ada");
+  EXPECT_THAT(text, HasSubstr("── " + name + " "));
+  EXPECT_THAT(text, HasSubstr("| `" + name + "` |"));
+  drop("letter one");
+  const std::string cut = fileOf(std::string(201, 'x'), "Dear Ada");
+  EXPECT_EQ(cut.rfind(std::string(60, 'x') + "~", 0), 0U) << cut;
+  EXPECT_THAT(text, HasSubstr("| `xxxxxxxx" + cut.substr(60) + "` |"));
+  drop(std::string(201, 'x'));
+  EXPECT_EQ(fileOf(std::string(200, 'x'), "Dear Ada").rfind(std::string(200, 'x') + ".19.", 0), 0U);
+}
+
+TEST_F(FormatsPageOfASafeStore, NamesTheFileOfAWriterThatHasNotFinished) {
+  for (int i = 1; i < 19; ++i) put("letter one", "a draft");
+  std::string seen;
+  const PersistentKeyValueStore::Writer writer = [&](const std::string& path) {
+    seen = path.substr(path.rfind('/') + 1);
+    return writing("", 0)(path);
+  };
+  test::watch(store->store("letter one", nullptr, writer));
+  settle();
+  EXPECT_THAT(page(), HasSubstr("| `" + seen + "` |"));
+}
+
+TEST(FormatsPage, NamesWhatASafeStoreHasBeside) {
+  EXPECT_THAT(page(), HasSubstr("| `" + newManifestName() + "` |"));
+  EXPECT_THAT(page(), HasSubstr("| `" + salvagedManifestName() + "` |"));
+  EXPECT_THAT(page(), HasSubstr(std::string("── ") + kStoreQuarantine + "/"));
 }
 
 TEST(FormatsPage, NamesDirectoriesAsTheyAreBuilt) {
