@@ -96,7 +96,8 @@ void addInspectCommand(CLI::App& app, int& status) {
       "what\n"
       "the file system has allocated. The configuration contains neither version tag nor locale: of several\n"
       "directories of one store, the last used one counts as the present one. It does not contain video priorities\n"
-      "either: items are listed by their last use.\n\n"
+      "either: items are listed by their last use. \"Durability\" is the configured one; without a configuration\n"
+      "it is \"checksums\" when the manifest has some, as that of a safe or synced store has.\n\n"
       "Examples:\n  cellar inspect /tmp/cellar-demo --config media-app.json --top 3\n"
       "  cellar inspect /tmp/cellar-demo --html storage.html");
   inspect->callback([options, &status] { status = runInspect(*options); });
