@@ -64,7 +64,7 @@ void showDraft(cellar::host::Host& host, const std::string& name, const std::fun
       const Found found = result.get();
       show(found == nullptr ? "no draft" : std::string(found->value.begin(), found->value.end()));
     } catch (const std::exception& error) {
-      show(error.what());  // a disk that cannot be read, say
+      show(error.what());  // a disk that cannot be read, or a draft that is damaged
     }
   });
 }
