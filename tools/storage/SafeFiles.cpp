@@ -20,9 +20,10 @@ constexpr std::size_t kMostNumberDigits = 19;
 
 // Takes the suffix away; false when there is none.
 bool removeSuffix(std::string& name, const std::string& suffix) {
-  if (name.size() < suffix.size() || name.compare(name.size() - suffix.size(), suffix.size(), suffix) != 0)
-    return false;
-  name.resize(name.size() - suffix.size());
+  if (name.size() < suffix.size()) return false;
+  const std::size_t rest = name.size() - suffix.size();
+  if (name.compare(rest, suffix.size(), suffix) != 0) return false;
+  name.resize(rest);
   return true;
 }
 
