@@ -36,7 +36,7 @@ std::string Repair::fix(const Finding& finding) {
     case Finding::Kind::UnfinishedManifest:
       return removeFile(finding);
     case Finding::Kind::DamagedManifest:
-      if (finding.isSafe) throw std::runtime_error("the store salvages it at its next start");
+      if (finding.isSafe) throw std::runtime_error("the store salvages it at its next start, if it is safe or synced");
       return quarantineStore(finding);
     case Finding::Kind::InterruptedSalvage:
       throw std::runtime_error("the store puts it in its place at its next start");
