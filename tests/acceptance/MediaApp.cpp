@@ -56,6 +56,15 @@ const std::map<std::string, StoreOfTheApp> kStores = {
 };
 
 bool isInline(const std::string& store) { return store == "settings"; }
+bool isSafe(const std::string& store) { return store == "drafts"; }
+
+// Whose value a file has, by its name: in a safe store a number and a checksum follow the key.
+std::string keyIn(const std::string& store, const std::string& filename) {
+  if (!isSafe(store)) return filename;
+  std::smatch parts;
+  const bool isNamed = std::regex_match(filename, parts, std::regex("(.*)\\.[0-9]+\\.[0-9a-f]{8}"));
+  return isNamed ? parts[1].str() : filename + " has no number and checksum";
+}
 
 std::vector<std::string> storesThat(bool haveKeys) {
   std::vector<std::string> names;
@@ -310,7 +319,11 @@ void MediaApp::expectKeysAndFiles(const std::string& store) const {
   for (const auto& [key, item] : model.items) {
     if (!isInline(store)) files[key] = item.value;
   }
-  EXPECT_EQ(test::valueFiles(pathOf(store)), files) << store;
+  std::map<std::string, Bytes> found;
+  for (const auto& [name, bytes] : test::valueFiles(pathOf(store))) {
+    EXPECT_TRUE(found.emplace(keyIn(store, name), bytes).second) << store << " has two files for the key of " << name;
+  }
+  EXPECT_EQ(found, files) << store;
 }
 
 void MediaApp::expectAllFetched() {
@@ -327,7 +340,7 @@ void MediaApp::expectRowsAsModelled() const {
     for (const auto& [key, row] : rows) {
       ASSERT_EQ(items.count(key), 1U) << store << " " << key;
       const ModelOfValues::Item& item = items.at(key);
-      EXPECT_EQ(row.filename, key);
+      EXPECT_EQ(keyIn(store, row.filename), key);
       EXPECT_EQ(row.size, item.value.size()) << key;
       EXPECT_EQ(row.isInline, isInline(store)) << key;
       EXPECT_EQ(row.inlineData, isInline(store) ? item.value : Bytes()) << key;
