@@ -168,9 +168,9 @@ bool ManifestSnapshot::hasChecksums() const {
 }
 
 void ManifestSnapshot::forEachInlineValue(const std::function<void(const std::string&, const Bytes&)>& onValue) const {
+  const SQLiteManifestPersistence manifest(path_, nullptr, nullptr);  // refuses a foreign table
   translatingExceptions([&] {
     SQLiteStore store(path_);
-    if (store.info("LarderManifest").empty()) return;
     SQLiteStoreCursor cursor =
         store.cursor("SELECT key, inline_data FROM LarderManifest WHERE inline_data IS NOT NULL;");
     while (cursor.next()) onValue(cursor.get<std::string>(0), cursor.get<Bytes>(1));

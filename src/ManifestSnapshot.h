@@ -50,7 +50,7 @@ class CELLAR_EXPORT ManifestSnapshot {
   bool hasChecksums() const;
 
   // Calls `onValue` with each value that is in the manifest, in no order, on this thread. What it throws passes
-  // through. Throws as `records`. Not an error: a table that does not exist.
+  // through. Throws as `records`. Not an error: an empty file.
   void forEachInlineValue(
       const std::function<void(const std::string& key, const std::vector<unsigned char>& value)>& onValue) const;
 

@@ -140,6 +140,11 @@ TEST_F(ManifestSnapshotTest, OfAnEmptyFileHasNoChecksumsAndNoInlineValues) {
   snapshot->forEachInlineValue([](const auto& key, const auto&) { ADD_FAILURE() << key; });
 }
 
+TEST_F(ManifestSnapshotTest, ReadsNoInlineValueOfATableThatCallsFunctions) {
+  run("CREATE TABLE LarderManifest (key TEXT, inline_data BLOB AS (zeroblob(length(key))))");
+  EXPECT_THROW(take()->forEachInlineValue([](const auto&, const auto&) { ADD_FAILURE(); }), ManifestCorruptedException);
+}
+
 TEST_F(ManifestSnapshotTest, HasWhatARunningStoreHasCommittedAndNotYetCheckpointed) {
   const auto manifest = openManifest();
   manifest->setItem({"key", "key", 7, false, 10, 20, nullptr});
