@@ -11,9 +11,9 @@
 #include "Clock.h"
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
+#include "base/StoreTime.h"
 #include "manifest/ManifestRecords.h"
 #include "manifest/ManifestUndo.h"
-#include "manifest/StoreTime.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -16,7 +16,7 @@
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
 #include "SQLiteStore.h"
-#include "manifest/SchemaFunctions.h"
+#include "base/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -34,6 +34,11 @@ class LarderException;
 // is destroyed leaves undone what it has not started: the key keeps what it had. (A manager that is released lets its
 // stores finish first.)
 //
+// All of this holds for a relaxed store, the default. A safe or a synced one (`KeyValueStoreOptions::durability`) keeps
+// each value in a file of its own, "<key, encoded>.<number>.<checksum>", and replaces it as a whole; takes any key;
+// fails only the operation at hand, also where a relaxed one is purged; and delivers no bytes but those that were
+// stored: `DamagedValueException`, or a miss in a cache. See docs/reliability.md.
+//
 // Errors travel in the futures: `InvalidatedException` after invalidation, `FileUtilsIoException` for files, what a
 // writer, reader or loader throws, `std::invalid_argument` for a reserved key of a store with files (one that ends in
 // the manifest's or the attributes' file name). A manifest that is damaged, or cannot be written, fails nothing: the

@@ -13,8 +13,8 @@
 
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
-#include "manifest/Schema.h"
-#include "manifest/SchemaFunctions.h"
+#include "base/Schema.h"
+#include "base/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 

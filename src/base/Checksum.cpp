@@ -4,9 +4,9 @@
 
 namespace velmora::mobile::xplat::cellar {
 
+// Without bytes it would start again.
 void Checksum::add(const unsigned char* bytes, std::size_t count) {
-  if (count > 0)
-    value_ = static_cast<std::uint32_t>(crc32_z(value_, bytes, count));  // without bytes it would start again
+  if (count > 0) value_ = static_cast<std::uint32_t>(crc32_z(value_, bytes, count));
 }
 
 std::uint32_t Checksum::of(const std::string& key, const std::vector<unsigned char>& value) {

@@ -215,8 +215,8 @@ void ReplacingWrites::noteReplaced(const StoreLock& lock, Write& write) {
   clearing_.noteStored(lock, write.key);
   if (write.replaced != nullptr) {
     const bool isItsOwn = write.replaced->filename == write.filename;  // of a record whose file had been removed
-    if (auto path = isItsOwn ? std::nullopt : files_.fileOf(*write.replaced))
-      write.filesToDelete.push_back(std::move(*path));
+    auto path = isItsOwn ? std::nullopt : files_.fileOf(*write.replaced);
+    if (path) write.filesToDelete.push_back(std::move(*path));
   }
   // The log of the manifest has gone on since: what had failed before is not in it.
   for (std::string& path : doubtfulFiles_) write.filesToDelete.push_back(std::move(path));

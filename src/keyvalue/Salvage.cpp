@@ -12,12 +12,12 @@
 #include "Incident.h"
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
+#include "base/DamagedManifest.h"
+#include "base/NewManifest.h"
+#include "base/StoreTime.h"
 #include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/VersionedFiles.h"
-#include "manifest/DamagedManifest.h"
-#include "manifest/NewManifest.h"
-#include "manifest/StoreTime.h"
 
 namespace velmora::mobile::xplat::cellar {
 

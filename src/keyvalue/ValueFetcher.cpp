@@ -202,10 +202,11 @@ bool ValueFetcher::checkFile(const DiskCacheItem& item, const std::string& path)
 
 // A cache does without the item: false, for a miss.
 bool ValueFetcher::handleDamage(const DiskCacheItem& item) {
-  const DamagedValueException error(context_.options.name, item.key);
-  errorLine(__LINE__).stream() << error.description();
-  context_.report({Incident::Kind::DamagedValue, context_.options.name, item.key, error.description()});
-  if (!context_.isCache()) throw error;
+  const std::string& name = context_.options.name;
+  const std::string text = DamagedValueException(name, item.key).description();
+  errorLine(__LINE__).stream() << text;
+  context_.report({Incident::Kind::DamagedValue, name, item.key, text});
+  if (!context_.isCache()) throw DamagedValueException(name, item.key);
   drop(item);
   return false;
 }

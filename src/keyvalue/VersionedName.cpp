@@ -42,8 +42,8 @@ std::optional<std::uint64_t> numberIn(const std::string& digits, std::size_t mos
     const bool isLetter = base == 16 && character >= 'a' && character <= 'f';
     return isLetter || (character >= '0' && character <= '9');
   };
-  if (digits.empty() || digits.size() > most || !std::all_of(digits.begin(), digits.end(), isDigit))
-    return std::nullopt;
+  if (digits.empty() || digits.size() > most) return std::nullopt;
+  if (!std::all_of(digits.begin(), digits.end(), isDigit)) return std::nullopt;
   return std::stoull(digits, nullptr, base);
 }
 

@@ -1,4 +1,4 @@
-#include "manifest/SchemaFunctions.h"
+#include "base/SchemaFunctions.h"
 
 #include <sqlite3.h>
 

@@ -1,4 +1,4 @@
-#include "manifest/DamagedManifest.h"
+#include "base/DamagedManifest.h"
 
 #include <algorithm>
 #include <cstdint>
@@ -12,8 +12,8 @@
 
 #include "LarderException.h"
 #include "SQLiteStore.h"
-#include "manifest/Schema.h"
-#include "manifest/SchemaFunctions.h"
+#include "base/Schema.h"
+#include "base/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -1,4 +1,4 @@
-#include "manifest/StoreTime.h"
+#include "base/StoreTime.h"
 
 #include <algorithm>
 #include <limits>

@@ -3,7 +3,7 @@
 #include <functional>
 #include <string>
 
-#include "manifest/ManifestRow.h"
+#include "base/ManifestRow.h"
 
 namespace velmora::mobile::xplat::cellar {
 

@@ -4,7 +4,7 @@
 #include <string>
 
 #include "SQLiteStore.h"
-#include "manifest/ManifestRow.h"
+#include "base/ManifestRow.h"
 
 namespace velmora::mobile::xplat::cellar {
 

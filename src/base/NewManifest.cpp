@@ -1,6 +1,6 @@
-#include "manifest/NewManifest.h"
+#include "base/NewManifest.h"
 
-#include "manifest/Schema.h"
+#include "base/Schema.h"
 
 namespace velmora::mobile::xplat::cellar {
 
