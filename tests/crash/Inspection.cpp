@@ -4,6 +4,7 @@
 #include <sqlite3.h>
 
 #include <algorithm>
+#include <chrono>
 #include <exception>
 #include <filesystem>
 #include <map>
@@ -11,6 +12,7 @@
 #include <optional>
 #include <set>
 #include <system_error>
+#include <thread>
 #include <utility>
 
 #include "DiskCacheManifest.h"
@@ -91,7 +93,7 @@ class Inspector {
         ledger_(ledger),
         findings_(findings),
         orphansBefore_(std::exchange(findings.orphans, {})),
-        host_(kConfiguration, root) {}
+        host_(configuration(), root) {}
 
   void run() {
     for (const auto& [path, facts] : facts_) {
@@ -101,12 +103,16 @@ class Inspector {
       stores_.push_back(host_.store<PersistentKeyValueStore>(kStores.at(number).identifier, kSession));
       checkSize(number);
     }
-    for (std::size_t number = 0; number < kStores.size(); ++number) checkFiles(number);
+    if (!areStoresSafe()) {
+      for (std::size_t number = 0; number < kStores.size(); ++number) checkFiles(number);
+    }
     for (const Ledger::Key& key : ledger_.keys()) checkKey(key);
     for (std::size_t number = 0; number < kStores.size(); ++number) {
       checkNames(number);
       checkNewWork(number);
+      if (areStoresSafe()) checkNoFileIsLeftBehind(number);
     }
+    if (log_.contains("salvaged") || log_.contains("is damaged")) blame("a store was salvaged, or had a damaged value");
     if (log_.contains("purged")) blame("a store was purged");
   }
 
@@ -147,11 +153,11 @@ class Inspector {
     ledger_.settle(key, version);
   }
 
-  // A process that has ended by itself has left nothing half done.
+  // A process that has ended by itself has left nothing half done, and a safe store never has anything.
   Outcome judge(const Ledger::Key& key, const std::optional<Ledger::Bytes>& found, bool isError, bool& isMiddle) const {
     const Outcome outcome = ledger_.judge(key, found, isError, isMiddle);
     const bool isHalf = outcome == Outcome::Partial || outcome == Outcome::Older || outcome == Outcome::Error;
-    return isHalf && ending_ != Ending::Killed ? Outcome::Forbidden : outcome;
+    return isHalf && (ending_ != Ending::Killed || areStoresSafe()) ? Outcome::Forbidden : outcome;
   }
 
   void count(Outcome outcome, bool isMiddle) {
@@ -193,6 +199,30 @@ class Inspector {
       findings_.orphans.insert(path);
       if (cleared.count(name) > 0 && orphansBefore_.count(path) == 0) blame(path + " has been cleared and is there");
     }
+  }
+
+  // A safe store removes what it had found at its start, and what it evicts meanwhile, before long.
+  void checkNoFileIsLeftBehind(std::size_t number) {
+    constexpr int kPatience = 1000;  // times 10 ms
+    std::string left = fileLeftBehind(number);
+    for (int i = 0; i < kPatience && !left.empty(); ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+      left = fileLeftBehind(number);
+    }
+    if (!left.empty()) blame(left + " is left behind");
+  }
+
+  // Empty when there is none.
+  std::string fileLeftBehind(std::size_t number) {
+    std::set<std::string> named;
+    for (const std::string& key : recordedKeys(number)) {
+      if (const auto item = stores_[number]->getManifest()->getItem(key)) named.insert(item->filename);
+    }
+    for (const auto& entry : fs::directory_iterator(stores_[number]->path)) {
+      const std::string name = entry.path().filename().string();
+      if (name.rfind("key", 0) == 0 && named.count(name) == 0) return entry.path().string();
+    }
+    return "";
   }
 
   // No key that nobody has stored.
@@ -239,7 +269,7 @@ void inspect(const std::string& root, Ending ending, Ledger& ledger, Findings& f
 
 void intrude(const std::string& root, pid_t owner, Findings& findings) {
   try {
-    const host::Host second(kConfiguration, root);
+    const host::Host second(configuration(), root);
     findings.faults.emplace_back("a second host was let in while another process had the root");
   } catch (const std::exception& error) {
     const std::string text = error.what();
@@ -255,7 +285,7 @@ void endSession(const std::string& root, Ledger& ledger, Findings& findings) {
     return std::any_of(sessions.begin(), sessions.end(), [](const auto& session) { return session.key == kSession; });
   };
   try {
-    host::Host host(kConfiguration, root);
+    host::Host host(configuration(), root);
     if (!isListed(host)) findings.faults.emplace_back("a session with data is not listed");
     if (!host.logOut(kSession)) findings.faults.emplace_back("a session with data is not found by its end");
     if (isListed(host)) findings.faults.emplace_back("a session that was ended is listed");

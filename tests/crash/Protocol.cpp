@@ -1,8 +1,13 @@
 #include "crash/Protocol.h"
 
 #include <algorithm>
+#include <cstdlib>
 
 namespace velmora::mobile::xplat::cellar::crash {
+
+namespace {
+
+const char* const kSafe = "CELLAR_CRASH_SAFE";
 
 // The caches hold far less than what is stored in them, and one store far fewer items than it has keys.
 const char* const kConfiguration = R"({
@@ -24,6 +29,28 @@ const char* const kConfiguration = R"({
     "stores": {"drafts": {"type": "pkvs", "stale_age": "10 years"}}
   }
 })";
+
+}  // namespace
+
+void chooseSafeStores() {
+  (void)::setenv(kSafe, "1", 1);  // NOLINT(concurrency-mt-unsafe): there is no other thread yet
+}
+
+bool areStoresSafe() {
+  static const bool areSafe = std::getenv(kSafe) != nullptr;  // NOLINT(concurrency-mt-unsafe)
+  return areSafe;
+}
+
+std::string configuration() {
+  std::string text = kConfiguration;
+  if (!areStoresSafe()) return text;
+  const std::string before = "\"stale_age\"";
+  const std::string durability = "\"durability\": \"safe\", ";
+  for (auto at = text.find(before); at != std::string::npos; at = text.find(before, at + durability.size() + 1)) {
+    text.insert(at, durability);
+  }
+  return text;
+}
 
 const char* nameOf(Ending ending) {
   static constexpr std::array<const char*, 6> names = {"killed",         "closed at rest",   "closed while busy",

@@ -26,7 +26,11 @@ constexpr std::size_t kRecent = 2;  // is cleared now and then
 constexpr std::size_t kDrafts = 5;  // of the session
 constexpr const char* kSession = "alice";
 
-extern const char* const kConfiguration;
+// Whether the stores are safe ones: chosen by the first process, found in the environment by the others.
+void chooseSafeStores();
+bool areStoresSafe();
+
+std::string configuration();
 
 // How the worker is to end.
 enum class Ending : std::uint8_t {

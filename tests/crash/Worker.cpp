@@ -124,7 +124,7 @@ bool hasOwnQueues(Ending ending) { return ending == Ending::ShutDown || ending =
 
 std::unique_ptr<host::Host> startHost(const Task& task, std::shared_ptr<TaskQueueFactory> queues) {
   host::HostOptions options;
-  options.configuration = kConfiguration;
+  options.configuration = configuration();
   options.root = task.root;
   options.taskQueueFactory = std::move(queues);
   if (task.ending == Ending::Impatient) options.shutDownPatience = std::chrono::seconds(0);

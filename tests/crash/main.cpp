@@ -1,5 +1,5 @@
 // Kills an application in the midst of its work, or has it close, again and again, and looks each time at what it
-// finds. usage: cellar_crash [--close] TIMES [SEED [DIRECTORY]]
+// finds. usage: cellar_crash [--safe] [--close] TIMES [SEED [DIRECTORY]]
 #include <glog/logging.h>
 #include <poll.h>
 #include <sys/wait.h>
@@ -276,9 +276,14 @@ int run(std::vector<std::string> arguments) {
     work({arguments[1], std::stoull(arguments[2]), static_cast<std::uint32_t>(std::stoul(arguments[3])),
           static_cast<Ending>(std::stoi(arguments[4])), std::stoi(arguments[5]), std::stoi(arguments[6])});
   }
+  if (!arguments.empty() && arguments[0] == "--safe") {
+    chooseSafeStores();
+    arguments.erase(arguments.begin());
+  }
   const bool closes = !arguments.empty() && arguments[0] == "--close";
   if (closes) arguments.erase(arguments.begin());
-  if (arguments.empty() || arguments.size() > 3) throw std::invalid_argument("[--close] TIMES [SEED [DIRECTORY]]");
+  if (arguments.empty() || arguments.size() > 3)
+    throw std::invalid_argument("[--safe] [--close] TIMES [SEED [DIRECTORY]]");
   const std::uint64_t seed = arguments.size() > 1 ? std::stoull(arguments[1]) : std::random_device()();
   return torment(closes, std::stoul(arguments[0]), seed, arguments.size() > 2 ? arguments[2] : defaultPlace());
 }
