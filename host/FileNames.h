@@ -1,6 +1,6 @@
 #pragma once
 
-#include <cellar/FileNames.h>
+#include <cellar/EncodedFileName.h>
 
 namespace velmora::mobile::xplat::cellar::host {
 

@@ -6,7 +6,7 @@
 #include <cstdio>
 #include <stdexcept>
 
-#include "FileNames.h"
+#include "EncodedFileName.h"
 
 namespace velmora::mobile::xplat::cellar {
 

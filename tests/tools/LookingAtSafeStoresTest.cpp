@@ -15,7 +15,7 @@
 #include <vector>
 
 #include "Console.h"
-#include "FileNames.h"
+#include "EncodedFileName.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"

@@ -6,7 +6,7 @@
 #include <exception>
 #include <utility>
 
-#include "FileNames.h"
+#include "EncodedFileName.h"
 #include "storage/UntouchedFiles.h"
 
 namespace velmora::mobile::xplat::cellar::tools {

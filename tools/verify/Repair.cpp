@@ -4,7 +4,7 @@
 #include <stdexcept>
 #include <utility>
 
-#include "FileNames.h"
+#include "EncodedFileName.h"
 #include "Format.h"
 #include "ManifestSnapshot.h"
 #include "SQLiteManifestPersistence.h"

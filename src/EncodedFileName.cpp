@@ -1,4 +1,4 @@
-#include "FileNames.h"
+#include "EncodedFileName.h"
 
 #include <cstddef>
 #include <stdexcept>
