@@ -34,7 +34,7 @@ void BatchRemoval::run(Provider provider, OnSuccess onSuccess, OnError onError) 
                       onSuccess = std::move(onSuccess), onError] {
     if (const auto self = weakThis.lock()) self->step(countedProvider, onSuccess, onError);
   };
-  workQueue_.dispatchBehindAll(begin, onError);
+  workQueue_.dispatchBehindAll(begin, std::move(onError));
 }
 
 void BatchRemoval::step(const Provider& provider, const OnSuccess& onSuccess, const OnError& onError) {
