@@ -61,6 +61,12 @@ using Handler = std::function<void(const Incident&)>;
 
 class HostIncidents : public testing::Test {
  protected:
+  // What waits on a queue may hold the queue.
+  void TearDown() override {
+    host.reset();
+    queues->runAll();
+  }
+
   // With a handler that keeps what it is given and then calls `onIncident`.
   HostOptions options(std::shared_ptr<TaskQueueFactory> factory = nullptr) {
     HostOptions options;
@@ -161,6 +167,8 @@ TEST_F(HostIncidents, HaveNoQueueWithoutAHandler) {
   host = std::make_unique<Host>(options(others));
   EXPECT_EQ(others->workQueueCount(), without + 1);
   EXPECT_THAT(told, IsEmpty());
+  host.reset();
+  others->runAll();
 }
 
 // The handler
