@@ -32,7 +32,7 @@ std::size_t damages() {
 
 class SafeStoreDamage : public KeyValueStoreFixture, public testing::WithParamInterface<bool> {
  protected:
-  using Random = std::mt19937_64;
+  using Random = std::mt19937;
   using Values = std::map<std::string, std::string>;
 
   SafeStoreDamage() {
