@@ -184,6 +184,8 @@ bool ValueFetcher::readInlineValue(const std::string& key, std::vector<unsigned 
     isThere = !value.empty();
     if (isThere && !checksum) return;
     const auto current = manifest->getItem(key);
+    const bool isRowMissing = value.empty() && current != nullptr && current->hasInlineData && current->size > 0;
+    if (isRowMissing && context_.isSafe()) throw ManifestCorruptedException("A row is not found by its key.", -1);
     isThere = current != nullptr && (isThere || checksum || current->size == 0);  // not one that has vanished
     checksum = isThere ? current->checksum : std::nullopt;
   });
