@@ -83,6 +83,7 @@ class Reading {
   }
 
  private:
+  static constexpr std::int64_t kFirstRow = std::numeric_limits<std::int64_t>::min();
   static constexpr std::int64_t kLastRow = std::numeric_limits<std::int64_t>::max();
 
   // From the row that is next up to the first that cannot be read.
@@ -92,8 +93,10 @@ class Reading {
     while (cursor.next()) {
       const auto number = static_cast<std::int64_t>(cursor.get<unsigned long long>(0));
       if (number == kLastRow) return;
-      if (number < next_) continue;  // out of order, and read before
-      next_ = number + 1;
+      if (number >= next_) {  // a damaged number may be followed by a smaller one
+        next_ = number + 1;
+        firstDistance_ = 1;
+      }
       consume(rowIn(cursor));
     }
   }
@@ -109,29 +112,35 @@ class Reading {
   // A damaged page takes a range of rows with it: finds its end, doubling the distance and then halving it. False when
   // there is none.
   bool skipDamage() {
-    if (std::exchange(failedAt_, next_) != next_ && canRead(next_)) return true;  // the damage was in the last row
-    std::int64_t damaged = next_;
-    std::int64_t distance = 1;
-    while (distance < kLastRow - damaged && !canRead(damaged + distance)) {
-      damaged += distance;
-      distance *= 2;
+    if (firstDistance_ == 1 && canRead(next_)) {  // the damage was in the last row
+      firstDistance_ = 2;
+      return true;
     }
-    if (distance >= kLastRow - damaged) return false;
+    std::int64_t damaged = next_;
+    std::int64_t distance = firstDistance_;
+    while (damaged < kLastRow - distance && !canRead(damaged + distance)) {
+      damaged += distance;
+      distance = doubled(distance);
+    }
+    if (damaged >= kLastRow - distance) return false;
     std::int64_t readable = damaged + distance;
-    while (readable - damaged > 1) {
+    while (readable - damaged > firstDistance_) {
       const std::int64_t middle = damaged + (readable - damaged) / 2;
       (canRead(middle) ? readable : damaged) = middle;
     }
     next_ = readable;
+    firstDistance_ = doubled(firstDistance_);
     return true;
   }
 
+  static std::int64_t doubled(std::int64_t distance) { return distance < kLastRow / 4 ? 2 * distance : distance; }
+
+  // The first of the rows from this one on, whole.
   bool canRead(std::int64_t row) {
     try {
-      SQLiteStoreCursor cursor =
-          store_.cursor("SELECT key FROM LarderManifest WHERE rowid >= ?1 ORDER BY rowid LIMIT 1");
+      SQLiteStoreCursor cursor = store_.cursor(selectRows_ + " LIMIT 1");
       bindRow(cursor, row);
-      cursor.next();
+      if (cursor.next()) rowIn(cursor);
       return true;
     } catch (const SQLiteStoreException& error) {
       if (!isDamage(error)) throw;
@@ -146,8 +155,8 @@ class Reading {
   SQLiteStore& store_;
   const std::string selectRows_;
   const std::function<void(ManifestRow&&)>& consume_;
-  std::int64_t next_ = 0;  // rows are numbered from 1 on
-  std::int64_t failedAt_ = -1;
+  std::int64_t next_ = kFirstRow;   // a damaged number may be negative
+  std::int64_t firstDistance_ = 1;  // grows while damage follows damage, so that this ends
 };
 
 }  // namespace

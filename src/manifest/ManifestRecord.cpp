@@ -1,5 +1,7 @@
 #include "manifest/ManifestRecord.h"
 
+#include <cstddef>
+#include <cstring>
 #include <new>
 #include <stdexcept>
 
@@ -13,16 +15,17 @@ void ManifestRecord::Deleter::operator()(ManifestRecord* record) const {
 ManifestRecord::Owner ManifestRecord::create(const DiskCacheItem& item) {
   if (item.key.size() > kLongestKey) throw std::length_error("The key is too long.");
   const auto keyLength = static_cast<std::uint32_t>(item.key.size());
-  Owner record(new (::operator new(sizeof(ManifestRecord) + keyLength)) ManifestRecord(keyLength));
-  item.key.copy(reinterpret_cast<char*>(record.get() + 1), keyLength);
+  const std::size_t behind = keyLength + (item.checksum ? sizeof(*item.checksum) : 0);
+  Owner record(new (::operator new(sizeof(ManifestRecord) + behind))
+                   ManifestRecord(keyLength, item.checksum.has_value()));
+  item.key.copy(record->bytes(), keyLength);
+  if (item.checksum) std::memcpy(record->bytes() + keyLength, &*item.checksum, sizeof(*item.checksum));
   if (item.filename != item.key) record->filename_ = std::make_unique<const std::string>(item.filename);
   record->size = item.size;
   record->hasInlineData = item.hasInlineData;
   record->modificationDate = item.modificationDate;
   record->lastAccessDate = item.lastAccessDate;
   record->extendedMetadata = item.extendedMetadata;
-  record->hasChecksum = item.checksum.has_value();
-  record->checksum = item.checksum.value_or(0);
   return record;
 }
 
@@ -40,7 +43,14 @@ void ManifestRecord::copyTo(DiskCacheItem& item) const {
   item.modificationDate = modificationDate;
   item.lastAccessDate = lastAccessDate;
   item.extendedMetadata = extendedMetadata;
-  item.checksum = hasChecksum ? std::make_optional(checksum) : std::nullopt;
+  item.checksum = checksum();
+}
+
+std::optional<std::uint32_t> ManifestRecord::checksum() const {
+  if (!hasChecksum_) return std::nullopt;
+  std::uint32_t checksum = 0;
+  std::memcpy(&checksum, bytes() + keyLength_, sizeof(checksum));
+  return checksum;
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -10,7 +11,8 @@
 namespace velmora::mobile::xplat::cellar {
 
 // An item's record as the manifest keeps it, of which a cache may have a million: in one piece of memory, with the
-// bytes of the key behind the object, and without the file's name where that is the key, as it nearly always is.
+// bytes of the key, and the checksum if it has one, behind the object, and without the file's name where that is the
+// key, as it nearly always is.
 class ManifestRecord {
  public:
   // Gives the memory back without the size of the class, so that the key's bytes go with it.
@@ -26,7 +28,7 @@ class ManifestRecord {
   ManifestRecord(const ManifestRecord&) = delete;
   ManifestRecord& operator=(const ManifestRecord&) = delete;
 
-  std::string_view key() const { return {reinterpret_cast<const char*>(this + 1), keyLength_}; }
+  std::string_view key() const { return {bytes(), keyLength_}; }
 
   DiskCacheItem item() const;
   void copyTo(DiskCacheItem& item) const;  // into the memory of its strings
@@ -34,7 +36,6 @@ class ManifestRecord {
   std::uint32_t size = 0;
   std::int32_t modificationDate = 0;
   std::int32_t lastAccessDate = 0;
-  std::uint32_t checksum = 0;  // if it has one
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
 
   std::uint32_t accessDateIndex = 0;  // kept by the two orders of eviction
@@ -45,12 +46,18 @@ class ManifestRecord {
 
  public:
   bool hasInlineData : 1;  // beside the length, where they take no room of their own
-  bool hasChecksum : 1;
 
  private:
-  explicit ManifestRecord(std::uint32_t keyLength) noexcept
-      : keyLength_(keyLength & kLongestKey), hasInlineData(false), hasChecksum(false) {}
+  const bool hasChecksum_ : 1;
+
+  ManifestRecord(std::uint32_t keyLength, bool hasChecksum) noexcept
+      : keyLength_(keyLength & kLongestKey), hasInlineData(false), hasChecksum_(hasChecksum) {}
   ~ManifestRecord() = default;
+
+  // The key, and behind it the checksum.
+  char* bytes() { return reinterpret_cast<char*>(this + 1); }
+  const char* bytes() const { return reinterpret_cast<const char*>(this + 1); }
+  std::optional<std::uint32_t> checksum() const;
 
   std::unique_ptr<const std::string> filename_;  // null: the same as the key
 };
