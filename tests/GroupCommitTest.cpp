@@ -255,6 +255,37 @@ TEST_F(GroupCommit, ChangesOfOneKeyTakeEffectInTheirOrder) {
   EXPECT_THAT(valueFiles(), ElementsAre("key"));
 }
 
+// What two threads do at once: the second one's change comes to the queue while the first one's is being handed over.
+TEST_F(GroupCommit, ChangesOfOneKeyTakeEffectInTheirOrderBesideOtherThreads) {
+  std::vector<Written> changes;
+  work().beforeDispatch = [&] {
+    work().beforeDispatch = nullptr;
+    changes.push_back(store("another"));
+  };
+  changes.push_back(remove("old"));
+  changes.push_back(store("old", "newer"));
+  settle();
+  EXPECT_THAT(allTold(changes), Each("<done>"));
+  EXPECT_EQ(contents(), (Contents{{"another", "value"}, {"old", "newer"}}));
+}
+
+// The first one's is refused, and the second one's is not.
+TEST_F(GroupCommit, AChangeThatIsRefusedBesideOtherThreadsIsNotLost) {
+  std::vector<Written> changes;
+  work().beforeDispatch = [&] {
+    work().beforeDispatch = nullptr;
+    changes.push_back(store("another"));
+    changes.push_back(store("last"));
+    work().throwOnDispatch(true);
+  };
+  const Written refused = remove("old");
+  work().throwOnDispatch(false);
+  settle();
+  EXPECT_THAT(allTold(changes), Each("<done>"));
+  EXPECT_EQ(told(refused), "<error> The queue takes no tasks.");
+  EXPECT_EQ(contents(), (Contents{{"another", "value"}, {"last", "value"}, {"old", "value"}}));
+}
+
 TEST_F(GroupCommit, ARemovalBehindAStoreOfItsKeyWaitsForTheFileQueue) {
   store("old", "newer");
   const Written removed = remove("old");
@@ -286,6 +317,21 @@ TEST_F(GroupCommit, ACallbackThatThrowsHarmsNoOther) {
   const Written two = store("two");
   EXPECT_THROW(work().runNext(), std::runtime_error);
   EXPECT_EQ(told(two), "<done>");
+}
+
+TEST_F(GroupCommit, ACallbackThatThrowsHarmsNoChangeOfAnotherThread) {
+  options.inlineData = true;
+  close();
+  openWatched();
+  Written another;
+  work().beforeDispatch = [&] {
+    work().beforeDispatch = nullptr;
+    another = store("another");
+  };
+  auto large = KeyValueStoreFixture::store->store("large", Bytes(200'000));  // too large for a group
+  large.then(nullptr, [](std::future<void>&) { throw std::runtime_error("of the host"); });
+  EXPECT_THROW(work().runNext(), std::runtime_error);
+  EXPECT_EQ(told(another), "<done>");
 }
 
 TEST_F(GroupCommit, ACallbackMayUseTheStore) {

@@ -10,6 +10,7 @@
 #include <iostream>
 #include <iterator>
 #include <map>
+#include <memory>
 #include <random>
 #include <string>
 #include <vector>
@@ -131,6 +132,7 @@ class SafeStoreDamage : public KeyValueStoreFixture, public testing::WithParamIn
       delivered += kept;
       if (kept == 0) ++withoutAny;
       std::filesystem::remove_all(storePath());
+      queues = std::make_shared<test::ManualQueueFactory>();  // keeps those of every store that there was
     }
     std::cout << damages() << " damaged " << what << ": " << delivered << " of " << stored
               << " values delivered, none in " << withoutAny << " stores\n";

@@ -87,6 +87,7 @@ ManualExecutor::~ManualExecutor() {
 }
 
 void ManualExecutor::dispatch(std::function<void()> task) {
+  if (beforeDispatch) beforeDispatch();
   {
     const std::lock_guard<std::mutex> lock(state_->mutex);
     if (state_->throwsOnDispatch) throw std::runtime_error("The queue takes no tasks.");

@@ -31,6 +31,9 @@ class CELLAR_EXPORT ManualExecutor : public AsyncExecutor {
   // queue.
   std::function<void()> onDispatch;
 
+  // The same before the task is added: what it dispatches comes first, as another thread's may.
+  std::function<void()> beforeDispatch;
+
   ManualExecutor();
   ManualExecutor(const ManualExecutor&) = delete;
   ManualExecutor& operator=(const ManualExecutor&) = delete;

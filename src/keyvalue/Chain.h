@@ -5,13 +5,15 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-// Which operation comes right behind which on a queue, so that whoever runs one of them can do work of the next ones as
-// well. Any thread may call.
+// Which operation comes right behind which, so that whoever runs one of them can do work of the next ones as well. Any
+// thread may call. Operations that threads hand over at the same time may stand on the queue in another order than here;
+// those of one thread are in their order in both.
 template <class Operation> class Chain {
  public:
   // What an operation derives from.
   class Link {
     friend class Chain;
+    std::weak_ptr<Operation> previous_;
     std::weak_ptr<Operation> next_;
   };
 
@@ -20,7 +22,10 @@ template <class Operation> class Chain {
     std::shared_ptr<Operation> last;  // released without the mutex
     const std::lock_guard<std::mutex> lock(mutex_);
     last = last_.lock();
-    if (last != nullptr) static_cast<Link&>(*last).next_ = operation;
+    if (last != nullptr) {
+      static_cast<Link&>(*last).next_ = operation;
+      static_cast<Link&>(*operation).previous_ = last;
+    }
     last_ = operation;
   }
 
@@ -30,7 +35,11 @@ template <class Operation> class Chain {
     last_.reset();
   }
 
-  // Null when there is none.
+  // Null when there is none, or none any more.
+  std::shared_ptr<Operation> before(const Operation& operation) {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    return static_cast<const Link&>(operation).previous_.lock();
+  }
   std::shared_ptr<Operation> after(const Operation& operation) {
     const std::lock_guard<std::mutex> lock(mutex_);
     return static_cast<const Link&>(operation).next_.lock();

@@ -54,6 +54,8 @@ class GroupCommit {
   }
 
   void run(const std::shared_ptr<ManifestChange>& change);
+  std::shared_ptr<ManifestChange> firstWaiting(const std::shared_ptr<ManifestChange>& change);
+  void runFrom(const std::shared_ptr<ManifestChange>& first);
   Group groupBehind(const std::shared_ptr<ManifestChange>& first);
   bool commit(const Group& group);
   static void note(const StoreLock& lock, ManifestChange& change);

@@ -67,7 +67,8 @@ class WorkQueue {
 
   void throwIfRefused(KeyRange keys) const;
 
-  // The change right behind; null when there is none.
+  // The changes right before and behind; null when there is none.
+  std::shared_ptr<ManifestChange> previous(const ManifestChange& change) { return changes_.before(change); }
   std::shared_ptr<ManifestChange> next(const ManifestChange& change) { return changes_.after(change); }
 
  private:
