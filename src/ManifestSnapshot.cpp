@@ -16,6 +16,8 @@
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
 #include "SQLiteStore.h"
+#include "base/ManifestErrors.h"
+#include "base/Schema.h"
 #include "base/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -95,17 +97,6 @@ void copyInto(FileUtils& fileUtils, const std::string& copy, const std::string& 
   if (files.journal) fileUtils.writeFile(copy + kJournalSuffix, *files.journal);
 }
 
-// The callers of a snapshot know the manifest's exceptions and nothing of SQLite.
-template <class Action> auto translatingExceptions(Action action) {
-  try {
-    return action();
-  } catch (const SQLiteStoreCorruptedException& error) {
-    throw ManifestCorruptedException(error.description(), error.code());
-  } catch (const SQLiteStoreException& error) {
-    throw ManifestPersistenceException(error.description(), error.code());
-  }
-}
-
 // By key, of the records that have one.
 std::unordered_map<std::string, std::uint64_t> inlineSizesIn(const std::string& path) {
   std::unordered_map<std::string, std::uint64_t> sizes;
@@ -150,7 +141,8 @@ std::vector<ManifestSnapshot::Record> ManifestSnapshot::records(
   auto items = manifest.getAllItems();
   std::vector<Record> records;
   records.reserve(items.size());
-  const auto inlineSizes = translatingExceptions([this] { return inlineSizesIn(path_); });
+  std::unordered_map<std::string, std::uint64_t> inlineSizes;
+  translatingManifestErrors([&] { inlineSizes = inlineSizesIn(path_); });
   for (auto& item : items) {
     const auto inlineSize = inlineSizes.find(item->key);
     records.push_back({std::move(*item), std::nullopt});
@@ -160,16 +152,17 @@ std::vector<ManifestSnapshot::Record> ManifestSnapshot::records(
 }
 
 bool ManifestSnapshot::hasChecksums() const {
-  return translatingExceptions([this] {
+  bool hasChecksums = false;
+  translatingManifestErrors([&] {
     SQLiteStore store(path_);
-    const auto columns = store.info("LarderManifest");
-    return std::any_of(columns.begin(), columns.end(), [](const auto& column) { return column.name == "checksum"; });
+    hasChecksums = hasChecksumColumn(store);
   });
+  return hasChecksums;
 }
 
 void ManifestSnapshot::forEachInlineValue(const std::function<void(const std::string&, const Bytes&)>& onValue) const {
   const SQLiteManifestPersistence manifest(path_, nullptr, nullptr);  // refuses a foreign table
-  translatingExceptions([&] {
+  translatingManifestErrors([&] {
     SQLiteStore store(path_);
     SQLiteStoreCursor cursor =
         store.cursor("SELECT key, inline_data FROM LarderManifest WHERE inline_data IS NOT NULL;");

@@ -1,8 +1,5 @@
 #include "SQLiteManifestPersistence.h"
 
-#include <algorithm>
-#include <array>
-#include <cstddef>
 #include <cstdint>
 #include <filesystem>
 #include <fstream>
@@ -13,8 +10,9 @@
 
 #include "ExtendedMetadata.h"
 #include "LarderException.h"
+#include "base/FunctionReference.h"
+#include "base/ManifestErrors.h"
 #include "base/Schema.h"
-#include "base/SchemaFunctions.h"
 
 namespace velmora::mobile::xplat::cellar {
 
@@ -26,6 +24,7 @@ constexpr int kReadOnly = 8;
 constexpr int kAbort = 4;
 // And for a database that another connection has locked.
 constexpr int kBusy = 5;
+constexpr int kTooBig = 18;
 
 constexpr const char* beForbearing = "PRAGMA busy_timeout = 1000";
 
@@ -34,62 +33,6 @@ bool isThere(const std::string& path) {
   std::error_code error;
   const auto size = std::filesystem::file_size(path, error);
   return error ? error != std::errc::no_such_file_or_directory && error != std::errc::not_a_directory : size > 0;
-}
-
-constexpr const char* chooseJournal = "PRAGMA journal_mode = WAL;PRAGMA synchronous = NORMAL;";
-
-struct ExpectedColumn {
-  const char* name;
-  const char* type;
-};
-
-constexpr std::array<ExpectedColumn, 7> firstVersionColumns = {{{"key", "TEXT"},
-                                                                {"filename", "TEXT"},
-                                                                {"size", "INTEGER"},
-                                                                {"has_inline_data", "BOOLEAN"},
-                                                                {"inline_data", "BLOB"},
-                                                                {"modification_date", "INTEGER"},
-                                                                {"last_access_date", "INTEGER"}}};
-constexpr ExpectedColumn metadataColumn = {"extended_manifest", "BLOB"};
-constexpr const char* checksumColumn = "checksum";
-
-void checkColumn(const std::vector<SQLiteStoreColumn>& columns, std::size_t position, const ExpectedColumn& expected) {
-  const bool matches =
-      position < columns.size() && columns[position].name == expected.name && columns[position].type == expected.type;
-  if (!matches) throw SQLiteStoreCorruptedException("Invalid schema.", -1);
-}
-
-// Brings the table to the latest version, or refuses it.
-void initializeTable(SQLiteStore& store) {
-  throwIfTableCallsFunctions(store, kManifestTable);
-  store.exec(std::string(chooseJournal) + kCreateManifestTable);
-  const auto columns = store.info(kManifestTable);
-  for (std::size_t position = 0; position < firstVersionColumns.size(); ++position) {
-    checkColumn(columns, position, firstVersionColumns[position]);
-  }
-  if (columns.size() == firstVersionColumns.size()) {
-    store.exec("ALTER TABLE LarderManifest ADD extended_manifest BLOB");
-    return;
-  }
-  checkColumn(columns, firstVersionColumns.size(), metadataColumn);
-}
-
-void addChecksums(SQLiteStore& store) {
-  const auto columns = store.info(kManifestTable);
-  const auto isChecksum = [](const SQLiteStoreColumn& column) { return column.name == checksumColumn; };
-  if (std::any_of(columns.begin(), columns.end(), isChecksum)) return;
-  store.exec(kAddChecksums);
-}
-
-// The layers above know the manifest's exceptions and nothing of SQLite.
-template <class Action> auto translatingExceptions(Action action) {
-  try {
-    return action();
-  } catch (const SQLiteStoreCorruptedException& exception) {
-    throw ManifestCorruptedException(exception.description(), exception.code());
-  } catch (const SQLiteStoreException& exception) {
-    throw ManifestPersistenceException(exception.description(), exception.code());
-  }
 }
 
 // By way of the signed 64-bit number, so that a date before the epoch keeps its sign on disk.
@@ -123,7 +66,7 @@ SQLiteManifestPersistence::SQLiteManifestPersistence(const std::string& path,
       extendedMetadataFactory_(std::move(extendedMetadataFactory)),
       storeFactory_(std::move(storeFactory)),
       durability_(durability) {
-  translatingExceptions([this] {
+  translatingManifestErrors([this] {
     store_ = openStore();
     initializeDatabase(*store_);
   });
@@ -138,30 +81,30 @@ std::unique_ptr<SQLiteStore> SQLiteManifestPersistence::openStore() const {
 
 void SQLiteManifestPersistence::initializeDatabase(SQLiteStore& store) const {
   if (hasChecksums()) store.exec(beForbearing);
-  initializeTable(store);
+  initializeManifestTable(store);
   if (hasChecksums()) addChecksums(store);
   if (durability_ == Durability::Synced) store.exec("PRAGMA synchronous = FULL");
 }
 
-template <class Operation> auto SQLiteManifestPersistence::withPatience(Operation operation) const {
+// Does nothing when the persistence has been invalidated, and returns what is empty then.
+template <class Operation> auto SQLiteManifestPersistence::perform(const Operation& operation) const {
   if constexpr (std::is_void_v<decltype(operation())>) {
-    operation();
-    setPatience(true);
+    performUnlessInvalidated(operation);
   } else {
-    auto result = operation();
-    setPatience(true);
+    decltype(operation()) result{};
+    performUnlessInvalidated([&] { result = operation(); });
     return result;
   }
 }
 
-template <class Operation> auto SQLiteManifestPersistence::perform(Operation operation) const {
-  using Result = decltype(operation());
+void SQLiteManifestPersistence::performUnlessInvalidated(FunctionReference operation) const {
   const std::lock_guard<std::recursive_mutex> lock(mutex_);
-  if (invalidated_) return Result();
-  return translatingExceptions([&] {
+  if (invalidated_) return;
+  translatingManifestErrors([&] {
     prepare();
     try {
-      return withPatience(operation);
+      operation();
+      setPatience(true);
     } catch (const SQLiteStoreException& exception) {
       handleFailure(exception);
       throw;
@@ -186,9 +129,26 @@ void SQLiteManifestPersistence::setPatience(bool isPatient) const {
 }
 
 void SQLiteManifestPersistence::handleFailure(const SQLiteStoreException& exception) const {
+  if (exception.code() == kTooBig && hasChecksums()) throwIfDamaged(exception);
   if (transaction_ == Transaction::Open) transaction_ = Transaction::Failed;
   if (exception.code() == kBusy) setPatience(false);
   if (exception.code() == kReadOnly) handleReadOnly(exception);
+}
+
+// A row that says of itself that it is larger than any can be, unless somebody has stored such a value.
+void SQLiteManifestPersistence::throwIfDamaged(const SQLiteStoreException& exception) const {
+  bool isDamaged = false;
+  try {
+    isDamaged = !isIntact();
+  } catch (const SQLiteStoreException&) {
+    isDamaged = true;
+  }
+  if (isDamaged) throw SQLiteStoreCorruptedException(exception.description(), exception.code());
+}
+
+bool SQLiteManifestPersistence::isIntact() const {
+  SQLiteStoreCursor cursor = store_->cursor("PRAGMA integrity_check(1);");
+  return cursor.next() && cursor.get<std::string>(0) == "ok";
 }
 
 // Either the file could not be opened for writing when it was opened, or it says itself that it must never be written:
@@ -239,10 +199,7 @@ bool SQLiteManifestPersistence::hasMoved() const {
 
 bool SQLiteManifestPersistence::isSound() const {
   try {
-    return perform([this] {
-      SQLiteStoreCursor cursor = store_->cursor("PRAGMA integrity_check(1);");
-      return cursor.next() && cursor.get<std::string>(0) == "ok";
-    });
+    return perform([this] { return isIntact(); });
   } catch (const ManifestCorruptedException&) {
     return false;
   }

@@ -40,6 +40,7 @@
 namespace velmora::mobile::xplat::cellar {
 
 class ExtendedMetadataFactory;
+class FunctionReference;
 class SQLiteStoreException;
 
 inline constexpr char kManifestFileName[] = "manifest_v1.sqlite";
@@ -94,8 +95,8 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   void setSize(const std::string& key, std::uint32_t size);
 
  private:
-  template <class Operation> auto perform(Operation operation) const;
-  template <class Operation> auto withPatience(Operation operation) const;
+  template <class Operation> auto perform(const Operation& operation) const;
+  void performUnlessInvalidated(FunctionReference operation) const;
   void setPatience(bool isPatient) const;
 
   bool hasChecksums() const { return durability_ != Durability::Relaxed; }
@@ -104,6 +105,8 @@ class CELLAR_EXPORT SQLiteManifestPersistence : public ManifestPersistence {
   void initializeDatabase(SQLiteStore& store) const;
   void prepare() const;
   void handleFailure(const SQLiteStoreException& exception) const;
+  void throwIfDamaged(const SQLiteStoreException& exception) const;
+  bool isIntact() const;
   void reopen() const;
   void rollBack() noexcept;
   void handleReadOnly(const SQLiteStoreException& exception) const;

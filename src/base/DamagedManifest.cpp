@@ -21,10 +21,13 @@ namespace {
 
 using Bytes = std::vector<unsigned char>;
 
-constexpr int kStatementDoesNotFit = 1;  // SQLite's code for a statement that names what is not there
+// SQLite's codes for a statement that names what is not there, and for a value that is larger than any can be.
+constexpr int kStatementDoesNotFit = 1;
+constexpr int kTooBig = 18;
 
 bool isDamage(const SQLiteStoreException& error) {
-  return dynamic_cast<const SQLiteStoreCorruptedException*>(&error) != nullptr || error.code() == kStatementDoesNotFit;
+  return dynamic_cast<const SQLiteStoreCorruptedException*>(&error) != nullptr ||
+         error.code() == kStatementDoesNotFit || error.code() == kTooBig;
 }
 
 std::optional<Bytes> bytesIn(SQLiteStoreCursor& cursor, int column, bool isNull) {

@@ -2,6 +2,8 @@
 
 namespace velmora::mobile::xplat::cellar {
 
+class SQLiteStore;
+
 inline constexpr char kManifestTable[] = "LarderManifest";
 
 // Makes the table unless it is there.
@@ -20,5 +22,11 @@ inline constexpr char kCreateManifestTable[] =
 
 // Adds to it what a safe store keeps beside.
 inline constexpr char kAddChecksums[] = "ALTER TABLE LarderManifest ADD checksum INTEGER";
+
+// Chooses the journal, and brings the table to the latest version or, with SQLiteStoreCorruptedException, refuses it.
+void initializeManifestTable(SQLiteStore& store);
+
+bool hasChecksumColumn(SQLiteStore& store);
+void addChecksums(SQLiteStore& store);  // unless they are there
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -45,6 +45,32 @@ std::shared_ptr<DiskCacheManifestInterface> StoreManifest::open() {
                                              options.durability);
 }
 
+bool StoreManifest::recoveringFromDamage(const StoreLock& lock, FunctionReference operation) {
+  for (int attempt = 0;; ++attempt) {
+    try {
+      operation();
+      return true;
+    } catch (const ManifestCorruptedException& error) {
+      const Outcome outcome = recovery_->recoverFromDamage(lock, error, attempt);
+      if (outcome == Outcome::NotRecovered) throw;
+      if (outcome == Outcome::Emptied) return false;
+    }
+  }
+}
+
+bool StoreManifest::recoveringFromFailedWrite(const StoreLock& lock, FunctionReference operation) {
+  for (int attempt = 0;; ++attempt) {
+    try {
+      operation();
+      return true;
+    } catch (const ManifestPersistenceException& error) {
+      const Outcome outcome = recovery_->recoverFromFailedWrite(lock, error, attempt);
+      if (outcome == Outcome::NotRecovered) throw;
+      if (outcome == Outcome::Emptied) return false;
+    }
+  }
+}
+
 void StoreManifest::load(const StoreLock& lock) {
   recoveringFromDamage(lock, [&] { get()->load(); });
 }

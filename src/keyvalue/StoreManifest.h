@@ -9,6 +9,7 @@
 
 #include "DiskCacheManifest.h"
 #include "LarderException.h"
+#include "base/FunctionReference.h"
 #include "keyvalue/KeyRange.h"
 #include "keyvalue/ManifestRecovery.h"
 #include "keyvalue/StoreContext.h"
@@ -40,32 +41,10 @@ class StoreManifest {
 
   // Runs what uses the manifest, again when it was damaged and could be recovered. False when the store has been
   // emptied instead. Throws what else goes wrong, and the damage itself when nothing can be done about it.
-  template <class Operation> bool recoveringFromDamage(const StoreLock& lock, Operation operation) {
-    for (int attempt = 0;; ++attempt) {
-      try {
-        operation();
-        return true;
-      } catch (const ManifestCorruptedException& error) {
-        const Outcome outcome = recovery_->recoverFromDamage(lock, error, attempt);
-        if (outcome == Outcome::NotRecovered) throw;
-        if (outcome == Outcome::Emptied) return false;
-      }
-    }
-  }
+  bool recoveringFromDamage(const StoreLock& lock, FunctionReference operation);
 
   // The same for what writes a value's record.
-  template <class Operation> bool recoveringFromFailedWrite(const StoreLock& lock, Operation operation) {
-    for (int attempt = 0;; ++attempt) {
-      try {
-        operation();
-        return true;
-      } catch (const ManifestPersistenceException& error) {
-        const Outcome outcome = recovery_->recoverFromFailedWrite(lock, error, attempt);
-        if (outcome == Outcome::NotRecovered) throw;
-        if (outcome == Outcome::Emptied) return false;
-      }
-    }
-  }
+  bool recoveringFromFailedWrite(const StoreLock& lock, FunctionReference operation);
 
   // Makes the changes in one transaction. False when nothing has changed: they can be made one by one then.
   bool changeTogether(const StoreLock& lock, const std::function<void()>& changes);
