@@ -237,7 +237,7 @@ void SQLiteManifestPersistence::storeItem(const DiskCacheItem& item, const std::
         "VALUES  (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9);");
     bindItem(cursor, item);
     if (inlineData != nullptr) cursor.bind<std::vector<unsigned char>>(8, *inlineData);
-    if (item.checksum) cursor.bind<unsigned long long>(9, *item.checksum);
+    if (item.checksum) cursor.bind<unsigned long long>(9, inChecksumColumn(*item.checksum));
     cursor.next();
   });
 }
@@ -373,9 +373,7 @@ std::unique_ptr<DiskCacheItem> SQLiteManifestPersistence::itemInRowOf(SQLiteStor
     item->extendedMetadata = extendedMetadataFactory_->getExtendedMetadata();
     item->extendedMetadata->deserialize(cursor.get<std::vector<unsigned char>>(6));
   }
-  if (hasChecksums() && cursor.get<bool>(8)) {
-    item->checksum = static_cast<std::uint32_t>(cursor.get<unsigned long long>(7));
-  }
+  if (hasChecksums() && cursor.get<bool>(8)) item->checksum = fromChecksumColumn(cursor.get<unsigned long long>(7));
   return item;
 }
 

@@ -1,6 +1,7 @@
 // Random damage to the files of a safe store: what is delivered afterwards is what was stored. CELLAR_DAMAGES sets the
-// number of damaged stores of each kind.
+// number of damaged stores of each kind, CELLAR_FIRST_DAMAGE the seed of the first.
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <cstddef>
@@ -26,9 +27,9 @@ namespace {
 using test::KeyValueStoreFixture;
 using test::LogCapture;
 
-std::size_t damages() {
-  const char* const number = std::getenv("CELLAR_DAMAGES");
-  return number == nullptr ? 60 : static_cast<std::size_t>(std::stoul(number));
+std::size_t numberIn(const char* variable, std::size_t usual) {
+  const char* const number = std::getenv(variable);
+  return number == nullptr ? usual : static_cast<std::size_t>(std::stoul(number));
 }
 
 class SafeStoreDamage : public KeyValueStoreFixture, public testing::WithParamInterface<bool> {
@@ -60,11 +61,18 @@ class SafeStoreDamage : public KeyValueStoreFixture, public testing::WithParamIn
     return values;
   }
 
+  static std::string read(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), {}};
+  }
+
+  static void write(const std::string& path, const std::string& bytes) {
+    std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
+  }
+
   // Flips bits, overwrites a range with garbage or zeros, cuts the end off, or puts something else there.
   static void damage(const std::string& path, Random& random) {
-    std::ifstream in(path, std::ios::binary);
-    std::string bytes((std::istreambuf_iterator<char>(in)), {});
-    in.close();
+    std::string bytes = read(path);
     if (bytes.empty()) bytes = "?";
     const std::size_t at = random() % bytes.size();
     switch (random() % 5) {
@@ -87,12 +95,27 @@ class SafeStoreDamage : public KeyValueStoreFixture, public testing::WithParamIn
       default:
         bytes = "Something else altogether.";
     }
-    std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
+    write(path, bytes);
   }
 
-  std::string randomFile(Random& random) const {
-    std::vector<std::string> names = valueFiles();
-    return names.empty() ? "manifest_v1.sqlite" : names[random() % names.size()];
+  void damageOne(bool isManifest, const Values& values, Random& random) {
+    if (isManifest) return damage(pathOf("manifest_v1.sqlite"), random);
+    if (GetParam()) return damageInlineValue(values, random);
+    const std::vector<std::string> names = valueFiles();
+    ASSERT_THAT(names, testing::SizeIs(values.size()));
+    damage(pathOf(names[random() % names.size()]), random);
+  }
+
+  // Other bytes in its place; the record knows the length.
+  void damageInlineValue(const Values& values, Random& random) {
+    const std::string& value = std::next(values.begin(), static_cast<std::ptrdiff_t>(random() % values.size()))->second;
+    std::string bytes = read(pathOf("manifest_v1.sqlite"));
+    const std::size_t place = bytes.find(value);
+    ASSERT_NE(place, std::string::npos) << value;
+    const std::size_t first = random() % value.size();
+    const std::size_t count = 1 + random() % (value.size() - first);
+    for (std::size_t i = first; i < first + count; ++i) bytes[place + i] ^= static_cast<char>(1 + random() % 255);
+    write(pathOf("manifest_v1.sqlite"), bytes);
   }
 
   // The number of values that are delivered. None may be wrong; new work must succeed.
@@ -122,11 +145,13 @@ class SafeStoreDamage : public KeyValueStoreFixture, public testing::WithParamIn
     std::size_t stored = 0;
     std::size_t delivered = 0;
     std::size_t withoutAny = 0;
-    for (std::size_t seed = 0; seed < damages() && !HasFailure(); ++seed) {
+    const std::size_t damages = numberIn("CELLAR_DAMAGES", 60);
+    const std::size_t first = numberIn("CELLAR_FIRST_DAMAGE", 0);
+    for (std::size_t seed = first; seed < first + damages && !HasFailure(); ++seed) {
       SCOPED_TRACE(seed);
       Random random(seed);
       const Values values = live(random);
-      damage(pathOf(isManifest ? "manifest_v1.sqlite" : randomFile(random)), random);
+      damageOne(isManifest, values, random);
       const std::size_t kept = expectNothingWrong(values);
       stored += values.size();
       delivered += kept;
@@ -134,7 +159,7 @@ class SafeStoreDamage : public KeyValueStoreFixture, public testing::WithParamIn
       std::filesystem::remove_all(storePath());
       queues = std::make_shared<test::ManualQueueFactory>();  // keeps those of every store that there was
     }
-    std::cout << damages() << " damaged " << what << ": " << delivered << " of " << stored
+    std::cout << damages << " damaged " << what << ": " << delivered << " of " << stored
               << " values delivered, none in " << withoutAny << " stores\n";
     RecordProperty("delivered", std::to_string(delivered));
   }

@@ -522,6 +522,37 @@ TEST_F(SafeStore, KeepsTheRowsThatCanBeRead) {
   EXPECT_EQ(get("new"), "value");
 }
 
+TEST_F(SafeStore, ChecksValuesThoughTheColumnOfTheirChecksumsHasLostItsName) {
+  options.inlineData = true;
+  open();
+  put("a", "1");
+  put("b", "2");
+  close();
+  execute("UPDATE LarderManifest SET inline_data = X'00' WHERE key = 'a'");
+  execute("ALTER TABLE LarderManifest RENAME COLUMN checksum TO cheeksum");
+  const LogCapture log;
+  open();
+  EXPECT_THAT(get("a"), HasSubstr("is damaged"));
+  EXPECT_EQ(get("b"), "2");
+  put("b", "3");
+  reopen();
+  EXPECT_THAT(get("a"), HasSubstr("is damaged"));
+  EXPECT_EQ(get("b"), "3");
+}
+
+TEST_F(SafeStore, KeepsRowsWhateverTheirNumbersAre) {
+  options.inlineData = true;
+  open();
+  for (const char* key : {"a", "b", "c"}) put(key, key);
+  close();
+  execute("UPDATE LarderManifest SET rowid = -9223372036854775807 WHERE key = 'a'");
+  execute("UPDATE LarderManifest SET rowid = 9223372036854775806 WHERE key = 'c'");
+  execute("ALTER TABLE LarderManifest RENAME COLUMN size TO sice");
+  const LogCapture log;
+  open();
+  EXPECT_EQ(contents(), (Contents{{"a", "a"}, {"b", "b"}, {"c", "c"}}));
+}
+
 TEST_F(SafeStore, ContinuesWhenItsDirectoryIsRemoved) {
   open();
   put("a", "1");

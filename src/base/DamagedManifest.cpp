@@ -1,6 +1,8 @@
 #include "base/DamagedManifest.h"
 
 #include <algorithm>
+#include <array>
+#include <cstddef>
 #include <cstdint>
 #include <exception>
 #include <limits>
@@ -44,23 +46,45 @@ ManifestRow rowIn(SQLiteStoreCursor& cursor) {
   row.item.lastAccessDate = static_cast<std::int32_t>(cursor.get<unsigned long long>(6));
   row.inlineData = bytesIn(cursor, 7, !cursor.get<bool>(10));
   row.metadata = bytesIn(cursor, 8, !cursor.get<bool>(11));
-  if (cursor.get<bool>(12)) row.item.checksum = static_cast<std::uint32_t>(cursor.get<unsigned long long>(9));
+  if (cursor.get<bool>(12)) row.item.checksum = fromChecksumColumn(cursor.get<unsigned long long>(9));
   return row;
 }
 
-// Of a column, or NULL where the table has none of that name.
-std::string expressionFor(const std::string& name, const std::vector<SQLiteStoreColumn>& columns) {
-  const auto isIt = [&](const SQLiteStoreColumn& column) { return column.name == name; };
-  return std::any_of(columns.begin(), columns.end(), isIt) ? name : "NULL";
-}
+// By their places, because their names may be damaged. NULL where the table has none.
+class ColumnNames {
+ public:
+  explicit ColumnNames(SQLiteStore& store)
+      : names_(columnNamesOf(store)), hasChecksums_(hasChecksumColumn(store) || isToHaveChecksums(store)) {}
 
-std::string selectRowsOf(const std::vector<SQLiteStoreColumn>& columns) {
-  const std::string inlineData = expressionFor("inline_data", columns);
-  const std::string metadata = expressionFor("extended_manifest", columns);
-  const std::string checksum = expressionFor("checksum", columns);
-  return "SELECT rowid, key, filename, size, has_inline_data, modification_date, last_access_date, " + inlineData +
-         ", " + metadata + ", " + checksum + ", " + inlineData + " IS NOT NULL, " + metadata + " IS NOT NULL, " +
-         checksum + " IS NOT NULL FROM LarderManifest WHERE rowid >= ?1 ORDER BY rowid";
+  std::string at(std::size_t place) const { return place < names_.size() ? quoted(names_[place]) : "NULL"; }
+
+  // By its name first: somebody else's columns may stand before it.
+  std::string checksum() const {
+    if (!hasChecksums_) return "NULL";
+    const bool isNamed = std::find(names_.begin(), names_.end(), kChecksumColumn) != names_.end();
+    return isNamed ? kChecksumColumn : at(kPlaceOfChecksum);
+  }
+
+ private:
+  static constexpr std::size_t kPlaceOfChecksum = 8;
+
+  static std::string quoted(const std::string& name) {
+    std::string quoted = "\"";
+    for (const char character : name) quoted += character == '"' ? std::string("\"\"") : std::string(1, character);
+    return quoted + "\"";
+  }
+
+  const std::vector<std::string> names_;
+  const bool hasChecksums_;
+};
+
+std::string selectRowsOf(const ColumnNames& columns) {
+  std::string statement = "SELECT rowid";
+  for (const std::size_t place : std::array<std::size_t, 6>{0, 1, 2, 3, 5, 6}) statement += ", " + columns.at(place);
+  const std::array<std::string, 3> mayBeNull = {columns.at(4), columns.at(7), columns.checksum()};
+  for (const std::string& name : mayBeNull) statement += ", " + name;
+  for (const std::string& name : mayBeNull) statement += ", " + name + " IS NOT NULL";
+  return statement + " FROM LarderManifest WHERE rowid >= ?1 ORDER BY rowid";
 }
 
 // What the consumer of a row has thrown, which is no damage.
@@ -71,7 +95,7 @@ struct ConsumerFailure {
 class Reading {
  public:
   Reading(SQLiteStore& store, const std::function<void(ManifestRow&&)>& consume)
-      : store_(store), selectRows_(selectRowsOf(store.info(kManifestTable))), consume_(consume) {}
+      : store_(store), selectRows_(selectRowsOf(ColumnNames(store))), consume_(consume) {}
 
   void readAll() {
     for (bool isOver = false; !isOver;) {

@@ -24,7 +24,7 @@ void NewManifest::add(const ManifestRow& row) {
   cursor.bind<unsigned long long>(6, number(row.item.lastAccessDate));
   if (row.inlineData) cursor.bind<std::vector<unsigned char>>(7, *row.inlineData);
   if (row.metadata) cursor.bind<std::vector<unsigned char>>(8, *row.metadata);
-  if (row.item.checksum) cursor.bind<unsigned long long>(9, *row.item.checksum);
+  if (row.item.checksum) cursor.bind<unsigned long long>(9, inChecksumColumn(*row.item.checksum));
   cursor.next();
 }
 

@@ -29,7 +29,6 @@ constexpr std::array<ExpectedColumn, 7> kFirstVersionColumns = {{{"key", "TEXT"}
                                                                  {"modification_date", "INTEGER"},
                                                                  {"last_access_date", "INTEGER"}}};
 constexpr ExpectedColumn kMetadataColumn = {"extended_manifest", "BLOB"};
-constexpr const char* kChecksumColumn = "checksum";
 
 void checkColumn(const std::vector<SQLiteStoreColumn>& columns, std::size_t position, const ExpectedColumn& expected) {
   const bool matches =
@@ -53,14 +52,27 @@ void initializeManifestTable(SQLiteStore& store) {
   checkColumn(columns, kFirstVersionColumns.size(), kMetadataColumn);
 }
 
+std::vector<std::string> columnNamesOf(SQLiteStore& store) {
+  SQLiteStoreCursor cursor = store.cursor("PRAGMA table_info(LarderManifest)");
+  std::vector<std::string> names;
+  while (cursor.next()) names.push_back(cursor.get<std::string>(1));
+  return names;
+}
+
 bool hasChecksumColumn(SQLiteStore& store) {
-  const auto columns = store.info(kManifestTable);
-  return std::any_of(columns.begin(), columns.end(),
-                     [](const SQLiteStoreColumn& column) { return column.name == kChecksumColumn; });
+  const auto names = columnNamesOf(store);
+  return std::find(names.begin(), names.end(), kChecksumColumn) != names.end();
+}
+
+bool isToHaveChecksums(SQLiteStore& store) {
+  SQLiteStoreCursor cursor = store.cursor("PRAGMA user_version");
+  return cursor.next() && cursor.get<unsigned long long>(0) != 0;
 }
 
 void addChecksums(SQLiteStore& store) {
-  if (!hasChecksumColumn(store)) store.exec(kAddChecksums);
+  if (hasChecksumColumn(store)) return;
+  if (isToHaveChecksums(store)) throw SQLiteStoreCorruptedException("Invalid schema.", -1);
+  store.exec("BEGIN IMMEDIATE;" + std::string(kAddChecksums) + "COMMIT;");
 }
 
 }  // namespace velmora::mobile::xplat::cellar
