@@ -32,37 +32,6 @@ void throwIfAmbiguous(const std::vector<std::unique_ptr<DiskCacheItem>>& records
 
 }  // namespace
 
-DiskCacheManifestInterface::~DiskCacheManifestInterface() = default;
-
-std::optional<ReplacedItem> DiskCacheManifestInterface::replaceItem(const DiskCacheItem& item,
-                                                                    bool /*withInlineData*/) {
-  setItem(item);
-  return std::nullopt;
-}
-
-bool DiskCacheManifestInterface::changeTogether(const std::function<void()>& /*changes*/) { return false; }
-
-void DiskCacheManifestInterface::storeItem(const DiskCacheItem& item, const std::vector<unsigned char>* inlineData) {
-  setItem(item);
-  if (inlineData != nullptr) setInlineData(item.key, *inlineData);
-}
-
-void DiskCacheManifestInterface::changeTogetherOrThrow(const std::function<void()>& changes) { changes(); }
-
-std::int64_t DiskCacheManifestInterface::currentDate() { return Clock::now(); }
-
-bool DiskCacheManifestInterface::hasMoved() { return false; }
-
-bool DiskCacheManifestInterface::isSound() { return true; }
-
-void DiskCacheManifestInterface::release() {}
-
-void DiskCacheManifestInterface::suspend() {}
-
-void DiskCacheManifestInterface::resume() {}
-
-void DiskCacheManifestInterface::reload() { load(); }
-
 std::shared_ptr<DiskCacheManifest> DiskCacheManifest::createDiskCacheManifest(
     const std::string& path, std::shared_ptr<AsyncExecutor> executor, std::shared_ptr<ExtendedMetadataFactory> factory,
     std::shared_ptr<PruneStrategyBase> strategy) {
@@ -475,6 +444,7 @@ void DiskCacheManifest::runQueuedFlush(AccessDates& queued) {
 // written now wait for the timer.
 void DiskCacheManifest::commitAccessTimeUpdates(AccessDates& dates) {
   try {
+    if (time_ != nullptr) writeTogether(dates);
     for (; !dates.empty(); dates.erase(dates.begin())) {
       const auto& [key, date] = *dates.begin();
       if (isAccessDate(key, date)) persistence_->updateLastAccessDate(key, date);
@@ -488,6 +458,22 @@ void DiskCacheManifest::commitAccessTimeUpdates(AccessDates& dates) {
     left = hasAccessDate(lock, left->first, left->second) ? std::next(left) : dates.erase(left);
   }
   pendingAccessDates_.merge(dates);
+}
+
+// In one transaction, for which a synced store waits once. Where there are none, nothing is written, and the dates
+// stay.
+void DiskCacheManifest::writeTogether(AccessDates& dates) {
+  AccessDates current;
+  {
+    const ItemsLock lock(itemsMutex_);
+    for (const auto& [key, date] : dates) {
+      if (hasAccessDate(lock, key, date)) current.emplace(key, date);
+    }
+  }
+  const auto writeAll = [&] {
+    for (const auto& [key, date] : current) persistence_->updateLastAccessDate(key, date);
+  };
+  if (current.empty() || persistence_->performTogether(writeAll)) dates.clear();
 }
 
 bool DiskCacheManifest::isAccessDate(const std::string& key, std::int32_t date) {

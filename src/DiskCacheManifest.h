@@ -221,6 +221,7 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   void flush();
   void runQueuedFlush(AccessDates& queued);
   void commitAccessTimeUpdates(AccessDates& dates);
+  void writeTogether(AccessDates& dates);
   bool isAccessDate(const std::string& key, std::int32_t date);
 
   const std::unique_ptr<ManifestPersistence> persistence_;

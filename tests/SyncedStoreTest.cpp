@@ -165,6 +165,20 @@ TEST_F(SyncedStore, SyncsARemoval) {
   EXPECT_THAT(calls, ElementsAre("write manifest_v1.sqlite-wal", "sync manifest_v1.sqlite-wal"));
 }
 
+TEST_F(SyncedStore, SyncsAccessDatesTogether) {
+  open();
+  for (const char* key : {"a", "b", "c"}) put(key, "value");
+  clock.advance(10);
+  for (const char* key : {"a", "b", "c"}) EXPECT_EQ(get(key), "value");
+  Calls calls;
+  {
+    const CallTrace trace(calls);
+    ASSERT_TRUE(fire(120));
+  }
+  EXPECT_THAT(calls, ElementsAre("write manifest_v1.sqlite-wal", "sync manifest_v1.sqlite-wal"));
+  for (const std::string& row : rowsOnDisk()) EXPECT_THAT(row, testing::HasSubstr(std::to_string(kStart + 10)));
+}
+
 TEST_F(SyncedStore, IsTheOnlyOneThatSyncs) {
   for (const Durability durability : {Durability::Relaxed, Durability::Safe}) {
     options.durability = durability;
