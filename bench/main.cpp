@@ -6,6 +6,7 @@
 #include <exception>
 #include <fstream>
 #include <iostream>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -28,6 +29,7 @@ struct Arguments {
   bool quick = false;
   bool evenIfBusy = false;
   std::vector<std::string> places;
+  std::string disk;
   std::vector<std::string> benchmarks;
   std::string results;
   std::string document;
@@ -67,7 +69,9 @@ void run(const Arguments& arguments) {
   bench::Manifests manifests(places.back());
   const bool isOneTopic = !arguments.benchmarks.empty() && arguments.document.empty();
   if (arguments.quick || isOneTopic) places.resize(1);  // a topic is for a quick look
-  const bench::Context context{arguments.quick, places, report, manifests};
+  std::optional<bench::Place> disk;
+  if (!arguments.disk.empty()) disk = placeOf(arguments.disk);
+  const bench::Context context{arguments.quick, places, disk, report, manifests};
   for (const auto& benchmark : bench::benchmarks()) {
     if (!isWanted(arguments, benchmark.name)) continue;
     const bench::Stopwatch watch;
@@ -90,6 +94,7 @@ int main(int argc, char** argv) {
   app.add_flag("--quick", arguments.quick, "Fewer and smaller measurements");
   app.add_flag("--even-if-busy", arguments.evenIfBusy, "Report although other programs took part of the processors");
   app.add_option("--place", arguments.places, "NAME:DIRECTORY to measure in")->required();
+  app.add_option("--disk", arguments.disk, "NAME:DIRECTORY on a disk, to measure syncs in");
   app.add_option("--results", arguments.results, "The file for the results, as JSON")->required();
   app.add_option("--plots", arguments.plots, "A directory for gnuplot scripts");
   app.add_option("--document", arguments.document, "The document to write the tables into");

@@ -5,6 +5,7 @@ namespace velmora::mobile::xplat::cellar::bench {
 const std::vector<Benchmark>& benchmarks() {
   static const std::vector<Benchmark> all = {
       {"store", "Storing: microseconds for each of many new values", measureStores},
+      {"durability", "Durability: microseconds for each of many new values", measureDurability},
       {"fetch", "Fetching: microseconds for each of many values that are there", measureFetches},
       {"caller", "The caller's time: microseconds until a call returns", measureCallers},
       {"prune", "Pruning: microseconds for each removed item", measurePrunes},

@@ -9,6 +9,7 @@ namespace velmora::mobile::xplat::cellar::bench {
 
 // Each measures one thing and adds its rows to the report.
 void measureStores(const Context& context);
+void measureDurability(const Context& context);
 void measureFetches(const Context& context);
 void measureCallers(const Context& context);
 void measurePrunes(const Context& context);

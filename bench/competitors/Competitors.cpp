@@ -8,4 +8,10 @@ const std::vector<std::pair<std::string, OpenCompetitor>>& competitors() {
   return all;
 }
 
+const std::vector<std::pair<std::string, OpenGroupingCompetitor>>& syncedCompetitors() {
+  static const std::vector<std::pair<std::string, OpenGroupingCompetitor>> all = {{"LevelDB", openSyncedLevelDB},
+                                                                                  {"SQLite", openSyncedSQLite}};
+  return all;
+}
+
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -1,4 +1,5 @@
 #include <leveldb/db.h>
+#include <leveldb/write_batch.h>
 
 #include <stdexcept>
 
@@ -12,9 +13,12 @@ void throwUnlessOk(const leveldb::Status& status) {
   if (!status.ok()) throw std::runtime_error(status.ToString());
 }
 
-class LevelDB : public Competitor {
+leveldb::Slice sliceOf(const Bytes& value) { return {reinterpret_cast<const char*>(value.data()), value.size()}; }
+
+class LevelDB : public GroupingCompetitor {
  public:
-  explicit LevelDB(const std::string& directory) {
+  LevelDB(const std::string& directory, bool isSynced) {
+    writeOptions_.sync = isSynced;
     leveldb::Options options;
     options.create_if_missing = true;
     leveldb::DB* database = nullptr;
@@ -23,8 +27,13 @@ class LevelDB : public Competitor {
   }
 
   void put(const std::string& key, const Bytes& value) override {
-    const leveldb::Slice bytes(reinterpret_cast<const char*>(value.data()), value.size());
-    throwUnlessOk(database_->Put(leveldb::WriteOptions(), key, bytes));
+    throwUnlessOk(database_->Put(writeOptions_, key, sliceOf(value)));
+  }
+
+  void putTogether(const Entries& entries) override {
+    leveldb::WriteBatch batch;
+    for (const auto& [key, value] : entries) batch.Put(key, sliceOf(value));
+    throwUnlessOk(database_->Write(writeOptions_, &batch));
   }
 
   Bytes get(const std::string& key) override {
@@ -34,11 +43,18 @@ class LevelDB : public Competitor {
   }
 
  private:
+  leveldb::WriteOptions writeOptions_;
   std::unique_ptr<leveldb::DB> database_;
 };
 
 }  // namespace
 
-std::unique_ptr<Competitor> openLevelDB(const std::string& directory) { return std::make_unique<LevelDB>(directory); }
+std::unique_ptr<Competitor> openLevelDB(const std::string& directory) {
+  return std::make_unique<LevelDB>(directory, false);
+}
+
+std::unique_ptr<GroupingCompetitor> openSyncedLevelDB(const std::string& directory) {
+  return std::make_unique<LevelDB>(directory, true);
+}
 
 }  // namespace velmora::mobile::xplat::cellar::bench

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstddef>
+#include <optional>
 #include <vector>
 
 #include "support/Fill.h"
@@ -13,6 +14,7 @@ namespace velmora::mobile::xplat::cellar::bench {
 struct Context {
   bool quick = false;
   std::vector<Place> places{};
+  std::optional<Place> disk{};  // where a sync has to wait for a medium
   Report& report;
   Manifests& manifests;
 

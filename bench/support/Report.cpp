@@ -14,8 +14,9 @@ namespace velmora::mobile::xplat::cellar::bench {
 namespace {
 
 constexpr const char* kFastest = "fastest competitor";
-const std::vector<std::string> kContestants = {"ours",    "lower bound", "in groups", "LevelDB", "LMDB",
-                                               "RocksDB", "SQLite",      "du",        "rm -rf"};
+const std::vector<std::string> kContestants = {
+    "ours", "relaxed", "safe store", "lower bound",      "in groups", "LevelDB", "LevelDB in groups",
+    "LMDB", "RocksDB", "SQLite",     "SQLite in groups", "du",        "rm -rf"};
 
 std::string formatted(double value) {
   char text[32];
@@ -50,6 +51,7 @@ bool contains(const Report::Section& section, const std::string& contestant) {
 }
 
 std::string goalText(const Row& row, const Goal& goal) {
+  if (goal.limit == kNoLimit) return goal.against + ", no goal";
   if (goal.against.empty()) return "<= " + formatted(goal.limit) + " " + row.unit;
   return "<= " + formatted(goal.limit) + " " + goal.against;
 }
@@ -81,6 +83,7 @@ Cells figureCells(const Report::Section& section, const Row& row, Format format)
 
 Cells verdictCells(const Row& row, const Goal& goal) {
   const std::string ratio = goal.against.empty() ? "" : formatted(ratioOf(row, goal));
+  if (goal.limit == kNoLimit) return {ratio, goalText(row, goal), ""};
   return {ratio, goalText(row, goal), isMet(row, goal) ? "yes" : "no"};
 }
 

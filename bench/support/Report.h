@@ -1,5 +1,6 @@
 #pragma once
 
+#include <limits>
 #include <map>
 #include <string>
 #include <vector>
@@ -11,7 +12,8 @@
 namespace velmora::mobile::xplat::cellar::bench {
 
 // Ours is to be at most `limit` times that of `against`: "lower bound", the name of a competitor, "fastest competitor",
-// or empty when the limit is a figure of its own.
+// or empty when the limit is a figure of its own. Without a limit only the ratio is reported.
+constexpr double kNoLimit = std::numeric_limits<double>::infinity();
 struct Goal {
   std::string against;
   double limit;

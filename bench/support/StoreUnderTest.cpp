@@ -21,10 +21,20 @@ std::shared_ptr<DiskCache> createCache(const std::string& directory, const Store
                                        const std::shared_ptr<host::ThreadQueueFactory>& queues) {
   const auto files = std::make_shared<FileUtils>();
   const auto trash = std::make_shared<TrashCollector>(directory + "-trash", files, nullptr, nullptr);
-  const auto cache = std::make_shared<DiskCache>(
-      directory, directory + "-tmp", "bench", options.capacity, kTenYears, options.normalSize, options.normalSize,
-      options.inlineData, queues, nullptr, trash, std::make_shared<LRUPruneStrategy>(), options.reporter, nullptr,
-      files, [](unsigned int) {}, kBatchSize);
+  DiskCacheOptions cacheOptions;
+  cacheOptions.directory = directory;
+  cacheOptions.temporaryDirectory = directory + "-tmp";
+  cacheOptions.name = "bench";
+  cacheOptions.capacity = options.capacity;
+  cacheOptions.staleAge = kTenYears;
+  cacheOptions.inlineData = options.inlineData;
+  cacheOptions.batchSize = kBatchSize;
+  cacheOptions.onSizeChanged = [](unsigned int) {};
+  cacheOptions.pruneStrategy = std::make_shared<LRUPruneStrategy>();
+  cacheOptions.durability = options.durability;
+  cacheOptions.normalSize = options.normalSize;
+  cacheOptions.survivalSize = options.normalSize;
+  const auto cache = std::make_shared<DiskCache>(cacheOptions, StoreServices{queues, trash, files, options.reporter});
   if (options.load) cache->loadManifest();
   return cache;
 }

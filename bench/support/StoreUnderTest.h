@@ -8,6 +8,7 @@
 #include <string>
 
 #include <cellar/DiskCache.h>
+#include <cellar/Durability.h>
 #include <cellar/host/ThreadQueueFactory.h>
 
 #include "support/Places.h"
@@ -19,6 +20,7 @@ struct StoreOptions {
   bool inlineData = false;
   std::optional<std::uint64_t> capacity{};
   std::uint32_t normalSize = std::numeric_limits<std::uint32_t>::max();  // bytes that a prune leaves
+  Durability durability = Durability::Relaxed;
   bool load = true;
   std::shared_ptr<AnalyticsEventReporter> reporter{};
 };
