@@ -1,6 +1,7 @@
 #include <cellar/Durability.h>
 
 #include <cstddef>
+#include <cstdint>
 #include <iostream>
 #include <string>
 #include <utility>

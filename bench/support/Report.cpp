@@ -132,10 +132,11 @@ nlohmann::ordered_json jsonOf(const Row& row) {
   nlohmann::ordered_json json = {{"what", row.what}, {"where", row.where}, {"on", row.cpus}, {"unit", row.unit}};
   for (const auto& [name, figure] : row.figures) json["figures"][name] = jsonOf(figure);
   for (const Goal& goal : row.goals) {
-    json["goals"].push_back({{"against", goal.against},
-                             {"limit", goal.limit},
-                             {"ratio", goal.against.empty() ? row.figures.at("ours").median : ratioOf(row, goal)},
-                             {"met", isMet(row, goal)}});
+    const double ratio = goal.against.empty() ? row.figures.at("ours").median : ratioOf(row, goal);
+    json["goals"].push_back({{"against", goal.against}, {"ratio", ratio}});
+    if (goal.limit == kNoLimit) continue;
+    json["goals"].back()["limit"] = goal.limit;
+    json["goals"].back()["met"] = isMet(row, goal);
   }
   return json;
 }
