@@ -370,6 +370,17 @@ void FileUtils::sync(const string& path) {
   if (::fsync(file.get()) != 0) throwSystemError("Could not sync file", errno);
 }
 
+void FileUtils::beginSync(const string& path) noexcept {
+#if defined(SYNC_FILE_RANGE_WRITE) && (!defined(__ANDROID_API__) || __ANDROID_API__ >= 26)
+  const int file = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (file < 0) return;
+  (void)::sync_file_range(file, 0, 0, SYNC_FILE_RANGE_WRITE);  // up to the end
+  (void)::close(file);
+#else
+  static_cast<void>(path);
+#endif
+}
+
 std::vector<string> FileUtils::listFiles(const string& path) {
   std::vector<string> names;
   DirectoryStream directory(::opendir(path.c_str()));

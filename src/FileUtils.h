@@ -106,6 +106,9 @@ class CELLAR_EXPORT FileUtils {
 
   // The bare names of the regular files in a directory, in the file system's order.
   virtual std::vector<std::string> listFiles(const std::string& path);
+
+  // Has the system begin what `sync` of a file waits for, where it can: several files are synced in less time then.
+  virtual void beginSync(const std::string& path) noexcept;
 };
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -621,6 +621,17 @@ TEST_F(PersistentKeyValueStoreGoingInline, LetsAFetchThatWaitsForTheFileHaveIt) 
   EXPECT_EQ(told(fetched), "old");
 }
 
+TEST_F(PersistentKeyValueStoreGoingInline, AnswersAFetchWithAMissWhenTheFileIsRemovedAndTheKeyStoredInline) {
+  openInlineOverFile();
+  const Fetched fetched = watch(store->fetch("key"));
+  watch(store->removeItem("key"));
+  watch(store->store("key", bytesOf("new")));
+  work().runAll();
+  settle();
+  EXPECT_EQ(told(fetched), "<miss>");
+  EXPECT_EQ(get("key"), "new");
+}
+
 TEST_F(PersistentKeyValueStoreGoingInline, LogsAFileThatCannotBeDeletedAndIsDone) {
   openInlineOverFile();
   files->failNext(Operation::DeleteFile, EACCES);

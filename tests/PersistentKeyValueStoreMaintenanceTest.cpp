@@ -571,6 +571,19 @@ TEST_F(PersistentKeyValueStoreClearing, LeavesWhatIsStoredBetweenItsBatches) {
   EXPECT_EQ(contents(), (Contents{{"key0", "new"}, {"key1", "new"}, {"key2", "new"}, {"key3", "new"}}));
 }
 
+TEST_F(PersistentKeyValueStoreClearing, TellsThatTheQueueTakesItsNextBatchNoMore) {
+  options.batchSize = 1;
+  open();
+  putMany(3);
+  store->clear(onSuccess(), onError());
+  work().runAll();
+  work().throwOnDispatch(true);
+  file().runAll();
+  work().throwOnDispatch(false);
+  settle();
+  EXPECT_EQ(ending, "<error> The queue takes no tasks.");
+}
+
 TEST_F(PersistentKeyValueStoreClearing, TwiceAtOnceSucceedsTwice) {
   options.batchSize = 1;
   open();

@@ -12,11 +12,13 @@
 #include <ctime>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <map>
 #include <memory>
 #include <optional>
 #include <stdexcept>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "Clock.h"
@@ -118,6 +120,14 @@ TEST_F(SafeStore, WritesOneRowForAValue) {
   open();
   put("a", "1");
   EXPECT_THAT(rowsOnDisk(), ElementsAre(MatchesRegex("a a\\.1\\.[0-9a-f]{8} 1 0 1000000 1000000 -")));
+}
+
+TEST_F(SafeStore, HasItsManifestBeforeTheFirstFile) {
+  openUnloaded();
+  watch(store->store("a", bytesOf("1")));
+  file().runNext();
+  EXPECT_THAT(valueFiles(), SizeIs(1));
+  EXPECT_GT(std::filesystem::file_size(manifestPath()), 0U);
 }
 
 TEST_F(SafeStore, HasTheOldValueWhenItIsKilledBeforeTheRecordIsReplacedAndNoStrayFileAfterwards) {
@@ -427,12 +437,53 @@ TEST_F(SafeStore, TellsTheTruthOfOperationsThatItWasReleasedBefore) {
   put("a", "1");
   const Written written = watch(store->store("a", bytesOf("2")));
   const Written removed = watch(store->removeItem("b"));
+  const Fetched fetched = watch(store->fetch("a"));
+  const Written used = watch(store->updateLastAccessDate("c"));
   store.reset();
   settle();
-  EXPECT_THAT(told(written), HasSubstr("Store has been released."));
-  EXPECT_THAT(told(removed), HasSubstr("Store has been released."));
+  for (const std::string& answer : {told(written), told(removed), told(fetched), told(used)}) {
+    EXPECT_THAT(answer, HasSubstr("Store has been released."));
+  }
   open();
   EXPECT_EQ(get("a"), "1");
+}
+
+TEST_F(SafeStore, LeavesNoFileOfAWriteThatAQueueRefuses) {
+  open();
+  put("a", "1");
+  const Written written = watch(store->store("a", bytesOf("2")));
+  work().throwOnDispatch(true);
+  file().runNext();
+  work().throwOnDispatch(false);
+  settle();
+  EXPECT_EQ(told(written), "<error> The queue takes no tasks.");
+  EXPECT_THAT(valueFiles(), SizeIs(1));
+  EXPECT_EQ(get("a"), "1");
+}
+
+TEST_F(SafeStore, LeavesNoFileOfAWriteThatAQueueDrops) {
+  open();
+  put("a", "1");
+  const Written written = watch(store->store("a", bytesOf("2")));
+  file().runNext();
+  work().dropAll();
+  settle();
+  EXPECT_TRUE(isA<std::future_error>(written->failure));
+  EXPECT_THAT(valueFiles(), SizeIs(1));
+  EXPECT_EQ(get("a"), "1");
+}
+
+TEST_F(SafeStore, TellsThatAValueIsStoredThoughItsSizeCannotBeReported) {
+  options.inlineData = true;
+  open();
+  const Written written = watch(store->store("a", bytesOf("1")));
+  work().beforeDispatch = [&] { work().throwOnDispatch(true); };
+  const LogCapture log;
+  work().runNext();
+  work().beforeDispatch = nullptr;
+  work().throwOnDispatch(false);
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_TRUE(log.contains("could not report its size"));
 }
 
 TEST_F(SafeStore, FailsWhatWaitsWhenItIsInvalidated) {
@@ -831,6 +882,44 @@ TEST_F(SafeStore, SyncsFileAndDirectoryBeforeTheRecordWhenItIsSynced) {
   settle();
   EXPECT_TRUE(first->hasSucceeded());
   EXPECT_TRUE(second->hasSucceeded());
+}
+
+// The greatest number of a key's files is the latest value's, by whichever way it was stored.
+TEST_F(SafeStore, NumbersFilesInTheOrderOfTheirWrites) {
+  options.durability = Durability::Synced;
+  open();
+  std::vector<Written> written = {watch(store->store("other", bytesOf("1")))};
+  written.push_back(watch(store->store("a", nullptr, writing("older", 5))));
+  written.push_back(watch(store->store("a", bytesOf("newer"))));
+  file().runNext();
+  file().runNext();
+  file().runNext();
+  for (const std::string& name : valueFiles()) {
+    if (name.rfind("a.", 0) != 0) continue;
+    EXPECT_EQ(valueFile(name), name.rfind("a.2.", 0) == 0 ? "older" : "newer") << name;
+  }
+  settle();
+  for (const Written& one : written) EXPECT_EQ(told(one), "<done>");
+  EXPECT_EQ(get("a"), "newer");
+}
+
+TEST_F(SafeStore, NumbersFilesInTheOrderOfTheirWritesBesideOtherThreads) {
+  options.durability = Durability::Synced;
+  open();
+  std::vector<Written> written;
+  file().beforeDispatch = [&] {
+    const auto self = std::exchange(file().beforeDispatch, nullptr);
+    written.push_back(watch(store->store("other", bytesOf("1"))));
+  };
+  written.push_back(watch(store->store("a", bytesOf("older"))));
+  written.push_back(watch(store->store("a", bytesOf("newer"))));
+  file().runAll();
+  std::map<std::string, std::string> values;
+  for (const std::string& name : valueFiles()) values[name.substr(0, name.rfind('.'))] = valueFile(name);
+  EXPECT_EQ(values, (Contents{{"a.2", "older"}, {"a.3", "newer"}, {"other.1", "1"}}));
+  settle();
+  for (const Written& one : written) EXPECT_EQ(told(one), "<done>");
+  EXPECT_EQ(get("a"), "newer");
 }
 
 TEST_F(SafeStore, FailsAWriteThatCannotBeSynced) {

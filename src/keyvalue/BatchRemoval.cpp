@@ -56,18 +56,30 @@ void BatchRemoval::deleteThenStep(const Items& batch, const Provider& provider, 
   for (const DiskCacheItem& item : batch) {
     if (auto path = files_.fileOf(item)) paths.push_back(std::move(*path));
   }
-  const auto goOn = [weakThis = context_.weak(*this), provider, onSuccess, onError](std::future<void>& deleted) {
+  const auto goOn = [weakThis = context_.weak(*this), provider, onSuccess, onError](const std::exception_ptr& failure) {
     const auto self = weakThis.lock();
     if (self == nullptr) return;
     try {
-      deleted.get();
+      if (failure != nullptr) std::rethrow_exception(failure);
     } catch (const std::exception& error) {
       if (onError) onError(error);
       return;
     }
     self->step(provider, onSuccess, onError);
   };
-  deleteFiles(paths).then(context_.workQueue, goOn);
+  deleteFiles(paths).then(nullptr, [queue = context_.workQueue, goOn, onError](std::future<void>& deleted) {
+    std::exception_ptr failure;
+    try {
+      deleted.get();
+    } catch (...) {
+      failure = std::current_exception();
+    }
+    try {
+      queue->dispatch([goOn, failure] { goOn(failure); });
+    } catch (const std::exception& error) {
+      if (onError) onError(error);
+    }
+  });
 }
 
 Future<void> BatchRemoval::deleteFiles(const std::vector<std::string>& paths) {

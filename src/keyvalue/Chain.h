@@ -5,27 +5,22 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-// Which operation comes right behind which, so that whoever runs one of them can do work of the next ones as well. Any
-// thread may call. Operations that threads hand over at the same time may stand on the queue in another order than here;
-// those of one thread are in their order in both.
+// Which operation comes right behind which on a queue, so that whoever runs one of them can do work of the next ones as
+// well. Any thread may call.
 template <class Operation> class Chain {
  public:
   // What an operation derives from.
   class Link {
     friend class Chain;
-    std::weak_ptr<Operation> previous_;
     std::weak_ptr<Operation> next_;
   };
 
-  // To be called before the operation is handed to the queue.
+  // To be called before the operation is handed to the queue, and `cutUnlessLast` afterwards.
   void append(const std::shared_ptr<Operation>& operation) {
     std::shared_ptr<Operation> last;  // released without the mutex
     const std::lock_guard<std::mutex> lock(mutex_);
     last = last_.lock();
-    if (last != nullptr) {
-      static_cast<Link&>(*last).next_ = operation;
-      static_cast<Link&>(*operation).previous_ = last;
-    }
+    if (last != nullptr) static_cast<Link&>(*last).next_ = operation;
     last_ = operation;
   }
 
@@ -35,11 +30,14 @@ template <class Operation> class Chain {
     last_.reset();
   }
 
-  // Null when there is none, or none any more.
-  std::shared_ptr<Operation> before(const Operation& operation) {
+  // The same when something else came after the operation while it was being handed to the queue, where it may stand
+  // behind that now: what is appended later must not be done before it.
+  void cutUnlessLast(const std::shared_ptr<Operation>& operation) {
     const std::lock_guard<std::mutex> lock(mutex_);
-    return static_cast<const Link&>(operation).previous_.lock();
+    if (last_.lock() != operation) last_.reset();
   }
+
+  // Null when there is none.
   std::shared_ptr<Operation> after(const Operation& operation) {
     const std::lock_guard<std::mutex> lock(mutex_);
     return static_cast<const Link&>(operation).next_.lock();

@@ -24,6 +24,7 @@ Future<void> FileQueue::run(std::function<void()> task) {
 void FileQueue::dispatchWrite(const std::shared_ptr<FileWrite>& write, std::function<void()> task) {
   writes_.append(write);
   queue_->dispatch(std::move(task));
+  writes_.cutUnlessLast(write);
 }
 
 std::shared_ptr<FileWrite> FileQueue::next(const std::vector<std::shared_ptr<FileWrite>>& group) {

@@ -18,38 +18,11 @@ constexpr std::size_t kMaxGroupBytes = std::size_t{128} << 10U;  // a first chan
 
 }  // namespace
 
-std::exception_ptr GroupCommit::storeIsGone() {
-  return std::make_exception_ptr(InvalidatedException("Store has been released."));
-}
-
 // The task of a change. Does nothing when an earlier one has run it.
 void GroupCommit::run(const std::shared_ptr<ManifestChange>& change) {
-  std::exception_ptr failure;  // of a callback of another's
-  while (!change->isTaken()) {
-    try {
-      runFrom(firstWaiting(change));
-    } catch (...) {
-      failure = std::current_exception();
-    }
-  }
-  if (failure != nullptr) std::rethrow_exception(failure);
-}
-
-// What another thread was about to hand over when this change came may stand behind it on the queue. It goes first: the
-// group would overtake it otherwise, and so would a later change of that thread.
-std::shared_ptr<ManifestChange> GroupCommit::firstWaiting(const std::shared_ptr<ManifestChange>& change) {
-  auto first = change;
-  for (auto previous = workQueue_.previous(*first); previous != nullptr && !previous->isTaken();
-       previous = workQueue_.previous(*first)) {
-    first = std::move(previous);
-  }
-  return first;
-}
-
-void GroupCommit::runFrom(const std::shared_ptr<ManifestChange>& first) {
-  if (!first->take()) return;
-  if (workQueue_.next(*first) == nullptr) return first->runAlone();
-  const Group group = groupBehind(first);
+  if (!change->take()) return;
+  if (workQueue_.next(*change) == nullptr) return change->runAlone();
+  const Group group = groupBehind(change);
   const bool isCommitted = group.size() > 1 && commit(group);
   std::exception_ptr failure;  // of a callback: the executor's affair, but not the other changes'
   for (const auto& member : group) {

@@ -37,9 +37,6 @@ class GroupCommit {
     workQueue_.dispatchChangeHere(change, taskOf(change));
   }
 
-  // Of an operation on a safe store that was released before.
-  static std::exception_ptr storeIsGone();
-
  private:
   using Group = std::vector<std::shared_ptr<ManifestChange>>;
 
@@ -48,14 +45,12 @@ class GroupCommit {
       if (const auto owner = change->owner.lock()) {  // whoever locks it keeps this alive, too
         run(change);
       } else if (change->take()) {
-        isSafe ? change->promise.setException(storeIsGone()) : change->promise.setValue();
+        isSafe ? change->promise.setException(StoreContext::storeIsGone()) : change->promise.setValue();
       }
     };
   }
 
   void run(const std::shared_ptr<ManifestChange>& change);
-  std::shared_ptr<ManifestChange> firstWaiting(const std::shared_ptr<ManifestChange>& change);
-  void runFrom(const std::shared_ptr<ManifestChange>& first);
   Group groupBehind(const std::shared_ptr<ManifestChange>& first);
   bool commit(const Group& group);
   static void note(const StoreLock& lock, ManifestChange& change);

@@ -43,7 +43,9 @@ void Leftovers::removeAmong(const Files& files, std::vector<std::string> unfinis
       if (named.count(name) == 0) leftovers.push_back(std::move(name));
     }
     const Files unknown = withoutRecord(named, files, leftovers);
-    if (unknown.empty() || isManifestSound()) {
+    const bool isSound = unknown.empty() || isManifestSound();
+    if (!isSound && context_.fileDeletion.use_count() > 1) return remove();  // theirs are removed, but not deleted yet
+    if (isSound) {
       for (const auto& file : unknown) leftovers.push_back(file.name);
     } else {
       manifest_.recover(lock, ManifestCorruptedException("There are files without a record.", 0));

@@ -20,7 +20,6 @@ class ManifestChange : public Chain<ManifestChange>::Link {
 
   // True for the first who asks: to be run by the caller.
   bool take() { return !isTaken_.exchange(true); }
-  bool isTaken() const { return isTaken_; }
 
   // Of the value that it puts into the manifest.
   virtual std::size_t bytes() const { return 0; }

@@ -13,6 +13,7 @@
 #include "keyvalue/FileQueue.h"
 #include "keyvalue/GroupCommit.h"
 #include "keyvalue/ItemRemover.h"
+#include "keyvalue/StoreLog.h"
 #include "keyvalue/StoreManifest.h"
 #include "keyvalue/ValueFiles.h"
 #include "keyvalue/VersionedFiles.h"
@@ -62,6 +63,7 @@ struct ReplacingWrites::Write final : ManifestChange, Chain<Write>::Link, std::e
   std::unique_ptr<DiskCacheItem> replaced;   // by it
   std::optional<std::uint32_t> total;        // of all items with this one, to report
   std::vector<std::string> filesToDelete{};  // paths
+  bool mayBeInLog = false;                   // the record, though it is not recorded
 
   Write(const std::string& key_, std::vector<unsigned char> value_, PersistentKeyValueStore::Writer writer_,
         Metadata metadata_, std::weak_ptr<ReplacingWrites> owner_, Token operation_)
@@ -72,11 +74,23 @@ struct ReplacingWrites::Write final : ManifestChange, Chain<Write>::Link, std::e
         owner(std::move(owner_)),
         operation(std::move(operation_)) {}
 
+  Write(const Write&) = delete;
+  Write& operator=(const Write&) = delete;
+
+  // Gives up the file of one that a queue has refused or dropped.
+  ~Write() override {
+    if (filename.empty() || isRecorded) return;
+    if (const auto self = owner.lock()) self->giveUpFile(*this);
+  }
+
   std::size_t bytes() const override { return filename.empty() ? value.size() : 0; }
 
   // Whoever runs a write holds the store.
   void runAlone() override { owner.lock()->replaceAlone(*this); }
-  void change(const StoreLock& lock) override { owner.lock()->replaceRecord(lock, *this); }
+  void change(const StoreLock& lock) override {
+    mayBeInLog = true;  // should the commit fail
+    owner.lock()->replaceRecord(lock, *this);
+  }
   void note(const StoreLock& lock) override { owner.lock()->noteReplaced(lock, *this); }
   void finish() override { owner.lock()->fulfil(*this); }
 };
@@ -101,11 +115,12 @@ Future<void> ReplacingWrites::begin(const std::shared_ptr<Write>& write) {
   try {
     context_.throwIfInvalid();
     write->passage = workQueue_.enterBehind(KeyRange(write->key));
-    if (!write->writer) writes_.append(write);
+    writes_.append(write);
     fileQueue_.dispatch([write] {
       if (const auto self = write->owner.lock()) return self->writeFiles(write);
-      write->promise.setException(GroupCommit::storeIsGone());
+      write->promise.setException(StoreContext::storeIsGone());
     });
+    writes_.cutUnlessLast(write);
   } catch (...) {
     write->promise.setException(std::current_exception());
   }
@@ -132,7 +147,7 @@ ReplacingWrites::Writes ReplacingWrites::takeBehind(const std::shared_ptr<Write>
   std::uint64_t bytes = first->value.size();
   while (writes.size() < kMaxGroupSize && bytes < kMaxGroupBytes) {
     auto next = writes_.after(*writes.back());
-    if (next == nullptr || next->isWritten) break;
+    if (next == nullptr || next->isWritten || next->writer) break;
     bytes += next->value.size();
     writes.push_back(std::move(next));
   }
@@ -143,6 +158,7 @@ void ReplacingWrites::writeFile(Write& write) {
   write.isWritten = true;
   try {
     context_.throwIfInvalid();
+    manifest_.get();  // a file without any manifest would look, after a kill, as if the manifest had been lost
     auto written = write.writer ? versions_.write(write.key, write.writer) : versions_.write(write.key, write.value);
     write.filename = std::move(written.name);
     write.size = written.size;
@@ -159,6 +175,7 @@ void ReplacingWrites::sync(const Writes& writes) {
       if (write->failure == nullptr) work(*write);
     }
   };
+  if (writes.size() > 1) ofEach([&](const Write& write) { versions_.beginSync(write.filename); });
   ofEach([&](Write& write) {
     try {
       versions_.sync(write.filename);
@@ -225,24 +242,26 @@ void ReplacingWrites::noteReplaced(const StoreLock& lock, Write& write) {
 
 void ReplacingWrites::fulfil(Write& write) {
   if (write.failure != nullptr) {
+    write.mayBeInLog = write.mayBeInLog || mayBeInLog(write.failure);
     giveUpFile(write);
     return write.promise.setException(write.failure);
   }
   deleteFiles(std::move(write.filesToDelete));
   try {
     if (write.total) manifest_.dispatchReport(*write.total);
-  } catch (...) {
-    return write.promise.setException(std::current_exception());
+  } catch (const std::exception& error) {  // the value is stored all the same
+    errorLine(__LINE__).stream() << "Store \"" << context_.options.name
+                                 << "\" could not report its size: " << error.what();
   }
   write.promise.setValue();
 }
 
 // When writing the manifest has failed, the row may be in its log all the same, and be found there at the next start:
 // the file stays until the log has gone on.
-void ReplacingWrites::giveUpFile(const Write& write) {
+void ReplacingWrites::giveUpFile(Write& write) {
   if (write.filename.empty() || write.isRecorded) return;
-  const std::string path = files_.pathOf(write.filename);
-  if (!mayBeInLog(write.failure)) return deleteFiles({path});
+  const std::string path = files_.pathOf(std::exchange(write.filename, {}));
+  if (!write.mayBeInLog) return deleteFiles({path});
   const StoreLock lock = context_.lock();
   doubtfulFiles_.push_back(path);
 }

@@ -54,7 +54,7 @@ class ReplacingWrites final : public WritePath {
   void replaceRecord(const StoreLock& lock, Write& write);
   void noteReplaced(const StoreLock& lock, Write& write);
   void fulfil(Write& write);
-  void giveUpFile(const Write& write);
+  void giveUpFile(Write& write);
   void deleteFiles(std::vector<std::string> paths);
 
   StoreContext& context_;

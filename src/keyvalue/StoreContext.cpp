@@ -50,4 +50,8 @@ void StoreContext::throwIfClosed() const {
   if (isClosed) throwIfInvalid();
 }
 
+std::exception_ptr StoreContext::storeIsGone() {
+  return std::make_exception_ptr(InvalidatedException("Store has been released."));
+}
+
 }  // namespace velmora::mobile::xplat::cellar

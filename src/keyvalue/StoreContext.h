@@ -84,6 +84,9 @@ class StoreContext {
   void throwIfInvalid() const;
   void throwIfClosed() const;
 
+  // Of an operation on a safe store that was released before.
+  static std::exception_ptr storeIsGone();
+
   bool isCache() const { return store_.isPrunable(); }
   bool isSafe() const { return options.durability != Durability::Relaxed; }
 

@@ -40,24 +40,29 @@ struct ValueFetcher::Fetch {
   const std::weak_ptr<ValueFetcher> fetcher;
   const Token operation;
   std::shared_ptr<const DiskCacheItem> item;  // once it is found
+  const bool isSafe;
   Promise<Fetched> promise;
 
-  Fetch(std::vector<std::string> keys_, Loader loader_, std::weak_ptr<ValueFetcher> fetcher_, Token operation_)
+  Fetch(std::vector<std::string> keys_, Loader loader_, std::weak_ptr<ValueFetcher> fetcher_, Token operation_,
+        bool isSafe_)
       : keys(std::move(keys_)),
         loader(std::move(loader_)),
         fetcher(std::move(fetcher_)),
-        operation(std::move(operation_)) {}
+        operation(std::move(operation_)),
+        isSafe(isSafe_) {}
+
+  void endWithoutStore() { isSafe ? promise.setException(StoreContext::storeIsGone()) : promise.setValue(nullptr); }
 };
 
 Future<ValueFetcher::Fetched> ValueFetcher::fetchFirst(std::vector<std::string> keys, Loader loader) {
-  const auto fetch =
-      std::make_shared<Fetch>(std::move(keys), std::move(loader), context_.weak(*this), context_.operation);
+  const auto fetch = std::make_shared<Fetch>(std::move(keys), std::move(loader), context_.weak(*this),
+                                             context_.operation, context_.isSafe());
   Future<Fetched> future = fetch->promise.getFuture();
   workQueue_.dispatch(KeyRange(fetch->keys), fetch->promise, [fetch] {
     if (const auto self = fetch->fetcher.lock()) {
       self->find(fetch);
     } else {
-      fetch->promise.setValue(nullptr);
+      fetch->endWithoutStore();
     }
   });
   return future;
@@ -79,7 +84,7 @@ void ValueFetcher::find(const std::shared_ptr<Fetch>& fetch) {
         if (const auto self = fetch->fetcher.lock()) {
           self->load(*fetch);
         } else {
-          fetch->promise.setValue(nullptr);
+          fetch->endWithoutStore();
         }
       });
       return;
@@ -144,6 +149,7 @@ bool ValueFetcher::hasLostItem(const DiskCacheItem& item) {
     const auto current = manifest_.lookUp(lock, KeyRange(item.key));
     if (current == nullptr) return true;
     if (context_.isSafe()) return current->filename != item.filename;
+    if (current->hasInlineData != item.hasInlineData) return true;
     return writes_.contains(item.key) && !context_.files->pathExists(files_.pathOf(item.filename));
   } catch (const std::exception&) {
     return false;
@@ -241,12 +247,15 @@ std::optional<std::int32_t> ValueFetcher::modificationDate(const std::string& ke
 Future<void> ValueFetcher::updateLastAccessDate(const std::string& key) {
   const auto promise = std::make_shared<Promise<void>>();
   Future<void> future = promise->getFuture();
-  workQueue_.dispatch(KeyRange(key), *promise,
-                      [weakThis = context_.weak(*this), operation = context_.operation, key, promise] {
-                        settle(*promise, [&] {
-                          if (const auto self = weakThis.lock()) self->noteAccess(key);
-                        });
-                      });
+  workQueue_.dispatch(
+      KeyRange(key), *promise,
+      [weakThis = context_.weak(*this), operation = context_.operation, key, promise, isSafe = context_.isSafe()] {
+        settle(*promise, [&] {
+          const auto self = weakThis.lock();
+          if (self != nullptr) return self->noteAccess(key);
+          if (isSafe) std::rethrow_exception(StoreContext::storeIsGone());
+        });
+      });
   return future;
 }
 

@@ -129,6 +129,8 @@ VersionedFiles::Written VersionedFiles::write(const std::string& key, const Pers
   }
 }
 
+void VersionedFiles::beginSync(const std::string& name) { context_.files->beginSync(pathOf(name)); }
+
 void VersionedFiles::sync(const std::string& name) { context_.files->sync(pathOf(name)); }
 
 void VersionedFiles::syncDirectory() { syncOrGiveUp(*context_.files, context_.options.directory); }

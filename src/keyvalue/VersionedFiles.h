@@ -49,7 +49,8 @@ class VersionedFiles {
   // The store's own, which somebody may have removed. In a synced store it outlives a power cut.
   void createDirectory();
 
-  // Makes a file that was written, and the names of all, outlive a power cut.
+  // Makes a file that was written, and the names of all, outlive a power cut. Of several files each is begun first.
+  void beginSync(const std::string& name);
   void sync(const std::string& name);
   void syncDirectory();
 

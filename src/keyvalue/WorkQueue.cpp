@@ -28,6 +28,7 @@ void WorkQueue::dispatchBehindAll(std::function<void()> task, std::function<void
 void WorkQueue::append(const std::shared_ptr<ManifestChange>& change, std::function<void()> task) {
   changes_.append(change);
   context_.workQueue->dispatch(std::move(task));
+  changes_.cutUnlessLast(change);
 }
 
 // A task finds out for itself that the store is gone.

@@ -67,8 +67,7 @@ class WorkQueue {
 
   void throwIfRefused(KeyRange keys) const;
 
-  // The changes right before and behind; null when there is none.
-  std::shared_ptr<ManifestChange> previous(const ManifestChange& change) { return changes_.before(change); }
+  // The change right behind; null when there is none.
   std::shared_ptr<ManifestChange> next(const ManifestChange& change) { return changes_.after(change); }
 
  private:
