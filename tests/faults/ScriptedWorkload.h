@@ -43,7 +43,7 @@ class ScriptedWorkload {
   };
 
   // Under `root`, with stores of that durability: of safe ones no value may be lost, whatever fails, and none is
-  // discarded.
+  // discarded. Only of what SQLite has not been shown values may vanish, which is counted.
   ScriptedWorkload(const std::string& root, FaultMode mode, Durability durability = Durability::Relaxed);
   ScriptedWorkload(const ScriptedWorkload&) = delete;
   ScriptedWorkload& operator=(const ScriptedWorkload&) = delete;
@@ -66,6 +66,9 @@ class ScriptedWorkload {
 
   // How many times so far a store has been discarded for its manifest.
   std::size_t discards() const;
+
+  // How many fetches so far have missed a value that SQLite has lost without knowing.
+  std::size_t silentlyMissing() const { return silentlyMissing_; }
 
   bool isInTrouble = false;  // by a fault that neither of the two below knows of
   FaultyVfs vfs;
@@ -137,6 +140,7 @@ class ScriptedWorkload {
   std::map<std::string, std::size_t> purges_;            // of this process, by store
   std::map<std::string, std::size_t> linesBeforeStart_;  // that reported a purge, by store
   std::size_t complaints_ = 0;                           // exceptions and failed futures
+  std::size_t silentlyMissing_ = 0;
   bool mayThrow_ = false;  // a manifest is being loaded: its task passes on what is not damage
   int freshVersion_ = 100;
   std::unique_ptr<Process> process_;
