@@ -78,7 +78,7 @@ Figures measureCase(const Context& context, const Place& place, const Case& what
 }
 
 void measureDown(const Context& context, const Place& place) {
-  const std::size_t items = context.scaled<std::size_t>(40'000, 10'000);
+  const std::size_t items = context.scaled<std::size_t>(15'000, 10'000);
   const Case what{items, items / 10 * 9, items};
   const Figures figures = measureCase(context, place, what, context.scaled(3, 1));
   const std::string name = countName(items) + " items down to " + countName(items / 10);
@@ -86,7 +86,7 @@ void measureDown(const Context& context, const Place& place) {
 }
 
 void measureAll(const Context& context, const Place& place) {
-  const std::size_t items = context.scaled<std::size_t>(40'000, 5'000);
+  const std::size_t items = context.scaled<std::size_t>(15'000, 5'000);
   for (const auto& [name, remove] : {std::pair<std::string, Removal>("clearing ", &StoreUnderTest::clear),
                                      std::pair<std::string, Removal>("expiring ", &StoreUnderTest::expireAll)}) {
     const Figures figures = measureCase(context, place, {items, items, items, remove}, context.scaled(3, 1));
@@ -98,7 +98,7 @@ void measureAll(const Context& context, const Place& place) {
 void measureGrowth(const Context& context, const Place& place) {
   constexpr std::size_t few = 10'000;
   const std::size_t many = context.scaled<std::size_t>(1'000'000, 100'000);
-  const std::size_t pruned = context.scaled<std::size_t>(5'000, 1'000);
+  const std::size_t pruned = context.scaled<std::size_t>(2'000, 1'000);
   Plot plot{"prune", "Pruning: cost of an item", "items in the store", "microseconds"};
   Figures first;
   Figures last;
