@@ -176,8 +176,7 @@ double removing(const Place& place, std::size_t files) {
 }
 
 void measureTrash(const Context& context, const Place& place) {
-  const std::size_t files = context.scaled<std::size_t>(100'000, 10'000);
-  for (const std::size_t count : {files / 1000, files / 10}) {
+  for (const std::size_t count : {std::size_t{100}, context.scaled<std::size_t>(10'000, 1'000)}) {
     const Scratch scratch(place);
     const Figures figures = interleaved(
         place,
@@ -186,6 +185,7 @@ void measureTrash(const Context& context, const Place& place) {
     const std::string name = "collectPath of " + countName(count) + " files";
     context.report.add(Row{name, place.name, cpuName(false), "us", figures, {{"", 50}}});
   }
+  const std::size_t files = context.scaled<std::size_t>(40'000, 10'000);
   const Figures figures = interleaved(
       place, {{"ours", [&] { return emptying(place, files); }}, {"rm -rf", [&] { return removing(place, files); }}},
       context.scaled(3, 3), 0);
