@@ -86,6 +86,7 @@ class FaultSweep : public testing::Test {
     std::cout << faults.name << ": " << met << " faults in " << runs << " runs\n";
     if (faults.mode == ScriptedWorkload::FaultMode::SilentLoss) {
       std::cout << "  in " << runsWithSilentLoss << " runs values were missing of which SQLite had lost the rows\n";
+      EXPECT_LE(runsWithSilentLoss, 2U);  // where it takes its log for shorter than it is
     }
     RecordProperty("faults", std::to_string(met));
     if (faults.mode != ScriptedWorkload::FaultMode::ManyFaults) lookAt(places, faults.mode);
