@@ -372,7 +372,7 @@ void FileUtils::sync(const string& path) {
 
 void FileUtils::beginSync(const string& path) noexcept {
 #if defined(SYNC_FILE_RANGE_WRITE) && (!defined(__ANDROID_API__) || __ANDROID_API__ >= 26)
-  const int file = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  const int file = ::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
   if (file < 0) return;
   (void)::sync_file_range(file, 0, 0, SYNC_FILE_RANGE_WRITE);  // up to the end
   (void)::close(file);
