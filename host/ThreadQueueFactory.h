@@ -9,17 +9,21 @@
 
 namespace velmora::mobile::xplat::cellar::host {
 
-// Serial queues with one thread each, for applications that have no queues of their own. Threads are named after their
-// role and number ("cellar-file-1", "cellar-work-2") where the system supports it; one more thread ("cellar-timer")
-// serves the timers of all queues. Any thread may call, and a queue may be used from its own tasks.
+// Serial queues on a few threads, for applications that have no queues of their own. However many queues there are, the
+// threads are one for each processor that the creating thread may use, named "cellar-1", "cellar-2" and so on, one more
+// because tasks wait for the disk, and one for all timers ("cellar-timer"). Any thread may call, and a queue may be used
+// from its own tasks.
 //
-// Queues: tasks of one queue run one at a time in the order of dispatch. An exception that leaves a task is one error
-// line in the log, and the queue continues. A queue whose last reference is released runs what was dispatched and then
-// ends its thread; releasing never waits, so a task may release its own queue. Queues may outlive the factory: they are
-// closed then.
+// Queues: tasks of one queue run one at a time in the order of dispatch, each time on any of the threads. An exception
+// that leaves a task is one error line in the log, which names the queue ("cellar-file-1", "cellar-work-2"), and the
+// queue continues. A queue whose last reference is released runs what was dispatched; releasing never waits, so a task
+// may release its own queue. Queues may outlive the factory: they are closed then.
 //
-// A thread without tasks sleeps; if tasks follow each other closely, it first spins for up to 200 microseconds. On
-// Linux the threads run as SCHED_BATCH, so that waking one does not preempt its waker.
+// What a task dispatches to other queues at its end runs on the same thread next; no other thread is woken for it. So a
+// task must not wait for what it has dispatched itself, and a task that takes long takes a thread from all queues.
+//
+// A thread without tasks sleeps. If tasks follow each other closely, one thread first looks out for the next for up to
+// 100 microseconds. On Linux the threads run as SCHED_BATCH, so that waking one does not preempt its waker.
 //
 // Timers: `dispatchAfter` and `scheduleAfter` both fire once, on their queue. A delay of 0 or less is due at once; a
 // delay beyond the range of the clock never ends. Companions are ignored. When the handle's destructor returns, the
@@ -33,7 +37,7 @@ namespace velmora::mobile::xplat::cellar::host {
 // `refuseNewWork` and `drain`.
 class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
  public:
-  // Starts the timer thread. Throws `std::system_error` if the system cannot start a thread.
+  // Starts the threads. Throws `std::system_error` if the system cannot start one.
   ThreadQueueFactory();
 
   // As `shutDown`; on a thread of its own (a task held the last reference) as `abandon`.
@@ -42,8 +46,7 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   ThreadQueueFactory(const ThreadQueueFactory&) = delete;
   ThreadQueueFactory& operator=(const ThreadQueueFactory&) = delete;
 
-  // A new queue, with a thread of the file or of the work role. After closing, a closed queue. Throws
-  // `std::system_error` if the system cannot start a thread.
+  // A new queue, which is one object and no thread. After closing, a closed queue.
   std::shared_ptr<AsyncExecutor> createQueue() override;
   std::shared_ptr<AsyncExecutor> createWorkQueue() override;
 

@@ -1,0 +1,193 @@
+#include "host/queues/ThreadPool.h"
+
+#include <algorithm>
+#include <utility>
+
+#include "host/queues/Deadline.h"
+
+#if defined(__linux__)
+#include <pthread.h>
+#include <sched.h>
+#endif
+
+namespace velmora::mobile::xplat::cellar::host {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// The longest search for work before a thread sleeps. To wake one takes some tens of microseconds, longer than most
+// tasks, and whoever fetches one value after another comes back within this time.
+constexpr std::chrono::microseconds kLongestSearch(100);
+
+// The pool that this thread works for. Its threads keep a pool alive, so its address cannot be reused meanwhile.
+thread_local const ThreadPool* currentPool = nullptr;
+thread_local bool goesOnWithNextWork = false;
+
+// Background work must not delay its callers: a batch thread does not preempt the thread that wakes it. If the system
+// refuses, that is ignored.
+void becomeBackgroundThread(const std::string& name) {
+#if defined(__linux__)
+  const sched_param noPriority{};
+  (void)pthread_setschedparam(pthread_self(), SCHED_BATCH, &noPriority);
+  constexpr std::size_t longest = 15;  // bytes that the system allows
+  pthread_setname_np(pthread_self(), name.substr(0, longest).c_str());
+#else
+  static_cast<void>(name);
+#endif
+}
+
+// The number of processors that this thread may use; the machine may have more.
+std::size_t processorsOfThisThread() {
+#if defined(__linux__)
+  cpu_set_t processors;
+  if (sched_getaffinity(0, sizeof(processors), &processors) == 0) {
+    return static_cast<std::size_t>(CPU_COUNT(&processors));
+  }
+#endif
+  return std::max(std::thread::hardware_concurrency(), 1U);
+}
+
+}  // namespace
+
+ThreadPool::ThreadPool() : hasOtherProcessors_(processorsOfThisThread() > 1) {}
+
+std::shared_ptr<ThreadPool> ThreadPool::start(const std::function<void()>& timers) {
+  const std::shared_ptr<ThreadPool> pool(new ThreadPool());
+  const std::size_t workers = processorsOfThisThread() + 1;
+  try {
+    for (std::size_t number = 1; number <= workers; ++number) {
+      pool->startThread("cellar-" + std::to_string(number), [&pool = *pool] { pool.runWork(); });
+    }
+    pool->startThread("cellar-timer", timers);
+  } catch (...) {
+    pool->close();
+    pool->join();
+    throw;
+  }
+  return pool;
+}
+
+void ThreadPool::startThread(std::string name, std::function<void()> function) {
+  threads_.emplace_back([pool = shared_from_this(), name = std::move(name), function = std::move(function)] {
+    currentPool = pool.get();
+    becomeBackgroundThread(name);
+    function();
+  });
+}
+
+// ---- tasks
+
+bool ThreadPool::admitTask() {
+  ++unfinishedTasks_;
+  if (!isClosed_ && (!isClosedToOthers_ || isOwnThread())) return true;
+  taskEnds();
+  return false;
+}
+
+void ThreadPool::taskEnds() {
+  if (--unfinishedTasks_ > 0) return;
+  stopIfIdle();
+  const std::lock_guard<std::mutex> lock(idleMutex_);
+  idle_.notify_all();
+}
+
+bool ThreadPool::waitUntilIdle(Clock::time_point deadline) {
+  std::unique_lock<std::mutex> lock(idleMutex_);
+  while (unfinishedTasks_ > 0) {
+    if (Clock::now() >= deadline) return false;
+    idle_.wait_until(lock, cappedDeadline(deadline));
+  }
+  return true;
+}
+
+bool ThreadPool::isOwnThread() const { return currentPool == this; }
+
+bool ThreadPool::isThreadOfAnyPool() { return currentPool != nullptr; }
+
+// ---- work
+
+void ThreadPool::isAboutToBeFree(bool isFree) { goesOnWithNextWork = isFree; }
+
+void ThreadPool::schedule(std::shared_ptr<Work> work) {
+  const bool isForThisThread = isOwnThread() && std::exchange(goesOnWithNextWork, false);
+  std::unique_lock<std::mutex> lock(mutex_);
+  ready_.push_back(std::move(work));
+  hasReadyWork_ = true;
+  if (!isForThisThread && !isSearching_) wakeOne(lock);
+}
+
+// Releases the lock.
+void ThreadPool::wakeOne(std::unique_lock<std::mutex>& lock) {
+  if (sleepers_ == 0) return lock.unlock();
+  searchPays_ = hasOtherProcessors_ && Clock::now() - fellAsleep_ < kLongestSearch;
+  lock.unlock();
+  changed_.notify_one();
+}
+
+void ThreadPool::runWork() {
+  while (const std::shared_ptr<Work> work = take()) work->run();
+}
+
+// Waits for work. Null when the pool has stopped.
+std::shared_ptr<ThreadPool::Work> ThreadPool::take() {
+  search();
+  std::unique_lock<std::mutex> lock(mutex_);
+  while (ready_.empty()) {
+    if (isStopped_) return nullptr;
+    ++sleepers_;
+    fellAsleep_ = Clock::now();
+    changed_.wait(lock);
+    --sleepers_;
+  }
+  std::shared_ptr<Work> work = std::move(ready_.front());
+  ready_.pop_front();
+  hasReadyWork_ = !ready_.empty();
+  // Whoever scheduled the rest may have left it to this thread's search.
+  if (hasReadyWork_) wakeOne(lock);
+  return work;
+}
+
+// One thread at a time looks out for work a little longer before it sleeps, as long as that is found to pay.
+void ThreadPool::search() {
+  if (!searchPays_ || hasReadyWork_ || isSearching_.exchange(true)) return;
+  const Clock::time_point end = Clock::now() + kLongestSearch;
+  while (!hasReadyWork_ && searchPays_) {
+    std::this_thread::yield();  // the thread that will schedule may need the processor
+    if (Clock::now() >= end) searchPays_ = false;
+  }
+  isSearching_ = false;
+}
+
+// ---- closing
+
+void ThreadPool::close() {
+  isClosed_ = true;
+  stopIfIdle();
+}
+
+void ThreadPool::stopIfIdle() {
+  if (!isClosed_ || unfinishedTasks_ > 0) return;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    isStopped_ = true;
+    searchPays_ = false;
+  }
+  changed_.notify_all();
+}
+
+void ThreadPool::join() {
+  const std::lock_guard<std::mutex> lock(joinMutex_);
+  for (std::thread& thread : takeThreads()) thread.join();
+}
+
+void ThreadPool::detach() {
+  for (std::thread& thread : takeThreads()) thread.detach();
+}
+
+std::vector<std::thread> ThreadPool::takeThreads() {
+  const std::lock_guard<std::mutex> lock(threadsMutex_);
+  return std::exchange(threads_, {});
+}
+
+}  // namespace velmora::mobile::xplat::cellar::host
