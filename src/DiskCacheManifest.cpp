@@ -3,7 +3,6 @@
 #include <glog/logging.h>
 
 #include <exception>
-#include <iterator>
 #include <string_view>
 #include <unordered_set>
 #include <utility>
@@ -12,6 +11,7 @@
 #include "LarderException.h"
 #include "SQLiteManifestPersistence.h"
 #include "base/StoreTime.h"
+#include "manifest/AccessDates.h"
 #include "manifest/ManifestRecords.h"
 #include "manifest/ManifestUndo.h"
 
@@ -20,7 +20,6 @@ namespace velmora::mobile::xplat::cellar {
 namespace {
 
 constexpr std::int64_t kFlushIntervalNanoseconds = 120'000'000'000;
-constexpr std::size_t kMaxPendingAccessDates = 512;
 
 // A key with two rows has a damaged index, by which its former row was not found when it was replaced.
 void throwIfAmbiguous(const std::vector<std::unique_ptr<DiskCacheItem>>& records) {
@@ -51,11 +50,13 @@ DiskCacheManifest::DiskCacheManifest(std::unique_ptr<ManifestPersistence> persis
     : persistence_(std::move(persistence)),
       executor_(std::move(executor)),
       records_(std::make_unique<ManifestRecords>(std::move(strategy))),
-      time_(durability == Durability::Relaxed ? nullptr : std::make_unique<StoreTime>()) {}
+      time_(durability == Durability::Relaxed ? nullptr : std::make_unique<StoreTime>()),
+      accessDates_(
+          std::make_unique<AccessDates>(*persistence_, *records_, itemsMutex_, durability != Durability::Relaxed)) {}
 
 DiskCacheManifest::~DiskCacheManifest() {
   try {
-    flush();
+    accessDates_->flush();
   } catch (...) {
     LOG(ERROR) << "Could not write access dates as the manifest was destroyed.";
   }
@@ -65,9 +66,8 @@ void DiskCacheManifest::clear() {
   const std::lock_guard<std::mutex> loadLock(loadMutex_);
   const ItemsLock lock(itemsMutex_);
   records_->clear();
-  pendingAccessDates_.clear();
+  accessDates_->clear(lock);
   persistence_->clearItems();
-  hasFlushFailed_ = false;
   loaded_ = true;
 }
 
@@ -132,7 +132,7 @@ bool DiskCacheManifest::change(const std::function<void()>& changes) {
   try {
     haveChanged = persistence_->performTogether(changes);
   } catch (...) {
-    std::exchange(undo_, nullptr)->takeBack(*records_, pendingAccessDates_);
+    std::exchange(undo_, nullptr)->takeBack(*records_, accessDates_->waiting(lock));
     throw;
   }
   undo_.reset();
@@ -143,7 +143,7 @@ void DiskCacheManifest::storeItem(const DiskCacheItem& item, const std::vector<u
   const ItemsLock lock(itemsMutex_);
   persistence_->storeItem(item, inlineData);
   noteFormer(lock, item.key);
-  pendingAccessDates_.erase(item.key);
+  accessDates_->waiting(lock).erase(item.key);
   records_->store(item);
 }
 
@@ -173,7 +173,7 @@ void DiskCacheManifest::reload() {
     persistence_->resume();
     const auto records = persistence_->getAllItems();
     records_->clear();
-    pendingAccessDates_.clear();
+    accessDates_->waiting(lock).clear();
     for (const auto& record : records) {
       records_->store(*record);
       if (time_ != nullptr) time_->noteDateOf(*record);
@@ -184,14 +184,14 @@ void DiskCacheManifest::reload() {
 }
 
 // To be called before a record in memory changes.
-void DiskCacheManifest::noteFormer(const ItemsLock& /*lock*/, const std::string& key) {
-  if (undo_ != nullptr) undo_->note(key, *records_, pendingAccessDates_);
+void DiskCacheManifest::noteFormer(const ItemsLock& lock, const std::string& key) {
+  if (undo_ != nullptr) undo_->note(key, *records_, accessDates_->waiting(lock));
 }
 
 void DiskCacheManifest::set(const ItemsLock& lock, const DiskCacheItem& item) {
   persistence_->setItem(item);
   noteFormer(lock, item.key);
-  pendingAccessDates_.erase(item.key);
+  accessDates_->waiting(lock).erase(item.key);
   records_->store(item);
 }
 
@@ -218,26 +218,22 @@ std::unique_ptr<DiskCacheItem> DiskCacheManifest::getItem(const std::string& key
 }
 
 void DiskCacheManifest::updateLastAccessDate(const std::string& key) {
-  std::shared_ptr<AccessDates> due;
+  std::shared_ptr<AccessDates::Dates> due;
   {
     const ItemsLock lock(itemsMutex_);
     if (findOrRead(lock, key) == nullptr) return;
     const std::int32_t date = now(lock);
     records_->setLastAccessDate(key, date);
-    pendingAccessDates_[key] = date;
-    if (!isFlushDue(lock)) return;
-    due = std::make_shared<AccessDates>();
-    due->swap(pendingAccessDates_);
-    queuedAccessDates_ = due;
+    accessDates_->waiting(lock)[key] = date;
+    if (loaded_) due = accessDates_->takeDue(lock);
+    if (due == nullptr) return;
   }
   try {
     executor_->dispatch([weakThis = weak_from_this<DiskCacheManifest>(), due] {
-      if (const auto self = weakThis.lock()) self->runQueuedFlush(*due);
+      if (const auto self = weakThis.lock()) self->accessDates_->flush(*due);
     });
   } catch (...) {
-    const ItemsLock lock(itemsMutex_);
-    pendingAccessDates_.merge(*due);  // those used again meanwhile stay as they are
-    due->clear();
+    accessDates_->giveBack(ItemsLock(itemsMutex_), *due);
     throw;
   }
 }
@@ -347,7 +343,7 @@ DiskCacheItem DiskCacheManifest::remove(const ItemsLock& lock, const ManifestRec
   const std::string key(record.key());
   persistence_->removeItem(key);
   noteFormer(lock, key);
-  pendingAccessDates_.erase(key);
+  accessDates_->waiting(lock).erase(key);
   return records_->remove(record);
 }
 
@@ -400,90 +396,13 @@ void DiskCacheManifest::armFlushTimer() {
   const auto onTimer = [weakThis = weak_from_this<DiskCacheManifest>()] {
     const auto self = weakThis.lock();
     if (self == nullptr) return;
-    self->flush();
+    self->accessDates_->flush();
     self->armFlushTimer();
   };
   std::unique_ptr<AsyncTimer> timer;  // the old one is destroyed without the lock
   const ItemsLock lock(itemsMutex_);
   if (invalidated_) return;
   timer = std::exchange(flushTimer_, executor_->scheduleAfter(kFlushIntervalNanoseconds, onTimer, nullptr));
-}
-
-void DiskCacheManifest::flush() {
-  AccessDates dates;
-  {
-    const ItemsLock lock(itemsMutex_);
-    dates.swap(pendingAccessDates_);
-  }
-  commitAccessTimeUpdates(dates);
-}
-
-// Enough dates for a flush of their own, and neither a queued flush nor the timer is to come first.
-bool DiskCacheManifest::isFlushDue(const ItemsLock& /*lock*/) const {
-  if (!loaded_ || hasFlushFailed_ || pendingAccessDates_.size() <= kMaxPendingAccessDates) return false;
-  const auto queued = queuedAccessDates_.lock();
-  return queued == nullptr || queued->empty();
-}
-
-void DiskCacheManifest::runQueuedFlush(AccessDates& queued) {
-  AccessDates dates;
-  {
-    const ItemsLock lock(itemsMutex_);
-    dates.swap(queued);
-  }
-  commitAccessTimeUpdates(dates);
-  {
-    const ItemsLock lock(itemsMutex_);
-    if (!isFlushDue(lock)) return;
-    dates.swap(pendingAccessDates_);  // what has come together while the flush was queued
-  }
-  commitAccessTimeUpdates(dates);
-}
-
-// Dates of items that have been used or set again meanwhile, or were removed, are not written. Those that cannot be
-// written now wait for the timer.
-void DiskCacheManifest::commitAccessTimeUpdates(AccessDates& dates) {
-  try {
-    if (time_ != nullptr) writeTogether(dates);
-    for (; !dates.empty(); dates.erase(dates.begin())) {
-      const auto& [key, date] = *dates.begin();
-      if (isAccessDate(key, date)) persistence_->updateLastAccessDate(key, date);
-    }
-  } catch (const std::exception& error) {
-    LOG(ERROR) << "Could not write access dates: " << error.what();
-  }
-  const ItemsLock lock(itemsMutex_);
-  hasFlushFailed_ = !dates.empty();
-  for (auto left = dates.begin(); left != dates.end();) {
-    left = hasAccessDate(lock, left->first, left->second) ? std::next(left) : dates.erase(left);
-  }
-  pendingAccessDates_.merge(dates);
-}
-
-// In one transaction, for which a synced store waits once. Where there are none, nothing is written, and the dates
-// stay.
-void DiskCacheManifest::writeTogether(AccessDates& dates) {
-  AccessDates current;
-  {
-    const ItemsLock lock(itemsMutex_);
-    for (const auto& [key, date] : dates) {
-      if (hasAccessDate(lock, key, date)) current.emplace(key, date);
-    }
-  }
-  const auto writeAll = [&] {
-    for (const auto& [key, date] : current) persistence_->updateLastAccessDate(key, date);
-  };
-  if (current.empty() || persistence_->performTogether(writeAll)) dates.clear();
-}
-
-bool DiskCacheManifest::isAccessDate(const std::string& key, std::int32_t date) {
-  const ItemsLock lock(itemsMutex_);
-  return hasAccessDate(lock, key, date);
-}
-
-bool DiskCacheManifest::hasAccessDate(const ItemsLock& /*lock*/, const std::string& key, std::int32_t date) const {
-  const ManifestRecord* const record = records_->find(key);
-  return record != nullptr && record->lastAccessDate == date;
 }
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -6,7 +6,6 @@
 #include <mutex>
 #include <optional>
 #include <string>
-#include <unordered_map>
 #include <vector>
 
 #include "DiskCacheItem.h"
@@ -18,6 +17,7 @@
 
 namespace velmora::mobile::xplat::cellar {
 
+class AccessDates;
 class ExtendedMetadataFactory;
 class ManifestRecord;
 class ManifestRecords;
@@ -198,8 +198,6 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   bool isLoaded() override;
 
  private:
-  using AccessDates = std::unordered_map<std::string, std::int32_t>;
-
   using ItemsLock = std::lock_guard<std::recursive_mutex>;  // of the items mutex
   using Next = std::function<const ManifestRecord*()>;
 
@@ -210,19 +208,12 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   std::optional<ReplacedItem> whatIsReplaced(const ItemsLock& lock, const std::string& key, bool withInlineData);
   const ManifestRecord* findOrRead(const ItemsLock& lock, const std::string& key);
   DiskCacheItem remove(const ItemsLock& lock, const ManifestRecord& record);
-  bool hasAccessDate(const ItemsLock& lock, const std::string& key, std::int32_t date) const;
-  bool isFlushDue(const ItemsLock& lock) const;
   template <class Order, class MayGo>
   std::vector<DiskCacheItem> prune(const ItemsLock& lock, Order order, std::uint32_t count, MayGo mayGo);
   template <class MayGo> void removeInOrder(const ItemsLock& lock, const ManifestRecord* record, const Next& next,
                                             std::uint32_t count, MayGo mayGo, std::vector<DiskCacheItem>& removed);
 
   void armFlushTimer();
-  void flush();
-  void runQueuedFlush(AccessDates& queued);
-  void commitAccessTimeUpdates(AccessDates& dates);
-  void writeTogether(AccessDates& dates);
-  bool isAccessDate(const std::string& key, std::int32_t date);
 
   const std::unique_ptr<ManifestPersistence> persistence_;
   const std::shared_ptr<AsyncExecutor> executor_;
@@ -233,10 +224,8 @@ class CELLAR_EXPORT DiskCacheManifest : public DiskCacheManifestInterface {
   const std::unique_ptr<StoreTime> time_;  // null: the clock is believed
   bool loaded_ = false;
   bool invalidated_ = false;
-  std::unique_ptr<ManifestUndo> undo_;  // of the changes that are being made together; null otherwise
-  AccessDates pendingAccessDates_;
-  std::weak_ptr<AccessDates> queuedAccessDates_;  // those of the flush on the executor; empty once it runs
-  bool hasFlushFailed_ = false;                   // then pending dates wait for the timer
+  std::unique_ptr<ManifestUndo> undo_;              // of the changes that are being made together; null otherwise
+  const std::unique_ptr<AccessDates> accessDates_;  // that wait to be written
   std::unique_ptr<AsyncTimer> flushTimer_;
 };
 

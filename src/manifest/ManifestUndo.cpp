@@ -4,7 +4,7 @@
 
 namespace velmora::mobile::xplat::cellar {
 
-void ManifestUndo::note(const std::string& key, const ManifestRecords& records, const AccessDates& waiting) {
+void ManifestUndo::note(const std::string& key, const ManifestRecords& records, const AccessDates::Dates& waiting) {
   Former former{key, std::nullopt, std::nullopt};
   if (const ManifestRecord* const record = records.find(key)) former.record = records.copyOf(*record);
   const auto date = waiting.find(key);
@@ -13,7 +13,7 @@ void ManifestUndo::note(const std::string& key, const ManifestRecords& records, 
 }
 
 // The latest change first.
-void ManifestUndo::takeBack(ManifestRecords& records, AccessDates& waiting) const {
+void ManifestUndo::takeBack(ManifestRecords& records, AccessDates::Dates& waiting) const {
   for (auto former = formers_.rbegin(); former != formers_.rend(); ++former) {
     if (former->record) {
       records.restore(*former->record);

@@ -3,9 +3,9 @@
 #include <cstdint>
 #include <optional>
 #include <string>
-#include <unordered_map>
 #include <vector>
 
+#include "manifest/AccessDates.h"
 #include "manifest/ManifestRecords.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -13,12 +13,10 @@ namespace velmora::mobile::xplat::cellar {
 // What keys had in memory before changes that are made together, to go back to if those do not come about.
 class ManifestUndo {
  public:
-  using AccessDates = std::unordered_map<std::string, std::int32_t>;  // that wait to be written
-
   // To be called before each change.
-  void note(const std::string& key, const ManifestRecords& records, const AccessDates& waiting);
+  void note(const std::string& key, const ManifestRecords& records, const AccessDates::Dates& waiting);
 
-  void takeBack(ManifestRecords& records, AccessDates& waiting) const;
+  void takeBack(ManifestRecords& records, AccessDates::Dates& waiting) const;
 
  private:
   struct Former {
