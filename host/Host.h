@@ -144,7 +144,7 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   template <class StoreType>
   std::shared_ptr<StoreType> store(const std::string& storeIdentifier,
                                    const std::optional<std::string>& sessionKey = std::nullopt) {
-    return detail::storeAs<StoreType>(storeIdentifier, getStore(storeIdentifier, sessionKey));
+    return cellar::detail::storeAs<StoreType>(storeIdentifier, getStore(storeIdentifier, sessionKey));
   }
 
   // Ends the open session: its managers and stores become invalid and its directories are moved to the trash, in all

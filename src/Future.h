@@ -44,7 +44,7 @@ template <class T> struct SharedFutureState {
   std::future<T> future;
   std::function<void(std::future<T>&)> callback;
   std::shared_ptr<AsyncExecutor> executor;
-  bool fulfilled = false;
+  std::atomic<bool> fulfilled{false};  // changed with the mutex held, or before the state is shared
 
   // Whether the value has left `future`. A callback on an executor takes it without the mutex, so only the thread that
   // runs the callback may ask `future` itself meanwhile; other threads hear of it when the callback returns.
@@ -101,8 +101,15 @@ template <class T> class Future {
     state_->throwIfTaken();
   }
 
-  // Blocks until the promise is fulfilled; rethrows its exception. Never call it on the queue that is to fulfil the
-  // promise, nor in an inline callback of the same future.
+  // Whether the promise has been fulfilled, also with an exception: `get` does not wait then, and an inline callback
+  // runs at once. It stays so when the value has been taken. Never waits; throws when the future is empty.
+  [[nodiscard]] bool isReady() const {
+    if (state_ == nullptr) throw FutureError(FutureError::Code::InvalidSharedState);
+    return state_->fulfilled.load(std::memory_order_acquire);
+  }
+
+  // For a `Future<void>`. Blocks until the promise is fulfilled; rethrows its exception. Never call it on the queue
+  // that is to fulfil the promise, nor in an inline callback of the same future.
   template <class U = T, class = std::enable_if_t<std::is_void_v<U>>> void get() {
     throwIfInvalid();
     const auto state = state_;
@@ -111,6 +118,13 @@ template <class T> class Future {
     if (state->callback) throw FutureError(FutureError::Code::FetchWithCallback);
     const typename detail::SharedFutureState<T>::Taking taking(*state);
     state->future.get();
+  }
+
+  // Does not compile: a value has no `get`.
+  template <class U = T, std::enable_if_t<!std::is_void_v<U>, int> = 0> U get() {
+    static_assert(std::is_void_v<U>,
+                  "Only a Future<void> has get(). Take a value in the callback of then(), or wait for it with "
+                  "cellar::host::await() of <cellar/host/Await.h>.");
   }
 
   // Calls `callback` once, with the standard future that holds the value or exception: on `executor`, or with a null
@@ -125,8 +139,11 @@ template <class T> class Future {
     if (state->callback) throw FutureError(FutureError::Code::CallbackAlreadySet);
     state->callback = std::move(callback);
     state->executor = std::move(executor);
-    if (state->fulfilled) state->runCallback(state);
+    if (state->fulfilled.load(std::memory_order_relaxed)) state->runCallback(state);
   }
+
+  // The same inline.
+  void then(std::function<void(std::future<T>&)>&& callback) { then(nullptr, std::move(callback)); }
 
  private:
   std::shared_ptr<detail::SharedFutureState<T>> state_;
@@ -141,10 +158,10 @@ template <class T> class Promise {
   Promise(const Promise&) = delete;
   Promise& operator=(const Promise&) = delete;
 
-  Future<T> getFuture() {
+  [[nodiscard]] Future<T> getFuture() {
     auto state = std::make_shared<detail::SharedFutureState<T>>();
     state->future = promise_.get_future();
-    state->fulfilled = fulfilled_;
+    state->fulfilled.store(fulfilled_, std::memory_order_relaxed);
     state_ = std::move(state);
     return Future<T>(state_);
   }
@@ -170,7 +187,7 @@ template <class T> class Promise {
     const auto state = state_;  // the callback may destroy this promise
     if (state == nullptr) return;
     const std::lock_guard<std::mutex> lock(state->mutex);
-    state->fulfilled = true;
+    state->fulfilled.store(true, std::memory_order_release);
     if (state->callback) state->runCallback(state);
   }
 

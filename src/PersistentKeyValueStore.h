@@ -123,13 +123,13 @@ class CELLAR_EXPORT PersistentKeyValueStore : public Store {
 
   // The value; a null result for a miss. A hit counts as a use of the item. A file that has vanished behind the store
   // is an error, unless the store itself removed it meanwhile: that is a miss.
-  Future<std::unique_ptr<FetchResult>> fetch(const std::string& key);
-  Future<std::unique_ptr<FetchResult>> fetch(const std::string& key, Reader reader);
-  Future<std::unique_ptr<FetchResult>> fetch(const std::string& key, Loader loader);
+  [[nodiscard]] Future<std::unique_ptr<FetchResult>> fetch(const std::string& key);
+  [[nodiscard]] Future<std::unique_ptr<FetchResult>> fetch(const std::string& key, Reader reader);
+  [[nodiscard]] Future<std::unique_ptr<FetchResult>> fetch(const std::string& key, Loader loader);
 
   // The value of the first of the keys that has an item; the result says which. A null result when none has, or there
   // are no keys.
-  Future<std::unique_ptr<FetchResult>> fetchFirst(const std::vector<std::string>& keys, Loader loader);
+  [[nodiscard]] Future<std::unique_ptr<FetchResult>> fetchFirst(const std::vector<std::string>& keys, Loader loader);
 
   // The loader of a plain fetch: the inline value, or the bytes of the file.
   bool readValue(std::shared_ptr<const DiskCacheItem> item, const std::string& path, std::vector<unsigned char>& value);

@@ -298,7 +298,7 @@ TEST_P(EndToEnd, ManyThreadsMayUseAllStoresAtOnce) {
       const auto opened = application_->store(identifiers[(thread + static_cast<std::size_t>(i)) % identifiers.size()]);
       const std::string key = std::to_string(i % 8);
       await(opened->store(key, Bytes(static_cast<std::size_t>(i), 'x')));
-      await(opened->fetch(key));
+      (void)await(opened->fetch(key));
       await(opened->updateLastAccessDate(key));
       if (i % 5 == 0) await(opened->removeItem(key));
       ++completed;
@@ -420,7 +420,7 @@ TEST_P(EndToEnd, InvalidatingWhileManyThreadsWriteLeavesEveryFutureWithAnAnswer)
         if (i % 2 == 0) {
           await(letters->store(std::to_string(i), kValue));
         } else {
-          await(thumbs->fetch(std::to_string(i)));
+          (void)await(thumbs->fetch(std::to_string(i)));
         }
         ++fulfilled;
       } catch (const InvalidatedException&) {

@@ -219,7 +219,67 @@ TEST_F(FutureTest, AfterACallbackThatLeftTheValueTheFutureStillHasItsCallback) {
   EXPECT_EQ(misuse([&] { future.get(); }), kFetchWithCallback);
 }
 
+// Readiness
+
+TEST_F(FutureTest, IsReadyFromItsFulfilmentOnAlsoWhenTheValueHasBeenTaken) {
+  Promise<Value> promise;
+  const Future<Value> future = promise.getFuture();
+  Future<Value> copy = future;
+  EXPECT_FALSE(future.isReady());
+  promise.setValue(nullptr);
+  EXPECT_TRUE(future.isReady());
+  copy.then([](std::future<Value>& value) { value.get(); });
+  EXPECT_TRUE(future.isReady());
+}
+
+TEST_F(FutureTest, IsReadyWithAnExceptionABrokenPromiseOrAnEarlyValue) {
+  Promise<void> failing;
+  const Future<void> failed = failing.getFuture();
+  failing.setException(failure("no luck"));
+  EXPECT_TRUE(failed.isReady());
+  const Future<void> broken = Promise<void>().getFuture();
+  EXPECT_TRUE(broken.isReady());
+  Promise<void> early;
+  early.setValue();
+  EXPECT_TRUE(early.getFuture().isReady());
+}
+
+TEST_F(FutureTest, AnEmptyFutureIsNeitherReadyNorNot) {
+  EXPECT_EQ(misuse([] { (void)Future<Value>().isReady(); }), kInvalid);
+}
+
+TEST_F(FutureTest, AnInlineCallbackMayAskWhetherItsFutureIsReady) {
+  Promise<void> promise;
+  Future<void> future = promise.getFuture();
+  bool ready = false;
+  future.then([&](auto&) { ready = future.isReady(); });
+  promise.setValue();
+  EXPECT_TRUE(ready);
+}
+
+TEST_F(FutureTest, AskingWhetherItIsReadyDoesNotWaitForAThreadThatGets) {
+  Promise<void> promise;
+  Future<void> future = promise.getFuture();
+  test::runOnThreads(2, [&](std::size_t thread) {
+    if (thread == 0) return future.get();
+    letOthersTry();
+    EXPECT_FALSE(future.isReady());
+    promise.setValue();
+    EXPECT_TRUE(future.isReady());
+  });
+}
+
 // Delivery
+
+TEST_F(FutureTest, ThenWithoutAnExecutorDeliversInline) {
+  Promise<Value> promise;
+  Future<Value> future = promise.getFuture();
+  int seen = 0;
+  future.then([&](std::future<Value>& value) { seen = *value.get(); });
+  EXPECT_EQ(misuse([&] { future.then([](auto&) {}); }), kCallbackAlreadySet);
+  promise.setValue(std::make_unique<int>(42));
+  EXPECT_EQ(seen, 42);
+}
 
 TEST_F(FutureTest, ThenOnAFulfilledFutureRunsTheCallbackInlineAtOnceWithoutAnExecutor) {
   Promise<Value> promise;
@@ -592,7 +652,7 @@ TEST_F(FutureTest, ASecondGetFutureThrowsAndTheFirstOneStillGetsItsValue) {
   Future<void> future = promise.getFuture();
   int calls = 0;
   future.then(nullptr, [&](auto&) { ++calls; });
-  EXPECT_EQ(standardMisuse([&] { promise.getFuture(); }), std::future_errc::future_already_retrieved);
+  EXPECT_EQ(standardMisuse([&] { (void)promise.getFuture(); }), std::future_errc::future_already_retrieved);
   promise.setValue();
   EXPECT_EQ(calls, 1);
 }

@@ -88,7 +88,7 @@ class PersistentKeyValueStoreOutstandingOperations : public testing::Test {
     for (std::size_t i = 0; i < kOperations; ++i) futures.push_back(call(key));
     const std::size_t bytes = (bytesInUse - begun) / kOperations;
     queues->runAll();
-    for (auto& future : futures) host::await(std::move(future));
+    for (auto& future : futures) (void)host::await(std::move(future));
     futures.clear();
     futures.shrink_to_fit();
     EXPECT_LT(bytesInUse, before + 64 * 1024) << name;

@@ -42,10 +42,10 @@ class CELLAR_EXPORT ManualExecutor : public AsyncExecutor {
   // Throws std::runtime_error and drops the task while `throwOnDispatch` is set.
   void dispatch(std::function<void()> task) override;
 
-  std::unique_ptr<AsyncTimer> dispatchAfter(std::int64_t delayNanoseconds, std::function<void()> task,
-                                            std::function<void()> companion) override;
-  std::unique_ptr<AsyncTimer> scheduleAfter(std::int64_t delayNanoseconds, std::function<void()> task,
-                                            std::function<void()> companion) override;
+  [[nodiscard]] std::unique_ptr<AsyncTimer> dispatchAfter(std::int64_t delayNanoseconds, std::function<void()> task,
+                                                          std::function<void()> companion) override;
+  [[nodiscard]] std::unique_ptr<AsyncTimer> scheduleAfter(std::int64_t delayNanoseconds, std::function<void()> task,
+                                                          std::function<void()> companion) override;
 
   // The number of waiting tasks.
   std::size_t pending() const;

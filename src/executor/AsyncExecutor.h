@@ -16,14 +16,17 @@ struct CELLAR_EXPORT AsyncExecutor {
   // Runs `task` once, later. A queue that is shut down may destroy it without running it.
   virtual void dispatch(std::function<void()> task) = 0;
 
-  // Runs `task` once after `delayNanoseconds`. The library always passes an empty `companion`.
-  virtual std::unique_ptr<AsyncTimer> dispatchAfter(std::int64_t delayNanoseconds, std::function<void()> task,
-                                                    std::function<void()> companion) = 0;
+  // Runs `task` once after `delayNanoseconds`, unless the handle is destroyed before. The library always passes an
+  // empty `companion`.
+  [[nodiscard]] virtual std::unique_ptr<AsyncTimer> dispatchAfter(std::int64_t delayNanoseconds,
+                                                                  std::function<void()> task,
+                                                                  std::function<void()> companion) = 0;
 
   // The same contract as `dispatchAfter`. A host may let these timers repeat until their handle is destroyed: the
   // library replaces the handle each time the task has run.
-  virtual std::unique_ptr<AsyncTimer> scheduleAfter(std::int64_t delayNanoseconds, std::function<void()> task,
-                                                    std::function<void()> companion) = 0;
+  [[nodiscard]] virtual std::unique_ptr<AsyncTimer> scheduleAfter(std::int64_t delayNanoseconds,
+                                                                  std::function<void()> task,
+                                                                  std::function<void()> companion) = 0;
 };
 
 }  // namespace velmora::mobile::xplat::executor

@@ -121,7 +121,7 @@ class Inspector {
 
   void checkSize(std::size_t number) {
     PersistentKeyValueStore& store = *stores_[number];
-    host::await(store.fetch("nothing"));  // loading comes before it
+    (void)host::await(store.fetch("nothing"));  // loading comes before it
     const auto facts = facts_.find(store.path);
     const std::string wanted = facts == facts_.end() ? "0" : facts->second.size;
     const std::string size = std::to_string(store.getManifest()->size());

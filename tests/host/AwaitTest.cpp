@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <cstddef>
 #include <future>
 #include <memory>
 #include <stdexcept>
@@ -12,6 +13,7 @@
 
 #include "Future.h"
 #include "host/ThreadQueueFactory.h"
+#include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
 
 namespace velmora::mobile::xplat::cellar::host {
@@ -19,13 +21,17 @@ namespace {
 
 using test::Latch;
 
-FutureError::Code codeOfAwaiting(Future<void> future) {
+template <class Operation> FutureError::Code codeOf(Operation operation) {
   try {
-    await(std::move(future));
-  } catch (const FutureError& error) {
+    operation();
+  } catch (const FutureMisuseError& error) {
     return error.code();
   }
   throw std::logic_error("Awaiting worked.");
+}
+
+FutureError::Code codeOfAwaiting(const Future<void>& future) {
+  return codeOf([&] { await(future); });
 }
 
 TEST(Await, ReturnsAValueThatIsThereAlready) {
@@ -118,6 +124,100 @@ TEST(Await, RefusesAFutureThatHasACallback) {
   future.then(nullptr, [](std::future<void>&) {});
   EXPECT_EQ(codeOfAwaiting(future), FutureError::Code::CallbackAlreadySet);
 }
+
+TEST(Await, SaysWhatToDoAboutAFutureThatHasNoValueToGive) {
+  Promise<int> promise;
+  const Future<int> future = promise.getFuture();
+  promise.setValue(1);
+  EXPECT_EQ(await(future), 1);
+  try {
+    (void)await(future);
+    FAIL() << "There is no second value.";
+  } catch (const FutureError& error) {
+    EXPECT_STREQ(error.what(), FutureMisuseError(FutureError::Code::ValueAlreadyFetched).what());
+  }
+}
+
+// --- With a timeout ---
+
+using std::chrono::milliseconds;
+
+TEST(Await, ATimeoutThatIsNotReachedChangesNothing) {
+  ThreadQueueFactory queues;
+  const auto queue = queues.createQueue();
+  for (const milliseconds timeout : {milliseconds(std::chrono::hours(24 * 365)), milliseconds::max()}) {
+    EXPECT_EQ(await(dispatchTask<int>(queue, [] { return 42; }), timeout), 42);
+  }
+  EXPECT_NO_THROW(await(dispatchTask<void>(queue, [] {}), std::chrono::minutes(10)));
+  EXPECT_THROW(await(dispatchTask<void>(queue, [] { throw std::out_of_range("far away"); }), std::chrono::minutes(10)),
+               std::out_of_range);
+}
+
+TEST(Await, ATimeoutOfNothingTakesWhatIsThereOnly) {
+  for (const milliseconds timeout : {milliseconds(0), milliseconds(-1), milliseconds::min()}) {
+    Promise<int> there;
+    there.setValue(7);
+    EXPECT_EQ(await(there.getFuture(), timeout), 7);
+    Promise<int> missing;
+    EXPECT_THROW((void)await(missing.getFuture(), timeout), TimeoutError);
+  }
+}
+
+TEST(Await, ATimeoutIsReportedWithItsLength) {
+  Promise<void> promise;
+  const auto began = std::chrono::steady_clock::now();
+  try {
+    await(promise.getFuture(), milliseconds(20));
+    FAIL() << "There is no value.";
+  } catch (const std::runtime_error& error) {
+    EXPECT_STREQ(error.what(), "The future had no value after 20 ms.");
+  }
+  EXPECT_GE(std::chrono::steady_clock::now() - began, milliseconds(20));
+}
+
+TEST(Await, AValueThatComesTooLateIsDestroyedAtOnce) {
+  Promise<std::shared_ptr<int>> promise;
+  const auto future = promise.getFuture();
+  EXPECT_THROW((void)await(future, milliseconds(0)), TimeoutError);
+  EXPECT_EQ(codeOf([&] { (void)await(future); }), FutureError::Code::CallbackAlreadySet);
+  auto value = std::make_shared<int>(0);
+  const std::weak_ptr<int> watched = value;
+  promise.setValue(std::move(value));
+  EXPECT_TRUE(watched.expired());
+  EXPECT_EQ(codeOf([&] { (void)await(future); }), FutureError::Code::ValueAlreadyFetched);
+}
+
+TEST(Await, ABrokenPromiseIsNotWaitedFor) {
+  const auto queue = std::make_shared<test::ManualExecutor>();
+  const Future<void> future = dispatchTask<void>(queue, [] {});
+  queue->dropAll();
+  EXPECT_THROW(await(future, std::chrono::hours(1)), std::future_error);
+}
+
+TEST(Await, WithATimeoutIsRefusedOnAThreadOfTheKitToo) {
+  ThreadQueueFactory queues;
+  const auto wait = [] { await(Promise<void>().getFuture(), milliseconds(0)); };
+  EXPECT_THROW(dispatchTask<void>(queues.createQueue(), wait).get(), std::logic_error);
+}
+
+TEST(Await, AValueAndTheEndOfTheTimeMayMeet) {
+  for (int round = 0; round < 100; ++round) {
+    Promise<std::unique_ptr<int>> promise;
+    const auto future = promise.getFuture();
+    int outcomes = 0;
+    test::runOnThreads(2, [&](std::size_t thread) {
+      if (thread == 0) return promise.setValue(std::make_unique<int>(round));
+      try {
+        outcomes += *await(future, milliseconds(round % 2)) == round ? 1 : 0;
+      } catch (const TimeoutError&) {
+        ++outcomes;
+      }
+    });
+    ASSERT_EQ(outcomes, 1);
+  }
+}
+
+// --- Where it is refused ---
 
 TEST(Await, IsRefusedOnAThreadOfTheKitAndLeavesTheFutureAlone) {
   ThreadQueueFactory queues;
