@@ -31,7 +31,7 @@ constexpr std::size_t kSomeFiles = 200;
 
 template <class T> bool isRefused(const Future<T>& request) {
   try {
-    host::await(request);
+    (void)host::await(request);
     return false;
   } catch (const InvalidatedException&) {
     return true;

@@ -1,0 +1,80 @@
+#include "host/Batches.h"
+
+#include <future>
+
+#include "host/Futures.h"
+
+namespace velmora::mobile::xplat::cellar::host {
+
+namespace {
+
+using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
+
+std::string textOfCurrentException() {
+  try {
+    throw;
+  } catch (const std::exception& error) {
+    return error.what();
+  } catch (...) {
+    return "not a standard exception";
+  }
+}
+
+// What the operation returns, or throws, as a `BatchError` of its key if it fails.
+template <class T, class Operation> Future<T> attempt(const char* name, const std::string& key, Operation operation) {
+  Future<T> future;
+  try {
+    future = operation();
+  } catch (...) {
+    Promise<T> promise;
+    future = promise.getFuture();
+    promise.setException(std::current_exception());
+  }
+  return then(std::move(future), [name, key](std::future<T>& result) {
+    try {
+      return result.get();
+    } catch (...) {
+      throw BatchError(name, key);
+    }
+  });
+}
+
+}  // namespace
+
+BatchError::BatchError(const std::string& operation, std::string key)
+    : std::runtime_error("Could not " + operation + " \"" + key + "\": " + textOfCurrentException()),
+      key_(std::move(key)) {}
+
+BatchError::~BatchError() = default;
+
+const std::string& BatchError::key() const noexcept { return key_; }
+
+Future<void> storeAll(PersistentKeyValueStore& store,
+                      const std::vector<std::pair<std::string, std::vector<unsigned char>>>& values) {
+  std::vector<Future<void>> stored;
+  stored.reserve(values.size());
+  for (const auto& pair : values) {
+    stored.push_back(attempt<void>("store", pair.first, [&] { return store.store(pair.first, pair.second); }));
+  }
+  return whenAll(std::move(stored));
+}
+
+Future<std::vector<Fetched>> fetchMany(PersistentKeyValueStore& store, const std::vector<std::string>& keys) {
+  std::vector<Future<Fetched>> fetched;
+  fetched.reserve(keys.size());
+  for (const auto& key : keys) {
+    fetched.push_back(attempt<Fetched>("fetch", key, [&] { return store.fetch(key); }));
+  }
+  return whenAll(std::move(fetched));
+}
+
+Future<void> removeAll(PersistentKeyValueStore& store, const std::vector<std::string>& keys) {
+  std::vector<Future<void>> removed;
+  removed.reserve(keys.size());
+  for (const auto& key : keys) {
+    removed.push_back(attempt<void>("remove", key, [&] { return store.removeItem(key); }));
+  }
+  return whenAll(std::move(removed));
+}
+
+}  // namespace velmora::mobile::xplat::cellar::host
