@@ -359,7 +359,7 @@ TEST_F(MediaApp, AStoreOfASessionThatHasEndedRefusesEverything) {
   drafts->clear([] {}, [&](const std::exception& error) { refusalOfClear = error.what(); });
   std::vector<std::string> refusals;
   for (const std::function<void()>& operation : std::vector<std::function<void()>>{
-           [&] { (void)await(drafts->store("key", {1})); }, [&] { await(drafts->fetch("key")); },
+           [&] { await(drafts->store("key", {1})); }, [&] { (void)await(drafts->fetch("key")); },
            [&] { await(drafts->removeItem("key")); }, [&] { await(drafts->updateLastAccessDate("key")); },
            [&] { drafts->fetchModificationDate("key"); }, [&] { drafts->getAllKeys(); }}) {
     refusals.push_back(refusalOf(operation));
