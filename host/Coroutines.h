@@ -25,8 +25,8 @@
 //
 // A coroutine that returns a `Future` begins at once, on the caller's thread. The future gets the value or exception
 // that the coroutine ends with, when the coroutine's variables and parameters have been destroyed. Nobody has to keep
-// the future. Take parameters by value: references may dangle after the first `co_await`. What an inline callback of
-// the future throws is one error line in the log.
+// the future. Take parameters by value: references may dangle after the first `co_await`, as may a lambda's captures.
+// What an inline callback of the future throws is one error line in the log.
 //
 // `co_await future` has the value of the future, or throws its exception, or `FutureMisuseError` as `then` does. The
 // coroutine continues on the thread that fulfils the future, a store's queue for example, under the lock of that
@@ -189,9 +189,13 @@ template <class T> host::detail::Awaiter<T> operator co_await(Future<T> future) 
 
 }  // namespace velmora::mobile::xplat::cellar
 
+namespace std {
+
 template <class T, class... Arguments>
-struct std::coroutine_traits<velmora::mobile::xplat::cellar::Future<T>, Arguments...> {
+struct coroutine_traits<velmora::mobile::xplat::cellar::Future<T>, Arguments...> {
   using promise_type = velmora::mobile::xplat::cellar::host::detail::CoroutinePromise<T>;
 };
+
+}  // namespace std
 
 #endif
