@@ -1,11 +1,9 @@
 #pragma once
 
 #include <chrono>
-#include <condition_variable>
+#include <cstdint>
 #include <functional>
-#include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -15,6 +13,7 @@
 #include <cellar/StoreManager.h>
 #include <cellar/XAnalytics.h>
 #include <cellar/executor/TaskQueueFactory.h>
+#include <cellar/host/Session.h>
 #include <cellar/session/Invalidatable.h>
 
 namespace velmora::mobile::xplat::cellar {
@@ -27,13 +26,21 @@ class FileUtils;
 class LazyDispatcher;
 class StoreDirectoryNameBuilderFactory;
 class TrashCollector;
-struct PathLocations;
 struct StoreManagerDefinition;
 
 namespace host {
 
+class ManagerScopes;
 class RootLock;
+class SessionData;
 class ThreadQueueFactory;
+struct ManagerSlot;
+
+// What becomes of a session's data when another session opens.
+enum class Accounts {
+  OneAtATime,  // one session is open at a time; maintenance of its managers removes the data of the others
+  Kept,        // several may be open at the same time, and the data of each is kept until it is logged out
+};
 
 // What a host is built from. `configuration` and `root` are required.
 struct HostOptions {
@@ -62,6 +69,11 @@ struct HostOptions {
   // no other host uses the root, in this process or another: they would lose each other's values.
   bool lockRoot = true;
 
+  // With `Kept` each session has areas of its own under "accounts". Data of before, in the root's areas, is moved there
+  // when its session opens, and back when the host is set to `OneAtATime` again: then what remains under "accounts" is
+  // listed by `sessions`, and not removed by maintenance.
+  Accounts accounts = Accounts::OneAtATime;
+
   // Called for each `Incident`: something that nobody has asked for has happened to stored data. Empty: incidents are
   // only logged. It runs on a queue of its own, one call at a time: a slow one delays further incidents and the end of
   // the host, nothing else. It may use the host and its stores, except `logOut` and `invalidate`, which throw on the
@@ -83,7 +95,12 @@ struct StoredSession {
 
   // Absent if it cannot be derived from the tag: with your own mapper, or for a directory that this host has not named.
   std::optional<std::string> key;
+
+  std::optional<std::uint64_t> bytes{};  // of all its files; absent unless they were to be measured
 };
+
+// Whether `Host::sessions` adds up the sizes of all files, which takes some seconds for a million of them.
+enum class SessionSizes { Skipped, Measured };
 
 // Everything that an application needs to use the library, built in one call:
 //
@@ -97,11 +114,15 @@ struct StoredSession {
 // Under the root: "caches", "documents", "shared" (the areas), "trash" and the lock file "_cellar_lock". One host at a
 // time may use a root, in all processes together. Any thread may call.
 //
-// Sessions: one at a time. The first request with a session key opens that session; if the first request for a
+// Sessions: one at a time, unless the options say otherwise. The first request with a session key opens that session; if the first request for a
 // session-scoped manager has no key, it opens the session "". Later requests without a key mean the open session.
 // Requests for another session throw until `logOut`, because a manager keeps its first session and its maintenance
 // removes all others. Managers without session scope ignore keys. After a restart no session is open, and the data of
 // the last one is still there: `sessions` lists it, and `logOut(sessionKey)` discards it.
+//
+// With `HostOptions::accounts = Accounts::Kept` each request with a key opens that session beside the others. A request
+// without a key means the open session, or opens the session "" if none is open; it throws `std::logic_error` if there
+// are several. The data of a session is kept until `logOut` or `Session::end`.
 //
 // Destroying the host loses no data. It ends promptly, however busy other threads are: their new requests fail at once
 // with a broken promise in the future, work that waits for the lazy delay is dropped, and work that was accepted before
@@ -147,6 +168,9 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
     return cellar::detail::storeAs<StoreType>(storeIdentifier, getStore(storeIdentifier, sessionKey));
   }
 
+  // The session of that key, which is opened if it is not. Throws as a request for one of its managers does.
+  [[nodiscard]] Session openSession(const std::string& sessionKey);
+
   // Ends the open session: its managers and stores become invalid and its directories are moved to the trash, in all
   // areas, including those of managers that were never requested. The next request may open another session. During
   // the call, stores finish what they are writing, and requests for session-scoped managers are refused: must not be
@@ -156,7 +180,7 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   // Throws `FileUtilsIoException` that names what could not be discarded; the session has ended nevertheless, and
   // `logOut(sessionKey)` tries again. Not an error: the open session was ended already. If no session has been opened
   // since the host was created, but there is data of sessions, it throws `std::logic_error`: it cannot know which one
-  // to discard.
+  // to discard. So it does if several sessions are open.
   void logOut();
 
   // Ends that session: as `logOut()` if it is open. If not, for example after a restart, its directories in all areas
@@ -168,9 +192,9 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
 
   // The sessions that have directories in any area, sorted by tag; the open one is included once it has been used.
   // Throws `FileUtilsIoException` when an area cannot be read.
-  std::vector<StoredSession> sessions() const;
+  std::vector<StoredSession> sessions(SessionSizes sizes = SessionSizes::Skipped) const;
 
-  // Ends the open session, if there is one, and also discards the data of the other managers that were requested. Waits
+  // Ends the open sessions, if there are any, and also discards the data of the other managers that were requested. Waits
   // and throws as `logOut`.
   void invalidate() override;
 
@@ -185,38 +209,22 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<LazyDispatcher>& lazyWork() const { return lazyWork_; }
 
  private:
-  // One manager; null until it is built.
-  struct Slot {
-    std::mutex mutex;  // guards the manager; held while it is built
-    std::shared_ptr<StoreManager> manager;
-  };
-  // The managers of one scope by name, and the number of requests for them. Guarded by the mutex of the host.
-  struct Scope {
-    std::map<std::string, Slot> managers{};  // grows only
-    std::size_t requests = 0;                // under way
-    bool isEnding = false;                   // further requests are refused
-  };
-  struct SessionName {
-    std::string key;
-    std::string tag;
-  };
-  class Request;
-  class Ending;
-  class Discarding;
+  friend class Session;
   class IncidentGate;
 
   std::shared_ptr<Store> getStore(const std::string& identifier, const std::optional<std::string>& sessionKey);
-  std::shared_ptr<StoreManager> managerIn(const Request& request, const std::optional<std::string>& sessionKey);
-  std::shared_ptr<StoreManager> build(const StoreManagerDefinition& definition, const std::string& sessionKey);
-  std::string openSession(const std::optional<std::string>& sessionKey);
-  static void invalidateAll(Scope& scope);
-  bool endSession(const SessionName& session);
-  bool endOpenSession(const std::optional<std::string>& tag);
-  bool discard(const SessionName& session);
-  bool discardIn(const std::string& area, const std::string& name);
-  bool holds(const std::string& area, const std::string& name) const;
-  std::vector<std::string> directoriesIn(const std::string& area) const;
+  std::shared_ptr<Store> storeIn(const StoreManagerDefinition& definition, ManagerScope& scope, ManagerSlot& slot,
+                                 const std::string& identifier);
+  std::shared_ptr<StoreManager> managerIn(const StoreManagerDefinition& definition, ManagerScope& scope,
+                                          ManagerSlot& slot);
+  std::shared_ptr<StoreManager> build(const StoreManagerDefinition& definition, ManagerScope& scope);
   std::optional<std::string> keyOf(const std::string& tag) const;
+
+  bool isOpen(const std::shared_ptr<ManagerScope>& session) const;
+  std::shared_ptr<StoreManager> managerOf(const std::shared_ptr<ManagerScope>& session, const std::string& name);
+  std::shared_ptr<Store> storeOf(const std::shared_ptr<ManagerScope>& session, const std::string& identifier);
+  bool end(const std::shared_ptr<ManagerScope>& session);
+
   static std::shared_ptr<IncidentGate> gateFor(std::function<void(const Incident&)> handler);
   static std::shared_ptr<const IncidentReporter> reporterThrough(const std::shared_ptr<IncidentGate>& gate,
                                                                  TaskQueueFactory& queues);
@@ -226,7 +234,6 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<const Configuration> configuration_;
   const std::shared_ptr<FileUtils> fileUtils_;
   const std::unique_ptr<const RootLock> rootLock_;  // null without `lockRoot`; released after all that follows
-  const std::shared_ptr<PathLocations> locations_;
   const std::shared_ptr<StoreDirectoryNameBuilderFactory> nameBuilders_;
   const bool tagsTellKeys_;
   const std::function<std::string(const std::string&)> sessionTagMapper_;
@@ -242,14 +249,8 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<AsyncExecutor> measuringQueue_;
   const std::shared_ptr<IncidentGate> incidentGate_;         // null: nobody is told of incidents
   const std::shared_ptr<const IncidentReporter> incidents_;  // null with the gate
-
-  std::mutex mutex_;                 // guards everything below; not held while other objects are called
-  std::condition_variable changed_;  // a scope's requests, its end, or that of a discarding
-  Scope sessionScoped_;
-  Scope sessionless_;
-  std::optional<SessionName> openSession_;
-  bool hasOpenedSession_ = false;            // since the host was created
-  std::optional<std::string> discardedTag_;  // of a session that is not open, while it is discarded
+  const std::unique_ptr<SessionData> sessionData_;
+  const std::unique_ptr<ManagerScopes> scopes_;
 };
 
 }  // namespace host

@@ -1,0 +1,154 @@
+#include "host/sessions/SessionData.h"
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <set>
+#include <utility>
+
+#include "FileUtils.h"
+#include "LarderException.h"
+#include "StoreDirectoryNameBuilder.h"
+#include "TrashCollector.h"
+#include "host/DirectoryPathLocations.h"
+
+namespace velmora::mobile::xplat::cellar::host {
+
+namespace {
+
+constexpr std::array<Area, 3> kAreas = {Area::Caches, Area::Documents, Area::Shared};
+
+}  // namespace
+
+SessionData::SessionData(std::string root, bool severalKept, std::shared_ptr<FileUtils> fileUtils,
+                         std::shared_ptr<TrashCollector> trash,
+                         std::shared_ptr<StoreDirectoryNameBuilderFactory> nameBuilders)
+    : accounts_(fileUtils->combinePath(root, "accounts")),
+      severalKept_(severalKept),
+      fileUtils_(std::move(fileUtils)),
+      trash_(std::move(trash)),
+      nameBuilders_(std::move(nameBuilders)),
+      shared_(std::make_shared<DirectoryPathLocations>(std::move(root))) {}
+
+std::string SessionData::nameOf(const std::string& tag) const {
+  return nameBuilders_->createStoreDirectoryNameBuilder(tag)->buildStoreManagerName();
+}
+
+std::string SessionData::accountPath(const std::string& name) const { return fileUtils_->combinePath(accounts_, name); }
+
+std::shared_ptr<PathLocations> SessionData::locationsOf(const std::string& tag) const {
+  return severalKept_ ? std::make_shared<DirectoryPathLocations>(accountPath(nameOf(tag))) : shared_;
+}
+
+void SessionData::adopt(const std::string& tag) {
+  if (!severalKept_ && !fileUtils_->pathExists(accounts_)) return;
+  const std::string name = nameOf(tag);
+  DirectoryPathLocations account(accountPath(name));
+  PathLocations& from = severalKept_ ? *shared_ : account;
+  PathLocations& to = severalKept_ ? account : *shared_;
+  for (const Area area : kAreas) {
+    const std::string source = fileUtils_->combinePath(from.pathForArea(area, ""), name);
+    const std::string target = to.pathForArea(area, "");
+    if (!fileUtils_->isDirectory(source) || fileUtils_->pathExists(fileUtils_->combinePath(target, name))) continue;
+    fileUtils_->createDirectory(target, true);
+    fileUtils_->rename(source, fileUtils_->combinePath(target, name));
+  }
+}
+
+std::vector<std::string> SessionData::tags() const {
+  const auto names = nameBuilders_->createStoreDirectoryNameBuilder("");
+  const std::size_t prefix = names->buildStoreManagerName().size();
+  std::set<std::string> tags;
+  const auto addThoseIn = [&](const std::string& place) {
+    for (const std::string& name : names->filterStoreManagerNames({}, directoriesIn(place))) {
+      tags.insert(name.substr(prefix));
+    }
+  };
+  for (const Area area : kAreas) addThoseIn(shared_->pathForArea(area, ""));
+  addThoseIn(accounts_);
+  return {tags.begin(), tags.end()};
+}
+
+// The directories in which a session has one of its own.
+std::vector<std::string> SessionData::places() const {
+  std::vector<std::string> places;
+  for (const Area area : kAreas) places.push_back(shared_->pathForArea(area, ""));
+  places.push_back(accounts_);
+  return places;
+}
+
+std::uint64_t SessionData::bytesOf(const std::string& tag) const {
+  std::uint64_t bytes = 0;
+  for (const std::string& place : places()) bytes += bytesBelow(fileUtils_->combinePath(place, nameOf(tag)));
+  return bytes;
+}
+
+std::uint64_t SessionData::bytesBelow(const std::string& directory) const {
+  std::uint64_t bytes = 0;
+  std::vector<std::string> waiting = {directory};
+  while (!waiting.empty()) {
+    const std::string path = std::move(waiting.back());
+    waiting.pop_back();
+    if (fileUtils_->isSymLink(path)) continue;
+    try {
+      for (const FileUtils::Info& entry : fileUtils_->listDirectory(path)) {
+        if (entry.type == FileUtils::Type::Directory) waiting.push_back(entry.path);
+        bytes += static_cast<std::uint64_t>(entry.size);
+      }
+    } catch (const FileUtilsIoException& error) {
+      if (error.code() != ENOENT) throw;
+    }
+  }
+  return bytes;
+}
+
+bool SessionData::discard(const std::string& tag) {
+  const std::string name = nameOf(tag);
+  bool isFound = false;
+  std::string remaining;
+  for (const std::string& place : places()) {
+    try {
+      if (discardIn(place, name)) isFound = true;
+    } catch (const FileUtilsIoException& error) {
+      remaining += (remaining.empty() ? "" : "; ") + std::string(error.description());
+    }
+  }
+  if (!remaining.empty()) throw FileUtilsIoException(0, "Data of the session remains: " + remaining);
+  return isFound;
+}
+
+// Whether there was anything. Checks again afterwards: a store that is being created in the background may have created
+// its directory again.
+bool SessionData::discardIn(const std::string& place, const std::string& name) {
+  const std::string path = fileUtils_->combinePath(place, name);
+  int attempts = 0;
+  for (; holds(place, name); ++attempts) {
+    if (attempts == 2) throw FileUtilsIoException(0, "could not move \"" + path + "\" to the trash");
+    trash_->collectPath(path);
+  }
+  return attempts > 0;
+}
+
+// Listing reports a place that cannot be read, but not on every file system which entries are directories.
+bool SessionData::holds(const std::string& place, const std::string& name) const {
+  const auto names = directoriesIn(place);
+  return std::find(names.begin(), names.end(), name) != names.end() ||
+         fileUtils_->pathExists(fileUtils_->combinePath(place, name));
+}
+
+// The names of its directories and links (which may point to directories). None if the place does not exist yet.
+std::vector<std::string> SessionData::directoriesIn(const std::string& place) const {
+  std::vector<std::string> names;
+  try {
+    for (const FileUtils::Info& entry : fileUtils_->listDirectory(place)) {
+      if (entry.type != FileUtils::Type::File) names.push_back(fileUtils_->basename(entry.path));
+    }
+  } catch (const FileUtilsIoException& error) {
+    if (error.code() != ENOENT) {
+      throw FileUtilsIoException(error.code(), "could not read \"" + place + "\": " + error.description());
+    }
+  }
+  return names;
+}
+
+}  // namespace velmora::mobile::xplat::cellar::host
