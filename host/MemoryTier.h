@@ -26,7 +26,8 @@ namespace velmora::mobile::xplat::cellar::host {
 // returned, before its future is ready: a fetch is answered from memory, or behind the change in the store's order. If
 // the change then fails, the value is no longer in memory, and fetches return what the store has. A fetch that was
 // under way when its key was changed returns the older or the newer value, and does not put it into memory. While a
-// clear is under way nothing is put into memory; what is stored meanwhile may be cleared too, as with the store.
+// clear is under way nothing is put into memory; as with the store, what is stored meanwhile may be cleared too, and a
+// fetch may return what is not cleared yet.
 //
 // What happens in the store without the tier is not noticed. A value that has expired, was pruned, or was lost with a
 // damaged manifest is served from memory as long as it stays there; so is the old value of a key that was stored or

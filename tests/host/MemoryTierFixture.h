@@ -1,11 +1,10 @@
 #pragma once
 
 #include <cstddef>
+#include <deque>
 #include <future>
 #include <memory>
 #include <string>
-#include <utility>
-#include <vector>
 
 #include "host/MemoryTier.h"
 #include "support/KeyValueStoreFixture.h"
@@ -85,7 +84,7 @@ class MemoryTierFixture : public KeyValueStoreFixture {
   }
 
   int productions = 0;
-  std::vector<std::unique_ptr<Promise<Bytes>>> promises;  // of the productions that are under way
+  std::deque<std::unique_ptr<Promise<Bytes>>> promises;  // of the productions that are under way
   std::unique_ptr<host::MemoryTier> tier;
 };
 
