@@ -32,7 +32,7 @@ Future<void> MemoryTier::store(const std::string& key, Bytes bytes, Metadata met
   return store(key, std::make_shared<const Bytes>(std::move(bytes)), std::move(metadata));
 }
 
-Future<void> MemoryTier::store(const std::string& key, Value value, Metadata metadata) {
+Future<void> MemoryTier::store(const std::string& key, const Value& value, Metadata metadata) {
   if (value == nullptr) throw std::invalid_argument("A memory tier stores no null value.");
   return std::shared_ptr<State>(state_)->store(key, value, std::move(metadata));
 }

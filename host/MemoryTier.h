@@ -48,7 +48,8 @@ class CELLAR_EXPORT MemoryTier {
   // queue of the store, which it would block. For work that blocks there is `dispatchTask<Bytes>(queue, work)`.
   using Producer = std::function<Future<Bytes>()>;
 
-  // What an entry takes besides its key and its value, in bytes: its place in the table and what the allocator adds.
+  // What an entry takes besides its key and its value, in bytes: its place in the table and what the allocator adds. On
+  // 64-bit Linux 204 to 214 were measured, and 172 to 182 for keys of at most 15 bytes.
   static constexpr std::size_t kEntryOverhead = 26 * sizeof(void*);
 
   // A value whose entry would take more than the bound divided by this is not kept in memory.
@@ -78,7 +79,7 @@ class CELLAR_EXPORT MemoryTier {
   // Stores the value in memory and in the store, which copies it. Ready, or failed, when the store's future is. A null
   // value throws `std::invalid_argument`.
   Future<void> store(const std::string& key, Bytes bytes, Metadata metadata = nullptr);
-  Future<void> store(const std::string& key, Value value, Metadata metadata = nullptr);
+  Future<void> store(const std::string& key, const Value& value, Metadata metadata = nullptr);
 
   // Removes the key from both. Not an error: a key that is not there.
   Future<void> remove(const std::string& key);

@@ -7,6 +7,7 @@ const std::vector<Benchmark>& benchmarks() {
       {"store", "Storing: microseconds for each of many new values", measureStores},
       {"durability", "Durability: microseconds for each of many new values", measureDurability},
       {"fetch", "Fetching: microseconds for each of many values that are there", measureFetches},
+      {"memory", "Finding a value in memory: microseconds for each", measureMemoryHits},
       {"caller", "The caller's time: microseconds until a call returns", measureCallers},
       {"prune", "Pruning: microseconds for each removed item", measurePrunes},
       {"capacity", "Writing to a store at its capacity: microseconds for each write", measureCapacity},

@@ -11,6 +11,7 @@ namespace velmora::mobile::xplat::cellar::bench {
 void measureStores(const Context& context);
 void measureDurability(const Context& context);
 void measureFetches(const Context& context);
+void measureMemoryHits(const Context& context);
 void measureCallers(const Context& context);
 void measurePrunes(const Context& context);
 void measureCapacity(const Context& context);

@@ -75,7 +75,6 @@ void MemoryTier::State::put(const Lock& /*lock*/, const std::string& key, const 
 void MemoryTier::State::forget(const std::string& key) {
   const Lock lock(mutex_);
   table_.erase(key);
-  flights_.erase(key);
 }
 
 void MemoryTier::State::trim(std::size_t bytes) {

@@ -70,6 +70,18 @@ TEST_F(MemoryTierInterleaving, AFetchThatIsOvertakenByAClearIsNotKept) {
   EXPECT_EQ(fetched("a"), "<miss>");
 }
 
+TEST_F(MemoryTierInterleaving, AFetchDoesNotJoinOneFromBeforeAClear) {
+  openTier();
+  put("a", "old");
+  const Got before = watch(tier->fetch("a"));
+  work().runNext();
+  const Written cleared = watch(tier->clear());
+  const Got behind = watch(tier->fetch("a"));
+  settle();
+  EXPECT_EQ(told(before), "old");
+  EXPECT_EQ(told(behind), "<miss>");
+}
+
 TEST_F(MemoryTierInterleaving, AFetchThatBeginsDuringAClearIsNotKept) {
   openTier();
   put("a", "old");
