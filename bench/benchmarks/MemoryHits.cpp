@@ -121,8 +121,12 @@ void measureCase(const Context& context, const Place& place, bool pinned, const 
   figures["ours"] = found;
   context.report.add(Row{sizeName(what.size) + ", find", place.name, cpuName(pinned), "us", figures, what.goals});
   figures["ours"] = fetched;
-  context.report.add(
-      Row{sizeName(what.size) + ", fetch and await", place.name, cpuName(pinned), "us", figures, {{"fastest competitor", kNoLimit}}});
+  context.report.add(Row{sizeName(what.size) + ", fetch and await",
+                         place.name,
+                         cpuName(pinned),
+                         "us",
+                         figures,
+                         {{"fastest competitor", kNoLimit}}});
 }
 
 }  // namespace

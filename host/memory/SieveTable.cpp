@@ -14,24 +14,24 @@ SieveTable::Value SieveTable::find(const std::string& key) {
 void SieveTable::put(const std::string& key, Value value) {
   const std::size_t cost = key.size() + value->capacity() + MemoryTier::kEntryOverhead;
   const bool isKept = cost <= maxBytes_ / MemoryTier::kLargestPart;
-  const auto found = entries_.find(key);
-  if (found != entries_.end()) {
-    if (isKept && replace(found->second, value, cost)) return;
-    erase(found);
-  }
+  auto found = entries_.find(key);
+  if (found != entries_.end() && isKept) return replace(found, std::move(value), cost);
+  erase(found);
   if (!isKept) return;
   trim(maxBytes_ - cost);
   add(key, std::move(value), cost);
 }
 
-// In its place; false when there is not enough room.
-bool SieveTable::replace(Entry& entry, Value& value, std::size_t cost) {
-  if (bytes_ - entry.cost > maxBytes_ - cost) return false;
-  bytes_ = bytes_ - entry.cost + cost;
-  entry.cost = cost;
+// In its place, and others make room for it: an entry of no cost is not evicted.
+void SieveTable::replace(Entries::iterator found, Value value, std::size_t cost) {
+  Entry& entry = found->second;
+  bytes_ -= entry.cost;
+  entry.cost = 0;
   entry.value = std::move(value);
+  trim(maxBytes_ - cost);
   entry.isVisited = true;
-  return true;
+  entry.cost = cost;
+  bytes_ += cost;
 }
 
 void SieveTable::add(const std::string& key, Value value, std::size_t cost) {
@@ -58,7 +58,7 @@ void SieveTable::clear() {
 
 void SieveTable::evict() {
   Entry* entry = hand_ != nullptr ? hand_ : oldest_;
-  while (entry->isVisited) {
+  while (entry->isVisited || entry->cost == 0) {
     entry->isVisited = false;
     entry = entry->newer != nullptr ? entry->newer : oldest_;
   }

@@ -44,7 +44,7 @@ class SieveTable {
   };
   using Entries = std::unordered_map<std::string, Entry>;
 
-  bool replace(Entry& entry, Value& value, std::size_t cost);
+  void replace(Entries::iterator found, Value value, std::size_t cost);
   void add(const std::string& key, Value value, std::size_t cost);
   void evict();
   void erase(Entries::iterator found);

@@ -183,6 +183,17 @@ TEST_F(MemoryTier, AValueThatGrowsIsKeptAndOthersGo) {
   EXPECT_EQ(tier->counts().entries, 7u);
 }
 
+TEST_F(MemoryTier, AValueThatGrowsWhereTheHandStandsIsKeptAlsoWhenAllOthersWereFound) {
+  openTier(8 * (kOverhead + 2));
+  const std::string keys = "abcdefgh";
+  for (const char key : keys) keep({key}, "1");
+  for (const char key : keys) EXPECT_EQ(inMemory({key}), "1");
+  keep("a", std::string(1 + kOverhead, 'x'));
+  EXPECT_EQ(inMemory("a"), std::string(1 + kOverhead, 'x'));
+  EXPECT_EQ(inMemory("b"), "<miss>");
+  EXPECT_EQ(tier->counts().entries, 7u);
+}
+
 // --- Trimming ---
 
 TEST_F(MemoryTier, TrimsToAtMostSoManyBytesAndKeepsThemInTheStore) {
