@@ -129,8 +129,8 @@ bool Host::endThreads() {
 
 std::shared_ptr<StoreManager> Host::manager(const std::string& name, const std::optional<std::string>& sessionKey) {
   const auto definition = configuration_->getManager(name);
-  const ManagerScopes::Request request = definition->sessionScoped ? ManagerScopes::Request(*scopes_, sessionKey)
-                                                                   : ManagerScopes::Request(*scopes_);
+  const ManagerScopes::Request request =
+      definition->sessionScoped ? ManagerScopes::Request(*scopes_, sessionKey) : ManagerScopes::Request(*scopes_);
   return managerIn(*definition, *request.scope(), request.slot(name));
 }
 
@@ -141,8 +141,8 @@ std::shared_ptr<StoreManager> Host::managerOfStore(const std::string& storeIdent
 
 std::shared_ptr<Store> Host::getStore(const std::string& identifier, const std::optional<std::string>& sessionKey) {
   const auto definition = configuration_->getManager(configuration_->getStore(identifier)->managerName);
-  const ManagerScopes::Request request = definition->sessionScoped ? ManagerScopes::Request(*scopes_, sessionKey)
-                                                                   : ManagerScopes::Request(*scopes_);
+  const ManagerScopes::Request request =
+      definition->sessionScoped ? ManagerScopes::Request(*scopes_, sessionKey) : ManagerScopes::Request(*scopes_);
   return storeIn(*definition, *request.scope(), request.slot(definition->name), identifier);
 }
 
@@ -221,7 +221,9 @@ void Host::logOut() {
                          ". Name the one to end, as in logOut(sessionKey).");
 }
 
-bool Host::logOut(const std::string& sessionKey) { return logOut(StoredSession{sessionTagMapper_(sessionKey), sessionKey}); }
+bool Host::logOut(const std::string& sessionKey) {
+  return logOut(StoredSession{sessionTagMapper_(sessionKey), sessionKey});
+}
 
 bool Host::logOut(const StoredSession& session) {
   refuseOnQueueThread("Host::logOut");

@@ -114,11 +114,11 @@ enum class SessionSizes { Skipped, Measured };
 // Under the root: "caches", "documents", "shared" (the areas), "trash" and the lock file "_cellar_lock". One host at a
 // time may use a root, in all processes together. Any thread may call.
 //
-// Sessions: one at a time, unless the options say otherwise. The first request with a session key opens that session; if the first request for a
-// session-scoped manager has no key, it opens the session "". Later requests without a key mean the open session.
-// Requests for another session throw until `logOut`, because a manager keeps its first session and its maintenance
-// removes all others. Managers without session scope ignore keys. After a restart no session is open, and the data of
-// the last one is still there: `sessions` lists it, and `logOut(sessionKey)` discards it.
+// Sessions: one at a time, unless the options say otherwise. The first request with a session key opens that session;
+// if the first request for a session-scoped manager has no key, it opens the session "". Later requests without a key
+// mean the open session. Requests for another session throw until `logOut`, because a manager keeps its first session
+// and its maintenance removes all others. Managers without session scope ignore keys. After a restart no session is
+// open, and the data of the last one is still there: `sessions` lists it, and `logOut(sessionKey)` discards it.
 //
 // With `HostOptions::accounts = Accounts::Kept` each request with a key opens that session beside the others. A request
 // without a key means the open session, or opens the session "" if none is open; it throws `std::logic_error` if there
@@ -194,8 +194,8 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   // Throws `FileUtilsIoException` when an area cannot be read.
   std::vector<StoredSession> sessions(SessionSizes sizes = SessionSizes::Skipped) const;
 
-  // Ends the open sessions, if there are any, and also discards the data of the other managers that were requested. Waits
-  // and throws as `logOut`.
+  // Ends the open sessions, if there are any, and also discards the data of the other managers that were requested.
+  // Waits and throws as `logOut`.
   void invalidate() override;
 
   // The host's services, for your own use. Only `analytics` can be null.

@@ -13,9 +13,7 @@ const std::string& Session::key() const { return scope_->key; }
 
 bool Session::isOpen() const { return host_->isOpen(scope_); }
 
-std::shared_ptr<StoreManager> Session::manager(const std::string& name) const {
-  return host_->managerOf(scope_, name);
-}
+std::shared_ptr<StoreManager> Session::manager(const std::string& name) const { return host_->managerOf(scope_, name); }
 
 std::shared_ptr<Store> Session::getStore(const std::string& identifier) const {
   return host_->storeOf(scope_, identifier);

@@ -11,8 +11,8 @@ namespace velmora::mobile::xplat::cellar::host {
 
 // Serial queues on a few threads, for applications that have no queues of their own. However many queues there are, the
 // threads are one for each processor that the creating thread may use, named "cellar-1", "cellar-2" and so on, one more
-// because tasks wait for the disk, and one for all timers ("cellar-timer"). Any thread may call, and a queue may be used
-// from its own tasks.
+// because tasks wait for the disk, and one for all timers ("cellar-timer"). Any thread may call, and a queue may be
+// used from its own tasks.
 //
 // Queues: tasks of one queue run one at a time in the order of dispatch, each time on any of the threads. An exception
 // that leaves a task is one error line in the log, which names the queue ("cellar-file-1", "cellar-work-2"), and the
