@@ -9,6 +9,7 @@
 #include <string>
 #include <utility>
 
+#include "host/QueueThreadMark.h"
 #include "host/queues/Deadline.h"
 #include "host/queues/SerialQueue.h"
 #include "host/queues/ThreadPool.h"
@@ -89,8 +90,11 @@ std::shared_ptr<AsyncExecutor> ThreadQueueFactory::createWorkQueue() {
 }
 
 void ThreadQueueFactory::refuseOnQueueThread(const std::string& operation, const std::string& advice) {
-  if (!ThreadPool::isThreadOfAnyPool()) return;
-  throw std::logic_error(operation + " may deadlock on a thread of the host kit's queues. " + advice);
+  const bool isMarked = QueueThreadMark::tell(operation);
+  if (ThreadPool::isThreadOfAnyPool()) {
+    throw std::logic_error(operation + " may deadlock on a thread of the host kit's queues. " + advice);
+  }
+  if (isMarked) throw std::logic_error(operation + " may deadlock in a task of a queue. " + advice);
 }
 
 bool ThreadQueueFactory::drain(std::chrono::milliseconds patience) {

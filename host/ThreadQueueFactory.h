@@ -50,8 +50,8 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   std::shared_ptr<AsyncExecutor> createQueue() override;
   std::shared_ptr<AsyncExecutor> createWorkQueue() override;
 
-  // Throws `std::logic_error` on a thread of any factory: what `operation` waits for may have to run there. The text
-  // names the operation and ends with the advice.
+  // Throws `std::logic_error` on a thread of any factory and under a `QueueThreadMark`: what `operation` waits for may
+  // have to run there. The text names the operation and ends with the advice.
   static void refuseOnQueueThread(const std::string& operation, const std::string& advice);
 
   // Waits until no queue has anything to run, including what tasks dispatch to other queues; false if that takes longer
