@@ -51,26 +51,34 @@ template <class Queue> class FactoryOf : public TaskQueueFactory {
   host::ThreadQueueFactory kit_;
 };
 
-// A pool of two threads that take turns. Its second task has begun when its `dispatch` returns, so that it is sure to
-// run beside a first one that takes longer.
+// A pool of two threads that take turns. A second task that is dispatched while the first one is held has run when its
+// `dispatch` returns, so that they are sure to overlap.
 class PooledQueue : public PassingQueue {
  public:
   explicit PooledQueue(TaskQueueFactory& kit) : PassingQueue(kit), other_(kit.createQueue()) {}
 
   void dispatch(Task task) override {
     const int number = ++count_;
-    if (number % 2 == 1) return queue->dispatch(std::move(task));
-    if (number > 2) return other_->dispatch(std::move(task));
-    Latch begun(1);
-    other_->dispatch([&begun, task = std::move(task)] {
-      begun.countDown();
-      task();
-    });
-    begun.wait();
+    if (number == 1) {
+      queue->dispatch([firstHasEnded = firstHasEnded_, task = std::move(task)] {
+        task();
+        *firstHasEnded = true;
+      });
+    } else if (number > 2 || *firstHasEnded_) {
+      (number % 2 == 1 ? queue : other_)->dispatch(std::move(task));
+    } else {
+      Latch ended(1);
+      other_->dispatch([&ended, task = std::move(task)] {
+        task();
+        ended.countDown();
+      });
+      ended.wait();
+    }
   }
 
  private:
   const std::shared_ptr<AsyncExecutor> other_;
+  const std::shared_ptr<std::atomic<bool>> firstHasEnded_ = std::make_shared<std::atomic<bool>>(false);
   std::atomic<int> count_{0};
 };
 
