@@ -231,6 +231,9 @@ TEST_F(CheckedQueuesTest, ATimerThatRunsInsideTheCallThatArmsItIsReported) {
 TEST_F(CheckedQueuesTest, ATaskMayRunBeforeItsDispatchReturnsOnAnotherThread) {
   raw->onDispatch = [&] { runBeside(0); };
   queue->dispatch([] {});
+  raw->onDispatch = nullptr;
+  queue->dispatch([] {});
+  raw->run(1);
   EXPECT_THAT(checked.violations(), IsEmpty());
 }
 
