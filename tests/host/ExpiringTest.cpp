@@ -2,8 +2,9 @@
 
 #include <gtest/gtest.h>
 
-#include <atomic>
+#include <algorithm>
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <future>
 #include <limits>
@@ -26,7 +27,6 @@ namespace {
 using std::string;
 using std::chrono::seconds;
 using test::Bytes;
-using test::bytesOf;
 using test::ManualExecutor;
 
 // What has become of a `get`: "<pending>", "<miss>", "<error>" with its text, or the value.

@@ -3,12 +3,11 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <future>
-#include <map>
 #include <memory>
 #include <optional>
 #include <stdexcept>
@@ -319,7 +318,7 @@ TEST_F(TypedStoreTest, NamesTheStoreByItsDirectory) {
     close();
     options.directory = path;
     openUnloaded();
-    const string name = detail::nameOf(*store);
+    string name = detail::nameOf(*store);
     settle();
     return name;
   };
@@ -341,9 +340,10 @@ struct XorCodec {
 };
 
 TEST_F(TypedStoreTest, UsesTheCodecThatItWasGiven) {
-  const TypedStore<string, XorCodec> secrets(store, XorCodec{1});
-  const auto copy = secrets;
-  done(secrets.put("a", "bcd"));
+  auto secrets = std::make_unique<TypedStore<string, XorCodec>>(store, XorCodec{1});
+  const TypedStore<string, XorCodec> copy = *secrets;
+  done(secrets->put("a", "bcd"));
+  secrets.reset();
   EXPECT_EQ(get("a"), "cbe");
   EXPECT_EQ(valueOf(copy.get("a")), "bcd");
   EXPECT_EQ(valueOf(TypedStore<string, XorCodec>(store, XorCodec{0}).get("a")), "cbe");
