@@ -14,6 +14,12 @@
 
 namespace velmora::mobile::xplat::cellar::host {
 
+namespace detail {
+// Whether T itself is known to refer to what it does not contain.
+template <class T> constexpr bool kIsReference = std::is_pointer_v<T> || std::is_member_pointer_v<T> ||
+                                                 std::is_null_pointer_v<T> || std::is_same_v<T, std::string_view>;
+}  // namespace detail
+
 // A codec turns values of a type into bytes and back, for a `TypedStore`. It is any type with these two functions,
 // which may be static:
 //
@@ -44,8 +50,7 @@ struct StringCodec {
 template <class T> struct TrivialCodec {
   static_assert(std::is_trivially_copyable_v<T> && std::is_default_constructible_v<T>,
                 "TrivialCodec is for types that can be copied as memory; others need a codec of their own.");
-  static_assert(!std::is_pointer_v<T> && !std::is_member_pointer_v<T> && !std::is_null_pointer_v<T> &&
-                    !std::is_convertible_v<T, std::string_view>,
+  static_assert(!detail::kIsReference<T>,
                 "A pointer or a view does not contain what it refers to: store that instead.");
 
   static std::vector<unsigned char> encode(const T& value) {
@@ -67,8 +72,12 @@ template <class T> struct TrivialCodec {
 
 // JSON text, for `JsonValue` and what the JSON library converts to and from it: types with `to_json` and `from_json`,
 // and vectors, maps and the like of these. Throws what the JSON library throws: when encoding, for a text that is not
-// UTF-8. Numbers that are not finite become null.
+// UTF-8. Numbers that are not finite become null. A T with views in it, as a vector of `std::string_view`, refers to
+// memory that is gone once it is read.
 template <class T> struct JsonCodec {
+  static_assert(!detail::kIsReference<T>,
+                "A pointer or a view does not contain what it refers to: store that instead.");
+
   static std::vector<unsigned char> encode(const T& value) {
     if constexpr (std::is_same_v<T, JsonValue>) {
       return StringCodec::encode(value.dump());
@@ -91,7 +100,7 @@ namespace detail {
 
 template <class T, class = void> struct HasJson : std::false_type {};
 template <class T> struct HasJson<T, std::void_t<decltype(std::declval<const JsonValue&>().template get<T>())>>
-    : std::is_constructible<JsonValue, const T&> {};
+    : std::bool_constant<std::is_constructible_v<JsonValue, const T&> && !kIsReference<T>> {};
 
 template <class T> struct NoCodec {
   static_assert(!std::is_same_v<T, T>,

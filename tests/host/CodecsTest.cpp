@@ -8,6 +8,7 @@
 #include <map>
 #include <stdexcept>
 #include <string>
+#include <string_view>
 #include <type_traits>
 #include <vector>
 
@@ -126,6 +127,12 @@ TEST(DefaultCodec, FollowsTheType) {
   EXPECT_TRUE((std::is_base_of_v<JsonCodec<JsonValue>, DefaultCodec<JsonValue>>));
   EXPECT_TRUE((std::is_base_of_v<JsonCodec<Draft>, DefaultCodec<Draft>>));
   EXPECT_TRUE((std::is_base_of_v<JsonCodec<std::vector<Draft>>, DefaultCodec<std::vector<Draft>>>));
+}
+
+TEST(DefaultCodec, IsNotThereForWhatRefersToOtherMemory) {
+  EXPECT_FALSE(detail::HasJson<std::string_view>::value);
+  EXPECT_FALSE(detail::HasJson<const char*>::value);
+  EXPECT_FALSE(detail::HasJson<const std::string*>::value);
 }
 
 TEST(DefaultCodec, StoresAStructureAsMemoryOnlyWhenAsked) { EXPECT_FALSE(detail::HasJson<Point>::value); }
