@@ -32,10 +32,8 @@ struct Draft {
   int revision = 0;
 };
 
-void to_json(JsonValue& json, const Draft& draft) {  // NOLINT(readability-identifier-naming): the library's name
-  json = {{"title", draft.title}, {"revision", draft.revision}};
-}
-void from_json(const JsonValue& json, Draft& draft) {  // NOLINT(readability-identifier-naming)
+void to_json(JsonValue& json, const Draft& draft) { json = {{"title", draft.title}, {"revision", draft.revision}}; }
+void from_json(const JsonValue& json, Draft& draft) {
   draft = {json.at("title").get<std::string>(), json.at("revision").get<int>()};
 }
 
