@@ -1,4 +1,4 @@
-// Keeps thumbnails in memory in front of their cache. usage: kit-memory_tier NEW-DIRECTORY
+// Keeps thumbnails in memory in front of their cache. usage: kit-memory-tier NEW-DIRECTORY
 // KIT: begin
 #include <cellar/Cellar.h>
 #include <cellar/host/Await.h>

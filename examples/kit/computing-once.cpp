@@ -1,4 +1,4 @@
-// Downloads a picture once for all who want it. usage: kit-computing_once NEW-DIRECTORY
+// Downloads a picture once for all who want it. usage: kit-computing-once NEW-DIRECTORY
 // KIT: begin
 #include <cellar/Cellar.h>
 #include <cellar/host/Await.h>
