@@ -127,8 +127,8 @@ class User {
     for (auto& write : std::exchange(writes_, {})) {
       attempt([&] { await(std::move(write)); });
     }
-    for (auto& [key, fetch] : std::exchange(fetches_, {})) {
-      attempt([&, &expected = key] {
+    for (auto& pair : std::exchange(fetches_, {})) {
+      attempt([&, &expected = pair.first, &fetch = pair.second] {
         const auto found = await(std::move(fetch));
         if (found != nullptr && !isValueOf(expected.first, expected.second, found->value)) ++tally_.strange;
       });

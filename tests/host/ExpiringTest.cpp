@@ -196,7 +196,7 @@ TEST_F(ExpiringTest, NamesTheReasonOfTheOtherCodec) {
   auto value = numbers.get("a");
   settle();
   try {
-    await(value);
+    static_cast<void>(await(value));
     FAIL() << "It has three bytes.";
   } catch (const DecodeError& error) {
     EXPECT_STREQ(error.what(), "The value of 'a' in store 'store' cannot be decoded: 3 bytes instead of 4.");
