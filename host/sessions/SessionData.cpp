@@ -18,6 +18,8 @@ namespace {
 
 constexpr std::array<Area, 3> kAreas = {Area::Caches, Area::Documents, Area::Shared};
 
+const std::string kAccountPrefix = "session_";  // before a tag, which may be empty
+
 }  // namespace
 
 SessionData::SessionData(std::string root, bool severalKept, std::shared_ptr<FileUtils> fileUtils,
@@ -30,20 +32,22 @@ SessionData::SessionData(std::string root, bool severalKept, std::shared_ptr<Fil
       nameBuilders_(std::move(nameBuilders)),
       shared_(std::make_shared<DirectoryPathLocations>(std::move(root))) {}
 
-std::string SessionData::nameOf(const std::string& tag) const {
+std::string SessionData::managerName(const std::string& tag) const {
   return nameBuilders_->createStoreDirectoryNameBuilder(tag)->buildStoreManagerName();
 }
 
-std::string SessionData::accountPath(const std::string& name) const { return fileUtils_->combinePath(accounts_, name); }
+std::string SessionData::accountPath(const std::string& tag) const {
+  return fileUtils_->combinePath(accounts_, kAccountPrefix + tag);
+}
 
 std::shared_ptr<PathLocations> SessionData::locationsOf(const std::string& tag) const {
-  return severalKept_ ? std::make_shared<DirectoryPathLocations>(accountPath(nameOf(tag))) : shared_;
+  return severalKept_ ? std::make_shared<DirectoryPathLocations>(accountPath(tag)) : shared_;
 }
 
 void SessionData::adopt(const std::string& tag) {
   if (!severalKept_ && !fileUtils_->pathExists(accounts_)) return;
-  const std::string name = nameOf(tag);
-  DirectoryPathLocations account(accountPath(name));
+  const std::string name = managerName(tag);
+  DirectoryPathLocations account(accountPath(tag));
   PathLocations& from = severalKept_ ? *shared_ : account;
   PathLocations& to = severalKept_ ? account : *shared_;
   for (const Area area : kAreas) {
@@ -59,27 +63,26 @@ std::vector<std::string> SessionData::tags() const {
   const auto names = nameBuilders_->createStoreDirectoryNameBuilder("");
   const std::size_t prefix = names->buildStoreManagerName().size();
   std::set<std::string> tags;
-  const auto addThoseIn = [&](const std::string& place) {
-    for (const std::string& name : names->filterStoreManagerNames({}, directoriesIn(place))) {
-      tags.insert(name.substr(prefix));
-    }
-  };
-  for (const Area area : kAreas) addThoseIn(shared_->pathForArea(area, ""));
-  addThoseIn(accounts_);
+  for (const Area area : kAreas) {
+    const auto directories = directoriesIn(shared_->pathForArea(area, ""));
+    for (const std::string& name : names->filterStoreManagerNames({}, directories)) tags.insert(name.substr(prefix));
+  }
+  for (const std::string& name : directoriesIn(accounts_)) {
+    if (name.rfind(kAccountPrefix, 0) == 0) tags.insert(name.substr(kAccountPrefix.size()));
+  }
   return {tags.begin(), tags.end()};
 }
 
-// The directories in which a session has one of its own.
-std::vector<std::string> SessionData::places() const {
-  std::vector<std::string> places;
-  for (const Area area : kAreas) places.push_back(shared_->pathForArea(area, ""));
-  places.push_back(accounts_);
+std::vector<SessionData::Place> SessionData::placesOf(const std::string& tag) const {
+  std::vector<Place> places;
+  for (const Area area : kAreas) places.push_back({shared_->pathForArea(area, ""), managerName(tag)});
+  places.push_back({accounts_, kAccountPrefix + tag});
   return places;
 }
 
 std::uint64_t SessionData::bytesOf(const std::string& tag) const {
   std::uint64_t bytes = 0;
-  for (const std::string& place : places()) bytes += bytesBelow(fileUtils_->combinePath(place, nameOf(tag)));
+  for (const Place& place : placesOf(tag)) bytes += bytesBelow(fileUtils_->combinePath(place.directory, place.name));
   return bytes;
 }
 
@@ -103,12 +106,11 @@ std::uint64_t SessionData::bytesBelow(const std::string& directory) const {
 }
 
 bool SessionData::discard(const std::string& tag) {
-  const std::string name = nameOf(tag);
   bool isFound = false;
   std::string remaining;
-  for (const std::string& place : places()) {
+  for (const Place& place : placesOf(tag)) {
     try {
-      if (discardIn(place, name)) isFound = true;
+      if (discardAt(place)) isFound = true;
     } catch (const FileUtilsIoException& error) {
       remaining += (remaining.empty() ? "" : "; ") + std::string(error.description());
     }
@@ -119,10 +121,10 @@ bool SessionData::discard(const std::string& tag) {
 
 // Whether there was anything. Checks again afterwards: a store that is being created in the background may have created
 // its directory again.
-bool SessionData::discardIn(const std::string& place, const std::string& name) {
-  const std::string path = fileUtils_->combinePath(place, name);
+bool SessionData::discardAt(const Place& place) {
+  const std::string path = fileUtils_->combinePath(place.directory, place.name);
   int attempts = 0;
-  for (; holds(place, name); ++attempts) {
+  for (; holds(place); ++attempts) {
     if (attempts == 2) throw FileUtilsIoException(0, "could not move \"" + path + "\" to the trash");
     trash_->collectPath(path);
   }
@@ -130,22 +132,22 @@ bool SessionData::discardIn(const std::string& place, const std::string& name) {
 }
 
 // Listing reports a place that cannot be read, but not on every file system which entries are directories.
-bool SessionData::holds(const std::string& place, const std::string& name) const {
-  const auto names = directoriesIn(place);
-  return std::find(names.begin(), names.end(), name) != names.end() ||
-         fileUtils_->pathExists(fileUtils_->combinePath(place, name));
+bool SessionData::holds(const Place& place) const {
+  const auto names = directoriesIn(place.directory);
+  return std::find(names.begin(), names.end(), place.name) != names.end() ||
+         fileUtils_->pathExists(fileUtils_->combinePath(place.directory, place.name));
 }
 
-// The names of its directories and links (which may point to directories). None if the place does not exist yet.
-std::vector<std::string> SessionData::directoriesIn(const std::string& place) const {
+// The names of its directories and links (which may point to directories). None if it does not exist yet.
+std::vector<std::string> SessionData::directoriesIn(const std::string& path) const {
   std::vector<std::string> names;
   try {
-    for (const FileUtils::Info& entry : fileUtils_->listDirectory(place)) {
+    for (const FileUtils::Info& entry : fileUtils_->listDirectory(path)) {
       if (entry.type != FileUtils::Type::File) names.push_back(fileUtils_->basename(entry.path));
     }
   } catch (const FileUtilsIoException& error) {
     if (error.code() != ENOENT) {
-      throw FileUtilsIoException(error.code(), "could not read \"" + place + "\": " + error.description());
+      throw FileUtilsIoException(error.code(), "could not read \"" + path + "\": " + error.description());
     }
   }
   return names;

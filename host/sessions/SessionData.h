@@ -20,7 +20,7 @@ namespace host {
 // in areas of their own.
 //
 //   caches/_store_alice                       the session with the tag "alice", one at a time
-//   accounts/_store_alice/caches/_store_alice  the same, several kept
+//   accounts/session_alice/caches/_store_alice  the same, several kept
 //
 // Whatever the host keeps now, data is found, moved and discarded in both places. Any thread may call; what is not
 // about one session that others do not use at the same time is a snapshot.
@@ -48,12 +48,17 @@ class SessionData {
   bool discard(const std::string& tag);
 
  private:
-  std::string nameOf(const std::string& tag) const;
-  std::string accountPath(const std::string& name) const;
-  std::vector<std::string> places() const;
-  bool discardIn(const std::string& place, const std::string& name);
-  bool holds(const std::string& place, const std::string& name) const;
-  std::vector<std::string> directoriesIn(const std::string& place) const;
+  struct Place {
+    std::string directory;
+    std::string name;
+  };
+
+  std::string managerName(const std::string& tag) const;
+  std::string accountPath(const std::string& tag) const;
+  std::vector<Place> placesOf(const std::string& tag) const;
+  bool discardAt(const Place& place);
+  bool holds(const Place& place) const;
+  std::vector<std::string> directoriesIn(const std::string& path) const;
   std::uint64_t bytesBelow(const std::string& directory) const;
 
   const std::string accounts_;  // the directory of the sessions' own areas

@@ -402,10 +402,11 @@ TEST_F(Coroutines, GoFromQueueToQueue) {
   const auto first = queues.createQueue();
   const auto second = queues.createWorkQueue();
   const auto wander = [](std::shared_ptr<AsyncExecutor> one, std::shared_ptr<AsyncExecutor> other) -> Future<int> {
+    const auto caller = std::this_thread::get_id();
     int hops = 0;
     for (int i = 0; i < 200; ++i) {
-      const auto here = co_await resumeOn(dispatchTask<std::thread::id>(one, std::this_thread::get_id), other);
-      if (here != std::this_thread::get_id()) ++hops;
+      const auto there = co_await resumeOn(dispatchTask<std::thread::id>(one, std::this_thread::get_id), other);
+      if (there != caller && std::this_thread::get_id() != caller) ++hops;
     }
     co_return hops;
   };

@@ -101,8 +101,8 @@ TEST_F(SessionTest, EachHasAreasOfItsOwnAndWhatHasNoSessionIsShared) {
   alice.manager("archive");
   EXPECT_EQ(alice.manager("web"), host->openSession("bob").manager("web"));
   EXPECT_EQ(alice.store<PersistentKeyValueStore>("pages"), host->store<PersistentKeyValueStore>("pages"));
-  EXPECT_TRUE(directory.exists("accounts/_store_%41l%2fice/caches/_store_%41l%2fice"));
-  EXPECT_TRUE(directory.exists("accounts/_store_%41l%2fice/documents/_store_%41l%2fice"));
+  EXPECT_TRUE(directory.exists("accounts/session_%41l%2fice/caches/_store_%41l%2fice"));
+  EXPECT_TRUE(directory.exists("accounts/session_%41l%2fice/documents/_store_%41l%2fice"));
   EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_sessionlessStore"});
 }
 
@@ -128,7 +128,7 @@ TEST_F(SessionTest, EndingOneDiscardsItsDataAndLeavesTheOthers) {
   const auto letters = alice.store<PersistentKeyValueStore>("letters");
   EXPECT_TRUE(alice.end());
   EXPECT_FALSE(alice.isOpen());
-  EXPECT_FALSE(directory.exists("accounts/_store_alice"));
+  EXPECT_FALSE(directory.exists("accounts/session_alice"));
   EXPECT_THROW(static_cast<void>(await(letters->fetch("key"))), InvalidatedException);
   EXPECT_EQ(get(bob, "letters"), "of bob");
 }
@@ -176,7 +176,7 @@ TEST_F(SessionTest, ARequestWithoutAKeyMeansTheOnlyOneAndIsRefusedIfThereAreSeve
 TEST_F(SessionTest, WithoutAnyARequestWithoutAKeyOpensTheEmptyOne) {
   const auto host = start();
   host->manager("inbox");
-  EXPECT_TRUE(directory.exists("accounts/_store_/caches/_store_"));
+  EXPECT_TRUE(directory.exists("accounts/session_/caches/_store_"));
   EXPECT_EQ(host->manager("inbox"), host->openSession("").manager("inbox"));
 }
 
@@ -187,7 +187,7 @@ TEST_F(SessionTest, LoggingOutByKeyEndsAnOpenOneAndDiscardsOneOfAnEarlierRun) {
   put(bob, "letters", "of bob");
   EXPECT_TRUE(host->logOut("alice"));
   EXPECT_FALSE(host->logOut("alice"));
-  EXPECT_FALSE(directory.exists("accounts/_store_alice"));
+  EXPECT_FALSE(directory.exists("accounts/session_alice"));
   EXPECT_TRUE(bob.isOpen());
   EXPECT_TRUE(host->logOut("bob"));
   EXPECT_FALSE(bob.isOpen());
@@ -233,7 +233,7 @@ TEST_F(SessionTest, SizesAreThoseOfAllFilesOfASession) {
   std::ofstream(alice.store<UnmanagedStore>("files")->path + "/deeper/small") << "123";
   std::filesystem::create_symlink("/", alice.store<UnmanagedStore>("files")->path + "/link");
   const Session bob = host->openSession("bob");
-  std::filesystem::create_directories(directory.file("accounts/_store_bob/caches/_store_bob"));
+  std::filesystem::create_directories(directory.file("accounts/session_bob/caches/_store_bob"));
   const auto measured = host->sessions(SessionSizes::Measured);
   ASSERT_EQ(tagsOf(measured), (std::vector<std::string>{"alice", "bob"}));
   EXPECT_EQ(measured[0].key, "alice");
@@ -275,14 +275,14 @@ TEST_F(SessionTest, TheDataOfAnAccountIsFoundWhenOneIsOpenAtATimeAgain) {
             "Another session is open, log out before you ask for a new one.");
   EXPECT_EQ(tagsOf(host->sessions()), (std::vector<std::string>{"alice", "bob"}));
   EXPECT_TRUE(host->logOut("bob"));
-  EXPECT_FALSE(directory.exists("accounts/_store_bob"));
+  EXPECT_FALSE(directory.exists("accounts/session_bob"));
   alice.end();
   EXPECT_TRUE(host->sessions().empty());
 }
 
 TEST_F(SessionTest, DataInBothPlacesStaysAndIsDiscardedTogether) {
   put(start(Accounts::OneAtATime)->openSession("alice"), "letters", "former");
-  std::filesystem::create_directories(directory.file("accounts/_store_alice/caches/_store_alice"));
+  std::filesystem::create_directories(directory.file("accounts/session_alice/caches/_store_alice"));
   const auto host = start();
   const Session alice = host->openSession("alice");
   EXPECT_EQ(get(alice, "letters"), "nothing");

@@ -365,21 +365,30 @@ TEST_F(ThreadQueueFactoryTest, ManyShortLivedQueuesRunEverything) {
 
 // Timers
 
-TEST_F(ThreadQueueFactoryTest, ATimerFiresOnItsQueue) {
+TEST_F(ThreadQueueFactoryTest, ATimerFiresAmongTheTasksOfItsQueue) {
   const auto queue = factory->createQueue();
-  std::thread::id queueThread;
-  queue->dispatch([&] { queueThread = std::this_thread::get_id(); });
-  std::thread::id timerThread;
-  Latch fired(1);
+  const auto gate = std::make_shared<Latch>(1);
+  block(queue, gate);
+  std::vector<std::string> order;  // unguarded: the queue alone keeps it whole
+  bool isRefused = false;
+  queue->dispatch([&] { order.emplace_back("before"); });
   const auto timer = queue->dispatchAfter(
-      kMillisecond,
+      0,
       [&] {
-        timerThread = std::this_thread::get_id();
-        fired.countDown();
+        order.emplace_back("timer");
+        try {
+          ThreadQueueFactory::refuseOnQueueThread("waiting", "");
+        } catch (const std::logic_error&) {
+          isRefused = true;
+        }
       },
       nullptr);
-  fired.wait();
-  EXPECT_EQ(timerThread, queueThread);
+  handOutDueTimers();
+  queue->dispatch([&] { order.emplace_back("behind"); });
+  gate->countDown();
+  finish(queue);
+  EXPECT_EQ(order, (std::vector<std::string>{"before", "timer", "behind"}));
+  EXPECT_TRUE(isRefused);
 }
 
 TEST_F(ThreadQueueFactoryTest, ATimerNeverFiresEarly) {

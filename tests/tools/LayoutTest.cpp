@@ -69,6 +69,18 @@ TEST_F(LayoutTest, OfARootHasItsAreasManagersAndStores) {
   EXPECT_EQ(layout_.managers.at(1).sessionTag(), "alice");
 }
 
+TEST_F(LayoutTest, OfSeveralAccountsHasTheAreasOfEach) {
+  data_.makeStore("caches/_sessionlessStore/thumbs_v1");
+  data_.makeStore("accounts/session_alice/documents/_store_alice/drafts_v1");
+  data_.makeStore("accounts/session_/caches/_store_/thumbs_v1");
+  EXPECT_THAT(found(), ElementsAre("accounts/session_/caches/_store_: thumbs_v1+",
+                                   "accounts/session_alice/documents/_store_alice: drafts_v1+",
+                                   "caches/_sessionlessStore: thumbs_v1+"));
+  EXPECT_EQ(layout_.managers.at(1).area, "documents");
+  EXPECT_EQ(layout_.managers.at(1).sessionTag(), "alice");
+  EXPECT_THAT(found("accounts/session_alice"), ElementsAre("documents/_store_alice: drafts_v1+"));
+}
+
 TEST_F(LayoutTest, OfAnyDepthIsRecognised) {
   makeRoot();
   EXPECT_THAT(found("documents"), ElementsAre("_store_alice: drafts_v1+"));

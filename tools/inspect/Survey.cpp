@@ -1,6 +1,7 @@
 #include "inspect/Survey.h"
 
 #include <algorithm>
+#include <filesystem>
 #include <map>
 #include <set>
 
@@ -131,12 +132,13 @@ class Surveyor {
     }
   }
 
-  // There is one session at a time; of several in an area it is taken to be the one used last.
+  // There is one session at a time; of several in an area it is taken to be the one used last. Accounts that are kept
+  // have areas of their own.
   void markOtherSessions() {
     std::map<std::string, ManagerSurvey*> newest;
     for (ManagerSurvey& manager : survey_.managers) {
       if (manager.isSessionless) continue;
-      ManagerSurvey*& present = newest[manager.area];
+      ManagerSurvey*& present = newest[std::filesystem::path(manager.path).parent_path().string()];
       if (present == nullptr) {
         present = &manager;
         continue;

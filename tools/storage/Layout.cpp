@@ -23,6 +23,7 @@ namespace {
 const std::string kSessionPrefix = "_store_";
 const std::string kSessionless = "_sessionlessStore";
 const std::string kTrash = "trash";
+const std::string kAccounts = "accounts";  // of a host that keeps several: areas of their own
 constexpr std::array<const char*, 3> kAreas = {"caches", "documents", "shared"};
 
 bool isManagerName(const std::string& name) {
@@ -126,6 +127,12 @@ class Finder {
     return fs::is_regular_file(fs::symlink_status(in(root, host::RootLock::fileName), ignored));
   }
 
+  void addAccounts(const std::string& path) {
+    for (const std::string& account : directoriesIn(path)) {
+      for (const std::string& area : directoriesIn(in(path, account))) addArea(in(in(path, account), area));
+    }
+  }
+
   void findAreas(const std::string& root) {
     bool isRoot = holdsLock(root);
     for (const std::string& name : directoriesIn(root)) {
@@ -134,6 +141,8 @@ class Finder {
         layout_.others.push_back({path, OtherPlace::Kind::Trash});
       } else if (name == kQuarantineName) {
         layout_.others.push_back({path, OtherPlace::Kind::Quarantine});
+      } else if (name == kAccounts) {
+        addAccounts(path);
       } else if (holdsManagers(path) || isAreaName(name)) {
         isRoot = true;
         addArea(path);
