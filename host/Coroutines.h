@@ -159,7 +159,18 @@ template <class T> class CoroutinePromiseBase : public CoroutineOfAFuture {
   End final_suspend() const noexcept { return {}; }
   void unhandled_exception() noexcept { outcome_->failure = std::current_exception(); }
 
+  CoroutinePromiseBase() = default;
+  CoroutinePromiseBase(const CoroutinePromiseBase&) = delete;
+  CoroutinePromiseBase& operator=(const CoroutinePromiseBase&) = delete;
+
  protected:
+  // Of a coroutine that is dropped the future says so here, where what its callback throws does no harm.
+  ~CoroutinePromiseBase() {
+    if (outcome_ == nullptr) return;
+    outcome_->failure = std::make_exception_ptr(std::future_error(std::future_errc::broken_promise));
+    outcome_->deliver();
+  }
+
   std::unique_ptr<Outcome<T>> outcome_ = std::make_unique<Outcome<T>>();
 };
 

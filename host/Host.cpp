@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cstddef>
+#include <exception>
 #include <map>
 #include <mutex>
 #include <stdexcept>
@@ -183,7 +184,9 @@ std::shared_ptr<StoreManager> Host::managerIn(const StoreManagerDefinition& defi
 std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definition, ManagerScope& scope) {
   auto locations = sessionData_->sessionless();
   if (definition.sessionScoped) {
-    std::call_once(scope.adoption, [&] { sessionData_->adopt(scope.tag); });
+    const std::lock_guard<std::mutex> lock(scope.adoption);
+    if (!scope.isAdopted) sessionData_->adopt(scope.tag);
+    scope.isAdopted = true;
     locations = sessionData_->locationsOf(scope.tag);
   }
   StoreManagerFactory factory(definition.sessionScoped, analytics_, attributes_, configuration_, sizes_, fileUtils_,
@@ -244,8 +247,16 @@ bool Host::end(const std::shared_ptr<ManagerScope>& session) {
 
 void Host::invalidate() {
   refuseOnQueueThread("Host::invalidate");
-  for (const auto& session : scopes_->openSessions()) end(session);
+  std::exception_ptr failure;  // the first; it keeps nothing else from being discarded
+  for (const auto& session : scopes_->openSessions()) {
+    try {
+      end(session);
+    } catch (...) {
+      if (failure == nullptr) failure = std::current_exception();
+    }
+  }
   ManagerScopes::Ending(*scopes_).invalidateManagers();
+  if (failure != nullptr) std::rethrow_exception(failure);
 }
 
 std::vector<StoredSession> Host::sessions(SessionSizes sizes) const {

@@ -19,17 +19,18 @@ namespace velmora::mobile::xplat::cellar::host {
 // queue continues. A queue whose last reference is released runs what was dispatched; releasing never waits, so a task
 // may release its own queue. Queues may outlive the factory: they are closed then.
 //
-// What a task dispatches to other queues at its end runs on the same thread next; no other thread is woken for it. So a
-// task must not wait for what it has dispatched itself, and a task that takes long takes a thread from all queues.
+// A task that takes long, or waits, takes a thread from all queues. If as many tasks wait for other queues as there are
+// processors, and one more, nothing else runs.
 //
 // A thread without tasks sleeps. If tasks follow each other closely, one thread first looks out for the next for up to
-// 100 microseconds. On Linux the threads run as SCHED_BATCH, so that waking one does not preempt its waker.
+// 100 microseconds, and no other is woken. On Linux the threads run as SCHED_BATCH, so that waking one does not preempt
+// its waker.
 //
 // Timers: `dispatchAfter` and `scheduleAfter` both fire once, on their queue. A delay of 0 or less is due at once; a
 // delay beyond the range of the clock never ends. Companions are ignored. When the handle's destructor returns, the
-// task is running, has run, or will never run; in the last case its captures are destroyed. The destructor does not
-// wait for a running task, so a handle may be destroyed under a lock and by the task itself. A timer does not keep its
-// queue open.
+// task is running, has run, or will never run; in the last case its captures are destroyed, or another thread is
+// just destroying them. The destructor does not wait for a running task, so a handle may be destroyed under a lock and
+// by the task itself. A timer does not keep its queue open.
 //
 // Closing (`shutDown`, `abandon`, the destructor): tasks that were dispatched before still run, timers that have not
 // fired are dropped, and tasks that are dispatched afterwards, also by those tasks, are destroyed without running, on
@@ -64,8 +65,8 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   // other threads are, unless tasks keep dispatching further ones forever.
   void refuseNewWork();
 
-  // Closes and waits for the threads: when it returns, no task is running. From a task of these queues it closes and
-  // returns at once. May be called again.
+  // Closes and waits for the threads: when it returns, no task is running (unless `abandon` was called before). From a
+  // task of these queues it closes and returns at once. May be called again.
   void shutDown();
 
   // Closes without waiting: the threads are detached, and end when they have run what was dispatched. For queues with a

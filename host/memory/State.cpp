@@ -91,8 +91,8 @@ MemoryTier::Counts MemoryTier::State::counts() {
 void MemoryTier::State::close() {
   std::shared_ptr<Store> store;
   const Lock lock(mutex_);
-  store = std::move(store_);
-  store_ = nullptr;
+  store = std::exchange(store_, nullptr);
+  if (isCalling_) storeOfLastCalls_ = store;  // what has been accepted is still done
   table_.clear();
   flights_.clear();
   computations_.clear();
@@ -106,7 +106,7 @@ void MemoryTier::State::makeCalls() {
     std::shared_ptr<Store> store;
     {
       const Lock lock(mutex_);
-      store = store_;
+      store = store_ != nullptr ? store_ : storeOfLastCalls_;
     }
     if (store == nullptr) continue;
     const auto failure = failureOf([&] { call(*store); });
@@ -124,9 +124,13 @@ MemoryTier::State::Call MemoryTier::State::firstCall() {
 }
 
 MemoryTier::State::Call MemoryTier::State::nextCall() {
+  std::shared_ptr<Store> released;  // without the lock
   const Lock lock(mutex_);
   isCalling_ = !calls_.empty();
-  if (!isCalling_) return nullptr;
+  if (!isCalling_) {
+    released = std::exchange(storeOfLastCalls_, nullptr);
+    return nullptr;
+  }
   Call call = std::move(calls_.front());
   calls_.pop_front();
   return call;

@@ -70,6 +70,7 @@ class MemoryTier::State : public std::enable_shared_from_this<State> {
   std::size_t clearing_ = 0;  // clears that are under way
   std::deque<Call> calls_;
   bool isCalling_ = false;
+  std::shared_ptr<Store> storeOfLastCalls_;  // those that were accepted before the end
   std::uint64_t hits_ = 0;
   std::uint64_t misses_ = 0;
 };

@@ -34,11 +34,9 @@ void SerialQueue::run() noexcept {
     const std::lock_guard<std::mutex> lock(mutex_);
     running_.swap(waiting_);
   }
-  for (std::size_t i = 0; i < running_.size(); ++i) {
-    ThreadPool::isAboutToBeFree(i + 1 == running_.size());
-    runLogged(running_[i]);
-    running_[i] = nullptr;  // its captures are destroyed before it counts as finished
-    ThreadPool::isAboutToBeFree(false);
+  for (Task& task : running_) {
+    runLogged(task);
+    task = nullptr;  // its captures are destroyed before it counts as finished
     pool_->taskEnds();
   }
   running_.clear();

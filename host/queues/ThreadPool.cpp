@@ -22,7 +22,6 @@ constexpr std::chrono::microseconds kLongestSearch(100);
 
 // The pool that this thread works for. Its threads keep a pool alive, so its address cannot be reused meanwhile.
 thread_local const ThreadPool* currentPool = nullptr;
-thread_local bool goesOnWithNextWork = false;
 
 // Background work must not delay its callers: a batch thread does not preempt the thread that wakes it. If the system
 // refuses, that is ignored.
@@ -53,7 +52,7 @@ std::size_t processorsOfThisThread() {
 ThreadPool::ThreadPool() : hasOtherProcessors_(processorsOfThisThread() > 1) {}
 
 std::shared_ptr<ThreadPool> ThreadPool::start(const std::function<void()>& timers) {
-  const std::shared_ptr<ThreadPool> pool(new ThreadPool());
+  std::shared_ptr<ThreadPool> pool(new ThreadPool());
   const std::size_t workers = processorsOfThisThread() + 1;
   try {
     for (std::size_t number = 1; number <= workers; ++number) {
@@ -79,11 +78,14 @@ void ThreadPool::startThread(std::string name, std::function<void()> function) {
 // ---- tasks
 
 bool ThreadPool::admitTask() {
+  if (!takesTasks()) return false;  // so that those who go on dispatching do not disturb the count
   ++unfinishedTasks_;
-  if (!isClosed_ && (!isClosedToOthers_ || isOwnThread())) return true;
+  if (takesTasks()) return true;
   taskEnds();
   return false;
 }
+
+bool ThreadPool::takesTasks() const { return !isClosed_ && (!isClosedToOthers_ || isOwnThread()); }
 
 void ThreadPool::taskEnds() {
   if (--unfinishedTasks_ > 0) return;
@@ -107,14 +109,11 @@ bool ThreadPool::isThreadOfAnyPool() { return currentPool != nullptr; }
 
 // ---- work
 
-void ThreadPool::isAboutToBeFree(bool isFree) { goesOnWithNextWork = isFree; }
-
 void ThreadPool::schedule(std::shared_ptr<Work> work) {
-  const bool isForThisThread = isOwnThread() && std::exchange(goesOnWithNextWork, false);
   std::unique_lock<std::mutex> lock(mutex_);
   ready_.push_back(std::move(work));
   hasReadyWork_ = true;
-  if (!isForThisThread && !isSearching_) wakeOne(lock);
+  if (!isSearching_) wakeOne(lock);
 }
 
 // Releases the lock.
@@ -148,7 +147,8 @@ std::shared_ptr<ThreadPool::Work> ThreadPool::take() {
   return work;
 }
 
-// One thread at a time looks out for work a little longer before it sleeps, as long as that is found to pay.
+// One thread at a time looks out for work a little longer before it sleeps, as long as that is found to pay. No other
+// thread is woken meanwhile: what goes from queue to queue, or comes right behind, finds this one.
 void ThreadPool::search() {
   if (!searchPays_ || hasReadyWork_ || isSearching_.exchange(true)) return;
   const Clock::time_point end = Clock::now() + kLongestSearch;

@@ -36,11 +36,8 @@ class ThreadPool : public std::enable_shared_from_this<ThreadPool> {
   bool admitTask();
   void taskEnds();
 
-  // Has a thread run the work once. If this is a thread of the pool that is about to be free, no other is woken for it.
+  // Has a thread run the work once.
   void schedule(std::shared_ptr<Work> work);
-
-  // Says of this thread whether it has nothing else to do when its present task ends.
-  static void isAboutToBeFree(bool isFree);
 
   bool isOwnThread() const;
   static bool isThreadOfAnyPool();
@@ -57,6 +54,7 @@ class ThreadPool : public std::enable_shared_from_this<ThreadPool> {
 
  private:
   ThreadPool();
+  bool takesTasks() const;
   void startThread(std::string name, std::function<void()> function);
   void runWork();
   std::shared_ptr<Work> take();

@@ -13,7 +13,9 @@ namespace velmora::mobile::xplat::cellar::host {
 namespace {
 
 std::shared_ptr<ManagerScope> makeScope(const std::string& key, const std::string& tag, bool isOpen) {
-  return std::shared_ptr<ManagerScope>(new ManagerScope{key, tag, {}, {}, 0, isOpen, false});
+  auto scope = std::make_shared<ManagerScope>(key, tag);
+  scope->isOpen = isOpen;
+  return scope;
 }
 
 }  // namespace
@@ -81,8 +83,7 @@ std::shared_ptr<ManagerScope> ManagerScopes::findOrOpen(Lock& lock, const std::o
   if (auto open = findOpen(lock, sessionKey)) return open;
   if (const auto other = findByTag(lock, tag)) {
     if (!other->isOpen) throw InvalidatedException("The session is being logged out.");
-    throw std::logic_error("Session '" + key + "' would share the directories of session '" + other->key +
-                           "', which is open.");
+    throw std::logic_error("Another session that would have the same directories, of tag '" + tag + "', is open.");
   }
   hasOpenedSession_ = true;
   return sessions_.emplace_back(makeScope(key, tag, true));
@@ -100,7 +101,7 @@ ManagerScopes::Request::Request(ManagerScopes& scopes, const std::optional<std::
 ManagerScopes::Request::Request(ManagerScopes& scopes, std::shared_ptr<ManagerScope> session)
     : scopes_(scopes), scope_(std::move(session)) {
   const std::lock_guard<std::mutex> lock(scopes_.mutex_);
-  if (!scope_->isOpen) throw InvalidatedException("The session '" + scope_->key + "' has ended.");
+  if (!scope_->isOpen) throw InvalidatedException("The session of tag '" + scope_->tag + "' has ended.");
   if (scope_->isEnding) throw InvalidatedException("The managers are being invalidated.");
   ++scope_->requests;
 }

@@ -8,6 +8,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <cellar/Incident.h>
@@ -24,12 +25,16 @@ struct ManagerSlot {
   std::shared_ptr<StoreManager> manager{};
 };
 
-// The managers of one session, or those of none. Guarded by the mutex of the scopes, but for `key`, `tag` and
-// `adoption`.
+// The managers of one session, or those of none. What follows `isAdopted` is guarded by the mutex of the scopes.
 struct ManagerScope {
-  const std::string key{};
-  const std::string tag{};
-  std::once_flag adoption{};  // of the session's data from where it was kept before
+  ManagerScope(std::string sessionKey, std::string sessionTag)
+      : key(std::move(sessionKey)), tag(std::move(sessionTag)) {}
+
+  const std::string key;
+  const std::string tag;
+
+  std::mutex adoption{};   // held while the session's data is moved from where it was kept before
+  bool isAdopted = false;  // guarded by `adoption`
 
   std::map<std::string, ManagerSlot> managers{};  // by name; grows only
   std::size_t requests = 0;                       // under way

@@ -18,14 +18,14 @@ namespace {
 
 constexpr std::array<Area, 3> kAreas = {Area::Caches, Area::Documents, Area::Shared};
 
-const std::string kAccountPrefix = "session_";  // before a tag, which may be empty
+const std::string kAccountPrefix = "of_";  // before a tag, which may be empty
 
 }  // namespace
 
 SessionData::SessionData(std::string root, bool severalKept, std::shared_ptr<FileUtils> fileUtils,
                          std::shared_ptr<TrashCollector> trash,
                          std::shared_ptr<StoreDirectoryNameBuilderFactory> nameBuilders)
-    : accounts_(fileUtils->combinePath(root, "accounts")),
+    : accounts_(fileUtils->combinePath(root, "_cellar_accounts")),
       severalKept_(severalKept),
       fileUtils_(std::move(fileUtils)),
       trash_(std::move(trash)),
@@ -53,9 +53,28 @@ void SessionData::adopt(const std::string& tag) {
   for (const Area area : kAreas) {
     const std::string source = fileUtils_->combinePath(from.pathForArea(area, ""), name);
     const std::string target = to.pathForArea(area, "");
-    if (!fileUtils_->isDirectory(source) || fileUtils_->pathExists(fileUtils_->combinePath(target, name))) continue;
+    if (!fileUtils_->isDirectory(source) || holds({target, name})) continue;
+    // Elsewhere a relative link would lead to another place, or nowhere.
+    if (fileUtils_->isSymLink(source)) throw FileUtilsIoException(0, "could not move the link \"" + source + "\"");
     fileUtils_->createDirectory(target, true);
     fileUtils_->rename(source, fileUtils_->combinePath(target, name));
+  }
+  if (!severalKept_) removeIfEmpty(tag);
+}
+
+// What remains of an account whose data has been moved out of it.
+void SessionData::removeIfEmpty(const std::string& tag) {
+  DirectoryPathLocations account(accountPath(tag));
+  std::vector<std::string> emptied;
+  emptied.reserve(kAreas.size() + 1);
+  for (const Area area : kAreas) emptied.push_back(account.pathForArea(area, ""));
+  emptied.push_back(accountPath(tag));
+  for (const std::string& path : emptied) {
+    try {
+      if (fileUtils_->isDirectory(path)) fileUtils_->deleteFile(path);
+    } catch (const FileUtilsIoException&) {
+      // It is not empty.
+    }
   }
 }
 
@@ -75,6 +94,7 @@ std::vector<std::string> SessionData::tags() const {
 
 std::vector<SessionData::Place> SessionData::placesOf(const std::string& tag) const {
   std::vector<Place> places;
+  places.reserve(kAreas.size() + 1);
   for (const Area area : kAreas) places.push_back({shared_->pathForArea(area, ""), managerName(tag)});
   places.push_back({accounts_, kAccountPrefix + tag});
   return places;
@@ -146,7 +166,7 @@ std::vector<std::string> SessionData::directoriesIn(const std::string& path) con
       if (entry.type != FileUtils::Type::File) names.push_back(fileUtils_->basename(entry.path));
     }
   } catch (const FileUtilsIoException& error) {
-    if (error.code() != ENOENT) {
+    if (error.code() != ENOENT && error.code() != ENOTDIR) {
       throw FileUtilsIoException(error.code(), "could not read \"" + path + "\": " + error.description());
     }
   }

@@ -19,8 +19,8 @@ namespace host {
 // Where the directories of sessions are: with all others in the areas of the root, or, if several sessions are kept,
 // in areas of their own.
 //
-//   caches/_store_alice                       the session with the tag "alice", one at a time
-//   accounts/session_alice/caches/_store_alice  the same, several kept
+//   caches/_store_alice                             the session with the tag "alice", one at a time
+//   _cellar_accounts/of_alice/caches/_store_alice   the same, several kept
 //
 // Whatever the host keeps now, data is found, moved and discarded in both places. Any thread may call; what is not
 // about one session that others do not use at the same time is a snapshot.
@@ -34,7 +34,7 @@ class SessionData {
   std::shared_ptr<PathLocations> locationsOf(const std::string& tag) const;
 
   // Moves the directories of a session that lie in the other place to where they are looked for now. Those that are in
-  // both places stay. Throws `FileUtilsIoException`; what was moved by then is found.
+  // both places stay. Throws `FileUtilsIoException`, also for a link; what was moved by then is found.
   void adopt(const std::string& tag);
 
   // The tags of the sessions with directories, sorted. Throws when a place cannot be read.
@@ -56,6 +56,7 @@ class SessionData {
   std::string managerName(const std::string& tag) const;
   std::string accountPath(const std::string& tag) const;
   std::vector<Place> placesOf(const std::string& tag) const;
+  void removeIfEmpty(const std::string& tag);
   bool discardAt(const Place& place);
   bool holds(const Place& place) const;
   std::vector<std::string> directoriesIn(const std::string& path) const;

@@ -223,6 +223,15 @@ TEST_F(Coroutines, AreDestroyedWhenTheirResumptionIsDropped) {
   EXPECT_TRUE(isBroken(sum));
 }
 
+TEST_F(Coroutines, AreDestroyedThoughTheCallbackOfTheirFutureThrows) {
+  const test::LogCapture log;
+  Promise<int> promise;
+  plusOneOn(queue_, promise.getFuture()).then([](std::future<int>& sum) { sum.get(); });
+  promise.setValue(1);
+  queue_->dropAll();
+  EXPECT_EQ(log.errorCount(), 1U);
+}
+
 TEST_F(Coroutines, WaitingForOneThatIsDestroyedFailsWithItsBrokenPromise) {
   Promise<int> promise;
   const Future<int> sum = plusOne(plusOneOn(queue_, promise.getFuture()));

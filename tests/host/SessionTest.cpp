@@ -101,8 +101,8 @@ TEST_F(SessionTest, EachHasAreasOfItsOwnAndWhatHasNoSessionIsShared) {
   alice.manager("archive");
   EXPECT_EQ(alice.manager("web"), host->openSession("bob").manager("web"));
   EXPECT_EQ(alice.store<PersistentKeyValueStore>("pages"), host->store<PersistentKeyValueStore>("pages"));
-  EXPECT_TRUE(directory.exists("accounts/session_%41l%2fice/caches/_store_%41l%2fice"));
-  EXPECT_TRUE(directory.exists("accounts/session_%41l%2fice/documents/_store_%41l%2fice"));
+  EXPECT_TRUE(directory.exists("_cellar_accounts/of_%41l%2fice/caches/_store_%41l%2fice"));
+  EXPECT_TRUE(directory.exists("_cellar_accounts/of_%41l%2fice/documents/_store_%41l%2fice"));
   EXPECT_EQ(directory.names("caches"), std::vector<std::string>{"_sessionlessStore"});
 }
 
@@ -128,7 +128,7 @@ TEST_F(SessionTest, EndingOneDiscardsItsDataAndLeavesTheOthers) {
   const auto letters = alice.store<PersistentKeyValueStore>("letters");
   EXPECT_TRUE(alice.end());
   EXPECT_FALSE(alice.isOpen());
-  EXPECT_FALSE(directory.exists("accounts/session_alice"));
+  EXPECT_FALSE(directory.exists("_cellar_accounts/of_alice"));
   EXPECT_THROW(static_cast<void>(await(letters->fetch("key"))), InvalidatedException);
   EXPECT_EQ(get(bob, "letters"), "of bob");
 }
@@ -138,7 +138,7 @@ TEST_F(SessionTest, OneThatHasEndedRefusesEverythingAndEndsOnce) {
   const Session alice = host->openSession("alice");
   put(alice, "letters", "first");
   EXPECT_TRUE(alice.end());
-  const std::string ended = InvalidatedException("The session 'alice' has ended.").what();
+  const std::string ended = InvalidatedException("The session of tag 'alice' has ended.").what();
   EXPECT_EQ(errorOf<InvalidatedException>([&] { alice.manager("inbox"); }), ended);
   EXPECT_EQ(errorOf<InvalidatedException>([&] { alice.manager("web"); }), ended);
   EXPECT_EQ(errorOf<InvalidatedException>([&] { alice.store<PersistentKeyValueStore>("letters"); }), ended);
@@ -176,7 +176,7 @@ TEST_F(SessionTest, ARequestWithoutAKeyMeansTheOnlyOneAndIsRefusedIfThereAreSeve
 TEST_F(SessionTest, WithoutAnyARequestWithoutAKeyOpensTheEmptyOne) {
   const auto host = start();
   host->manager("inbox");
-  EXPECT_TRUE(directory.exists("accounts/session_/caches/_store_"));
+  EXPECT_TRUE(directory.exists("_cellar_accounts/of_/caches/_store_"));
   EXPECT_EQ(host->manager("inbox"), host->openSession("").manager("inbox"));
 }
 
@@ -187,7 +187,7 @@ TEST_F(SessionTest, LoggingOutByKeyEndsAnOpenOneAndDiscardsOneOfAnEarlierRun) {
   put(bob, "letters", "of bob");
   EXPECT_TRUE(host->logOut("alice"));
   EXPECT_FALSE(host->logOut("alice"));
-  EXPECT_FALSE(directory.exists("accounts/session_alice"));
+  EXPECT_FALSE(directory.exists("_cellar_accounts/of_alice"));
   EXPECT_TRUE(bob.isOpen());
   EXPECT_TRUE(host->logOut("bob"));
   EXPECT_FALSE(bob.isOpen());
@@ -213,7 +213,7 @@ TEST_F(SessionTest, TwoKeysOfOneNameAreNotOpenTogether) {
   Host host(std::move(mapped));
   const Session alice = host.openSession("alice");
   EXPECT_EQ(errorOf<std::logic_error>([&] { static_cast<void>(host.openSession("bob")); }),
-            "Session 'bob' would share the directories of session 'alice', which is open.");
+            "Another session that would have the same directories, of tag 'same', is open.");
   EXPECT_TRUE(alice.isOpen());
   alice.end();
   EXPECT_TRUE(host.openSession("bob").isOpen());
@@ -233,7 +233,7 @@ TEST_F(SessionTest, SizesAreThoseOfAllFilesOfASession) {
   std::ofstream(alice.store<UnmanagedStore>("files")->path + "/deeper/small") << "123";
   std::filesystem::create_symlink("/", alice.store<UnmanagedStore>("files")->path + "/link");
   const Session bob = host->openSession("bob");
-  std::filesystem::create_directories(directory.file("accounts/session_bob/caches/_store_bob"));
+  std::filesystem::create_directories(directory.file("_cellar_accounts/of_bob/caches/_store_bob"));
   const auto measured = host->sessions(SessionSizes::Measured);
   ASSERT_EQ(tagsOf(measured), (std::vector<std::string>{"alice", "bob"}));
   EXPECT_EQ(measured[0].key, "alice");
@@ -275,14 +275,14 @@ TEST_F(SessionTest, TheDataOfAnAccountIsFoundWhenOneIsOpenAtATimeAgain) {
             "Another session is open, log out before you ask for a new one.");
   EXPECT_EQ(tagsOf(host->sessions()), (std::vector<std::string>{"alice", "bob"}));
   EXPECT_TRUE(host->logOut("bob"));
-  EXPECT_FALSE(directory.exists("accounts/session_bob"));
+  EXPECT_FALSE(directory.exists("_cellar_accounts/of_bob"));
   alice.end();
   EXPECT_TRUE(host->sessions().empty());
 }
 
 TEST_F(SessionTest, DataInBothPlacesStaysAndIsDiscardedTogether) {
   put(start(Accounts::OneAtATime)->openSession("alice"), "letters", "former");
-  std::filesystem::create_directories(directory.file("accounts/session_alice/caches/_store_alice"));
+  std::filesystem::create_directories(directory.file("_cellar_accounts/of_alice/caches/_store_alice"));
   const auto host = start();
   const Session alice = host->openSession("alice");
   EXPECT_EQ(get(alice, "letters"), "nothing");
@@ -309,6 +309,56 @@ TEST_F(SessionTest, AMoveThatFailsFailsTheRequestAndTheNextOneTriesAgain) {
   EXPECT_TRUE(directory.exists("caches/_store_alice"));
   fails = false;
   EXPECT_EQ(get(alice, "letters"), "of alice");
+}
+
+TEST_F(SessionTest, NothingRemainsOfAnAccountWhoseDataHasMovedBack) {
+  put(start()->openSession("alice"), "letters", "of alice");
+  const auto host = start(Accounts::OneAtATime);
+  host->openSession("alice").manager("inbox");
+  EXPECT_FALSE(directory.exists("_cellar_accounts/of_alice"));
+}
+
+TEST_F(SessionTest, ALinkInThePlaceOfBeforeIsNotMoved) {
+  std::filesystem::create_directories(directory.file("elsewhere"));
+  std::filesystem::create_directories(directory.file("caches"));
+  std::filesystem::create_symlink("../elsewhere", directory.file("caches/_store_alice"));
+  const auto host = start();
+  EXPECT_THROW(host->openSession("alice").manager("inbox"), FileUtilsIoException);
+  EXPECT_TRUE(std::filesystem::is_symlink(directory.file("caches/_store_alice")));
+  EXPECT_TRUE(host->logOut("alice"));
+  EXPECT_NO_THROW(host->openSession("alice").manager("inbox"));
+}
+
+TEST_F(SessionTest, AFileWhereAccountsWouldBeIsInNobodysWay) {
+  std::ofstream(directory.file("_cellar_accounts")) << "a file";
+  const auto host = start(Accounts::OneAtATime);
+  put(host->openSession("alice"), "letters", "of alice");
+  EXPECT_EQ(tagsOf(host->sessions()), std::vector<std::string>{"alice"});
+  EXPECT_TRUE(host->logOut("alice"));
+  EXPECT_TRUE(host->sessions().empty());
+}
+
+TEST_F(SessionTest, InvalidatingTheHostGoesOnWhenTheDataOfOneCannotBeDiscarded) {
+  const auto files = std::make_shared<FaultyFileUtils>();
+  HostOptions faulty = options(Accounts::Kept);
+  faulty.fileUtils = files;
+  Host host(std::move(faulty));
+  const Session alice = host.openSession("alice");
+  const Session bob = host.openSession("bob");
+  put(alice, "letters", "of alice");
+  put(bob, "letters", "of bob");
+  put(bob, "pages", "of everybody");
+  const auto pages = host.manager("web");
+  files->onCall = [&](FaultyFileUtils::Operation operation, const std::string& path) {
+    if (operation == FaultyFileUtils::Operation::Rename && path == directory.file("_cellar_accounts/of_alice")) {
+      throw FileUtilsIoException(5, "Input/output error");
+    }
+  };
+  EXPECT_THROW(host.invalidate(), FileUtilsIoException);
+  EXPECT_FALSE(alice.isOpen());
+  EXPECT_FALSE(bob.isOpen());
+  EXPECT_FALSE(pages->isValid());
+  EXPECT_EQ(tagsOf(host.sessions()), std::vector<std::string>{"alice"});
 }
 
 // Beside each other

@@ -71,14 +71,14 @@ TEST_F(LayoutTest, OfARootHasItsAreasManagersAndStores) {
 
 TEST_F(LayoutTest, OfSeveralAccountsHasTheAreasOfEach) {
   data_.makeStore("caches/_sessionlessStore/thumbs_v1");
-  data_.makeStore("accounts/session_alice/documents/_store_alice/drafts_v1");
-  data_.makeStore("accounts/session_/caches/_store_/thumbs_v1");
-  EXPECT_THAT(found(), ElementsAre("accounts/session_/caches/_store_: thumbs_v1+",
-                                   "accounts/session_alice/documents/_store_alice: drafts_v1+",
+  data_.makeStore("_cellar_accounts/of_alice/documents/_store_alice/drafts_v1");
+  data_.makeStore("_cellar_accounts/of_/caches/_store_/thumbs_v1");
+  EXPECT_THAT(found(), ElementsAre("_cellar_accounts/of_/caches/_store_: thumbs_v1+",
+                                   "_cellar_accounts/of_alice/documents/_store_alice: drafts_v1+",
                                    "caches/_sessionlessStore: thumbs_v1+"));
   EXPECT_EQ(layout_.managers.at(1).area, "documents");
   EXPECT_EQ(layout_.managers.at(1).sessionTag(), "alice");
-  EXPECT_THAT(found("accounts/session_alice"), ElementsAre("documents/_store_alice: drafts_v1+"));
+  EXPECT_THAT(found("_cellar_accounts/of_alice"), ElementsAre("documents/_store_alice: drafts_v1+"));
 }
 
 TEST_F(LayoutTest, OfAnyDepthIsRecognised) {

@@ -23,7 +23,7 @@ namespace {
 const std::string kSessionPrefix = "_store_";
 const std::string kSessionless = "_sessionlessStore";
 const std::string kTrash = "trash";
-const std::string kAccounts = "accounts";  // of a host that keeps several: areas of their own
+const std::string kAccounts = "_cellar_accounts";  // of a host that keeps several: areas of their own
 constexpr std::array<const char*, 3> kAreas = {"caches", "documents", "shared"};
 
 bool isManagerName(const std::string& name) {
