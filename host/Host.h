@@ -69,8 +69,8 @@ struct HostOptions {
   // no other host uses the root, in this process or another: they would lose each other's values.
   bool lockRoot = true;
 
-  // With `Kept` each session has areas of its own under "_cellar_accounts". Data of before, in the root's areas, is moved there
-  // when its session opens, and back when the host is set to `OneAtATime` again: then what remains there is
+  // With `Kept` each session has areas of its own under "_cellar_accounts". Data of before, in the root's areas, is
+  // moved there when its session opens, and back when the host is set to `OneAtATime` again: then what remains there is
   // listed by `sessions`, and not removed by maintenance.
   Accounts accounts = Accounts::OneAtATime;
 
@@ -111,8 +111,8 @@ enum class SessionSizes { Skipped, Measured };
 //   host.logOut();                                                     // the session that is open
 //   for (const auto& session : host.sessions()) host.logOut(session);  // and those of earlier runs
 //
-// Under the root: "caches", "documents", "shared" (the areas), "_cellar_accounts", "trash" and the lock file "_cellar_lock". One host at a
-// time may use a root, in all processes together. Any thread may call.
+// Under the root: "caches", "documents", "shared" (the areas), "_cellar_accounts", "trash" and the lock file
+// "_cellar_lock". One host at a time may use a root, in all processes together. Any thread may call.
 //
 // Sessions: one at a time, unless the options say otherwise. The first request with a session key opens that session;
 // if the first request for a session-scoped manager has no key, it opens the session "". Later requests without a key
