@@ -84,7 +84,7 @@ TEST(Await, RethrowsTheStoredException) {
 TEST(Await, RethrowsTheExceptionOfAValueToo) {
   Promise<std::unique_ptr<int>> promise;
   promise.setException(std::make_exception_ptr(std::out_of_range("far away")));
-  EXPECT_THROW(await(promise.getFuture()), std::out_of_range);
+  EXPECT_THROW(static_cast<void>(await(promise.getFuture())), std::out_of_range);
 }
 
 TEST(Await, ThrowsABrokenPromiseWhenTheWorkWasDropped) {
@@ -105,7 +105,7 @@ TEST(Await, ThrowsABrokenPromiseWhenTheQueueIsClosed) {
   ThreadQueueFactory queues;
   const auto queue = queues.createQueue();
   queues.shutDown();
-  EXPECT_THROW(await(dispatchTask<void>(queue, [] {})), std::future_error);
+  EXPECT_THROW(static_cast<void>(await(dispatchTask<void>(queue, [] {}))), std::future_error);
 }
 
 TEST(Await, RefusesAnEmptyFuture) { EXPECT_EQ(codeOfAwaiting({}), FutureError::Code::InvalidSharedState); }
@@ -148,8 +148,9 @@ TEST(Await, ATimeoutThatIsNotReachedChangesNothing) {
   for (const milliseconds timeout : {milliseconds(std::chrono::hours(24 * 365)), milliseconds::max()}) {
     EXPECT_EQ(await(dispatchTask<int>(queue, [] { return 42; }), timeout), 42);
   }
-  EXPECT_NO_THROW(await(dispatchTask<void>(queue, [] {}), std::chrono::minutes(10)));
-  EXPECT_THROW(await(dispatchTask<void>(queue, [] { throw std::out_of_range("far away"); }), std::chrono::minutes(10)),
+  EXPECT_NO_THROW(static_cast<void>(await(dispatchTask<void>(queue, [] {}), std::chrono::minutes(10))));
+  EXPECT_THROW(static_cast<void>(await(dispatchTask<void>(queue, [] { throw std::out_of_range("far away"); }),
+                                       std::chrono::minutes(10))),
                std::out_of_range);
 }
 
@@ -159,7 +160,7 @@ TEST(Await, ATimeoutOfNothingTakesWhatIsThereOnly) {
     there.setValue(7);
     EXPECT_EQ(await(there.getFuture(), timeout), 7);
     Promise<int> missing;
-    EXPECT_THROW((void)await(missing.getFuture(), timeout), TimeoutError);
+    EXPECT_THROW(static_cast<void>((void)await(missing.getFuture(), timeout)), TimeoutError);
   }
 }
 
@@ -191,7 +192,7 @@ TEST(Await, ABrokenPromiseIsNotWaitedFor) {
   const auto queue = std::make_shared<test::ManualExecutor>();
   const Future<void> future = dispatchTask<void>(queue, [] {});
   queue->dropAll();
-  EXPECT_THROW(await(future, std::chrono::hours(1)), std::future_error);
+  EXPECT_THROW(static_cast<void>(await(future, std::chrono::hours(1))), std::future_error);
 }
 
 TEST(Await, WithATimeoutIsRefusedOnAThreadOfTheKitToo) {

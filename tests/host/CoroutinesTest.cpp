@@ -81,7 +81,7 @@ TEST_F(Coroutines, MoveValuesThatOnlyMove) {
   Value result;
   const Future<void> done = assign(promise.getFuture(), result);
   promise.setValue(std::make_unique<int>(3));
-  EXPECT_NO_THROW(await(done));
+  EXPECT_NO_THROW(static_cast<void>(await(done)));
   EXPECT_EQ(*result, 3);
 }
 
@@ -119,7 +119,7 @@ TEST_F(Coroutines, PassOnWhatTheyDoNotCatch) {
     co_await std::suspend_never();
     throw std::runtime_error("thrown");
   };
-  EXPECT_THROW(await(fail()), std::runtime_error);
+  EXPECT_THROW(static_cast<void>(await(fail())), std::runtime_error);
   Future<int> broken;
   {
     Promise<int> dropped;

@@ -975,7 +975,7 @@ TEST_F(HostTest, ValuesOfASessionAreGoneAfterLoggingOut) {
   const auto before = host.store<DiskCache>("covers", "alice");
   await(before->store("sunrise", {1}));
   host.logOut();
-  EXPECT_THROW(await(before->fetch("sunrise")), InvalidatedException);
+  EXPECT_THROW(static_cast<void>(await(before->fetch("sunrise"))), InvalidatedException);
   EXPECT_EQ(await(host.store<DiskCache>("covers", "alice")->fetch("sunrise")), nullptr);
 }
 
@@ -983,7 +983,7 @@ TEST_F(HostTest, AStoreThatIsHeldAfterTheHostFailsItsFutures) {
   auto host = std::make_unique<Host>(kConfigurationOfValues, directory.path());
   const auto covers = host->store<DiskCache>("covers");
   host.reset();
-  EXPECT_THROW(await(covers->store("sunrise", {1})), std::future_error);
+  EXPECT_THROW(static_cast<void>(await(covers->store("sunrise", {1}))), std::future_error);
 }
 
 // Waiting would be for ever: what is awaited runs on the queue that waits.
@@ -1210,7 +1210,7 @@ TEST_F(HostTest, WhatIsHeldAfterTheHostDoesNoMoreWork) {
   EXPECT_TRUE(media->isValid());
   EXPECT_EQ(media->getTemporaryDirectory(), directory.file("caches/_sessionlessStore/tmp"));
   EXPECT_EQ(thumbs->path, directory.file("caches/_sessionlessStore/thumbs_250_v1"));
-  EXPECT_THROW(await(dispatchTask<void>(queue, [] {})), std::future_error);
+  EXPECT_THROW(static_cast<void>(await(dispatchTask<void>(queue, [] {}))), std::future_error);
 }
 
 TEST_F(HostTest, AManagerThatIsHeldAfterTheHostMayStillBeInvalidated) {
