@@ -41,11 +41,11 @@ class MemoryTier::State::Clear {
   std::atomic<bool> isOver_{false};
 };
 
+// The value first, while nobody else can have the future: the lock that is held is not held around the future's own.
 Future<Value> MemoryTier::State::readyWith(Value value) {
   Promise<Value> promise;
-  Future<Value> future = promise.getFuture();
   promise.setValue(std::move(value));
-  return future;
+  return promise.getFuture();
 }
 
 // --- Memory ---
