@@ -299,7 +299,7 @@ TEST_F(SessionTest, AMoveThatFailsFailsTheRequestAndTheNextOneTriesAgain) {
   faulty.fileUtils = files;
   Host host(std::move(faulty));
   const Session alice = host.openSession("alice");
-  bool fails = true;
+  std::atomic<bool> fails{true};
   files->onCall = [&](FaultyFileUtils::Operation operation, const std::string& path) {
     if (fails && operation == FaultyFileUtils::Operation::Rename && path == directory.file("caches/_store_alice")) {
       throw FileUtilsIoException(28, "No space left on device");
@@ -342,6 +342,13 @@ TEST_F(SessionTest, InvalidatingTheHostGoesOnWhenTheDataOfOneCannotBeDiscarded) 
   const auto files = std::make_shared<FaultyFileUtils>();
   HostOptions faulty = options(Accounts::Kept);
   faulty.fileUtils = files;
+  std::atomic<bool> fails{false};
+  files->onCall = [&](FaultyFileUtils::Operation operation, const std::string& path) {
+    if (fails && operation == FaultyFileUtils::Operation::Rename &&
+        path == directory.file("_cellar_accounts/of_alice")) {
+      throw FileUtilsIoException(5, "Input/output error");
+    }
+  };
   Host host(std::move(faulty));
   const Session alice = host.openSession("alice");
   const Session bob = host.openSession("bob");
@@ -349,11 +356,7 @@ TEST_F(SessionTest, InvalidatingTheHostGoesOnWhenTheDataOfOneCannotBeDiscarded) 
   put(bob, "letters", "of bob");
   put(bob, "pages", "of everybody");
   const auto pages = host.manager("web");
-  files->onCall = [&](FaultyFileUtils::Operation operation, const std::string& path) {
-    if (operation == FaultyFileUtils::Operation::Rename && path == directory.file("_cellar_accounts/of_alice")) {
-      throw FileUtilsIoException(5, "Input/output error");
-    }
-  };
+  fails = true;
   EXPECT_THROW(host.invalidate(), FileUtilsIoException);
   EXPECT_FALSE(alice.isOpen());
   EXPECT_FALSE(bob.isOpen());
