@@ -76,8 +76,9 @@ struct HostOptions {
 
   // Called for each `Incident`: something that nobody has asked for has happened to stored data. Empty: incidents are
   // only logged. It runs on a queue of its own, one call at a time: a slow one delays further incidents and the end of
-  // the host, nothing else. It may use the host and its stores, except `logOut` and `invalidate`, which throw on the
-  // host's own threads. What it throws is one error line in the log.
+  // the host, and keeps one of the host's few threads from other work. It may use the host and its stores, except
+  // `logOut`, `invalidate` and `Session::end`, which throw on the host's own threads. What it throws is one error line
+  // in the log.
   //
   // No lock is held during a call. Queues of your own that run tasks at once call it on the thread that reports: of a
   // manager, and of a store that could not be created, when the request to the host is over; of a store's values, and

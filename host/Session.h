@@ -28,7 +28,8 @@ class CELLAR_EXPORT Session {
     return cellar::detail::storeAs<StoreType>(storeIdentifier, getStore(storeIdentifier));
   }
 
-  // Ends the session and discards its data, as `Host::logOut` with its key does. False if it has ended already.
+  // Ends the session and discards its data. False if it has ended already. Waits and throws as `Host::logOut` with its
+  // key: on the host's own threads `std::logic_error`, and what could not be discarded although the session has ended.
   bool end() const;
 
  private:
