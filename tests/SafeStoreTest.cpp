@@ -254,6 +254,25 @@ TEST_F(SafeStore, ClearsWhatWasStoredBefore) {
   EXPECT_THAT(valueFiles(), IsEmpty());
 }
 
+// Behind a write of any key, the clear goes by way of the file queue: so must what is called after it.
+TEST_F(SafeStore, LetsNothingOvertakeAClear) {
+  open();
+  put("a", "1");
+  watch(store->store("b", bytesOf("2")));
+  store->clear(onSuccess(), onError());
+  const Fetched afterClear = watch(store->fetch("a"));
+  const Written written = watch(store->store("a", bytesOf("3")));
+  const Fetched afterWrite = watch(store->fetch("a"));
+  work().runAll();
+  file().runAll();
+  settle();
+  EXPECT_EQ(ending, "<done>");
+  EXPECT_EQ(told(afterClear), "<miss>");
+  EXPECT_EQ(told(written), "<done>");
+  EXPECT_EQ(told(afterWrite), "3");
+  EXPECT_EQ(contents(), (Contents{{"a", "3"}}));
+}
+
 TEST_F(SafeStore, EvictsAtCapacity) {
   options.capacity = 2;
   open();

@@ -13,7 +13,8 @@
 namespace velmora::mobile::xplat::cellar {
 
 // The keys of operations that reach the work queue by way of the file queue: those behind them have to go the same way,
-// so that the operations on a key take effect in the order in which they were called. Any thread may call.
+// so that the operations on a key take effect in the order in which they were called. One without keys is about all of
+// them. Any thread may call.
 class KeysAhead {
   struct State;
 
@@ -35,6 +36,7 @@ class KeysAhead {
 
   bool containsAny(KeyRange keys) const {
     const std::lock_guard<std::mutex> lock(state_->mutex);
+    if (state_->operationsOnAll > 0) return true;
     if (state_->counts.empty()) return false;
     for (const std::string& key : keys) {
       if (state_->counts.count(key) > 0) return true;
@@ -52,6 +54,7 @@ class KeysAhead {
     std::mutex mutex;  // guards the rest
     std::unordered_map<std::string, std::size_t> counts{};
     std::size_t operations = 0;
+    std::size_t operationsOnAll = 0;
   };
 
   const std::shared_ptr<State> state_ = std::make_shared<State>();
@@ -61,12 +64,14 @@ inline KeysAhead::Passage::Passage(std::shared_ptr<State> state, KeyRange keys)
     : state_(std::move(state)), keys_(keys.begin(), keys.end()) {
   const std::lock_guard<std::mutex> lock(state_->mutex);
   ++state_->operations;
+  if (keys_.empty()) ++state_->operationsOnAll;
   for (const std::string& key : keys_) ++state_->counts[key];
 }
 
 inline KeysAhead::Passage::~Passage() {
   const std::lock_guard<std::mutex> lock(state_->mutex);
   --state_->operations;
+  if (keys_.empty()) --state_->operationsOnAll;
   for (const std::string& key : keys_) {
     const auto count = state_->counts.find(key);
     if (--count->second == 0) state_->counts.erase(count);
