@@ -26,7 +26,7 @@ std::string demangle(const std::type_info& type) {
 
 void detail::throwStoreTypeMismatch(const std::string& identifier, const std::type_info& wanted, const Store& store) {
   throw std::logic_error("Store '" + identifier + "' is a " + demangle(typeid(store)) + ", not a " + demangle(wanted) +
-                         ".");
+                         ". Ask for the class that belongs to its \"type\".");
 }
 
 StoreManager::StoreManager(const std::string& parentPath, const StoreManagerDefinition& definition, bool forceCleanse,

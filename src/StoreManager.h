@@ -3,6 +3,7 @@
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <type_traits>
 #include <typeinfo>
 
 #include "Export.h"
@@ -25,6 +26,8 @@ namespace detail {
 // The store, which may be null, as a store of that type. Throws `std::logic_error` for one of another type.
 template <class StoreType>
 std::shared_ptr<StoreType> storeAs(const std::string& identifier, const std::shared_ptr<Store>& store) {
+  static_assert(std::is_base_of_v<Store, StoreType>,
+                "A store is a DiskCache, a PersistentKeyValueStore or an UnmanagedStore.");
   auto typed = std::dynamic_pointer_cast<StoreType>(store);
   if (store != nullptr && typed == nullptr) throwStoreTypeMismatch(identifier, typeid(StoreType), *store);
   return typed;

@@ -78,10 +78,6 @@ const char* const kConfigurationOfValues = R"({
 })";
 
 // A store type that no configuration has.
-class OtherStore : public Store {
-  using Store::Store;
-};
-
 // As on a file system that leaves the types of a directory's entries open: they are left out of the list.
 class FilesOfUnknownTypes : public FileUtils {
  public:
@@ -302,8 +298,9 @@ TEST_F(HostTest, AnUnknownStoreThrowsEachTime) {
 
 TEST_F(HostTest, AStoreOfAnotherTypeThrows) {
   const auto host = start();
-  EXPECT_NE(errorOf<std::logic_error>([&] { host->store<OtherStore>("thumbs"); }).find("Store 'thumbs'"),
-            std::string::npos);
+  EXPECT_EQ(errorOf<std::logic_error>([&] { host->store<PersistentKeyValueStore>("thumbs"); }),
+            "Store 'thumbs' is a velmora::mobile::xplat::cellar::UnmanagedStore, not a "
+            "velmora::mobile::xplat::cellar::PersistentKeyValueStore. Ask for the class that belongs to its \"type\".");
 }
 
 TEST_F(HostTest, ErrorsOfTheConfigurationPassThrough) {
