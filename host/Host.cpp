@@ -24,6 +24,8 @@
 #include "host/FileNames.h"
 #include "host/RootLock.h"
 #include "host/ThreadQueueFactory.h"
+#include "host/figures/ManagerFigures.h"
+#include "host/figures/MeasuredSizes.h"
 #include "host/sessions/ManagerScopes.h"
 #include "host/sessions/SessionData.h"
 
@@ -31,22 +33,21 @@ namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
 
-// Managers of one area and scope share a directory, and each treats the stores of the other as stale.
-void refuseSharedDirectories(const Configuration& configuration, const JsonValue& document) {
+// Sorted. Managers of one area and scope share a directory, and each treats the stores of the other as stale.
+std::vector<std::string> namesOfManagers(const Configuration& configuration, const std::string& json) {
   std::map<std::pair<Area, bool>, std::string> owners;
+  std::vector<std::string> names;
+  const JsonValue document = JsonValue::parse(json);
   for (const auto& [name, ignored] : document.items()) {
+    names.push_back(name);
     const auto definition = configuration.getManager(name);
     const auto [owner, isFree] = owners.emplace(std::pair(definition->area, definition->sessionScoped), name);
     if (isFree) continue;
     throw ConfigurationException("Managers '" + owner->second + "' and '" + name +
                                  "' would share a directory, give them different areas or session scopes.");
   }
-}
-
-std::shared_ptr<const Configuration> readConfiguration(const std::string& json) {
-  auto configuration = std::make_shared<const Configuration>(json);
-  refuseSharedDirectories(*configuration, JsonValue::parse(json));
-  return configuration;
+  std::sort(names.begin(), names.end());
+  return names;
 }
 
 std::unique_ptr<const RootLock> lockRoot(const HostOptions& options, FileUtils& fileUtils) {
@@ -79,7 +80,8 @@ HostOptions plainOptions(const std::string& configuration, const std::string& ro
 }  // namespace
 
 Host::Host(HostOptions options)
-    : configuration_(readConfiguration(options.configuration)),
+    : configuration_(std::make_shared<const Configuration>(options.configuration)),
+      managerNames_(namesOfManagers(*configuration_, options.configuration)),
       fileUtils_(options.fileUtils ? options.fileUtils : std::make_shared<FileUtils>()),
       rootLock_(lockRoot(options, *fileUtils_)),
       nameBuilders_(std::make_shared<StoreDirectoryNameBuilderFactory>(options.versionTag, options.localeSecondTag,
@@ -91,10 +93,11 @@ Host::Host(HostOptions options)
       analytics_(reporterFor(std::move(options.analytics))),
       threads_(options.taskQueueFactory ? nullptr : std::make_shared<ThreadQueueFactory>()),
       taskQueueFactory_(threads_ ? threads_ : options.taskQueueFactory),
-      trash_(std::make_shared<TrashCollector>(fileUtils_->combinePath(options.root, "trash"), fileUtils_, analytics_,
-                                              taskQueueFactory_)),
+      trashPath_(fileUtils_->combinePath(options.root, "trash")),
+      trash_(std::make_shared<TrashCollector>(trashPath_, fileUtils_, analytics_, taskQueueFactory_)),
       attributes_(std::make_shared<AttributeStore>(fileUtils_)),
-      sizes_(std::make_shared<DiskSizeCalculator>(fileUtils_, attributes_, analytics_)),
+      measuredSizes_(std::make_shared<MeasuredSizes>(fileUtils_, attributes_, analytics_)),
+      sizes_(measuredSizes_),
       lazyWork_(LazyDispatcher::createLazyDispatcher(taskQueueFactory_, options.lazyDelaySeconds)),
       measuringQueue_(taskQueueFactory_->createWorkQueue()),
       incidentGate_(gateFor(std::move(options.onIncident))),
@@ -172,8 +175,10 @@ std::shared_ptr<StoreManager> Host::managerIn(const StoreManagerDefinition& defi
                                               ManagerSlot& slot) {
   std::unique_lock<std::mutex> lock(slot.mutex);
   if (slot.manager != nullptr) return slot.manager;
-  auto manager = build(definition, scope);
+  const auto figures = std::make_shared<const ManagerFigures>(definition);
+  auto manager = build(definition, scope, *figures);
   slot.manager = manager;
+  scopes_->setFigures(slot, figures);
   lock.unlock();
   // The manager has only registered the directories of its unmanaged stores; the host has to have them measured.
   lazyWork_->addTask([sizes = sizes_] { sizes->startDiskSizeCalculation(); }, measuringQueue_);
@@ -181,7 +186,8 @@ std::shared_ptr<StoreManager> Host::managerIn(const StoreManagerDefinition& defi
 }
 
 // With a new factory each time: a factory that failed to build a manager never tries again.
-std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definition, ManagerScope& scope) {
+std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definition, ManagerScope& scope,
+                                          const ManagerFigures& figures) {
   auto locations = sessionData_->sessionless();
   if (definition.sessionScoped) {
     const std::lock_guard<std::mutex> lock(scope.adoption);
@@ -189,8 +195,9 @@ std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definiti
     scope.isAdopted = true;
     locations = sessionData_->locationsOf(scope.tag);
   }
-  StoreManagerFactory factory(definition.sessionScoped, analytics_, attributes_, configuration_, sizes_, fileUtils_,
-                              lazyWork_, locations, nameBuilders_, taskQueueFactory_, trash_,
+  StoreManagerFactory factory(definition.sessionScoped, figures.observe(analytics_), attributes_,
+                              figures.observe(definition, analytics_, measuredSizes_), sizes_, fileUtils_, lazyWork_,
+                              locations, nameBuilders_, taskQueueFactory_, trash_,
                               [&scope](const std::string&) { return scope.tag; });
   factory.setIncidents(incidents_);
   auto manager = factory.managerForIdentifier(definition.name, scope.key, runMaintenance_);

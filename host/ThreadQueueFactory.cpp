@@ -97,6 +97,11 @@ void ThreadQueueFactory::refuseOnQueueThread(const std::string& operation, const
   if (isMarked) throw std::logic_error(operation + " may deadlock in a task of a queue. " + advice);
 }
 
+ThreadQueueFactory::Load ThreadQueueFactory::load() const {
+  const ThreadPool::Load load = threads_->pool->load();
+  return {load.waiting, load.running};
+}
+
 bool ThreadQueueFactory::drain(std::chrono::milliseconds patience) {
   return !threads_->pool->isOwnThread() && threads_->pool->waitUntilIdle(deadlineAfter(inNanoseconds(patience)));
 }

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstddef>
 #include <memory>
 #include <string>
 
@@ -54,6 +55,14 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   // Throws `std::logic_error` on a thread of any factory and under a `QueueThreadMark`: what `operation` waits for may
   // have to run there. The text names the operation and ends with the advice.
   static void refuseOnQueueThread(const std::string& operation, const std::string& advice);
+
+  // Tasks of all queues together, as a snapshot. Does not wait for them. A thread on its way to sleep counts as one
+  // that runs a task, for some microseconds, if there are tasks.
+  struct Load {
+    std::size_t waiting;
+    std::size_t running;
+  };
+  Load load() const;
 
   // Waits until no queue has anything to run, including what tasks dispatch to other queues; false if that takes longer
   // than `patience`. Armed timers do not count. Says nothing about what other threads dispatch during the call. Called

@@ -49,13 +49,12 @@ std::size_t processorsOfThisThread() {
 
 }  // namespace
 
-ThreadPool::ThreadPool() : hasOtherProcessors_(processorsOfThisThread() > 1) {}
+ThreadPool::ThreadPool() : hasOtherProcessors_(processorsOfThisThread() > 1), workers_(processorsOfThisThread() + 1) {}
 
 std::shared_ptr<ThreadPool> ThreadPool::start(const std::function<void()>& timers) {
   std::shared_ptr<ThreadPool> pool(new ThreadPool());
-  const std::size_t workers = processorsOfThisThread() + 1;
   try {
-    for (std::size_t number = 1; number <= workers; ++number) {
+    for (std::size_t number = 1; number <= pool->workers_; ++number) {
       pool->startThread("cellar-" + std::to_string(number), [&pool = *pool] { pool.runWork(); });
     }
     pool->startThread("cellar-timer", timers);
@@ -101,6 +100,17 @@ bool ThreadPool::waitUntilIdle(Clock::time_point deadline) {
     idle_.wait_until(lock, cappedDeadline(deadline));
   }
   return true;
+}
+
+ThreadPool::Load ThreadPool::load() {
+  std::size_t idle = isSearching_ ? 1 : 0;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    idle += sleepers_;
+  }
+  const std::size_t unfinished = unfinishedTasks_;
+  const std::size_t running = std::min(unfinished, workers_ - std::min(idle, workers_));
+  return {unfinished - running, running};
 }
 
 bool ThreadPool::isOwnThread() const { return currentPool == this; }

@@ -42,6 +42,14 @@ class ThreadPool : public std::enable_shared_from_this<ThreadPool> {
   bool isOwnThread() const;
   static bool isThreadOfAnyPool();
 
+  struct Load {
+    std::size_t waiting;
+    std::size_t running;
+  };
+
+  // The tasks at this moment. A thread on its way to sleep counts as one that runs a task.
+  Load load();
+
   // False if that takes longer.
   bool waitUntilIdle(std::chrono::steady_clock::time_point deadline);
 
@@ -64,6 +72,7 @@ class ThreadPool : public std::enable_shared_from_this<ThreadPool> {
   std::vector<std::thread> takeThreads();
 
   const bool hasOtherProcessors_;
+  const std::size_t workers_;  // threads that run work
 
   // A task is counted before the flags are read: either it is refused, or who sets a flag finds it counted.
   std::atomic<std::size_t> unfinishedTasks_{0};

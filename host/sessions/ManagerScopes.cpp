@@ -7,6 +7,7 @@
 
 #include "LarderException.h"
 #include "StoreManager.h"
+#include "host/figures/ManagerFigures.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
@@ -36,6 +37,37 @@ std::vector<std::shared_ptr<ManagerScope>> ManagerScopes::openSessions() const {
   std::copy_if(sessions_.begin(), sessions_.end(), std::back_inserter(open),
                [](const auto& session) { return session->isOpen; });
   return open;
+}
+
+void ManagerScopes::setFigures(ManagerSlot& slot, std::shared_ptr<const ManagerFigures> figures) {
+  const Lock lock(mutex_);
+  slot.figures.swap(figures);
+}
+
+ScopeFigures ManagerScopes::figuresWithoutSession() const {
+  const Lock lock(mutex_);
+  return figuresOf(lock, *sessionless_);
+}
+
+std::vector<ScopeFigures> ManagerScopes::figuresOfSessions() const {
+  std::vector<ScopeFigures> figures;
+  {
+    const Lock lock(mutex_);
+    for (const auto& session : sessions_) {
+      if (session->isOpen) figures.push_back(figuresOf(lock, *session));
+    }
+  }
+  std::sort(figures.begin(), figures.end(),
+            [](const ScopeFigures& one, const ScopeFigures& other) { return one.tag < other.tag; });
+  return figures;
+}
+
+ScopeFigures ManagerScopes::figuresOf(const Lock& /*lock*/, const ManagerScope& scope) {
+  ScopeFigures figures{scope.tag, {}};
+  for (const auto& [name, slot] : scope.managers) {
+    if (slot.figures != nullptr) figures.managers.emplace(name, slot.figures);
+  }
+  return figures;
 }
 
 std::shared_ptr<ManagerScope> ManagerScopes::findByTag(const Lock& /*lock*/, const std::string& tag) const {
@@ -168,8 +200,10 @@ ManagerScopes::Ending::~Ending() {
 // No request uses the managers meanwhile.
 void ManagerScopes::Ending::invalidateManagers() {
   for (auto& [name, slot] : scope_->managers) {
+    if (slot.figures != nullptr) slot.figures->release();  // so that the stores end with the manager
     if (slot.manager != nullptr) slot.manager->invalidate();
     slot.manager = nullptr;
+    scopes_.setFigures(slot, nullptr);
   }
   hasEnded_ = true;
 }

@@ -19,10 +19,19 @@ class StoreManager;
 
 namespace host {
 
+class ManagerFigures;
+
 // One manager; null until it is built.
 struct ManagerSlot {
   std::mutex mutex{};  // guards the manager; held while it is built
   std::shared_ptr<StoreManager> manager{};
+  std::shared_ptr<const ManagerFigures> figures{};  // null with the manager; guarded by the mutex of the scopes
+};
+
+// What is known of the managers of a scope that have been built.
+struct ScopeFigures {
+  std::string tag;
+  std::map<std::string, std::shared_ptr<const ManagerFigures>> managers;  // by name
 };
 
 // The managers of one session, or those of none. What follows `isAdopted` is guarded by the mutex of the scopes.
@@ -104,6 +113,13 @@ class ManagerScopes {
     bool hasEnded_ = false;
   };
 
+  // Of a manager that has just been built.
+  void setFigures(ManagerSlot& slot, std::shared_ptr<const ManagerFigures> figures);
+
+  // Of the managers without session scope, and of those of the open sessions, sorted by tag. Waits for nobody.
+  ScopeFigures figuresWithoutSession() const;
+  std::vector<ScopeFigures> figuresOfSessions() const;
+
   bool hasOpenedSession() const;  // since the scopes were created
   std::vector<std::shared_ptr<ManagerScope>> openSessions() const;
 
@@ -115,6 +131,7 @@ class ManagerScopes {
   std::shared_ptr<ManagerScope> findOrOpen(Lock& lock, const std::optional<std::string>& sessionKey);
   std::shared_ptr<ManagerScope> theOpenOne(const Lock& lock) const;
   bool isAnOpenOneEnding(const Lock& lock) const;
+  static ScopeFigures figuresOf(const Lock& lock, const ManagerScope& scope);
 
   const bool severalSessions_;
   const SessionTagMapper sessionTagMapper_;

@@ -11,6 +11,7 @@
 #include "StoreDirectoryNameBuilder.h"
 #include "TrashCollector.h"
 #include "host/DirectoryPathLocations.h"
+#include "host/sessions/BytesBelow.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
@@ -102,26 +103,8 @@ std::vector<SessionData::Place> SessionData::placesOf(const std::string& tag) co
 
 std::uint64_t SessionData::bytesOf(const std::string& tag) const {
   std::uint64_t bytes = 0;
-  for (const Place& place : placesOf(tag)) bytes += bytesBelow(fileUtils_->combinePath(place.directory, place.name));
-  return bytes;
-}
-
-std::uint64_t SessionData::bytesBelow(const std::string& directory) const {
-  std::uint64_t bytes = 0;
-  std::vector<std::string> waiting = {directory};
-  while (!waiting.empty()) {
-    const std::string path = std::move(waiting.back());
-    waiting.pop_back();
-    if (fileUtils_->isSymLink(path)) continue;
-    try {
-      for (const FileUtils::Info& entry : fileUtils_->listDirectory(path)) {
-        if (entry.type == FileUtils::Type::Directory) waiting.push_back(entry.path);
-        bytes += static_cast<std::uint64_t>(entry.size);
-      }
-    } catch (const FileUtilsIoException& error) {
-      if (error.code() != ENOENT) throw;
-    }
-  }
+  for (const Place& place : placesOf(tag))
+    bytes += bytesBelow(*fileUtils_, fileUtils_->combinePath(place.directory, place.name));
   return bytes;
 }
 

@@ -60,7 +60,6 @@ class SessionData {
   bool discardAt(const Place& place);
   bool holds(const Place& place) const;
   std::vector<std::string> directoriesIn(const std::string& path) const;
-  std::uint64_t bytesBelow(const std::string& directory) const;
 
   const std::string accounts_;  // the directory of the sessions' own areas
   const bool severalKept_;
