@@ -3,7 +3,7 @@
 #include <glog/logging.h>
 
 #include <cerrno>
-#include <utility>
+#include <exception>
 
 #include "Clock.h"
 #include "Configuration.h"
@@ -34,10 +34,13 @@ std::optional<TrashMetrics> measureTrash(FileUtils& fileUtils, const std::string
     if (error.code() == ENOENT) return TrashMetrics{0, 0};
     LOG(ERROR) << "Cannot measure trash. " << error.what();
     return std::nullopt;
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Cannot measure trash. " << error.what();
+    return std::nullopt;
   }
   try {
     trash.bytes = bytesBelow(fileUtils, path);
-  } catch (const FileUtilsIoException& error) {
+  } catch (const std::exception& error) {
     LOG(ERROR) << "Cannot measure trash. " << error.what();
   }
   return trash;

@@ -21,6 +21,7 @@
 #include "Configuration.h"
 #include "DiskCache.h"
 #include "DiskSizeCalculator.h"
+#include "JsonValue.h"
 #include "LarderException.h"
 #include "LazyDispatcher.h"
 #include "Store.h"
@@ -304,6 +305,25 @@ TEST_F(Metrics, AManagerThatCouldNotBeBuiltIsNot) {
   files->failAlways(Operation::CreateDirectory, EIO);
   EXPECT_THROW(host->manager("media"), FileUtilsIoException);
   EXPECT_FALSE(managerMetrics("media").isBuilt);
+}
+
+TEST_F(Metrics, OfHostileNamesAreReadAgainFromTheJson) {
+  start(options(R"({"\"}],\n\u0000": {"session_scoped": false, "stores": {
+    "\u0001\"identifier": {"type": "pkvs", "name": "a\"b"},
+    "<b>\ud83d\ude00": {"type": "disk_cache", "name": "c\\d", "lru_size_limit": "1KB"}}}})"));
+  put(*host->store<DiskCache>("<b>\xf0\x9f\x98\x80"), "cat", 5);
+  const HostMetrics metrics = host->metrics();
+  const JsonValue json = JsonValue::parse(toJson(metrics));
+  ASSERT_EQ(json.at("managers").size(), 1U);
+  const JsonValue& manager = json.at("managers")[0];
+  EXPECT_EQ(manager.at("name"), std::string("\"}],\n\0", 6));
+  ASSERT_EQ(manager.at("stores").size(), 2U);
+  for (std::size_t i = 0; i < 2; ++i) {
+    EXPECT_EQ(manager.at("stores")[i].at("identifier"), metrics.managers[0].stores[i].identifier);
+    EXPECT_EQ(manager.at("stores")[i].at("name"), metrics.managers[0].stores[i].name);
+  }
+  EXPECT_EQ(manager.at("stores")[0].at("name"), "a\"b");
+  EXPECT_EQ(manager.at("stores")[1].at("bytes"), 5);
 }
 
 // Prunes

@@ -142,9 +142,10 @@ TEST_F(MetricsThreads, AreReadInACallbackOfAStore) {
   const auto host = start();
   const auto thumbs = host->store<DiskCache>("thumbs");
   await(thumbs->store("cat", Bytes(3)));
-  Promise<HostMetrics> seen;
-  thumbs->fetch("cat").then(nullptr, [&](auto& /*fetched*/) { seen.setValue(host->metrics()); });
-  EXPECT_EQ(storeIn(await(seen.getFuture()), "thumbs").hits, 1U);
+  const auto seen = std::make_shared<Promise<HostMetrics>>();  // still in use when its value is there
+  const auto metrics = seen->getFuture();
+  thumbs->fetch("cat").then(nullptr, [&host, seen](auto& /*fetched*/) { seen->setValue(host->metrics()); });
+  EXPECT_EQ(storeIn(await(metrics), "thumbs").hits, 1U);
 }
 
 TEST_F(MetricsThreads, DoNotWaitForAStoreThatIsStuck) {
