@@ -33,7 +33,8 @@ namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
 
-// Sorted. Managers of one area and scope share a directory, and each treats the stores of the other as stale.
+// Sorted, as an object keeps its members. Managers of one area and scope share a directory, and each treats the stores
+// of the other as stale.
 std::vector<std::string> namesOfManagers(const Configuration& configuration, const std::string& json) {
   std::map<std::pair<Area, bool>, std::string> owners;
   std::vector<std::string> names;
@@ -46,7 +47,6 @@ std::vector<std::string> namesOfManagers(const Configuration& configuration, con
     throw ConfigurationException("Managers '" + owner->second + "' and '" + name +
                                  "' would share a directory, give them different areas or session scopes.");
   }
-  std::sort(names.begin(), names.end());
   return names;
 }
 

@@ -4,6 +4,7 @@
 
 #include <cerrno>
 #include <exception>
+#include <map>
 
 #include "Clock.h"
 #include "Configuration.h"
@@ -20,8 +21,8 @@ namespace velmora::mobile::xplat::cellar::host {
 namespace {
 
 ManagerMetrics read(const StoreManagerDefinition& definition, const ScopeFigures& scope) {
-  const auto found = scope.managers.find(definition.name);
-  return found == scope.managers.end() ? limitsOf(definition) : found->second->read();
+  const auto found = scope.find(definition.name);
+  return found == scope.end() ? limitsOf(definition) : found->second->read();
 }
 
 // A pass may take away at any moment what is looked at.
@@ -62,7 +63,7 @@ HostMetrics Host::metrics(TrashSize trash) const {
 
 std::vector<ManagerMetrics> Host::managerMetrics() const {
   const ScopeFigures sessionless = scopes_->figuresWithoutSession();
-  const std::vector<ScopeFigures> sessions = scopes_->figuresOfSessions();
+  const std::map<std::string, ScopeFigures> sessions = scopes_->figuresOfSessions();
   std::vector<ManagerMetrics> managers;
   for (const std::string& name : managerNames_) {
     const auto definition = configuration_->getManager(name);
@@ -70,9 +71,9 @@ std::vector<ManagerMetrics> Host::managerMetrics() const {
       managers.push_back(read(*definition, sessionless));
       continue;
     }
-    for (const ScopeFigures& session : sessions) {
+    for (const auto& [tag, session] : sessions) {
       managers.push_back(read(*definition, session));
-      managers.back().session = session.tag;
+      managers.back().session = tag;
     }
   }
   return managers;

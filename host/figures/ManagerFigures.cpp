@@ -1,6 +1,5 @@
 #include "host/figures/ManagerFigures.h"
 
-#include <algorithm>
 #include <utility>
 
 #include "AnalyticsEventReporter.h"
@@ -45,9 +44,9 @@ ManagerMetrics limitsOf(const StoreManagerDefinition& definition) {
   metrics.isSessionScoped = definition.sessionScoped;
   metrics.maxBytes = definition.maxSize;
   metrics.pruneInterval = definition.pruneInterval;
-  for (const auto& [identifier, store] : definition.stores) metrics.stores.push_back(limitsOf(identifier, *store));
-  std::sort(metrics.stores.begin(), metrics.stores.end(),
-            [](const StoreMetrics& one, const StoreMetrics& other) { return one.identifier < other.identifier; });
+  std::map<std::string, const StoreDefinition*> sorted;
+  for (const auto& [identifier, store] : definition.stores) sorted.emplace(identifier, store.get());
+  for (const auto& [identifier, store] : sorted) metrics.stores.push_back(limitsOf(identifier, *store));
   return metrics;
 }
 

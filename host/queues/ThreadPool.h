@@ -72,7 +72,6 @@ class ThreadPool : public std::enable_shared_from_this<ThreadPool> {
   std::vector<std::thread> takeThreads();
 
   const bool hasOtherProcessors_;
-  const std::size_t workers_;  // threads that run work
 
   // A task is counted before the flags are read: either it is refused, or who sets a flag finds it counted.
   std::atomic<std::size_t> unfinishedTasks_{0};
@@ -93,6 +92,7 @@ class ThreadPool : public std::enable_shared_from_this<ThreadPool> {
   std::condition_variable changed_;
 
   std::mutex joinMutex_;  // so that a second `join` waits for the first; never locked by the pool's threads
+  const std::size_t workers_;  // threads that run work
   std::mutex threadsMutex_;
   std::vector<std::thread> threads_;
 };

@@ -49,23 +49,19 @@ ScopeFigures ManagerScopes::figuresWithoutSession() const {
   return figuresOf(lock, *sessionless_);
 }
 
-std::vector<ScopeFigures> ManagerScopes::figuresOfSessions() const {
-  std::vector<ScopeFigures> figures;
-  {
-    const Lock lock(mutex_);
-    for (const auto& session : sessions_) {
-      if (session->isOpen) figures.push_back(figuresOf(lock, *session));
-    }
+std::map<std::string, ScopeFigures> ManagerScopes::figuresOfSessions() const {
+  const Lock lock(mutex_);
+  std::map<std::string, ScopeFigures> figures;
+  for (const auto& session : sessions_) {
+    if (session->isOpen) figures.emplace(session->tag, figuresOf(lock, *session));
   }
-  std::sort(figures.begin(), figures.end(),
-            [](const ScopeFigures& one, const ScopeFigures& other) { return one.tag < other.tag; });
   return figures;
 }
 
 ScopeFigures ManagerScopes::figuresOf(const Lock& /*lock*/, const ManagerScope& scope) {
-  ScopeFigures figures{scope.tag, {}};
+  ScopeFigures figures;
   for (const auto& [name, slot] : scope.managers) {
-    if (slot.figures != nullptr) figures.managers.emplace(name, slot.figures);
+    if (slot.figures != nullptr) figures.emplace(name, slot.figures);
   }
   return figures;
 }

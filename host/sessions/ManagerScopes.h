@@ -28,11 +28,8 @@ struct ManagerSlot {
   std::shared_ptr<const ManagerFigures> figures{};  // null with the manager; guarded by the mutex of the scopes
 };
 
-// What is known of the managers of a scope that have been built.
-struct ScopeFigures {
-  std::string tag;
-  std::map<std::string, std::shared_ptr<const ManagerFigures>> managers;  // by name
-};
+// What is known of the managers of a scope that have been built, by name.
+using ScopeFigures = std::map<std::string, std::shared_ptr<const ManagerFigures>>;
 
 // The managers of one session, or those of none. What follows `isAdopted` is guarded by the mutex of the scopes.
 struct ManagerScope {
@@ -116,9 +113,9 @@ class ManagerScopes {
   // Of a manager that has just been built.
   void setFigures(ManagerSlot& slot, std::shared_ptr<const ManagerFigures> figures);
 
-  // Of the managers without session scope, and of those of the open sessions, sorted by tag. Waits for nobody.
+  // Of the managers without session scope, and of those of the open sessions, by tag. Waits for nobody.
   ScopeFigures figuresWithoutSession() const;
-  std::vector<ScopeFigures> figuresOfSessions() const;
+  std::map<std::string, ScopeFigures> figuresOfSessions() const;
 
   bool hasOpenedSession() const;  // since the scopes were created
   std::vector<std::shared_ptr<ManagerScope>> openSessions() const;
