@@ -91,7 +91,7 @@ class ThreadPool : public std::enable_shared_from_this<ThreadPool> {
   bool isStopped_ = false;
   std::condition_variable changed_;
 
-  std::mutex joinMutex_;  // so that a second `join` waits for the first; never locked by the pool's threads
+  std::mutex joinMutex_;       // so that a second `join` waits for the first; never locked by the pool's threads
   const std::size_t workers_;  // threads that run work
   std::mutex threadsMutex_;
   std::vector<std::thread> threads_;
