@@ -24,6 +24,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
 constexpr int kDone = 0;
+constexpr int kIncomplete = 1;
 
 struct InspectOptions {
   std::string root;
@@ -70,7 +71,7 @@ int runInspect(const InspectOptions& options) {
   } else if (!hasPage) {
     printSurvey(result, console);
   }
-  return kDone;
+  return result.unreadable.empty() ? kDone : kIncomplete;
 }
 
 }  // namespace
@@ -98,6 +99,10 @@ void addInspectCommand(CLI::App& app, int& status) {
       "directories of one store, the last used one counts as the present one. It does not contain video priorities\n"
       "either: items are listed by their last use. \"Durability\" is the configured one; without a configuration\n"
       "it is \"checksums\" when the manifest has some, as that of a safe or synced store has.\n\n"
+      "What cannot be read, because it is not a regular file or too large or for the reason that the system gives, is\n"
+      "listed at the end.\n\n"
+      "Exit status: 0, 1 when a part could not be read, 2 for usage and input errors. Damage is shown, and is what\n"
+      "cellar verify is for.\n\n"
       "Examples:\n  cellar inspect /tmp/cellar-demo --config media-app.json --top 3\n"
       "  cellar inspect /tmp/cellar-demo --html storage.html");
   inspect->callback([options, &status] { status = runInspect(*options); });

@@ -1,6 +1,8 @@
 #include "inspect/StoreFigures.h"
 
 #include <algorithm>
+#include <exception>
+#include <filesystem>
 #include <memory>
 #include <utility>
 
@@ -17,6 +19,8 @@
 #include "storage/UntouchedFiles.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
+
+namespace fs = std::filesystem;
 
 namespace {
 
@@ -56,7 +60,7 @@ std::vector<ItemFigures> largestOf(const std::vector<ItemFigures>& items, std::s
 void measureFiles(const StorePlace& place, const StoreContext& context, StoreSurvey& store,
                   std::vector<ItemFigures>& values) {
   store.allocatedBytes = allocatedBy(place.path);
-  walkTree(place.path, [&](const std::string& path, const Entry& entry) {
+  const auto onEntry = [&](const std::string& path, const Entry& entry) {
     store.allocatedBytes += entry.allocated;
     if (entry.type != Entry::Type::File) return;
     context.onFile(entry.size);
@@ -72,13 +76,21 @@ void measureFiles(const StorePlace& place, const StoreContext& context, StoreSur
       store.fileBytes += entry.size;
       values.push_back({path, entry.size, entry.modified, false});
     }
-  });
+  };
+  walkTree(place.path, onEntry, context.onUnreadable);
+}
+
+bool exists(const std::string& path) {
+  std::error_code ignored;
+  return fs::exists(fs::symlink_status(path, ignored));
 }
 
 // The stored result of the last measurement of the directory.
 std::optional<std::uint64_t> keptSize(const std::string& path) {
-  AttributeStore attributes(std::make_shared<UntouchedFiles>());
-  const JsonValue document = attributes.get(path);
+  const std::string file = path + "/" + AttributeStore::fileName;
+  if (!exists(file)) return std::nullopt;
+  const auto bytes = UntouchedFiles(kLargestAttributes).readFile(file);
+  const JsonValue document = JsonValue::parse(bytes.begin(), bytes.end(), nullptr, false);
   if (!document.is_object()) return std::nullopt;
   const auto size = document.find(DiskSizeCalculator::ATTR_SIZE);
   if (size == document.end() || !size->is_number_integer() || size->get<std::int64_t>() < 0) return std::nullopt;
@@ -178,6 +190,30 @@ void useDefinition(const StoreDefinition& definition, StoreSurvey& store) {
   }
 }
 
+// The manifest, or the attributes: whatever the store itself has written down.
+void useKept(const StorePlace& place, const ConfiguredStore& configured, const std::vector<ItemFigures>& values,
+             const StoreContext& context, StoreSurvey& store) {
+  if (!place.hasManifest) {
+    const std::string strangeness = strangenessOf(place.path + "/" + ManifestSnapshot::manifestName);
+    if (!strangeness.empty()) {
+      context.onUnreadable({place.path + "/" + ManifestSnapshot::manifestName, strangeness});
+    }
+    store.recordedBytes = keptSize(place.path);
+    useFiles(values, context, store);
+    return;
+  }
+  const ManifestSnapshot snapshot(place.path, context.temporaryDirectory, std::make_shared<UntouchedFiles>());
+  store.damages = snapshot.integrityErrors();
+  if (!store.damages.empty()) {
+    useFiles(values, context, store);
+    return;
+  }
+  if (store.durability.empty() && snapshot.hasChecksums()) store.durability = "checksums";
+  const auto* const cache = dynamic_cast<const DiskCacheDefinition*>(configured.definition.get());
+  const auto metadata = cache != nullptr ? ExtendedMetadataFactoryFactory(cache->metadataFactory) : nullptr;
+  useRecords(snapshot.records(metadata), cache, context, store);
+}
+
 }  // namespace
 
 StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configured, const StoreContext& context) {
@@ -192,33 +228,25 @@ StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configur
 
   std::vector<ItemFigures> values;
   measureFiles(place, context, store, values);
-  if (!place.hasManifest) {
-    store.recordedBytes = keptSize(place.path);
+  try {
+    useKept(place, configured, values, context, store);
+  } catch (const std::exception& error) {
+    context.onUnreadable(unreadableBy(error, place.path));
     useFiles(values, context, store);
-    return store;
   }
-  const ManifestSnapshot snapshot(place.path, context.temporaryDirectory, std::make_shared<UntouchedFiles>());
-  store.damages = snapshot.integrityErrors();
-  if (!store.damages.empty()) {
-    useFiles(values, context, store);
-    return store;
-  }
-  if (store.durability.empty() && snapshot.hasChecksums()) store.durability = "checksums";
-  const auto* const cache = dynamic_cast<const DiskCacheDefinition*>(configured.definition.get());
-  const auto metadata = cache != nullptr ? ExtendedMetadataFactoryFactory(cache->metadataFactory) : nullptr;
-  useRecords(snapshot.records(metadata), cache, context, store);
   return store;
 }
 
-void measureTree(const std::string& path, Leftover& leftover, const OnFile& onFile) {
+void measureTree(const std::string& path, Leftover& leftover, const StoreContext& context) {
   leftover.allocatedBytes = allocatedBy(path);
-  walkTree(path, [&](const std::string&, const Entry& entry) {
+  const auto onEntry = [&](const std::string&, const Entry& entry) {
     leftover.allocatedBytes += entry.allocated;
     if (entry.type != Entry::Type::File) return;
-    onFile(entry.size);
+    context.onFile(entry.size);
     ++leftover.files;
     leftover.bytes += entry.size;
-  });
+  };
+  walkTree(path, onEntry, context.onUnreadable);
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -5,6 +5,7 @@
 #include <string>
 
 #include "inspect/Survey.h"
+#include "storage/StoreFiles.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -18,12 +19,13 @@ struct StoreContext {
   std::size_t top;
   std::int64_t now;
   OnFile onFile;
+  OnUnreadable onUnreadable;
 };
 
-// The figures of one store's directory.
+// The figures of one store's directory. What cannot be read is not in them.
 StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configured, const StoreContext& context);
 
 // The files of a tree that is not a store.
-void measureTree(const std::string& path, Leftover& leftover, const OnFile& onFile);
+void measureTree(const std::string& path, Leftover& leftover, const StoreContext& context);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

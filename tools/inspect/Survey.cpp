@@ -5,8 +5,6 @@
 #include <map>
 #include <set>
 
-#include "InputError.h"
-#include "LarderException.h"
 #include "inspect/StoreFigures.h"
 #include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
@@ -79,7 +77,9 @@ void markAllButHighest(const Family& family) {
 class Surveyor {
  public:
   Surveyor(const Layout& layout, const ConfiguredStores& configured, StoreContext context)
-      : layout_(layout), configured_(configured), context_(std::move(context)) {}
+      : layout_(layout), configured_(configured), context_(std::move(context)) {
+    context_.onUnreadable = [this](const Unreadable& found) { add(found); };
+  }
 
   Survey make() {
     survey_.root = layout_.root;
@@ -94,6 +94,10 @@ class Surveyor {
   }
 
  private:
+  void add(const Unreadable& found) {
+    survey_.unreadable.push_back({relativeTo(layout_.root, found.path), found.reason});
+  }
+
   ManagerSurvey surveyManager(const ManagerPlace& place) {
     ManagerSurvey manager;
     manager.path = relativeTo(layout_.root, place.path);
@@ -167,13 +171,13 @@ class Surveyor {
     Leftover leftover;
     leftover.path = relativeTo(layout_.root, place.path);
     leftover.kind = kindOf(place.kind);
-    measureTree(place.path, leftover, context_.onFile);
+    measureTree(place.path, leftover, context_);
     if (leftover.files > 0) survey_.leftovers.push_back(leftover);
   }
 
   const Layout& layout_;
   const ConfiguredStores& configured_;
-  const StoreContext context_;
+  StoreContext context_;
   Survey survey_;
 };
 
@@ -182,11 +186,7 @@ class Surveyor {
 Survey makeSurvey(const Layout& layout, const ConfiguredStores& configured, std::size_t top, std::int64_t now,
                   const OnFile& onFile) {
   const TemporaryFolder temporary;
-  try {
-    return Surveyor(layout, configured, {layout.root, temporary.path(), top, now, onFile}).make();
-  } catch (const LarderException& error) {
-    throw InputError(error.description());
-  }
+  return Surveyor(layout, configured, {layout.root, temporary.path(), top, now, onFile, nullptr}).make();
 }
 
 const char* textOf(StoreKind kind) {

@@ -7,6 +7,8 @@
 #include <string>
 #include <vector>
 
+#include "storage/UntouchedFiles.h"
+
 namespace velmora::mobile::xplat::cellar::tools {
 
 class ConfiguredStores;
@@ -98,12 +100,13 @@ struct Survey {
   std::int64_t inspectedAt;  // seconds since the Unix epoch
   std::vector<ManagerSurvey> managers;
   std::vector<Leftover> leftovers;
+  std::vector<Unreadable> unreadable;  // not in any figure; paths below the root
 };
 
 using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each file that is looked at
 
 // Inspects everything in the layout without changing it. `top`: how many of the largest items, and of the next to be
-// evicted, are listed for each store. Throws `InputError` for what cannot be read.
+// evicted, are listed for each store.
 Survey makeSurvey(const Layout& layout, const ConfiguredStores& configured, std::size_t top, std::int64_t now,
                   const OnFile& onFile);
 

@@ -117,6 +117,10 @@ nlohmann::ordered_json surveyAsJson(const Survey& survey) {
   for (const Leftover& leftover : survey.leftovers) json["leftovers"].push_back(asJson(leftover));
   json["ages"] = asJson(totals.ages);
   json["sizes"] = asJson(totals.sizes);
+  json["unreadable"] = Json::array();
+  for (const Unreadable& part : survey.unreadable) {
+    json["unreadable"].push_back({{"path", part.path}, {"reason", part.reason}});
+  }
   return json;
 }
 

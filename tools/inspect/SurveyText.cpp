@@ -92,6 +92,7 @@ class Printer {
     for (const ManagerSurvey& manager : survey_.managers) printManager(manager);
     printLeftovers();
     printTotals();
+    printUnreadable();
   }
 
  private:
@@ -188,6 +189,14 @@ class Printer {
                   " of manifests, " + formatSize(totals.allocatedBytes) + " on the disk");
     if (survey_.leftovers.empty()) return;
     console_.line(formatSize(totals.leftoverAllocatedBytes) + " on the disk left over");
+  }
+
+  void printUnreadable() {
+    if (survey_.unreadable.empty()) return;
+    console_.heading("Not readable, and in none of the figures");
+    for (const Unreadable& part : survey_.unreadable) {
+      console_.bad(printable(part.path) + ": " + printable(part.reason));
+    }
   }
 
   const Survey& survey_;

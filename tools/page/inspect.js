@@ -126,6 +126,15 @@ function fillManagers() {
   });
 }
 
+function fillUnreadable() {
+  if (survey.unreadable.length === 0) return;
+  const section = document.getElementById("unreadable");
+  section.hidden = false;
+  for (const part of survey.unreadable) {
+    section.querySelector("tbody").append(make("tr", {}, make("td", { textContent: part.path }), make("td", { textContent: part.reason })));
+  }
+}
+
 function fillLeftovers() {
   if (survey.leftovers.length === 0) return;
   const section = document.getElementById("leftovers");
@@ -205,5 +214,6 @@ function drawCharts() {
 fillHeader();
 fillTiles();
 fillManagers();
+fillUnreadable();
 fillLeftovers();
 keepDrawn(drawCharts);

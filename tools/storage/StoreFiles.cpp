@@ -12,12 +12,22 @@ namespace {
 
 constexpr std::array<const char*, 4> kSuffixes = {"", "-wal", "-shm", "-journal"};
 
-using OnEntry = std::function<void(const std::string& below, const Entry&)>;
+std::vector<Entry> entriesOf(const std::string& directory, const OnUnreadable& onUnreadable) {
+  try {
+    return listUntouched(directory);
+  } catch (const UnreadableException& error) {
+    if (!onUnreadable) throw;
+    onUnreadable(error.unreadable());
+    return {};
+  }
+}
 
-void walk(const std::string& directory, const std::string& prefix, const OnEntry& onEntry) {
-  for (const Entry& entry : listUntouched(directory)) {
+void walk(const std::string& directory, const std::string& prefix, const OnEntry& onEntry,
+          const OnUnreadable& onUnreadable) {
+  for (const Entry& entry : entriesOf(directory, onUnreadable)) {
     onEntry(prefix + entry.name, entry);
-    if (entry.type == Entry::Type::Directory) walk(directory + "/" + entry.name, prefix + entry.name + "/", onEntry);
+    if (entry.type != Entry::Type::Directory) continue;
+    walk(directory + "/" + entry.name, prefix + entry.name + "/", onEntry, onUnreadable);
   }
 }
 
@@ -40,6 +50,15 @@ bool isAttributesFile(const Entry& entry) {
   return entry.type == Entry::Type::File && entry.name == AttributeStore::fileName;
 }
 
-void walkTree(const std::string& directory, const OnEntry& onEntry) { walk(directory, "", onEntry); }
+bool isStrangeAttributesFile(const Entry& entry) {
+  const bool isStrange = entry.type == Entry::Type::Link || entry.type == Entry::Type::Other;
+  return isStrange && entry.name == AttributeStore::fileName;
+}
+
+void walkTree(const std::string& directory, const OnEntry& onEntry, const OnUnreadable& onUnreadable) {
+  walk(directory, "", onEntry, onUnreadable);
+}
+
+void walkTree(const std::string& directory, const OnEntry& onEntry) { walk(directory, "", onEntry, nullptr); }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

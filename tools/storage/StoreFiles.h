@@ -22,8 +22,17 @@ bool isInStoreQuarantine(const std::string& below);
 // Whether it is the file of a directory's attributes.
 bool isAttributesFile(const Entry& entry);
 
-// Every entry of a tree, a directory before its contents, links not followed; each with its path below the tree.
-// Throws `FileUtilsIoException`.
-void walkTree(const std::string& directory, const std::function<void(const std::string& below, const Entry&)>& onEntry);
+// Whether something else has its name: a link, a fifo.
+bool isStrangeAttributesFile(const Entry& entry);
+
+using OnEntry = std::function<void(const std::string& below, const Entry&)>;
+using OnUnreadable = std::function<void(const Unreadable&)>;
+
+// Every entry of a tree, a directory before its contents, links not followed; each with its path below the tree. Passes
+// by directories that cannot be read, or have gone meanwhile, after calling `onUnreadable`.
+void walkTree(const std::string& directory, const OnEntry& onEntry, const OnUnreadable& onUnreadable);
+
+// The same for trees that are the program's own: throws `UnreadableException`.
+void walkTree(const std::string& directory, const OnEntry& onEntry);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -53,6 +53,8 @@ std::string describe(const Finding& finding) {
              bytes(finding.actual) + ")";
     case Finding::Kind::DamagedManifest:
       return "damaged manifest: " + printable(finding.detail);
+    case Finding::Kind::Unreadable:
+      return "cannot be read: " + printable(finding.detail);
     case Finding::Kind::DamagedAttributes:
       break;
   }

@@ -22,7 +22,8 @@ struct Finding {
     UnfinishedManifest,  // a safe store was killed while it made it,
     InterruptedSalvage,  // or before it put it in place
     Quarantine,          // of a safe store: what it could not use
-    DamagedAttributes
+    DamagedAttributes,
+    Unreadable  // `directory` is its path, whatever it is
   };
 
   Kind kind;

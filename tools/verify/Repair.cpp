@@ -41,6 +41,7 @@ std::string Repair::fix(const Finding& finding) {
     case Finding::Kind::InterruptedSalvage:
       throw std::runtime_error("the store puts it in its place at its next start");
     case Finding::Kind::UnreadableValue:
+    case Finding::Kind::Unreadable:
       throw std::runtime_error("it may be readable later");
     case Finding::Kind::Quarantine:
       throw std::runtime_error("look at what is in it, and remove it yourself");

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cstddef>
+#include <exception>
 #include <filesystem>
 #include <memory>
 #include <optional>
@@ -24,12 +25,15 @@ namespace fs = std::filesystem;
 
 namespace {
 
-// Links are followed, as a store does when it reads a value. The store's own files are not values.
+// Links are followed, as a store does when it reads a value. The store's own files are not values. Throws
+// `UnreadableException` when the system does not say whether there is a file.
 std::optional<std::uint64_t> sizeOfValue(const std::string& directory, const std::string& below) {
   if (isManifestFile(below)) return std::nullopt;
   const fs::path path = fs::path(directory) / below;
   std::error_code error;
-  if (!fs::is_regular_file(path, error)) return std::nullopt;
+  const fs::file_status status = fs::status(path, error);
+  if (status.type() == fs::file_type::none) throw UnreadableException(error.value(), {path.string(), error.message()});
+  if (!fs::is_regular_file(status)) return std::nullopt;
   const std::uintmax_t size = fs::file_size(path, error);
   return error ? std::nullopt : std::make_optional<std::uint64_t>(size);
 }
@@ -122,7 +126,13 @@ class StoreCheck {
 
   void checkFile(const DiskCacheItem& item) {
     const std::string below = (fs::path(".") / fs::path(item.filename).relative_path()).lexically_normal().string();
-    const auto actual = sizeOfValue(directory_, below);
+    std::optional<std::uint64_t> actual;
+    try {
+      actual = sizeOfValue(directory_, below);
+    } catch (const UnreadableException& error) {
+      add(Kind::UnreadableValue, item, actual).detail = error.description();
+      return;
+    }
     if (actual) valueFiles_.insert(below);
     const bool isProvisional = item.size == 0 && !item.checksum;
     if (!actual) {
@@ -149,17 +159,19 @@ class StoreCheck {
 
   void findStrays() {
     Finding quarantine = make(Kind::Quarantine, kStoreQuarantine);
-    walkTree(directory_, [&](const std::string& below, const Entry& entry) {
+    const auto onEntry = [&](const std::string& below, const Entry& entry) {
       if (entry.type == Entry::Type::Directory) return;
       onFile_(entry.size);
-      if (isManifestFile(below) || isAttributesFile(entry) || valueFiles_.count(below) > 0) return;
+      if (isManifestFile(below) || isAttributesFile(entry) || isStrangeAttributesFile(entry)) return;
+      if (valueFiles_.count(below) > 0) return;
       if (isInStoreQuarantine(below)) {
         ++quarantine.files;
         quarantine.actual += entry.size;
       } else if (!isSafe_ || !takeForSafe(below, entry)) {
         add(Kind::FileWithoutRecord, below, entry.size);
       }
-    });
+    };
+    walkTree(directory_, onEntry, [](const Unreadable& /*found with the attributes*/) {});
     if (quarantine.files > 0) findings_.push_back(std::move(quarantine));
   }
 
@@ -220,28 +232,59 @@ class StoreCheck {
 };
 
 bool isJson(const std::string& path) {
-  const auto bytes = UntouchedFiles().readFile(path);
-  return JsonValue::accept(std::string(bytes.begin(), bytes.end()));
+  const auto bytes = UntouchedFiles(kLargestAttributes).readFile(path);
+  return JsonValue::accept(bytes.begin(), bytes.end());
 }
 
-}  // namespace
-
-Findings checkStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile) {
+Findings checkReadableStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile) {
   // Until it is in its place, the present one says little of the files.
-  if (fs::is_regular_file(fs::path(place.path) / salvagedManifestName())) {
+  std::error_code error;
+  if (fs::is_regular_file(fs::symlink_status(fs::path(place.path) / salvagedManifestName(), error))) {
     return {{Finding::Kind::InterruptedSalvage, place.path, salvagedManifestName()}};
   }
-  if (!place.hasManifest) return {};
+  if (!place.hasManifest) {
+    const std::string manifest = place.path + "/" + ManifestSnapshot::manifestName;
+    const std::string strangeness = strangenessOf(manifest);
+    return strangeness.empty() ? Findings() : Findings{findingOf({manifest, strangeness})};
+  }
   const ManifestSnapshot snapshot(place.path, temporaryDirectory, std::make_shared<UntouchedFiles>());
   return StoreCheck(place.path, onFile).check(snapshot);
 }
 
+Findings checkAttributesFile(const std::string& directory, const std::string& below) {
+  const std::string path = directory + "/" + below;
+  try {
+    if (isJson(path)) return {};
+  } catch (const std::exception& error) {
+    return {findingOf(unreadableBy(error, path))};
+  }
+  return {{Finding::Kind::DamagedAttributes, directory, below}};
+}
+
+}  // namespace
+
+Finding findingOf(const Unreadable& unreadable) {
+  Finding finding{Finding::Kind::Unreadable, unreadable.path, ""};
+  finding.detail = unreadable.reason;
+  return finding;
+}
+
+Findings checkStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile) {
+  try {
+    return checkReadableStore(place, temporaryDirectory, onFile);
+  } catch (const std::exception& error) {
+    return {findingOf(unreadableBy(error, place.path))};
+  }
+}
+
 Findings checkAttributes(const std::string& directory) {
   Findings findings;
-  walkTree(directory, [&](const std::string& below, const Entry& entry) {
-    if (!isAttributesFile(entry) || isJson(directory + "/" + below)) return;
-    findings.push_back({Finding::Kind::DamagedAttributes, directory, below});
-  });
+  const auto onEntry = [&](const std::string& below, const Entry& entry) {
+    if (!isAttributesFile(entry) && !isStrangeAttributesFile(entry)) return;
+    const Findings found = checkAttributesFile(directory, below);
+    findings.insert(findings.end(), found.begin(), found.end());
+  };
+  walkTree(directory, onEntry, [&](const Unreadable& part) { findings.push_back(findingOf(part)); });
   return findings;
 }
 

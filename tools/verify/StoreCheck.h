@@ -4,6 +4,7 @@
 #include <functional>
 #include <string>
 
+#include "storage/UntouchedFiles.h"
 #include "verify/Finding.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -13,11 +14,14 @@ struct StorePlace;
 using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each file that is looked at
 
 // Holds records and files of a store against each other; a store without a manifest has nothing to be held against.
-// `temporaryDirectory` is for the copy of the manifest: nothing else is written. Throws `LarderException` for what
-// cannot be read.
+// `temporaryDirectory` is for the copy of the manifest: nothing else is written. What cannot be read is a finding.
 Findings checkStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile);
 
-// The attributes files of a tree that are not JSON, `directory` being where the tree begins.
+// The finding that this cannot be read.
+Finding findingOf(const Unreadable& unreadable);
+
+// The attributes files of a tree that are not JSON, and what of it cannot be read, `directory` being where the tree
+// begins.
 Findings checkAttributes(const std::string& directory);
 
 }  // namespace velmora::mobile::xplat::cellar::tools
