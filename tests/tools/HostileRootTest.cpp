@@ -170,6 +170,16 @@ TEST_F(HostileRoot, WithSpecialFilesAmongTheValuesReadsNoneOfThem) {
                                                kThumbs + ": file without record: 'zero' (0 bytes)"));
 }
 
+TEST_F(HostileRoot, KeepsTheRecordOfAValueThatMayBeThere) {
+  const std::string name(300, 'n');
+  data_.putRecord(kThumbs, {"key", name, 4, false, 1, 1, nullptr});
+  const std::string path = data_.path(kThumbs + "/" + name);
+  const std::string line = kThumbs + ": unreadable value: 'key': cannot read '" + path + "': File name too long";
+  EXPECT_THAT(verified(), ElementsAre(line));
+  EXPECT_THAT(verified(true), ElementsAre(line + "; NOT REPAIRED: it may be readable later"));
+  EXPECT_EQ(data_.rows(kThumbs).size(), 2U);
+}
+
 TEST_F(HostileRoot, WithAttributesOfManyLevelsIsRead) {
   const std::size_t levels = 100'000;
   data_.putFile(kAttributes, std::string(levels, '[') + std::string(levels, ']'));
@@ -177,6 +187,34 @@ TEST_F(HostileRoot, WithAttributesOfManyLevelsIsRead) {
   EXPECT_THAT(verified(), IsEmpty());
   data_.putFile(kAttributes, std::string(levels, '['));
   EXPECT_EQ(verified().size(), 1U);
+}
+
+TEST_F(HostileRoot, WithADirectoryThatVanishesIsWalkedOn) {
+  std::vector<std::string> seen;
+  std::vector<std::string> missed;
+  data_.putFile(kManager + "/web_v1/deep/page", "x");
+  const std::string web = data_.path(kManager + "/web_v1");
+  const auto onEntry = [&](const std::string& below, const Entry&) {
+    seen.push_back(below);
+    if (below == "deep") fs::remove_all(web + "/deep");
+  };
+  walkTree(web, onEntry, [&](const Unreadable& part) { missed.push_back(part.path + ": " + part.reason); });
+  EXPECT_THAT(seen, ElementsAre("deep", "page"));
+  EXPECT_THAT(missed, ElementsAre(web + "/deep: No such file or directory"));
+  EXPECT_THROW(walkTree(web + "/deep", onEntry), UnreadableException);
+}
+
+TEST_F(HostileRoot, WithADirectoryThatIsReplacedByALinkIsNotLeft) {
+  std::vector<std::string> missed;
+  const std::string web = data_.path(kManager + "/web_v1");
+  data_.putFile(kManager + "/web_v1/deep/page", "x");
+  const auto onEntry = [&](const std::string& below, const Entry&) {
+    if (below != "deep") return;
+    fs::remove_all(web + "/deep");
+    fs::create_symlink(data_.path(kSound), web + "/deep");
+  };
+  walkTree(web, onEntry, [&](const Unreadable& part) { missed.push_back(part.path); });
+  EXPECT_THAT(missed, ElementsAre(web + "/deep"));
 }
 
 TEST(UntouchedFiles, ReadsAFileThatHasNoSizeUntilItsEnd) {

@@ -85,6 +85,7 @@ class Surveyor {
     survey_.root = layout_.root;
     survey_.depth = textOf(layout_.kind);
     survey_.inspectedAt = context_.now;
+    for (const Unreadable& found : layout_.unreadable) add(found);
     for (const ManagerPlace& place : layout_.managers) survey_.managers.push_back(surveyManager(place));
     markOtherSessions();
     for (ManagerSurvey& manager : survey_.managers) countForLimit(manager);

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <array>
 #include <filesystem>
+#include <map>
 #include <system_error>
 
 #include "InputError.h"
@@ -41,14 +42,6 @@ bool hasManifest(const std::string& directory) {
   return fs::is_regular_file(fs::symlink_status(in(directory, ManifestSnapshot::manifestName), ignored));
 }
 
-std::vector<std::string> directoriesIn(const std::string& path) {
-  std::vector<std::string> names;
-  for (const Entry& entry : listUntouched(path)) {
-    if (entry.type == Entry::Type::Directory) names.push_back(entry.name);
-  }
-  return names;
-}
-
 std::string resolved(const std::string& path) {
   std::error_code error;
   const fs::path root = fs::canonical(path, error);
@@ -76,16 +69,31 @@ class Finder {
     } else {
       findAreas(root);
     }
+    for (const auto& [path, reason] : unreadable_) layout_.unreadable.push_back({path, reason});
     return layout_;
   }
 
  private:
-  static bool holdsManifests(const std::string& path) {
+  // The root itself must be readable.
+  std::vector<std::string> directoriesIn(const std::string& path) {
+    std::vector<std::string> names;
+    try {
+      for (const Entry& entry : listUntouched(path)) {
+        if (entry.type == Entry::Type::Directory) names.push_back(entry.name);
+      }
+    } catch (const UnreadableException& error) {
+      if (path == layout_.root) throw;
+      unreadable_[path] = error.unreadable().reason;
+    }
+    return names;
+  }
+
+  bool holdsManifests(const std::string& path) {
     const auto names = directoriesIn(path);
     return std::any_of(names.begin(), names.end(), [&](const auto& name) { return hasManifest(in(path, name)); });
   }
 
-  static bool holdsManagers(const std::string& path) {
+  bool holdsManagers(const std::string& path) {
     const auto names = directoriesIn(path);
     return std::any_of(names.begin(), names.end(), isManagerName);
   }
@@ -149,14 +157,17 @@ class Finder {
       }
     }
     layout_.kind = isRoot ? Layout::Kind::Root : Layout::Kind::Empty;
-    if (!isRoot && !listUntouched(root).empty()) {
-      throw InputError("ROOT '" + root + "' is not a storage root or a part of one: there is no manager's directory (" +
-                       kSessionless + ", " + kSessionPrefix + "...) in it or one level below, and no " +
-                       ManifestSnapshot::manifestName);
+    if (isRoot || listUntouched(root).empty()) return;
+    if (!unreadable_.empty()) {
+      throw InputError("cannot read '" + unreadable_.begin()->first + "': " + unreadable_.begin()->second);
     }
+    throw InputError("ROOT '" + root + "' is not a storage root or a part of one: there is no manager's directory (" +
+                     kSessionless + ", " + kSessionPrefix + "...) in it or one level below, and no " +
+                     ManifestSnapshot::manifestName);
   }
 
   Layout layout_;
+  std::map<std::string, std::string> unreadable_;  // the reason by path: a directory may be listed more than once
 };
 
 }  // namespace

@@ -3,6 +3,8 @@
 #include <string>
 #include <vector>
 
+#include "storage/UntouchedFiles.h"
+
 namespace velmora::mobile::xplat::cellar::tools {
 
 // The directory into which `cellar verify --repair` moves what it removes from stores. It is beside the managers'
@@ -44,10 +46,12 @@ struct Layout {
   std::string root;  // absolute, without links
   std::vector<ManagerPlace> managers;
   std::vector<OtherPlace> others;
+  std::vector<Unreadable> unreadable;  // directories in which there may be more
 };
 
 // Finds out whether the directory is a storage root, an area, a manager or a store, and what is in it. Changes nothing.
-// Throws `InputError` for a path that cannot be read or is none of these.
+// Throws `InputError` for a path that cannot be read or is none of these. Passes by directories below that cannot be
+// read.
 Layout findLayout(const std::string& path);
 
 // The part of `path` below `root`; "." for the root itself.

@@ -49,7 +49,7 @@ std::string strangenessOf(const std::string& path);
 // date where the system allows that. Throws `UnreadableException`. Not an error: an entry that is removed meanwhile.
 std::vector<Entry> listUntouched(const std::string& directory);
 
-// The files of a tree, listed likewise.
+// The files of a tree, listed likewise, but for those in directories that cannot be read.
 std::uint64_t countFiles(const std::string& directory);
 
 // Bytes that the directory itself has allocated on the disk.

@@ -38,13 +38,16 @@ std::optional<std::uint64_t> sizeOfValue(const std::string& directory, const std
   return error ? std::nullopt : std::make_optional<std::uint64_t>(size);
 }
 
-// A damaged manifest cannot always tell that it is a safe store's, but what lies beside it can.
-bool looksSafe(const std::string& directory) {
+// A damaged manifest cannot always tell that it is a safe store's, but what lies beside it can. So may what cannot be
+// listed.
+bool looksSafe(const std::string& directory) try {
   const auto entries = listUntouched(directory);
   return std::any_of(entries.begin(), entries.end(), [](const Entry& entry) {
     return entry.type == Entry::Type::Directory ? entry.name == kStoreQuarantine
                                                 : parseSafeFileName(entry.name).has_value();
   });
+} catch (const UnreadableException&) {
+  return true;
 }
 
 // Reads nothing of a damaged manifest.

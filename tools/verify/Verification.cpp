@@ -3,7 +3,6 @@
 #include <exception>
 #include <filesystem>
 
-#include "InputError.h"
 #include "LarderException.h"
 #include "storage/Layout.h"
 #include "storage/Printable.h"
@@ -32,19 +31,21 @@ class Verifier {
       : layout_(layout), repair_(repair), onFile_(onFile), onLine_(onLine) {}
 
   VerificationResult run() {
+    for (const Unreadable& part : layout_.unreadable) settle({findingOf(part)}, Quarantine(layout_.root));
     for (const ManagerPlace& manager : layout_.managers) {
+      const Quarantine quarantine = quarantineFor(layout_, manager);
       for (const StorePlace& store : manager.stores) {
         ++result_.stores;
-        settle(checkStore(store, temporary_.path(), onFile_), manager);
-        settle(checkAttributes(store.path), manager);
+        settle(checkStore(store, temporary_.path(), onFile_), quarantine);
+        settle(checkAttributes(store.path), quarantine);
       }
     }
     return result_;
   }
 
  private:
-  void settle(const Findings& findings, const ManagerPlace& manager) {
-    Repair repair(layout_.root, quarantineFor(layout_, manager));
+  void settle(const Findings& findings, const Quarantine& quarantine) {
+    Repair repair(layout_.root, quarantine);
     for (const Finding& finding : findings) {
       ++result_.findings;
       std::string line = printable(relativeTo(layout_.root, finding.directory)) + ": " + describe(finding);
@@ -74,11 +75,7 @@ class Verifier {
 }  // namespace
 
 VerificationResult verify(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine) {
-  try {
-    return Verifier(layout, repair, onFile, onLine).run();
-  } catch (const LarderException& error) {
-    throw InputError(error.description());
-  }
+  return Verifier(layout, repair, onFile, onLine).run();
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -18,8 +18,7 @@ struct VerificationResult {
 
 using OnLine = std::function<void(const std::string& line)>;  // one finding, with what was done about it
 
-// Checks every store in the layout, and repairs what it finds if `repair` is set. Throws `InputError` for what cannot
-// be read.
+// Checks every store in the layout, and repairs what it finds if `repair` is set. What cannot be read is a finding.
 VerificationResult verify(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine);
 
 }  // namespace velmora::mobile::xplat::cellar::tools
