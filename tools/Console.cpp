@@ -5,6 +5,8 @@
 #include <cstdlib>
 #include <iostream>
 
+#include "Printable.h"
+
 namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
@@ -35,7 +37,9 @@ bool Console::isTerminal() const { return isTerminal_; }
 
 void Console::heading(const std::string& text) { out_ << "\n" << coloured(kBold, text) << std::endl; }
 
-void Console::line(const std::string& text) { out_ << "  " << text << std::endl; }
+void Console::line(const std::string& text, const std::string& dimmed) {
+  out_ << "  " << printable(text) << (dimmed.empty() ? "" : coloured(kDim, dimmed)) << std::endl;
+}
 
 void Console::good(const std::string& text) { out_ << "  " << coloured(kGreen, text) << std::endl; }
 
@@ -47,13 +51,11 @@ void Console::verdict(const std::string& text, bool isGood) {
   out_ << "\n" << coloured(isGood ? kBoldGreen : kRed, text) << std::endl;
 }
 
-std::string Console::dim(const std::string& text) const { return coloured(kDim, text); }
-
-void Console::rewriteLine(const std::string& text) { out_ << "\r\x1b[2K" << text << std::flush; }
+void Console::rewriteLine(const std::string& text) { out_ << "\r\x1b[2K" << printable(text) << std::flush; }
 
 std::string Console::coloured(const char* code, const std::string& text) const {
-  if (!hasColours_) return text;
-  return "\x1b[" + std::string(code) + "m" + text + "\x1b[0m";
+  if (!hasColours_) return printable(text);
+  return "\x1b[" + std::string(code) + "m" + printable(text) + "\x1b[0m";
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

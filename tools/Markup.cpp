@@ -1,10 +1,12 @@
 #include "Markup.h"
 
+#include "Printable.h"
+
 namespace velmora::mobile::xplat::cellar::tools {
 
 std::string escapedMarkup(const std::string& text) {
   std::string result;
-  for (const char character : text) {
+  for (const char character : printable(text)) {
     switch (character) {
       case '&':
         result += "&amp;";
@@ -15,8 +17,11 @@ std::string escapedMarkup(const std::string& text) {
       case '>':
         result += "&gt;";
         break;
+      case '"':
+        result += "&quot;";
+        break;
       default:
-        result += static_cast<unsigned char>(character) < 0x20 ? ' ' : character;
+        result += character;
     }
   }
   return result;

@@ -4,7 +4,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// The text escaped for an SVG image or a page; control characters become spaces.
+// The text, made `printable`, escaped for an SVG image.
 std::string escapedMarkup(const std::string& text);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

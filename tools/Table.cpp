@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <utility>
 
+#include "Printable.h"
+
 namespace velmora::mobile::xplat::cellar::tools {
 
 Table::Table(std::vector<Column> columns) : columns_(std::move(columns)) {
@@ -11,7 +13,10 @@ Table::Table(std::vector<Column> columns) : columns_(std::move(columns)) {
 
 void Table::addRow(std::vector<std::string> cells) {
   cells.resize(columns_.size());
-  for (std::size_t i = 0; i < cells.size(); ++i) widths_[i] = std::max(widths_[i], cells[i].size());
+  for (std::size_t i = 0; i < cells.size(); ++i) {
+    cells[i] = printable(cells[i]);
+    widths_[i] = std::max(widths_[i], cells[i].size());
+  }
   rows_.push_back(std::move(cells));
 }
 

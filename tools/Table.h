@@ -18,7 +18,7 @@ class Table {
 
   explicit Table(std::vector<Column> columns);
 
-  // One cell for each column.
+  // One cell for each column, which is made `printable`.
   void addRow(std::vector<std::string> cells);
 
   // The lines, each indented and with a line end. An empty column still shows its title.

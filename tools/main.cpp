@@ -8,6 +8,7 @@
 
 #include "Console.h"
 #include "InputError.h"
+#include "Printable.h"
 #include "check/Check.h"
 #include "demo/Demo.h"
 #include "inspect/Inspect.h"
@@ -62,7 +63,7 @@ CLI::App* addDemo(CLI::App& app, tools::DemoOptions& options) {
 }
 
 int report(const std::string& problem) {
-  std::cerr << "cellar: " << problem << std::endl;
+  std::cerr << "cellar: " << tools::printable(problem) << std::endl;
   return kUsage;
 }
 
@@ -103,7 +104,7 @@ int main(int argc, char** argv) {
   } catch (const tools::InputError& error) {
     return report(error.what());
   } catch (const std::exception& error) {
-    std::cerr << "cellar: " << error.what() << std::endl;
+    std::cerr << "cellar: " << tools::printable(std::string(error.what())) << std::endl;
     return kFailed;
   }
 }

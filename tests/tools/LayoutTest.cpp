@@ -10,7 +10,6 @@
 
 #include "InputError.h"
 #include "storage/ConfiguredStores.h"
-#include "storage/Printable.h"
 #include "tools/StoredData.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -195,10 +194,6 @@ TEST_F(ConfiguredStoresTest, ThatCannotBeReadAreAnInputErrorThatNamesTheFile) {
       EXPECT_THAT(error.what(), HasSubstr(file));
     }
   }
-}
-
-TEST(Printable, HasNoControlCharacters) {
-  EXPECT_EQ(printable("caf\xc3\xa9 \x1b[2J\n\x7f"), "caf\xc3\xa9 \\x1b[2J\\x0a\\x7f");
 }
 
 }  // namespace

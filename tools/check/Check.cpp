@@ -7,12 +7,12 @@
 
 #include "Console.h"
 #include "InputError.h"
+#include "Printable.h"
 #include "check/CheckReport.h"
 #include "check/ConfigurationDocument.h"
 #include "check/Faults.h"
 #include "check/ResolvedConfiguration.h"
 #include "check/Warnings.h"
-#include "storage/Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -59,7 +59,7 @@ CheckResult check(const CheckOptions& options) {
 void printFaults(const CheckResult& result) {
   for (const Diagnostic& fault : result.faults) {
     const std::string place = fault.pointer.empty() ? "" : fault.pointer + ": ";
-    std::cerr << "cellar: " << result.file << ": " << printable(place + fault.text) << std::endl;
+    std::cerr << "cellar: " << printable(result.file + ": " + place + fault.text) << std::endl;
   }
 }
 
@@ -67,7 +67,7 @@ int runCheck(const CheckOptions& options) {
   const CheckResult result = check(options);
   printFaults(result);
   if (options.json) {
-    std::cout << checkAsJson(result).dump(2, ' ', false, OrderedJson::error_handler_t::replace) << std::endl;
+    std::cout << printable(checkAsJson(result), 2) << std::endl;
   } else if (result.faults.empty()) {
     Console console = Console::standardOutput();
     printCheck(result, console);

@@ -6,8 +6,8 @@
 #include "Configuration.h"
 #include "Console.h"
 #include "Format.h"
+#include "Printable.h"
 #include "storage/ConfiguredStores.h"
-#include "storage/Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 

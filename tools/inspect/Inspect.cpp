@@ -9,6 +9,7 @@
 
 #include "Console.h"
 #include "InputError.h"
+#include "Printable.h"
 #include "Progress.h"
 #include "TextFile.h"
 #include "inspect/Survey.h"
@@ -55,16 +56,12 @@ Survey survey(const InspectOptions& options, Console& console) {
                     [&](std::uint64_t /*bytes*/) { progress.advanceTo(++seen, files); });
 }
 
-std::string textOf(const nlohmann::ordered_json& json) {
-  return json.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
-}
-
 int runInspect(const InspectOptions& options) {
   const bool hasPage = !options.page.empty();
   if (hasPage) requireOutside(options.root, options.page);
   Console console = Console::standardOutput();
   const Survey result = survey(options, console);
-  const std::string json = textOf(surveyAsJson(result));
+  const std::string json = printable(surveyAsJson(result), 2);
   if (hasPage) writeTextFile(options.page, pageOf(kInspectPage, json));
   if (options.json) {
     console.raw(json + "\n");

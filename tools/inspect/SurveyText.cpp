@@ -8,9 +8,9 @@
 
 #include "Console.h"
 #include "Format.h"
+#include "Printable.h"
 #include "Table.h"
 #include "inspect/Totals.h"
-#include "storage/Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -85,7 +85,7 @@ class Printer {
 
   void print() {
     if (survey_.depth == "empty") {
-      console_.raw("Nothing is stored in " + survey_.root + ": the directory is empty\n");
+      console_.raw("Nothing is stored in " + printable(survey_.root) + ": the directory is empty\n");
       return;
     }
     console_.raw("Storage in " + printable(survey_.root) + "\n");
@@ -161,8 +161,7 @@ class Printer {
     console_.line(title + ":");
     for (const ItemFigures& item : items) {
       const std::string used = formatAge(survey_.inspectedAt - item.lastAccess);
-      console_.line("  " + formatSize(item.bytes) + "  " + printable(item.key) + "  " +
-                    console_.dim(used + (item.isInline ? ", inline" : "")));
+      console_.line("  " + formatSize(item.bytes) + "  " + item.key + "  ", used + (item.isInline ? ", inline" : ""));
     }
   }
 

@@ -24,10 +24,15 @@ const counted = (count, singular, plural) => formatCount(count) + " " + (count =
 
 // ---- pieces -----------------------------------------------------------------------------------------------------------
 
+// Characters that would change the order of the text around them, or cannot be seen, are shown by their numbers.
+const hidden = /[\u0000-\u001f\u007f-\u009f\u00ad\u061c\u180e\u200b\u200e\u200f\u2028-\u202e\u2060-\u206f\ufeff\ufff9-\ufffb]|[\udb40-\udb43][\udc00-\udfff]/g;
+const hexadecimal = (character) => "\\u" + character.codePointAt(0).toString(16).padStart(4, "0");
+const printable = (text) => String(text).replace(hidden, hexadecimal);
+
 function make(name, properties = {}, ...children) {
   const element = document.createElement(name);
   for (const [key, value] of Object.entries(properties)) {
-    key === "figure" ? (element.dataset.figure = value) : (element[key] = value);
+    key === "figure" ? (element.dataset.figure = value) : (element[key] = key === "textContent" ? printable(value) : value);
   }
   element.append(...children);
   return element;

@@ -100,10 +100,10 @@ function managerCard(manager, at) {
 
 function fillHeader() {
   const name = survey.root.split("/").pop() || survey.root;
-  document.title = "Storage in " + name;
-  document.getElementById("title").textContent = "Storage in " + name;
+  document.title = printable("Storage in " + name);
+  document.getElementById("title").textContent = printable("Storage in " + name);
   const date = new Date(survey.inspected_at * 1000).toISOString().slice(0, 16).replace("T", " ");
-  document.getElementById("subtitle").textContent = survey.root + " · " + date + " UTC";
+  document.getElementById("subtitle").textContent = printable(survey.root) + " · " + date + " UTC";
 }
 
 function fillTiles() {
@@ -156,7 +156,7 @@ const shownStores = 14;
 // The largest stores, and the rest as one.
 function bytesByStore() {
   const stores = survey.managers.flatMap((manager) => manager.stores.map((store) => (
-    { label: store.directory, bytes: store.allocated_bytes, leftover: store.leftover !== null })));
+    { label: printable(store.directory), bytes: store.allocated_bytes, leftover: store.leftover !== null })));
   stores.sort((a, b) => b.bytes - a.bytes);
   const rest = stores.slice(shownStores);
   const shown = stores.slice(0, shownStores);

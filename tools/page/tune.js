@@ -2,10 +2,10 @@
 
 // ---- the page ---------------------------------------------------------------------------------------------------------
 
-const fill = (id, text) => (document.getElementById(id).textContent = text);
+const fill = (id, text) => (document.getElementById(id).textContent = printable(text));
 
 function fillTexts() {
-  document.title = shown.texts.title;
+  document.title = printable(shown.texts.title);
   for (const id of ["title", "advice", "cost"]) fill(id, shown.texts[id]);
   for (const note of shown.texts.notes) document.getElementById("notes").append(make("p", { className: "quiet", textContent: note }));
 }

@@ -10,6 +10,7 @@
 #include "Console.h"
 #include "Format.h"
 #include "InputError.h"
+#include "Printable.h"
 #include "Progress.h"
 #include "PruneStrategy.h"
 #include "TextFile.h"
@@ -138,8 +139,7 @@ void runTune(const TuneOptions& options) {
   if (!options.svg.empty()) writeTextFile(options.svg, tuningAsSvg(report));
   if (!options.html.empty()) writeTextFile(options.html, tuningAsPage(report));
   if (options.json) {
-    std::cout << tuningAsJson(report).dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace)
-              << std::endl;
+    std::cout << printable(tuningAsJson(report), 2) << std::endl;
   } else {
     printTuning(report, console);
   }

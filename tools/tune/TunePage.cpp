@@ -2,6 +2,7 @@
 
 #include <nlohmann/json.hpp>
 
+#include "Printable.h"
 #include "page/Page.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -33,7 +34,7 @@ std::string tuningAsPage(const TuneReport& report) {
   Json document = tuningAsJson(report);
   document["texts"] = asJson(textsOf(report));
   document["curve"] = curveOf(report.tuning);
-  return pageOf(kTunePage, document.dump(-1, ' ', false, Json::error_handler_t::replace));
+  return pageOf(kTunePage, printable(document, -1));
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -7,6 +7,7 @@
 
 #include "Console.h"
 #include "Format.h"
+#include "Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -139,7 +140,7 @@ void printTuning(const TuneReport& report, Console& console) {
   for (const auto& row : texts.rows) table.addRow(row);
   console.raw("\n" + table.text());
   console.verdict(texts.advice, true);
-  if (!texts.cost.empty()) console.raw(texts.cost + "\n");
+  if (!texts.cost.empty()) console.raw(printable(texts.cost) + "\n");
 }
 
 Json tuningAsJson(const TuneReport& report) {

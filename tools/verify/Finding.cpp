@@ -1,7 +1,7 @@
 #include "verify/Finding.h"
 
 #include "Format.h"
-#include "storage/Printable.h"
+#include "Printable.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 

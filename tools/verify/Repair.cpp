@@ -7,9 +7,9 @@
 #include "EncodedFileName.h"
 #include "Format.h"
 #include "ManifestSnapshot.h"
+#include "Printable.h"
 #include "SQLiteManifestPersistence.h"
 #include "storage/Layout.h"
-#include "storage/Printable.h"
 #include "storage/SafeFiles.h"
 #include "storage/StoreFiles.h"
 

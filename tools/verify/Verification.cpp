@@ -4,8 +4,8 @@
 #include <filesystem>
 
 #include "LarderException.h"
+#include "Printable.h"
 #include "storage/Layout.h"
-#include "storage/Printable.h"
 #include "storage/TemporaryFolder.h"
 #include "verify/Quarantine.h"
 #include "verify/Repair.h"

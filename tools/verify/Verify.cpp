@@ -7,6 +7,7 @@
 
 #include "Console.h"
 #include "Format.h"
+#include "Printable.h"
 #include "Progress.h"
 #include "storage/Layout.h"
 #include "storage/UntouchedFiles.h"
@@ -42,7 +43,7 @@ int runVerify(const VerifyOptions& options) {
       layout, options.repair, [&](std::uint64_t /*bytes*/) { progress->advanceTo(++seen, files); },
       [&console](const std::string& line) {
         if (console.isTerminal()) console.rewriteLine("");
-        console.raw(line + "\n");
+        console.raw(printable(line) + "\n");
       });
   progress.reset();
   console.raw(verdictOf(result, options.repair) + "\n");
