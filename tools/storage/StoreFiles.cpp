@@ -41,6 +41,12 @@ std::string salvagedManifestName() { return ManifestSnapshot::manifestName + "-s
 
 bool isInStoreQuarantine(const std::string& below) { return below.rfind(std::string(kStoreQuarantine) + "/", 0) == 0; }
 
+std::vector<std::string> manifestFiles() {
+  std::vector<std::string> names;
+  for (const char* const suffix : kSuffixes) names.push_back(ManifestSnapshot::manifestName + suffix);
+  return names;
+}
+
 bool isManifestFile(const std::string& name) {
   return std::any_of(kSuffixes.begin(), kSuffixes.end(),
                      [&](const char* suffix) { return name == ManifestSnapshot::manifestName + suffix; });

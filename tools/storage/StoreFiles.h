@@ -2,6 +2,7 @@
 
 #include <functional>
 #include <string>
+#include <vector>
 
 #include "storage/UntouchedFiles.h"
 
@@ -9,6 +10,9 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 // Whether a file of that name (below the store's directory) is the manifest or one of SQLite's files beside it.
 bool isManifestFile(const std::string& name);
+
+// Their names.
+std::vector<std::string> manifestFiles();
 
 // The manifest that a safe store makes in the place of a damaged one: while it is being made, and while it is complete
 // but not in its place.

@@ -3,8 +3,8 @@
 #include <filesystem>
 #include <utility>
 
-#include "FileUtils.h"
 #include "storage/Layout.h"
+#include "verify/Beneath.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -12,34 +12,35 @@ namespace fs = std::filesystem;
 
 namespace {
 
-// The path itself, or the next one of its kind that is free: "sunrise.jpg.1".
-fs::path freePath(const fs::path& wanted) {
-  fs::path path = wanted;
-  int number = 0;
-  while (fs::exists(fs::symlink_status(path))) path = wanted.string() + "." + std::to_string(++number);
-  return path;
-}
+// Where something below the base has its place in the quarantine.
+struct Place {
+  Place(const std::string& base, const std::string& path)
+      : below(fs::path(path).lexically_relative(base)), quarantine(fs::path(kQuarantineName) / below.parent_path()) {}
+
+  // Of its name there.
+  std::string pathOf(const std::string& base, const std::string& name) const {
+    return (base / quarantine / name).string();
+  }
+
+  fs::path below;
+  fs::path quarantine;  // the directory
+};
 
 }  // namespace
 
 Quarantine::Quarantine(std::string base) : base_(std::move(base)) {}
 
 std::string Quarantine::take(const std::string& path) const {
-  std::string target = placeFor(path);
-  fs::rename(path, target);
-  return target;
+  const Place place(base_, path);
+  const Beneath source(base_, place.below.parent_path());
+  const Beneath target(base_, place.quarantine, Beneath::IfMissing::Create);
+  return place.pathOf(base_, source.moveTo(target, place.below.filename().string()));
 }
 
 std::string Quarantine::keep(const std::string& path, const std::vector<unsigned char>& bytes) const {
-  std::string target = placeFor(path);
-  FileUtils().createFile(target, bytes);
-  return target;
-}
-
-std::string Quarantine::placeFor(const std::string& path) const {
-  const fs::path wanted = fs::path(base_) / kQuarantineName / fs::path(path).lexically_relative(base_);
-  fs::create_directories(wanted.parent_path());
-  return freePath(wanted).string();
+  const Place place(base_, path);
+  const Beneath target(base_, place.quarantine, Beneath::IfMissing::Create);
+  return place.pathOf(base_, target.create(place.below.filename().string(), bytes));
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -12,17 +12,14 @@ class Quarantine {
   // `base`: the directory of the managers' directories, or that of a store that is verified alone.
   explicit Quarantine(std::string base);
 
-  // Moves a file or directory below the base; returns its new path. Throws
-  // `std::filesystem::filesystem_error`.
+  // Moves a file, a link or a directory below the base; returns its new path. Throws `std::runtime_error`, also when a
+  // link is on the way to it or to the quarantine.
   std::string take(const std::string& path) const;
 
-  // Writes bytes into a file there, as if it had been moved from `path`; returns its path. Throws the same, and
-  // `FileUtilsIoException`.
+  // Writes bytes into a file there, as if it had been moved from `path`; returns its path. Throws the same.
   std::string keep(const std::string& path, const std::vector<unsigned char>& bytes) const;
 
  private:
-  std::string placeFor(const std::string& path) const;
-
   const std::string base_;
 };
 

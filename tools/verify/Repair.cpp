@@ -1,5 +1,7 @@
 #include "verify/Repair.h"
 
+#include <sys/types.h>
+
 #include <filesystem>
 #include <stdexcept>
 #include <utility>
@@ -12,6 +14,7 @@
 #include "storage/Layout.h"
 #include "storage/SafeFiles.h"
 #include "storage/StoreFiles.h"
+#include "verify/Beneath.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -20,6 +23,7 @@ Repair::Repair(std::string root, Quarantine quarantine) : root_(std::move(root))
 Repair::~Repair() = default;
 
 std::string Repair::fix(const Finding& finding) {
+  if (finding.kind != Finding::Kind::Unreadable) requireUnused(finding.directory);
   switch (finding.kind) {
     case Finding::Kind::RecordWithoutFile:
       return finding.file.empty() ? removeRecord(finding) : nameFile(finding);
@@ -52,8 +56,18 @@ std::string Repair::fix(const Finding& finding) {
   return quarantineFile(finding);
 }
 
+// The program's own connection would be taken for that of an application, which is why it is looked for before.
+void Repair::requireUnused(const std::string& directory) const {
+  if (manifest_ != nullptr) return;
+  const Beneath store(root_, relativeTo(root_, directory));
+  const pid_t user = store.userOfDatabase(ManifestSnapshot::manifestName);
+  if (user != 0) throw std::runtime_error("process " + std::to_string(user) + " has the store open");
+}
+
 SQLiteManifestPersistence& Repair::manifestOf(const Finding& finding) {
   if (manifest_ == nullptr) {
+    const Beneath store(root_, relativeTo(root_, finding.directory));
+    for (const std::string& name : manifestFiles()) store.requireOwn(name);
     const std::string path = finding.directory + "/" + ManifestSnapshot::manifestName;
     const Durability durability = finding.isSafe ? Durability::Safe : Durability::Relaxed;
     manifest_ = std::make_unique<SQLiteManifestPersistence>(path, nullptr, nullptr, durability);
@@ -91,7 +105,8 @@ std::string Repair::quarantineFile(const Finding& finding) {
 
 // Of a write that was never acknowledged, or of a value that another one has replaced.
 std::string Repair::removeFile(const Finding& finding) const {
-  std::filesystem::remove(std::filesystem::path(finding.directory) / finding.name);
+  const std::filesystem::path path = std::filesystem::path(finding.directory) / finding.name;
+  Beneath(root_, relativeTo(root_, path.parent_path().string())).remove(path.filename().string());
   return "file removed";
 }
 

@@ -13,7 +13,8 @@ class SQLiteManifestPersistence;
 namespace velmora::mobile::xplat::cellar::tools {
 
 // Mends the findings of one store, or of the attributes of one tree, without losing a value. The store must not be in
-// use.
+// use: nothing is mended while another process has its manifest open. Nothing is created, renamed, removed or written
+// through a link.
 class Repair {
  public:
   // `root` is what paths are named below.
@@ -26,6 +27,7 @@ class Repair {
   std::string fix(const Finding& finding);
 
  private:
+  void requireUnused(const std::string& directory) const;
   SQLiteManifestPersistence& manifestOf(const Finding& finding);
   std::string removeRecord(const Finding& finding);
   std::string nameFile(const Finding& finding);

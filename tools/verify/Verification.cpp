@@ -2,11 +2,13 @@
 
 #include <exception>
 #include <filesystem>
+#include <memory>
 
 #include "LarderException.h"
 #include "Printable.h"
 #include "storage/Layout.h"
 #include "storage/TemporaryFolder.h"
+#include "verify/HostLocks.h"
 #include "verify/Quarantine.h"
 #include "verify/Repair.h"
 
@@ -75,7 +77,11 @@ class Verifier {
 }  // namespace
 
 VerificationResult verify(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine) {
-  return Verifier(layout, repair, onFile, onLine).run();
+  std::unique_ptr<const HostLocks> locks;
+  if (repair) locks = std::make_unique<const HostLocks>(layout.root);
+  VerificationResult result = Verifier(layout, repair, onFile, onLine).run();
+  result.isLocked = locks != nullptr && locks->areThere();
+  return result;
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -9,6 +9,7 @@
 #include "Format.h"
 #include "Printable.h"
 #include "Progress.h"
+#include "host/RootLock.h"
 #include "storage/Layout.h"
 #include "storage/UntouchedFiles.h"
 #include "verify/Verification.h"
@@ -47,6 +48,10 @@ int runVerify(const VerifyOptions& options) {
       });
   progress.reset();
   console.raw(verdictOf(result, options.repair) + "\n");
+  if (result.repaired > 0 && !result.isLocked) {
+    console.raw("Repaired without a lock: there is no " + host::RootLock::fileName +
+                ", so an application may have been running\n");
+  }
   const std::uint64_t remaining = options.repair ? result.findings - result.repaired : result.findings;
   return remaining == 0 ? kSound : kFound;
 }
@@ -69,7 +74,10 @@ void addVerifyCommand(CLI::App& app, int& status) {
       "unfinished ones are deleted; a damaged manifest is left to the store, which salvages it, and its directory\n"
       "\"quarantine\" to you. Of other stores only records are deleted.\n"
       "Stop the application first: a running store must not be repaired, and a write in progress looks like a\n"
-      "finding.\n\n"
+      "finding. --repair holds the lock of the host (_cellar_lock), and refuses while somebody else holds it. Of a\n"
+      "host without a lock it refuses each store whose manifest another process has open, and says so; an\n"
+      "application that starts meanwhile is not kept away then. No link is followed when something is created,\n"
+      "renamed, removed or written. Without --repair no lock is taken.\n\n"
       "Exit status: 0 when nothing was found or everything is repaired, 1 when something remains, 2 for usage and\n"
       "input errors.\n\n"
       "Example:\n  cellar verify /tmp/cellar-demo --repair");
