@@ -2,6 +2,8 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <ctime>
+#include <limits>
 #include <sstream>
 #include <stdexcept>
 #include <string>
@@ -50,6 +52,35 @@ Lines ofCache(const std::string& members) {
 }
 
 Lines faultsOf(const std::string& text) { return linesOf(findFaults(parseConfigurationDocument(text))); }
+
+// --- Large documents ---
+
+// The time of a processor that a document of so many stores and managers takes, the least of three.
+double effortOf(int count) {
+  std::string stores;
+  std::string managers;
+  for (int i = 0; i < count; ++i) {
+    stores += ", \"s" + std::to_string(i) + R"(": {"type": "pkvs", "odd": 1})";
+    managers += ", \"m" + std::to_string(i) + "\": {}";
+  }
+  const std::string text = R"({"m": {"stores": {"s": {"type": "pkvs"})" + stores + "}}" + managers + "}";
+  const std::string refused =
+      R"({"m": {"max_size": 1, "stores": {"s": {"type": "pkvs"})" + stores + "}}" + managers + "}";
+  double least = std::numeric_limits<double>::infinity();
+  for (int round = 0; round < 3; ++round) {
+    const std::clock_t begin = std::clock();
+    const ConfigurationDocument document = parseConfigurationDocument(text);
+    EXPECT_THAT(findFaults(document), IsEmpty());
+    const auto warnings = findWarnings(document, resolve(document, {}));
+    EXPECT_GE(warnings.size(), static_cast<std::size_t>(count));
+    EXPECT_EQ(faultsOf(refused).size(), 1U);
+    least = std::min(least, static_cast<double>(std::clock() - begin));
+  }
+  return least;
+}
+
+// Eight times as much takes eight times as long, not 64 times.
+TEST(CheckOfALargeDocument, TakesTimeInProportionToItsSize) { EXPECT_LT(effortOf(4000), 24 * effortOf(500)); }
 
 // --- Unknown and ignored keys ---
 

@@ -2,7 +2,8 @@
 
 #include <cstddef>
 #include <exception>
-#include <set>
+#include <iterator>
+#include <unordered_map>
 #include <utility>
 
 #include "InputError.h"
@@ -12,49 +13,101 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-// Collects the names that an object has twice, from the parser's events.
-class RepeatedNames {
+// Builds a document from the parser's events. The library's own reader looks through all members of an object for each
+// one that it adds.
+class DocumentBuilder : public nlohmann::json_sax<OrderedJson> {
  public:
-  void onEvent(OrderedJson::parse_event_t event, const OrderedJson& parsed) {
-    switch (event) {
-      case OrderedJson::parse_event_t::object_start:
-      case OrderedJson::parse_event_t::array_start:
-        open_.emplace_back();
-        if (open_.size() > kTooDeep) throw InputError("is nested too deeply for a configuration");
-        break;
-      case OrderedJson::parse_event_t::object_end:
-      case OrderedJson::parse_event_t::array_end:
-        open_.pop_back();
-        break;
-      case OrderedJson::parse_event_t::key:
-        if (open_.size() <= kDeepest) note(parsed.get_ref<const std::string&>());
-        break;
-      case OrderedJson::parse_event_t::value:
-        break;
+  explicit DocumentBuilder(ConfigurationDocument& document) : document_(document) {}
+
+  bool null() override { return add(nullptr); }
+  bool boolean(bool value) override { return add(value); }
+  bool number_integer(number_integer_t value) override { return add(value); }
+  bool number_unsigned(number_unsigned_t value) override { return add(value); }
+  bool number_float(number_float_t value, const string_t& /*text*/) override { return add(value); }
+  bool string(string_t& value) override { return add(std::move(value)); }
+  bool binary(binary_t& /*value*/) override { return add(nullptr); }
+  bool start_object(std::size_t /*size*/) override { return open(OrderedJson::object()); }
+  bool end_object() override { return close(); }
+  bool start_array(std::size_t /*size*/) override { return open(OrderedJson::array()); }
+  bool end_array() override { return close(); }
+
+  bool key(string_t& name) override {
+    Open& object = open_.back();
+    auto& members = object.value->get_ref<OrderedJson::object_t&>();
+    const auto [place, isNew] = object.places.emplace(name, members.size());
+    object.next = place->second;
+    object.latest = name;
+    if (isNew) {
+      members.emplace_back(std::move(name), nullptr);
+    } else if (open_.size() <= kDeepest) {
+      noteRepeated();
     }
+    return true;
   }
 
-  std::vector<std::string> take() { return std::move(pointers_); }
+  bool parse_error(std::size_t /*position*/, const std::string& /*token*/,
+                   const nlohmann::detail::exception& error) override {
+    // The parser reports nothing but these.
+    rethrowAs<OrderedJson::parse_error>(error);
+    rethrowAs<OrderedJson::out_of_range>(error);
+    return false;
+  }
 
  private:
   static constexpr std::size_t kDeepest = 4;    // document, manager, "stores", store
   static constexpr std::size_t kTooDeep = 200;  // values are copied and printed recursively
 
-  struct Names {
-    std::set<std::string> names;
+  struct Open {
+    OrderedJson* value;
+    std::unordered_map<std::string, std::size_t> places;  // of its members
+    std::size_t next = 0;                                 // where the next value belongs
     std::string latest;
   };
 
-  void note(const std::string& name) {
-    open_.back().latest = name;
-    if (open_.back().names.insert(name).second) return;
-    std::string pointer;
-    for (const Names& names : open_) pointer = memberPointer(pointer, names.latest);
-    pointers_.push_back(std::move(pointer));
+  template <class Error> static void rethrowAs(const nlohmann::detail::exception& error) {
+    if (const auto* known = dynamic_cast<const Error*>(&error)) throw Error(*known);
   }
 
-  std::vector<Names> open_;
-  std::vector<std::string> pointers_;
+  bool add(OrderedJson value) {
+    place(std::move(value));
+    return true;
+  }
+
+  bool open(OrderedJson value) {
+    open_.push_back({place(std::move(value)), {}, 0, {}});
+    if (open_.size() > kTooDeep) throw InputError("is nested too deeply for a configuration");
+    return true;
+  }
+
+  bool close() {
+    open_.pop_back();
+    return true;
+  }
+
+  // Only what is open last grows, so that the pointers to what is open stay good.
+  OrderedJson* place(OrderedJson value) {
+    OrderedJson* target = &document_.root;
+    if (!open_.empty()) {
+      OrderedJson& parent = *open_.back().value;
+      if (parent.is_array()) parent.push_back(nullptr);
+      target = parent.is_array() ? &parent.back() : memberAt(parent, open_.back().next);
+    }
+    *target = std::move(value);
+    return target;
+  }
+
+  static OrderedJson* memberAt(OrderedJson& object, std::size_t place) {
+    return &std::next(object.get_ref<OrderedJson::object_t&>().begin(), static_cast<std::ptrdiff_t>(place))->second;
+  }
+
+  void noteRepeated() {
+    std::string pointer;
+    for (const Open& object : open_) pointer = memberPointer(pointer, object.latest);
+    document_.repeated.push_back(std::move(pointer));
+  }
+
+  ConfigurationDocument& document_;
+  std::vector<Open> open_;
 };
 
 }  // namespace
@@ -71,13 +124,8 @@ ConfigurationDocument readConfigurationDocument(const std::string& path) {
 ConfigurationDocument parseConfigurationDocument(const std::string& text) {
   ConfigurationDocument document;
   document.text = text;
-  RepeatedNames names;
-  document.root =
-      OrderedJson::parse(text, [&](int /*depth*/, OrderedJson::parse_event_t event, const OrderedJson& parsed) {
-        names.onEvent(event, parsed);
-        return true;
-      });
-  document.repeated = names.take();
+  DocumentBuilder builder(document);
+  OrderedJson::sax_parse(text, &builder);
   return document;
 }
 

@@ -4,6 +4,7 @@
 #include <cstddef>
 #include <exception>
 #include <string>
+#include <unordered_set>
 
 #include "Configuration.h"
 #include "check/KnownKeys.h"
@@ -102,16 +103,14 @@ Diagnostics findRepeatedIdentifiers(const ConfigurationDocument& document) {
     if (!namesADefinition(pointer)) continue;
     findings.push_back({kKind, pointer, "is defined twice here"});
   }
-  std::vector<std::string> seen;
+  std::unordered_set<std::string> seen;
   if (!document.root.is_object()) return findings;
   for (const auto& [name, manager] : document.root.items()) {
     const OrderedJson stores = manager.is_object() ? manager.value("stores", OrderedJson()) : OrderedJson();
     if (!stores.is_object()) continue;
     for (const auto& [identifier, store] : stores.items()) {
       const std::string pointer = memberPointer(memberPointer(memberPointer("", name), "stores"), identifier);
-      if (std::find(seen.begin(), seen.end(), identifier) == seen.end()) {
-        seen.push_back(identifier);
-      } else {
+      if (!seen.insert(identifier).second) {
         findings.push_back({kKind, pointer, "another manager has a store of this identifier"});
       }
     }

@@ -140,18 +140,21 @@ void warnOfRepeatedKeys(const ConfigurationDocument& document, Diagnostics& find
 Diagnostics findWarnings(const ConfigurationDocument& document, const ResolvedConfiguration& resolved) {
   Diagnostics findings;
   Namesakes namesakes;
+  // Both have the order of the document; looking a name up would take longer, the more there are.
+  auto written = document.root.begin();
   for (const ResolvedManager& manager : resolved) {
-    const OrderedJson& written = document.root.at(manager.definition->name);
-    warnOfManagerKeys(manager.pointer, written, findings);
+    warnOfManagerKeys(manager.pointer, *written, findings);
     warnOfManagerLimit(manager, findings);
     warnOfPruning(manager, findings);
+    auto writtenStore = manager.stores.empty() ? OrderedJson::const_iterator() : written->at("stores").begin();
     for (const ResolvedStore& store : manager.stores) {
-      warnOfStoreKeys(store.pointer, written.at("stores").at(store.identifier), findings);
+      warnOfStoreKeys(store.pointer, *writtenStore++, findings);
       warnOfLimits(store, findings);
       warnOfDurability(manager, store, findings);
       warnOfFileName(store, findings);
     }
     namesakes.lookAt(manager, findings);
+    ++written;
   }
   warnOfRepeatedKeys(document, findings);
   return findings;
