@@ -3,6 +3,7 @@
 #include <future>
 
 #include "host/Futures.h"
+#include "host/errors/Texts.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
@@ -10,18 +11,9 @@ namespace {
 
 using Fetched = std::unique_ptr<PersistentKeyValueStore::FetchResult>;
 
-std::string textOfCurrentException() {
-  try {
-    throw;
-  } catch (const std::exception& error) {
-    return error.what();
-  } catch (...) {
-    return "not a standard exception";
-  }
-}
-
 // What the operation returns, or throws, as a `BatchError` of its key if it fails.
-template <class T, class Operation> Future<T> attempt(const char* name, const std::string& key, Operation operation) {
+template <class T, class Operation>
+Future<T> attempt(const char* name, const PersistentKeyValueStore& store, const std::string& key, Operation operation) {
   Future<T> future;
   try {
     future = operation();
@@ -30,31 +22,29 @@ template <class T, class Operation> Future<T> attempt(const char* name, const st
     future = promise.getFuture();
     promise.setException(std::current_exception());
   }
-  return then(std::move(future), [name, key](std::future<T>& result) {
+  return then(std::move(future), [name, key, path = store.path](std::future<T>& result) {
     try {
       return result.get();
     } catch (...) {
-      throw BatchError(name, key);
+      throw BatchError(name, key, path);
     }
   });
 }
 
 }  // namespace
 
-BatchError::BatchError(const std::string& operation, std::string key)
-    : std::runtime_error("Could not " + operation + " \"" + key + "\": " + textOfCurrentException()),
-      key_(std::move(key)) {}
+BatchError::BatchError(const std::string& operation, const std::string& key, const std::string& path)
+    : StoreError("Could not " + operation + ": " + culprit(nameOfDirectory(path), key, path) + currentText(),
+                 nameOfDirectory(path), key, path) {}
 
 BatchError::~BatchError() = default;
-
-const std::string& BatchError::key() const noexcept { return key_; }
 
 Future<void> storeAll(PersistentKeyValueStore& store,
                       const std::vector<std::pair<std::string, std::vector<unsigned char>>>& values) {
   std::vector<Future<void>> stored;
   stored.reserve(values.size());
   for (const auto& pair : values) {
-    stored.push_back(attempt<void>("store", pair.first, [&] { return store.store(pair.first, pair.second); }));
+    stored.push_back(attempt<void>("store", store, pair.first, [&] { return store.store(pair.first, pair.second); }));
   }
   return whenAll(std::move(stored));
 }
@@ -63,7 +53,7 @@ Future<std::vector<Fetched>> fetchMany(PersistentKeyValueStore& store, const std
   std::vector<Future<Fetched>> fetched;
   fetched.reserve(keys.size());
   for (const auto& key : keys) {
-    fetched.push_back(attempt<Fetched>("fetch", key, [&] { return store.fetch(key); }));
+    fetched.push_back(attempt<Fetched>("fetch", store, key, [&] { return store.fetch(key); }));
   }
   return whenAll(std::move(fetched));
 }
@@ -72,7 +62,7 @@ Future<void> removeAll(PersistentKeyValueStore& store, const std::vector<std::st
   std::vector<Future<void>> removed;
   removed.reserve(keys.size());
   for (const auto& key : keys) {
-    removed.push_back(attempt<void>("remove", key, [&] { return store.removeItem(key); }));
+    removed.push_back(attempt<void>("remove", store, key, [&] { return store.removeItem(key); }));
   }
   return whenAll(std::move(removed));
 }

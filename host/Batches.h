@@ -1,8 +1,6 @@
 #pragma once
 
-#include <exception>
 #include <memory>
-#include <stdexcept>
 #include <string>
 #include <utility>
 #include <vector>
@@ -10,6 +8,7 @@
 #include <cellar/Export.h>
 #include <cellar/Future.h>
 #include <cellar/PersistentKeyValueStore.h>
+#include <cellar/host/Errors.h>
 
 // Many keys of one store with one future: a `PersistentKeyValueStore`, a `DiskCache`. The operations are called one
 // after the other on the caller's thread, as the store's own would be: each by itself, in the order of the keys, so
@@ -22,17 +21,13 @@
 // Any thread may call. Neither the store nor the arguments have to outlive the call.
 namespace velmora::mobile::xplat::cellar::host {
 
-// The operation on one key of a batch has failed. To be made while that exception is handled.
-class CELLAR_EXPORT BatchError : public std::runtime_error, public std::nested_exception {
+// The operation on one key of a batch has failed.
+class CELLAR_EXPORT BatchError : public StoreError {
  public:
-  // The text has the operation ("store"), the key as it is, and what the exception says.
-  BatchError(const std::string& operation, std::string key);
+  // To be made while the nested exception is handled. The text is that of a `StoreError` behind what could not be done:
+  // "Could not store: Store 'drafts__v1', key 'x', /data/drafts__v1: TEXT".
+  BatchError(const std::string& operation, const std::string& key, const std::string& path);
   ~BatchError() override;
-
-  const std::string& key() const noexcept;
-
- private:
-  std::string key_;
 };
 
 // Stores each value under its key. Of a key that is there twice the last value stays.

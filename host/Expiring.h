@@ -33,11 +33,11 @@ CELLAR_EXPORT bool takeDeadline(std::vector<unsigned char>& bytes);
 // deadline it has expired. One with a time of 0 or less replaces what is there and has expired at once;
 // `std::chrono::seconds::max()` means for ever. A clock that is set back lets a value live longer.
 //
-// `get` of an expired value is a miss, and removes it. It removes no newer value: not one that is put, by then, through
-// any TypedStore with a time to live over the same store object. What is stored meanwhile by other means, with the
-// store's own functions or a TypedStore of another codec, can be removed in its place. The store's own limits apply as
-// well: its stale age, capacity and pruning may remove a value earlier. Nothing else looks for expired values: what is
-// never asked for stays until then.
+// `get` of an expired value is a miss, and removes it; where that fails it is one error line. It removes no newer
+// value: not one that is put, by then, through any TypedStore with a time to live over the same store object. What is
+// stored meanwhile by other means, with the store's own functions or a TypedStore of another codec, can be removed in
+// its place. The store's own limits apply as well: its stale age, capacity and pruning may remove a value earlier.
+// Nothing else looks for expired values: what is never asked for stays until then.
 //
 // A value without a deadline, of another codec for example, fails with `DecodeError`.
 //

@@ -2,6 +2,8 @@
 
 #include <glog/logging.h>
 
+#include "host/errors/Texts.h"
+
 namespace velmora::mobile::xplat::cellar::host {
 
 FutureMisuseError::FutureMisuseError(Code code) : FutureError(code) {}
@@ -30,15 +32,7 @@ namespace detail {
 // Declared by host/Coroutines.h, which not every compiler can read.
 CELLAR_EXPORT void logException(const char* text) noexcept;
 
-void logException(const char* text) noexcept {
-  try {
-    throw;
-  } catch (const std::exception& error) {
-    LOG(ERROR) << text << error.what();
-  } catch (...) {
-    LOG(ERROR) << text << "not a standard exception";
-  }
-}
+void logException(const char* text) noexcept { LOG(ERROR) << text << currentText(); }
 
 }  // namespace detail
 

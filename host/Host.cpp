@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <cstddef>
 #include <exception>
-#include <map>
 #include <mutex>
 #include <stdexcept>
 #include <utility>
@@ -15,15 +14,17 @@
 #include "Configuration.h"
 #include "DiskSizeCalculator.h"
 #include "FileUtils.h"
-#include "JsonValue.h"
 #include "LarderException.h"
 #include "LazyDispatcher.h"
 #include "StoreDirectoryNameBuilder.h"
 #include "StoreManagerFactory.h"
 #include "TrashCollector.h"
+#include "host/Errors.h"
 #include "host/FileNames.h"
 #include "host/RootLock.h"
 #include "host/ThreadQueueFactory.h"
+#include "host/configuration/Reading.h"
+#include "host/errors/Texts.h"
 #include "host/figures/ManagerFigures.h"
 #include "host/figures/MeasuredSizes.h"
 #include "host/sessions/ManagerScopes.h"
@@ -33,21 +34,37 @@ namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
 
-// Sorted, as an object keeps its members. Managers of one area and scope share a directory, and each treats the stores
-// of the other as stale.
-std::vector<std::string> namesOfManagers(const Configuration& configuration, const std::string& json) {
-  std::map<std::pair<Area, bool>, std::string> owners;
+// Sorted, as an object keeps its members.
+std::vector<std::string> namesOfManagers(const std::string& configuration) {
   std::vector<std::string> names;
-  const JsonValue document = JsonValue::parse(json);
-  for (const auto& [name, ignored] : document.items()) {
-    names.push_back(name);
-    const auto definition = configuration.getManager(name);
-    const auto [owner, isFree] = owners.emplace(std::pair(definition->area, definition->sessionScoped), name);
-    if (isFree) continue;
-    throw ConfigurationException("Managers '" + owner->second + "' and '" + name +
-                                 "' would share a directory, give them different areas or session scopes.");
-  }
+  const JsonValue document = JsonValue::parse(configuration);
+  for (const auto& [name, ignored] : document.items()) names.push_back(name);
   return names;
+}
+
+// A manager or store could not be built.
+class BuildError : public StoreError {
+ public:
+  BuildError(const std::string& culprit, const std::string& store, const std::string& path)
+      : StoreError(culprit + ", " + path + ": " + currentText(), store, "", path) {}
+};
+
+// Throws the exception that is being handled so that it names what could not be built. File errors stay what they are,
+// and so does what says that a request was wrong or that something has been ended.
+[[noreturn]] void throwNamed(const std::string& culprit, const std::string& store, const std::string& path) {
+  try {
+    throw;
+  } catch (const FileUtilsIoException& error) {
+    std::throw_with_nested(FileUtilsIoException(error.code(), culprit + ", " + path + ": " + error.description()));
+  } catch (const InvalidatedException&) {
+    throw;
+  } catch (const ConfigurationException&) {
+    throw;
+  } catch (const std::logic_error&) {
+    throw;
+  } catch (...) {
+    throw BuildError(culprit, store, path);
+  }
 }
 
 std::unique_ptr<const RootLock> lockRoot(const HostOptions& options, FileUtils& fileUtils) {
@@ -80,8 +97,8 @@ HostOptions plainOptions(const std::string& configuration, const std::string& ro
 }  // namespace
 
 Host::Host(HostOptions options)
-    : configuration_(std::make_shared<const Configuration>(options.configuration)),
-      managerNames_(namesOfManagers(*configuration_, options.configuration)),
+    : configuration_(readConfiguration(options.configuration)),
+      managerNames_(namesOfManagers(options.configuration)),
       fileUtils_(options.fileUtils ? options.fileUtils : std::make_shared<FileUtils>()),
       rootLock_(lockRoot(options, *fileUtils_)),
       nameBuilders_(std::make_shared<StoreDirectoryNameBuilderFactory>(options.versionTag, options.localeSecondTag,
@@ -166,7 +183,14 @@ std::shared_ptr<Store> Host::storeOf(const std::shared_ptr<ManagerScope>& sessio
 
 std::shared_ptr<Store> Host::storeIn(const StoreManagerDefinition& definition, ManagerScope& scope, ManagerSlot& slot,
                                      const std::string& identifier) {
-  auto store = managerIn(definition, scope, slot)->getStoreImpl(identifier, PruneStrategyIdentifier::Null);
+  const auto manager = managerIn(definition, scope, slot);
+  std::shared_ptr<Store> store;
+  try {
+    store = manager->getStoreImpl(identifier, PruneStrategyIdentifier::Null);
+  } catch (...) {
+    throwNamed("Store '" + identifier + "' of manager '" + definition.name + "'", identifier,
+               sessionData_->pathOf(definition, *definition.stores.at(identifier), scope.tag));
+  }
   if (store == nullptr) throw InvalidatedException("The manager of store '" + identifier + "' has been invalidated.");
   return store;
 }
@@ -176,8 +200,12 @@ std::shared_ptr<StoreManager> Host::managerIn(const StoreManagerDefinition& defi
   std::unique_lock<std::mutex> lock(slot.mutex);
   if (slot.manager != nullptr) return slot.manager;
   const auto figures = std::make_shared<const ManagerFigures>(definition);
-  auto manager = build(definition, scope, *figures);
-  slot.manager = manager;
+  try {
+    slot.manager = build(definition, scope, *figures);
+  } catch (...) {
+    throwNamed("Manager '" + definition.name + "'", "", sessionData_->pathOf(definition, scope.tag));
+  }
+  auto manager = slot.manager;
   scopes_->setFigures(slot, figures);
   lock.unlock();
   // The manager has only registered the directories of its unmanaged stores; the host has to have them measured.

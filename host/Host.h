@@ -142,8 +142,9 @@ enum class TrashSize { Skipped, Measured };
 // root. The destructor may run on one of the host's own queues; it does not wait then.
 class CELLAR_EXPORT Host : public session::Invalidatable {
  public:
-  // Throws what `Configuration` throws; `ConfigurationException` when two managers of one area are both session scoped
-  // or both not (they would share a directory and remove each other's stores); `std::invalid_argument` when the root
+  // Throws what `Configuration` throws, and `ConfigurationException` when two managers of one area are both session
+  // scoped or both not (they would share a directory and remove each other's stores); each of these is a
+  // `ConfigurationError` of host/Errors.h as well, which tells line and column. `std::invalid_argument` when the root
   // is empty; `FileUtilsIoException` when the root cannot be created or locked, at once and with the owner's process id
   // when another host uses it (code `EWOULDBLOCK`). Creates the root and its lock file; all other directories are
   // created with the managers. Without `lockRoot` it does not access the disk.
@@ -155,7 +156,10 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
 
   // The manager of that name, built on first request; never empty. Throws `ConfigurationException` when there is none,
   // `std::logic_error` when another session is open, `InvalidatedException` while its scope is being ended, what the
-  // mapper throws for a session's key, and what building the manager throws. If building fails, nothing is discarded,
+  // mapper throws for a session's key, and what building the manager throws. That names the manager and its directory,
+  // never the session's key: a `FileUtilsIoException` is one still, with the same code and the original nested in it;
+  // what is neither that nor one of the above becomes a `StoreError`, whose store is "". If building fails, nothing is
+  // discarded,
   // and the next request tries again. Stores whose creation failed are created again, too
   // (`StoreManager::retryFailedCreations`).
   std::shared_ptr<StoreManager> manager(const std::string& name,
@@ -166,7 +170,8 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
                                                const std::optional<std::string>& sessionKey = std::nullopt);
 
   // The store of that identifier, of any manager, with the prune strategy of its definition; never empty. Throws as
-  // `manager`, what creating the store throws, `std::logic_error` when it is not a `StoreType`, and
+  // `manager`, what creating the store throws, likewise with the names of the store, its manager and its directory,
+  // `std::logic_error` when it is not a `StoreType`, and
   // `InvalidatedException` when you have invalidated its manager yourself. If a store could not be created, here or in
   // the background, the next request tries again: no caller waits for it forever.
   template <class StoreType>

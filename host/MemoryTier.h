@@ -38,6 +38,9 @@ namespace velmora::mobile::xplat::cellar::host {
 //
 // Destroyed while work is under way: the tier releases its store and its memory, and the futures are fulfilled by the
 // store as if nothing had happened. A producer that runs then reaches its callers, but its value is not stored.
+//
+// Errors of the store name it and the key, as `naming` of host/Errors.h makes them; those of producers are passed on as
+// they are.
 class CELLAR_EXPORT MemoryTier {
  public:
   using Bytes = std::vector<unsigned char>;
@@ -72,8 +75,8 @@ class CELLAR_EXPORT MemoryTier {
   // The value if it is in memory, else null. Never asks the store for values.
   [[nodiscard]] Value find(const std::string& key);
 
-  // The value, from memory or from the store; null for a miss. A hit in memory returns a future that is ready. Fails as
-  // the store's fetch does.
+  // The value, from memory or from the store; null for a miss. A hit in memory returns a future that is ready. Fails
+  // where the store's fetch does.
   [[nodiscard]] Future<Value> fetch(const std::string& key);
 
   // Stores the value in memory and in the store, which copies it. Ready, or failed, when the store's future is. A null

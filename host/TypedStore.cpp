@@ -1,59 +1,45 @@
 #include "host/TypedStore.h"
 
+#include <glog/logging.h>
+
 #include <algorithm>
 #include <array>
 #include <cstddef>
 #include <functional>
 #include <map>
 #include <mutex>
+#include <stdexcept>
+
+#include <cellar/LarderException.h>
 
 #include "host/FileNames.h"
+#include "host/errors/Texts.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
 
-constexpr std::size_t kShownKey = 80;  // bytes
-
-// A key as messages show it: in quotes, shortened, and without what would end the text or move the cursor.
-std::string shown(std::string_view key) {
-  constexpr char kDigits[] = "0123456789abcdef";
-  std::size_t end = std::min(key.size(), kShownKey);
-  while (end > 0 && end < key.size() && (static_cast<unsigned char>(key[end]) & 0xc0) == 0x80) --end;  // within UTF-8
-  std::string text = "'";
-  for (const char character : key.substr(0, end)) {
-    const auto byte = static_cast<unsigned char>(character);
-    if (byte < 0x20 || byte == 0x7f) {
-      text += {'\\', 'x', kDigits[byte / 16], kDigits[byte % 16]};
-    } else {
-      text += character;
-    }
-  }
-  return text + (end < key.size() ? "...'" : "'");
-}
-
-// What the exception that is being handled says.
-std::string currentReason() {
+// Of an expired value; the exception is being handled.
+void logFailedRemoval(const std::string& path, const std::string& storedKey) noexcept {
   try {
-    throw;
+    detail::throwNamed(path, decodeFileName(storedKey));
+  } catch (const InvalidatedException&) {
+    // Its session has ended, and the value with it.
+  } catch (const std::future_error&) {
+    // The host is going. The value stays expired.
   } catch (const std::exception& error) {
-    return error.what();
-  } catch (...) {
-    return "The codec does not say why.";
+    LOG(ERROR) << "An expired value is not removed: " << error.what();
   }
 }
 
 }  // namespace
 
-DecodeError::DecodeError(std::string store, std::string key, const std::string& reason)
-    : std::runtime_error("The value of " + shown(key) + " in store '" + store + "' cannot be decoded: " + reason),
-      store_(std::move(store)),
-      key_(std::move(key)) {}
+DecodeError::DecodeError(const std::string& key, const std::string& path)
+    : StoreError("The value of " + shown(key) + " in store '" + nameOfDirectory(path) +
+                     "' cannot be decoded: " + currentText(),
+                 nameOfDirectory(path), key, path) {}
 
 DecodeError::~DecodeError() = default;
-
-const std::string& DecodeError::store() const noexcept { return store_; }
-const std::string& DecodeError::key() const noexcept { return key_; }
 
 namespace detail {
 
@@ -62,19 +48,12 @@ std::shared_ptr<PersistentKeyValueStore> required(std::shared_ptr<PersistentKeyV
   return store;
 }
 
-std::string nameOf(const PersistentKeyValueStore& store) {
-  const std::size_t end = store.path.find_last_not_of('/') + 1;
-  const std::size_t slash = store.path.substr(0, end).rfind('/');
-  const std::size_t begin = slash == std::string::npos ? 0 : slash + 1;
-  return store.path.substr(begin, end - begin);
-}
-
 std::string storedKey(const PersistentKeyValueStore& store, std::string_view key) {
   try {
     return encodeFileName(std::string(key));
   } catch (const std::length_error&) {
     throw std::length_error("Key " + shown(key) + " of " + std::to_string(key.size()) +
-                            " bytes is too long for store '" + nameOf(store) +
+                            " bytes is too long for store '" + nameOfDirectory(store.path) +
                             "': encoded it would exceed the 255 bytes of a file name.");
   }
 }
@@ -91,9 +70,7 @@ std::vector<std::string> originalKeys(PersistentKeyValueStore& store) {
   return keys;
 }
 
-void throwDecodeError(const std::string& store, const std::string& storedKey) {
-  std::throw_with_nested(DecodeError(store, decodeFileName(storedKey), currentReason()));
-}
+void throwDecodeError(const std::string& path, const std::string& key) { throw DecodeError(key, path); }
 
 Future<void> failed(std::exception_ptr failure) {
   Promise<void> promise;
@@ -136,11 +113,22 @@ ExpiryWatch::~ExpiryWatch() {
   stripe_.watches.erase(std::find_if(begin, end, [this](const auto& watch) { return watch.second == this; }));
 }
 
-void ExpiryWatch::removeUnlessPut() {
+void ExpiryWatch::removeUnlessPut() noexcept {
   const auto store = weakStore_.lock();
   if (store == nullptr) return;
-  const std::lock_guard<std::recursive_mutex> inOrder(stripe_.order);
-  if (!wasPut_) store->removeItem(storedKey_);
+  try {
+    const std::lock_guard<std::recursive_mutex> inOrder(stripe_.order);
+    if (wasPut_) return;
+    store->removeItem(storedKey_).then([path = store->path, key = storedKey_](std::future<void>& removed) {
+      try {
+        removed.get();
+      } catch (...) {
+        logFailedRemoval(path, key);
+      }
+    });
+  } catch (...) {
+    logFailedRemoval(store->path, storedKey_);
+  }
 }
 
 Future<void> ExpiryWatch::put(PersistentKeyValueStore& store, const std::string& storedKey,

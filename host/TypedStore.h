@@ -5,7 +5,6 @@
 #include <future>
 #include <memory>
 #include <optional>
-#include <stdexcept>
 #include <string>
 #include <string_view>
 #include <type_traits>
@@ -17,23 +16,17 @@
 #include <cellar/PersistentKeyValueStore.h>
 #include <cellar/executor/AsyncExecutor.h>
 #include <cellar/host/Codecs.h>
+#include <cellar/host/Errors.h>
 
 namespace velmora::mobile::xplat::cellar::host {
 
-// A value is there, but its codec cannot read it. It stays in the store. What the codec has thrown is nested
-// (`std::rethrow_if_nested`), and its text is a part of this one.
-class CELLAR_EXPORT DecodeError : public std::runtime_error {
+// A value is there, but its codec cannot read it. It stays in the store. What the codec has thrown is nested.
+class CELLAR_EXPORT DecodeError : public StoreError {
  public:
-  // "The value of 'key' in store 'name' cannot be decoded: reason", with a long key shortened.
-  DecodeError(std::string store, std::string key, const std::string& reason);
+  // To be made while the nested exception is handled.
+  // "The value of 'key' in store 'drafts__v1' cannot be decoded: TEXT", with a long key shortened.
+  DecodeError(const std::string& key, const std::string& path);
   ~DecodeError() override;
-
-  const std::string& store() const noexcept;  // the name of the store's directory
-  const std::string& key() const noexcept;    // as `get` was given it
-
- private:
-  std::string store_;
-  std::string key_;
 };
 
 namespace detail {
@@ -57,8 +50,6 @@ template <class T, class Text> using IfView =
 // `store` itself. Throws `std::invalid_argument` for null.
 CELLAR_EXPORT std::shared_ptr<PersistentKeyValueStore> required(std::shared_ptr<PersistentKeyValueStore> store);
 
-CELLAR_EXPORT std::string nameOf(const PersistentKeyValueStore& store);
-
 // The key under which the store has the value. Throws `std::length_error`.
 CELLAR_EXPORT std::string storedKey(const PersistentKeyValueStore& store, std::string_view key);
 
@@ -66,7 +57,7 @@ CELLAR_EXPORT std::string storedKey(const PersistentKeyValueStore& store, std::s
 CELLAR_EXPORT std::vector<std::string> originalKeys(PersistentKeyValueStore& store);
 
 // Throws `DecodeError` with the exception that is being handled nested in it.
-[[noreturn]] CELLAR_EXPORT void throwDecodeError(const std::string& store, const std::string& storedKey);
+[[noreturn]] CELLAR_EXPORT void throwDecodeError(const std::string& path, const std::string& key);
 
 CELLAR_EXPORT Future<void> failed(std::exception_ptr failure);
 
@@ -79,7 +70,8 @@ class CELLAR_EXPORT ExpiryWatch {
   ExpiryWatch(const ExpiryWatch&) = delete;
   ExpiryWatch& operator=(const ExpiryWatch&) = delete;
 
-  void removeUnlessPut();
+  // A removal that fails is one error line; one that an invalidated store refuses or a queue drops is not.
+  void removeUnlessPut() noexcept;
 
   // Stores a value that the watches of its key know of.
   static Future<void> put(PersistentKeyValueStore& store, const std::string& storedKey,
@@ -110,8 +102,8 @@ class CELLAR_EXPORT ExpiryWatch {
 //
 // Keys are any bytes: the store gets `encodeFileName` of them, so that none reaches outside its directory. A key whose
 // encoded form is longer than 255 bytes (of 256 small letters, or of 86 bytes that are all encoded) fails the operation
-// with `std::length_error`; hash such keys. The errors of all operations travel in their futures, those of the codec
-// and of the store.
+// with `std::length_error`; hash such keys. The errors of all operations travel in their futures: those of the codec
+// and of the store as a `StoreError` that names store and key, except where `naming` says otherwise.
 //
 // `put` encodes on the calling thread. `get` decodes on `decodingQueue` if there is one, and its future is fulfilled
 // there, for a miss and an error too. Without, that happens on the store's own queues, where it delays the store's
@@ -127,11 +119,11 @@ template <class T, class Codec = DefaultCodec<T>> class TypedStore {
   explicit TypedStore(std::shared_ptr<PersistentKeyValueStore> store, Codec codec = Codec(),
                       std::shared_ptr<AsyncExecutor> decodingQueue = nullptr)
       : store_(detail::required(std::move(store))),
-        reader_(std::make_shared<const Reader>(Reader{std::move(codec), detail::nameOf(*store_)})),
+        reader_(std::make_shared<const Reader>(Reader{std::move(codec), store_->path})),
         decodingQueue_(std::move(decodingQueue)) {}
 
   // Stores the value under the key, replacing what is there. Fulfilled when it is written, as
-  // `PersistentKeyValueStore::store`. Fails with what the codec throws; the key keeps its value then.
+  // `PersistentKeyValueStore::store`. If the codec throws, the key keeps its value.
   Future<void> put(std::string_view key, const T& value) const {
     static_assert(!kExpires, "Say how long this value lives: put(key, value, timeToLive).");
     return putting(
@@ -156,16 +148,13 @@ template <class T, class Codec = DefaultCodec<T>> class TypedStore {
     return put(key, T(std::string_view(value)), timeToLive);
   }
 
-  // The value; empty for a miss. Fails with `DecodeError` if the codec cannot read it, and as
-  // `PersistentKeyValueStore::fetch`.
+  // The value; empty for a miss. Fails with `DecodeError` if the codec cannot read it, and where
+  // `PersistentKeyValueStore::fetch` fails.
   [[nodiscard]] Future<std::optional<T>> get(std::string_view key) const {
-    const auto operation = std::make_shared<Get>(reader_);
+    const auto operation = std::make_shared<Get>(reader_, key);
     Future<std::optional<T>> future = operation->promise.getFuture();
     try {
-      const std::string storedKey = detail::storedKey(*store_, key);
-      if constexpr (kExpires) operation->watch = std::make_unique<detail::ExpiryWatch>(store_, storedKey);
-      store_->fetch(storedKey).then(
-          decodingQueue_, [operation](std::future<detail::FetchedValue>& fetched) { operation->finish(fetched); });
+      begin(operation, detail::storedKey(*store_, key));
     } catch (...) {
       operation->promise.setException(std::current_exception());
     }
@@ -186,13 +175,14 @@ template <class T, class Codec = DefaultCodec<T>> class TypedStore {
   // What outlives this handle until the last value is decoded.
   struct Reader {
     Codec codec;
-    std::string storeName;
+    std::string path;  // of the store
   };
 
   struct Get {
-    explicit Get(std::shared_ptr<const Reader> reader_) : reader(std::move(reader_)) {}
+    Get(std::shared_ptr<const Reader> reader_, std::string_view key_) : reader(std::move(reader_)), key(key_) {}
 
     const std::shared_ptr<const Reader> reader;
+    const std::string key;                       // as `get` was given it
     std::unique_ptr<detail::ExpiryWatch> watch;  // null without a time to live
     Promise<std::optional<T>> promise;
 
@@ -204,7 +194,7 @@ template <class T, class Codec = DefaultCodec<T>> class TypedStore {
         if (found != nullptr) decode(*found, value);
         if (watch != nullptr && found != nullptr && !value) watch->removeUnlessPut();
       } catch (...) {
-        failure = std::current_exception();
+        failure = detail::named(std::current_exception(), reader->path, key);
       }
       failure != nullptr ? promise.setException(failure) : promise.setValue(std::move(value));
     }
@@ -217,14 +207,29 @@ template <class T, class Codec = DefaultCodec<T>> class TypedStore {
           value.emplace(reader->codec.decode(std::move(found.value)));
         }
       } catch (...) {
-        detail::throwDecodeError(reader->storeName, found.key);
+        detail::throwDecodeError(reader->path, key);
       }
     }
   };
 
+  void begin(const std::shared_ptr<Get>& operation, const std::string& storedKey) const {
+    if constexpr (kExpires) operation->watch = std::make_unique<detail::ExpiryWatch>(store_, storedKey);
+    try {
+      store_->fetch(storedKey).then(
+          decodingQueue_, [operation](std::future<detail::FetchedValue>& fetched) { operation->finish(fetched); });
+    } catch (...) {
+      detail::throwNamed(store_->path, operation->key);
+    }
+  }
+
   template <class Operation> Future<void> putting(std::string_view key, const Operation& operation) const {
     try {
-      return operation(detail::storedKey(*store_, key));
+      const std::string storedKey = detail::storedKey(*store_, key);
+      try {
+        return naming(operation(storedKey), *store_, std::string(key));
+      } catch (...) {
+        detail::throwNamed(store_->path, std::string(key));
+      }
     } catch (...) {
       return detail::failed(std::current_exception());
     }

@@ -1,5 +1,7 @@
 #include "Future.h"
 
+#include <glog/logging.h>
+
 namespace velmora::mobile::xplat::cellar {
 
 namespace {
@@ -19,6 +21,21 @@ const char* textOf(FutureError::Code code) {
 }
 
 }  // namespace
+
+namespace detail {
+
+void logExceptionOfBrokenPromise() noexcept {
+  constexpr const char* kText = "A callback of a broken promise has failed: ";
+  try {
+    throw;
+  } catch (const std::exception& error) {
+    LOG(ERROR) << kText << error.what();
+  } catch (...) {
+    LOG(ERROR) << kText << "not a standard exception";
+  }
+}
+
+}  // namespace detail
 
 FutureError::FutureError(Code code) : std::logic_error(textOf(code)), code_(code) {}
 

@@ -38,6 +38,9 @@ class CELLAR_EXPORT FutureError : public std::logic_error {
 
 namespace detail {
 
+// One error line about the exception that is being handled: nobody was there to receive it.
+CELLAR_EXPORT void logExceptionOfBrokenPromise() noexcept;
+
 // What a promise and the copies of its future share. Lives as long as any of them, or a delivery that is still queued.
 template <class T> struct SharedFutureState {
   std::mutex mutex;  // guards all but the atomics; held while an inline callback runs
@@ -130,7 +133,7 @@ template <class T> class Future {
   // Calls `callback` once, with the standard future that holds the value or exception: on `executor`, or with a null
   // executor inline, on the thread that fulfils the promise or on this one when that has happened already. An inline
   // callback runs under the future's lock: it must not call `get` or `then` of this future or a copy. What it throws
-  // reaches whoever ran it.
+  // reaches whoever ran it; where that is the end of an unfulfilled promise, it is one error line in the log.
   void then(std::shared_ptr<AsyncExecutor> executor, std::function<void(std::future<T>&)>&& callback) {
     throwIfInvalid();
     const auto state = state_;  // the callback may destroy this future
@@ -150,11 +153,18 @@ template <class T> class Future {
 };
 
 // The producer's end. Used by one thread at a time; fulfilling it twice throws `std::future_error`, and so does asking
-// for a second future. Destroyed unfulfilled, it fails its future with `std::future_error` (broken promise).
+// for a second future. Destroyed unfulfilled, it fails its future with `std::future_error` (broken promise); what an
+// inline callback of that future throws, or an executor that refuses to take the callback, is one error line then.
 template <class T> class Promise {
  public:
   Promise() = default;
-  ~Promise() { abandon(); }
+  ~Promise() {
+    try {
+      abandon();
+    } catch (...) {
+      detail::logExceptionOfBrokenPromise();
+    }
+  }
   Promise(const Promise&) = delete;
   Promise& operator=(const Promise&) = delete;
 

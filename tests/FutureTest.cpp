@@ -14,6 +14,7 @@
 
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
+#include "support/LogCapture.h"
 #include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -616,14 +617,50 @@ TEST_F(FutureTest, AnExecutorThatTakesNoTasksFailsThenOnAFulfilledFuture) {
   EXPECT_EQ(misuse([&] { future.then(nullptr, [](auto&) {}); }), kCallbackAlreadySet);
 }
 
-TEST(FutureDeathTest, ACallbackThatThrowsOutOfADyingPromiseEndsTheProcess) {
-  EXPECT_DEATH(
-      {
-        Promise<void> promise;
-        Future<void> future = promise.getFuture();
-        future.then(nullptr, [](auto&) { throw std::runtime_error("callback"); });
-      },
-      "");
+// A destructor has nobody to throw to.
+
+TEST_F(FutureTest, ACallbackThatThrowsOutOfADyingPromiseIsOneErrorLine) {
+  const test::LogCapture log;
+  auto promise = std::make_unique<Promise<void>>();
+  Future<void> future = promise->getFuture();
+  future.then([](std::future<void>& value) { value.get(); });  // throws the broken promise
+  promise.reset();
+  EXPECT_EQ(log.errorCount(), 1U);
+  EXPECT_TRUE(log.contains("A callback of a broken promise has failed: std::future_error"));
+  EXPECT_EQ(misuse([&] { future.throwIfInvalid(); }), kAlreadyFetched);  // the lock is free
+}
+
+TEST_F(FutureTest, ACallbackThatThrowsWhatIsNoStandardExceptionOutOfADyingPromiseIsOneErrorLine) {
+  const test::LogCapture log;
+  {
+    Promise<Value>().getFuture().then([](auto&) { throw 42; });
+  }
+  EXPECT_EQ(log.messages(), std::vector<string>{"A callback of a broken promise has failed: not a standard exception"});
+}
+
+TEST_F(FutureTest, ACallbackThatThrowsWhenAnExecutorDropsItsTaskIsOneErrorLine) {
+  const test::LogCapture log;
+  dispatchTask<void>(queue_, [] {}).then([](auto&) { throw std::runtime_error("callback"); });
+  queue_->dropAll();
+  EXPECT_EQ(log.messages(), std::vector<string>{"A callback of a broken promise has failed: callback"});
+}
+
+TEST_F(FutureTest, AnExecutorThatRefusesTheCallbackOfADyingPromiseIsOneErrorLine) {
+  const test::LogCapture log;
+  {
+    Promise<void> promise;
+    promise.getFuture().then(queue_, [](auto&) {});
+    queue_->throwOnDispatch(true);
+  }
+  EXPECT_EQ(log.errorCount(), 1U);
+}
+
+TEST_F(FutureTest, WhatACallbackThrowsReachesWhoeverAbandonsThePromise) {
+  const test::LogCapture log;
+  Promise<void> promise;
+  promise.getFuture().then([](auto&) { throw std::runtime_error("callback"); });
+  EXPECT_THROW(promise.abandon(), std::runtime_error);
+  EXPECT_EQ(log.errorCount(), 0U);
 }
 
 // Promises

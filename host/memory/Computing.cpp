@@ -1,7 +1,9 @@
 #include <glog/logging.h>
 
 #include <cellar/LarderException.h>
+#include <cellar/host/Errors.h>
 
+#include "host/errors/Texts.h"
 #include "host/memory/State.h"
 
 namespace velmora::mobile::xplat::cellar::host {
@@ -9,6 +11,17 @@ namespace velmora::mobile::xplat::cellar::host {
 namespace {
 
 using Value = MemoryTier::Value;
+
+// Whether the store itself has failed, not a callback or one of its queues.
+bool isOfTheLibrary(const std::exception_ptr& failure) {
+  try {
+    std::rethrow_exception(failure);
+  } catch (const LarderException&) {
+    return true;
+  } catch (...) {
+    return false;
+  }
+}
 
 }  // namespace
 
@@ -37,11 +50,11 @@ void MemoryTier::State::goOn(const std::shared_ptr<Request>& computation, std::f
   Value value;
   try {
     value = found.get();
-  } catch (const InvalidatedException&) {
-    return finish(*computation, nullptr, std::current_exception());
-  } catch (const LarderException& error) {
-    LOG(ERROR) << "The value of '" << computation->key << "' is computed again: " << error.what();
-  } catch (...) {  // a key that the store refuses, or a queue that is shut down
+  } catch (const StoreError& error) {
+    const bool isUnreadable = isOfTheLibrary(error.nested_ptr());  // or the store refuses the key
+    if (!isUnreadable) return finish(*computation, nullptr, std::current_exception());
+    LOG(ERROR) << "The value of " << shown(computation->key) << " is computed again: " << error.what();
+  } catch (...) {  // an invalid store, or a queue that is shut down
     return finish(*computation, nullptr, std::current_exception());
   }
   value != nullptr ? finish(*computation, value, nullptr) : produce(computation);
@@ -71,7 +84,8 @@ void MemoryTier::State::storeComputed(const Request& computation, const Value& v
   }
   stored.then(nullptr, [key = computation.key](std::future<void>& result) {
     const auto failure = failureOf([&] { result.get(); });
-    if (failure != nullptr) LOG(ERROR) << "The computed value of '" << key << "' is not stored: " << textOf(failure);
+    if (failure != nullptr)
+      LOG(ERROR) << "The computed value of " << shown(key) << " is not stored: " << textOf(failure);
   });
   makeCalls();
 }

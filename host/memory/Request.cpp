@@ -2,16 +2,6 @@
 
 namespace velmora::mobile::xplat::cellar::host {
 
-std::string textOf(const std::exception_ptr& failure) {
-  try {
-    std::rethrow_exception(failure);
-  } catch (const std::exception& error) {
-    return error.what();
-  } catch (...) {
-    return "unknown exception";
-  }
-}
-
 Future<Request::Value> Request::join() {
   waiting.emplace_back();
   return waiting.back().getFuture();

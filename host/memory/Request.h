@@ -21,9 +21,6 @@ template <class Operation> std::exception_ptr failureOf(Operation operation) {
   }
 }
 
-// What the exception says.
-std::string textOf(const std::exception_ptr& failure);
-
 // A value that several callers wait for. Joined with the tier's lock held, while it is among the tier's requests.
 struct Request {
   using Value = MemoryTier::Value;

@@ -6,6 +6,9 @@
 #include <stdexcept>
 
 #include <cellar/LarderException.h>
+#include <cellar/host/Errors.h>
+
+#include "host/errors/Texts.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
@@ -32,7 +35,7 @@ class MemoryTier::State::Clear {
       const Lock lock(state_->mutex_);
       --state_->clearing_;
     }
-    failure ? promise_.setException(failure) : promise_.setValue();
+    failure ? promise_.setException(state_->named(failure, "")) : promise_.setValue();
   }
 
  private:
@@ -46,6 +49,11 @@ Future<Value> MemoryTier::State::readyWith(Value value) {
   Promise<Value> promise;
   promise.setValue(std::move(value));
   return promise.getFuture();
+}
+
+// The store's failure, null for none, with its culprit.
+std::exception_ptr MemoryTier::State::named(const std::exception_ptr& failure, const std::string& key) const {
+  return failure == nullptr ? nullptr : detail::named(failure, path_, key);
 }
 
 // --- Memory ---
@@ -152,14 +160,14 @@ Future<Value> MemoryTier::State::fetch(const std::string& key) {
     calls_.emplace_back([this, flight](Store& store) {
       Future<Fetched> fetched;
       const auto refusal = failureOf([&] { fetched = store.fetch(flight->key); });
-      if (refusal != nullptr) return land(*flight, nullptr, refusal);
+      if (refusal != nullptr) return land(*flight, nullptr, named(refusal, flight->key));
       fetched.then(nullptr, [self = shared_from_this(), flight](std::future<Fetched>& result) {
         Value value;
         const auto failure = failureOf([&] {
           const Fetched found = result.get();
           if (found != nullptr) value = std::make_shared<const Bytes>(std::move(found->value));
         });
-        self->land(*flight, value, failure);
+        self->land(*flight, value, self->named(failure, flight->key));
       });
     });
   }
@@ -197,7 +205,7 @@ Future<void> MemoryTier::State::change(const Lock& lock, const std::string& key,
 void MemoryTier::State::settle(const std::string& key, Promise<void>& promise, const std::exception_ptr& failure) {
   if (failure == nullptr) return promise.setValue();
   forget(key);
-  promise.setException(failure);
+  promise.setException(named(failure, key));
 }
 
 Future<void> MemoryTier::State::store(const Lock& lock, const std::string& key, const Value& value, Metadata metadata) {

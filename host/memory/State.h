@@ -23,7 +23,7 @@ namespace velmora::mobile::xplat::cellar::host {
 class MemoryTier::State : public std::enable_shared_from_this<State> {
  public:
   State(std::shared_ptr<PersistentKeyValueStore> store, std::size_t maxBytes)
-      : store_(std::move(store)), table_(maxBytes) {}
+      : path_(store->path), store_(std::move(store)), table_(maxBytes) {}
 
   void close();
   Value find(const std::string& key);
@@ -60,7 +60,10 @@ class MemoryTier::State : public std::enable_shared_from_this<State> {
   void finish(Request& computation, const Value& value, const std::exception_ptr& failure);
   void storeComputed(const Request& computation, const Value& value);
 
+  std::exception_ptr named(const std::exception_ptr& failure, const std::string& key) const;
   static Future<Value> readyWith(Value value);
+
+  const std::string path_;  // of the store
 
   std::mutex mutex_;  // guards everything below
   std::shared_ptr<Store> store_;

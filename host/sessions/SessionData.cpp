@@ -45,6 +45,23 @@ std::shared_ptr<PathLocations> SessionData::locationsOf(const std::string& tag) 
   return severalKept_ ? std::make_shared<DirectoryPathLocations>(accountPath(tag)) : shared_;
 }
 
+std::shared_ptr<StoreDirectoryNameBuilder> SessionData::namesOf(const StoreManagerDefinition& manager,
+                                                                const std::string& tag) const {
+  return manager.sessionScoped ? nameBuilders_->createStoreDirectoryNameBuilder(tag)
+                               : nameBuilders_->createStoreDirectoryNameBuilder();
+}
+
+std::string SessionData::pathOf(const StoreManagerDefinition& manager, const std::string& tag) const {
+  const auto locations = manager.sessionScoped ? locationsOf(tag) : shared_;
+  const std::string area = locations->pathForArea(manager.area, "");
+  return fileUtils_->combinePath(area, namesOf(manager, tag)->buildStoreManagerName());
+}
+
+std::string SessionData::pathOf(const StoreManagerDefinition& manager, const StoreDefinition& store,
+                                const std::string& tag) const {
+  return fileUtils_->combinePath(pathOf(manager, tag), namesOf(manager, tag)->buildStoreName(store));
+}
+
 void SessionData::adopt(const std::string& tag) {
   if (!severalKept_ && !fileUtils_->pathExists(accounts_)) return;
   const std::string name = managerName(tag);

@@ -10,6 +10,7 @@
 namespace velmora::mobile::xplat::cellar {
 
 class FileUtils;
+class StoreDirectoryNameBuilder;
 class StoreDirectoryNameBuilderFactory;
 class TrashCollector;
 struct PathLocations;
@@ -33,6 +34,10 @@ class SessionData {
   const std::shared_ptr<PathLocations>& sessionless() const { return shared_; }
   std::shared_ptr<PathLocations> locationsOf(const std::string& tag) const;
 
+  // The directories of a manager and of one of its stores; the tag counts if the manager is session scoped.
+  std::string pathOf(const StoreManagerDefinition& manager, const std::string& tag) const;
+  std::string pathOf(const StoreManagerDefinition& manager, const StoreDefinition& store, const std::string& tag) const;
+
   // Moves the directories of a session that lie in the other place to where they are looked for now. Those that are in
   // both places stay. Throws `FileUtilsIoException`, also for a link; what was moved by then is found.
   void adopt(const std::string& tag);
@@ -53,6 +58,8 @@ class SessionData {
     std::string name;
   };
 
+  std::shared_ptr<StoreDirectoryNameBuilder> namesOf(const StoreManagerDefinition& manager,
+                                                     const std::string& tag) const;
   std::string managerName(const std::string& tag) const;
   std::string accountPath(const std::string& tag) const;
   std::vector<Place> placesOf(const std::string& tag) const;

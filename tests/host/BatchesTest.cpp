@@ -134,7 +134,8 @@ TEST_F(Batches, OneThatFailsIsNamedAndTheOthersAreDone) {
   files->failPath(test::Operation::WriteFile, pathOf("two"), ENOSPC);
   const Future<void> stored = storeAll(*store, {{"one", bytesOf("1")}, {"two", bytesOf("2")}, {"three", bytesOf("3")}});
   settle();
-  EXPECT_THAT(failureOf(stored), testing::StartsWith("two | Could not store \"two\": "));
+  EXPECT_THAT(failureOf(stored), testing::StartsWith("two | Could not store: Store 'store', key 'two', " + store->path +
+                                                     ": domain: QZLarderIoErrorErrorDomain; "));
   EXPECT_EQ(contents(), (Contents{{"one", "1"}, {"three", "3"}}));
 }
 
@@ -164,6 +165,8 @@ TEST_F(Batches, AStoreThatIsInvalidFailsThem) {
     FAIL();
   } catch (const BatchError& error) {
     EXPECT_EQ(error.key(), "key0");
+    EXPECT_EQ(error.store(), "store");
+    EXPECT_EQ(error.path(), store->path);
     EXPECT_THROW(std::rethrow_if_nested(error), InvalidatedException);
   }
 }
@@ -175,8 +178,8 @@ TEST_F(Batches, AQueueThatTakesNoTasksFailsThemWithoutThrowing) {
   const Future<void> removed = removeAll(*store, {"key"});
   const auto found = fetchMany(*store, {"key"});
   settle();
-  EXPECT_THAT(failureOf(stored), testing::StartsWith("key0 | Could not store \"key0\": "));
-  EXPECT_THAT(failureOf(removed), testing::StartsWith("key | Could not remove \"key\": "));
+  EXPECT_THAT(failureOf(stored), testing::StartsWith("key0 | Could not store: Store 'store', key 'key0', "));
+  EXPECT_THAT(failureOf(removed), testing::StartsWith("key | Could not remove: Store 'store', key 'key', "));
   EXPECT_THROW((void)await(found), BatchError);
 }
 

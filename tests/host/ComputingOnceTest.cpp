@@ -13,6 +13,7 @@ namespace {
 
 using test::bytesOf;
 using test::Got;
+using test::hasNested;
 using test::isA;
 using test::kBroken;
 using test::LogCapture;
@@ -167,7 +168,8 @@ TEST_P(MemoryTierComputing, AValueThatCannotBeReadIsComputedAgain) {
 TEST_P(MemoryTierComputing, AStoreThatRefusesOrDropsTheFetchFailsTheCallWithoutARun) {
   const Got reserved = watch(tier->fetchOrCompute("manifest_v1.sqlite", producing("made")));
   settle();
-  EXPECT_TRUE(isA<std::invalid_argument>(reserved->failure));
+  EXPECT_TRUE(hasNested<std::invalid_argument>(reserved->failure));
+  EXPECT_EQ(told(reserved).rfind("<error> Store 'store', key 'manifest_v1.sqlite', " + store->path + ": ", 0), 0u);
   const Got dropped = watch(tier->fetchOrCompute("a", producing("made")));
   work().dropAll();
   EXPECT_EQ(told(dropped), kBroken);

@@ -20,6 +20,7 @@
 #include "host/ThreadQueueFactory.h"
 #include "support/Barrier.h"
 #include "support/KeyValueStoreFixture.h"
+#include "support/LogCapture.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 namespace {
@@ -278,11 +279,54 @@ TEST_F(ExpiringTest, WorksOnQueuesThatRunTasksAtOnce) {
   for (const auto& queue : queues->all()) queue->onDispatch = nullptr;
 }
 
-TEST_F(ExpiringTest, IsAMissAlsoWhenTheRemovalFails) {
-  put("a", "old", seconds(10));
+TEST_F(ExpiringTest, IsAMissAlsoWhenTheRemovalFailsWhichIsOneErrorLine) {
+  put("My Key", "old", seconds(10));
   clock.advance(10);
   files->failNext(test::Operation::DeleteFile, EIO);
+  const test::LogCapture log;
+  EXPECT_EQ(get("My Key"), "<miss>");
+  EXPECT_EQ(log.errorCount(), 1U);
+  EXPECT_TRUE(
+      log.contains("An expired value is not removed: Store 'store', key 'My Key', " + store->path + ": domain"));
+}
+
+TEST_F(ExpiringTest, IsAMissAlsoWhenTheRemovalIsRefusedWhichIsOneErrorLine) {
+  put("a", "old", seconds(10));
+  clock.advance(10);
+  const auto queue = std::make_shared<ManualExecutor>();
+  const auto value = watch(ExpiringStore<string>(store, {}, queue).get("a"));
+  settle();
+  work().throwOnDispatch(true);
+  const test::LogCapture log;
+  EXPECT_EQ(queue->runAll(), 1U);
+  settle();
+  EXPECT_EQ(*value, "<miss>");
+  EXPECT_EQ(log.errorCount(), 1U);
+  EXPECT_TRUE(log.contains("An expired value is not removed: Store 'store', key 'a', "));
+}
+
+TEST_F(ExpiringTest, ARemovalThatSucceedsLogsNothing) {
+  put("a", "old", seconds(10));
+  clock.advance(10);
+  const test::LogCapture log;
   EXPECT_EQ(get("a"), "<miss>");
+  EXPECT_EQ(log.errorCount(), 0U);
+}
+
+TEST_F(ExpiringTest, AStoreThatIsInvalidOrDroppedBeforeTheRemovalLogsNothing) {
+  const test::LogCapture log;
+  for (const bool isInvalid : {false, true}) {
+    put("a", "old", seconds(0));
+    const auto queue = std::make_shared<ManualExecutor>();
+    const auto value = watch(ExpiringStore<string>(store, {}, queue).get("a"));
+    settle();
+    if (isInvalid) store->invalidateSoon();
+    EXPECT_EQ(queue->runAll(), 1U);
+    if (!isInvalid) work().dropAll();
+    settle();
+    EXPECT_EQ(*value, "<miss>");
+  }
+  EXPECT_EQ(log.errorCount(), 0U);
 }
 
 TEST_F(ExpiringTest, IsAMissAlsoWhenTheStoreIsGoneByThen) {

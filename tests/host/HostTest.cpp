@@ -303,10 +303,10 @@ TEST_F(HostTest, AStoreOfAnotherTypeThrows) {
             "velmora::mobile::xplat::cellar::PersistentKeyValueStore. Ask for the class that belongs to its \"type\".");
 }
 
-TEST_F(HostTest, ErrorsOfTheConfigurationPassThrough) {
+TEST_F(HostTest, ErrorsOfTheConfigurationPassThroughWithTheirPlace) {
   EXPECT_THROW(Host("{", "/nowhere"), JsonValue::parse_error);
   EXPECT_EQ(errorOf<std::invalid_argument>([] { Host(R"({"media": {"area": "attic"}})", "/nowhere"); }),
-            "Invalid area 'attic', use caches, documents or shared.");
+            "Configuration, /media/area, line 1, column 20: Invalid area 'attic', use caches, documents or shared.");
   EXPECT_EQ(descriptionOfStarting(R"({"a": {"stores": {"s": {"type": "unmanaged"}, "s": {"type": "unmanaged"}}}})"),
             "Duplicate store definition.");
 }

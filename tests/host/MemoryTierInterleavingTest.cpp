@@ -12,6 +12,7 @@ namespace {
 
 using test::bytesOf;
 using test::Got;
+using test::hasNested;
 using test::isA;
 using test::kBroken;
 using test::told;
@@ -129,7 +130,7 @@ TEST_F(MemoryTierInterleaving, AClearThatTheQueueRefusesFails) {
   openTier();
   work().throwOnDispatch(true);
   const Written cleared = watch(tier->clear());
-  EXPECT_EQ(told(cleared), "<error> The queue takes no tasks.");
+  EXPECT_EQ(told(cleared), "<error> Store 'store', " + store->path + ": The queue takes no tasks.");
   work().throwOnDispatch(false);
   keep("a", "value");
   EXPECT_EQ(inMemory("a"), "value");
@@ -172,7 +173,7 @@ TEST_F(MemoryTierInterleaving, AValueThatCouldNotBeStoredIsNotInMemory) {
   const Written written = watch(tier->store("a", bytesOf("new")));
   EXPECT_EQ(inMemory("a"), "new");
   settle();
-  EXPECT_TRUE(isA<FileUtilsIoException>(written->failure));
+  EXPECT_TRUE(hasNested<FileUtilsIoException>(written->failure));
   EXPECT_EQ(inMemory("a"), "<miss>");
   EXPECT_EQ(fetched("a"), onDisk("a"));
 }
@@ -182,7 +183,7 @@ TEST_F(MemoryTierInterleaving, AValueThatTheQueueRefusesOrDropsIsNotInMemory) {
   work().throwOnDispatch(true);
   file().throwOnDispatch(true);
   const Written refused = watch(tier->store("a", bytesOf("new")));
-  EXPECT_EQ(told(refused), "<error> The queue takes no tasks.");
+  EXPECT_EQ(told(refused), "<error> Store 'store', key 'a', " + store->path + ": The queue takes no tasks.");
   EXPECT_EQ(inMemory("a"), "<miss>");
   work().throwOnDispatch(false);
   file().throwOnDispatch(false);
@@ -260,8 +261,8 @@ TEST_F(MemoryTierInterleaving, AFailureReachesAllWhoFetchTogetherAndIsNotKept) {
   const Got first = watch(tier->fetch("a"));
   const Got second = watch(tier->fetch("a"));
   settle();
-  EXPECT_TRUE(isA<FileUtilsIoException>(first->failure));
-  EXPECT_TRUE(isA<FileUtilsIoException>(second->failure));
+  EXPECT_TRUE(hasNested<FileUtilsIoException>(first->failure));
+  EXPECT_TRUE(hasNested<FileUtilsIoException>(second->failure));
   EXPECT_EQ(fetched("a"), "value");
 }
 

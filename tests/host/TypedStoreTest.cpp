@@ -40,8 +40,8 @@ namespace {
 using std::string;
 using test::Bytes;
 using test::bytesOf;
+using test::hasNested;
 using test::isA;
-using test::kInvalid;
 using test::ManualExecutor;
 using test::Outcome;
 using test::whatOf;
@@ -256,6 +256,7 @@ TEST_F(TypedStoreTest, NamesStoreAndKeyOfAValueThatItCannotRead) {
   } catch (const DecodeError& error) {
     EXPECT_EQ(error.store(), "store");
     EXPECT_EQ(error.key(), "My Key");
+    EXPECT_EQ(error.path(), store->path);
     EXPECT_THROW(std::rethrow_if_nested(error), std::invalid_argument);
   }
   EXPECT_EQ(valueOf(typed<string>().get("My Key")), "abc") << "it stays";
@@ -284,9 +285,9 @@ TEST_F(TypedStoreTest, PassesOnWhateverACodecThrows) {
   };
   const auto values = typed<int, RudeCodec>();
   EXPECT_EQ(done(values.put("a", 1)), "<done>");
-  EXPECT_EQ(done(values.put("a", -1)), "<error> Not that one.");
+  EXPECT_EQ(done(values.put("a", -1)), "<error> Store 'store', key 'a', " + store->path + ": Not that one.");
   const std::exception_ptr failure = failureOf(values.get("a"));
-  EXPECT_EQ(whatOf(failure), "The value of 'a' in store 'store' cannot be decoded: The codec does not say why.");
+  EXPECT_EQ(whatOf(failure), "The value of 'a' in store 'store' cannot be decoded: not a standard exception");
   try {
     std::rethrow_exception(failure);
   } catch (const DecodeError& error) {
@@ -295,36 +296,56 @@ TEST_F(TypedStoreTest, PassesOnWhateverACodecThrows) {
   EXPECT_EQ(valueOf(typed<int>().get("a")), 1) << "a value that cannot be encoded replaces nothing";
 }
 
-TEST_F(TypedStoreTest, PassesOnAFailingStore) {
+TEST_F(TypedStoreTest, NamesStoreAndKeyOfWhatFails) {
   const auto names = typed<string>();
-  done(names.put("a", "1"));
+  done(names.put("My Key", "1"));
   files->failNext(test::Operation::ReadFile, EIO);
-  EXPECT_TRUE(isA<FileUtilsIoException>(failureOf(names.get("a"))));
+  const std::exception_ptr failure = failureOf(names.get("My Key"));
+  EXPECT_TRUE(hasNested<FileUtilsIoException>(failure));
+  const string culprit = "Store 'store', key 'My Key', " + store->path + ": ";
+  EXPECT_EQ(whatOf(failure).rfind(culprit + "domain: QZLarderIoErrorErrorDomain; code: 5; ", 0), 0U) << whatOf(failure);
+  try {
+    std::rethrow_exception(failure);
+  } catch (const StoreError& error) {
+    EXPECT_EQ(error.store(), "store");
+    EXPECT_EQ(error.key(), "My Key");
+    EXPECT_EQ(error.path(), store->path);
+  }
   files->failNext(test::Operation::WriteFile, ENOSPC);
-  EXPECT_NE(done(names.put("b", "2")).find("<error>"), string::npos);
+  EXPECT_EQ(done(names.put("My Key", "2")).rfind("<error> " + culprit, 0), 0U);
+  files->failNext(test::Operation::DeleteFile, EIO);
+  EXPECT_EQ(done(names.put("My Key", "2")), "<done>");
+  EXPECT_EQ(done(names.remove("My Key")).rfind("<error> " + culprit, 0), 0U);
+}
 
+TEST_F(TypedStoreTest, NamesStoreAndKeyWhenAQueueTakesNoTasks) {
+  const auto names = typed<string>();
+  work().throwOnDispatch(true);
+  file().throwOnDispatch(true);
+  const string culprit = "Store 'store', key 'a', " + store->path + ": ";
+  EXPECT_EQ(done(names.put("a", "1")).rfind("<error> " + culprit, 0), 0U);
+  EXPECT_EQ(done(names.remove("a")).rfind("<error> " + culprit, 0), 0U);
+  const std::exception_ptr failure = failureOf(names.get("a"));
+  EXPECT_TRUE(isA<StoreError>(failure));
+  EXPECT_EQ(whatOf(failure).rfind(culprit, 0), 0U) << whatOf(failure);
+}
+
+TEST_F(TypedStoreTest, SaysThatItsStoreIsInvalidAsTheStoreDoes) {
+  const auto names = typed<string>();
   store->invalidateWithFuture();
   settle();
-  EXPECT_EQ(whatOf(failureOf(names.get("a"))), kInvalid);
-  EXPECT_EQ(done(names.put("a", "1")), "<error> " + kInvalid);
-  EXPECT_EQ(done(names.remove("a")), "<error> " + kInvalid);
+  const std::exception_ptr failure = failureOf(names.get("a"));
+  EXPECT_TRUE(isA<InvalidatedException>(failure));
+  EXPECT_TRUE(hasNested<InvalidatedException>(failure));
+  const string named = "domain: QZInvalidatedExceptionErrorDomain; code: 0; description: Store 'store', key 'a', " +
+                       store->path + ": Store has been invalidated. .";
+  EXPECT_EQ(whatOf(failure), named);
+  EXPECT_EQ(done(names.put("a", "1")), "<error> " + named);
+  EXPECT_EQ(done(names.remove("a")), "<error> " + named);
   EXPECT_THROW(static_cast<void>(names.keys()), InvalidatedException);
 }
 
 TEST_F(TypedStoreTest, NeedsAStore) { EXPECT_THROW(TypedStore<int>(nullptr), std::invalid_argument); }
-
-TEST_F(TypedStoreTest, NamesTheStoreByItsDirectory) {
-  const auto nameOf = [this](const string& path) {
-    close();
-    options.directory = path;
-    openUnloaded();
-    string name = detail::nameOf(*store);
-    settle();
-    return name;
-  };
-  EXPECT_EQ(nameOf(directory.file("drafts_v1")), "drafts_v1");
-  EXPECT_EQ(nameOf(directory.file("drafts_v1//")), "drafts_v1");
-}
 
 // --- Codecs with a state, queues, lifetimes ---
 

@@ -62,6 +62,17 @@ template <class Exception> bool isA(const std::exception_ptr& failure) {
   }
 }
 
+// Whether the exception has one of that type nested in it.
+template <class Exception> bool hasNested(const std::exception_ptr& failure) {
+  try {
+    std::rethrow_exception(failure);
+  } catch (const std::nested_exception& error) {
+    return isA<Exception>(error.nested_ptr());
+  } catch (...) {
+    return false;
+  }
+}
+
 // What has become of a future, told by its callback.
 template <class T> struct Outcome {
   int completions = 0;

@@ -129,18 +129,4 @@ ConfigurationDocument parseConfigurationDocument(const std::string& text) {
   return document;
 }
 
-std::string memberPointer(const std::string& pointer, const std::string& name) {
-  std::string escaped;
-  for (const char character : name) {
-    if (character == '~') {
-      escaped += "~0";
-    } else if (character == '/') {
-      escaped += "~1";
-    } else {
-      escaped += character;
-    }
-  }
-  return pointer + "/" + escaped;
-}
-
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -4,6 +4,8 @@
 #include <string>
 #include <vector>
 
+#include "host/configuration/Faults.h"
+
 namespace velmora::mobile::xplat::cellar::tools {
 
 // Keeps members in the order of the document.
@@ -22,7 +24,6 @@ ConfigurationDocument readConfigurationDocument(const std::string& path);
 // The same from a text. Throws the JSON library's parse errors, and `InputError` for the nesting.
 ConfigurationDocument parseConfigurationDocument(const std::string& text);
 
-// The JSON pointer of a member of what `pointer` points at.
-std::string memberPointer(const std::string& pointer, const std::string& name);
+using host::memberPointer;
 
 }  // namespace velmora::mobile::xplat::cellar::tools
