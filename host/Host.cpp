@@ -14,6 +14,7 @@
 #include "Configuration.h"
 #include "DiskSizeCalculator.h"
 #include "FileUtils.h"
+#include "JsonValue.h"
 #include "LarderException.h"
 #include "LazyDispatcher.h"
 #include "StoreDirectoryNameBuilder.h"

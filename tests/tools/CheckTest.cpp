@@ -293,7 +293,7 @@ TEST(CheckFaults, EachIsNamedWithItsPlaceInTheParsersWords) {
   EXPECT_THAT(
       faultsOf(R"({"m": {"max_size": "20mb", "area": 3, "session_scoped": 1, "stores": {"a": {"type": "disk"}, "b": {},
                    "c": {"type": "pkvs", "stale_age": "1 hour"}, "d": 7}}, "n": 4})"),
-      ElementsAre("/m/area: type must be string, but is number", "/m/max_size: Invalid unit 'mb', use B, KB, MB or GB.",
+      ElementsAre("/m/max_size: Invalid unit 'mb', use B, KB, MB or GB.", "/m/area: type must be string, but is number",
                   "/m/session_scoped: type must be boolean, but is number",
                   "/m/stores/a/type: Invalid type 'disk', use unmanaged, pkvs or disk_cache.",
                   "/m/stores/b: has no 'type', use unmanaged, pkvs or disk_cache",
