@@ -157,11 +157,10 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   // The manager of that name, built on first request; never empty. Throws `ConfigurationException` when there is none,
   // `std::logic_error` when another session is open, `InvalidatedException` while its scope is being ended, what the
   // mapper throws for a session's key, and what building the manager throws. That names the manager and its directory,
-  // never the session's key: a `FileUtilsIoException` is one still, with the same code and the original nested in it;
-  // what is neither that nor one of the above becomes a `StoreError`, whose store is "". If building fails, nothing is
-  // discarded,
-  // and the next request tries again. Stores whose creation failed are created again, too
-  // (`StoreManager::retryFailedCreations`).
+  // and with it the session's tag, not its key: a `FileUtilsIoException` is one still, with the same code and the
+  // original nested in it; anything else but a `std::logic_error` or one of the above becomes a `StoreError`, whose
+  // store is "". If building fails, nothing is discarded, and the next request tries again. Stores whose creation
+  // failed are created again, too (`StoreManager::retryFailedCreations`).
   std::shared_ptr<StoreManager> manager(const std::string& name,
                                         const std::optional<std::string>& sessionKey = std::nullopt);
 
@@ -171,9 +170,9 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
 
   // The store of that identifier, of any manager, with the prune strategy of its definition; never empty. Throws as
   // `manager`, what creating the store throws, likewise with the names of the store, its manager and its directory,
-  // `std::logic_error` when it is not a `StoreType`, and
-  // `InvalidatedException` when you have invalidated its manager yourself. If a store could not be created, here or in
-  // the background, the next request tries again: no caller waits for it forever.
+  // `std::logic_error` when it is not a `StoreType`, and `InvalidatedException` when you have invalidated its manager
+  // yourself. If a store could not be created, here or in the background, the next request tries again: no caller waits
+  // for it forever.
   template <class StoreType>
   std::shared_ptr<StoreType> store(const std::string& storeIdentifier,
                                    const std::optional<std::string>& sessionKey = std::nullopt) {

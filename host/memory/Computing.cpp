@@ -84,8 +84,8 @@ void MemoryTier::State::storeComputed(const Request& computation, const Value& v
   }
   stored.then(nullptr, [key = computation.key](std::future<void>& result) {
     const auto failure = failureOf([&] { result.get(); });
-    if (failure != nullptr)
-      LOG(ERROR) << "The computed value of " << shown(key) << " is not stored: " << textOf(failure);
+    if (failure == nullptr) return;
+    LOG(ERROR) << "The computed value of " << shown(key) << " is not stored: " << textOf(failure);
   });
   makeCalls();
 }

@@ -143,6 +143,7 @@ TEST_F(Naming, RefusesAFutureThatHasNoValueToGive) {
 TEST_F(Naming, ManyThreadsMayFailAtOnce) {
   std::vector<Promise<void>> promises(100);
   std::vector<Future<void>> named;
+  named.reserve(promises.size());
   for (auto& promise : promises) named.push_back(naming(promise.getFuture(), *store, "x"));
   const auto failure = std::make_exception_ptr(std::runtime_error("text"));
   test::runOnThreads(4, [&](std::size_t thread) {
