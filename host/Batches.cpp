@@ -34,7 +34,7 @@ Future<T> attempt(const char* name, const PersistentKeyValueStore& store, const 
 }  // namespace
 
 BatchError::BatchError(const std::string& operation, const std::string& key, const std::string& path)
-    : StoreError("Could not " + operation + ": " + culprit(nameOfDirectory(path), key, path) + currentText(),
+    : StoreError(joined({"Could not ", operation, ": ", culprit(nameOfDirectory(path), key, path), currentText()}),
                  nameOfDirectory(path), key, path) {}
 
 BatchError::~BatchError() = default;

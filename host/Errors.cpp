@@ -7,7 +7,7 @@
 namespace velmora::mobile::xplat::cellar::host {
 
 StoreError::StoreError(std::string store, std::string key, std::string path)
-    : std::runtime_error(culprit(store, key, path) + currentText()),
+    : std::runtime_error(joined({culprit(store, key, path), currentText()})),
       store_(std::move(store)),
       key_(std::move(key)),
       path_(std::move(path)) {}
@@ -26,8 +26,8 @@ ConfigurationError::ConfigurationError(const std::string& reason, std::string po
     : pointer_(std::move(pointer)),
       line_(line),
       column_(column),
-      text_("Configuration" + (pointer_.empty() ? "" : ", " + pointer_) + ", line " + std::to_string(line_) +
-            ", column " + std::to_string(column_) + ": " + reason) {}
+      text_(joined({"Configuration", pointer_.empty() ? "" : ", ", pointer_, ", line ", std::to_string(line_),
+                    ", column ", std::to_string(column_), ": ", reason})) {}
 
 ConfigurationError::~ConfigurationError() = default;
 

@@ -47,7 +47,7 @@ std::vector<std::string> namesOfManagers(const std::string& configuration) {
 class BuildError : public StoreError {
  public:
   BuildError(const std::string& culprit, const std::string& store, const std::string& path)
-      : StoreError(culprit + ", " + path + ": " + currentText(), store, "", path) {}
+      : StoreError(joined({culprit, ", ", path, ": ", currentText()}), store, "", path) {}
 };
 
 // Throws the exception that is being handled so that it names what could not be built. File errors stay what they are,
@@ -56,7 +56,8 @@ class BuildError : public StoreError {
   try {
     throw;
   } catch (const FileUtilsIoException& error) {
-    std::throw_with_nested(FileUtilsIoException(error.code(), culprit + ", " + path + ": " + error.description()));
+    std::throw_with_nested(
+        FileUtilsIoException(error.code(), joined({culprit, ", ", path, ": ", error.description()})));
   } catch (const InvalidatedException&) {
     throw;
   } catch (const ConfigurationException&) {
@@ -189,7 +190,7 @@ std::shared_ptr<Store> Host::storeIn(const StoreManagerDefinition& definition, M
   try {
     store = manager->getStoreImpl(identifier, PruneStrategyIdentifier::Null);
   } catch (...) {
-    throwNamed("Store '" + identifier + "' of manager '" + definition.name + "'", identifier,
+    throwNamed(joined({"Store '", identifier, "' of manager '", definition.name, "'"}), identifier,
                sessionData_->pathOf(definition, *definition.stores.at(identifier), scope.tag));
   }
   if (store == nullptr) throw InvalidatedException("The manager of store '" + identifier + "' has been invalidated.");
@@ -204,7 +205,7 @@ std::shared_ptr<StoreManager> Host::managerIn(const StoreManagerDefinition& defi
   try {
     slot.manager = build(definition, scope, *figures);
   } catch (...) {
-    throwNamed("Manager '" + definition.name + "'", "", sessionData_->pathOf(definition, scope.tag));
+    throwNamed(joined({"Manager '", definition.name, "'"}), "", sessionData_->pathOf(definition, scope.tag));
   }
   auto manager = slot.manager;
   scopes_->setFigures(slot, figures);

@@ -35,8 +35,8 @@ void logFailedRemoval(const std::string& path, const std::string& storedKey) noe
 }  // namespace
 
 DecodeError::DecodeError(const std::string& key, const std::string& path)
-    : StoreError("The value of " + shown(key) + " in store '" + nameOfDirectory(path) +
-                     "' cannot be decoded: " + currentText(),
+    : StoreError(joined({"The value of ", shown(key), " in store '", nameOfDirectory(path),
+                         "' cannot be decoded: ", currentText()}),
                  nameOfDirectory(path), key, path) {}
 
 DecodeError::~DecodeError() = default;

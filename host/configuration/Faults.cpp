@@ -3,11 +3,13 @@
 #include <algorithm>
 #include <exception>
 #include <map>
+#include <string_view>
 #include <utility>
 
 #include "Configuration.h"
 #include "JsonValue.h"
 #include "host/configuration/Outline.h"
+#include "host/errors/Texts.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
@@ -32,23 +34,26 @@ class FaultFinder {
 
   Faults find(const Outline& document) {
     if (!document.isObject) add("", document.begin, "is not an object of managers");
-    std::map<std::string, int> names;
+    ByName managers;
     for (const Outline& manager : document.members) {
       const std::string pointer = memberPointer("", manager.name);
-      if (names[manager.name]++ > 0) add(pointer, manager.nameAt, "is defined twice here");
+      const bool isNew = managers.emplace(manager.name, &manager).second;
+      if (!isNew) add(pointer, manager.nameAt, "is defined twice here");
       lookAtManager(pointer, manager);
     }
     return std::move(faults_);
   }
 
  private:
+  using ByName = std::map<std::string, const Outline*>;
+
   void add(const std::string& pointer, std::size_t at, const std::string& refusal) {
     if (!refusal.empty()) faults_.push_back({pointer, at, refusal});
   }
 
   // Of several members of one name the last counts.
   static std::vector<const Outline*> membersThatCount(const Outline& object) {
-    std::map<std::string, const Outline*> last;
+    ByName last;
     for (const Outline& member : object.members) last[member.name] = &member;
     std::vector<const Outline*> members;
     for (const Outline& member : object.members) {
@@ -57,13 +62,15 @@ class FaultFinder {
     return members;
   }
 
-  std::string textOf(const Outline& member) const { return text_.substr(member.nameAt, member.end - member.nameAt); }
+  std::string_view textOf(const Outline& member) const {
+    return std::string_view(text_).substr(member.nameAt, member.end - member.nameAt);
+  }
 
   void lookAtManager(const std::string& pointer, const Outline& manager) {
     if (!manager.isObject) return add(pointer, manager.begin, "a manager must be an object");
     for (const Outline* const member : membersThatCount(manager)) {
       if (member->name == "stores") continue;
-      add(memberPointer(pointer, member->name), member->begin, refusalOf(R"({"m":{)" + textOf(*member) + "}}"));
+      add(memberPointer(pointer, member->name), member->begin, refusalOf(joined({R"({"m":{)", textOf(*member), "}}"})));
     }
     const Outline* const stores = manager.find("stores");
     if (stores == nullptr) return;
@@ -81,8 +88,8 @@ class FaultFinder {
 
   void lookAtStore(const std::string& pointer, const Outline& store) {
     if (!store.isObject) return add(pointer, store.begin, "a store must be an object");
-    const auto lookAt = [&](const Outline& member, const std::string& otherMembers) {
-      const std::string refusal = refusalOf(R"({"m":{"stores":{"s":{)" + otherMembers + textOf(member) + "}}}}");
+    const auto lookAt = [&](const Outline& member, std::string_view otherMembers) {
+      const std::string refusal = refusalOf(joined({R"({"m":{"stores":{"s":{)", otherMembers, textOf(member), "}}}}"}));
       add(memberPointer(pointer, member.name), member.begin, refusal);
       return refusal.empty();
     };
@@ -91,12 +98,12 @@ class FaultFinder {
     if (type == nullptr) return add(pointer, store.begin, "has no 'type', use unmanaged, pkvs or disk_cache");
     if (!lookAt(*type, "")) return;
     for (const Outline* const member : membersThatCount(store)) {
-      if (member->name != "name" && member->name != "type") lookAt(*member, textOf(*type) + ",");
+      if (member->name != "name" && member->name != "type") lookAt(*member, joined({textOf(*type), ","}));
     }
   }
 
   const std::string& text_;
-  std::map<std::string, const Outline*> owners_;  // of the stores
+  ByName owners_;  // of the stores
   Faults faults_;
 };
 

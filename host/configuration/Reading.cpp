@@ -13,6 +13,7 @@
 
 #include "host/configuration/Faults.h"
 #include "host/configuration/Outline.h"
+#include "host/errors/Texts.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
@@ -43,11 +44,15 @@ template <class Error> class Located : public Error, public ConfigurationError {
 
 // The first fault that the library words like this, which is the one that it met: those before it are of the same
 // manager or store. Where the library's words do not tell what is wrong they are others, and it is the first of all.
-template <class Error> [[noreturn]] void throwLocated(const Error& refusal, const std::string& json) {
+Place placeOfRefusal(const char* text, const std::string& json) {
   const auto faults = faultsOf(json);
   const auto culprit =
-      std::find_if(faults.begin(), faults.end(), [&](const auto& fault) { return fault.text == refusal.what(); });
-  throw Located<Error>(refusal, placeOf(culprit != faults.end() ? *culprit : faults.front(), json));
+      std::find_if(faults.begin(), faults.end(), [&](const auto& fault) { return fault.text == text; });
+  return placeOf(culprit != faults.end() ? *culprit : faults.front(), json);
+}
+
+template <class Error> [[noreturn]] void throwLocated(const Error& refusal, const std::string& json) {
+  throw Located<Error>(refusal, placeOfRefusal(refusal.what(), json));
 }
 
 std::shared_ptr<const Configuration> readLocating(const std::string& json) {
@@ -74,8 +79,8 @@ void refuseSharedDirectories(const Configuration& configuration, const std::stri
     const auto [owner, isFree] = owners.emplace(std::pair(definition->area, definition->sessionScoped), manager.name);
     if (isFree) continue;
     try {
-      throw ConfigurationException("Managers '" + owner->second + "' and '" + manager.name +
-                                   "' would share a directory, give them different areas or session scopes.");
+      throw ConfigurationException(joined({"Managers '", owner->second, "' and '", manager.name,
+                                           "' would share a directory, give them different areas or session scopes."}));
     } catch (const ConfigurationException& refusal) {
       const ConfigurationFault fault{memberPointer("", manager.name), manager.begin, ""};
       throw Located<ConfigurationException>(refusal, placeOf(fault, json));

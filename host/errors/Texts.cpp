@@ -5,6 +5,12 @@
 
 namespace velmora::mobile::xplat::cellar::host {
 
+std::string joined(std::initializer_list<std::string_view> parts) {
+  std::string text;
+  for (const std::string_view part : parts) text += part;
+  return text;
+}
+
 std::string textOf(const std::exception_ptr& failure) {
   try {
     std::rethrow_exception(failure);
@@ -42,7 +48,8 @@ std::string nameOfDirectory(const std::string& path) {
 }
 
 std::string culprit(const std::string& store, const std::string& key, const std::string& path) {
-  return "Store '" + store + "'" + (key.empty() ? "" : ", key " + shown(key)) + ", " + path + ": ";
+  if (key.empty()) return joined({"Store '", store, "', ", path, ": "});
+  return joined({"Store '", store, "', key ", shown(key), ", ", path, ": "});
 }
 
 }  // namespace velmora::mobile::xplat::cellar::host
