@@ -22,7 +22,7 @@ namespace {
 using testing::HasSubstr;
 using testing::SizeIs;
 
-const std::string kRoot = CELLAR_SOURCE_DIR;
+const std::string kRoot = CELLAR_SOURCE_DIR "/";
 
 using Texts = std::set<std::string>;
 
@@ -34,7 +34,7 @@ std::string read(const std::string& path) {
 // All sources of the library, or of the kit without that for tests.
 std::string sourcesBelow(const std::string& directory) {
   std::string sources;
-  for (const auto& entry : std::filesystem::recursive_directory_iterator(kRoot + "/" + directory)) {
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(kRoot + directory)) {
     const std::string path = entry.path().string();
     const std::string extension = entry.path().extension().string();
     if (path.find("/host/testing/") != std::string::npos || (extension != ".h" && extension != ".cpp")) continue;
@@ -73,7 +73,7 @@ std::map<std::string, std::vector<std::string>> tableOf(const std::string& secti
   std::map<std::string, std::vector<std::string>> rows;
   bool isSection = false;
   bool isTable = false;
-  for (const std::string& line : test::linesOf(std::ifstream(kRoot + "/docs/errors.md"))) {
+  for (const std::string& line : test::linesOf(std::ifstream(kRoot + "docs/errors.md"))) {
     if (line.rfind("## ", 0) == 0) isSection = line == "## " + section;
     isTable = isSection && (line.rfind("| " + firstCell + " |", 0) == 0 || (isTable && line.rfind('|', 0) == 0));
     if (!isTable || line.rfind("| `", 0) != 0) continue;
@@ -110,7 +110,7 @@ TEST(ErrorsPage, HasEachExceptionOfTheKitAndNoOther) {
   EXPECT_EQ(namesOf(rows), classes);
   for (const auto& [name, cells] : rows) {
     const std::string header = cells.at(1).substr(1, cells.at(1).size() - 2);
-    EXPECT_THAT(read(kRoot + "/" + header), HasSubstr("class CELLAR_EXPORT " + name + " ")) << header;
+    EXPECT_THAT(read(kRoot + header), HasSubstr("class CELLAR_EXPORT " + name + " ")) << header;
   }
 }
 
@@ -121,7 +121,7 @@ TEST(ErrorsPage, HasEachDomainAndNoOther) {
     written.insert(match[0].substr(1, match[0].size() - 2));
   }
   Texts listed;
-  for (const auto& match : matches(read(kRoot + "/docs/errors.md"), pattern)) listed.insert(match[0]);
+  for (const auto& match : matches(read(kRoot + "docs/errors.md"), pattern)) listed.insert(match[0]);
   ASSERT_THAT(written, SizeIs(7));
   EXPECT_EQ(listed, written);
 }
@@ -143,7 +143,7 @@ TEST(ErrorsPage, HasTheDomainOfEachException) {
 }
 
 TEST(ErrorsPage, HasEachCodeOfAMisusedFutureWithItsNumber) {
-  const std::string header = read(kRoot + "/src/Future.h");
+  const std::string header = read(kRoot + "src/Future.h");
   const std::size_t begin = header.find("enum class Code");
   const std::string codes = header.substr(begin, header.find("};", begin) - begin);
   std::map<std::string, std::string> numbers;
