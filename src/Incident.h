@@ -20,7 +20,8 @@ struct CELLAR_EXPORT Incident {
     DamagedValue = 3,       // a value's bytes are not those that were stored
     ManagerDiscarded = 4,   // at start, because the file system is too small
     TrashStuck = 5,         // something in the trash cannot be deleted
-    CreationFailed = 6      // a store could not be created
+    CreationFailed = 6,     // a store could not be created
+    OverLimit = 7           // an unmanaged cache was measured with more than its limit
   };
 
   Kind kind;

@@ -80,6 +80,14 @@ bool StoreManager::isValid() { return impl_->isValid(); }
 
 void StoreManager::retryFailedCreations() { impl_->retryFailedCreations(); }
 
+void StoreManager::pruneNow() { impl_->pruneNow(); }
+
+std::uint32_t StoreManager::sizeOf(const std::string& identifier) { return impl_->sizeOf(identifier); }
+
+void StoreManager::setSizeListener(std::function<void(const std::string&, std::uint32_t)> listener) {
+  impl_->setSizeListener(std::move(listener));
+}
+
 bool StoreManager::forceCleanseOnInit() {
   const std::lock_guard<std::mutex> lock(forceCleanseMutex);
   return forceCleanseAtStart;

@@ -188,29 +188,54 @@ void StoreManagerImpl::onStoreSizeChanged(const std::string& identifier, unsigne
     item->currentSize = size;
   }
 
+  std::shared_ptr<const SizeListener> listener;
   {
     const std::lock_guard<std::mutex> lock(mutex_);
     totalSize_ = size + (totalSize_ - oldSize);
+    listener = sizeListener_;
   }
+  if (listener != nullptr) (*listener)(identifier, size);
   if (maintenanceEnabled_) queue_->dispatch([self = shared_from_this()] { self->pruneStoresIfNecessary(); });
 }
 
-void StoreManagerImpl::pruneStoresIfNecessary() {
-  // A store may finish at once, on this thread, and report back: no lock is held while it is asked.
-  for (const PruneRequest& request : beginPruneRound()) startPruning(request);
+std::uint32_t StoreManagerImpl::sizeOf(const std::string& identifier) {
+  const auto item = common_.getExistingStore(identifier);
+  if (item == nullptr) return 0;
+  const std::lock_guard<std::mutex> lock(item->mutex);
+  return item->currentSize;
 }
 
-// Decides which stores to prune and marks them. From then on, if there are any, the round is in progress.
-std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() {
+void StoreManagerImpl::setSizeListener(SizeListener listener) {
+  auto shared = listener ? std::make_shared<const SizeListener>(std::move(listener)) : nullptr;
+  const std::lock_guard<std::mutex> lock(mutex_);
+  sizeListener_.swap(shared);
+}
+
+void StoreManagerImpl::pruneNow() {
+  if (maintenanceEnabled_) queue_->dispatch([self = shared_from_this()] { self->pruneStores(true); });
+}
+
+void StoreManagerImpl::pruneStoresIfNecessary() { pruneStores(false); }
+
+void StoreManagerImpl::pruneStores(bool isRequested) {
+  // A store may finish at once, on this thread, and report back: no lock is held while it is asked.
+  for (const PruneRequest& request : beginPruneRound(isRequested)) startPruning(request);
+}
+
+// Decides which stores to prune and marks them. From then on, if there are any, the round is in progress. One that was
+// requested waits neither for the interval nor for the manager's own limit.
+std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound(bool isRequested) {
   const std::lock_guard<std::mutex> lock(mutex_);
   const StoreManagerDefinition& definition = common_.definition();
   // A store that is destroyed in the middle of its prune does not say so.
   if (pruneInProgress_) noteIfRoundIsOver(lock);
+  isRoundRequested_ = isRoundRequested_ || isRequested;
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
+  const bool isDue = std::exchange(isRoundRequested_, false);
   const auto nextPruneTime = lastPruneTime_ + definition.pruneInterval;
-  if (lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};
+  if (!isDue && lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};
   const bool survivalMode = isInSurvivalMode();
-  if (totalSize_ <= definition.maxSize && !survivalMode) return {};
+  if (!isDue && totalSize_ <= definition.maxSize && !survivalMode) return {};
 
   std::vector<PruneRequest> requests;
   for (const auto& [identifier, item] : common_.copyStoreMap()) {

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -21,7 +22,7 @@ class LazyDispatcher;
 // their limits. It knows the size that each store last reported and their total. When the total is above the manager's
 // limit (or the device is short of space), and the prune interval has passed since the last round ended, every prunable
 // store that is above its own limit is asked to prune itself. A store over its own limit inside a manager that is not
-// over its own is left alone.
+// over its own is left alone, unless a round is requested by `pruneNow`.
 //
 // Limits are checked when a size is reported, that is after a write: they can be passed by what is written until the
 // round has run. Sizes and totals are unsigned 32-bit and wrap.
@@ -89,6 +90,11 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   // Starts a round of pruning, if it is time and there is need. At most one round is under way.
   void pruneStoresIfNecessary();
 
+  // As those of `StoreManager`.
+  void pruneNow();
+  std::uint32_t sizeOf(const std::string& identifier);
+  void setSizeListener(std::function<void(const std::string& identifier, std::uint32_t size)> listener);
+
   // Takes note that a store has finished pruning, well or not.
   void onStorePruneBackToNormalComplete(const std::string& identifier);
 
@@ -106,20 +112,24 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
 
  private:
   struct PruneRequest;
+  using SizeListener = std::function<void(const std::string& identifier, std::uint32_t size)>;
 
+  void pruneStores(bool isRequested);
   void measureNewUnmanagedStore(const std::string& identifier,
                                 const std::shared_ptr<const StoreDefinition>& definition);
   void createAllStores();
-  std::vector<PruneRequest> beginPruneRound();
+  std::vector<PruneRequest> beginPruneRound(bool isRequested);
   std::string whyFileSystemIsTooSmall();
   bool isInSurvivalMode() const;
   void noteIfRoundIsOver(const std::lock_guard<std::mutex>& lock);
   void startPruning(const PruneRequest& request);
 
-  std::mutex mutex_;  // guards the three below
+  std::mutex mutex_;  // guards the five below
   std::uint32_t totalSize_ = 0;
   std::int64_t lastPruneTime_ = 0;
   bool pruneInProgress_ = false;
+  bool isRoundRequested_ = false;  // by `pruneNow`, while another was under way
+  std::shared_ptr<const SizeListener> sizeListener_;
 
   std::recursive_mutex cleanupMutex_;  // held by a clean-up in the background, which may lead to an invalidation
 

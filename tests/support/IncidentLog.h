@@ -13,9 +13,9 @@ namespace velmora::mobile::xplat::cellar::test {
 
 // "CreationFailed thumbs: description", with " of key" before the colon if there is one.
 inline std::string textOf(const Incident& incident) {
-  static const std::vector<std::string> kinds = {"StorePurged",   "StoreSalvaged",    "ValuesQuarantined",
-                                                 "DamagedValue",  "ManagerDiscarded", "TrashStuck",
-                                                 "CreationFailed"};
+  static const std::vector<std::string> kinds = {"StorePurged",    "StoreSalvaged",    "ValuesQuarantined",
+                                                 "DamagedValue",   "ManagerDiscarded", "TrashStuck",
+                                                 "CreationFailed", "OverLimit"};
   return kinds.at(static_cast<std::size_t>(incident.kind)) + " " + incident.name +
          (incident.key.empty() ? "" : " of " + incident.key) + ": " + incident.description;
 }
