@@ -16,7 +16,7 @@ list(TRANSFORM CELLAR_PUBLIC_HEADERS PREPEND src/ OUTPUT_VARIABLE public_headers
 install(FILES ${public_headers} DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}/cellar COMPONENT development)
 install(DIRECTORY src/executor src/session host DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}/cellar COMPONENT development
   FILES_MATCHING PATTERN "*.h" PATTERN "configuration" EXCLUDE PATTERN "errors" EXCLUDE PATTERN "figures" EXCLUDE
-  PATTERN "memory" EXCLUDE PATTERN "queues" EXCLUDE PATTERN "sessions" EXCLUDE
+  PATTERN "limits" EXCLUDE PATTERN "memory" EXCLUDE PATTERN "queues" EXCLUDE PATTERN "sessions" EXCLUDE
   PATTERN "conformance" EXCLUDE PATTERN "powercut" EXCLUDE)
 
 set(package_directory ${CMAKE_INSTALL_LIBDIR}/cmake/cellar)

@@ -28,6 +28,8 @@
 #include "host/errors/Texts.h"
 #include "host/figures/ManagerFigures.h"
 #include "host/figures/MeasuredSizes.h"
+#include "host/limits/PromptPruning.h"
+#include "host/limits/UnmanagedMeasuring.h"
 #include "host/sessions/ManagerScopes.h"
 #include "host/sessions/SessionData.h"
 
@@ -85,6 +87,11 @@ std::shared_ptr<AnalyticsEventReporter> reporterFor(std::unique_ptr<XAnalytics> 
   return std::make_shared<AnalyticsEventReporter>(std::move(sink));
 }
 
+std::shared_ptr<AsyncExecutor> pruningQueue(const HostOptions& options, TaskQueueFactory& queues) {
+  const bool prunesPromptly = options.prune == Prune::Promptly && options.runMaintenance;
+  return prunesPromptly ? queues.createWorkQueue() : nullptr;
+}
+
 void refuseOnQueueThread(const std::string& operation) {
   ThreadQueueFactory::refuseOnQueueThread(operation, "Use a thread of your own instead.");
 }
@@ -121,6 +128,9 @@ Host::Host(HostOptions options)
       measuringQueue_(taskQueueFactory_->createWorkQueue()),
       incidentGate_(gateFor(std::move(options.onIncident))),
       incidents_(reporterThrough(incidentGate_, *taskQueueFactory_)),
+      pruningQueue_(pruningQueue(options, *taskQueueFactory_)),
+      pruneDelay_(options.pruneDelay),
+      unmanaged_(measuringEvery(options.measureUnmanagedEvery)),
       sessionData_(std::make_unique<SessionData>(options.root, options.accounts == Accounts::Kept, fileUtils_, trash_,
                                                  nameBuilders_)),
       scopes_(std::make_unique<ManagerScopes>(options.accounts == Accounts::Kept, sessionTagMapper_)) {
@@ -130,6 +140,13 @@ Host::Host(HostOptions options)
 }
 
 Host::Host(const std::string& configuration, const std::string& root) : Host(plainOptions(configuration, root)) {}
+
+// Null: never.
+std::shared_ptr<UnmanagedMeasuring> Host::measuringEvery(std::chrono::seconds interval) const {
+  if (interval <= std::chrono::seconds(0)) return nullptr;
+  const UnmanagedMeasuring::Services services{measuringQueue_, fileUtils_, attributes_, sizes_, incidents_};
+  return std::make_shared<UnmanagedMeasuring>(interval, services);
+}
 
 Host::~Host() {
   lazyWork_->willBeTriggeredExternally();
@@ -194,6 +211,7 @@ std::shared_ptr<Store> Host::storeIn(const StoreManagerDefinition& definition, M
                sessionData_->pathOf(definition, *definition.stores.at(identifier), scope.tag));
   }
   if (store == nullptr) throw InvalidatedException("The manager of store '" + identifier + "' has been invalidated.");
+  if (unmanaged_ != nullptr) unmanaged_->noteRequest(store);
   return store;
 }
 
@@ -232,6 +250,9 @@ std::shared_ptr<StoreManager> Host::build(const StoreManagerDefinition& definiti
   factory.setIncidents(incidents_);
   auto manager = factory.managerForIdentifier(definition.name, scope.key, runMaintenance_);
   manager->retryFailedCreations();
+  if (pruningQueue_ != nullptr && definition.pruneInterval != 0) {
+    PromptPruning::begin(manager, definition, pruningQueue_, pruneDelay_);
+  }
   return manager;
 }
 

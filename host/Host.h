@@ -37,12 +37,19 @@ class MeasuredSizes;
 class RootLock;
 class SessionData;
 class ThreadQueueFactory;
+class UnmanagedMeasuring;
 struct ManagerSlot;
 
 // What becomes of a session's data when another session opens.
 enum class Accounts {
   OneAtATime,  // one session is open at a time; maintenance of its managers removes the data of the others
   Kept,        // several may be open at the same time, and the data of each is kept until it is logged out
+};
+
+// When a manager prunes its disk caches.
+enum class Prune {
+  AtIntervals,  // when all its stores together exceed its own limit, at most once in each `prune_interval`
+  Promptly,     // also some seconds after one of its disk caches, or all its stores together, exceed a limit by a tenth
 };
 
 // What a host is built from. `configuration` and `root` are required.
@@ -64,6 +71,26 @@ struct HostOptions {
   long lazyDelaySeconds = 10;
   bool runMaintenance = true;  // whether managers remove stale data and prune stores that are over their limits
   std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for accepted work
+
+  // With `Promptly` a manager prunes `pruneDelay` after a limit has been exceeded by more than a tenth, if it still is:
+  // its own limit or that of a disk cache, the configured one. So a cache has at most 1.1 times its limit and what is
+  // written in this time. It then prunes each disk cache that is over its own limit. `pruneDelay` is also the least
+  // time between two such prunes of a manager; less than 1 second counts as 1. No timer runs while the limits are kept.
+  //
+  // Only with maintenance, for managers that prune at all (`prune_interval` is not 0), and as long as the host or
+  // somebody else has a handle on the manager.
+  Prune prune = Prune::AtIntervals;
+  std::chrono::seconds pruneDelay{3};
+
+  // How often the host measures an unmanaged cache that has a limit while it is in use; 0: only as the library does,
+  // which is once in a week. One that has more than its limit is an `OverLimit` incident, once until it is measured
+  // within its limit; nothing is deleted before the cache is opened the next time, then by the size measured last.
+  //
+  // A cache is in use when `Host::store` or `Session::store` has returned it since it was last measured, and then as
+  // long as somebody other than its manager holds it. Who keeps the path only does not count, nor who has it from the
+  // manager. Measuring takes place on a queue of the host's, and a hundred times as long as it has taken passes before
+  // the next time. The end of the host waits for a measurement that is under way.
+  std::chrono::seconds measureUnmanagedEvery{0};
 
   std::shared_ptr<FileUtils> fileUtils;                // null: the real file system
   std::shared_ptr<TaskQueueFactory> taskQueueFactory;  // null: threads of the host's own
@@ -251,6 +278,7 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   static std::shared_ptr<IncidentGate> gateFor(std::function<void(const Incident&)> handler);
   static std::shared_ptr<const IncidentReporter> reporterThrough(const std::shared_ptr<IncidentGate>& gate,
                                                                  TaskQueueFactory& queues);
+  std::shared_ptr<UnmanagedMeasuring> measuringEvery(std::chrono::seconds interval) const;
   void closeIncidentGate(std::chrono::seconds patience);
   bool endThreads();
 
@@ -275,6 +303,9 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<AsyncExecutor> measuringQueue_;
   const std::shared_ptr<IncidentGate> incidentGate_;         // null: nobody is told of incidents
   const std::shared_ptr<const IncidentReporter> incidents_;  // null with the gate
+  const std::shared_ptr<AsyncExecutor> pruningQueue_;        // null: managers prune at intervals only
+  const std::chrono::seconds pruneDelay_;
+  const std::shared_ptr<UnmanagedMeasuring> unmanaged_;  // null: the host does not measure while stores are in use
   const std::unique_ptr<SessionData> sessionData_;
   const std::unique_ptr<ManagerScopes> scopes_;
 };
