@@ -82,9 +82,10 @@ struct HostOptions {
   Prune prune = Prune::AtIntervals;
   std::chrono::seconds pruneDelay{3};
 
-  // How often the host measures an unmanaged cache that has a limit while it is in use; 0: only as the library does,
-  // which is once in a week. One that has more than its limit is an `OverLimit` incident, once until it is measured
-  // within its limit; nothing is deleted before the cache is opened the next time, then by the size measured last.
+  // How often the host measures an unmanaged cache that has a limit while it is in use; 0: only as the library does, as
+  // it is opened and not more than once in a week. One that has more than its limit is an `OverLimit` incident, once
+  // until it is measured within its limit; nothing is deleted before the cache is opened the next time, then by the
+  // size measured last.
   //
   // A cache is in use when `Host::store` or `Session::store` has returned it since it was last measured, and then as
   // long as somebody other than its manager holds it. Who keeps the path only does not count, nor who has it from the

@@ -84,7 +84,7 @@ void StoreManager::pruneNow() { impl_->pruneNow(); }
 
 std::uint32_t StoreManager::sizeOf(const std::string& identifier) { return impl_->sizeOf(identifier); }
 
-void StoreManager::setSizeListener(std::function<void(const std::string&, std::uint32_t)> listener) {
+void StoreManager::setSizeListener(std::shared_ptr<const SizeListener> listener) {
   impl_->setSizeListener(std::move(listener));
 }
 

@@ -103,21 +103,24 @@ class CELLAR_EXPORT StoreManager {
   void retryFailedCreations();
 
   // Starts a round of pruning in the background, whatever the interval and the manager's own limit say: every disk
-  // cache that is over its limit is pruned. If a round is under way, it follows when that is over and a store reports
-  // its size. The interval to the next round begins at its end. Does nothing without maintenance, with an interval of
-  // 0, and once the manager is invalid. Throws what the queue throws.
+  // cache that is over its limit is pruned. If a round is under way, the next begins when that is over and a store
+  // reports its size. The interval begins at the end of this round, too. Does nothing without maintenance, with an
+  // interval of 0, and once the manager is invalid. Throws what the queue throws; the next size that is reported starts
+  // the round then.
   void pruneNow();
 
   // The bytes that the store of that identifier reported last. 0 if it has not been created or has not reported yet,
   // and once the manager is invalid.
   std::uint32_t sizeOf(const std::string& identifier);
 
+  using SizeListener = std::function<void(const std::string& identifier, std::uint32_t size)>;
+
   // `listener` is called from now on with each size that a store reports, after each write for example: on a queue of
   // the store's or the manager's, before the limits are checked, and for different stores at the same time. No lock is
   // held then. It should take little time, and must not throw. It replaces an earlier one, which may still be called by
-  // who has begun to. Empty: nobody is told. The manager keeps it, also when this handle is gone; it must not keep the
+  // who has begun to. Null: nobody is told. The manager keeps it, also when this handle is gone; it must not keep the
   // manager. An invalid manager calls nobody.
-  void setSizeListener(std::function<void(const std::string& identifier, std::uint32_t size)> listener);
+  void setSizeListener(std::shared_ptr<const SizeListener> listener);
 
   // Whether managers built from now on discard their directories as they start. One flag for the process, off at first
   // and never reset by the library.

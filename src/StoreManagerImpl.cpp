@@ -195,7 +195,7 @@ void StoreManagerImpl::onStoreSizeChanged(const std::string& identifier, unsigne
     listener = sizeListener_;
   }
   if (listener != nullptr) (*listener)(identifier, size);
-  if (maintenanceEnabled_) queue_->dispatch([self = shared_from_this()] { self->pruneStoresIfNecessary(); });
+  if (maintenanceEnabled_) checkLimitsSoon();
 }
 
 std::uint32_t StoreManagerImpl::sizeOf(const std::string& identifier) {
@@ -205,37 +205,42 @@ std::uint32_t StoreManagerImpl::sizeOf(const std::string& identifier) {
   return item->currentSize;
 }
 
-void StoreManagerImpl::setSizeListener(SizeListener listener) {
-  auto shared = listener ? std::make_shared<const SizeListener>(std::move(listener)) : nullptr;
+void StoreManagerImpl::setSizeListener(std::shared_ptr<const SizeListener> listener) {
   const std::lock_guard<std::mutex> lock(mutex_);
-  sizeListener_.swap(shared);
+  sizeListener_.swap(listener);
 }
 
 void StoreManagerImpl::pruneNow() {
-  if (maintenanceEnabled_) queue_->dispatch([self = shared_from_this()] { self->pruneStores(true); });
+  if (!maintenanceEnabled_) return;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    isRoundRequested_ = true;
+  }
+  checkLimitsSoon();
 }
 
-void StoreManagerImpl::pruneStoresIfNecessary() { pruneStores(false); }
+void StoreManagerImpl::checkLimitsSoon() {
+  queue_->dispatch([self = shared_from_this()] { self->pruneStoresIfNecessary(); });
+}
 
-void StoreManagerImpl::pruneStores(bool isRequested) {
+void StoreManagerImpl::pruneStoresIfNecessary() {
   // A store may finish at once, on this thread, and report back: no lock is held while it is asked.
-  for (const PruneRequest& request : beginPruneRound(isRequested)) startPruning(request);
+  for (const PruneRequest& request : beginPruneRound()) startPruning(request);
 }
 
 // Decides which stores to prune and marks them. From then on, if there are any, the round is in progress. One that was
 // requested waits neither for the interval nor for the manager's own limit.
-std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound(bool isRequested) {
+std::vector<StoreManagerImpl::PruneRequest> StoreManagerImpl::beginPruneRound() {
   const std::lock_guard<std::mutex> lock(mutex_);
   const StoreManagerDefinition& definition = common_.definition();
   // A store that is destroyed in the middle of its prune does not say so.
   if (pruneInProgress_) noteIfRoundIsOver(lock);
-  isRoundRequested_ = isRoundRequested_ || isRequested;
   if (!common_.isValid() || pruneInProgress_ || definition.pruneInterval == 0) return {};
-  const bool isDue = std::exchange(isRoundRequested_, false);
+  const bool isRequested = std::exchange(isRoundRequested_, false);
   const auto nextPruneTime = lastPruneTime_ + definition.pruneInterval;
-  if (!isDue && lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};
+  if (!isRequested && lastPruneTime_ != 0 && Clock::now() < nextPruneTime) return {};
   const bool survivalMode = isInSurvivalMode();
-  if (!isDue && totalSize_ <= definition.maxSize && !survivalMode) return {};
+  if (!isRequested && totalSize_ <= definition.maxSize && !survivalMode) return {};
 
   std::vector<PruneRequest> requests;
   for (const auto& [identifier, item] : common_.copyStoreMap()) {

@@ -32,6 +32,8 @@ class LazyDispatcher;
 // neither is held while a store is asked to prune.
 class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<StoreManagerImpl> {
  public:
+  using SizeListener = std::function<void(const std::string& identifier, std::uint32_t size)>;
+
   // Bytes. The figure they are compared with is the file system's total size, not what is available on it: they take
   // effect on very small file systems only.
   static constexpr std::int64_t kMinimumFreeSizeSurvivalMode = 104857600;  // below: survival mode
@@ -87,13 +89,13 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   // then.
   void onStoreSizeChanged(const std::string& identifier, unsigned int size);
 
-  // Starts a round of pruning, if it is time and there is need. At most one round is under way.
+  // Starts a round of pruning, if it is time and there is need, or it was requested. At most one round is under way.
   void pruneStoresIfNecessary();
 
   // As those of `StoreManager`.
   void pruneNow();
   std::uint32_t sizeOf(const std::string& identifier);
-  void setSizeListener(std::function<void(const std::string& identifier, std::uint32_t size)> listener);
+  void setSizeListener(std::shared_ptr<const SizeListener> listener);
 
   // Takes note that a store has finished pruning, well or not.
   void onStorePruneBackToNormalComplete(const std::string& identifier);
@@ -112,13 +114,12 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
 
  private:
   struct PruneRequest;
-  using SizeListener = std::function<void(const std::string& identifier, std::uint32_t size)>;
 
-  void pruneStores(bool isRequested);
   void measureNewUnmanagedStore(const std::string& identifier,
                                 const std::shared_ptr<const StoreDefinition>& definition);
   void createAllStores();
-  std::vector<PruneRequest> beginPruneRound(bool isRequested);
+  void checkLimitsSoon();
+  std::vector<PruneRequest> beginPruneRound();
   std::string whyFileSystemIsTooSmall();
   bool isInSurvivalMode() const;
   void noteIfRoundIsOver(const std::lock_guard<std::mutex>& lock);
@@ -128,7 +129,7 @@ class CELLAR_EXPORT StoreManagerImpl : public std::enable_shared_from_this<Store
   std::uint32_t totalSize_ = 0;
   std::int64_t lastPruneTime_ = 0;
   bool pruneInProgress_ = false;
-  bool isRoundRequested_ = false;  // by `pruneNow`, while another was under way
+  bool isRoundRequested_ = false;  // by `pruneNow`; it has not begun yet
   std::shared_ptr<const SizeListener> sizeListener_;
 
   std::recursive_mutex cleanupMutex_;  // held by a clean-up in the background, which may lead to an invalidation

@@ -171,9 +171,12 @@ TEST_F(StoreManagerPruneNow, DoesNothingOnceTheManagerIsInvalid) {
 
 TEST_F(StoreManagerPruneNow, ThrowsWhatTheQueueThrows) {
   build(kLarge);
+  report(*a_, 101);
   queues->queue(0)->throwOnDispatch(true);
   EXPECT_THROW(manager_->pruneNow(), std::runtime_error);
   queues->queue(0)->throwOnDispatch(false);
+  report(*b_, 1);  // the request stands
+  EXPECT_EQ(a_->pruneCount(), 1U);
 }
 
 // Sizes
@@ -193,9 +196,13 @@ TEST_F(StoreManagerPruneNow, ASizeIsWhatTheStoreReportedLast) {
 class SizeListener : public StoreManagerPruneNow {
  protected:
   void listen() {
-    manager_->setSizeListener([this](const string& identifier, std::uint32_t size) {
+    setListener([this](const string& identifier, std::uint32_t size) {
       told_.push_back(identifier + " " + std::to_string(size));
     });
+  }
+
+  void setListener(StoreManager::SizeListener listener) {
+    manager_->setSizeListener(std::make_shared<const StoreManager::SizeListener>(std::move(listener)));
   }
 
   std::vector<string> told_;
@@ -220,7 +227,7 @@ TEST_F(SizeListener, IsToldWithoutMaintenanceAndWithoutAnInterval) {
 TEST_F(SizeListener, ComesBeforeTheLimitsAreChecked) {
   build(0);
   std::size_t pruned = 1;
-  manager_->setSizeListener([&](const string&, std::uint32_t) { pruned = a_->pruneCount(); });
+  setListener([&](const string&, std::uint32_t) { pruned = a_->pruneCount(); });
   queues->queue(0)->onDispatch = [this] { settle(); };
   a_->reportSize(101);
   EXPECT_EQ(pruned, 0U);
@@ -230,7 +237,7 @@ TEST_F(SizeListener, ComesBeforeTheLimitsAreChecked) {
 TEST_F(SizeListener, MayUseTheManager) {
   build(kLarge);
   queues->queue(0)->onDispatch = [this] { settle(); };
-  manager_->setSizeListener([this](const string& identifier, std::uint32_t) {
+  setListener([this](const string& identifier, std::uint32_t) {
     told_.push_back(std::to_string(manager_->sizeOf(identifier)));
     manager_->setSizeListener(nullptr);
     manager_->pruneNow();
@@ -243,12 +250,12 @@ TEST_F(SizeListener, MayUseTheManager) {
 TEST_F(SizeListener, IsReplaced) {
   build(kLarge);
   const auto token = std::make_shared<int>(0);
-  manager_->setSizeListener([token](const string&, std::uint32_t) {});
+  setListener([token](const string&, std::uint32_t) {});
   EXPECT_EQ(token.use_count(), 2);
   listen();
   EXPECT_EQ(token.use_count(), 1);
   report(*a_, 7);
-  manager_->setSizeListener({});
+  manager_->setSizeListener(nullptr);
   report(*a_, 8);
   EXPECT_THAT(told_, ElementsAre("a 7"));
 }
@@ -279,8 +286,8 @@ TEST_F(SizeListener, IsReplacedWhileStoresReport) {
     });
   }
   for (int i = 0; i < 100; ++i) {
-    manager_->setSizeListener([&](const string&, std::uint32_t) { ++calls; });
-    manager_->setSizeListener({});
+    setListener([&](const string&, std::uint32_t) { ++calls; });
+    manager_->setSizeListener(nullptr);
   }
   for (std::thread& thread : threads) thread.join();
   const int before = calls;

@@ -28,8 +28,8 @@ bool exceedsByMoreThanATenth(std::uint64_t bytes, std::uint64_t limit) { return 
 void PromptPruning::begin(const std::shared_ptr<StoreManager>& manager, const StoreManagerDefinition& definition,
                           std::shared_ptr<AsyncExecutor> queue, std::chrono::seconds delay) {
   const auto pruning = std::make_shared<PromptPruning>(manager, definition, std::move(queue), delay);
-  manager->setSizeListener(
-      [pruning](const std::string& identifier, std::uint32_t bytes) { pruning->noteSize(identifier, bytes); });
+  manager->setSizeListener(std::make_shared<const StoreManager::SizeListener>(
+      [pruning](const std::string& identifier, std::uint32_t bytes) { pruning->noteSize(identifier, bytes); }));
   pruning->readSizes(*manager);
 }
 
