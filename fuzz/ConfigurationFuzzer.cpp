@@ -1,6 +1,7 @@
 // The configuration document against a second reading of it: the same documents are accepted with the same definitions,
 // and the same first fault is reported for the others.
 
+#include <array>
 #include <cstdint>
 #include <exception>
 #include <limits>
@@ -122,15 +123,18 @@ void readDiskCache(const Document& store, const StoreDefinition* actual) {
   const std::uint32_t survival = size(stringAt(store, "survival_size", "0MB"));
   const int factory =
       choiceAt(store, "metadata_factory", "null", {"null", "video_download"}, "factory", "null or video_download");
-  const int strategy = choiceAt(store, "prune_strategy", "null", {"lru", "null", "video_download"}, "prune",
-                                "null, lru or video_download");
+  const int strategy = choiceAt(store, "prune_strategy", "null", {"lru", "null", "video_download", "greedy_dual"},
+                                "prune", "null, lru or video_download");
+  constexpr std::array<PruneStrategyIdentifier, 4> kStrategies = {
+      PruneStrategyIdentifier::LRU, PruneStrategyIdentifier::Null, PruneStrategyIdentifier::VideoDownload,
+      PruneStrategyIdentifier::GreedyDual};
   if (actual == nullptr) return;
   const auto* definition = dynamic_cast<const DiskCacheDefinition*>(actual);
   check(definition != nullptr, "a disk cache is one");
   check(definition->inlineData == inlineData && definition->staleAge == staleAge && definition->lruSizeLimit == limit &&
             definition->maxSize == limit && definition->survivalSize == survival &&
             static_cast<int>(definition->metadataFactory) == factory &&
-            static_cast<int>(definition->pruneStrategy) == strategy,
+            definition->pruneStrategy == kStrategies[static_cast<std::size_t>(strategy)],
         "its values are the document's");
   check(definition->capacity == capacityOf(store), "its capacity is the document's");
   check(definition->isCache && definition->isManaged, "what its type fixes is fixed");

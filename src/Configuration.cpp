@@ -189,6 +189,7 @@ PruneStrategyIdentifier parsePruneStrategy(const string& text) {
   if (text == "null") return PruneStrategyIdentifier::Null;
   if (text == "lru") return PruneStrategyIdentifier::LRU;
   if (text == "video_download") return PruneStrategyIdentifier::VideoDownload;
+  if (text == "greedy_dual") return PruneStrategyIdentifier::GreedyDual;
   throw std::invalid_argument("Invalid prune '" + text + "', use null, lru or video_download.");
 }
 

@@ -84,6 +84,7 @@ void DiskCacheManifest::load() {
         if (time_ != nullptr) time_->noteDateOf(*record);
         record.reset();  // so that the two forms of all records are never in memory together
       }
+      records_->loaded();
       loaded_ = true;
     }
   }
@@ -178,6 +179,7 @@ void DiskCacheManifest::reload() {
       records_->store(*record);
       if (time_ != nullptr) time_->noteDateOf(*record);
     }
+    records_->loaded();
     loaded_ = true;
   }
   armFlushTimer();
@@ -286,9 +288,11 @@ void DiskCacheManifest::removeInlineData(const std::string& key) {
 std::vector<DiskCacheItem> DiskCacheManifest::pruneToSize(std::uint32_t size, std::uint32_t count) {
   const ItemsLock lock(itemsMutex_);
   if (!loaded_ || records_->totalSize() <= size) return {};
-  return prune(
+  auto removed = prune(
       lock, [&] { return records_->byStrategy(); }, count,
       [&](const ManifestRecord&) { return records_->totalSize() > size; });
+  if (size > 0) records_->evicted(removed);  // of a prune of everything there is nothing to learn
+  return removed;
 }
 
 std::vector<DiskCacheItem> DiskCacheManifest::pruneOldEntries(long date, std::uint32_t count) {

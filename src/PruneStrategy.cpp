@@ -51,6 +51,10 @@ int VideoDownloadPruneStrategy::VideoDownloadExtendedMetadataToPriority(
   return chunkSecond <= highPriorityVideoSecondCutoff ? highPriority : lowPriority;
 }
 
+bool GreedyDualPruneStrategy::compare(const DiskCacheItem* a, const DiskCacheItem* b) const {
+  return lessRecentlyUsed(*a, *b);
+}
+
 Comparator::Comparator(std::shared_ptr<PruneStrategyBase> strategy) : strategy_(std::move(strategy)) {
   if (strategy_ == nullptr) strategy_ = std::make_shared<LRUPruneStrategy>();
 }
@@ -63,6 +67,8 @@ std::shared_ptr<PruneStrategyBase> PruneStrategyFactory(PruneStrategyIdentifier 
       return std::make_shared<LRUPruneStrategy>();
     case PruneStrategyIdentifier::VideoDownload:
       return std::make_shared<VideoDownloadPruneStrategy>();
+    case PruneStrategyIdentifier::GreedyDual:
+      return std::make_shared<GreedyDualPruneStrategy>();
     case PruneStrategyIdentifier::Null:
       break;
   }

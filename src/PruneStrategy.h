@@ -54,6 +54,20 @@ class CELLAR_EXPORT VideoDownloadPruneStrategy : public PruneStrategyBase {
                                               const VideoDownloadExtendedMetadata::ItemType& itemType) const;
 };
 
+// The cache finds more requests when items are of different sizes: what is small and of a size whose items are asked
+// for again stays longer than what is large and of a size whose items are not. Each item has a priority, the level of
+// the cache plus 1 / sqrt(size), weighted by the share of uses among the fetches and evictions of the sizes between the
+// same two powers of two; eviction takes the lowest and lifts the level to it, so that what is not used ages. With
+// items of one size the order is that of least recent use. The cache learns the shares while it runs; after a restart
+// it starts with the access dates and sizes of its items.
+//
+// Two items alone do not show that order: to compare, this class is the same as LRUPruneStrategy. A class derived from
+// it is asked to compare.
+class CELLAR_EXPORT GreedyDualPruneStrategy : public PruneStrategyBase {
+ public:
+  bool compare(const DiskCacheItem* a, const DiskCacheItem* b) const override;
+};
+
 // A strategy as the ordering of items: called with two item pointers, true when the first is to be pruned before the
 // second. Copies share the strategy.
 class CELLAR_EXPORT Comparator {
@@ -67,8 +81,8 @@ class CELLAR_EXPORT Comparator {
   std::shared_ptr<PruneStrategyBase> strategy_;
 };
 
-// A new strategy for LRU and VideoDownload; empty for Null and every other number, which leaves the choice to the
-// caller.
+// A new strategy for LRU, VideoDownload and GreedyDual; empty for Null and every other number, which leaves the choice
+// to the caller.
 CELLAR_EXPORT std::shared_ptr<PruneStrategyBase> PruneStrategyFactory(PruneStrategyIdentifier identifier);
 
 }  // namespace velmora::mobile::xplat::cellar

@@ -23,7 +23,7 @@ struct StoreServices;
 enum class Area : int { Caches = 0, Documents = 1, Shared = 2 };
 
 // In which order a disk cache gives up its items. `Null` means "as the store's definition says".
-enum class PruneStrategyIdentifier : int { LRU = 0, Null = 1, VideoDownload = 2 };
+enum class PruneStrategyIdentifier : int { LRU = 0, Null = 1, VideoDownload = 2, GreedyDual = 16 };
 
 // What a disk cache remembers about an item beside its size and dates.
 enum class ExtendedMetadataFactoryIdentifier : int { Null = 0, VideoDownload = 1 };

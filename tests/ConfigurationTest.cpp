@@ -266,6 +266,7 @@ TEST(Configuration, ADiskCacheTakesItsValuesFromTheDocument) {
 TEST(Configuration, EachPruneStrategyAndFactoryHasItsText) {
   EXPECT_EQ(diskCache(R"(,"prune_strategy":"null")")->pruneStrategy, PruneStrategyIdentifier::Null);
   EXPECT_EQ(diskCache(R"(,"prune_strategy":"lru")")->pruneStrategy, PruneStrategyIdentifier::LRU);
+  EXPECT_EQ(diskCache(R"(,"prune_strategy":"greedy_dual")")->pruneStrategy, PruneStrategyIdentifier::GreedyDual);
   EXPECT_EQ(diskCache(R"(,"metadata_factory":"null")")->metadataFactory, ExtendedMetadataFactoryIdentifier::Null);
 }
 

@@ -204,6 +204,17 @@ TEST_F(VideoDownloadPruneStrategyTest, SumsBeyondTheRangeOfADateWrap) {
   EXPECT_TRUE(before(strategy, chunkUsedAt(0, 5), chunkUsedAt(-1, 500)));
 }
 
+TEST(GreedyDualPruneStrategy, ComparesTwoItemsByLastUse) {
+  DiskCacheItem older("small", "small", 1, false, 10, 20, nullptr);
+  DiskCacheItem newer("large", "large", 1 << 20, false, 5, 21, nullptr);
+  const GreedyDualPruneStrategy strategy;
+  EXPECT_TRUE(strategy.compare(&older, &newer));
+  EXPECT_FALSE(strategy.compare(&newer, &older));
+  newer.lastAccessDate = 20;
+  EXPECT_FALSE(strategy.compare(&older, &newer));
+  EXPECT_FALSE(strategy.compare(&newer, &older));
+}
+
 TEST(PruneStrategyBase, CannotBeDeletedThroughItsBase) {
   EXPECT_FALSE(std::is_destructible_v<PruneStrategyBase>);
   EXPECT_FALSE(std::has_virtual_destructor_v<PruneStrategyBase>);
@@ -237,6 +248,9 @@ TEST(PruneStrategyFactory, MakesTheStrategyOfAnIdentifier) {
   EXPECT_NE(std::dynamic_pointer_cast<VideoDownloadPruneStrategy>(
                 PruneStrategyFactory(PruneStrategyIdentifier::VideoDownload)),
             nullptr);
+  EXPECT_NE(
+      std::dynamic_pointer_cast<GreedyDualPruneStrategy>(PruneStrategyFactory(PruneStrategyIdentifier::GreedyDual)),
+      nullptr);
   EXPECT_NE(PruneStrategyFactory(static_cast<PruneStrategyIdentifier>(0)), nullptr);
   EXPECT_NE(PruneStrategyFactory(static_cast<PruneStrategyIdentifier>(2)), nullptr);
 }

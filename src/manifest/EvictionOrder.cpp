@@ -44,6 +44,14 @@ void EvictionOrder::changed(const ManifestRecord& record) {
   moveUp(record.*place_);
 }
 
+void EvictionOrder::moved(const ManifestRecord& record) {
+  const std::size_t place = record.*place_;
+  heap_[place].date = dateOf_(record);
+  heap_[place].turn = nextSequence_++;
+  moveUp(place);
+  moveDown(record.*place_);
+}
+
 void EvictionOrder::removed(const ManifestRecord& record) {
   const std::size_t place = record.*place_;
   const Entry last = heap_.back();

@@ -35,12 +35,19 @@ class EvictionOrder {
   void changed(const ManifestRecord& record);
   void removed(const ManifestRecord& record);
 
+  // To be called instead of `changed` where the record is to be the last of its date, whatever date it had.
+  void moved(const ManifestRecord& record);
+
   // The record's turn among those of its date; for one that was removed and has come back.
   std::uint32_t turnOf(const ManifestRecord& record) const { return heap_[record.*place_].turn; }
   void setTurn(const ManifestRecord& record, std::uint32_t turn);
 
   // To be called when other dates have become earlier as well.
   void allChanged();
+
+  template <class Action> void forEach(Action action) {
+    for (const Entry& entry : heap_) action(*entry.record);
+  }
 
   // Forgets all records.
   void clear() { std::vector<Entry>().swap(heap_); }

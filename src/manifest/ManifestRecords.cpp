@@ -64,8 +64,11 @@ template <class Strategy> bool isExactly(const PruneStrategyBase* strategy) {
 ManifestRecords::ManifestRecords(std::shared_ptr<PruneStrategyBase> strategy)
     : strategy_(std::move(strategy)),
       isVideoStrategy_(isExactly<VideoDownloadPruneStrategy>(strategy_.get())),
-      isOwnStrategy_(strategy_ != nullptr && !isVideoStrategy_ && !isExactly<LRUPruneStrategy>(strategy_.get())),
-      byAccessDate_(accessDateOf, &ManifestRecord::accessDateIndex) {}
+      isOwnStrategy_(strategy_ != nullptr && !isVideoStrategy_ && !isExactly<LRUPruneStrategy>(strategy_.get()) &&
+                     !isExactly<GreedyDualPruneStrategy>(strategy_.get())),
+      byAccessDate_(accessDateOf, &ManifestRecord::accessDateIndex),
+      byGreedyDual_(isExactly<GreedyDualPruneStrategy>(strategy_.get()) ? std::make_unique<GreedyDualOrder>()
+                                                                        : nullptr) {}
 
 std::vector<std::string> ManifestRecords::keys() const {
   std::vector<std::string> keys;
@@ -82,6 +85,7 @@ const ManifestRecord* ManifestRecords::find(const std::string& key) const {
 const ManifestRecord* ManifestRecords::store(const DiskCacheItem& item) {
   byAccessDate_.reserveOneMore();
   if (isVideoStrategy_) byVideoPriority_.reserveOneMore();
+  if (byGreedyDual_ != nullptr) byGreedyDual_->reserveOneMore();
   auto record = ManifestRecord::create(item);
   ManifestRecord& stored = *record;
   const auto old = records_.find(item.key);
@@ -97,6 +101,7 @@ const ManifestRecord* ManifestRecords::store(const DiskCacheItem& item) {
   totalSize_ += stored.size;
   byAccessDate_.added(stored);
   if (isVideoStrategy_) byVideoPriority_.added(stored);
+  if (byGreedyDual_ != nullptr) byGreedyDual_->added(stored);
   return &stored;
 }
 
@@ -105,6 +110,7 @@ void ManifestRecords::setLastAccessDate(const std::string& key, std::int32_t dat
   record.lastAccessDate = date;
   byAccessDate_.changed(record);
   if (isVideoStrategy_) byVideoPriority_.changed(record);
+  if (byGreedyDual_ != nullptr) byGreedyDual_->used(record);
 }
 
 void ManifestRecords::setHasInlineData(const std::string& key, bool hasInlineData) {
@@ -119,24 +125,31 @@ DiskCacheItem ManifestRecords::remove(const ManifestRecord& record) {
 }
 
 ManifestRecords::Copy ManifestRecords::copyOf(const ManifestRecord& record) const {
-  return {record.item(), byAccessDate_.turnOf(record), isVideoStrategy_ ? byVideoPriority_.turnOf(record) : 0};
+  const std::uint32_t turnByPriority = isVideoStrategy_           ? byVideoPriority_.turnOf(record)
+                                       : byGreedyDual_ != nullptr ? byGreedyDual_->turnOf(record)
+                                                                  : 0;
+  return {record.item(), byAccessDate_.turnOf(record), turnByPriority, record.priority};
 }
 
 void ManifestRecords::restore(const Copy& copy) {
-  const ManifestRecord* const record = store(copy.item);
-  byAccessDate_.setTurn(*record, copy.turnByAccessDate);
-  if (isVideoStrategy_) byVideoPriority_.setTurn(*record, copy.turnByPriority);
+  store(copy.item);
+  ManifestRecord& record = *records_.at(copy.item.key);
+  byAccessDate_.setTurn(record, copy.turnByAccessDate);
+  if (isVideoStrategy_) byVideoPriority_.setTurn(record, copy.turnByPriority);
+  if (byGreedyDual_ != nullptr) byGreedyDual_->restore(record, copy.priority, copy.turnByPriority);
 }
 
 void ManifestRecords::leaveOrders(const ManifestRecord& record) {
   totalSize_ -= record.size;
   byAccessDate_.removed(record);
   if (isVideoStrategy_) byVideoPriority_.removed(record);
+  if (byGreedyDual_ != nullptr) byGreedyDual_->removed(record);
 }
 
 void ManifestRecords::clear() {
   byAccessDate_.clear();
   byVideoPriority_.clear();
+  if (byGreedyDual_ != nullptr) byGreedyDual_->clear();
   records_.clear();
   totalSize_ = 0;
 }
@@ -145,13 +158,26 @@ void ManifestRecords::reserve(std::size_t count) {
   records_.reserve(count);
   byAccessDate_.reserve(count);
   if (isVideoStrategy_) byVideoPriority_.reserve(count);
+  if (byGreedyDual_ != nullptr) byGreedyDual_->reserve(count);
 }
 
 ManifestRecords::Next ManifestRecords::leastRecentlyUsed() {
   return [this] { return byAccessDate_.first(); };
 }
 
+void ManifestRecords::evicted(const std::vector<DiskCacheItem>& items) {
+  if (byGreedyDual_ != nullptr) byGreedyDual_->evicted(items);
+}
+
+void ManifestRecords::loaded() {
+  if (byGreedyDual_ != nullptr) byGreedyDual_->arrange();
+}
+
 ManifestRecords::Next ManifestRecords::byStrategy() {
+  if (byGreedyDual_ != nullptr) {
+    byGreedyDual_->begin();
+    return [this] { return byGreedyDual_->first(); };
+  }
   using Basis = VideoEvictionOrder::Basis;
   const Basis basis = isVideoStrategy_ ? byVideoPriority_.basis(records_.size())
                       : isOwnStrategy_ ? Basis::Comparison

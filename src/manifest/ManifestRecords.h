@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "manifest/EvictionOrder.h"
+#include "manifest/GreedyDualOrder.h"
 #include "manifest/VideoEvictionOrder.h"
 
 namespace velmora::mobile::xplat::cellar {
@@ -46,6 +47,7 @@ class ManifestRecords {
     DiskCacheItem item;
     std::uint32_t turnByAccessDate;
     std::uint32_t turnByPriority;
+    std::int32_t priority;
   };
   Copy copyOf(const ManifestRecord& record) const;
   void restore(const Copy& copy);
@@ -56,6 +58,11 @@ class ManifestRecords {
   // Of those stored with the same access date and not used since, those first that were stored first.
   Next leastRecentlyUsed();
   Next byStrategy();
+
+  // To be called when a prune by strategy has come about and left room for items, and when all records of the medium
+  // are here.
+  void evicted(const std::vector<DiskCacheItem>& items);
+  void loaded();
 
  private:
   using Map = std::unordered_map<std::string_view, ManifestRecord::Owner>;
@@ -68,7 +75,8 @@ class ManifestRecords {
   const bool isOwnStrategy_;  // a host's own class, derived from ours or not, which can only be asked
   Map records_;
   EvictionOrder byAccessDate_;
-  VideoEvictionOrder byVideoPriority_;  // kept with the video strategy only
+  VideoEvictionOrder byVideoPriority_;                   // kept with the video strategy only
+  const std::unique_ptr<GreedyDualOrder> byGreedyDual_;  // null with every other strategy
   std::uint32_t totalSize_ = 0;
 };
 

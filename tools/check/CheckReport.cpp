@@ -19,6 +19,8 @@ const char* strategyName(PruneStrategyIdentifier strategy) {
       return "lru";
     case PruneStrategyIdentifier::VideoDownload:
       return "video_download";
+    case PruneStrategyIdentifier::GreedyDual:
+      return "greedy_dual";
     case PruneStrategyIdentifier::Null:
       break;
   }
