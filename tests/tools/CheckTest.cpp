@@ -201,6 +201,10 @@ TEST(CheckWarnings, TheVideoStrategyWithoutItsMetadataIsNamed) {
   EXPECT_THAT(ofCache(R"("prune_strategy": "video_download", "metadata_factory": "video_download")"), IsEmpty());
 }
 
+TEST(CheckWarnings, TheGreedyDualStrategyNeedsNothingElse) {
+  EXPECT_THAT(ofCache(R"("prune_strategy": "greedy_dual")"), IsEmpty());
+}
+
 TEST(CheckWarnings, CachesThatTogetherExceedTheirManagersLimitAreNamed) {
   const std::string stores = R"("stores": {"a": {"type": "disk_cache", "lru_size_limit": "6MB"},
       "b": {"type": "unmanaged", "is_cache": true, "max_size": "4MB"}, "c": {"type": "unmanaged", "max_size": "9MB"}})";
