@@ -29,8 +29,10 @@ void EvictionOrder::reserveOneMore() {
   if (heap_.size() == heap_.capacity()) heap_.reserve(heap_.size() + heap_.size() / 4 + kChildren);
 }
 
-void EvictionOrder::added(ManifestRecord& record) {
-  heap_.push_back({dateOf_(record), nextSequence_++, &record});
+void EvictionOrder::added(ManifestRecord& record) { added(record, dateOf_(record)); }
+
+void EvictionOrder::added(ManifestRecord& record, std::int32_t date) {
+  heap_.push_back({date, nextSequence_++, &record});
   moveUp(heap_.size() - 1);
 }
 
@@ -44,9 +46,9 @@ void EvictionOrder::changed(const ManifestRecord& record) {
   moveUp(record.*place_);
 }
 
-void EvictionOrder::moved(const ManifestRecord& record) {
+void EvictionOrder::moved(const ManifestRecord& record, std::int32_t date) {
   const std::size_t place = record.*place_;
-  heap_[place].date = dateOf_(record);
+  heap_[place].date = date;
   heap_[place].turn = nextSequence_++;
   moveUp(place);
   moveDown(record.*place_);
@@ -70,6 +72,10 @@ void EvictionOrder::setTurn(const ManifestRecord& record, std::uint32_t turn) {
 
 void EvictionOrder::allChanged() {
   for (Entry& entry : heap_) entry.date = dateOf_(*entry.record);
+  rebuild();
+}
+
+void EvictionOrder::rebuild() {
   if (heap_.size() < 2) return;
   for (std::size_t place = parentOf(heap_.size() - 1) + 1; place-- > 0;) moveDown(place);
 }

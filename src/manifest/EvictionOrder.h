@@ -35,9 +35,6 @@ class EvictionOrder {
   void changed(const ManifestRecord& record);
   void removed(const ManifestRecord& record);
 
-  // To be called instead of `changed` where the record is to be the last of its date, whatever date it had.
-  void moved(const ManifestRecord& record);
-
   // The record's turn among those of its date; for one that was removed and has come back.
   std::uint32_t turnOf(const ManifestRecord& record) const { return heap_[record.*place_].turn; }
   void setTurn(const ManifestRecord& record, std::uint32_t turn);
@@ -45,7 +42,16 @@ class EvictionOrder {
   // To be called when other dates have become earlier as well.
   void allChanged();
 
-  template <class Action> void forEach(Action action) {
+  // For an order whose dates are given to it, and whose records themselves have one that is never later: a record is
+  // added with its date, or put behind all others of another date; all get other dates, and keep their turns.
+  void added(ManifestRecord& record, std::int32_t date);
+  void moved(const ManifestRecord& record, std::int32_t date);
+  std::int32_t givenDateOf(const ManifestRecord& record) const { return heap_[record.*place_].date; }
+  template <class NewDate> void changeAll(NewDate newDate) {
+    for (Entry& entry : heap_) entry.date = newDate(*entry.record, entry.date);
+    rebuild();
+  }
+  template <class Action> void forEach(Action action) const {
     for (const Entry& entry : heap_) action(*entry.record);
   }
 
@@ -60,6 +66,7 @@ class EvictionOrder {
   };
 
   static bool isBefore(const Entry& a, const Entry& b);
+  void rebuild();
   void put(std::size_t place, const Entry& entry);
   void moveUp(std::size_t place);
   void moveDown(std::size_t place);

@@ -17,20 +17,16 @@ constexpr std::int32_t kHighestLevel = 1 << 30;  // the highest worth, of one by
 
 }  // namespace
 
-void GreedyDualOrder::added(ManifestRecord& record) {
-  record.priority = level_ + worthOf(record.size);
-  order_.added(record);
-}
+void GreedyDualOrder::added(ManifestRecord& record) { order_.added(record, level_ + worthOf(record.size)); }
 
-void GreedyDualOrder::used(ManifestRecord& record) {
+void GreedyDualOrder::used(const ManifestRecord& record) {
   learn(record.size, &Outcomes::uses);
-  record.priority = level_ + worthOf(record.size);
-  order_.moved(record);
+  order_.moved(record, level_ + worthOf(record.size));
 }
 
 void GreedyDualOrder::removed(const ManifestRecord& record) {
+  if (&record == std::exchange(offered_, nullptr)) reached_ = std::max(reached_, priorityOf(record));
   order_.removed(record);
-  if (&record == std::exchange(offered_, nullptr)) reached_ = std::max(reached_, record.priority);
 }
 
 void GreedyDualOrder::begin() {
@@ -45,9 +41,8 @@ void GreedyDualOrder::evicted(const std::vector<DiskCacheItem>& items) {
   for (const DiskCacheItem& item : items) learn(item.size, &Outcomes::evictions);
 }
 
-void GreedyDualOrder::restore(ManifestRecord& record, std::int32_t priority, std::uint32_t turn) {
-  record.priority = priority;
-  order_.moved(record);
+void GreedyDualOrder::restore(const ManifestRecord& record, std::int32_t priority, std::uint32_t turn) {
+  order_.moved(record, priority);
   order_.setTurn(record, turn);
 }
 
@@ -70,10 +65,10 @@ void GreedyDualOrder::arrange() {
   const auto levelAt = [&](std::int64_t date) {
     return static_cast<std::int32_t>(rise * static_cast<double>(date - oldest));
   };
-  order_.forEach(
-      [&](ManifestRecord& record) { record.priority = levelAt(record.lastAccessDate) + worthOf(record.size); });
+  order_.changeAll([&](const ManifestRecord& record, std::int32_t /*former*/) {
+    return levelAt(record.lastAccessDate) + worthOf(record.size);
+  });
   level_ = levelAt(newest);
-  order_.allChanged();
 }
 
 void GreedyDualOrder::clear() {
@@ -116,8 +111,7 @@ std::int32_t GreedyDualOrder::worthOf(std::uint32_t size) const {
 
 // Before priorities leave their range.
 void GreedyDualOrder::lowerAll() {
-  order_.forEach([this](ManifestRecord& record) { record.priority -= level_; });
-  order_.allChanged();
+  order_.changeAll([this](const ManifestRecord& /*record*/, std::int32_t priority) { return priority - level_; });
   level_ = 0;
 }
 

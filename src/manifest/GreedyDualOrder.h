@@ -3,6 +3,7 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <limits>
 #include <vector>
 
 #include "manifest/EvictionOrder.h"
@@ -19,10 +20,11 @@ class GreedyDualOrder {
   void reserveOneMore() { order_.reserveOneMore(); }
   void added(ManifestRecord& record);
   void removed(const ManifestRecord& record);
+  std::int32_t priorityOf(const ManifestRecord& record) const { return order_.givenDateOf(record); }
   std::uint32_t turnOf(const ManifestRecord& record) const { return order_.turnOf(record); }
 
   // To be called after a record was found.
-  void used(ManifestRecord& record);
+  void used(const ManifestRecord& record);
 
   // To be called before a prune.
   void begin();
@@ -34,7 +36,7 @@ class GreedyDualOrder {
   void evicted(const std::vector<DiskCacheItem>& items);
 
   // For a record that was removed and has come back.
-  void restore(ManifestRecord& record, std::int32_t priority, std::uint32_t turn);
+  void restore(const ManifestRecord& record, std::int32_t priority, std::uint32_t turn);
 
   // Gives all records the priorities that their dates of use suggest, as when they have been read after a start.
   void arrange();
@@ -49,14 +51,14 @@ class GreedyDualOrder {
     std::uint32_t evictions = 0;
   };
 
-  static std::int32_t priorityOf(const ManifestRecord& record) { return record.priority; }
+  static std::int32_t never(const ManifestRecord& /*record*/) { return std::numeric_limits<std::int32_t>::min(); }
   static std::size_t classOf(std::uint32_t size);
   void learn(std::uint32_t size, std::uint32_t Outcomes::*outcome);
   double weightOf(const Outcomes& outcomes) const;
   std::int32_t worthOf(std::uint32_t size) const;
   void lowerAll();
 
-  EvictionOrder order_ = {priorityOf, &ManifestRecord::priorityIndex};
+  EvictionOrder order_ = {never, &ManifestRecord::priorityIndex};  // with priorities as dates
   std::array<Outcomes, 32> outcomes_ = {};
   Outcomes total_;
   std::int32_t level_ = 0;

@@ -36,7 +36,6 @@ class ManifestRecord {
   std::uint32_t size = 0;
   std::int32_t modificationDate = 0;
   std::int32_t lastAccessDate = 0;
-  std::int32_t priority = 0;  // kept by the greedy-dual order
   std::shared_ptr<DiskCacheItem::ExtendedMetadata> extendedMetadata;
 
   std::uint32_t accessDateIndex = 0;  // kept by the two orders of eviction

@@ -128,12 +128,12 @@ ManifestRecords::Copy ManifestRecords::copyOf(const ManifestRecord& record) cons
   const std::uint32_t turnByPriority = isVideoStrategy_           ? byVideoPriority_.turnOf(record)
                                        : byGreedyDual_ != nullptr ? byGreedyDual_->turnOf(record)
                                                                   : 0;
-  return {record.item(), byAccessDate_.turnOf(record), turnByPriority, record.priority};
+  return {record.item(), byAccessDate_.turnOf(record), turnByPriority,
+          byGreedyDual_ != nullptr ? byGreedyDual_->priorityOf(record) : 0};
 }
 
 void ManifestRecords::restore(const Copy& copy) {
-  store(copy.item);
-  ManifestRecord& record = *records_.at(copy.item.key);
+  const ManifestRecord& record = *store(copy.item);
   byAccessDate_.setTurn(record, copy.turnByAccessDate);
   if (isVideoStrategy_) byVideoPriority_.setTurn(record, copy.turnByPriority);
   if (byGreedyDual_ != nullptr) byGreedyDual_->restore(record, copy.priority, copy.turnByPriority);
