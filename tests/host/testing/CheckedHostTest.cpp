@@ -87,8 +87,7 @@ class SwitchingQueue : public PassingQueue {
   const std::shared_ptr<AsyncExecutor> other_;
 };
 
-// The first fetch is in the midst of its callback, on a queue of the store, while the second one runs on another
-// thread.
+// The first fetch is in the midst of its loader, on a queue of the store, while the second one runs on another thread.
 TEST(CheckedHost, APoolThatIsNotSerialIsReported) {
   const TemporaryDirectory directory;
   const auto checked = std::make_shared<CheckedQueues>(std::make_shared<FactoryOf<SwitchingQueue>>());
@@ -103,10 +102,12 @@ TEST(CheckedHost, APoolThatIsNotSerialIsReported) {
 
   Latch begun(1);
   Latch end(1);
-  letters->fetch("key").then(nullptr, [&](auto& /*found*/) {
+  const PersistentKeyValueStore::Loader loader = [&](auto&&...) {
     begun.countDown();
     end.wait();
-  });
+    return true;
+  };
+  const auto first = letters->fetch("key", loader);
   begun.wait();
   SwitchingQueue::isSwitched() = true;
   EXPECT_NE(host::await(letters->fetch("key")), nullptr);
@@ -114,6 +115,7 @@ TEST(CheckedHost, APoolThatIsNotSerialIsReported) {
               Contains(ContainsRegex("(File|Work) queue [0-9]+: task [0-9]+ began before task [0-9]+ had ended, on "
                                      "another thread. Tasks of a queue run one at a time.")));
   end.countDown();
+  EXPECT_NE(host::await(first), nullptr);
   host.logOut();
 }
 
