@@ -82,8 +82,7 @@ void UnmanagedMeasuring::startTimer(const std::string& path, Cache& cache, const
 
 void UnmanagedMeasuring::forgetEnded(const Lock& /*lock*/) {
   for (auto cache = caches_.begin(); cache != caches_.end();) {
-    const bool hasEnded = cache->second.store.expired() && !cache->second.isScheduled;
-    cache = hasEnded ? caches_.erase(cache) : std::next(cache);
+    cache = cache->second.store.expired() ? caches_.erase(cache) : std::next(cache);
   }
 }
 
@@ -111,7 +110,6 @@ std::shared_ptr<UnmanagedStore> UnmanagedMeasuring::takeDue(const std::string& p
 }
 
 std::optional<std::uint64_t> UnmanagedMeasuring::measure(const std::string& path) const {
-  if (!services_.files->isDirectory(path)) return std::nullopt;  // discarded, or removed by the application
   try {
     const auto stats = calculator_->traverseDirectory(path, {}, {AttributeStore::fileName});
     keep(path, stats);

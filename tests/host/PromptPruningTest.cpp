@@ -148,6 +148,17 @@ class PromptPruning : public testing::Test {
     return count;
   }
 
+  std::size_t everArmed() const {
+    std::size_t count = 0;
+    for (const auto& queue : queues->all()) {
+      const auto timers = queue->timers();
+      count += static_cast<std::size_t>(std::count_if(timers.begin(), timers.end(), [](const test::TimerInfo& timer) {
+        return timer.delayNanoseconds == kDelayNanoseconds;
+      }));
+    }
+    return count;
+  }
+
   // False if none runs.
   bool fire() {
     const auto all = queues->all();
@@ -275,8 +286,10 @@ TEST_F(PromptPruning, RunsOneTimerHoweverMuchIsWritten) {
   start();
   useUpTheFirstRound();
   const auto thumbs = open("thumbs");
+  const std::size_t before = everArmed();
   for (int i = 0; i < 20; ++i) store(*thumbs, std::to_string(i), 1000);
   EXPECT_EQ(armed(), 1U);
+  EXPECT_EQ(everArmed(), before + 1);  // it is not put off by further writes
   fire();
   EXPECT_EQ(sizeOf("thumbs"), 1000U);
   EXPECT_THAT(pruned(), SizeIs(1));

@@ -336,6 +336,30 @@ TEST_F(UnmanagedMeasuringTest, ReportsNothingForAStoreWhoseDirectoryIsAnothersMe
   EXPECT_THAT(incidents.take(), SizeIs(1));
 }
 
+TEST_F(UnmanagedMeasuringTest, CancelsTheTimersOfStoresThatHaveEndedForTheNextOne) {
+  open();
+  request();
+  store = nullptr;
+  const auto definition = std::make_shared<UnmanagedStoreDefinition>("other", "media", false, false, 1, 1000, true);
+  store = std::make_shared<UnmanagedStore>(directory.makeDirectory("other"), definition);
+  request();
+  EXPECT_THAT(queue->armedDelays(), SizeIs(1));
+  EXPECT_THAT(queue->timers(), SizeIs(2));
+}
+
+TEST_F(UnmanagedMeasuringTest, ReportsADirectoryThatIsFilledAgain) {
+  open();
+  const auto held = store;
+  request();
+  write("file", 1001);
+  fire();
+  std::filesystem::remove_all(store->path);
+  fire();
+  write("file", 1002);
+  fire();
+  EXPECT_THAT(incidents.take(), ElementsAre(overLimit(1001), overLimit(1002)));
+}
+
 TEST_F(UnmanagedMeasuringTest, ForgetsStoresThatHaveEnded) {
   for (int i = 0; i < 3; ++i) {
     open();
@@ -370,6 +394,16 @@ TEST_F(UnmanagedMeasuringTest, RestsAlsoWhenTheCacheIsRequestedAnew) {
   measuringTakes(std::chrono::seconds(2));
   fire();
   EXPECT_THAT(queue->armedDelays(), IsEmpty());
+  request();
+  EXPECT_THAT(queue->armedDelays(), ElementsAre(200 * kSecond));
+}
+
+TEST_F(UnmanagedMeasuringTest, RestsAlsoWhenTheDirectoryIsAnotherStores) {
+  open();
+  request();
+  measuringTakes(std::chrono::seconds(2));
+  fire();
+  open();
   request();
   EXPECT_THAT(queue->armedDelays(), ElementsAre(200 * kSecond));
 }
