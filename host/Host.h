@@ -73,9 +73,10 @@ struct HostOptions {
   std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for accepted work
 
   // With `Promptly` a manager prunes `pruneDelay` after a limit has been exceeded by more than a tenth, if it still is:
-  // its own limit or that of a disk cache, the configured one. So a cache has at most 1.1 times its limit and what is
-  // written in this time. It then prunes each disk cache that is over its own limit. `pruneDelay` is also the least
-  // time between two such prunes of a manager; less than 1 second counts as 1. No timer runs while the limits are kept.
+  // its own limit or that of a disk cache, the configured one. It then prunes each disk cache that is over its own
+  // limit. So a cache has little more than 1.1 times its limit and what is written in this time. `pruneDelay` is also
+  // the least time between two such prunes of a manager; less than 1 second counts as 1. No timer runs while the limits
+  // are kept. A store tells its size with each write, and five minutes after it was opened.
   //
   // Only with maintenance, for managers that prune at all (`prune_interval` is not 0), and as long as the host or
   // somebody else has a handle on the manager.
