@@ -387,9 +387,10 @@ TEST_F(StoreManagerTest, TypedAccessAsAnotherTypeNamesTheStoreAndBothTypes) {
     manager_->getStore<FakeStore>("id");
     FAIL();
   } catch (const std::logic_error& error) {
-    EXPECT_STREQ(error.what(),
-                 "Store 'id' is a velmora::mobile::xplat::cellar::UnmanagedStore, "
-                 "not a velmora::mobile::xplat::cellar::test::FakeStore.");
+    EXPECT_STREQ(
+        error.what(),
+        "Store 'id' is a velmora::mobile::xplat::cellar::UnmanagedStore, "
+        "not a velmora::mobile::xplat::cellar::test::FakeStore. Ask for the class that belongs to its \"type\".");
   }
   EXPECT_NE(manager_->getStore<UnmanagedStore>("id"), nullptr);
 }
