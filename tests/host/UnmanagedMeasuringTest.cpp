@@ -252,7 +252,7 @@ TEST_F(UnmanagedMeasuringTest, SaysNothingOfADirectoryThatIsGone) {
   request();
   std::filesystem::remove_all(store->path);
   fire();
-  files->onCall = [this](Operation operation, const string& path) {
+  files->onCall = [](Operation operation, const string& path) {
     if (operation == Operation::ListDirectory) std::filesystem::remove_all(path);
   };
   write("file", 2000);
