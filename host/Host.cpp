@@ -79,7 +79,13 @@ std::unique_ptr<const RootLock> lockRoot(const HostOptions& options, FileUtils& 
 }
 
 std::string nameOfSession(const std::string& sessionKey) {
-  return sessionKey.empty() ? sessionKey : encodeFileName(sessionKey);
+  if (sessionKey.empty()) return sessionKey;
+  try {
+    return encodeFileName(sessionKey);
+  } catch (const std::length_error&) {  // its text has the key, which may be secret
+    throw std::length_error("A session's key of " + std::to_string(sessionKey.size()) +
+                            " bytes would be too long for a file name. Set a session tag mapper.");
+  }
 }
 
 std::shared_ptr<AnalyticsEventReporter> reporterFor(std::unique_ptr<XAnalytics> sink) {
@@ -144,8 +150,11 @@ Host::Host(const std::string& configuration, const std::string& root) : Host(pla
 // Null: never.
 std::shared_ptr<UnmanagedMeasuring> Host::measuringEvery(std::chrono::seconds interval) const {
   if (interval <= std::chrono::seconds(0)) return nullptr;
-  const UnmanagedMeasuring::Services services{measuringQueue_, fileUtils_, attributes_, sizes_, incidents_};
-  return std::make_shared<UnmanagedMeasuring>(interval, services);
+  UnmanagedMeasuring::Services services{measuringQueue_, fileUtils_, attributes_, sizes_, incidents_};
+  services.onMeasured = [sizes = measuredSizes_](const std::string& path, const DiskSizeCalculator::Stats& stats) {
+    sizes->noteMeasured(path, stats);
+  };
+  return std::make_shared<UnmanagedMeasuring>(interval, std::move(services));
 }
 
 Host::~Host() {

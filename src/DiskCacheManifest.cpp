@@ -291,7 +291,7 @@ std::vector<DiskCacheItem> DiskCacheManifest::pruneToSize(std::uint32_t size, st
   auto removed = prune(
       lock, [&] { return records_->byStrategy(); }, count,
       [&](const ManifestRecord&) { return records_->totalSize() > size; });
-  if (size > 0) records_->evicted(removed);  // of a prune of everything there is nothing to learn
+  if (size > 0 && !removed.empty()) records_->evicted(removed);  // of a prune of everything there is nothing to learn
   return removed;
 }
 

@@ -144,7 +144,7 @@ class CELLAR_EXPORT DiskCacheDefinition : public StoreDefinition {
   const std::uint32_t lruSizeLimit;            // bytes that a normal prune leaves
   const std::uint32_t survivalSize;            // bytes that a prune leaves when the device is short of space
   const ExtendedMetadataFactoryIdentifier metadataFactory;
-  const PruneStrategyIdentifier pruneStrategy;
+  const PruneStrategyIdentifier pruneStrategy;  // GreedyDual: whatever strategy the store is asked for with
   const Durability durability;
 };
 

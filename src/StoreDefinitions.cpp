@@ -95,8 +95,10 @@ std::shared_ptr<Store> DiskCacheDefinition::createStore(const std::string& store
   options.normalSize = lruSizeLimit;
   options.survivalSize = survivalSize;
   options.extendedMetadataFactory = ExtendedMetadataFactoryFactory(metadataFactory);
+  // A cache that a manager creates in the background, before anybody asks for it, is asked for with LRU.
+  const bool isFixed = pruneStrategy == PruneStrategyIdentifier::GreedyDual;
   options.pruneStrategy = PruneStrategyFactory(
-      pruneStrategyOverride == PruneStrategyIdentifier::Null ? pruneStrategy : pruneStrategyOverride);
+      isFixed || pruneStrategyOverride == PruneStrategyIdentifier::Null ? pruneStrategy : pruneStrategyOverride);
   return DiskCache::create(options, services);
 }
 

@@ -1,6 +1,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
@@ -222,6 +223,46 @@ TEST_F(GreedyDualManifest, PrunesInBatchesAsItDoesAtOnce) {
   std::vector<std::string> atOnce;
   for (const DiskCacheItem& item : other->pruneToSize(1000, 1000)) atOnce.push_back(item.key);
   EXPECT_EQ(inBatches, atOnce);
+}
+
+// Of one size the order is that of least recent use, after a restart too: not that of the keys, in which they are read.
+TEST_F(GreedyDualManifest, StartsInTheOrderOfUseAmongItemsOfOneSize) {
+  std::vector<std::string> keys;
+  for (int i = 0; i < 500; ++i) {
+    keys.push_back(std::to_string(i * 7919 % 500));
+    put(keys.back(), 1 << 20);
+    date += 3600;
+  }
+  manifest = make(medium);
+  EXPECT_EQ(prune(0), keys);
+}
+
+TEST_F(GreedyDualManifest, StartsInTheOrderOfUseThoughAClockWasWrongForAWhile) {
+  std::vector<std::string> keys;
+  const auto putAt = [&](std::int32_t when, std::uint32_t size) {
+    keys.push_back(std::to_string(keys.size() * 7919 % 500));
+    date = when;
+    put(keys.back(), size);
+  };
+  putAt(0, 1 << 20);
+  for (int i = 0; i < 300; ++i) putAt(1'000'000 + 3600 * i, 1 << 20);
+  putAt(2'000'000'000, 1 << 20);
+  manifest = make(medium);
+  put("large", 4 << 20);  // worth half as much: goes before what was used last, behind what was used long ago
+  const auto evicted = prune(0);
+  const auto large = std::find(evicted.begin(), evicted.end(), "large") - evicted.begin();
+  EXPECT_THAT(large, AllOf(Ge(1), Le(300)));
+  EXPECT_EQ(evicted.front(), keys.front());
+  EXPECT_EQ(evicted.size(), keys.size() + 1);
+}
+
+TEST_F(GreedyDualManifest, LearnsNothingFromAPruneOfNoItems) {
+  for (int i = 0; i < 50; ++i) put("old" + std::to_string(i), 1000);
+  manifest = make(medium);
+  date += 3600;
+  EXPECT_THAT(prune(1, 0), IsEmpty());
+  put("new", 1000);
+  EXPECT_EQ(prune(0).back(), "new");
 }
 
 TEST_F(GreedyDualManifest, StartsWithNothing) { EXPECT_THAT(prune(0), IsEmpty()); }

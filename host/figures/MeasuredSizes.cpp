@@ -35,12 +35,14 @@ long long MeasuredSizes::fetchDirectorySize(const std::string& path) {
 // All zeros, the time too, say that it has failed.
 DiskSizeCalculator::Stats MeasuredSizes::calculateDirectorySize(const std::string& path) {
   const Stats stats = DiskSizeCalculator::calculateDirectorySize(path);
-  const bool isKnown = stats.valid || stats.timeSpent > 0;
-  const auto figures = figuresOf(path);
-  if (figures != nullptr && isKnown && stats.size >= 0) {
-    figures->noteMeasured(static_cast<std::uint64_t>(stats.size), static_cast<std::uint64_t>(stats.fileCount));
-  }
+  if (stats.valid || stats.timeSpent > 0) noteMeasured(path, stats);
   return stats;
+}
+
+void MeasuredSizes::noteMeasured(const std::string& path, const Stats& stats) {
+  const auto figures = figuresOf(path);
+  if (figures == nullptr || stats.size < 0) return;
+  figures->noteMeasured(static_cast<std::uint64_t>(stats.size), static_cast<std::uint64_t>(stats.fileCount));
 }
 
 }  // namespace velmora::mobile::xplat::cellar::host

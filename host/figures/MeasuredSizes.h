@@ -20,6 +20,9 @@ class MeasuredSizes final : public DiskSizeCalculator {
   // From now on, in place of whoever has been watching that directory.
   void watch(const std::string& path, const std::shared_ptr<StoreFigures>& figures);
 
+  // Of a directory that somebody else has measured.
+  void noteMeasured(const std::string& path, const Stats& stats);
+
   long long fetchDirectorySize(const std::string& path) override;
   Stats calculateDirectorySize(const std::string& path) override;
 

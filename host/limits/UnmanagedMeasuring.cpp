@@ -3,6 +3,7 @@
 #include <glog/logging.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <exception>
 #include <iterator>
 #include <utility>
@@ -11,6 +12,7 @@
 #include "FileUtils.h"
 #include "Incident.h"
 #include "JsonValue.h"
+#include "LarderException.h"
 #include "Store.h"
 #include "StoreDefinition.h"
 #include "StoreManagerImplCommon.h"
@@ -93,8 +95,10 @@ void UnmanagedMeasuring::measureDue(const std::string& path) {
   const std::weak_ptr<UnmanagedStore> measured = store;
   store.reset();  // it would count as held
   const auto start = now_();
-  const auto bytes = measure(path);
-  if (noteMeasured(path, measured, now_() - start, bytes)) report(*definition, *bytes);
+  const auto stats = measure(path);
+  const auto duration = now_() - start;
+  if (stats && isPresent(path, measured)) keep(path, *stats);
+  if (noteMeasured(path, measured, duration, stats)) report(*definition, static_cast<std::uint64_t>(stats->size));
 }
 
 // Null when the cache's manager has ended.
@@ -109,37 +113,54 @@ std::shared_ptr<UnmanagedStore> UnmanagedMeasuring::takeDue(const std::string& p
   return store;
 }
 
-std::optional<std::uint64_t> UnmanagedMeasuring::measure(const std::string& path) const {
+std::optional<DiskSizeCalculator::Stats> UnmanagedMeasuring::measure(const std::string& path) const {
   try {
-    const auto stats = calculator_->traverseDirectory(path, {}, {AttributeStore::fileName});
-    keep(path, stats);
-    return static_cast<std::uint64_t>(stats.size);
+    return calculator_->traverseDirectory(path, {}, {AttributeStore::fileName});
+  } catch (const FileUtilsIoException& error) {
+    if (error.code() == ENOENT) return std::nullopt;  // the directory was discarded meanwhile
+    LOG(ERROR) << "Cannot measure an unmanaged cache. " << error.what();
   } catch (const std::exception& error) {
-    // Not when the directory was discarded meanwhile.
-    if (services_.files->pathExists(path)) LOG(ERROR) << "Cannot measure an unmanaged cache. " << error.what();
-    return std::nullopt;
+    LOG(ERROR) << "Cannot measure an unmanaged cache. " << error.what();
+  } catch (...) {
+    LOG(ERROR) << "Cannot measure an unmanaged cache: unknown exception";
   }
+  return std::nullopt;
+}
+
+// Not another session's, which may have the same path by now.
+bool UnmanagedMeasuring::isPresent(const std::string& path, const std::weak_ptr<UnmanagedStore>& store) {
+  const Lock lock(mutex_);
+  const auto present = caches_[path].store.lock();
+  return present != nullptr && present == store.lock();
 }
 
 void UnmanagedMeasuring::keep(const std::string& path, const DiskSizeCalculator::Stats& stats) const {
-  if (services_.sizes->fetchDirectorySize(path) == stats.size) return;
-  const JsonValue attributes = services_.attributes->get(path);
-  if (attributes.is_object() && attributes.contains(StoreManagerImplCommon::TrashOnStartupKey)) return;
-  services_.sizes->setCachedStats(path, stats);
+  try {
+    if (services_.onMeasured) services_.onMeasured(path, stats);
+    if (services_.sizes->fetchDirectorySize(path) == stats.size) return;
+    const JsonValue attributes = services_.attributes->get(path);
+    if (attributes.is_object() && attributes.contains(StoreManagerImplCommon::TrashOnStartupKey)) return;
+    services_.sizes->setCachedStats(path, stats);
+  } catch (const std::exception& error) {
+    LOG(ERROR) << "Cannot keep the size of an unmanaged cache. " << error.what();
+  } catch (...) {
+    LOG(ERROR) << "Cannot keep the size of an unmanaged cache: unknown exception";
+  }
 }
 
 // Starts the next timer if the cache is in use. Whether the cache has come to be over its limit.
 bool UnmanagedMeasuring::noteMeasured(const std::string& path, const std::weak_ptr<UnmanagedStore>& store,
-                                      std::chrono::nanoseconds duration, std::optional<std::uint64_t> bytes) {
+                                      std::chrono::nanoseconds duration,
+                                      const std::optional<DiskSizeCalculator::Stats>& stats) {
   const Lock lock(mutex_);
   Cache& cache = caches_[path];
   cache.isScheduled = false;
   cache.rest = std::max(interval_, restAfter(duration));
   if (cache.isInUse()) startTimer(path, cache, lock);
   const auto present = cache.store.lock();
-  if (!bytes || present == nullptr || present != store.lock()) return false;  // another session's by now, perhaps
-  const bool wasOver = std::exchange(cache.isOverLimit, *bytes > present->getMaxSize());
-  return cache.isOverLimit && !wasOver;
+  if (!stats || present == nullptr || present != store.lock()) return false;  // another session's by now, perhaps
+  const bool isOver = static_cast<std::uint64_t>(stats->size) > present->getMaxSize();
+  return !std::exchange(cache.isOverLimit, isOver) && isOver;
 }
 
 void UnmanagedMeasuring::report(const StoreDefinition& definition, std::uint64_t bytes) const {

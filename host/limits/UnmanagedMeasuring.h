@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -43,6 +44,7 @@ class UnmanagedMeasuring : public std::enable_shared_from_this<UnmanagedMeasurin
     std::shared_ptr<AttributeStore> attributes;
     std::shared_ptr<DiskSizeCalculator> sizes;          // keeps the sizes
     std::shared_ptr<const IncidentReporter> incidents;  // null: incidents are only logged
+    std::function<void(const std::string& path, const DiskSizeCalculator::Stats& stats)> onMeasured{};  // may be empty
   };
 
   UnmanagedMeasuring(std::chrono::seconds interval, Services services, Now now = std::chrono::steady_clock::now);
@@ -69,10 +71,11 @@ class UnmanagedMeasuring : public std::enable_shared_from_this<UnmanagedMeasurin
   void forgetEnded(const Lock& lock);
   void measureDue(const std::string& path);
   std::shared_ptr<UnmanagedStore> takeDue(const std::string& path);
-  std::optional<std::uint64_t> measure(const std::string& path) const;
+  std::optional<DiskSizeCalculator::Stats> measure(const std::string& path) const;
   void keep(const std::string& path, const DiskSizeCalculator::Stats& stats) const;
+  bool isPresent(const std::string& path, const std::weak_ptr<UnmanagedStore>& store);
   bool noteMeasured(const std::string& path, const std::weak_ptr<UnmanagedStore>& store,
-                    std::chrono::nanoseconds duration, std::optional<std::uint64_t> bytes);
+                    std::chrono::nanoseconds duration, const std::optional<DiskSizeCalculator::Stats>& stats);
   void report(const StoreDefinition& definition, std::uint64_t bytes) const;
 
   const std::chrono::nanoseconds interval_;

@@ -75,6 +75,19 @@ void EvictionOrder::allChanged() {
   rebuild();
 }
 
+void EvictionOrder::sortBy(Date dateOf) {
+  std::sort(heap_.begin(), heap_.end(), [dateOf](const Entry& a, const Entry& b) {
+    const std::int32_t dateOfA = dateOf(*a.record);
+    const std::int32_t dateOfB = dateOf(*b.record);
+    return dateOfA != dateOfB ? dateOfA < dateOfB : isBefore(a, b);
+  });
+  nextSequence_ = 0;
+  for (Entry& entry : heap_) {
+    entry.record->*place_ = nextSequence_;
+    entry.turn = nextSequence_++;
+  }
+}
+
 void EvictionOrder::rebuild() {
   if (heap_.size() < 2) return;
   for (std::size_t place = parentOf(heap_.size() - 1) + 1; place-- > 0;) moveDown(place);

@@ -46,11 +46,14 @@ class EvictionOrder {
   // added with its date, or put behind all others of another date; all get other dates, and keep their turns.
   void added(ManifestRecord& record, std::int32_t date);
   void moved(const ManifestRecord& record, std::int32_t date);
+  std::size_t size() const { return heap_.size(); }
   std::int32_t givenDateOf(const ManifestRecord& record) const { return heap_[record.*place_].date; }
   template <class NewDate> void changeAll(NewDate newDate) {
     for (Entry& entry : heap_) entry.date = newDate(*entry.record, entry.date);
     rebuild();
   }
+  // Gives turns by these dates, and the records to `forEach` in that order. All have to get other dates afterwards.
+  void sortBy(Date dateOf);
   template <class Action> void forEach(Action action) const {
     for (const Entry& entry : heap_) action(*entry.record);
   }

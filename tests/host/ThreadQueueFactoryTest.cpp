@@ -40,11 +40,11 @@ constexpr std::int64_t kMillisecond = 1'000'000;
 constexpr std::int64_t kHour = 3'600'000 * kMillisecond;
 constexpr std::chrono::hours kLongPatience(1);
 
-// Opens a latch when the thread that watches it has ended.
+// Opens latches when the thread that has them has ended: several, as one thread may serve all queues.
 struct ThreadEnd {
-  std::shared_ptr<Latch> latch;
+  std::vector<std::shared_ptr<Latch>> latches;
   ~ThreadEnd() {
-    if (latch) latch->countDown();
+    for (const auto& latch : latches) latch->countDown();
   }
 };
 thread_local ThreadEnd threadEnd;
@@ -86,7 +86,7 @@ class ThreadQueueFactoryTest : public testing::Test {
 
   static std::shared_ptr<Latch> watchThreadEnd(AsyncExecutor& queue) {
     auto ended = std::make_shared<Latch>(1);
-    queue.dispatch([ended] { threadEnd.latch = ended; });
+    queue.dispatch([ended] { threadEnd.latches.push_back(ended); });
     return ended;
   }
 

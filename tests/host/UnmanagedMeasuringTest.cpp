@@ -548,6 +548,7 @@ TEST_F(HostThatMeasures, TellsOfACacheThatIsOverItsLimit) {
   EXPECT_THAT(told, IsEmpty());
   EXPECT_TRUE(fire());
   EXPECT_THAT(told, ElementsAre(text));
+  EXPECT_EQ(host->metrics().managers.at(0).stores.at(0).bytes, 1001U);
   EXPECT_THAT(events->named("qzdisk_size_calculator_logging"), IsEmpty());
   EXPECT_EQ(armed(), 1U);  // it is held
 }

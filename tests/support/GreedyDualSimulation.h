@@ -61,19 +61,21 @@ class GreedyDualSimulation {
     outcomes_ = {};
     level_ = 0;
     if (items_.empty()) return;
-    std::int64_t oldest = items_.begin()->second.date;
-    std::int64_t newest = oldest;
+    std::vector<std::int64_t> dates;
     double worth = 0;
     double bytes = 0;
     for (const auto& [key, item] : items_) {
-      oldest = std::min(oldest, item.date);
-      newest = std::max(newest, item.date);
+      dates.push_back(item.date);
       worth += static_cast<double>(worthOf(item.size)) * item.size;
       bytes += item.size;
     }
+    std::sort(dates.begin(), dates.end());
+    const std::size_t apart = dates.size() < 3 ? 0 : std::max<std::size_t>(dates.size() / 64, 1);
+    const std::int64_t oldest = dates[apart];
+    const std::int64_t newest = dates[dates.size() - 1 - apart];
     const double rise = newest == oldest ? 0 : worth / bytes / 2 / static_cast<double>(newest - oldest);
     const auto levelAt = [&](std::int64_t date) {
-      return static_cast<std::int64_t>(rise * static_cast<double>(date - oldest));
+      return static_cast<std::int64_t>(rise * static_cast<double>(std::min(std::max(date, oldest), newest) - oldest));
     };
     for (auto& [key, item] : items_) item.priority = levelAt(item.date) + worthOf(item.size);
     level_ = levelAt(newest);
