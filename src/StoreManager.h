@@ -71,9 +71,10 @@ class CELLAR_EXPORT StoreManager {
   StoreManager& operator=(const StoreManager&) = delete;
 
   // The store of that identifier, created by the first call; concurrent callers wait for it. `strategy` counts only in
-  // the call that creates a disk cache; `Null` takes what its definition names. Empty for an identifier that the
-  // manager does not have (one error line) and once the manager is invalid. Throws what creating the store throws;
-  // later callers of that identifier then wait without end, unless `retryFailedCreations` was called.
+  // the call that creates a disk cache; `Null` takes what its definition names, and so does a cache whose definition
+  // names `GreedyDual`. Empty for an identifier that the manager does not have (one error line) and once the manager is
+  // invalid. Throws what creating the store throws; later callers of that identifier then wait without end, unless
+  // `retryFailedCreations` was called.
   std::shared_ptr<Store> getStoreImpl(const std::string& identifier, PruneStrategyIdentifier strategy);
 
   // The same, as a store of that type. Empty only where `getStoreImpl` is; a store of another type throws
