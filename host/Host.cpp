@@ -14,7 +14,6 @@
 #include "Configuration.h"
 #include "DiskSizeCalculator.h"
 #include "FileUtils.h"
-#include "JsonValue.h"
 #include "LarderException.h"
 #include "LazyDispatcher.h"
 #include "StoreDirectoryNameBuilder.h"
@@ -24,6 +23,7 @@
 #include "host/FileNames.h"
 #include "host/RootLock.h"
 #include "host/ThreadQueueFactory.h"
+#include "host/configuration/Outline.h"
 #include "host/configuration/Reading.h"
 #include "host/errors/Texts.h"
 #include "host/figures/ManagerFigures.h"
@@ -37,11 +37,10 @@ namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
 
-// Sorted, as an object keeps its members.
 std::vector<std::string> namesOfManagers(const std::string& configuration) {
   std::vector<std::string> names;
-  const JsonValue document = JsonValue::parse(configuration);
-  for (const auto& [name, ignored] : document.items()) names.push_back(name);
+  for (const Outline& manager : outlineOf(configuration).members) names.push_back(manager.name);
+  std::sort(names.begin(), names.end());
   return names;
 }
 
