@@ -281,7 +281,7 @@ TEST_F(SizeListener, IsReplacedWhileStoresReport) {
   std::atomic<int> calls{0};
   std::vector<std::thread> threads;
   for (const auto& store : {a_, b_}) {
-    threads.emplace_back([&store] {
+    threads.emplace_back([store] {
       for (unsigned int size = 0; size < 1000; ++size) store->reportSize(size);
     });
   }

@@ -43,6 +43,7 @@ bool isInStoreQuarantine(const std::string& below) { return below.rfind(std::str
 
 std::vector<std::string> manifestFiles() {
   std::vector<std::string> names;
+  names.reserve(kSuffixes.size());
   for (const char* const suffix : kSuffixes) names.push_back(ManifestSnapshot::manifestName + suffix);
   return names;
 }
