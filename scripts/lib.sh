@@ -102,6 +102,22 @@ need() {
     die "could not install: ${missing[*]}"
 }
 
+# clang++ with the runtime of sanitizers, the package of which depends on its version: need_clang_with SANITIZERS, as
+# -fsanitize= takes them.
+need_clang_with() {
+  need "${build_packages[@]}" clang
+  local version
+  version=$(clang++ -dumpversion)
+  links_with "$1" || need "libclang-rt-${version%%.*}-dev"
+  links_with "$1" || die "clang++ $version cannot link with -fsanitize=$1"
+}
+
+links_with() {
+  echo 'extern "C" int LLVMFuzzerTestOneInput(const unsigned char*, unsigned long) { return 0; }' >build/sanitized.cpp
+  [[ $1 == *fuzzer* ]] || echo 'int main() {}' >>build/sanitized.cpp
+  clang++ "-fsanitize=$1" build/sanitized.cpp -o build/sanitized 2>/dev/null
+}
+
 # The cross compiler, and the libraries for 32-bit ARM that it links. Quick and offline when they are there.
 need_arm() {
   need g++-arm-linux-gnueabihf qemu-user-static cmake ninja-build ccache git libjs-chart.js
