@@ -2,12 +2,13 @@
 
 #include <sqlite3.h>
 
-#include <algorithm>
 #include <array>
 #include <cstring>
 #include <mutex>
 #include <optional>
 #include <stdexcept>
+
+#include "host/testing/powercut/ForwardedFile.h"
 
 namespace velmora::mobile::xplat::cellar::test {
 
@@ -111,30 +112,13 @@ auto asExtension() {
   return reinterpret_cast<void (*)()>(watchStatements);
 }  // NOLINT(*-reinterpret-cast): SQLite's way
 
-// What SQLite knows as the file; the real one's lies behind it in the same block.
-struct File {
-  sqlite3_file base;
-  sqlite3_file* real;
-};
-
-sqlite3_file* real(sqlite3_file* file) {
-  return reinterpret_cast<File*>(file)->real;  // NOLINT(*-reinterpret-cast): SQLite's way to derive
-}
-
-sqlite3_vfs* real(sqlite3_vfs* vfs) { return static_cast<sqlite3_vfs*>(vfs->pAppData); }
-
 template <class Call> int unlessFailing(VfsCall kind, Call call) {
   if (const auto code = faults.failureOf(kind)) return *code;
   return call();
 }
 
-int closeFile(sqlite3_file* file) {
-  sqlite3_file* const inner = real(file);
-  return inner->pMethods == nullptr ? SQLITE_OK : inner->pMethods->xClose(inner);
-}
-
 int readFile(sqlite3_file* file, void* buffer, int length, sqlite3_int64 offset) {
-  sqlite3_file* const inner = real(file);
+  sqlite3_file* const inner = realFile(file);
   const auto failure = faults.failureOf(VfsCall::Read);
   if (failure && *failure != SQLITE_IOERR_SHORT_READ) return *failure;
   const int result = inner->pMethods->xRead(inner, buffer, length, offset);
@@ -145,7 +129,7 @@ int readFile(sqlite3_file* file, void* buffer, int length, sqlite3_int64 offset)
 }
 
 int writeFile(sqlite3_file* file, const void* buffer, int length, sqlite3_int64 offset) {
-  sqlite3_file* const inner = real(file);
+  sqlite3_file* const inner = realFile(file);
   const auto failure = faults.failureOf(VfsCall::Write);
   if (!failure) return inner->pMethods->xWrite(inner, buffer, length, offset);
   if (faults.tears()) (void)inner->pMethods->xWrite(inner, buffer, length / 2, offset);
@@ -153,7 +137,7 @@ int writeFile(sqlite3_file* file, const void* buffer, int length, sqlite3_int64 
 }
 
 int truncateFile(sqlite3_file* file, sqlite3_int64 size) {
-  return unlessFailing(VfsCall::Truncate, [&] { return real(file)->pMethods->xTruncate(real(file), size); });
+  return unlessFailing(VfsCall::Truncate, [&] { return realFile(file)->pMethods->xTruncate(realFile(file), size); });
 }
 
 int syncFile(sqlite3_file* /*file*/, int /*flags*/) {
@@ -161,108 +145,67 @@ int syncFile(sqlite3_file* /*file*/, int /*flags*/) {
 }
 
 int fileSize(sqlite3_file* file, sqlite3_int64* size) {
-  return unlessFailing(VfsCall::FileSize, [&] { return real(file)->pMethods->xFileSize(real(file), size); });
+  return unlessFailing(VfsCall::FileSize, [&] { return realFile(file)->pMethods->xFileSize(realFile(file), size); });
 }
 
 int lockFile(sqlite3_file* file, int level) {
-  return unlessFailing(VfsCall::Lock, [&] { return real(file)->pMethods->xLock(real(file), level); });
+  return unlessFailing(VfsCall::Lock, [&] { return realFile(file)->pMethods->xLock(realFile(file), level); });
 }
-
-int unlockFile(sqlite3_file* file, int level) { return real(file)->pMethods->xUnlock(real(file), level); }
-
-int checkReservedLock(sqlite3_file* file, int* result) {
-  return real(file)->pMethods->xCheckReservedLock(real(file), result);
-}
-
-int fileControl(sqlite3_file* file, int operation, void* argument) {
-  return real(file)->pMethods->xFileControl(real(file), operation, argument);
-}
-
-int sectorSize(sqlite3_file* file) { return real(file)->pMethods->xSectorSize(real(file)); }
-
-int deviceCharacteristics(sqlite3_file* file) { return real(file)->pMethods->xDeviceCharacteristics(real(file)); }
 
 int mapSharedMemory(sqlite3_file* file, int region, int size, int extend, void volatile** memory) {
   *memory = nullptr;
   return unlessFailing(VfsCall::MapSharedMemory,
-                       [&] { return real(file)->pMethods->xShmMap(real(file), region, size, extend, memory); });
+                       [&] { return realFile(file)->pMethods->xShmMap(realFile(file), region, size, extend, memory); });
 }
 
 int lockSharedMemory(sqlite3_file* file, int offset, int count, int flags) {
-  const auto lock = [&] { return real(file)->pMethods->xShmLock(real(file), offset, count, flags); };
+  const auto lock = [&] { return realFile(file)->pMethods->xShmLock(realFile(file), offset, count, flags); };
   return (flags & SQLITE_SHM_LOCK) != 0 ? unlessFailing(VfsCall::LockSharedMemory, lock) : lock();
 }
 
-void sharedMemoryBarrier(sqlite3_file* file) { real(file)->pMethods->xShmBarrier(real(file)); }
-
-int unmapSharedMemory(sqlite3_file* file, int alsoDelete) {
-  return real(file)->pMethods->xShmUnmap(real(file), alsoDelete);
-}
-
-// The second version: without memory-mapped reading, which would go past this layer.
-const sqlite3_io_methods methods = {2,
-                                    closeFile,
-                                    readFile,
-                                    writeFile,
-                                    truncateFile,
-                                    syncFile,
-                                    fileSize,
-                                    lockFile,
-                                    unlockFile,
-                                    checkReservedLock,
-                                    fileControl,
-                                    sectorSize,
-                                    deviceCharacteristics,
-                                    mapSharedMemory,
-                                    lockSharedMemory,
-                                    sharedMemoryBarrier,
-                                    unmapSharedMemory,
-                                    nullptr,
-                                    nullptr};
+const sqlite3_io_methods methods = [] {
+  sqlite3_io_methods faulty = forwardedMethods();
+  faulty.xRead = readFile;
+  faulty.xWrite = writeFile;
+  faulty.xTruncate = truncateFile;
+  faulty.xSync = syncFile;
+  faulty.xFileSize = fileSize;
+  faulty.xLock = lockFile;
+  faulty.xShmMap = mapSharedMemory;
+  faulty.xShmLock = lockSharedMemory;
+  return faulty;
+}();
 
 int openFile(sqlite3_vfs* vfs, const char* name, sqlite3_file* file, int flags, int* outFlags) {
-  auto* const own = reinterpret_cast<File*>(file);       // NOLINT(*-reinterpret-cast): SQLite's way to derive
-  own->base.pMethods = nullptr;                          // nothing to close yet
-  own->real = reinterpret_cast<sqlite3_file*>(own + 1);  // NOLINT(*-reinterpret-cast): SQLite made room for both
-  own->real->pMethods = nullptr;
+  beginForwarding(file, sizeof(ForwardedFile));
   if (const auto failure = faults.failureOf(VfsCall::Open)) return *failure;
-  const int result = real(vfs)->xOpen(real(vfs), name, own->real, flags, outFlags);
-  if (own->real->pMethods != nullptr) own->base.pMethods = &methods;
+  const int result = realVfs(vfs)->xOpen(realVfs(vfs), name, realFile(file), flags, outFlags);
+  if (realFile(file)->pMethods != nullptr) file->pMethods = &methods;
   return result;
 }
 
 int deleteFile(sqlite3_vfs* vfs, const char* name, int /*syncDirectory*/) {
-  return unlessFailing(VfsCall::Delete, [&] { return real(vfs)->xDelete(real(vfs), name, 0); });
+  return unlessFailing(VfsCall::Delete, [&] { return realVfs(vfs)->xDelete(realVfs(vfs), name, 0); });
 }
 
 int accessFile(sqlite3_vfs* vfs, const char* name, int flags, int* result) {
   *result = 0;
-  return unlessFailing(VfsCall::Access, [&] { return real(vfs)->xAccess(real(vfs), name, flags, result); });
-}
-
-int fullPathname(sqlite3_vfs* vfs, const char* name, int size, char* out) {
-  return real(vfs)->xFullPathname(real(vfs), name, size, out);
+  return unlessFailing(VfsCall::Access, [&] { return realVfs(vfs)->xAccess(realVfs(vfs), name, flags, result); });
 }
 
 }  // namespace
 
 struct FaultyVfs::Registration {
   sqlite3_vfs* const system = sqlite3_vfs_find(nullptr);
-  sqlite3_vfs vfs = *system;  // what is not replaced here goes to the real one's functions
+  sqlite3_vfs vfs = layerAbove(*system, "faulty", sizeof(ForwardedFile));
 };
 
 FaultyVfs::FaultyVfs() : registration_(std::make_unique<Registration>()) {
   faults.reset();
   sqlite3_vfs& vfs = registration_->vfs;
-  vfs.iVersion = std::min(vfs.iVersion, 2);
-  vfs.szOsFile += static_cast<int>(sizeof(File));
-  vfs.zName = "faulty";
-  vfs.pNext = nullptr;
-  vfs.pAppData = registration_->system;
   vfs.xOpen = openFile;
   vfs.xDelete = deleteFile;
   vfs.xAccess = accessFile;
-  vfs.xFullPathname = fullPathname;
   if (sqlite3_vfs_register(&vfs, 1) != SQLITE_OK) throw std::runtime_error("SQLite takes no other file layer.");
   (void)sqlite3_auto_extension(asExtension());
 }

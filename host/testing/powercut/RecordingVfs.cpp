@@ -11,6 +11,8 @@
 #include <utility>
 #include <vector>
 
+#include "host/testing/powercut/ForwardedFile.h"
+
 namespace velmora::mobile::xplat::cellar::test {
 
 namespace {
@@ -24,22 +26,14 @@ struct Opened {
   bool hasSharedMemory = false;
 };
 
-// What SQLite knows as the file; the real one's lies behind it in the same block.
 struct File {
-  sqlite3_file base;
-  sqlite3_file* real;
+  ForwardedFile forwarded;
   Opened* opened;
 };
 
 Opened& opened(sqlite3_file* file) {
   return *reinterpret_cast<File*>(file)->opened;  // NOLINT(*-reinterpret-cast): SQLite's way to derive
 }
-
-sqlite3_file* real(sqlite3_file* file) {
-  return reinterpret_cast<File*>(file)->real;  // NOLINT(*-reinterpret-cast): SQLite's way to derive
-}
-
-sqlite3_vfs* real(sqlite3_vfs* vfs) { return static_cast<sqlite3_vfs*>(vfs->pAppData); }
 
 // SQLite's C functions between the caller and this do not pass an exception on.
 template <class Call> int guarded(int codeOfFailure, const Call& call) noexcept {
@@ -69,16 +63,11 @@ template <class Operation, class Record> int recorded(const std::shared_ptr<Shar
 
 int closeFile(sqlite3_file* file) {
   const std::unique_ptr<Opened> last(&opened(file));
-  sqlite3_file* const inner = real(file);
-  return inner->pMethods == nullptr ? SQLITE_OK : inner->pMethods->xClose(inner);
-}
-
-int readFile(sqlite3_file* file, void* buffer, int length, sqlite3_int64 offset) {
-  return real(file)->pMethods->xRead(real(file), buffer, length, offset);
+  return forwardedMethods().xClose(file);
 }
 
 int writeFile(sqlite3_file* file, const void* buffer, int length, sqlite3_int64 offset) {
-  const auto write = [&] { return real(file)->pMethods->xWrite(real(file), buffer, length, offset); };
+  const auto write = [&] { return realFile(file)->pMethods->xWrite(realFile(file), buffer, length, offset); };
   const auto note = [&](DiskRecord& /*disk*/) {
     const auto* const bytes = static_cast<const unsigned char*>(buffer);
     opened(file).node->content.write(static_cast<std::size_t>(offset), {bytes, bytes + length});
@@ -87,7 +76,7 @@ int writeFile(sqlite3_file* file, const void* buffer, int length, sqlite3_int64 
 }
 
 int truncateFile(sqlite3_file* file, sqlite3_int64 size) {
-  const auto truncate = [&] { return real(file)->pMethods->xTruncate(real(file), size); };
+  const auto truncate = [&] { return realFile(file)->pMethods->xTruncate(realFile(file), size); };
   const auto note = [&](DiskRecord& /*disk*/) { opened(file).node->content.truncate(static_cast<std::size_t>(size)); };
   return recorded(opened(file).record, SQLITE_IOERR_TRUNCATE, truncate, note);
 }
@@ -103,25 +92,9 @@ int syncFile(sqlite3_file* file, int /*flags*/) {
       opened(file).record, SQLITE_IOERR_FSYNC, [] { return SQLITE_OK; }, note);
 }
 
-int fileSize(sqlite3_file* file, sqlite3_int64* size) { return real(file)->pMethods->xFileSize(real(file), size); }
-
-int lockFile(sqlite3_file* file, int level) { return real(file)->pMethods->xLock(real(file), level); }
-
-int unlockFile(sqlite3_file* file, int level) { return real(file)->pMethods->xUnlock(real(file), level); }
-
-int checkReservedLock(sqlite3_file* file, int* result) {
-  return real(file)->pMethods->xCheckReservedLock(real(file), result);
-}
-
-int fileControl(sqlite3_file* file, int operation, void* argument) {
-  return real(file)->pMethods->xFileControl(real(file), operation, argument);
-}
-
-int sectorSize(sqlite3_file* file) { return real(file)->pMethods->xSectorSize(real(file)); }
-
 // A medium that promises no more than to leave alone what is beside a write.
 int deviceCharacteristics(sqlite3_file* file) {
-  return real(file)->pMethods->xDeviceCharacteristics(real(file)) & SQLITE_IOCAP_POWERSAFE_OVERWRITE;
+  return realFile(file)->pMethods->xDeviceCharacteristics(realFile(file)) & SQLITE_IOCAP_POWERSAFE_OVERWRITE;
 }
 
 int mapSharedMemory(sqlite3_file* file, int region, int size, int extend, void volatile** memory) {
@@ -133,39 +106,19 @@ int mapSharedMemory(sqlite3_file* file, int region, int size, int extend, void v
     });
     if (result != SQLITE_OK) return result;
   }
-  return real(file)->pMethods->xShmMap(real(file), region, size, extend, memory);
+  return realFile(file)->pMethods->xShmMap(realFile(file), region, size, extend, memory);
 }
 
-int lockSharedMemory(sqlite3_file* file, int offset, int count, int flags) {
-  return real(file)->pMethods->xShmLock(real(file), offset, count, flags);
-}
-
-void sharedMemoryBarrier(sqlite3_file* file) { real(file)->pMethods->xShmBarrier(real(file)); }
-
-int unmapSharedMemory(sqlite3_file* file, int alsoDelete) {
-  return real(file)->pMethods->xShmUnmap(real(file), alsoDelete);
-}
-
-// The second version: without memory-mapped reading, which would go past this layer.
-const sqlite3_io_methods methods = {2,
-                                    closeFile,
-                                    readFile,
-                                    writeFile,
-                                    truncateFile,
-                                    syncFile,
-                                    fileSize,
-                                    lockFile,
-                                    unlockFile,
-                                    checkReservedLock,
-                                    fileControl,
-                                    sectorSize,
-                                    deviceCharacteristics,
-                                    mapSharedMemory,
-                                    lockSharedMemory,
-                                    sharedMemoryBarrier,
-                                    unmapSharedMemory,
-                                    nullptr,
-                                    nullptr};
+const sqlite3_io_methods methods = [] {
+  sqlite3_io_methods recording = forwardedMethods();
+  recording.xClose = closeFile;
+  recording.xWrite = writeFile;
+  recording.xTruncate = truncateFile;
+  recording.xSync = syncFile;
+  recording.xDeviceCharacteristics = deviceCharacteristics;
+  recording.xShmMap = mapSharedMemory;
+  return recording;
+}();
 
 // The trees, and the layer that is there as long as there are any.
 class Layer {
@@ -203,29 +156,27 @@ std::unique_ptr<Opened> stateOf(const char* name, int flags) {
 }
 
 int openFile(sqlite3_vfs* vfs, const char* name, sqlite3_file* file, int flags, int* outFlags) {
-  File& own = *reinterpret_cast<File*>(file);            // NOLINT(*-reinterpret-cast): SQLite's way to derive
-  own.base.pMethods = nullptr;                           // nothing to close yet
-  own.real = reinterpret_cast<sqlite3_file*>(&own + 1);  // NOLINT(*-reinterpret-cast): SQLite made room for both
-  own.real->pMethods = nullptr;
+  File& own = *reinterpret_cast<File*>(file);  // NOLINT(*-reinterpret-cast): SQLite's way to derive
+  beginForwarding(file, sizeof(File));
   return guarded(SQLITE_CANTOPEN, [&] {
     std::unique_ptr<Opened> state = stateOf(name, flags);
     own.opened = state.get();
     const auto open = [&] {
-      const int result = real(vfs)->xOpen(real(vfs), name, own.real, flags, outFlags);
-      if (own.real->pMethods != nullptr) own.base.pMethods = &methods;
+      const int result = realVfs(vfs)->xOpen(realVfs(vfs), name, realFile(file), flags, outFlags);
+      if (realFile(file)->pMethods != nullptr) file->pMethods = &methods;
       return result;
     };
     const auto record = state->record;
     const int result = recorded(record, SQLITE_CANTOPEN, open,
                                 [&](DiskRecord& disk) { own.opened->node = disk.openedAsDatabase(name); });
     if (!state->node) state->record = nullptr;
-    if (own.base.pMethods != nullptr) (void)state.release();  // until it is closed
+    if (file->pMethods != nullptr) (void)state.release();  // until it is closed
     return result;
   });
 }
 
 int deleteFile(sqlite3_vfs* vfs, const char* name, int syncsDirectory) {
-  const auto remove = [&] { return real(vfs)->xDelete(real(vfs), name, 0); };
+  const auto remove = [&] { return realVfs(vfs)->xDelete(realVfs(vfs), name, 0); };
   return guarded(SQLITE_IOERR_DELETE, [&] {
     const auto note = [&](DiskRecord& disk) {
       (void)disk.observe(name);
@@ -235,30 +186,15 @@ int deleteFile(sqlite3_vfs* vfs, const char* name, int syncsDirectory) {
   });
 }
 
-int accessFile(sqlite3_vfs* vfs, const char* name, int flags, int* result) {
-  return real(vfs)->xAccess(real(vfs), name, flags, result);
-}
-
-int fullPathname(sqlite3_vfs* vfs, const char* name, int size, char* out) {
-  return real(vfs)->xFullPathname(real(vfs), name, size, out);
-}
-
 void Layer::add(const std::shared_ptr<SharedDiskRecord>& record) {
   const std::lock_guard<std::mutex> lock(mutex_);
   records_.push_back(record);
   if (records_.size() > 1) return;
   sqlite3_vfs* const system = sqlite3_vfs_find(nullptr);
   if (system != nullptr) {
-    vfs_ = *system;  // what is not replaced here goes to the real one's functions
-    vfs_.iVersion = std::min(vfs_.iVersion, 2);
-    vfs_.szOsFile += static_cast<int>(sizeof(File));
-    vfs_.zName = "recording";
-    vfs_.pNext = nullptr;
-    vfs_.pAppData = system;
+    vfs_ = layerAbove(*system, "recording", sizeof(File));
     vfs_.xOpen = openFile;
     vfs_.xDelete = deleteFile;
-    vfs_.xAccess = accessFile;
-    vfs_.xFullPathname = fullPathname;
     if (sqlite3_vfs_register(&vfs_, 1) == SQLITE_OK) return;
   }
   records_.clear();
@@ -270,7 +206,7 @@ void Layer::remove(const std::shared_ptr<SharedDiskRecord>& record) {
   records_.erase(std::find(records_.begin(), records_.end(), record));
   if (!records_.empty()) return;
   (void)sqlite3_vfs_unregister(&vfs_);
-  (void)sqlite3_vfs_register(real(&vfs_), 1);
+  (void)sqlite3_vfs_register(realVfs(&vfs_), 1);
 }
 
 }  // namespace
