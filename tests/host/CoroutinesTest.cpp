@@ -324,9 +324,11 @@ class Owned {
   };
 
   explicit Owned(std::coroutine_handle<promise_type> handle) : handle_(handle) {}
-  Owned(const Owned&) = delete;
-  Owned& operator=(const Owned&) = delete;
-  ~Owned() { handle_.destroy(); }
+  Owned(Owned&& other) noexcept : handle_(std::exchange(other.handle_, nullptr)) {}
+  Owned& operator=(Owned&&) = delete;
+  ~Owned() {
+    if (handle_) handle_.destroy();
+  }
 
   bool isDone() const { return handle_.done(); }
   std::exception_ptr failure() const { return handle_.promise().failure; }
