@@ -118,10 +118,13 @@ links_with() {
   clang++ "-fsanitize=$1" build/sanitized.cpp -o build/sanitized 2>/dev/null
 }
 
-# The cross compiler, and the libraries for 32-bit ARM that it links. Quick and offline when they are there.
+# The cross compiler, and the libraries for ARM that it links: need_arm, or need_arm 64. Quick and offline when they are there.
 need_arm() {
-  need g++-arm-linux-gnueabihf qemu-user-static cmake ninja-build ccache git libjs-chart.js
-  logged arm-sysroot bash scripts/arm-sysroot build/arm-sysroot || die "the libraries for 32-bit ARM could not be fetched"
+  local compiler=g++-arm-linux-gnueabihf architecture=armhf
+  [[ ${1:-} != 64 ]] || compiler=g++-aarch64-linux-gnu architecture=arm64
+  need "$compiler" qemu-user-static cmake ninja-build ccache git libjs-chart.js
+  logged "arm${1:-}-sysroot" bash scripts/arm-sysroot "build/arm${1:-}-sysroot" "$architecture" ||
+    die "the libraries for $architecture could not be fetched"
 }
 
 # ---- building and testing -----------------------------------------------------------------------------------------------
