@@ -5,7 +5,7 @@ _cellar_options() {  # of a command
     demo) echo --root --help ;;
     check) echo --version-tag --locale --session --json --help ;;
     tune)
-      echo --store --limit --config --worth --unknown-size --svg --html --json --csv --key --size --time --op --store-op --remove-op \
+      echo --store --limit --config --worth --unknown-size --svg --html --json --csv --key --size --time --op --store-op --remove-op --clear-op \
         --chunk-second --item-type --priority-weight --early-seconds --help
       ;;
     inspect) echo --config --top --json --html --help ;;
@@ -32,7 +32,7 @@ _cellar() {
       return
       ;;
     --version-tag | --locale | --session | --store | --limit | --worth | --unknown-size | --top) return ;;
-    --key | --size | --time | --op | --store-op | --remove-op) return ;;
+    --key | --size | --time | --op | --store-op | --remove-op | --clear-op) return ;;
     --chunk-second | --item-type | --priority-weight | --early-seconds) return ;;
   esac
   if [[ $word == -* ]]; then

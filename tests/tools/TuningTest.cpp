@@ -39,7 +39,9 @@ class TuningTest : public testing::Test {
   }
 
   Tuning tuned(std::int64_t present = 0) const {
-    return tune(trace, present, 0.01, [] {});
+    TuneSettings settings;
+    settings.present = present;
+    return tune(trace, settings, [](std::uint64_t, std::uint64_t) {});
   }
 
   std::string printed(std::int64_t present = 0) const {
@@ -153,16 +155,16 @@ TEST_F(TuningTest, ALimitBeyondTheLibrarysOwnIsMarked) {
 }
 
 TEST_F(TuningTest, TheVideoStrategyIsPlayedWhereItemsCarryWhatItNeeds) {
-  EXPECT_THAT(printed(), Not(HasSubstr("video strategy")));
+  EXPECT_THAT(printed(), Not(HasSubstr("video_download")));
   askInTurn(4, 3);
-  EXPECT_FALSE(tuned().limits.back().videoHits.has_value());
+  EXPECT_EQ(tuned().limits.back().strategies.count("video_download"), 0U);
   Access access;
   access.size = kMegabyte;
   access.itemType = 1;
   access.date = date;
   trace.append("item0", access);
-  EXPECT_THAT(tuned().limits.back().videoHits, testing::Optional(9U));
-  EXPECT_THAT(printed(), HasSubstr("video strategy"));
+  EXPECT_EQ(tuned().limits.back().strategies.at("video_download").hits, 9U);
+  EXPECT_THAT(printed(), HasSubstr("video_download"));
 }
 
 TEST_F(TuningTest, TheReportForMachinesHasTheSameFigures) {
@@ -178,6 +180,17 @@ TEST_F(TuningTest, TheReportForMachinesHasTheSameFigures) {
   EXPECT_EQ(json.at("enough").at("hits"), 100);
   EXPECT_EQ(json.at("present").at("hits"), 0);
   EXPECT_EQ(json.at("limits").size(), report.tuning.limits.size());
+}
+
+TEST_F(TuningTest, TheReportForMachinesHasWhatEachStrategyFinds) {
+  askInTurn(10, 11);
+  TuneReport report;
+  report.tuning = tuned(5 * kMegabyte);
+  const nlohmann::ordered_json strategies = tuningAsJson(report).at("present").at("strategies");
+  EXPECT_EQ(strategies.size(), 2U);
+  EXPECT_EQ(strategies.at("greedy_dual").at("hits"), 0);  // of items of one size, as least recently used
+  EXPECT_EQ(strategies.at("foresight").at("hits"), 50);   // the same five are kept
+  EXPECT_EQ(strategies.at("foresight").at("hit_bytes"), 50 * kMegabyte);
 }
 
 TEST_F(TuningTest, ThePlotMarksBothLimitsAndEscapesTheStoresName) {

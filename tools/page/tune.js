@@ -45,13 +45,16 @@ function marks() {
 
 function curves() {
   const all = [
-    curve("requests", "accent", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.hit_rate }))),
-    curve("bytes", "third", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.byte_hit_rate })), [6, 4]),
+    curve("lru", "accent", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.hit_rate }))),
+    curve("lru, bytes", "third", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.byte_hit_rate })), [6, 4]),
   ];
-  const simulated = shown.limits.filter((limit) => limit.video_hits !== undefined);
-  if (simulated.length > 0) {
-    all.push(curve("requests, video strategy", "second",
-      simulated.map((limit) => ({ x: placeOf(limit.limit), y: limit.video_hits / shown.requests })), [2, 3]));
+  const drawn = [["greedy_dual", "greedy_dual", "second"], ["video_download", "video_download", "fourth", [2, 3]],
+    ["foresight", "with foresight", "quiet", [1, 3]]];
+  for (const [strategy, label, name, dash] of drawn) {
+    const simulated = shown.limits.filter((limit) => limit.strategies?.[strategy] !== undefined);
+    if (simulated.length === 0) continue;
+    all.push(curve(label, name, simulated.map((limit) => (
+      { x: placeOf(limit.limit), y: limit.strategies[strategy].hits / shown.requests })), dash));
   }
   return all;
 }

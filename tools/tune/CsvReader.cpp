@@ -102,6 +102,7 @@ class Row {
 AccessKind kindOf(const std::string& op, const CsvColumns& columns) {
   const auto among = [&](const Cells& ops) { return std::find(ops.begin(), ops.end(), op) != ops.end(); };
   if (among(columns.stores)) return AccessKind::Store;
+  if (among(columns.clears)) return AccessKind::Clear;
   return among(columns.removes) ? AccessKind::Remove : AccessKind::Fetch;
 }
 
@@ -134,7 +135,12 @@ void readCsv(LineReader& lines, const CsvColumns& columns, Trace& trace, const s
     if (line.empty()) continue;
     split(line, cells);
     const Row row(lines, cells);
-    trace.append(row.text(layout.key), readAccess(row, layout, columns));
+    const Access access = readAccess(row, layout, columns);
+    if (access.kind == AccessKind::Clear) {
+      trace.appendClear(access.date);
+    } else {
+      trace.append(row.text(layout.key), access);
+    }
   }
 }
 

@@ -19,6 +19,7 @@ struct CsvColumns {
   std::string itemType;
   std::vector<std::string> stores;   // operations that store, for example "2a"
   std::vector<std::string> removes;  // operations that remove
+  std::vector<std::string> clears;   // operations that remove all items, whatever their key
 };
 
 // Appends the accesses in the table, whose first line names its columns, to the trace. Cells are separated by commas

@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <optional>
 #include <vector>
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -24,6 +25,10 @@ class HitCurve {
   // A request of an item of that size, which is found at `leastLimit` and above.
   void addHit(std::int64_t leastLimit, std::int64_t size);
   void addMiss(std::int64_t size);  // at every limit
+  void add(std::optional<std::int64_t> leastLimit, std::int64_t size) {
+    if (leastLimit) return addHit(*leastLimit, size);
+    addMiss(size);
+  }
 
   std::uint64_t requests() const { return requests_; }
   std::uint64_t requestedBytes() const { return requestedBytes_; }

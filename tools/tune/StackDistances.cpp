@@ -29,6 +29,13 @@ void StackDistances::remove(std::uint32_t key) {
   (void)takeOut(items_[key]);
 }
 
+void StackDistances::clear() {
+  items_.clear();
+  total_ = 0;
+  count_ = 0;
+  rebuild({}, {});
+}
+
 // Subtracts its bytes from the items below, and reads its leaf on the way down.
 std::int64_t StackDistances::takeOut(Item& item) {
   const Node bytes{-item.size, 0};

@@ -28,6 +28,9 @@ class StackDistances {
   // Removes the item. Not an error: one that is not there.
   void remove(std::uint32_t key);
 
+  // Removes all items.
+  void clear();
+
   // The least limit at which nothing has been evicted so far.
   std::int64_t peak() const { return peak_; }
 

@@ -1,9 +1,7 @@
 #include "tune/Trace.h"
 
 #include <algorithm>
-#include <cerrno>
 #include <limits>
-#include <system_error>
 
 #include "InputError.h"
 
@@ -14,17 +12,9 @@ namespace {
 // So that no sum of sizes exceeds 64 bits.
 constexpr std::int64_t kMostBytes = std::int64_t{1} << 60;
 
-[[noreturn]] void fail(const char* what, int code) {
-  throw InputError(std::string(what) + ": " + std::generic_category().message(code));
-}
+constexpr std::size_t kBlock = 4096;  // accesses that are read together
 
 }  // namespace
-
-Trace::Trace() : file_(std::tmpfile()) {
-  if (file_ == nullptr) fail("cannot create a temporary file for the accesses", errno);
-}
-
-Trace::~Trace() = default;
 
 void Trace::append(const std::string& key, Access access) {
   access.key = numberOf(key);
@@ -33,24 +23,42 @@ void Trace::append(const std::string& key, Access access) {
     bytes_ += access.size;
     if (firstSizes_[access.key] == Access::kUnknownSize) firstSizes_[access.key] = access.size;
   }
-  if (accesses_ == 0) firstDate_ = access.date;
-  lastDate_ = access.date;
   hasMetadata_ = hasMetadata_ || access.itemType != Access::kNoMetadata;
-  if (std::fwrite(&access, sizeof access, 1, file_.get()) != 1) fail("cannot keep the accesses", errno);
-  ++accesses_;
+  keep(access);
+}
+
+void Trace::appendClear(std::int64_t date) {
+  Access access;
+  access.kind = AccessKind::Clear;
+  access.key = Access::kNoKey;
+  access.date = date;
+  access.size = 0;
+  keep(access);
 }
 
 void Trace::mayBeEmpty(const std::string& key) { mayBeEmpty_[numberOf(key)] = true; }
 
 void Trace::replay(const std::function<void(const Access&)>& visit) const {
   std::vector<std::int64_t> sizes = startingSizes();
-  if (std::fseek(file_.get(), 0, SEEK_SET) != 0) fail("cannot read the accesses again", errno);
-  Access access;
-  for (std::uint64_t i = 0; i < accesses_; ++i) {
-    if (std::fread(&access, sizeof access, 1, file_.get()) != 1) fail("cannot read the accesses again", errno);
-    if (access.size == Access::kUnknownSize) access.size = sizes[access.key];
-    sizes[access.key] = access.size;
-    visit(access);
+  std::vector<Access> block(kBlock);
+  for (std::uint64_t first = 0; first < accesses_; first += kBlock) {
+    const std::size_t count = readBlock(first, block);
+    for (std::size_t i = 0; i < count; ++i) {
+      Access& access = block[i];
+      if (access.kind != AccessKind::Clear) {
+        if (access.size == Access::kUnknownSize) access.size = sizes[access.key];
+        sizes[access.key] = access.size;
+      }
+      visit(access);
+    }
+  }
+}
+
+void Trace::replayBackwards(const std::function<void(std::uint64_t, const Access&)>& visit) const {
+  std::vector<Access> block(kBlock);
+  for (std::uint64_t first = (accesses_ + kBlock - 1) / kBlock * kBlock; first > 0;) {
+    first -= kBlock;
+    for (std::size_t i = readBlock(first, block); i-- > 0;) visit(first + i, block[i]);
   }
 }
 
@@ -96,6 +104,18 @@ std::vector<std::int64_t> Trace::startingSizes() const {
   return sizes;
 }
 
-void Trace::CloseFile::operator()(std::FILE* file) const { (void)std::fclose(file); }
+void Trace::keep(const Access& access) {
+  if (accesses_ == 0) firstDate_ = access.date;
+  lastDate_ = access.date;
+  file_.append(&access, sizeof access);
+  ++accesses_;
+}
+
+// How many there are.
+std::size_t Trace::readBlock(std::uint64_t first, std::vector<Access>& block) const {
+  const auto count = static_cast<std::size_t>(std::min<std::uint64_t>(block.size(), accesses_ - first));
+  file_.readAt(first * sizeof(Access), block.data(), count * sizeof(Access));
+  return count;
+}
 
 }  // namespace velmora::mobile::xplat::cellar::tools

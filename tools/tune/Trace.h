@@ -1,14 +1,14 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
-#include <cstdio>
 #include <functional>
-#include <memory>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
 #include "tune/Access.h"
+#include "tune/TemporaryFile.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -16,13 +16,11 @@ namespace velmora::mobile::xplat::cellar::tools {
 // trace, so that memory is needed for the keys only.
 class Trace {
  public:
-  Trace();
-  Trace(const Trace&) = delete;
-  Trace& operator=(const Trace&) = delete;
-  ~Trace();
-
   // Appends an access; its `key` is filled in here. Throws `InputError` when there is no room for it.
   void append(const std::string& key, Access access);
+
+  // Appends that all items are removed.
+  void appendClear(std::int64_t date);
 
   // For a key that was found without a size: if none of its accesses has a size, it is 0.
   void mayBeEmpty(const std::string& key);
@@ -31,8 +29,12 @@ class Trace {
   void assumeSize(std::int64_t bytes) { assumedSize_ = bytes; }
 
   // Calls `visit` with each access, every size filled in: if it is not known, from the last access of the key before
-  // it, or else from the first one after it. Throws `InputError` when the file cannot be read again.
+  // it, or else from the first one after it. Throws `InputError` when the file cannot be read again. Several threads at
+  // once may call this, when none appends.
   void replay(const std::function<void(const Access&)>& visit) const;
+
+  // From the last to the first, with their numbers, from 0. Sizes are as they were appended.
+  void replayBackwards(const std::function<void(std::uint64_t, const Access&)>& visit) const;
 
   std::uint64_t accesses() const { return accesses_; }
   std::uint64_t keys() const { return firstSizes_.size(); }
@@ -42,14 +44,12 @@ class Trace {
   bool hasMetadata() const { return hasMetadata_; }
 
  private:
-  struct CloseFile {
-    void operator()(std::FILE* file) const;
-  };
-
   std::uint32_t numberOf(const std::string& key);
   std::vector<std::int64_t> startingSizes() const;
+  void keep(const Access& access);
+  std::size_t readBlock(std::uint64_t first, std::vector<Access>& block) const;
 
-  std::unique_ptr<std::FILE, CloseFile> file_;
+  TemporaryFile file_;
   std::unordered_map<std::string, std::uint32_t> numbers_;
   std::vector<std::int64_t> firstSizes_;  // by key; the first known one
   std::vector<bool> mayBeEmpty_;          // by key

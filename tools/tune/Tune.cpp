@@ -116,9 +116,10 @@ void readTrace(const TuneOptions& options, Console& console, Trace& trace, TuneR
 
 Tuning tuneTrace(const TuneOptions& options, const Trace& trace, std::int64_t present, Console& console) {
   Progress progress(console, "simulating the accesses");
-  std::uint64_t done = 0;
-  const std::uint64_t rounds = trace.hasMetadata() ? 2 : 1;
-  return tune(trace, present, options.worth / kPercent, [&] { progress.advanceTo(++done, rounds * trace.accesses()); });
+  TuneSettings settings;
+  settings.present = present;
+  settings.worth = options.worth / kPercent;
+  return tune(trace, settings, [&](std::uint64_t done, std::uint64_t whole) { progress.advanceTo(done, whole); });
 }
 
 void runTune(const TuneOptions& options) {
@@ -160,6 +161,10 @@ void addCsvOptions(CLI::App& tune, TuneOptions& options) {
       ->type_name("OP")
       ->needs(op);
   tune.add_option("--remove-op", options.columns.removes, "An operation that removes. May be given several times")
+      ->type_name("OP")
+      ->needs(op);
+  tune.add_option("--clear-op", options.columns.clears,
+                  "An operation that removes all items, as a log-out does. May be given several times")
       ->type_name("OP")
       ->needs(op);
 }

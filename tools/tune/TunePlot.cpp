@@ -24,7 +24,8 @@ constexpr const char* kHead = R"svg(<svg xmlns="http://www.w3.org/2000/svg" view
   .paper { fill: #ffffff; } .rule { stroke: #e3e6eb; stroke-width: 1; } .mark { stroke-width: 1; stroke-dasharray: 4 4; }
   @media (prefers-color-scheme: dark) {
     text { fill: #e6e8ee; } polyline { stroke: #e6e8ee; } .paper { fill: #14171d; } .rule { stroke: #2c323d; } }
-  .hits { stroke: #3b82f6; } .bytes { stroke: #0f9d6b; stroke-dasharray: 6 4; } .video { stroke: #d97706; stroke-dasharray: 2 3; }
+  .hits { stroke: #3b82f6; } .bytes { stroke: #0f9d6b; stroke-dasharray: 6 4; } .greedy_dual { stroke: #d97706; }
+  .video_download { stroke: #b4519f; stroke-dasharray: 2 3; } .foresight { stroke: #8a94a6; stroke-dasharray: 1 3; }
 </style>
 <rect class="paper" width="800" height="460"/>
 )svg";
@@ -86,17 +87,21 @@ class Plot {
   void drawCurves() {
     std::string hits;
     std::string bytes;
-    std::string video;
     for (const HitCurve::Point& point : tuning_.curve) {
       hits += at(point.limit, share(point.hits, tuning_.requests));
       bytes += at(point.limit, share(point.hitBytes, tuning_.requestedBytes));
     }
-    for (const TunedLimit& limit : tuning_.limits) {
-      if (limit.videoHits) video += at(limit.lru.limit, share(*limit.videoHits, tuning_.requests));
+    drawCurve("bytes", "lru, bytes", bytes, kLeft + 80);
+    drawCurve("hits", "lru", hits, kLeft);
+    double left = kLeft + 200;
+    for (const std::string& strategy : tuning_.others) {
+      std::string points;
+      for (const TunedLimit& limit : tuning_.limits) {
+        points += at(limit.lru.limit, share(hitsOf(limit, strategy), tuning_.requests));
+      }
+      drawCurve(strategy, strategy == strategies::kForesight ? "with foresight" : strategy, points, left);
+      left += 150;
     }
-    drawCurve("bytes", "bytes", bytes, kLeft + 110);
-    drawCurve("hits", "requests", hits, kLeft);
-    if (!video.empty()) drawCurve("video", "requests, video strategy", video, kLeft + 220);
   }
 
   void drawCurve(const std::string& kind, const std::string& name, const std::string& points, double left) {

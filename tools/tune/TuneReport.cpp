@@ -31,7 +31,10 @@ std::string noteOn(const TunedLimit& limit) {
   return limit.isEnough ? "enough" : "";
 }
 
-bool hasVideo(const Tuning& tuning) { return !tuning.limits.empty() && tuning.limits.front().videoHits.has_value(); }
+// As a configuration names it, but for the one that no application can have.
+std::string titleOf(const std::string& strategy) {
+  return strategy == strategies::kForesight ? "with foresight" : strategy;
+}
 
 std::vector<Table::Column> columnsOf(const Tuning& tuning) {
   std::vector<Table::Column> columns = {{"limit", Table::Align::Right},
@@ -39,7 +42,7 @@ std::vector<Table::Column> columnsOf(const Tuning& tuning) {
                                         {"of bytes", Table::Align::Right},
                                         {"hits", Table::Align::Right},
                                         {"misses", Table::Align::Right}};
-  if (hasVideo(tuning)) columns.push_back({"video strategy", Table::Align::Right});
+  for (const std::string& strategy : tuning.others) columns.push_back({titleOf(strategy), Table::Align::Right});
   columns.push_back({"", Table::Align::Left});
   return columns;
 }
@@ -48,7 +51,9 @@ std::vector<std::string> rowOf(const Tuning& tuning, const TunedLimit& limit) {
   std::vector<std::string> cells = {wholeBytes(limit.lru.limit), percent(share(limit.lru.hits, tuning.requests)),
                                     percent(share(limit.lru.hitBytes, tuning.requestedBytes)),
                                     formatCount(limit.lru.hits), formatCount(tuning.requests - limit.lru.hits)};
-  if (limit.videoHits) cells.push_back(percent(share(*limit.videoHits, tuning.requests)));
+  for (const std::string& strategy : tuning.others) {
+    cells.push_back(percent(share(hitsOf(limit, strategy), tuning.requests)));
+  }
   cells.push_back(noteOn(limit));
   return cells;
 }
@@ -110,7 +115,10 @@ Json asJson(const Tuning& tuning, const TunedLimit& limit) {
                {"hit_rate", share(limit.lru.hits, tuning.requests)},
                {"hit_bytes", limit.lru.hitBytes},
                {"byte_hit_rate", share(limit.lru.hitBytes, tuning.requestedBytes)}};
-  if (limit.videoHits) json["video_hits"] = *limit.videoHits;
+  for (const auto& [strategy, found] : limit.strategies) {
+    Json& figures = json["strategies"][strategy] = {{"hits", found.hits}};
+    if (strategy != strategies::kVideoDownload) figures["hit_bytes"] = found.hitBytes;
+  }
   return json;
 }
 

@@ -5,7 +5,6 @@
 #include "tune/Access.h"
 #include "tune/StackDistances.h"
 #include "tune/Trace.h"
-#include "tune/VideoCaches.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -69,37 +68,50 @@ std::vector<HitCurve::Point> pointsToPlot(const HitCurve& curve, std::int64_t fi
 
 struct Simulated {
   HitCurve curve;
+  std::vector<HitCurve> parts;
   std::int64_t everything = 0;
 };
 
-Simulated simulateLeastRecentlyUsed(const Trace& trace, std::int64_t present, const std::function<void()>& onAccess) {
-  Simulated simulated{HitCurve(present)};
+Simulated simulateLeastRecentlyUsed(const Trace& trace, std::int64_t present, const OnProgress& onProgress) {
+  Simulated simulated{HitCurve(present), std::vector<HitCurve>(kParts, HitCurve(present))};
   StackDistances distances;
+  std::uint64_t number = 0;
   trace.replay([&](const Access& access) {
-    if (access.kind == AccessKind::Remove) {
+    HitCurve& part = simulated.parts[partOf(number, trace.accesses())];
+    if (access.kind == AccessKind::Clear) {
+      distances.clear();
+    } else if (access.kind == AccessKind::Remove) {
       distances.remove(access.key);
     } else {
       const auto least = distances.use(access.key, access.size);
-      if (access.kind == AccessKind::Fetch && least) simulated.curve.addHit(*least, access.size);
-      if (access.kind == AccessKind::Fetch && !least) simulated.curve.addMiss(access.size);
+      if (access.kind == AccessKind::Fetch) {
+        simulated.curve.add(least, access.size);
+        part.add(least, access.size);
+      }
     }
-    onAccess();
+    onProgress(++number, trace.accesses());
   });
   simulated.everything = distances.peak();
   return simulated;
 }
 
-void playVideoStrategy(const Trace& trace, std::vector<TunedLimit>& limits, const std::function<void()>& onAccess) {
-  std::vector<std::int64_t> bytes;
-  bytes.reserve(limits.size());
-  for (const TunedLimit& limit : limits) bytes.push_back(limit.lru.limit);
-  VideoCaches caches(bytes);
-  trace.replay([&](const Access& access) {
-    caches.access(access);
-    onAccess();
-  });
-  const auto results = caches.results();
-  for (std::size_t i = 0; i < limits.size(); ++i) limits[i].videoHits = results[i].hits;
+TunedLimit tunedLimit(const Simulated& simulated, std::int64_t limit) {
+  TunedLimit tuned;
+  tuned.lru = simulated.curve.at(limit);
+  for (std::size_t part = 0; part < kParts; ++part) tuned.lruHitsByPart[part] = simulated.parts[part].at(limit).hits;
+  return tuned;
+}
+
+void simulateOthers(const Trace& trace, Tuning& tuning, unsigned threads, const OnProgress& onProgress) {
+  std::vector<Simulation> simulations;
+  for (const TunedLimit& limit : tuning.limits) {
+    for (const std::string& strategy : tuning.others) simulations.push_back({strategy, limit.lru.limit, {}});
+  }
+  simulate(trace, simulations, threads, onProgress);
+  auto simulation = simulations.cbegin();
+  for (TunedLimit& limit : tuning.limits) {
+    for (const std::string& strategy : tuning.others) limit.strategies[strategy] = (simulation++)->found;
+  }
 }
 
 const TunedLimit* first(const Tuning& tuning, bool TunedLimit::*mark) {
@@ -110,10 +122,10 @@ const TunedLimit* first(const Tuning& tuning, bool TunedLimit::*mark) {
 
 }  // namespace
 
-Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::function<void()>& onAccess) {
-  const Simulated simulated = simulateLeastRecentlyUsed(trace, present, onAccess);
+Tuning tune(const Trace& trace, const TuneSettings& settings, const OnProgress& onProgress) {
+  const Simulated simulated = simulateLeastRecentlyUsed(trace, settings.present, onProgress);
   const HitCurve& curve = simulated.curve;
-  const std::int64_t enough = roundedUp(curve.enough(worth).limit);
+  const std::int64_t enough = roundedUp(curve.enough(settings.worth).limit);
   Tuning tuning;
   tuning.requests = curve.requests();
   tuning.requestedBytes = curve.requestedBytes();
@@ -122,14 +134,25 @@ Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::f
   tuning.assumedSize = trace.assumedSize();
   tuning.seconds = trace.seconds();
   tuning.everything = simulated.everything;
-  tuning.worth = worth;
-  for (const std::int64_t limit : limitsToList(curve, simulated.everything, present, enough)) {
-    tuning.limits.push_back({curve.at(limit), std::nullopt, limit == present, limit == enough});
+  for (std::size_t part = 0; part < kParts; ++part) tuning.requestsByPart[part] = simulated.parts[part].requests();
+  tuning.strategy = settings.strategy;
+  tuning.worth = settings.worth;
+  for (const std::int64_t limit : limitsToList(curve, simulated.everything, settings.present, enough)) {
+    tuning.limits.push_back(tunedLimit(simulated, limit));
+    tuning.limits.back().isPresent = limit == settings.present;
+    tuning.limits.back().isEnough = limit == enough;
   }
-  if (trace.hasMetadata()) playVideoStrategy(trace, tuning.limits, onAccess);
+  tuning.others = {strategies::kGreedyDual};
+  if (trace.hasMetadata()) tuning.others.emplace_back(strategies::kVideoDownload);
+  tuning.others.emplace_back(strategies::kForesight);
+  simulateOthers(trace, tuning, settings.threads, onProgress);
   const std::int64_t last = powerOfTwoFrom(simulated.everything);
   tuning.curve = pointsToPlot(curve, firstLimit(curve, last), last);
   return tuning;
+}
+
+std::uint64_t hitsOf(const TunedLimit& limit, const std::string& strategy) {
+  return strategy == strategies::kLeastRecentlyUsed ? limit.lru.hits : limit.strategies.at(strategy).hits;
 }
 
 const TunedLimit* presentLimit(const Tuning& tuning) { return first(tuning, &TunedLimit::isPresent); }

@@ -1,12 +1,13 @@
 #pragma once
 
 #include <cstdint>
-#include <functional>
-#include <optional>
+#include <map>
 #include <string>
 #include <vector>
 
 #include "tune/HitCurve.h"
+#include "tune/SimulatedCache.h"
+#include "tune/Simulation.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -15,7 +16,8 @@ class Trace;
 // A size limit and what a cache of it would have found.
 struct TunedLimit {
   HitCurve::Point lru;
-  std::optional<std::uint64_t> videoHits;  // in the order of the video strategy
+  ByPart lruHitsByPart = {};
+  std::map<std::string, Found> strategies;  // the other ones
   bool isPresent = false;
   bool isEnough = false;
 };
@@ -26,17 +28,30 @@ struct Tuning {
   std::uint64_t requestedBytes = 0;
   std::uint64_t keys = 0;
   std::uint64_t keysOfUnknownSize = 0;
-  std::int64_t assumedSize = 0;        // of those
-  std::int64_t seconds = 0;            // from the first access to the last
-  std::int64_t everything = 0;         // bytes; with this limit nothing is ever evicted
+  std::int64_t assumedSize = 0;  // of those
+  std::int64_t seconds = 0;      // from the first access to the last
+  std::int64_t everything = 0;   // bytes; with this limit nothing is ever evicted
+  ByPart requestsByPart = {};
+  std::string strategy = strategies::kLeastRecentlyUsed;  // the present one
+  std::vector<std::string> others;                        // simulated beside "lru"
   double worth = 0;                    // the share of all requests that doubling a limit must turn into hits
   std::vector<TunedLimit> limits;      // ascending; the present one and the one that is enough are among them
   std::vector<HitCurve::Point> curve;  // finer, for a plot
 };
 
-// `present`: the current limit, 0 if it is not known. Limits are listed from one that finds next to nothing up to one
-// that evicts nothing. `onAccess` is called after each access.
-Tuning tune(const Trace& trace, std::int64_t present, double worth, const std::function<void()>& onAccess);
+struct TuneSettings {
+  std::int64_t present = 0;                               // the current limit; 0: not known
+  std::string strategy = strategies::kLeastRecentlyUsed;  // the current one
+  double worth = 0.01;
+  unsigned threads = 0;  // 0: as processors
+};
+
+// Limits are listed from one that finds next to nothing up to one that evicts nothing; among them are all powers of two
+// in between, and one and a half times these.
+Tuning tune(const Trace& trace, const TuneSettings& settings, const OnProgress& onProgress);
+
+// The hits of a strategy, of which the limit has to have figures.
+std::uint64_t hitsOf(const TunedLimit& limit, const std::string& strategy);
 
 // The figures of a listed limit; null if it is not listed.
 const TunedLimit* presentLimit(const Tuning& tuning);

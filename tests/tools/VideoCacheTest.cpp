@@ -1,4 +1,4 @@
-#include "tune/VideoCaches.h"
+#include "tune/VideoCache.h"
 
 #include <gtest/gtest.h>
 
@@ -19,13 +19,13 @@ namespace {
 using ItemType = VideoDownloadExtendedMetadata::ItemType;
 
 // The strategy's settings hold for the whole process.
-class VideoCachesTest : public testing::Test {
+class VideoCacheTest : public testing::Test {
  protected:
   static void weigh(int weight, int cutoff) {
     VideoDownloadPruneStrategy::priorityWeight = weight;
     VideoDownloadPruneStrategy::highPriorityVideoSecondCutoff = cutoff;
   }
-  ~VideoCachesTest() override { weigh(0, 0); }
+  ~VideoCacheTest() override { weigh(0, 0); }
 };
 
 Access chunk(std::uint32_t key, std::int64_t date, int second, int type = 0) {
@@ -36,6 +36,15 @@ Access chunk(std::uint32_t key, std::int64_t date, int second, int type = 0) {
   access.chunkSecond = second;
   access.itemType = type;
   return access;
+}
+
+std::uint64_t hitsOf(const std::vector<Access>& trace, std::int64_t limit) {
+  VideoCache cache(limit);
+  std::uint64_t hits = 0;
+  for (const Access& access : trace) {
+    if (cache.access(access, VideoCache::kNever) && access.kind == AccessKind::Fetch) ++hits;
+  }
+  return hits;
 }
 
 // Pruned by asking the strategy itself, item by item.
@@ -67,41 +76,38 @@ std::uint64_t hitsOfAPlainCache(const std::vector<Access>& trace, std::int64_t l
   return hits;
 }
 
-TEST_F(VideoCachesTest, AnEarlyChunkOutlivesLaterOnesThatWereUsedSince) {
+TEST_F(VideoCacheTest, AnEarlyChunkOutlivesLaterOnesThatWereUsedSince) {
   weigh(1000, 5);
-  VideoCaches caches({20});
-  caches.access(chunk(0, 1, 2));
-  for (std::uint32_t i = 1; i <= 5; ++i) caches.access(chunk(i, 1 + i, 100));
-  caches.access(chunk(0, 10, 2));
-  EXPECT_EQ(caches.results().front().hits, 1U);
+  std::vector<Access> trace = {chunk(0, 1, 2)};
+  for (std::uint32_t i = 1; i <= 5; ++i) trace.push_back(chunk(i, 1 + i, 100));
+  trace.push_back(chunk(0, 10, 2));
+  EXPECT_EQ(hitsOf(trace, 20), 1U);
 }
 
-TEST_F(VideoCachesTest, WithoutAWeightTheLeastRecentlyUsedGoes) {
+TEST_F(VideoCacheTest, WithoutAWeightTheLeastRecentlyUsedGoes) {
   weigh(0, 5);
-  VideoCaches caches({20});
-  caches.access(chunk(0, 1, 2));
-  for (std::uint32_t i = 1; i <= 5; ++i) caches.access(chunk(i, 1 + i, 100));
-  caches.access(chunk(0, 10, 2));
-  caches.access(chunk(5, 11, 100));
-  EXPECT_EQ(caches.results().front().hits, 1U);
+  std::vector<Access> trace = {chunk(0, 1, 2)};
+  for (std::uint32_t i = 1; i <= 5; ++i) trace.push_back(chunk(i, 1 + i, 100));
+  trace.push_back(chunk(0, 10, 2));
+  trace.push_back(chunk(5, 11, 100));
+  EXPECT_EQ(hitsOf(trace, 20), 1U);
 }
 
-TEST_F(VideoCachesTest, StoresAreNoRequestsAndWhatIsRemovedIsGone) {
-  VideoCaches caches({100});
-  Access access = chunk(0, 1, 0);
-  access.kind = AccessKind::Store;
-  caches.access(access);
-  caches.access(access);
-  EXPECT_EQ(caches.results().front().hits, 0U);
-  caches.access(chunk(0, 2, 0));
-  EXPECT_EQ(caches.results().front().hits, 1U);
-  access.kind = AccessKind::Remove;
-  caches.access(access);
-  caches.access(chunk(0, 3, 0));
-  EXPECT_EQ(caches.results().front().hits, 1U);
+TEST_F(VideoCacheTest, StoresAreNoRequestsAndWhatIsRemovedIsGone) {
+  Access store = chunk(0, 1, 0);
+  store.kind = AccessKind::Store;
+  Access removal = store;
+  removal.kind = AccessKind::Remove;
+  Access clear = store;
+  clear.kind = AccessKind::Clear;
+  const Access fetch = chunk(0, 2, 0);
+  EXPECT_EQ(hitsOf({store, store}, 100), 0U);
+  EXPECT_EQ(hitsOf({store, store, fetch}, 100), 1U);
+  EXPECT_EQ(hitsOf({store, store, fetch, removal, fetch}, 100), 1U);
+  EXPECT_EQ(hitsOf({store, store, fetch, clear, fetch, fetch}, 100), 2U);
 }
 
-TEST_F(VideoCachesTest, AgreeWithTheStrategyItselfOnRandomTraces) {
+TEST_F(VideoCacheTest, AgreeWithTheStrategyItselfOnRandomTraces) {
   weigh(1337, 4);
   std::mt19937 random(3);
   std::vector<Access> trace;
@@ -111,11 +117,8 @@ TEST_F(VideoCachesTest, AgreeWithTheStrategyItselfOnRandomTraces) {
     trace.push_back(chunk(key, 1000 + 100 * i, static_cast<int>(key % 9), static_cast<int>(key % 5)));
     trace.back().size = 1 + key % 13;
   }
-  const std::vector<std::int64_t> limits = {0, 7, 40, 90, 150, 400};
-  VideoCaches caches(limits);
-  for (const Access& access : trace) caches.access(access);
-  for (const VideoCaches::Result& result : caches.results()) {
-    EXPECT_EQ(result.hits, hitsOfAPlainCache(trace, result.limit)) << result.limit;
+  for (const std::int64_t limit : {0, 7, 40, 90, 150, 400}) {
+    EXPECT_EQ(hitsOf(trace, limit), hitsOfAPlainCache(trace, limit)) << limit;
   }
 }
 
