@@ -6,7 +6,6 @@
 #include <cstddef>
 #include <cstdint>
 #include <list>
-#include <memory>
 #include <optional>
 #include <random>
 #include <set>
@@ -14,13 +13,7 @@
 #include <utility>
 #include <vector>
 
-#include "DiskCache.h"
-#include "FileUtils.h"
-#include "TrashCollector.h"
-#include "host/Await.h"
-#include "host/testing/ManualClock.h"
-#include "host/testing/ManualQueue.h"
-#include "support/TemporaryDirectory.h"
+#include "tools/RealCache.h"
 #include "tune/Access.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -58,48 +51,6 @@ class PlainCache {
   const std::int64_t limit_;
   std::int64_t total_ = 0;
   std::list<std::pair<std::uint32_t, std::int64_t>> items_;  // used last at the front
-};
-
-// The library's own cache, used as an application uses it: what is not found is stored, and what has another size than
-// wanted, too; after that the cache is pruned.
-class RealCache {
- public:
-  explicit RealCache(unsigned int limit) {
-    const auto files = std::make_shared<FileUtils>();
-    const auto trash = std::make_shared<TrashCollector>(directory_.file("trash"), files, nullptr, queues_);
-    cache_ = DiskCache::createDiskCache(directory_.file("cache"), directory_.file("tmp"), "cache", std::nullopt,
-                                        1'000'000'000, limit, 0, true, queues_, nullptr, trash, nullptr, nullptr,
-                                        nullptr, files, nullptr, 50);
-    queues_->runAll();
-  }
-
-  bool access(const Access& access) {
-    const std::string key = "key" + std::to_string(access.key);
-    clock_.advance(1);
-    if (access.kind == AccessKind::Remove) {
-      finish(cache_->removeItem(key));
-      return false;
-    }
-    const auto found = finish(cache_->fetch(key));
-    const auto size = static_cast<std::size_t>(access.size);
-    if (found == nullptr || found->value.size() != size) {
-      finish(cache_->store(key, std::vector<unsigned char>(size, 'x')));
-      cache_->pruneBackToNormal([] {}, [](const std::exception& error) { FAIL() << error.what(); }, false);
-      queues_->runAll();
-    }
-    return found != nullptr;
-  }
-
- private:
-  template <class T> T finish(Future<T> future) {
-    queues_->runAll();
-    return host::await(std::move(future));
-  }
-
-  test::ManualClock clock_{1'000'000};
-  test::TemporaryDirectory directory_;
-  std::shared_ptr<test::ManualQueueFactory> queues_ = std::make_shared<test::ManualQueueFactory>();
-  std::shared_ptr<DiskCache> cache_;
 };
 
 struct Habits {
@@ -218,6 +169,16 @@ TEST(StackDistances, AnItemOfNoBytesIsFoundAtALimitOfNone) {
   StackDistances distances;
   distances.use(0, 0);
   EXPECT_EQ(distances.use(0, 0), at(0));
+}
+
+TEST(StackDistances, WhatIsClearedIsNewAndTheGreatestTotalStays) {
+  StackDistances distances;
+  distances.use(0, 10);
+  distances.use(1, 20);
+  distances.clear();
+  EXPECT_EQ(distances.use(1, 5), std::nullopt);
+  EXPECT_EQ(distances.use(1, 5), at(5));
+  EXPECT_EQ(distances.peak(), 30);
 }
 
 TEST(StackDistances, ManyUsesOfFewItemsNeedNoMoreRoom) {
