@@ -5,8 +5,8 @@ _cellar_options() {  # of a command
     demo) echo --root --help ;;
     check) echo --version-tag --locale --session --json --help ;;
     tune)
-      echo --store --limit --config --worth --unknown-size --svg --html --json --csv --key --size --time --op --store-op --remove-op --clear-op \
-        --chunk-second --item-type --priority-weight --early-seconds --help
+      echo --store --limit --strategy --config --worth --unknown-size --svg --html --json --csv --key --size --time --op --store-op \
+        --remove-op --clear-op --chunk-second --item-type --priority-weight --early-seconds --help
       ;;
     inspect) echo --config --top --json --html --help ;;
     verify) echo --repair --help ;;
@@ -29,6 +29,10 @@ _cellar() {
     --root)
       compopt -o filenames 2>/dev/null
       mapfile -t COMPREPLY < <(compgen -d -- "$word")
+      return
+      ;;
+    --strategy)
+      mapfile -t COMPREPLY < <(compgen -W "lru greedy_dual video_download" -- "$word")
       return
       ;;
     --version-tag | --locale | --session | --store | --limit | --worth | --unknown-size | --top) return ;;

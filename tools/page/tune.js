@@ -37,10 +37,19 @@ function mark(what, limit) {
   return { ...curve(label, "quiet", [{ x, y: 0 }, { x, y: 1 }], [4, 4]), isMark: true };
 }
 
+// With the present strategy, of which the figures of a limit may not be those in its row itself.
+function presentLimit() {
+  const { present, strategy } = shown;
+  if (present === null || strategy === "lru") return present;
+  return { limit: present.limit, hit_rate: present.strategies[strategy].hits / shown.requests };
+}
+
 function marks() {
-  const { enough, present } = shown;
-  if (enough !== null && present !== null && enough.limit === present.limit) return [mark("present, and enough", enough)];
-  return [["enough", enough], ["present", present]].filter(([, limit]) => limit !== null).map(([what, limit]) => mark(what, limit));
+  const { advice } = shown;
+  const present = presentLimit();
+  const isAdvised = advice !== null && present !== null && advice.limit === present.limit;
+  if (isAdvised && advice.strategy === shown.strategy) return [mark("present, and enough", advice)];
+  return [["enough", advice], ["present", present]].filter(([, limit]) => limit !== null).map(([what, limit]) => mark(what, limit));
 }
 
 function curves() {
@@ -48,7 +57,7 @@ function curves() {
     curve("lru", "accent", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.hit_rate }))),
     curve("lru, bytes", "third", shown.curve.map((point) => ({ x: placeOf(point.limit), y: point.byte_hit_rate })), [6, 4]),
   ];
-  const drawn = [["greedy_dual", "greedy_dual", "second"], ["video_download", "video_download", "fourth", [2, 3]],
+  const drawn = [["greedy_dual", "greedy_dual", "second"], ["video_download", "video_download", "alarm", [2, 3]],
     ["foresight", "with foresight", "quiet", [1, 3]]];
   for (const [strategy, label, name, dash] of drawn) {
     const simulated = shown.limits.filter((limit) => limit.strategies?.[strategy] !== undefined);

@@ -14,12 +14,10 @@
 #include "Progress.h"
 #include "PruneStrategy.h"
 #include "TextFile.h"
-#include "check/ConfigurationDocument.h"
-#include "check/Faults.h"
-#include "check/ResolvedConfiguration.h"
 #include "tune/CsvReader.h"
 #include "tune/EventReader.h"
 #include "tune/LineReader.h"
+#include "tune/Present.h"
 #include "tune/Trace.h"
 #include "tune/TunePage.h"
 #include "tune/TunePlot.h"
@@ -35,7 +33,8 @@ constexpr double kPercent = 100;
 struct TuneOptions {
   std::string events;
   std::string store;
-  std::int64_t limit = 0;
+  std::string limit;
+  std::string strategy = strategies::kLeastRecentlyUsed;
   std::string configuration;
   double worth = 1;  // percent
   std::int64_t unknownSize = -1;
@@ -47,29 +46,6 @@ struct TuneOptions {
   int priorityWeight = 0;
   int earlySeconds = 0;
 };
-
-// The store of that identifier or, because events contain names, of that name.
-std::shared_ptr<const StoreDefinition> findStore(const ResolvedConfiguration& resolved, const std::string& store) {
-  for (const ResolvedManager& manager : resolved) {
-    for (const ResolvedStore& candidate : manager.stores) {
-      if (candidate.identifier == store || candidate.definition->name == store) return candidate.definition;
-    }
-  }
-  return nullptr;
-}
-
-std::int64_t configuredLimit(const std::string& file, const std::string& name) {
-  const ConfigurationDocument document = readConfigurationDocument(file);
-  const Diagnostics faults = findFaults(document);
-  if (!faults.empty()) throw InputError(file + ": " + faults.front().pointer + ": " + faults.front().text);
-  const auto store = findStore(resolve(document, {}), name);
-  if (store == nullptr) throw InputError(file + ": there is no store '" + name + "'");
-  if (store->type != StoreDefinition::Type::DiskCache) {
-    throw InputError(file + ": store '" + name + "' is not a disk cache and has no size limit");
-  }
-  if (store->maxSize == 0) throw InputError(file + ": the limit of store '" + name + "' is 0");
-  return store->maxSize;
-}
 
 std::string listOf(const EventCounts& counts) {
   std::string list;
@@ -114,11 +90,20 @@ void readTrace(const TuneOptions& options, Console& console, Trace& trace, TuneR
   }
 }
 
-Tuning tuneTrace(const TuneOptions& options, const Trace& trace, std::int64_t present, Console& console) {
-  Progress progress(console, "simulating the accesses");
+TuneSettings settingsOf(const TuneOptions& options) {
   TuneSettings settings;
-  settings.present = present;
+  if (options.configuration.empty()) {
+    settings.present = options.limit.empty() ? 0 : parseLimit(options.limit);
+    settings.strategy = options.strategy;
+  } else {
+    settings = configuredSettings(options.configuration, options.store);
+  }
   settings.worth = options.worth / kPercent;
+  return settings;
+}
+
+Tuning tuneTrace(const TuneSettings& settings, const Trace& trace, Console& console) {
+  Progress progress(console, "simulating the accesses");
   return tune(trace, settings, [&](std::uint64_t done, std::uint64_t whole) { progress.advanceTo(done, whole); });
 }
 
@@ -126,8 +111,7 @@ void runTune(const TuneOptions& options) {
   if (!options.configuration.empty() && options.store.empty()) {
     throw InputError("--config needs --store, to know which limit to read");
   }
-  const std::int64_t present =
-      options.configuration.empty() ? options.limit : configuredLimit(options.configuration, options.store);
+  const TuneSettings settings = settingsOf(options);
   VideoDownloadPruneStrategy::priorityWeight = options.priorityWeight;
   VideoDownloadPruneStrategy::highPriorityVideoSecondCutoff = options.earlySeconds;
 
@@ -136,7 +120,8 @@ void runTune(const TuneOptions& options) {
   Trace trace;
   if (options.unknownSize >= 0) trace.assumeSize(options.unknownSize);
   readTrace(options, console, trace, report);
-  report.tuning = tuneTrace(options, trace, present, console);
+  report.tuning = tuneTrace(settings, trace, console);
+  if (report.tuning.strategy != settings.strategy) report.missingStrategy = settings.strategy;
   if (!options.svg.empty()) writeTextFile(options.svg, tuningAsSvg(report));
   if (!options.html.empty()) writeTextFile(options.html, tuningAsPage(report));
   if (options.json) {
@@ -184,6 +169,16 @@ void addVideoOptions(CLI::App& tune, TuneOptions& options) {
           "SECONDS");
 }
 
+// Empty if it is one.
+std::string whyNotALimit(const std::string& text) {
+  try {
+    (void)parseLimit(text);
+    return "";
+  } catch (const InputError& error) {
+    return error.what();
+  }
+}
+
 }  // namespace
 
 void addTuneCommand(CLI::App& app, int& status) {
@@ -195,13 +190,21 @@ void addTuneCommand(CLI::App& app, int& status) {
       ->type_name("FILE");
   tune->add_option("--store", options->store, "The store's name; not needed if all events are of one store")
       ->type_name("NAME");
-  CLI::Option* const limit = tune->add_option("--limit", options->limit, "The present limit: 52428800, 50MB")
-                                 ->transform(CLI::AsSizeValue(false).description(""))
-                                 ->check(CLI::Validator(CLI::PositiveNumber).description(""))
-                                 ->type_name("SIZE");
-  tune->add_option("--config", options->configuration, "Take the present limit of the store from this configuration")
+  CLI::Option* const limit =
+      tune->add_option("--limit", options->limit, "The present limit, as a configuration has it (50MB), or in bytes")
+          ->check(CLI::Validator(whyNotALimit, ""))
+          ->type_name("SIZE");
+  CLI::Option* const strategy =
+      tune->add_option("--strategy", options->strategy, "The present prune_strategy: lru, greedy_dual, video_download")
+          ->check(CLI::IsMember({strategies::kLeastRecentlyUsed, strategies::kGreedyDual, strategies::kVideoDownload})
+                      .description(""))
+          ->capture_default_str()
+          ->type_name("NAME");
+  tune->add_option("--config", options->configuration,
+                   "Take the present limit and strategy of the store from this configuration")
       ->type_name("FILE")
-      ->excludes(limit);
+      ->excludes(limit)
+      ->excludes(strategy);
   tune->add_option("--worth", options->worth, "Percent of the requests that doubling a limit has to turn into hits")
       ->check(CLI::Range(0.001, 100.0).description(""))
       ->capture_default_str()
@@ -217,8 +220,8 @@ void addTuneCommand(CLI::App& app, int& status) {
   addCsvOptions(*tune, *options);
   addVideoOptions(*tune, *options);
   tune->footer(
-      "Computes for every size limit how many requests a cache would have found that evicts the least recently\n"
-      "used items as soon as it is over its limit. docs/tuning.md explains the figures and their limits.\n\n"
+      "Computes for every size limit how many requests a cache would have found that is pruned as soon as it is over\n"
+      "its limit, with each prune_strategy. docs/tuning.md explains the figures and their limits.\n\n"
       "Examples:\n"
       "  cellar tune analytics.jsonl --store thumbs --config storage.json --svg thumbs.svg\n"
       "  zcat trace.csv.gz | cellar tune - --csv --key lbn --size size --op op --store-op 2a");

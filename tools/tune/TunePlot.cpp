@@ -8,6 +8,7 @@
 
 #include "Format.h"
 #include "Markup.h"
+#include "tune/Advice.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -48,8 +49,9 @@ class Plot {
     text(kLeft, 28, "start", title);
     drawRules();
     drawCurves();
-    drawMark(enoughLimit(tuning_), "enough", kTop + 14);
-    drawMark(presentLimit(tuning_), "present", kTop + 30);
+    const Advice advice = adviceOn(tuning_);
+    if (!advice.isTooShort) drawMark(advice.limit, advice.strategy, "enough", kTop + 14);
+    drawMark(presentLimit(tuning_), tuning_.strategy, "present", kTop + 30);
     return svg_ + "</svg>\n";
   }
 
@@ -110,14 +112,14 @@ class Plot {
     text(left + 34, 52, "start", name);
   }
 
-  void drawMark(const TunedLimit* limit, const std::string& what, double base) {
+  void drawMark(const TunedLimit* limit, const std::string& strategy, const std::string& what, double base) {
     if (limit == nullptr) return;
     const double left = x(std::log2(static_cast<double>(limit->lru.limit)));
     const bool isRight = left > (kLeft + kRight) / 2;
     line("mark", at(limit->lru.limit, 0) + at(limit->lru.limit, 1));
     text(isRight ? left - 6 : left + 6, base, isRight ? "end" : "start",
          what + ": " + formatWholeSize(static_cast<std::uint64_t>(limit->lru.limit)) + ", " +
-             number(100 * share(limit->lru.hits, tuning_.requests)) + " %");
+             number(100 * share(hitsOf(*limit, strategy), tuning_.requests)) + " %");
   }
 
   const Tuning& tuning_;

@@ -1,13 +1,13 @@
 #include "tune/TuneReport.h"
 
-#include <array>
-#include <cstdio>
-#include <limits>
+#include <cmath>
 #include <vector>
 
 #include "Console.h"
 #include "Format.h"
 #include "Printable.h"
+#include "tune/Advice.h"
+#include "tune/AdviceText.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -15,20 +15,15 @@ namespace {
 
 using Json = nlohmann::ordered_json;
 
-std::string percent(double part) {
-  std::array<char, 32> text{};
-  (void)std::snprintf(text.data(), text.size(), "%.2f %%", part * 100);
-  return text.data();
-}
-
 std::string bytes(std::int64_t size) { return formatSize(static_cast<std::uint64_t>(size)); }
 
 std::string wholeBytes(std::int64_t size) { return formatWholeSize(static_cast<std::uint64_t>(size)); }
 
-std::string noteOn(const TunedLimit& limit) {
-  if (limit.isPresent && limit.isEnough) return "present, and enough";
+std::string noteOn(const TunedLimit& limit, const Advice& advice) {
+  const bool isEnough = &limit == advice.limit && !advice.isTooShort;
+  if (limit.isPresent && isEnough) return "present, and enough";
   if (limit.isPresent) return "present";
-  return limit.isEnough ? "enough" : "";
+  return isEnough ? "enough" : "";
 }
 
 // As a configuration names it, but for the one that no application can have.
@@ -36,25 +31,32 @@ std::string titleOf(const std::string& strategy) {
   return strategy == strategies::kForesight ? "with foresight" : strategy;
 }
 
+// The share of bytes, which a video cache's simulation is not asked for.
+bool hasBytes(const std::string& strategy) { return strategy != strategies::kVideoDownload; }
+
 std::vector<Table::Column> columnsOf(const Tuning& tuning) {
   std::vector<Table::Column> columns = {{"limit", Table::Align::Right},
-                                        {"hit rate", Table::Align::Right},
-                                        {"of bytes", Table::Align::Right},
-                                        {"hits", Table::Align::Right},
-                                        {"misses", Table::Align::Right}};
-  for (const std::string& strategy : tuning.others) columns.push_back({titleOf(strategy), Table::Align::Right});
+                                        {titleOf(strategies::kLeastRecentlyUsed), Table::Align::Right},
+                                        {"of bytes", Table::Align::Right}};
+  for (const std::string& strategy : tuning.others) {
+    columns.push_back({titleOf(strategy), Table::Align::Right});
+    if (hasBytes(strategy)) columns.push_back({"of bytes", Table::Align::Right});
+  }
+  columns.push_back({"misses", Table::Align::Right});
   columns.push_back({"", Table::Align::Left});
   return columns;
 }
 
-std::vector<std::string> rowOf(const Tuning& tuning, const TunedLimit& limit) {
+std::vector<std::string> rowOf(const Tuning& tuning, const TunedLimit& limit, const Advice& advice) {
   std::vector<std::string> cells = {wholeBytes(limit.lru.limit), percent(share(limit.lru.hits, tuning.requests)),
-                                    percent(share(limit.lru.hitBytes, tuning.requestedBytes)),
-                                    formatCount(limit.lru.hits), formatCount(tuning.requests - limit.lru.hits)};
+                                    percent(share(limit.lru.hitBytes, tuning.requestedBytes))};
   for (const std::string& strategy : tuning.others) {
-    cells.push_back(percent(share(hitsOf(limit, strategy), tuning.requests)));
+    const Found& found = limit.strategies.at(strategy);
+    cells.push_back(percent(share(found.hits, tuning.requests)));
+    if (hasBytes(strategy)) cells.push_back(percent(share(found.hitBytes, tuning.requestedBytes)));
   }
-  cells.push_back(noteOn(limit));
+  cells.push_back(formatCount(tuning.requests - hitsOf(limit, tuning.strategy)));
+  cells.push_back(noteOn(limit, advice));
   return cells;
 }
 
@@ -79,34 +81,12 @@ std::vector<std::string> notesOn(const TuneReport& report) {
   if (report.damagedLines > 0) {
     notes.push_back(formatCount(report.damagedLines, "line is", "lines are") + " not JSON and not counted");
   }
-  return notes;
-}
-
-// With the rule that it follows from.
-std::string adviceOf(const Tuning& tuning) {
-  const TunedLimit* const enough = enoughLimit(tuning);
-  if (enough == nullptr) return "No limit would have found anything: no item is requested twice.";
-  const bool fits = enough->lru.limit <= std::numeric_limits<std::uint32_t>::max();
-  return wholeBytes(enough->lru.limit) + " is enough: from there on, doubling the limit always turns less than " +
-         percent(tuning.worth) + " of the requests into hits." +
-         (fits ? "" : " (The library's own limits end below 4 GB.)");
-}
-
-std::string costOf(const Tuning& tuning, const TunedLimit& present) {
-  const std::string has = "The present limit of " + wholeBytes(present.lru.limit) + " finds " +
-                          percent(share(present.lru.hits, tuning.requests));
-  const TunedLimit* const enough = enoughLimit(tuning);
-  if (enough == nullptr || enough == &present) return has + ".";
-  const std::string other = wholeBytes(enough->lru.limit);
-  const auto misses = [&](std::uint64_t count, const char* comparative) {
-    return formatCount(count) + comparative + (count == 1 ? "miss" : "misses") + " (" +
-           percent(share(count, tuning.requests)) + " of the requests)";
-  };
-  if (enough->lru.limit > present.lru.limit) {
-    return has + ": " + misses(enough->lru.hits - present.lru.hits, " more ") + " than " + other + " would have.";
+  if (!report.missingStrategy.empty()) {
+    notes.push_back("the present strategy \"" + report.missingStrategy + "\" cannot be simulated without metadata; \"" +
+                    tuning.strategy + "\" is taken instead");
   }
-  return has + ": " + misses(present.lru.hits - enough->lru.hits, " fewer ") + " than " + other + ", for " +
-         bytes(present.lru.limit - enough->lru.limit) + " more space.";
+  if (const std::string certainty = certaintyText(tuning); !certainty.empty()) notes.push_back(certainty);
+  return notes;
 }
 
 Json asJson(const Tuning& tuning, const TunedLimit& limit) {
@@ -126,6 +106,20 @@ Json asJson(const Tuning& tuning, const TunedLimit* limit) {
   return limit == nullptr ? Json() : asJson(tuning, *limit);
 }
 
+// Null for a log that is too short, or where nothing would have been found.
+Json adviceAsJson(const Tuning& tuning) {
+  const Advice advice = adviceOn(tuning);
+  if (advice.isTooShort || advice.limit == nullptr) return {};
+  const std::uint64_t hits = hitsOf(*advice.limit, advice.strategy);
+  const double margin = marginOf(tuning, hitsByPart(*advice.limit, advice.strategy));
+  Json json = {{"strategy", advice.strategy},
+               {"limit", advice.limit->lru.limit},
+               {"hits", hits},
+               {"hit_rate", share(hits, tuning.requests)}};
+  if (std::isfinite(margin)) json["margin"] = margin;
+  return json;
+}
+
 }  // namespace
 
 TuneTexts textsOf(const TuneReport& report) {
@@ -134,9 +128,10 @@ TuneTexts textsOf(const TuneReport& report) {
   texts.title = report.store.empty() ? report.source : report.store + ", from " + report.source;
   texts.notes = notesOn(report);
   texts.columns = columnsOf(tuning);
-  for (const TunedLimit& limit : tuning.limits) texts.rows.push_back(rowOf(tuning, limit));
-  texts.advice = adviceOf(tuning);
-  if (const TunedLimit* const present = presentLimit(tuning)) texts.cost = costOf(tuning, *present);
+  const Advice advice = adviceOn(tuning);
+  for (const TunedLimit* const limit : limitsToShow(tuning)) texts.rows.push_back(rowOf(tuning, *limit, advice));
+  texts.advice = adviceText(tuning);
+  texts.cost = costText(tuning);
   return texts;
 }
 
@@ -147,7 +142,7 @@ void printTuning(const TuneReport& report, Console& console) {
   Table table(texts.columns);
   for (const auto& row : texts.rows) table.addRow(row);
   console.raw("\n" + table.text());
-  console.verdict(texts.advice, true);
+  console.verdict(texts.advice, !adviceOn(report.tuning).isTooShort);
   if (!texts.cost.empty()) console.raw(printable(texts.cost) + "\n");
 }
 
@@ -168,6 +163,8 @@ Json tuningAsJson(const TuneReport& report) {
                {"limits", std::move(limits)},
                {"enough", asJson(tuning, enoughLimit(tuning))},
                {"present", asJson(tuning, presentLimit(tuning))},
+               {"strategy", tuning.strategy},
+               {"advice", adviceAsJson(tuning)},
                {"damaged_lines", report.damagedLines}};
   if (report.reportedHits) {
     json["reported_hits"] = *report.reportedHits;

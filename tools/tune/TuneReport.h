@@ -19,6 +19,7 @@ struct TuneReport {
   std::optional<std::uint64_t> reportedHits;  // by the running cache, if the source has it
   std::uint64_t reportedFirstHits = 0;        // the first access to their key: items that were stored before
   std::uint64_t damagedLines = 0;
+  std::string missingStrategy;  // the present one, if it could not be simulated
   Tuning tuning;
 };
 

@@ -42,6 +42,7 @@ std::vector<std::int64_t> limitsToList(const HitCurve& curve, std::int64_t every
                                        std::int64_t enough) {
   const std::int64_t last = powerOfTwoFrom(everything);
   std::vector<std::int64_t> limits = {present, enough};
+  if (2 * enough < last) limits.push_back(2 * enough);
   for (std::int64_t limit = firstLimit(curve, last); limit <= last; limit *= 2) {
     limits.push_back(limit);
     const bool hasMiddle = limit % 2 == 0 && limit < last;
@@ -135,7 +136,6 @@ Tuning tune(const Trace& trace, const TuneSettings& settings, const OnProgress& 
   tuning.seconds = trace.seconds();
   tuning.everything = simulated.everything;
   for (std::size_t part = 0; part < kParts; ++part) tuning.requestsByPart[part] = simulated.parts[part].requests();
-  tuning.strategy = settings.strategy;
   tuning.worth = settings.worth;
   for (const std::int64_t limit : limitsToList(curve, simulated.everything, settings.present, enough)) {
     tuning.limits.push_back(tunedLimit(simulated, limit));
@@ -145,6 +145,8 @@ Tuning tune(const Trace& trace, const TuneSettings& settings, const OnProgress& 
   tuning.others = {strategies::kGreedyDual};
   if (trace.hasMetadata()) tuning.others.emplace_back(strategies::kVideoDownload);
   tuning.others.emplace_back(strategies::kForesight);
+  const bool isKnown = std::find(tuning.others.begin(), tuning.others.end(), settings.strategy) != tuning.others.end();
+  if (isKnown) tuning.strategy = settings.strategy;
   simulateOthers(trace, tuning, settings.threads, onProgress);
   const std::int64_t last = powerOfTwoFrom(simulated.everything);
   tuning.curve = pointsToPlot(curve, firstLimit(curve, last), last);

@@ -41,7 +41,7 @@ struct Tuning {
 
 struct TuneSettings {
   std::int64_t present = 0;                               // the current limit; 0: not known
-  std::string strategy = strategies::kLeastRecentlyUsed;  // the current one
+  std::string strategy = strategies::kLeastRecentlyUsed;  // the current one; "lru" is taken for one without figures
   double worth = 0.01;
   unsigned threads = 0;  // 0: as processors
 };
