@@ -30,6 +30,10 @@ class TraceReadersTest : public testing::Test {
     std::vector<std::string> lines;
     trace.replay([&](const Access& access) {
       const char* const kinds[] = {"fetch ", "store ", "remove "};
+      if (access.kind == AccessKind::Clear) {
+        lines.emplace_back("clear");
+        return;
+      }
       lines.push_back(kinds[static_cast<int>(access.kind)] + std::to_string(access.key) + " " +
                       std::to_string(access.size));
     });
@@ -164,6 +168,17 @@ TEST_F(TraceReadersTest, OperationsThatAreNamedStoreOrRemoveAndAllOthersFetch) {
   names.removes = {"del"};
   readTable("op,lbn,bytes\n28,x,1\n2a,x,2\nset,x,3\ndel,x,\nanything,x,4\n", names);
   EXPECT_THAT(linesOf(trace), ElementsAre("fetch 0 1", "store 0 2", "store 0 3", "remove 0 3", "fetch 0 4"));
+}
+
+TEST_F(TraceReadersTest, AnOperationThatClearsNeedsNeitherKeyNorSize) {
+  CsvColumns names = columns();
+  names.op = "op";
+  names.time = "when";
+  names.clears = {"logout"};
+  readTable("op,when,lbn,bytes\n28,1,x,5\nlogout,2,,\n28,3,x,\nlogout,4,y,7\n", names);
+  EXPECT_THAT(linesOf(trace), ElementsAre("fetch 0 5", "clear", "fetch 0 5", "clear"));
+  EXPECT_EQ(trace.keys(), 1U);
+  EXPECT_EQ(trace.seconds(), 3);
 }
 
 TEST_F(TraceReadersTest, MetadataOfVideosIsTakenWhereItIs) {

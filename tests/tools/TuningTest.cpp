@@ -5,6 +5,7 @@
 
 #include <cstdint>
 #include <nlohmann/json.hpp>
+#include <numeric>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -97,6 +98,37 @@ TEST_F(TuningTest, EnoughIsRoundedUpToAUnitThatAConfigurationCanHave) {
   for (int i = 0; i < 2; ++i) ask("odd", 70 * kMegabyte + 12345);
   for (int i = 0; i < 2; ++i) ask("odd", 70 * kMegabyte + 12345);
   EXPECT_EQ(enoughLimit(tuned())->lru.limit, 71 * kMegabyte);
+}
+
+TEST_F(TuningTest, AtTheEndOfASessionEveryCacheIsEmptied) {
+  for (int session = 0; session < 50; ++session) {
+    askInTurn(10, 3);
+    trace.appendClear(date);
+  }
+  const Tuning tuning = tuned();
+  EXPECT_EQ(tuning.requests, 1500U);
+  EXPECT_EQ(tuning.limits.back().lru.hits, 1000U);
+  for (const auto& [strategy, found] : tuning.limits.back().strategies) EXPECT_EQ(found.hits, 1000U) << strategy;
+}
+
+TEST_F(TuningTest, FiguresOfThePartsAddUpToThoseOfTheWhole) {
+  askInTurn(10, 101);
+  const Tuning tuning = tuned(5 * kMegabyte);
+  const auto sum = [](const ByPart& parts) { return std::accumulate(parts.begin(), parts.end(), std::uint64_t{0}); };
+  EXPECT_EQ(sum(tuning.requestsByPart), tuning.requests);
+  for (const TunedLimit& limit : tuning.limits) {
+    EXPECT_EQ(sum(limit.lruHitsByPart), limit.lru.hits);
+    for (const auto& [strategy, found] : limit.strategies) EXPECT_EQ(sum(found.hitsByPart), found.hits) << strategy;
+  }
+}
+
+TEST_F(TuningTest, APresentStrategyThatCannotBeSimulatedIsTakenForLeastRecentlyUsed) {
+  askInTurn(10, 101);
+  TuneSettings settings;
+  settings.strategy = strategies::kVideoDownload;
+  EXPECT_EQ(tune(trace, settings, [](std::uint64_t, std::uint64_t) {}).strategy, "lru");
+  settings.strategy = strategies::kGreedyDual;
+  EXPECT_EQ(tune(trace, settings, [](std::uint64_t, std::uint64_t) {}).strategy, "greedy_dual");
 }
 
 TEST_F(TuningTest, SaysWhatThePresentLimitCosts) {
