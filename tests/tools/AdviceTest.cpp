@@ -17,7 +17,7 @@ namespace {
 using testing::HasSubstr;
 using testing::Not;
 
-constexpr std::int64_t kMegabyte = 1024 * 1024;
+constexpr std::int64_t kMegabyte = std::int64_t{1} << 20;
 
 // What a log of 10,000 requests could have given, every part of it the same.
 class AdviceTest : public testing::Test {

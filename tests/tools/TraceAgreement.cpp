@@ -20,10 +20,9 @@
 #include "tune/StackDistances.h"
 #include "tune/Trace.h"
 
-namespace {
+namespace velmora::mobile::xplat::cellar::tools {
 
-using namespace velmora::mobile::xplat::cellar;         // NOLINT(google-build-using-namespace): a program of one file
-using namespace velmora::mobile::xplat::cellar::tools;  // NOLINT(google-build-using-namespace): a program of one file
+namespace {
 
 // Returns the number of requests of which the two say something else.
 template <class Simulated> std::uint64_t compare(const std::string& strategy, const Trace& trace, unsigned int limit,
@@ -53,7 +52,9 @@ std::uint64_t compareAt(const Trace& trace, unsigned int limit) {
                  [&](const Access& access) { return greedyDual->access(access, SimulatedCache::kNever); });
 }
 
-int run(int count, char** arguments) {
+}  // namespace
+
+static int run(int count, char** arguments) {
   if (count < 5) throw std::invalid_argument("usage: cellar_trace_agreement trace.csv KEY-COLUMN SIZE-COLUMN LIMIT...");
   LineReader lines(arguments[1]);
   CsvColumns columns;
@@ -66,11 +67,11 @@ int run(int count, char** arguments) {
   return different == 0 ? EXIT_SUCCESS : EXIT_FAILURE;
 }
 
-}  // namespace
+}  // namespace velmora::mobile::xplat::cellar::tools
 
 int main(int count, char** arguments) {
   try {
-    return run(count, arguments);
+    return velmora::mobile::xplat::cellar::tools::run(count, arguments);
   } catch (const std::exception& error) {
     std::cerr << error.what() << std::endl;
     return EXIT_FAILURE;

@@ -143,6 +143,7 @@ std::vector<const TunedLimit*> limitsToShow(const Tuning& tuning) {
     shown.insert(step.index);
   }
   std::vector<const TunedLimit*> limits;
+  limits.reserve(shown.size());
   for (const std::size_t index : shown) limits.push_back(&tuning.limits[index]);
   return limits;
 }

@@ -205,7 +205,8 @@ void addTuneCommand(CLI::App& app, int& status) {
       ->type_name("FILE")
       ->excludes(limit)
       ->excludes(strategy);
-  tune->add_option("--worth", options->worth, "Percent of the requests that doubling a limit has to turn into hits")
+  tune->add_option("--worth", options->worth,
+                   "Percent of the requests that doubling a limit, or another strategy, has to turn into hits")
       ->check(CLI::Range(0.001, 100.0).description(""))
       ->capture_default_str()
       ->type_name("PERCENT");
