@@ -30,10 +30,10 @@ void ForesightCache::remove(Item& item) {
 }
 
 void ForesightCache::clear() {
-  items_.clear();
+  for (const Entry& entry : last_) {
+    if (isCurrent(entry)) remove(items_[entry.second]);
+  }
   last_.clear();
-  total_ = 0;
-  count_ = 0;
 }
 
 void ForesightCache::prune() {

@@ -40,6 +40,10 @@ void GreedyDualCache::store(Item& item, std::uint32_t key, std::int64_t size) {
   order_.added(*item.record);
 }
 
+GreedyDualCache::Item& GreedyDualCache::itemOf(const ManifestRecord& record) {
+  return items_[static_cast<std::uint32_t>(record.modificationDate)];
+}
+
 void GreedyDualCache::remove(Item& item) {
   order_.removed(*item.record);
   item.record.reset();
@@ -48,9 +52,8 @@ void GreedyDualCache::remove(Item& item) {
 
 // As a disk cache is emptied at the end of a session: another one begins, which has learnt nothing.
 void GreedyDualCache::clear() {
+  while (const ManifestRecord* const first = order_.first()) remove(itemOf(*first));
   order_.clear();
-  items_.clear();
-  total_ = 0;
 }
 
 void GreedyDualCache::prune() {
@@ -61,7 +64,7 @@ void GreedyDualCache::prune() {
     const ManifestRecord& first = *order_.first();
     evicted_.emplace_back();
     evicted_.back().size = first.size;
-    remove(items_[static_cast<std::uint32_t>(first.modificationDate)]);
+    remove(itemOf(first));
   }
   if (limit_ > 0) order_.evicted(evicted_);
 }

@@ -23,6 +23,7 @@ class GreedyDualCache : public SimulatedCache {
   };
 
   void store(Item& item, std::uint32_t key, std::int64_t size);
+  Item& itemOf(const ManifestRecord& record);
   void remove(Item& item);
   void clear();
   void prune();

@@ -30,7 +30,9 @@ void StackDistances::remove(std::uint32_t key) {
 }
 
 void StackDistances::clear() {
-  items_.clear();
+  for (const std::uint32_t key : keys_) {
+    if (key != kNowhere) items_[key].slot = kNowhere;
+  }
   total_ = 0;
   count_ = 0;
   rebuild({}, {});

@@ -42,7 +42,8 @@ std::vector<Table::Column> columnsOf(const Tuning& tuning) {
     columns.push_back({titleOf(strategy), Table::Align::Right});
     if (hasBytes(strategy)) columns.push_back({"of bytes", Table::Align::Right});
   }
-  columns.push_back({"misses", Table::Align::Right});
+  const bool isDefault = tuning.strategy == strategies::kLeastRecentlyUsed;
+  columns.push_back({isDefault ? "misses" : "misses of " + tuning.strategy, Table::Align::Right});
   columns.push_back({"", Table::Align::Left});
   return columns;
 }

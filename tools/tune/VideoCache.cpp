@@ -49,9 +49,7 @@ void VideoCache::remove(Item& item) {
 }
 
 void VideoCache::clear() {
-  order_.clear();
-  items_.clear();
-  total_ = 0;
+  while (!order_.empty()) remove(items_[std::get<std::uint32_t>(*order_.begin())]);
 }
 
 void VideoCache::prune() {
