@@ -214,6 +214,37 @@ TEST(CheckWarnings, CachesThatTogetherExceedTheirManagersLimitAreNamed) {
   EXPECT_THAT(ofManager(R"("max_size": "10MB", )" + stores), IsEmpty());
 }
 
+TEST(CheckWarnings, UnmanagedCachesThatAloneExceedTheirManagersLimitAreNamed) {
+  const std::string caches = R"("stores": {"a": {"type": "disk_cache", "lru_size_limit": "1MB"},
+      "b": {"type": "unmanaged", "is_cache": true, "max_size": "4MB"},
+      "c": {"type": "unmanaged", "is_cache": true, "max_size": "5MB"}})";
+  EXPECT_THAT(
+      ofManager(R"("max_size": "8MB", )" + caches),
+      ElementsAre("/m/max_size: its unmanaged caches alone may have 9.0 MB, more than the manager's limit of 8.0 MB: "
+                  "they count for it, and a round of pruning takes nothing from them",
+                  "/m/max_size: its caches may together have 10.0 MB, more than the manager's limit of 8.0 MB"));
+  EXPECT_THAT(
+      ofManager(R"("max_size": "9MB", )" + caches),
+      ElementsAre("/m/max_size: its caches may together have 10.0 MB, more than the manager's limit of 9.0 MB"));
+  EXPECT_THAT(ofManager(R"("max_size": "10MB", )" + caches), IsEmpty());
+  EXPECT_THAT(ofManager(R"("max_size": "1MB", "stores": {"u": {"type": "unmanaged", "max_size": "9MB"}})"), IsEmpty());
+}
+
+TEST(CheckReport, SaysForHowLongALimitMayBeExceeded) {
+  const auto report = [](const std::string& interval) {
+    CheckResult result;
+    result.resolved =
+        resolve(parseConfigurationDocument(R"({"m": {"prune_interval": ")" + interval + R"("}})"), NameTags());
+    std::ostringstream out;
+    Console console(out, false, false);
+    printCheck(result, console);
+    return out.str();
+  };
+  EXPECT_THAT(report("2 days"),
+              HasSubstr("pruned at most every 2 days: it may be exceeded for 2 days between two rounds\n"));
+  EXPECT_THAT(report("0 days"), HasSubstr("never pruned: it may be exceeded for ever\n"));
+}
+
 TEST(CheckWarnings, AManagerThatNeverPrunesIsNamedIfItHasWhatNeedsPruning) {
   EXPECT_THAT(
       ofManager(R"("prune_interval": "0 hours", "stores": {"a": {"type": "disk_cache", "lru_size_limit": "6MB"}})"),
@@ -393,7 +424,8 @@ TEST(CheckReport, FillsInEveryDefault) {
   printCheck(result, console);
   EXPECT_EQ(out.str(), R"(
 m
-  caches/_store_%41lice, a session's; limit 20.0 MB, pruned at most every 1 hour
+  caches/_store_%41lice, a session's; limit 20.0 MB, pruned at most every 1 hour: it may be exceeded for 1 hour between two rounds
+  unmanaged, and no cache: u; what is in them counts for the limit, is never pruned and may exceed it for ever
   c: disk_cache in c_250_v1
       pruned to 0 B, to 0 B when space is short; strategy null, metadata null
       any number of items, stale after 50 years, a file for each value, relaxed

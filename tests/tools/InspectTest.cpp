@@ -8,7 +8,10 @@
 #include <string>
 #include <vector>
 
+#include "AttributeStore.h"
 #include "Console.h"
+#include "DiskSizeCalculator.h"
+#include "FileUtils.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"
@@ -162,7 +165,8 @@ TEST_F(Inspecting, KnowsLimitsAndWhatIsStaleFromTheConfiguration) {
   EXPECT_EQ(storeIn(survey, kWeb).limitBytes, 400U);
   EXPECT_EQ(survey.managers.at(0).name, "media");
   EXPECT_EQ(survey.managers.at(0).limitBytes, 1024U);
-  EXPECT_EQ(survey.managers.at(0).countedBytes, 160U);
+  EXPECT_EQ(survey.managers.at(0).countedBytes, 360U);  // 160 recorded, and 200 measured
+  EXPECT_EQ(survey.managers.at(0).unmanagedBytes, 200U);
   EXPECT_THAT(survey.leftovers, IsEmpty());
 }
 
@@ -171,10 +175,25 @@ TEST_F(Inspecting, SaysHowFullThingsAre) {
   configure();
   const auto document = json();
   const auto& media = document["managers"][0];
-  EXPECT_EQ(media["fill"], 0.1563);
+  EXPECT_EQ(media["fill"], 0.3516);
   EXPECT_EQ(media["stores"][0]["fill"], 1.6);
   EXPECT_EQ(media["stores"][1]["fill"], 0.5);
   EXPECT_EQ(document["managers"][1]["stores"][0]["fill"], 0.25);
+}
+
+// An application counts what it has measured; what it knew is not on the disk, only what it once kept.
+TEST_F(Inspecting, CountsWhatMeasuringAnUnmanagedStoreFindsForTheLimitOfItsManager) {
+  makeRoot();
+  configure();
+  data_.putFile(kWeb + "/_cellar_extended_attributes", "{\"qzDirectorySizeCalculationSize\":7}");
+  EXPECT_THAT(text(), HasSubstr("media, 360 B of 1.0 KB (35 %), of which 200 B measured now in unmanaged stores\n"));
+  data_.putFile("caches/_sessionlessStore/web_250_v0/page", "of another version, which does not count");
+  EXPECT_EQ(look().managers.at(0).countedBytes, 360U);
+  DiskSizeCalculator calculator(std::make_shared<FileUtils>(),
+                                std::make_shared<AttributeStore>(std::make_shared<FileUtils>()), nullptr);
+  calculator.exclude(AttributeStore::fileName);
+  std::filesystem::remove(data_.path(kWeb + "/_cellar_extended_attributes"));
+  EXPECT_EQ(calculator.calculateDirectorySize(data_.path(kWeb)).size, 200);
 }
 
 TEST_F(Inspecting, WithoutAConfigurationTakesTheLowerVersionOfANameForALeftover) {
@@ -272,7 +291,8 @@ TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
   EXPECT_EQ(keysOf(document), "root depth inspected_at totals managers leftovers ages sizes unreadable ");
   EXPECT_EQ(keysOf(document["totals"]),
             "stores items held_bytes manifest_bytes allocated_bytes leftover_bytes leftover_allocated_bytes ");
-  EXPECT_EQ(keysOf(document["managers"][0]), "path directory name area session limit_bytes counted_bytes fill stores ");
+  EXPECT_EQ(keysOf(document["managers"][0]),
+            "path directory name area session limit_bytes counted_bytes fill stores unmanaged_bytes ");
   EXPECT_EQ(
       keysOf(document["managers"][0]["stores"][0]),
       "path directory identifier kind leftover damages items recorded_bytes files file_bytes inline_bytes "

@@ -67,14 +67,35 @@ Lines rulesOf(const StoreDefinition& store) {
   return {"a cache, emptied when it is opened with more than " + formatSize(store.maxSize)};
 }
 
+// Stores that nothing keeps in a size, and that count for their manager's limit all the same.
+std::vector<std::string> unboundedIn(const ResolvedManager& manager) {
+  std::vector<std::string> identifiers;
+  for (const ResolvedStore& store : manager.stores) {
+    const bool isUnmanaged = store.definition->type == StoreDefinition::Type::Unmanaged;
+    if (isUnmanaged && !store.definition->isCache) identifiers.push_back(store.identifier);
+  }
+  return identifiers;
+}
+
+std::string textOfUnbounded(const ResolvedManager& manager) {
+  std::string names;
+  for (const std::string& identifier : unboundedIn(manager)) names += (names.empty() ? "" : ", ") + identifier;
+  if (names.empty()) return "";
+  return "unmanaged, and no cache: " + names +
+         "; what is in them counts for the limit, is never pruned and may exceed " + "it for ever";
+}
+
 void printManager(const ResolvedManager& manager, Console& console) {
   const StoreManagerDefinition& definition = *manager.definition;
   console.heading(printable(definition.name));
-  const std::string rounds = definition.pruneInterval == 0
-                                 ? "never pruned"
-                                 : "pruned at most every " + formatDuration(definition.pruneInterval);
+  const std::string interval = formatDuration(definition.pruneInterval);
+  const std::string rounds =
+      definition.pruneInterval == 0
+          ? "never pruned: it may be exceeded for ever"
+          : "pruned at most every " + interval + ": it may be exceeded for " + interval + " between two rounds";
   console.line(printable(manager.directory) + (definition.sessionScoped ? ", a session's" : ", of no session") +
                "; limit " + formatSize(definition.maxSize) + ", " + rounds);
+  if (const std::string text = textOfUnbounded(manager); !text.empty()) console.line(text);
   if (manager.stores.empty()) console.line("no stores");
   for (const ResolvedStore& store : manager.stores) {
     console.line(printable(store.identifier + ": " + typeName(*store.definition) + " in " + store.directory));
@@ -141,6 +162,7 @@ OrderedJson asJson(const ResolvedManager& manager) {
           {"directory", manager.directory},
           {"max_size", definition.maxSize},
           {"prune_interval", definition.pruneInterval},
+          {"unbounded_stores", unboundedIn(manager)},
           {"session_scoped", definition.sessionScoped},
           {"stores", std::move(stores)}};
 }

@@ -72,10 +72,19 @@ void warnOfFileName(const ResolvedStore& store, Diagnostics& findings) {
 // Caches within their limits can together exceed their manager's, and then nothing can be pruned.
 void warnOfManagerLimit(const ResolvedManager& manager, Diagnostics& findings) {
   std::uint64_t sum = 0;
+  std::uint64_t unmanaged = 0;
   for (const ResolvedStore& store : manager.stores) {
-    if (store.definition->isCache) sum += store.definition->maxSize;
+    if (!store.definition->isCache) continue;
+    sum += store.definition->maxSize;
+    if (store.definition->type == StoreDefinition::Type::Unmanaged) unmanaged += store.definition->maxSize;
   }
-  if (sum <= manager.definition->maxSize) return;
+  if (unmanaged > manager.definition->maxSize) {
+    findings.push_back({"unmanaged_over_manager_limit", memberPointer(manager.pointer, "max_size"),
+                        "its unmanaged caches alone may have " + formatSize(unmanaged) +
+                            ", more than the manager's limit of " + formatSize(manager.definition->maxSize) +
+                            ": they count for it, and a round of pruning takes nothing from them"});
+  }
+  if (sum <= manager.definition->maxSize || sum == unmanaged) return;
   findings.push_back({"over_manager_limit", memberPointer(manager.pointer, "max_size"),
                       "its caches may together have " + formatSize(sum) + ", more than the manager's limit of " +
                           formatSize(manager.definition->maxSize)});

@@ -154,10 +154,14 @@ class Surveyor {
     }
   }
 
+  // An application counts what it has measured of an unmanaged store, which may be old, or nothing yet: here it is what
+  // measuring finds now.
   static void countForLimit(ManagerSurvey& manager) {
     for (const StoreSurvey& store : manager.stores) {
-      const bool counts = store.kind != StoreKind::Unmanaged && !store.leftover;
-      if (counts) manager.countedBytes += store.recordedBytes.value_or(0);
+      if (store.leftover) continue;
+      const bool isUnmanaged = store.kind == StoreKind::Unmanaged;
+      if (isUnmanaged) manager.unmanagedBytes += store.heldBytes();
+      manager.countedBytes += isUnmanaged ? store.heldBytes() : store.recordedBytes.value_or(0);
     }
   }
 

@@ -82,7 +82,8 @@ struct ManagerSurvey {
   std::string session;
   bool isSessionless = false;
   std::optional<std::uint64_t> limitBytes;
-  std::uint64_t countedBytes = 0;  // of its stores with keys, which count for the limit
+  std::uint64_t countedBytes = 0;    // what counts for the limit: recorded, or measured in unmanaged stores
+  std::uint64_t unmanagedBytes = 0;  // the latter part
   std::vector<StoreSurvey> stores;
 };
 

@@ -81,6 +81,7 @@ Json asJson(const ManagerSurvey& manager) {
   json["fill"] = orNull(fillOf(manager));
   json["stores"] = Json::array();
   for (const StoreSurvey& store : manager.stores) json["stores"].push_back(asJson(store));
+  json["unmanaged_bytes"] = manager.unmanagedBytes;
   return json;
 }
 

@@ -133,6 +133,9 @@ class Printer {
     if (manager.limitBytes) {
       title += ", " + formatSize(manager.countedBytes) + " of " + formatSize(*manager.limitBytes) + " (" +
                percent(fillOf(manager)) + ")";
+      if (manager.unmanagedBytes > 0) {
+        title += ", of which " + formatSize(manager.unmanagedBytes) + " measured now in unmanaged stores";
+      }
     }
     return title;
   }

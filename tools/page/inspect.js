@@ -86,9 +86,14 @@ function managerCard(manager, at) {
   card.append(make("div", { className: "top" }, make("h2", { textContent: title }),
     make("span", { className: "quiet", textContent: where.filter(Boolean).join(", ") })));
   if (manager.fill !== null) {
-    card.append(meter(manager.fill), make("p", { className: "quiet" },
+    const fill = make("p", { className: "quiet" },
       figure("span", at + "counted_bytes", formatSize(manager.counted_bytes)), " of ",
-      figure("span", at + "limit_bytes", formatSize(manager.limit_bytes)), " in stores with keys"));
+      figure("span", at + "limit_bytes", formatSize(manager.limit_bytes)));
+    if (manager.unmanaged_bytes > 0) {
+      fill.append(", of which ", figure("span", at + "unmanaged_bytes", formatSize(manager.unmanaged_bytes)),
+        " measured now in unmanaged stores");
+    }
+    card.append(meter(manager.fill), fill);
   }
   const stores = make("div", { className: "stores" });
   manager.stores.forEach((store, index) => stores.append(storeCard(store, at + "stores." + index + ".")));
