@@ -7,17 +7,21 @@
 #include <sstream>
 #include <stdexcept>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "Configuration.h"
 #include "Console.h"
 #include "InputError.h"
+#include "PersistentKeyValueStore.h"
 #include "check/CheckReport.h"
 #include "check/ConfigurationDocument.h"
 #include "check/Faults.h"
 #include "check/KnownKeys.h"
 #include "check/ResolvedConfiguration.h"
 #include "check/Warnings.h"
+#include "host/Host.h"
+#include "support/TemporaryDirectory.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 namespace {
@@ -318,7 +322,7 @@ TEST(CheckWarnings, StoresOfOneNameInSeveralPlacesAreNamed) {
 
 TEST(CheckWarnings, ManagersThatShareADirectoryAreNamed) {
   EXPECT_THAT(warningsOf(R"({"m": {}, "n": {}})"),
-              ElementsAre("/n: shares its directory caches/_store_% with /m: each removes the other's stores"));
+              ElementsAre("/n: shares its directory caches/_store_ with /m: each removes the other's stores"));
   EXPECT_THAT(warningsOf(R"({"m": {}, "n": {"session_scoped": false}, "o": {"area": "shared"}})"), IsEmpty());
 }
 
@@ -411,6 +415,22 @@ TEST(KnownKeys, TheNearestIsNotFarOff) {
 }
 
 // --- The resolved configuration ---
+
+TEST(CheckReport, NamesTheDirectoriesAsTheHostKitDoes) {
+  const test::TemporaryDirectory root;
+  const std::string text = R"({"m": {"stores": {"s": {"type": "pkvs"}}}, "n": {"area": "documents"}})";
+  for (const std::string session : {"", "Alice"}) {
+    host::HostOptions options;
+    options.configuration = text;
+    options.root = root.file("of" + session);
+    options.versionTag = "250";
+    host::Host host(std::move(options));
+    (void)host.store<PersistentKeyValueStore>("s", session);
+    const auto resolved = resolve(parseConfigurationDocument(text), {"250", "", "", session});
+    const std::string directory = "of" + session + "/" + resolved.at(0).directory;
+    EXPECT_TRUE(root.exists(directory + "/" + resolved.at(0).stores.at(0).directory)) << directory;
+  }
+}
 
 TEST(CheckReport, FillsInEveryDefault) {
   CheckResult result;

@@ -234,6 +234,28 @@ TEST_F(Inspecting, FindsTemporaryFilesTrashAndQuarantine) {
   EXPECT_EQ(document["totals"]["stores"], 3);
 }
 
+TEST_F(Inspecting, KeepsManagersApartWhoseAreasHaveNamesOfTheHostsOwn) {
+  configured_ = ConfiguredStores(data_.directory().write("configuration.json", R"({
+    "media": { "max_size": "1KB", "stores": { "thumbs": { "type": "disk_cache" }, "twin": { "type": "pkvs" } } },
+    "user": { "area": "documents", "max_size": "2KB", "stores": {
+      "drafts": { "type": "pkvs", "has_version": true }, "twin_": { "type": "pkvs", "name": "twin" } } },
+    "other": { "area": "shared", "max_size": "4KB" } })"));
+  data_.putItem("Library/_store_alice/thumbs_250_v1", "a", "x");
+  data_.putItem("Support/_store_alice/drafts_v1", "a", "x");
+  data_.putItem("Support/_store_alice/twin_250_v1", "a", "x");
+  data_.putItem("Unclear/_store_alice/twin_250_v1", "a", "x");
+  const Survey survey = look();
+  ASSERT_EQ(survey.managers.size(), 3U);
+  EXPECT_EQ(survey.managers.at(0).name, "media");
+  EXPECT_EQ(survey.managers.at(0).limitBytes, 1024U);
+  EXPECT_EQ(survey.managers.at(1).name, "user");
+  EXPECT_EQ(survey.managers.at(1).limitBytes, 2048U);
+  EXPECT_EQ(storeIn(survey, "Support/_store_alice/twin_250_v1").identifier, "twin_");
+  EXPECT_EQ(survey.managers.at(2).name, "media or user");
+  EXPECT_EQ(survey.managers.at(2).limitBytes, std::nullopt);
+  EXPECT_THAT(leftoversOf(survey), IsEmpty());
+}
+
 TEST_F(Inspecting, SortsAgesAndSizesIntoBuckets) {
   makeRoot();
   const auto document = json();

@@ -31,7 +31,8 @@ ResolvedManager resolveManager(const Configuration& configuration, const std::st
 ResolvedConfiguration resolve(const ConfigurationDocument& document, const NameTags& tags) {
   const Configuration configuration(document.text);
   const StoreDirectoryNameBuilderFactory names(tags.versionTag, tags.localeSecondTag, tags.localeFirstTag);
-  const std::string sessionTag = host::encodeFileName(tags.sessionKey);
+  // As the host kit does it.
+  const std::string sessionTag = tags.sessionKey.empty() ? "" : host::encodeFileName(tags.sessionKey);
   ResolvedConfiguration resolved;
   for (const auto& [name, manager] : document.root.items()) {
     resolved.push_back(resolveManager(configuration, name, manager, names, sessionTag));

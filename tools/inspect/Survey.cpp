@@ -106,10 +106,12 @@ class Surveyor {
     manager.area = place.area;
     manager.session = place.sessionTag();
     manager.isSessionless = place.isSessionless();
-    for (const auto& definition : configured_.managersOf(place)) {
-      manager.name += (manager.name.empty() ? "" : ", ") + definition->name;
-      manager.limitBytes = manager.limitBytes.value_or(0) + definition->maxSize;
+    const auto definitions = configured_.managersOf(place);
+    for (const auto& definition : definitions) {
+      manager.name += (manager.name.empty() ? "" : " or ") + definition->name;
+      manager.limitBytes = definition->maxSize;
     }
+    if (definitions.size() > 1) manager.limitBytes.reset();  // whose limit it is, is not known
     std::vector<ConfiguredStore> matches;
     for (const StorePlace& store : place.stores) {
       matches.push_back(configured_.find(place, store.name));

@@ -18,9 +18,12 @@ constexpr std::array<const char*, 3> kAreaNames = {"caches", "documents", "share
 bool isDigit(char character) { return character >= '0' && character <= '9'; }
 
 // An area of another name belongs to a host with its own locations, and may be any of them.
+bool isForeignArea(const std::string& directoryName) {
+  return std::find(kAreaNames.begin(), kAreaNames.end(), directoryName) == kAreaNames.end();
+}
+
 bool isArea(const std::string& directoryName, Area area) {
-  const auto found = std::find(kAreaNames.begin(), kAreaNames.end(), directoryName);
-  return found == kAreaNames.end() || found - kAreaNames.begin() == static_cast<int>(area);
+  return isForeignArea(directoryName) || kAreaNames.at(static_cast<std::size_t>(area)) == directoryName;
 }
 
 // Whether the part of a name between the store's name and its version is the expected locale and version tag: "_en_US",
@@ -37,9 +40,32 @@ bool fits(const VersionedName& name, const StoreDefinition& store) {
   return fits(name.stem.substr(store.name.size()), store);
 }
 
-std::vector<std::shared_ptr<const StoreManagerDefinition>> managersIn(const std::string& text) {
+using Managers = std::vector<std::shared_ptr<const StoreManagerDefinition>>;
+
+// Of its stores, those that are in the directory.
+std::size_t storesAt(const ManagerPlace& place, const StoreManagerDefinition& manager) {
+  const auto isThere = [&](const auto& configured) {
+    return std::any_of(place.stores.begin(), place.stores.end(), [&](const StorePlace& store) {
+      const VersionedName name(store.name);
+      return fits(name, *configured.second) && name.version == std::to_string(configured.second->version);
+    });
+  };
+  return static_cast<std::size_t>(std::count_if(manager.stores.begin(), manager.stores.end(), isThere));
+}
+
+Managers thoseWithMostStores(const Managers& managers, const ManagerPlace& place) {
+  std::size_t most = 0;
+  for (const auto& manager : managers) most = std::max(most, storesAt(place, *manager));
+  Managers best;
+  for (const auto& manager : managers) {
+    if (storesAt(place, *manager) == most) best.push_back(manager);
+  }
+  return best;
+}
+
+Managers managersIn(const std::string& text) {
   const Configuration configuration(text);
-  std::vector<std::shared_ptr<const StoreManagerDefinition>> managers;
+  Managers managers;
   const JsonValue document = JsonValue::parse(text);
   for (const auto& member : document.items()) managers.push_back(configuration.getManager(member.key()));
   return managers;
@@ -65,7 +91,7 @@ std::vector<std::shared_ptr<const StoreManagerDefinition>> ConfiguredStores::man
     const bool isScope = place.name.empty() || manager->sessionScoped != place.isSessionless();
     if (isScope && isArea(place.area, manager->area)) found.push_back(manager);
   }
-  return found;
+  return isForeignArea(place.area) ? thoseWithMostStores(found, place) : found;
 }
 
 ConfiguredStore ConfiguredStores::find(const ManagerPlace& place, const std::string& directoryName) const {

@@ -30,7 +30,8 @@ class ConfiguredStores {
 
   bool isEmpty() const;
 
-  // The managers that may keep their stores in that directory.
+  // The managers that may keep their stores in that directory. In an area that is none of the host kit's, which may be
+  // any of the three: the one with the most of the directory's stores, several only if they have equally many.
   std::vector<std::shared_ptr<const StoreManagerDefinition>> managersOf(const ManagerPlace& place) const;
 
   // Of several matching stores, the one with the longest name.
