@@ -9,7 +9,7 @@ _cellar_options() {  # of a command
         --remove-op --clear-op --chunk-second --item-type --priority-weight --early-seconds --help
       ;;
     inspect) echo --config --top --json --html --help ;;
-    verify) echo --repair --help ;;
+    verify) echo --repair --config --json --help ;;
     *) echo --help --version ;;
   esac
 }

@@ -192,4 +192,15 @@ std::vector<std::string> ManifestSnapshot::integrityErrors() const {
   return lines;
 }
 
+std::vector<std::string> ManifestSnapshot::foreignParts() const {
+  std::vector<std::string> parts;
+  translatingManifestErrors([&] {
+    SQLiteStore store(path_);
+    SQLiteStoreCursor cursor = store.cursor(
+        "SELECT type || ' ''' || name || '''' FROM sqlite_master WHERE type IN ('trigger', 'view') ORDER BY 1;");
+    while (cursor.next()) parts.push_back(cursor.get<std::string>(0));
+  });
+  return parts;
+}
+
 }  // namespace velmora::mobile::xplat::cellar

@@ -58,6 +58,10 @@ class CELLAR_EXPORT ManifestSnapshot {
   // a sound one.
   std::vector<std::string> integrityErrors() const;
 
+  // What somebody else has put into the database: "trigger 'name'", "view 'name'". A store runs none of it. Throws
+  // `ManifestPersistenceException` for a damaged manifest.
+  std::vector<std::string> foreignParts() const;
+
  private:
   const std::shared_ptr<FileUtils> fileUtils_;
   const std::string directory_;  // the snapshot's own

@@ -302,6 +302,14 @@ TEST_F(Inspecting, KeepsKeysOfAnyBytesInTheirPlace) {
   EXPECT_NO_THROW((void)json().dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace));
 }
 
+TEST_F(Inspecting, ShowsEncodedNamesDecodedAndHarmless) {
+  data_.putItem("documents/_store_%41l%1b/drafts_v1", "%41nna.txt", "x");
+  EXPECT_THAT(text(), HasSubstr("\ndocuments/_store_%41l%1b (session 'Al\\x1b')\n"));
+  EXPECT_THAT(text(), HasSubstr("%41nna.txt ('Anna.txt')"));
+  EXPECT_EQ(json()["managers"][0]["session"], "%41l%1b");
+  EXPECT_EQ(json()["managers"][0]["session_name"], "Al\x1b");
+}
+
 TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
   makeRoot();
   const auto document = json();
@@ -314,7 +322,7 @@ TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
   EXPECT_EQ(keysOf(document["totals"]),
             "stores items held_bytes manifest_bytes allocated_bytes leftover_bytes leftover_allocated_bytes ");
   EXPECT_EQ(keysOf(document["managers"][0]),
-            "path directory name area session limit_bytes counted_bytes fill stores unmanaged_bytes ");
+            "path directory name area session limit_bytes counted_bytes fill stores session_name unmanaged_bytes ");
   EXPECT_EQ(
       keysOf(document["managers"][0]["stores"][0]),
       "path directory identifier kind leftover damages items recorded_bytes files file_bytes inline_bytes "

@@ -8,9 +8,11 @@
 
 #include <cellar/SQLiteManifestPersistence.h>
 
+#include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
 #include "tools/StoredData.h"
 #include "verify/Verification.h"
+#include "verify/VerificationJson.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 namespace {
@@ -258,6 +260,53 @@ TEST_F(Verifying, SaysWhatCouldNotBeRepairedAndCountsItAsRemaining) {
   EXPECT_THAT(repairs(), ElementsAre(testing::HasSubstr("; NOT REPAIRED: ")));
   EXPECT_EQ(result_.repaired, 0U);
   EXPECT_EQ(contentOf(kThumbs + "/stray"), "x");
+}
+
+TEST_F(Verifying, FindsTriggersAndViewsThatSomebodyElseHasMade) {
+  data_.putItem(kThumbs, "a", "value");
+  data_.run(kThumbs,
+            "CREATE TRIGGER spy AFTER UPDATE ON LarderManifest BEGIN DELETE FROM LarderManifest; END;"
+            "CREATE VIEW look AS SELECT key FROM LarderManifest");
+  EXPECT_THAT(findings(), ElementsAre("foreign part: the manifest has the trigger 'spy', which no store runs",
+                                      "foreign part: the manifest has the view 'look', which no store runs"));
+  EXPECT_THAT(repairs(), testing::Each(testing::HasSubstr("; NOT REPAIRED: ")));
+  EXPECT_THAT(data_.rows(kThumbs), ElementsAre("a 5 0 -"));
+}
+
+TEST_F(Verifying, FindsAManifestThatIsMissingOrNoFile) {
+  data_.putItem(kThumbs, "a", "value");
+  const std::string manifest = kThumbs + "/manifest_v1.sqlite";
+  fs::remove(data_.path(manifest));
+  fs::remove(data_.path(manifest + "-shm"));
+  data_.putFile(manifest + "-wal", "log");
+  const std::string finding =
+      "missing manifest: there is no 'manifest_v1.sqlite', but 'manifest_v1.sqlite-wal' is there";
+  EXPECT_THAT(findings(), ElementsAre(finding));
+  EXPECT_THAT(repairs(), ElementsAre(testing::StartsWith(finding + "; NOT REPAIRED: ")));
+  EXPECT_EQ(contentOf(kThumbs + "/a"), "value");
+  fs::create_directory(data_.path(manifest));
+  EXPECT_THAT(findings(), ElementsAre("cannot be read: not a regular file"));
+}
+
+TEST_F(Verifying, KnowsFromTheConfigurationWhichStoresHaveAManifest) {
+  const ConfiguredStores configured(data_.directory().write("configuration.json", R"({"m": {"session_scoped": false,
+    "stores": { "thumbs": { "type": "pkvs", "has_version": true }, "web": { "type": "unmanaged", "has_version": true },
+                "new": { "type": "pkvs", "has_version": true } } } })"));
+  data_.putFile(kThumbs + "/a", "value");
+  data_.putFile(kManager + "/web_v1/page", "page");
+  data_.putFile(kManager + "/new_v1/_cellar_extended_attributes", "{}");
+  EXPECT_THAT(findings(), IsEmpty());
+  const Layout layout = findLayout(data_.root());
+  const auto result = verify(
+      layout, configured, false, [](std::uint64_t) {}, [](const std::string&) {});
+  ASSERT_EQ(result.all.size(), 1U);
+  EXPECT_EQ(describe(result.all.front().finding),
+            "missing manifest: there is no 'manifest_v1.sqlite', but 'a' is there");
+  const auto json = verificationAsJson(layout, result);
+  EXPECT_EQ(json["stores"], 3);
+  EXPECT_EQ(json["findings"][0]["kind"], "missing_manifest");
+  EXPECT_EQ(json["findings"][0]["path"], kThumbs);
+  EXPECT_EQ(json["findings"][0]["repaired"], false);
 }
 
 TEST_F(Verifying, EverythingAtOnceIsSoundAfterOneRepair) {

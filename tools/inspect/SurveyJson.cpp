@@ -4,6 +4,7 @@
 #include <string>
 
 #include "inspect/Totals.h"
+#include "storage/ReadableNames.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -81,6 +82,8 @@ Json asJson(const ManagerSurvey& manager) {
   json["fill"] = orNull(fillOf(manager));
   json["stores"] = Json::array();
   for (const StoreSurvey& store : manager.stores) json["stores"].push_back(asJson(store));
+  const std::string decoded = decodedName(manager.session);
+  json["session_name"] = decoded.empty() ? json["session"] : Json(decoded);
   json["unmanaged_bytes"] = manager.unmanagedBytes;
   return json;
 }

@@ -11,6 +11,7 @@
 #include "Printable.h"
 #include "Table.h"
 #include "inspect/Totals.h"
+#include "storage/ReadableNames.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -128,7 +129,8 @@ class Printer {
 
   static std::string titleOf(const ManagerSurvey& manager) {
     const bool isBelow = manager.path.front() != '.';
-    std::string title = printable(isBelow ? manager.path : manager.directory);
+    const std::string& place = isBelow ? manager.path : manager.directory;
+    std::string title = printable(place + sessionNote(place));
     if (!manager.name.empty()) title += "  " + printable(manager.name);
     if (manager.limitBytes) {
       title += ", " + formatSize(manager.countedBytes) + " of " + formatSize(*manager.limitBytes) + " (" +
@@ -164,7 +166,10 @@ class Printer {
     console_.line(title + ":");
     for (const ItemFigures& item : items) {
       const std::string used = formatAge(survey_.inspectedAt - item.lastAccess);
-      console_.line("  " + formatSize(item.bytes) + "  " + item.key + "  ", used + (item.isInline ? ", inline" : ""));
+      const std::string decoded = decodedName(item.key);
+      const std::string note = decoded.empty() ? "" : " ('" + decoded + "')";
+      console_.line("  " + formatSize(item.bytes) + "  " + item.key + note + "  ",
+                    used + (item.isInline ? ", inline" : ""));
     }
   }
 
@@ -177,8 +182,8 @@ class Printer {
                  {"Bytes", Align::Right},
                  {"On disk", Align::Right}});
     for (const Leftover& leftover : survey_.leftovers) {
-      table.addRow({printable(leftover.path), kindOf(leftover.kind), formatCount(leftover.files),
-                    formatSize(leftover.bytes), formatSize(leftover.allocatedBytes)});
+      table.addRow({printable(leftover.path + sessionNote(leftover.path)), kindOf(leftover.kind),
+                    formatCount(leftover.files), formatSize(leftover.bytes), formatSize(leftover.allocatedBytes)});
     }
     console_.raw(table.text());
   }

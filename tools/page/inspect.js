@@ -82,7 +82,7 @@ function storeCard(store, at) {
 function managerCard(manager, at) {
   const card = make("section", { className: "card manager" });
   const title = manager.name || (manager.path.startsWith(".") ? manager.directory : manager.path);
-  const where = [manager.name ? manager.path : "", manager.session === null ? "" : "session " + manager.session];
+  const where = [manager.name ? manager.path : "", manager.session === null ? "" : "session " + manager.session_name];
   card.append(make("div", { className: "top" }, make("h2", { textContent: title }),
     make("span", { className: "quiet", textContent: where.filter(Boolean).join(", ") })));
   if (manager.fill !== null) {

@@ -19,6 +19,8 @@ struct Finding {
     SupersededFile,  // of a safe store: without a record, and its key has another value
     UnfinishedFile,  // of a safe store: its writer was killed
     DamagedManifest,
+    MissingManifest,     // of a store with keys
+    ForeignPart,         // of a manifest: a trigger, a view
     UnfinishedManifest,  // a safe store was killed while it made it,
     InterruptedSalvage,  // or before it put it in place
     Quarantine,          // of a safe store: what it could not use
@@ -43,5 +45,8 @@ using Findings = std::vector<Finding>;
 
 // What is wrong, for people: "record without file: 'sunrise.jpg' (4.0 KB recorded)".
 std::string describe(const Finding& finding);
+
+// Of its kind, for machines: "record_without_file".
+const char* textOf(Finding::Kind kind);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

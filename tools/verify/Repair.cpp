@@ -42,6 +42,10 @@ std::string Repair::fix(const Finding& finding) {
     case Finding::Kind::DamagedManifest:
       if (finding.isSafe) throw std::runtime_error("the store salvages it at its next start, if it is safe or synced");
       return quarantineStore(finding);
+    case Finding::Kind::MissingManifest:
+      throw std::runtime_error("a safe store adopts its values when it is opened, another one begins empty");
+    case Finding::Kind::ForeignPart:
+      throw std::runtime_error("whoever put it there may need it");
     case Finding::Kind::InterruptedSalvage:
       throw std::runtime_error("the store puts it in its place at its next start");
     case Finding::Kind::UnreadableValue:

@@ -82,6 +82,10 @@ class StoreCheck {
       record.item.hasInlineData ? checkInline(record) : checkFile(record.item);
       if (isSafe_ && findings_.size() == before) soundKeys_.insert(record.item.key);
     }
+    for (const std::string& part : snapshot.foreignParts()) {
+      findings_.push_back(make(Kind::ForeignPart, ManifestSnapshot::manifestName));
+      findings_.back().detail = part;
+    }
     findStrays();
     return std::move(findings_);
   }
@@ -239,17 +243,35 @@ bool isJson(const std::string& path) {
   return JsonValue::accept(bytes.begin(), bytes.end());
 }
 
-Findings checkReadableStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile) {
+// A store without a manifest has nothing to be held against, unless it must have had one: one of SQLite's files is
+// still there, or it is configured with keys and has files.
+Findings checkMissingManifest(const StorePlace& place, bool hasKeys) {
+  const std::string manifest = place.path + "/" + ManifestSnapshot::manifestName;
+  const std::string strangeness = strangenessOf(manifest);
+  if (!strangeness.empty()) return {findingOf({manifest, strangeness})};
+  std::vector<Entry> entries;
+  const auto onEntry = [&](const std::string& below, const Entry& entry) {
+    if (below == entry.name) entries.push_back(entry);
+  };
+  walkTree(place.path, onEntry, [](const Unreadable& /*found with the attributes*/) {});
+  for (const Entry& entry : entries) {
+    const bool isValue = hasKeys && !isAttributesFile(entry) && !isStrangeAttributesFile(entry);
+    if (!isValue && !isManifestFile(entry.name) && entry.name != newManifestName()) continue;
+    Finding finding{Finding::Kind::MissingManifest, place.path, ManifestSnapshot::manifestName};
+    finding.detail = "'" + entry.name + "' is there";
+    return {finding};
+  }
+  return {};
+}
+
+Findings checkReadableStore(const StorePlace& place, bool hasKeys, const std::string& temporaryDirectory,
+                            const OnFile& onFile) {
   // Until it is in its place, the present one says little of the files.
   std::error_code error;
   if (fs::is_regular_file(fs::symlink_status(fs::path(place.path) / salvagedManifestName(), error))) {
     return {{Finding::Kind::InterruptedSalvage, place.path, salvagedManifestName()}};
   }
-  if (!place.hasManifest) {
-    const std::string manifest = place.path + "/" + ManifestSnapshot::manifestName;
-    const std::string strangeness = strangenessOf(manifest);
-    return strangeness.empty() ? Findings() : Findings{findingOf({manifest, strangeness})};
-  }
+  if (!place.hasManifest) return checkMissingManifest(place, hasKeys);
   const ManifestSnapshot snapshot(place.path, temporaryDirectory, std::make_shared<UntouchedFiles>());
   return StoreCheck(place.path, onFile).check(snapshot);
 }
@@ -272,9 +294,10 @@ Finding findingOf(const Unreadable& unreadable) {
   return finding;
 }
 
-Findings checkStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile) {
+Findings checkStore(const StorePlace& place, bool hasKeys, const std::string& temporaryDirectory,
+                    const OnFile& onFile) {
   try {
-    return checkReadableStore(place, temporaryDirectory, onFile);
+    return checkReadableStore(place, hasKeys, temporaryDirectory, onFile);
   } catch (const std::exception& error) {
     return {findingOf(unreadableBy(error, place.path))};
   }

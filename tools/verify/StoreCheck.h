@@ -15,7 +15,8 @@ using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each fil
 
 // Holds records and files of a store against each other; a store without a manifest has nothing to be held against.
 // `temporaryDirectory` is for the copy of the manifest: nothing else is written. What cannot be read is a finding.
-Findings checkStore(const StorePlace& place, const std::string& temporaryDirectory, const OnFile& onFile);
+// `hasKeys`: the store is configured as one that has a manifest once there is a value.
+Findings checkStore(const StorePlace& place, bool hasKeys, const std::string& temporaryDirectory, const OnFile& onFile);
 
 // The finding that this cannot be read.
 Finding findingOf(const Unreadable& unreadable);

@@ -3,10 +3,13 @@
 #include <exception>
 #include <filesystem>
 #include <memory>
+#include <utility>
 
 #include "LarderException.h"
 #include "Printable.h"
+#include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
+#include "storage/ReadableNames.h"
 #include "storage/TemporaryFolder.h"
 #include "verify/HostLocks.h"
 #include "verify/Quarantine.h"
@@ -29,8 +32,9 @@ std::string reasonOf(const std::exception& error) {
 
 class Verifier {
  public:
-  Verifier(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine)
-      : layout_(layout), repair_(repair), onFile_(onFile), onLine_(onLine) {}
+  Verifier(const Layout& layout, const ConfiguredStores& configured, bool repair, const OnFile& onFile,
+           const OnLine& onLine)
+      : layout_(layout), configured_(configured), repair_(repair), onFile_(onFile), onLine_(onLine) {}
 
   VerificationResult run() {
     for (const Unreadable& part : layout_.unreadable) settle({findingOf(part)}, Quarantine(layout_.root));
@@ -38,7 +42,7 @@ class Verifier {
       const Quarantine quarantine = quarantineFor(layout_, manager);
       for (const StorePlace& store : manager.stores) {
         ++result_.stores;
-        settle(checkStore(store, temporary_.path(), onFile_), quarantine);
+        settle(checkStore(store, hasKeys(manager, store), temporary_.path(), onFile_), quarantine);
         settle(checkAttributes(store.path), quarantine);
       }
     }
@@ -50,9 +54,16 @@ class Verifier {
     Repair repair(layout_.root, quarantine);
     for (const Finding& finding : findings) {
       ++result_.findings;
-      std::string line = printable(relativeTo(layout_.root, finding.directory)) + ": " + describe(finding);
-      if (repair_) line += "; " + fix(repair, finding);
+      SettledFinding settled{finding, relativeTo(layout_.root, finding.directory), "", false};
+      std::string line = printable(settled.path + sessionNote(settled.path)) + ": " + describe(finding);
+      if (repair_) {
+        const std::uint64_t before = result_.repaired;
+        settled.outcome = fix(repair, finding);
+        settled.isRepaired = result_.repaired > before;
+        line += "; " + settled.outcome;
+      }
       onLine_(line);
+      result_.all.push_back(std::move(settled));
     }
   }
 
@@ -66,7 +77,13 @@ class Verifier {
     }
   }
 
+  bool hasKeys(const ManagerPlace& manager, const StorePlace& store) const {
+    const auto definition = configured_.find(manager, store.name).definition;
+    return definition != nullptr && definition->type != StoreDefinition::Type::Unmanaged;
+  }
+
   const Layout& layout_;
+  const ConfiguredStores& configured_;
   const bool repair_;
   const OnFile& onFile_;
   const OnLine& onLine_;
@@ -77,9 +94,14 @@ class Verifier {
 }  // namespace
 
 VerificationResult verify(const Layout& layout, bool repair, const OnFile& onFile, const OnLine& onLine) {
+  return verify(layout, ConfiguredStores(), repair, onFile, onLine);
+}
+
+VerificationResult verify(const Layout& layout, const ConfiguredStores& configured, bool repair, const OnFile& onFile,
+                          const OnLine& onLine) {
   std::unique_ptr<const HostLocks> locks;
   if (repair) locks = std::make_unique<const HostLocks>(layout.root);
-  VerificationResult result = Verifier(layout, repair, onFile, onLine).run();
+  VerificationResult result = Verifier(layout, configured, repair, onFile, onLine).run();
   result.isLocked = locks != nullptr && locks->areThere();
   return result;
 }
