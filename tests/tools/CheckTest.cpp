@@ -390,6 +390,28 @@ TEST(CheckFaults, AreThereExactlyWhenTheLibraryRefuses) {
   }
 }
 
+TEST(CheckFaults, KeepNoWarningBackThatCanBeGivenInSpiteOfThem) {
+  const ConfigurationDocument document = parseConfigurationDocument(R"({
+    "m": { "max_size": "10mb", "max_sise": "1MB", "stores": {
+      "a": { "type": "disk_cache", "lru_size_limit": "5GB", "stale_age": 3, "survival_size": "1KB" } } },
+    "n": { "area": "documents", "max_size": "1KB", "stores": {
+      "b": { "type": "disk_cache", "lru_size_limit": "2KB", "max_size": "1KB" },
+      "c": { "type": "pkvs", "odd": 1, "capacity": "3", "version": "x" },
+      "d": { "type": "none", "odd": 1 }, "e": 7, "a": { "type": "pkvs" } } },
+    "o": 3 })");
+  const Diagnostics faults = findFaults(document);
+  EXPECT_EQ(faults.size(), 7U);
+  EXPECT_THAT(linesOf(findWarningsBeside(faults, document, NameTags())),
+              ElementsAre("/n/max_size: its caches may together have 2.0 KB, more than the manager's limit of 1.0 KB",
+                          "/n/stores/b/max_size: stores of type disk_cache ignore this key; their limit is "
+                          "'lru_size_limit'",
+                          "/m/max_sise: unknown key; did you mean 'max_size'?",
+                          "/m/stores/a/lru_size_limit: '5GB' does not fit into 32 bits and becomes 1.0 GB",
+                          "/n/stores/c/odd: unknown key",
+                          "/n/stores/c/capacity: \"3\" is not an integer: the store has no capacity limit"));
+  EXPECT_THAT(findWarningsBeside({{"", "", ""}}, parseConfigurationDocument("[]"), NameTags()), IsEmpty());
+}
+
 // --- Known keys ---
 
 // A value of no type that any key takes: whoever reads the key complains.

@@ -50,7 +50,10 @@ CheckResult check(const CheckOptions& options) {
   CheckResult result;
   result.file = options.file;
   result.faults = findFaults(document);
-  if (!result.faults.empty()) return result;
+  if (!result.faults.empty()) {
+    result.warnings = findWarningsBeside(result.faults, document, tags);
+    return result;
+  }
   result.resolved = resolve(document, tags);
   result.warnings = findWarnings(document, result.resolved);
   return result;
@@ -68,9 +71,9 @@ int runCheck(const CheckOptions& options) {
   printFaults(result);
   if (options.json) {
     std::cout << printable(checkAsJson(result), 2) << std::endl;
-  } else if (result.faults.empty()) {
+  } else {
     Console console = Console::standardOutput();
-    printCheck(result, console);
+    result.faults.empty() ? printCheck(result, console) : printWarnings(result, console);
   }
   if (!result.faults.empty()) return kErrors;
   return result.warnings.empty() ? kClean : kWarnings;

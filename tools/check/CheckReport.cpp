@@ -169,12 +169,16 @@ OrderedJson asJson(const ResolvedManager& manager) {
 
 }  // namespace
 
-void printCheck(const CheckResult& result, Console& console) {
-  for (const ResolvedManager& manager : result.resolved) printManager(manager, console);
-  console.raw("\n");
+void printWarnings(const CheckResult& result, Console& console) {
   for (const Diagnostic& warning : result.warnings) {
     console.bad(printable("warning: " + warning.pointer + ": " + warning.text));
   }
+}
+
+void printCheck(const CheckResult& result, Console& console) {
+  for (const ResolvedManager& manager : result.resolved) printManager(manager, console);
+  console.raw("\n");
+  printWarnings(result, console);
   const std::string counts = formatCount(result.resolved.size(), "manager", "managers") + ", " +
                              formatCount(storesIn(result.resolved), "store", "stores") + ", ";
   console.verdict(result.file + ": " + counts + formatCount(result.warnings.size(), "warning", "warnings"),

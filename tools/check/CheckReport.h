@@ -18,6 +18,7 @@ struct CheckResult {
   Diagnostics warnings;
 };
 
+void printWarnings(const CheckResult& result, Console& console);
 void printCheck(const CheckResult& result, Console& console);
 OrderedJson checkAsJson(const CheckResult& result);
 

@@ -1,5 +1,6 @@
 #include "check/Warnings.h"
 
+#include <algorithm>
 #include <cstdint>
 #include <map>
 #include <string>
@@ -7,6 +8,7 @@
 
 #include "Configuration.h"
 #include "Format.h"
+#include "check/Faults.h"
 #include "check/KeyWarnings.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -166,6 +168,80 @@ Diagnostics findWarnings(const ConfigurationDocument& document, const ResolvedCo
     ++written;
   }
   warnOfRepeatedKeys(document, findings);
+  return findings;
+}
+
+namespace {
+
+// Whether a fault lies at the pointer or below it.
+bool isFaulty(const std::string& pointer, const Diagnostics& faults) {
+  return std::any_of(faults.begin(), faults.end(), [&](const Diagnostic& fault) {
+    return fault.pointer == pointer || fault.pointer.rfind(pointer + "/", 0) == 0;
+  });
+}
+
+// Warns of the keys of what has a fault. What the key's own fault says is not said twice.
+class KeysOfFaulty {
+ public:
+  KeysOfFaulty(const Diagnostics& faults, Diagnostics& findings) : faults_(faults), findings_(findings) {}
+
+  void ofManager(const std::string& pointer, const OrderedJson& manager) {
+    if (manager.is_object()) warnOfManagerKeys(pointer, withoutFaulty(pointer, manager), findings_);
+  }
+
+  void ofStore(const std::string& pointer, const OrderedJson& store) {
+    if (!store.is_object() || !store.contains("type") || isFaulty(memberPointer(pointer, "type"), faults_)) return;
+    warnOfStoreKeys(pointer, withoutFaulty(pointer, store), findings_);
+  }
+
+ private:
+  OrderedJson withoutFaulty(const std::string& pointer, const OrderedJson& object) const {
+    OrderedJson kept = OrderedJson::object();
+    for (const auto& [key, value] : object.items()) {
+      if (key == "stores" || !isFaulty(memberPointer(pointer, key), faults_)) kept[key] = value;
+    }
+    return kept;
+  }
+
+  const Diagnostics& faults_;
+  Diagnostics& findings_;
+};
+
+bool hasOwnFault(const std::string& pointer, const OrderedJson& manager, const Diagnostics& faults) {
+  if (!manager.is_object()) return true;
+  const std::string stores = memberPointer(pointer, "stores") + "/";
+  return std::any_of(faults.begin(), faults.end(), [&](const Diagnostic& fault) {
+    const bool isBelow = fault.pointer == pointer || fault.pointer.rfind(pointer + "/", 0) == 0;
+    return isBelow && fault.pointer.rfind(stores, 0) != 0;
+  });
+}
+
+}  // namespace
+
+Diagnostics findWarningsBeside(const Diagnostics& faults, const ConfigurationDocument& document, const NameTags& tags) {
+  Diagnostics ofKeys;
+  KeysOfFaulty keys(faults, ofKeys);
+  ConfigurationDocument sound;
+  sound.root = OrderedJson::object();
+  sound.repeated = document.repeated;
+  if (!document.root.is_object()) return {};
+  for (const auto& [name, manager] : document.root.items()) {
+    const std::string pointer = memberPointer("", name);
+    const bool isRefused = hasOwnFault(pointer, manager, faults);
+    if (isRefused) keys.ofManager(pointer, manager);
+    if (!isRefused) sound.root[name] = manager;
+    if (!manager.is_object() || !manager.contains("stores") || !manager["stores"].is_object()) continue;
+    for (const auto& [identifier, store] : manager["stores"].items()) {
+      const std::string pointerOfStore = memberPointer(memberPointer(pointer, "stores"), identifier);
+      if (!isRefused && !isFaulty(pointerOfStore, faults)) continue;
+      keys.ofStore(pointerOfStore, store);
+      if (!isRefused) sound.root[name]["stores"].erase(identifier);
+    }
+  }
+  sound.text = sound.root.dump();
+  if (!findFaults(sound).empty()) return ofKeys;
+  Diagnostics findings = findWarnings(sound, resolve(sound, tags));
+  findings.insert(findings.end(), ofKeys.begin(), ofKeys.end());
   return findings;
 }
 
