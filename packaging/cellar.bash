@@ -3,7 +3,7 @@
 _cellar_options() {  # of a command
   case $1 in
     demo) echo --root --help ;;
-    check) echo --version-tag --locale --session --json --help ;;
+    check) echo --version-tag --locale --session --root --json --help ;;
     tune)
       echo --store --limit --strategy --config --worth --unknown-size --svg --html --json --csv --key --size --time --op --store-op \
         --remove-op --clear-op --chunk-second --item-type --priority-weight --early-seconds --help

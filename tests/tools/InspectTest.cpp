@@ -12,10 +12,12 @@
 #include "Console.h"
 #include "DiskSizeCalculator.h"
 #include "FileUtils.h"
+#include "InputError.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"
 #include "storage/ConfiguredStores.h"
+#include "storage/FileSystemSize.h"
 #include "storage/Layout.h"
 #include "support/Watchdog.h"
 #include "tools/StoredData.h"
@@ -310,6 +312,37 @@ TEST_F(Inspecting, ShowsEncodedNamesDecodedAndHarmless) {
   EXPECT_EQ(json()["managers"][0]["session_name"], "Al\x1b");
 }
 
+// A file system of any size.
+class SizedFiles : public FileUtils {
+ public:
+  explicit SizedFiles(long long total) : total_(total) {}
+  DiskSpace getDiskSpace(const std::string& /*path*/) override { return {total_, 0}; }
+
+ private:
+  const long long total_;
+};
+
+TEST_F(Inspecting, SaysWhenTheFileSystemIsSoSmallThatAllIsDiscardedAtEachStart) {
+  makeRoot();
+  const auto shown = [&](long long total) {
+    SizedFiles files(total);
+    Survey survey = look();
+    survey.fileSystemBytes = fileSystemSize(data_.root(), files);
+    std::ostringstream stream;
+    Console console(stream, false, false);
+    printSurvey(survey, console);
+    return stream.str() + surveyAsJson(survey)["discarded_at_start"].dump();
+  };
+  constexpr long long kLimit = 75LL << 20;
+  EXPECT_THAT(shown(kLimit - 1),
+              HasSubstr("the whole file system has 75.0 MB, less than 75.0 MB: at every start, managers discard all"));
+  EXPECT_THAT(shown(kLimit - 1), testing::EndsWith("true"));
+  EXPECT_THAT(shown(kLimit), Not(HasSubstr("file system")));
+  EXPECT_THAT(shown(kLimit), testing::EndsWith("false"));
+  FileUtils real;
+  EXPECT_THROW(fileSystemSize(data_.path("missing"), real), InputError);
+}
+
 TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
   makeRoot();
   const auto document = json();
@@ -318,7 +351,9 @@ TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
     for (const auto& member : object.items()) keys += member.key() + " ";
     return keys;
   };
-  EXPECT_EQ(keysOf(document), "root depth inspected_at totals managers leftovers ages sizes unreadable ");
+  EXPECT_EQ(
+      keysOf(document),
+      "root depth inspected_at totals managers leftovers ages sizes unreadable file_system_bytes discarded_at_start ");
   EXPECT_EQ(keysOf(document["totals"]),
             "stores items held_bytes manifest_bytes allocated_bytes leftover_bytes leftover_allocated_bytes ");
   EXPECT_EQ(keysOf(document["managers"][0]),

@@ -1,11 +1,13 @@
 #include "check/Check.h"
 
 #include <CLI/CLI.hpp>
+#include <cstdint>
 #include <iostream>
 #include <memory>
 #include <string>
 
 #include "Console.h"
+#include "FileUtils.h"
 #include "InputError.h"
 #include "Printable.h"
 #include "check/CheckReport.h"
@@ -13,6 +15,7 @@
 #include "check/Faults.h"
 #include "check/ResolvedConfiguration.h"
 #include "check/Warnings.h"
+#include "storage/FileSystemSize.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -27,6 +30,7 @@ struct CheckOptions {
   std::string versionTag;
   std::string locale;
   std::string session;
+  std::string root;
   bool json = false;
 };
 
@@ -44,7 +48,13 @@ NameTags tagsOf(const CheckOptions& options) {
   return tags;
 }
 
-CheckResult check(const CheckOptions& options) {
+Diagnostics warningsOfPlace(const std::string& root, FileUtils& fileUtils) {
+  if (root.empty()) return {};
+  const std::int64_t size = fileSystemSize(root, fileUtils);
+  return isTooSmall(size) ? Diagnostics{{"small_file_system", "", root + ": " + tooSmallText(size)}} : Diagnostics();
+}
+
+CheckResult checkDocument(const CheckOptions& options) {
   const NameTags tags = tagsOf(options);
   const ConfigurationDocument document = readConfigurationDocument(options.file);
   CheckResult result;
@@ -56,6 +66,14 @@ CheckResult check(const CheckOptions& options) {
   }
   result.resolved = resolve(document, tags);
   result.warnings = findWarnings(document, result.resolved);
+  return result;
+}
+
+CheckResult check(const CheckOptions& options) {
+  FileUtils fileUtils;
+  const Diagnostics ofPlace = warningsOfPlace(options.root, fileUtils);
+  CheckResult result = checkDocument(options);
+  result.warnings.insert(result.warnings.begin(), ofPlace.begin(), ofPlace.end());
   return result;
 }
 
@@ -94,6 +112,10 @@ void addCheckCommand(CLI::App& app, int& status) {
       ->type_name("LOCALE");
   check->add_option("--session", options->session, "The key of a session; directories are named as by the host kit")
       ->type_name("KEY");
+  check
+      ->add_option("--root", options->root,
+                   "The directory that is to hold everything: warn if its file system is too small")
+      ->type_name("DIR");
   check->add_flag("--json", options->json, "Print one JSON object for machines; sizes in bytes, durations in seconds");
   check->footer(
       "Reads the document with the library's own parser and prints the result: managers and stores with every\n"

@@ -171,7 +171,7 @@ OrderedJson asJson(const ResolvedManager& manager) {
 
 void printWarnings(const CheckResult& result, Console& console) {
   for (const Diagnostic& warning : result.warnings) {
-    console.bad(printable("warning: " + warning.pointer + ": " + warning.text));
+    console.bad(printable("warning: " + warning.pointer + (warning.pointer.empty() ? "" : ": ") + warning.text));
   }
 }
 

@@ -8,6 +8,7 @@
 #include <string>
 
 #include "Console.h"
+#include "FileUtils.h"
 #include "InputError.h"
 #include "Printable.h"
 #include "Progress.h"
@@ -17,6 +18,7 @@
 #include "inspect/SurveyText.h"
 #include "page/Page.h"
 #include "storage/ConfiguredStores.h"
+#include "storage/FileSystemSize.h"
 #include "storage/Layout.h"
 #include "storage/UntouchedFiles.h"
 
@@ -52,8 +54,11 @@ Survey survey(const InspectOptions& options, Console& console) {
   Progress progress(console, "looking at files");
   const std::uint64_t files = console.isTerminal() ? countFiles(layout.root) : 0;
   std::uint64_t seen = 0;
-  return makeSurvey(layout, configured, options.top, std::time(nullptr),
-                    [&](std::uint64_t /*bytes*/) { progress.advanceTo(++seen, files); });
+  Survey result = makeSurvey(layout, configured, options.top, std::time(nullptr),
+                             [&](std::uint64_t /*bytes*/) { progress.advanceTo(++seen, files); });
+  FileUtils fileUtils;
+  result.fileSystemBytes = fileSystemSize(layout.root, fileUtils);
+  return result;
 }
 
 int runInspect(const InspectOptions& options) {

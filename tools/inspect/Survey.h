@@ -101,7 +101,8 @@ struct Survey {
   std::int64_t inspectedAt;  // seconds since the Unix epoch
   std::vector<ManagerSurvey> managers;
   std::vector<Leftover> leftovers;
-  std::vector<Unreadable> unreadable;  // not in any figure; paths below the root
+  std::vector<Unreadable> unreadable;           // not in any figure; paths below the root
+  std::optional<std::int64_t> fileSystemBytes;  // the size of the whole file system, if it was asked for
 };
 
 using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each file that is looked at

@@ -4,6 +4,7 @@
 #include <string>
 
 #include "inspect/Totals.h"
+#include "storage/FileSystemSize.h"
 #include "storage/ReadableNames.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -125,6 +126,8 @@ nlohmann::ordered_json surveyAsJson(const Survey& survey) {
   for (const Unreadable& part : survey.unreadable) {
     json["unreadable"].push_back({{"path", part.path}, {"reason", part.reason}});
   }
+  json["file_system_bytes"] = orNull(survey.fileSystemBytes);
+  json["discarded_at_start"] = survey.fileSystemBytes ? Json(isTooSmall(*survey.fileSystemBytes)) : Json();
   return json;
 }
 

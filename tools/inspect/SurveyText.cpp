@@ -11,6 +11,7 @@
 #include "Printable.h"
 #include "Table.h"
 #include "inspect/Totals.h"
+#include "storage/FileSystemSize.h"
 #include "storage/ReadableNames.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -90,6 +91,8 @@ class Printer {
       return;
     }
     console_.raw("Storage in " + printable(survey_.root) + "\n");
+    const auto size = survey_.fileSystemBytes;
+    if (size && isTooSmall(*size)) console_.bad(tooSmallText(*size) + " (if this is the device)");
     for (const ManagerSurvey& manager : survey_.managers) printManager(manager);
     printLeftovers();
     printTotals();
