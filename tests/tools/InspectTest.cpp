@@ -150,6 +150,38 @@ TEST_F(Inspecting, NamesTheLargestAndWhatGoesFirstUpToTop) {
   EXPECT_EQ(storeIn(survey, kThumbs).newestAccess, StoredData::kNow - 60);
 }
 
+TEST_F(Inspecting, ListsWhatGoesNextByTheConfiguredStrategyAndSaysWhy) {
+  const auto useStrategy = [&](const std::string& strategy) {
+    configured_ = ConfiguredStores(data_.directory().write(
+        "configuration.json", R"({"m": {"session_scoped": false, "stores": {"thumbs": {"type": "disk_cache",
+                                 "lru_size_limit": "1KB", "prune_strategy": ")" +
+                                  strategy + R"("}}}})"));
+  };
+  data_.putItem(kThumbs, "small and old", "s", 3 * kDay);
+  data_.putItem(kThumbs, "large", std::string(100000, 'l'), 2 * kDay);
+  data_.putItem(kThumbs, "small and new", "s", kDay);
+  EXPECT_THAT(text(), HasSubstr("thumbs_250_v1, next to be evicted by lru, as --config does not say otherwise:"));
+  for (const char* const strategy : {"lru", "null", "video_download"}) {
+    useStrategy(strategy);
+    EXPECT_THAT(keysOf(storeIn(look(), kThumbs).nextToGo), ElementsAre("small and old", "large")) << strategy;
+    EXPECT_THAT(text(), HasSubstr("3 days; the least recently used of those left")) << strategy;
+  }
+  useStrategy("greedy_dual");
+  const Survey survey = look();
+  const StoreSurvey& thumbs = storeIn(survey, kThumbs);
+  EXPECT_THAT(keysOf(thumbs.nextToGo), ElementsAre("large", "small and old"));
+  EXPECT_EQ(thumbs.nextToGo.front().reason, "its size: smaller ones that were used less recently stay longer");
+  EXPECT_EQ(thumbs.itemsToPrune, 1U);
+  EXPECT_EQ(thumbs.order, "greedy_dual");
+  EXPECT_THAT(text(), HasSubstr("thumbs_250_v1, next to be evicted by greedy_dual, as after a restart (a prune would"));
+  EXPECT_EQ(json()["managers"][0]["stores"][0]["next_to_go"][1]["reason"], "the least recently used of those left");
+}
+
+TEST_F(Inspecting, ListsEveryItemEvenThoseWithoutASize) {
+  for (const char* const key : {"a", "b", "c"}) data_.putItem(kThumbs, key, "");
+  EXPECT_EQ(storeIn(look(), kThumbs).nextToGo.size(), 2U);
+}
+
 TEST_F(Inspecting, KnowsLimitsAndWhatIsStaleFromTheConfiguration) {
   makeRoot();
   configure();
@@ -363,7 +395,7 @@ TEST_F(Inspecting, PrintsJsonWhoseKeysAreFrozen) {
       "path directory identifier kind leftover damages items recorded_bytes files file_bytes inline_bytes "
       "held_bytes manifest_bytes allocated_bytes limit_bytes survival_bytes capacity stale_age fill oldest_access "
       "newest_access stale_items stale_bytes items_to_prune bytes_to_prune next_to_go largest ages sizes durability "
-      "quarantined_files quarantined_bytes ");
+      "quarantined_files quarantined_bytes eviction_order eviction_order_configured ");
   EXPECT_EQ(keysOf(document["managers"][0]["stores"][0]["largest"][0]), "key bytes last_access inline ");
 }
 

@@ -11,8 +11,8 @@
 #include "ExtendedMetadata.h"
 #include "JsonValue.h"
 #include "ManifestSnapshot.h"
-#include "PruneStrategy.h"
 #include "inspect/Buckets.h"
+#include "inspect/OrderOfEviction.h"
 #include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
 #include "storage/StoreFiles.h"
@@ -74,7 +74,7 @@ void measureFiles(const StorePlace& place, const StoreContext& context, StoreSur
     } else {
       ++store.files;
       store.fileBytes += entry.size;
-      values.push_back({path, entry.size, entry.modified, false});
+      values.push_back({path, entry.size, entry.modified, false, ""});
     }
   };
   walkTree(place.path, onEntry, context.onUnreadable);
@@ -105,40 +105,26 @@ void useFiles(const std::vector<ItemFigures>& values, const StoreContext& contex
 // --- Records ---
 
 ItemFigures figuresOf(const DiskCacheItem& item) {
-  return {item.key, item.size, item.lastAccessDate, item.hasInlineData};
+  return {item.key, item.size, item.lastAccessDate, item.hasInlineData, ""};
 }
 
-// The keys of all items in the order in which a prune takes them. The order of a strategy need not be consistent, which
-// the standard sorts require: a merge by halves works with any order.
-void sortForPrune(std::vector<const DiskCacheItem*>& items, const Comparator& before) {
-  if (items.size() < 2) return;
-  const auto middle = items.begin() + static_cast<std::ptrdiff_t>(items.size() / 2);
-  std::vector<const DiskCacheItem*> first(items.begin(), middle);
-  std::vector<const DiskCacheItem*> second(middle, items.end());
-  sortForPrune(first, before);
-  sortForPrune(second, before);
-  items.clear();
-  auto a = first.begin();
-  auto b = second.begin();
-  while (a != first.end() && b != second.end()) items.push_back(before(*b, *a) ? *b++ : *a++);
-  items.insert(items.end(), a, first.end());
-  items.insert(items.end(), b, second.end());
-}
-
-void countPrune(const std::vector<const DiskCacheItem*>& order, std::uint64_t limit, StoreSurvey& store) {
+void countPrune(const std::vector<EvictedItem>& order, std::uint64_t limit, StoreSurvey& store) {
   std::uint64_t left = store.recordedBytes.value_or(0);
   std::uint64_t items = 0;
-  for (auto next = order.begin(); left > limit && next != order.end(); ++next, ++items) left -= (*next)->size;
+  for (auto next = order.begin(); left > limit && next != order.end(); ++next, ++items) left -= next->item.size;
   store.itemsToPrune = items;
   store.bytesToPrune = *store.recordedBytes - left;
 }
 
 void notePruneOrder(const Records& records, const DiskCacheDefinition* cache, std::size_t top, StoreSurvey& store) {
-  std::vector<const DiskCacheItem*> order;
-  order.reserve(records.size());
-  for (const auto& record : records) order.push_back(&record.item);
-  sortForPrune(order, Comparator(cache != nullptr ? PruneStrategyFactory(cache->pruneStrategy) : nullptr));
-  for (std::size_t i = 0; i < std::min(top, order.size()); ++i) store.nextToGo.push_back(figuresOf(*order[i]));
+  const auto strategy = cache != nullptr ? cache->pruneStrategy : PruneStrategyIdentifier::LRU;
+  const auto order = orderOfEviction(records, strategy);
+  store.order = nameOfOrder(strategy);
+  store.isOrderConfigured = store.kind != StoreKind::Keyed;
+  for (std::size_t i = 0; i < std::min(top, order.size()); ++i) {
+    store.nextToGo.push_back(figuresOf(order[i].item));
+    store.nextToGo.back().reason = order[i].reason;
+  }
   if (cache != nullptr) countPrune(order, cache->lruSizeLimit, store);
 }
 

@@ -26,6 +26,7 @@ struct ItemFigures {
   std::uint64_t bytes = 0;
   std::int64_t lastAccess = 0;  // seconds since the Unix epoch
   bool isInline = false;
+  std::string reason = {};  // of one that goes next: why
 };
 
 enum class StoreKind { Unmanaged, Keyed, KeyValue, DiskCache };  // Keyed: one of the two after it, unknown which
@@ -60,6 +61,8 @@ struct StoreSurvey {
   std::optional<std::uint64_t> staleBytes;
 
   std::vector<ItemFigures> largest;
+  std::string order;                          // of eviction, of stores with keys: "lru"
+  bool isOrderConfigured = false;             // else it is assumed
   std::vector<ItemFigures> nextToGo;          // in the order of a prune, of stores with keys
   std::optional<std::uint64_t> itemsToPrune;  // of a disk cache with a limit: what a prune would remove now
   std::optional<std::uint64_t> bytesToPrune;

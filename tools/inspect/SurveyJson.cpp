@@ -62,12 +62,15 @@ Json asJson(const StoreSurvey& store) {
   json["items_to_prune"] = orNull(store.itemsToPrune);
   json["bytes_to_prune"] = orNull(store.bytesToPrune);
   json["next_to_go"] = asJson(store.nextToGo);
+  for (std::size_t i = 0; i < store.nextToGo.size(); ++i) json["next_to_go"][i]["reason"] = store.nextToGo[i].reason;
   json["largest"] = asJson(store.largest);
   json["ages"] = asJson(store.ages);
   json["sizes"] = asJson(store.sizes);
   json["durability"] = orNull(store.durability);
   json["quarantined_files"] = store.quarantinedFiles;
   json["quarantined_bytes"] = store.quarantinedBytes;
+  json["eviction_order"] = orNull(store.order);
+  json["eviction_order_configured"] = store.isOrderConfigured;
   return json;
 }
 

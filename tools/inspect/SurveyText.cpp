@@ -157,12 +157,18 @@ class Printer {
     console_.raw("\n");
     printList(printable(store.name) + ", largest", store.largest);
     if (store.nextToGo.empty()) return;
-    std::string title = printable(store.name) + ", next to be evicted";
+    std::string title = printable(store.name) + ", next to be evicted" + noteOfOrder(store);
     if (store.itemsToPrune.value_or(0) > 0) {
       title += " (a prune would remove " + formatCount(*store.itemsToPrune, "item", "items") + ", " +
                formatSize(*store.bytesToPrune) + ")";
     }
     printList(title, store.nextToGo);
+  }
+
+  static std::string noteOfOrder(const StoreSurvey& store) {
+    if (!store.isOrderConfigured) return " by lru, as --config does not say otherwise";
+    if (store.order == "greedy_dual") return " by greedy_dual, as after a restart";
+    return store.order == "lru" ? "" : " by " + store.order + ", without the application's weights";
   }
 
   void printList(const std::string& title, const std::vector<ItemFigures>& items) {
@@ -172,7 +178,7 @@ class Printer {
       const std::string decoded = decodedName(item.key);
       const std::string note = decoded.empty() ? "" : " ('" + decoded + "')";
       console_.line("  " + formatSize(item.bytes) + "  " + item.key + note + "  ",
-                    used + (item.isInline ? ", inline" : ""));
+                    used + (item.isInline ? ", inline" : "") + (item.reason.empty() ? "" : "; " + item.reason));
     }
   }
 

@@ -36,7 +36,7 @@ function itemList(title, items) {
   const list = make("ol");
   for (const item of items) {
     list.append(make("li", {}, make("span", { textContent: item.key }),
-      make("span", { textContent: formatSize(item.bytes) + ", " + formatAge(item.last_access) })));
+      make("span", { textContent: formatSize(item.bytes) + ", " + formatAge(item.last_access) + (item.reason ? "; " + item.reason : "") })));
   }
   return make("details", {}, make("summary", { textContent: title }), list);
 }
@@ -75,7 +75,7 @@ function storeCard(store, at) {
   card.append(storeFigures(store, at));
   for (const damage of store.damages) card.append(make("p", { className: "damage", textContent: "Damaged manifest: " + damage }));
   if (store.largest.length > 0) card.append(itemList("Largest", store.largest));
-  if (store.next_to_go.length > 0) card.append(itemList("Next to be evicted", store.next_to_go));
+  if (store.next_to_go.length > 0) card.append(itemList("Next to be evicted by " + store.eviction_order, store.next_to_go));
   return card;
 }
 
