@@ -41,6 +41,7 @@
 #include "host/testing/ManualQueue.h"
 #include "support/Bytes.h"
 #include "support/FaultyManifest.h"
+#include "support/GreedyDualSimulation.h"
 #include "support/LogCapture.h"
 #include "support/ManifestOnDisk.h"
 
@@ -51,6 +52,7 @@ namespace fs = std::filesystem;
 
 using test::Bytes;
 using test::FaultyManifest;
+using test::GreedyDualSimulation;
 using test::kManifestName;
 using test::kSecond;
 using test::LogCapture;
@@ -317,8 +319,9 @@ class Script {
     setup.isDiskCache = !oneIn(3);
     if (oneIn(2)) setup.capacity = 1 + below(4);
     const PruneStrategyIdentifier strategies[] = {PruneStrategyIdentifier::LRU, PruneStrategyIdentifier::Null,
-                                                  PruneStrategyIdentifier::VideoDownload};
-    setup.strategy = strategies[below(3)];
+                                                  PruneStrategyIdentifier::VideoDownload,
+                                                  PruneStrategyIdentifier::GreedyDual};
+    setup.strategy = strategies[below(4)];
     setup.batchSize = oneIn(3) ? 50 : 1 + below(3);
     setup.normalSize = below(100);
     setup.survivalSize = below(40);
@@ -402,6 +405,7 @@ class SettledSequence {
   void open() {
     session_ = std::make_unique<Session>(directory_.file("store"), directory_.file("trash"), setup_, false);
     session_->drain();
+    loadGreedyDual();
   }
 
   void close() {
@@ -467,7 +471,29 @@ class SettledSequence {
 
   void evictForOne() {
     if (!setup_.capacity || items_.size() < *setup_.capacity || items_.empty()) return;
-    items_.erase(oldest());
+    erase(oldest()->first);
+  }
+
+  void erase(const std::string& key) {
+    greedyDual_.remove(key);
+    items_.erase(key);  // last: the key may be the item's own
+  }
+
+  // What a start knows: sizes and dates of use.
+  void loadGreedyDual() {
+    std::map<std::int64_t, std::string> keys;  // no two dates are equal
+    for (const auto& [key, item] : items_) keys[item.lastAccessDate] = key;
+    EXPECT_EQ(keys.size(), items_.size());
+    greedyDual_ = {};
+    for (const auto& [date, key] : keys) greedyDual_.store(key, sizeOf(items_.at(key)), date);
+    greedyDual_.restart();
+  }
+
+  static std::uint32_t sizeOf(const Item& item) { return static_cast<std::uint32_t>(item.value.size()); }
+
+  void markUsed(const std::string& key) {
+    items_.at(key).lastAccessDate = now_;
+    greedyDual_.use(key, now_);
   }
 
   void storeValue(const std::string& key) {
@@ -479,6 +505,7 @@ class SettledSequence {
     expectFulfilled(*outcome);
     evictForOne();
     items_[key] = {value, now_, now_, second};
+    greedyDual_.store(key, sizeOf(items_[key]), now_);
     expectReported();
   }
 
@@ -496,7 +523,7 @@ class SettledSequence {
     }
     EXPECT_TRUE(outcome->failedWith<WriterFailed>()) << outcome->what();
     evictForOne();
-    items_.erase(key);
+    erase(key);
   }
 
   // Writes whose writer is never called: the file queue refuses or drops its task, or the store is released before.
@@ -558,7 +585,7 @@ class SettledSequence {
     EXPECT_EQ(outcome.result->key, key);
     EXPECT_EQ(outcome.result->value, items_.at(key).value);
     EXPECT_EQ(outcome.result->modificationDate, items_.at(key).modificationDate);
-    items_.at(key).lastAccessDate = now_;
+    markUsed(key);
   }
 
   void remove(const std::string& key) {
@@ -566,7 +593,7 @@ class SettledSequence {
     const auto outcome = watch(session_->store->removeItem(key));
     session_->drain();
     expectFulfilled(*outcome);
-    items_.erase(key);
+    erase(key);
   }
 
   void use(const std::string& key) {
@@ -574,7 +601,7 @@ class SettledSequence {
     const auto outcome = watch(session_->store->updateLastAccessDate(key));
     session_->drain();
     expectFulfilled(*outcome);
-    if (items_.count(key) > 0) items_[key].lastAccessDate = now_;
+    if (items_.count(key) > 0) markUsed(key);
   }
 
   void prune() {
@@ -588,8 +615,19 @@ class SettledSequence {
     script_.say("prune to " + std::to_string(target));
     expectSuccess(
         [&](auto onSuccess, auto onError) { session_->cache->pruneBackToNormal(onSuccess, onError, survival); });
-    while (total() > target) items_.erase(firstToGo());
+    pruneModel(target);
     expectReported();
+  }
+
+  void pruneModel(unsigned int target) {
+    if (setup_.strategy != PruneStrategyIdentifier::GreedyDual) {
+      while (total() > target) erase(firstToGo()->first);
+      return;
+    }
+    GreedyDualSimulation pruned = greedyDual_;
+    const std::vector<std::string> evicted = pruned.prune(target);
+    if (target != 0) greedyDual_ = pruned;  // of a prune to nothing, nothing is learnt
+    for (const std::string& key : evicted) erase(key);
   }
 
   void expire() {
@@ -606,7 +644,8 @@ class SettledSequence {
     EXPECT_FALSE(session_->queue(Session::kWorkQueue).armedDelays().empty());
     const std::int64_t cutoff = setup_.staleAge > now_ ? 0 : now_ - setup_.staleAge;
     for (auto it = items_.begin(); it != items_.end();) {
-      it = it->second.lastAccessDate < cutoff ? items_.erase(it) : std::next(it);
+      const auto item = it++;
+      if (item->second.lastAccessDate < cutoff) erase(item->first);
     }
     expectReported();
   }
@@ -615,6 +654,7 @@ class SettledSequence {
     script_.say("clear");
     expectSuccess([&](auto onSuccess, auto onError) { session_->store->clear(onSuccess, onError); });
     items_.clear();
+    greedyDual_.clear();
     expectReported();
   }
 
@@ -652,9 +692,9 @@ class SettledSequence {
     std::fstream file(storePath() + "/" + kManifestName, std::ios::binary | std::ios::in | std::ios::out);
     file << "This is not a database.";
     file.close();
+    items_.clear();
     const LogCapture log;
     open();
-    items_.clear();
   }
 
   void invalidate() {
@@ -776,6 +816,7 @@ class SettledSequence {
   std::int64_t now_ = kStart;
   std::int64_t lastInventedDate_ = 500'000'000;
   Items items_;
+  GreedyDualSimulation greedyDual_;  // follows all operations, whatever the strategy
   std::unique_ptr<Session> session_;
 };
 

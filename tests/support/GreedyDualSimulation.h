@@ -73,7 +73,7 @@ class GreedyDualSimulation {
     const std::size_t apart = dates.size() < 3 ? 0 : std::max<std::size_t>(dates.size() / 64, 1);
     const std::int64_t oldest = dates[apart];
     const std::int64_t newest = dates[dates.size() - 1 - apart];
-    const double rise = newest == oldest ? 0 : worth / bytes / 2 / static_cast<double>(newest - oldest);
+    const double rise = newest == oldest || bytes == 0 ? 0 : worth / bytes / 2 / static_cast<double>(newest - oldest);
     const auto levelAt = [&](std::int64_t date) {
       return static_cast<std::int64_t>(rise * static_cast<double>(std::min(std::max(date, oldest), newest) - oldest));
     };
@@ -99,7 +99,7 @@ class GreedyDualSimulation {
     item.priority = level_ + worthOf(item.size);
     item.turn = ++turns_;
   }
-  static int classOf(std::uint32_t size) { return static_cast<int>(std::floor(std::log2(size))); }
+  static int classOf(std::uint32_t size) { return static_cast<int>(std::floor(std::log2(std::max(size, 1U)))); }
   std::array<double, 2> sum() const {
     std::array<double, 2> sum = {};
     for (const auto& [key, counts] : outcomes_) sum = {sum[0] + counts[0], sum[1] + counts[1]};
@@ -118,7 +118,7 @@ class GreedyDualSimulation {
       const std::array<int, 2> own = found == outcomes_.end() ? std::array<int, 2>{} : found->second;
       weight = (own[0] / (all[0] / (all[0] + all[1])) + 16) / (own[0] + own[1] + 16.0);
     }
-    return std::lround(65536 * std::min(10.0, std::max(0.1, weight)) * std::sqrt(65536.0 / size));
+    return std::lround(65536 * std::min(10.0, std::max(0.1, weight)) * std::sqrt(65536.0 / std::max(size, 1U)));
   }
 
   std::map<std::string, Item> items_;
