@@ -21,7 +21,9 @@ const char* const kConfiguration = R"({
       "recent": {"type": "pkvs", "capacity": 20, "stale_age": "10 years"},
       "thumbs": {"type": "disk_cache", "lru_size_limit": "60KB", "survival_size": "10KB", "stale_age": "10 years"},
       "chunks": {"type": "disk_cache", "lru_size_limit": "10KB", "inline_data": true, "stale_age": "10 years",
-                 "metadata_factory": "video_download", "prune_strategy": "video_download"}
+                 "metadata_factory": "video_download", "prune_strategy": "video_download"},
+      "pictures": {"type": "disk_cache", "lru_size_limit": "40KB", "survival_size": "10KB", "stale_age": "10 years",
+                   "prune_strategy": "greedy_dual"}
     }
   },
   "inbox": {

@@ -16,12 +16,13 @@ struct StoreInfo {
   bool isInline;
   bool keepsAll;  // nothing but a removal takes a value away
 };
-constexpr std::array<StoreInfo, 6> kStores = {{{"letters", 40, 20000, false, true},
+constexpr std::array<StoreInfo, 7> kStores = {{{"letters", 40, 20000, false, true},
                                                {"settings", 40, 1500, true, true},
                                                {"recent", 60, 8000, false, false},
                                                {"thumbs", 60, 8000, false, false},
                                                {"chunks", 60, 1500, true, false},
-                                               {"drafts", 30, 5000, false, true}}};
+                                               {"drafts", 30, 5000, false, true},
+                                               {"pictures", 60, 8000, false, false}}};
 constexpr std::size_t kRecent = 2;  // is cleared now and then
 constexpr std::size_t kDrafts = 5;  // of the session
 constexpr const char* kSession = "alice";

@@ -43,9 +43,12 @@ const char* const kConfiguration = R"({
   }
 })";
 
+// The cache of stores that are not relaxed evicts in the order that has most to put back after a failure.
 std::string configurationOf(Durability durability) {
   std::string text = kConfiguration;
   if (durability == Durability::Relaxed) return text;
+  const std::string limit = "\"lru_size_limit\"";
+  text.insert(text.find(limit), "\"prune_strategy\": \"greedy_dual\", ");
   const std::string before = "\"stale_age\"";
   const std::string key =
       durability == Durability::Safe ? "\"durability\": \"safe\", " : "\"durability\": \"synced\", ";
