@@ -16,7 +16,7 @@ bool keepAPicture(const std::string& configuration, const std::string& directory
   const auto thumbs = host.store<DiskCache>("thumbs", "alice");  // of the session "alice"
   host::await(thumbs->store("sunrise.jpg", {0xff, 0xd8}));       // written on the store's queues, never on this thread
   const auto found = host::await(thumbs->fetch("sunrise.jpg"));  // null would be a miss
-  const auto web = host.store<UnmanagedStore>("web");            // a plain directory, measured and kept in its limit
+  const auto web = host.store<UnmanagedStore>("web");            // a plain directory; over its limit it opens empty
   std::ofstream(web->path + "/page.html") << "hello";
   return found != nullptr && found->value.size() == 2;
 }
