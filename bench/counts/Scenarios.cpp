@@ -11,6 +11,7 @@
 #include <cellar/DiskCacheManifest.h>
 #include <cellar/FileUtils.h>
 #include <cellar/PruneStrategy.h>
+#include <cellar/StoreDefinition.h>
 #include <cellar/TrashCollector.h>
 #include <cellar/host/testing/ManualQueue.h>
 
@@ -35,11 +36,13 @@ void throwUnless(bool condition, const char* message) {
   if (!condition) throw std::runtime_error(message);
 }
 
+using Strategy = PruneStrategyIdentifier;
+
 // A disk cache with manual queues.
 class CacheScenario : public Scenario {
  public:
   // `itemsBefore`: the number of items in its manifest when it is opened.
-  CacheScenario(const std::string& directory, std::size_t itemsBefore, std::uint32_t normalSize)
+  CacheScenario(const std::string& directory, std::size_t itemsBefore, std::uint32_t normalSize, Strategy strategy)
       : directory_(directory + "/store") {
     const auto files = std::make_shared<FileUtils>();
     files->createDirectory(directory_, true);
@@ -48,7 +51,7 @@ class CacheScenario : public Scenario {
     cache_ = std::make_shared<DiskCache>(
         directory_, directory + "/tmp", "counted", std::nullopt, kTenYears, normalSize, normalSize, false, queues,
         nullptr, std::make_shared<TrashCollector>(directory + "/trash", files, nullptr, nullptr),
-        std::make_shared<LRUPruneStrategy>(), nullptr, nullptr, files, [](unsigned int) {}, kBatchSize);
+        PruneStrategyFactory(strategy), nullptr, nullptr, files, [](unsigned int) {}, kBatchSize);
   }
 
  protected:
@@ -86,8 +89,8 @@ constexpr std::uint32_t kNoLimit = std::numeric_limits<std::uint32_t>::max();
 
 class Stores : public CacheScenario {
  public:
-  Stores(const std::string& directory, std::size_t outstanding)
-      : CacheScenario(directory, 0, kNoLimit), outstanding_(outstanding) {
+  Stores(const std::string& directory, std::size_t outstanding, Strategy strategy = Strategy::LRU)
+      : CacheScenario(directory, 0, kNoLimit, strategy), outstanding_(outstanding) {
     load();
   }
   void run() override { storeAll(outstanding_); }
@@ -104,7 +107,8 @@ class Stores : public CacheScenario {
 
 class Fetches : public CacheScenario {
  public:
-  explicit Fetches(const std::string& directory) : CacheScenario(directory, 0, kNoLimit) {
+  explicit Fetches(const std::string& directory, Strategy strategy = Strategy::LRU)
+      : CacheScenario(directory, 0, kNoLimit, strategy) {
     load();
     storeAll();
   }
@@ -127,7 +131,8 @@ class Fetches : public CacheScenario {
 
 class Prune : public CacheScenario {
  public:
-  explicit Prune(const std::string& directory) : CacheScenario(directory, kItems, 0) {
+  explicit Prune(const std::string& directory, Strategy strategy = Strategy::LRU)
+      : CacheScenario(directory, kItems, 0, strategy) {
     const Bytes value(1);
     for (std::size_t number = 0; number < kItems; ++number) writeFile(this->directory() + "/" + keyOf(number), value);
     load();
@@ -147,7 +152,8 @@ class Prune : public CacheScenario {
 
 class Load : public CacheScenario {
  public:
-  explicit Load(const std::string& directory) : CacheScenario(directory, kItems, kNoLimit) {}
+  explicit Load(const std::string& directory, Strategy strategy = Strategy::LRU)
+      : CacheScenario(directory, kItems, kNoLimit, strategy) {}
   void run() override { load(); }
   void verify() override { throwUnless(cache().getManifest()->count() == kItems, "not everything was loaded"); }
 };
@@ -190,6 +196,14 @@ const std::map<std::string, Create>& scenarios() {
       {"1,000 fetches", [](const std::string& directory) { return std::make_unique<Fetches>(directory); }},
       {"a prune of 10,000", [](const std::string& directory) { return std::make_unique<Prune>(directory); }},
       {"a load of 10,000", [](const std::string& directory) { return std::make_unique<Load>(directory); }},
+      {"1,000 stores, greedy_dual",
+       [](const std::string& directory) { return std::make_unique<Stores>(directory, 1, Strategy::GreedyDual); }},
+      {"1,000 fetches, greedy_dual",
+       [](const std::string& directory) { return std::make_unique<Fetches>(directory, Strategy::GreedyDual); }},
+      {"a prune of 10,000, greedy_dual",
+       [](const std::string& directory) { return std::make_unique<Prune>(directory, Strategy::GreedyDual); }},
+      {"a load of 10,000, greedy_dual",
+       [](const std::string& directory) { return std::make_unique<Load>(directory, Strategy::GreedyDual); }},
       {"1,000 events", [](const std::string& /*directory*/) { return std::make_unique<Events>(); }},
   };
   return all;
