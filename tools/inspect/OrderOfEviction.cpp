@@ -3,45 +3,13 @@
 #include <algorithm>
 #include <cstdint>
 #include <limits>
-#include <memory>
 #include <utility>
 
-#include "DiskCacheManifest.h"
-#include "ManifestPersistence.h"
-#include "PruneStrategy.h"
+#include "storage/MemoryManifest.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
-
-using Records = std::vector<ManifestSnapshot::Record>;
-
-// The records, to be loaded once. Writes nothing anywhere.
-class RecordsAlone final : public ManifestPersistence {
- public:
-  explicit RecordsAlone(const Records& records) : records_(records) {}
-
-  std::vector<std::unique_ptr<DiskCacheItem>> getAllItems() const override {
-    std::vector<std::unique_ptr<DiskCacheItem>> items;
-    items.reserve(records_.size());
-    for (const auto& record : records_) items.push_back(std::make_unique<DiskCacheItem>(record.item));
-    return items;
-  }
-
-  void clearItems() override {}
-  void setItem(const DiskCacheItem& /*item*/) override {}
-  std::unique_ptr<DiskCacheItem> getItem(const std::string& /*key*/) const override { return nullptr; }
-  void removeItem(const std::string& /*key*/) override {}
-  void updateLastAccessDate(const std::string& /*key*/, long /*date*/) override {}
-  std::vector<std::unique_ptr<DiskCacheItem>> getItemsLastAccessedBefore(long /*date*/) const override { return {}; }
-  void invalidate() override {}
-  std::vector<unsigned char> getInlineData(const std::string& /*key*/) const override { return {}; }
-  void setInlineData(const std::string& /*key*/, const std::vector<unsigned char>& /*data*/) override {}
-  void removeInlineData(const std::string& /*key*/) override {}
-
- private:
-  const Records& records_;
-};
 
 // Of one that goes although others have not been used for longer.
 const char* reasonBesideUse(PruneStrategyIdentifier strategy) {
@@ -52,11 +20,12 @@ const char* reasonBesideUse(PruneStrategyIdentifier strategy) {
 
 }  // namespace
 
-std::vector<EvictedItem> orderOfEviction(const Records& records, PruneStrategyIdentifier strategy) {
-  const auto manifest = std::make_shared<DiskCacheManifest>(std::make_unique<RecordsAlone>(records), nullptr,
-                                                            PruneStrategyFactory(strategy));
-  manifest->invalidate();  // memory alone works, without a queue
-  manifest->load();
+std::vector<EvictedItem> orderOfEviction(const std::vector<ManifestSnapshot::Record>& records,
+                                         PruneStrategyIdentifier strategy) {
+  std::vector<DiskCacheItem> items;
+  items.reserve(records.size());
+  for (const auto& record : records) items.push_back(record.item);
+  const auto manifest = memoryManifest(items, strategy);
   std::vector<EvictedItem> order;
   order.reserve(records.size());
   for (auto& item : manifest->pruneToSize(0, std::numeric_limits<std::uint32_t>::max())) {

@@ -1,72 +1,79 @@
 #include "tune/GreedyDualCache.h"
 
 #include <algorithm>
-#include <cstddef>
+#include <cstring>
 #include <limits>
+#include <string>
+
+#include "DiskCacheItem.h"
+#include "storage/MemoryManifest.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
+namespace {
+
+// So that a full cache and one more item still have 32 bits.
+constexpr std::int64_t kMost = std::int64_t{1} << 31;
+
+std::shared_ptr<DiskCacheManifest> emptyManifest() { return memoryManifest({}, PruneStrategyIdentifier::GreedyDual); }
+
+// Short, so that it takes no memory of its own.
+std::string nameOf(std::uint32_t key) {
+  std::string name(sizeof key, '\0');
+  std::memcpy(name.data(), &key, sizeof key);
+  return name;
+}
+
+std::uint32_t keyOf(const std::string& name) {
+  std::uint32_t key = 0;
+  std::memcpy(&key, name.data(), sizeof key);
+  return key;
+}
+
+}  // namespace
+
+GreedyDualCache::GreedyDualCache(std::int64_t limit) : manifest_(emptyManifest()) {
+  while ((limit >> unit_) >= kMost) ++unit_;
+  limit_ = static_cast<std::uint32_t>(limit >> unit_);
+}
+
 bool GreedyDualCache::access(const Access& access, std::uint64_t /*nextFetch*/) {
-  if (access.kind == AccessKind::Clear) {
-    clear();
+  if (access.kind == AccessKind::Clear) {  // another session's store, which has learnt nothing
+    for (const std::string& name : manifest_->getAllKeys()) sizes_[keyOf(name)] = kAbsent;
+    manifest_ = emptyManifest();
     return false;
   }
-  if (access.key >= items_.size()) items_.resize(std::size_t{access.key} + 1);
-  Item& item = items_[access.key];
-  const bool isFound = item.record != nullptr;
+  if (access.key >= sizes_.size()) sizes_.resize(std::size_t{access.key} + 1, kAbsent);
+  const std::int64_t found = sizes_[access.key];
   if (access.kind == AccessKind::Remove) {
-    if (isFound) remove(item);
-    return isFound;
+    remove(access.key);
+    return found != kAbsent;
   }
-  const bool isFetch = access.kind == AccessKind::Fetch;
-  if (isFound && isFetch) order_.used(*item.record);
-  if (isFound && isFetch && item.size == access.size) return true;
-  store(item, access.key, access.size);
+  const bool isFetched = access.kind == AccessKind::Fetch && found != kAbsent;
+  if (isFetched) manifest_->updateLastAccessDate(nameOf(access.key));
+  if (!isFetched || found != access.size) store(access.key, access.size);
+  return found != kAbsent;
+}
+
+void GreedyDualCache::store(std::uint32_t key, std::int64_t size) {
+  const std::int64_t units = (size + (std::int64_t{1} << unit_) - 1) >> unit_;
+  DiskCacheItem item;
+  item.key = item.filename = nameOf(key);
+  item.size = static_cast<std::uint32_t>(std::min(units, kMost));
+  manifest_->setItem(item);
+  sizes_[key] = size;
   prune();
-  return isFound;
 }
 
-// The record notes the key where the library has a date, which this order reads after a start only.
-void GreedyDualCache::store(Item& item, std::uint32_t key, std::int64_t size) {
-  if (item.record != nullptr) remove(item);
-  constexpr std::int64_t most = std::numeric_limits<std::uint32_t>::max();
-  DiskCacheItem stored;
-  stored.size = static_cast<std::uint32_t>(std::min(size, most));
-  stored.modificationDate = static_cast<std::int32_t>(key);
-  order_.reserveOneMore();
-  item.record = ManifestRecord::create(stored);
-  item.size = size;
-  total_ += size;
-  order_.added(*item.record);
-}
-
-GreedyDualCache::Item& GreedyDualCache::itemOf(const ManifestRecord& record) {
-  return items_[static_cast<std::uint32_t>(record.modificationDate)];
-}
-
-void GreedyDualCache::remove(Item& item) {
-  order_.removed(*item.record);
-  item.record.reset();
-  total_ -= item.size;
-}
-
-// As a disk cache is emptied at the end of a session: another one begins, which has learnt nothing.
-void GreedyDualCache::clear() {
-  while (const ManifestRecord* const first = order_.first()) remove(itemOf(*first));
-  order_.clear();
+void GreedyDualCache::remove(std::uint32_t key) {
+  manifest_->removeItem(nameOf(key));
+  sizes_[key] = kAbsent;
 }
 
 void GreedyDualCache::prune() {
-  if (total_ <= limit_) return;
-  evicted_.clear();
-  order_.begin();
-  while (total_ > limit_) {
-    const ManifestRecord& first = *order_.first();
-    evicted_.emplace_back();
-    evicted_.back().size = first.size;
-    remove(itemOf(first));
+  for (const DiskCacheItem& item : manifest_->pruneToSize(limit_, std::numeric_limits<std::uint32_t>::max())) {
+    sizes_[keyOf(item.key)] = kAbsent;
   }
-  if (limit_ > 0) order_.evicted(evicted_);
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

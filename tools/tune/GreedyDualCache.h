@@ -1,38 +1,32 @@
 #pragma once
 
 #include <cstdint>
+#include <memory>
 #include <vector>
 
-#include "DiskCacheItem.h"
-#include "manifest/GreedyDualOrder.h"
-#include "manifest/ManifestRecord.h"
+#include "DiskCacheManifest.h"
 #include "tune/SimulatedCache.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Driven by the library's own order of eviction, called as a manifest calls it.
+// A manifest of the library, without a medium, says what goes. Sizes have 32 bits there: for limits from 2 GB on they
+// are counted in units of some bytes, rounded up.
 class GreedyDualCache : public SimulatedCache {
  public:
-  explicit GreedyDualCache(std::int64_t limit) : limit_(limit) {}
+  explicit GreedyDualCache(std::int64_t limit);
   bool access(const Access& access, std::uint64_t nextFetch) override;
 
  private:
-  struct Item {
-    ManifestRecord::Owner record;  // null: not there
-    std::int64_t size = 0;
-  };
+  static constexpr std::int64_t kAbsent = -1;
 
-  void store(Item& item, std::uint32_t key, std::int64_t size);
-  Item& itemOf(const ManifestRecord& record);
-  void remove(Item& item);
-  void clear();
+  void store(std::uint32_t key, std::int64_t size);
+  void remove(std::uint32_t key);
   void prune();
 
-  const std::int64_t limit_;
-  std::int64_t total_ = 0;
-  GreedyDualOrder order_;
-  std::vector<Item> items_;  // by key
-  std::vector<DiskCacheItem> evicted_;
+  int unit_ = 0;  // binary digits
+  std::uint32_t limit_ = 0;
+  std::shared_ptr<DiskCacheManifest> manifest_;
+  std::vector<std::int64_t> sizes_;  // by key, of the items that are there
 };
 
 }  // namespace velmora::mobile::xplat::cellar::tools
