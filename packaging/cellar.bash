@@ -8,7 +8,7 @@ _cellar_options() {  # of a command
       echo --store --limit --strategy --config --worth --unknown-size --svg --html --json --csv --key --size --time --op --store-op \
         --remove-op --clear-op --chunk-second --item-type --priority-weight --early-seconds --help
       ;;
-    inspect) echo --config --top --json --html --help ;;
+    inspect) echo --config --top --json --html --since --watch --every --help ;;
     verify) echo --repair --config --json --help ;;
     *) echo --help --version ;;
   esac
@@ -21,7 +21,7 @@ _cellar() {
   done
   COMPREPLY=()
   case $before in
-    --config | --svg | --html)
+    --config | --svg | --html | --since)
       compopt -o filenames 2>/dev/null
       mapfile -t COMPREPLY < <(compgen -f -- "$word")
       return
@@ -35,7 +35,7 @@ _cellar() {
       mapfile -t COMPREPLY < <(compgen -W "lru greedy_dual video_download" -- "$word")
       return
       ;;
-    --version-tag | --locale | --session | --store | --limit | --worth | --unknown-size | --top) return ;;
+    --version-tag | --locale | --session | --store | --limit | --worth | --unknown-size | --top | --every) return ;;
     --key | --size | --time | --op | --store-op | --remove-op | --clear-op) return ;;
     --chunk-second | --item-type | --priority-weight | --early-seconds) return ;;
   esac

@@ -51,6 +51,10 @@ void Console::verdict(const std::string& text, bool isGood) {
   out_ << "\n" << coloured(isGood ? kBoldGreen : kRed, text) << std::endl;
 }
 
+void Console::startAgain() {
+  if (isTerminal_) out_ << "\x1b[H\x1b[2J" << std::flush;
+}
+
 void Console::rewriteLine(const std::string& text) { out_ << "\r\x1b[2K" << printable(text) << std::flush; }
 
 std::string Console::coloured(const char* code, const std::string& text) const {

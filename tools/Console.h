@@ -24,6 +24,9 @@ class Console {
 
   void verdict(const std::string& text, bool isGood);
 
+  // Empties the screen. On terminals only.
+  void startAgain();
+
   // Replaces the line that the cursor is in. On terminals only.
   void rewriteLine(const std::string& text);
 

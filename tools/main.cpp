@@ -9,6 +9,7 @@
 #include "Console.h"
 #include "InputError.h"
 #include "Printable.h"
+#include "Version.h"
 #include "check/Check.h"
 #include "demo/Demo.h"
 #include "inspect/Inspect.h"
@@ -22,8 +23,6 @@ namespace tools = velmora::mobile::xplat::cellar::tools;
 constexpr int kPassed = 0;
 constexpr int kFailed = 1;
 constexpr int kUsage = 2;
-
-constexpr const char* kVersion = "cellar " CELLAR_VERSION;
 
 // Commands redirect the log; on the terminal it would be mixed into the output.
 void keepLogOffTheTerminal(const char* program) {
@@ -42,7 +41,7 @@ void describe(CLI::App& app) {
       "tune "
       "analytics.jsonl --store thumbs\n\nExit status: 0 without problems, 1 when a problem was found, 2 for usage and "
       "input errors.");
-  app.set_version_flag("--version", kVersion);
+  app.set_version_flag("--version", tools::versionText());
   app.require_subcommand(1);
 }
 

@@ -31,11 +31,12 @@ void noteDate(StoreSurvey& store, std::int64_t date) {
   store.newestAccess = std::max(store.newestAccess.value_or(date), date);
 }
 
-void noteItem(StoreSurvey& store, const ItemFigures& item, std::int64_t now) {
+void noteItem(StoreSurvey& store, const ItemFigures& item, const StoreContext& context) {
   ++store.items;
   noteDate(store, item.lastAccess);
-  addTo(store.ages[ageBucketOf(now - item.lastAccess)], item.bytes);
+  addTo(store.ages[ageBucketOf(context.now - item.lastAccess)], item.bytes);
   addTo(store.sizes[sizeBucketOf(item.bytes)], item.bytes);
+  if (context.hashesKeys) store.keyHashes.push_back(std::hash<std::string>()(item.key));
 }
 
 // The first few of the items, in an order.
@@ -98,7 +99,7 @@ std::optional<std::uint64_t> keptSize(const std::string& path) {
 }
 
 void useFiles(const std::vector<ItemFigures>& values, const StoreContext& context, StoreSurvey& store) {
-  for (const ItemFigures& value : values) noteItem(store, value, context.now);
+  for (const ItemFigures& value : values) noteItem(store, value, context);
   store.largest = largestOf(values, context.top);
 }
 
@@ -147,7 +148,7 @@ void useRecords(const Records& records, const DiskCacheDefinition* cache, const 
   items.reserve(records.size());
   for (const auto& record : records) {
     items.push_back(figuresOf(record.item));
-    noteItem(store, items.back(), context.now);
+    noteItem(store, items.back(), context);
     *store.recordedBytes += record.item.size;
     store.inlineBytes += record.inlineSize.value_or(0);
   }
@@ -220,6 +221,7 @@ StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configur
     context.onUnreadable(unreadableBy(error, place.path));
     useFiles(values, context, store);
   }
+  std::sort(store.keyHashes.begin(), store.keyHashes.end());
   return store;
 }
 

@@ -20,6 +20,7 @@ struct StoreContext {
   std::int64_t now;
   OnFile onFile;
   OnUnreadable onUnreadable;
+  bool hashesKeys;
 };
 
 // The figures of one store's directory. What cannot be read is not in them.

@@ -191,9 +191,9 @@ class Surveyor {
 }  // namespace
 
 Survey makeSurvey(const Layout& layout, const ConfiguredStores& configured, std::size_t top, std::int64_t now,
-                  const OnFile& onFile) {
+                  const OnFile& onFile, bool hashesKeys) {
   const TemporaryFolder temporary;
-  return Surveyor(layout, configured, {layout.root, temporary.path(), top, now, onFile, nullptr}).make();
+  return Surveyor(layout, configured, {layout.root, temporary.path(), top, now, onFile, nullptr, hashesKeys}).make();
 }
 
 const char* textOf(StoreKind kind) {

@@ -74,6 +74,8 @@ struct StoreSurvey {
   std::uint64_t quarantinedFiles = 0;  // that a safe store could not use, in its own directory: not values
   std::uint64_t quarantinedBytes = 0;
 
+  std::vector<std::uint64_t> keyHashes;  // of all items, ascending; if they were asked for
+
   std::uint64_t heldBytes() const { return fileBytes + inlineBytes; }  // of values
 };
 
@@ -111,9 +113,9 @@ struct Survey {
 using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each file that is looked at
 
 // Inspects everything in the layout without changing it. `top`: how many of the largest items, and of the next to be
-// evicted, are listed for each store.
+// evicted, are listed for each store. `hashesKeys`: whether stores have the hashes of all keys, too.
 Survey makeSurvey(const Layout& layout, const ConfiguredStores& configured, std::size_t top, std::int64_t now,
-                  const OnFile& onFile);
+                  const OnFile& onFile, bool hashesKeys = false);
 
 const char* textOf(StoreKind kind);
 const char* textOf(LeftoverKind kind);

@@ -1,7 +1,6 @@
 #include "inspect/SurveyText.h"
 
 #include <array>
-#include <cmath>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -10,6 +9,7 @@
 #include "Format.h"
 #include "Printable.h"
 #include "Table.h"
+#include "inspect/SurveyWords.h"
 #include "inspect/Totals.h"
 #include "storage/FileSystemSize.h"
 #include "storage/ReadableNames.h"
@@ -21,10 +21,6 @@ namespace {
 using Align = Table::Align;
 
 std::string sizeOrNothing(const std::optional<std::uint64_t>& bytes) { return bytes ? formatSize(*bytes) : "-"; }
-
-std::string percent(const std::optional<double>& ratio) {
-  return ratio ? std::to_string(std::lround(*ratio * 100)) + " %" : "-";
-}
 
 // "3 days": the largest unit alone.
 std::string formatAge(std::int64_t seconds) {
@@ -76,11 +72,6 @@ std::string kindOf(LeftoverKind kind) {
   return "quarantine";
 }
 
-std::string limitOf(const StoreSurvey& store) {
-  if (store.limitBytes) return formatSize(*store.limitBytes);
-  return store.capacity ? formatCount(*store.capacity, "item", "items") : "-";
-}
-
 class Printer {
  public:
   Printer(const Survey& survey, Console& console) : survey_(survey), console_(console) {}
@@ -121,28 +112,13 @@ class Printer {
                  {"Durability", Align::Left}});
     for (const StoreSurvey& store : manager.stores) {
       table.addRow({printable(store.name), kindOf(store), formatCount(store.items), sizeOrNothing(store.recordedBytes),
-                    formatSize(store.heldBytes()), formatSize(store.allocatedBytes), limitOf(store),
-                    percent(fillOf(store)), age(store.oldestAccess), age(store.newestAccess),
+                    formatSize(store.heldBytes()), formatSize(store.allocatedBytes), limitText(store),
+                    percentText(fillOf(store)), age(store.oldestAccess), age(store.newestAccess),
                     store.staleItems ? formatCount(*store.staleItems) : "-",
                     store.durability.empty() ? "-" : store.durability});
     }
     console_.raw(table.text());
     for (const StoreSurvey& store : manager.stores) printItems(store);
-  }
-
-  static std::string titleOf(const ManagerSurvey& manager) {
-    const bool isBelow = manager.path.front() != '.';
-    const std::string& place = isBelow ? manager.path : manager.directory;
-    std::string title = printable(place + sessionNote(place));
-    if (!manager.name.empty()) title += "  " + printable(manager.name);
-    if (manager.limitBytes) {
-      title += ", " + formatSize(manager.countedBytes) + " of " + formatSize(*manager.limitBytes) + " (" +
-               percent(fillOf(manager)) + ")";
-      if (manager.unmanagedBytes > 0) {
-        title += ", of which " + formatSize(manager.unmanagedBytes) + " measured now in unmanaged stores";
-      }
-    }
-    return title;
   }
 
   void printItems(const StoreSurvey& store) {
