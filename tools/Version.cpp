@@ -6,7 +6,6 @@
 #include <CLI/Version.hpp>
 #include <climits>
 #include <nlohmann/json.hpp>
-#include <string_view>
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -23,10 +22,9 @@ std::string jsonVersion() {
 }
 
 std::string buildText() {
-  constexpr std::string_view sanitizers = CELLAR_SANITIZERS;
   return std::string("built by " CELLAR_COMPILER " as " CELLAR_BUILD_TYPE ", C++") +
-         std::to_string(__cplusplus / 100 % 100) + ", " + std::to_string(sizeof(void*) * CHAR_BIT) + " bits" +
-         (sanitizers.empty() ? "" : ", sanitizers: " CELLAR_SANITIZERS);
+         std::to_string(__cplusplus / 100 % 100) + ", " + std::to_string(sizeof(void*) * CHAR_BIT) +
+         " bits" CELLAR_SANITIZED;
 }
 
 }  // namespace
