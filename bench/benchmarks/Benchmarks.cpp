@@ -12,6 +12,8 @@ const std::vector<Benchmark>& benchmarks() {
       {"prune", "Pruning: microseconds for each removed item", measurePrunes},
       {"capacity", "Writing to a store at its capacity: microseconds for each write", measureCapacity},
       {"load", "Loading a manifest: time and memory for each item", measureLoading},
+      {"strategy", "The strategy greedy_dual (ours) beside lru: microseconds for each of values of 512 B to 16 KiB",
+       measureStrategies},
       {"tree", "Measuring and freeing directories", measureTrees},
       {"event", "Reporting: microseconds for each analytics event", measureEvents},
       {"start", "Starting", measureStart},

@@ -16,6 +16,7 @@ void measureCallers(const Context& context);
 void measurePrunes(const Context& context);
 void measureCapacity(const Context& context);
 void measureLoading(const Context& context);
+void measureStrategies(const Context& context);
 void measureTrees(const Context& context);
 void measureEvents(const Context& context);
 void measureStart(const Context& context);

@@ -15,8 +15,8 @@ namespace {
 
 constexpr const char* kFastest = "fastest competitor";
 const std::vector<std::string> kContestants = {
-    "ours", "relaxed", "safe store", "lower bound",      "in groups", "LevelDB", "LevelDB in groups",
-    "LMDB", "RocksDB", "SQLite",     "SQLite in groups", "du",        "rm -rf"};
+    "ours", "lru",     "relaxed", "safe store",       "lower bound", "in groups", "LevelDB", "LevelDB in groups",
+    "LMDB", "RocksDB", "SQLite",  "SQLite in groups", "du",          "rm -rf"};
 
 std::string formatted(double value) {
   char text[32];

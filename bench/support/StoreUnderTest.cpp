@@ -30,7 +30,7 @@ std::shared_ptr<DiskCache> createCache(const std::string& directory, const Store
   cacheOptions.inlineData = options.inlineData;
   cacheOptions.batchSize = kBatchSize;
   cacheOptions.onSizeChanged = [](unsigned int) {};
-  cacheOptions.pruneStrategy = std::make_shared<LRUPruneStrategy>();
+  cacheOptions.pruneStrategy = PruneStrategyFactory(options.strategy);
   cacheOptions.durability = options.durability;
   cacheOptions.normalSize = options.normalSize;
   cacheOptions.survivalSize = options.normalSize;

@@ -9,6 +9,7 @@
 
 #include <cellar/DiskCache.h>
 #include <cellar/Durability.h>
+#include <cellar/StoreDefinition.h>
 #include <cellar/host/ThreadQueueFactory.h>
 
 #include "support/Places.h"
@@ -21,6 +22,7 @@ struct StoreOptions {
   std::optional<std::uint64_t> capacity{};
   std::uint32_t normalSize = std::numeric_limits<std::uint32_t>::max();  // bytes that a prune leaves
   Durability durability = Durability::Relaxed;
+  PruneStrategyIdentifier strategy = PruneStrategyIdentifier::LRU;
   bool load = true;
   std::shared_ptr<AnalyticsEventReporter> reporter{};
 };
