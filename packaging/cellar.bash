@@ -5,8 +5,8 @@ _cellar_options() {  # of a command
     demo) echo --root --help ;;
     check) echo --version-tag --locale --session --root --json --help ;;
     tune)
-      echo --store --limit --strategy --config --worth --unknown-size --svg --html --json --csv --key --size --time --op --store-op \
-        --remove-op --clear-op --chunk-second --item-type --priority-weight --early-seconds --help
+      echo --store --limit --strategy --config --worth --unknown-size --sample --svg --html --json --csv --key --size --time --op \
+        --store-op --remove-op --clear-op --chunk-second --item-type --priority-weight --early-seconds --help
       ;;
     inspect) echo --config --top --json --html --since --watch --every --help ;;
     verify) echo --repair --config --json --help ;;
@@ -35,7 +35,7 @@ _cellar() {
       mapfile -t COMPREPLY < <(compgen -W "lru greedy_dual video_download" -- "$word")
       return
       ;;
-    --version-tag | --locale | --session | --store | --limit | --worth | --unknown-size | --top | --every) return ;;
+    --version-tag | --locale | --session | --store | --limit | --worth | --unknown-size | --sample | --top | --every) return ;;
     --key | --size | --time | --op | --store-op | --remove-op | --clear-op) return ;;
     --chunk-second | --item-type | --priority-weight | --early-seconds) return ;;
   esac

@@ -4,9 +4,13 @@
 #include <array>
 #include <cmath>
 #include <cstddef>
+#include <functional>
 #include <iterator>
 #include <limits>
 #include <set>
+#include <tuple>
+
+#include "tune/SampleScale.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -14,6 +18,40 @@ namespace {
 
 // Of Student's distribution with nine degrees of freedom.
 constexpr double kQuantile = 2.262;
+
+using Ten = std::array<double, 10>;
+constexpr double kTen = 10;
+static_assert(kParts == std::tuple_size_v<Ten> && Trace::kGroups == kParts);
+
+double meanOf(const Ten& rates) {
+  double mean = 0;
+  for (const double rate : rates) mean += rate / kTen;
+  return mean;
+}
+
+// Half of the interval that has 95 % of their means.
+double marginOfMean(const Ten& rates) {
+  const double mean = meanOf(rates);
+  double squares = 0;
+  for (const double rate : rates) squares += (rate - mean) * (rate - mean);
+  return kQuantile * std::sqrt(squares / (kTen - 1) / kTen);
+}
+
+// Each group is a sample of its own.
+Ten ratesByGroup(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy) {
+  const ByGroup& hits = hitsByGroup(limit, strategy);
+  Ten rates = {};
+  for (std::size_t group = 0; group < rates.size(); ++group) {
+    const double rate = tuning.sample.rate / Trace::kGroups;
+    rates[group] = SampleScale(rate, tuning.requests, tuning.sample.requestsByGroup[group], 0).hitRate(hits[group]);
+  }
+  return rates;
+}
+
+// What is not in the sample is what is not certain.
+double marginOfSample(const Tuning& tuning, const Ten& rates, double rate) {
+  return std::sqrt(1 - tuning.sample.rate) * marginOfMean(rates) + std::abs(meanOf(rates) - rate);
+}
 
 std::uint64_t distance(std::uint64_t a, std::uint64_t b) { return a > b ? a - b : b - a; }
 
@@ -96,7 +134,9 @@ Advice adviceOn(const Tuning& tuning) {
   const double ofWorth = std::ceil(static_cast<double>(kFewestOfWorth) / tuning.worth);
   advice.neededRequests = std::max(kFewestRequests, static_cast<std::uint64_t>(ofWorth));
   advice.repeated = tuning.limits.empty() ? 0 : tuning.limits.back().lru.hits;
-  advice.isTooShort = tuning.requests < advice.neededRequests || advice.repeated < kFewestRepeated;
+  const auto simulated = [&](std::uint64_t count) { return static_cast<double>(count) * tuning.sample.rate; };
+  advice.isTooShort = simulated(tuning.requests) < static_cast<double>(advice.neededRequests) ||
+                      simulated(advice.repeated) < static_cast<double>(kFewestRepeated);
   advice.strategy = tuning.strategy;
   const TunedLimit* const enough = enoughWith(tuning, tuning.strategy);
   if (const TunedLimit* const present = presentLimit(tuning)) {
@@ -113,21 +153,46 @@ Advice adviceOn(const Tuning& tuning) {
 }
 
 double marginOf(const Tuning& tuning, const ByPart& hits, const ByPart& otherHits) {
-  std::array<double, kParts> rates = {};
-  double mean = 0;
-  for (std::size_t part = 0; part < kParts; ++part) {
+  Ten rates = {};
+  for (std::size_t part = 0; part < rates.size(); ++part) {
     if (tuning.requestsByPart[part] == 0) return std::numeric_limits<double>::infinity();
     const double difference = static_cast<double>(hits[part]) - static_cast<double>(otherHits[part]);
     rates[part] = difference / static_cast<double>(tuning.requestsByPart[part]);
-    mean += rates[part] / kParts;
   }
-  double squares = 0;
-  for (const double rate : rates) squares += (rate - mean) * (rate - mean);
-  return kQuantile * std::sqrt(squares / (kParts - 1) / kParts);
+  return marginOfMean(rates);
+}
+
+double samplingMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy) {
+  if (tuning.sample.rate == 1) return 0;
+  return marginOfSample(tuning, ratesByGroup(tuning, limit, strategy), share(hitsOf(limit, strategy), tuning.requests));
+}
+
+double samplingMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy,
+                      const TunedLimit& other, const std::string& otherStrategy) {
+  if (tuning.sample.rate == 1) return 0;
+  Ten rates = ratesByGroup(tuning, limit, strategy);
+  const Ten others = ratesByGroup(tuning, other, otherStrategy);
+  std::transform(rates.begin(), rates.end(), others.begin(), rates.begin(), std::minus<>());
+  const double rate = share(hitsOf(limit, strategy), tuning.requests);
+  return marginOfSample(tuning, rates, rate - share(hitsOf(other, otherStrategy), tuning.requests));
+}
+
+double wholeMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy) {
+  return std::hypot(marginOf(tuning, hitsByPart(limit, strategy)), samplingMargin(tuning, limit, strategy));
+}
+
+double wholeMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy, const TunedLimit& other,
+                   const std::string& otherStrategy) {
+  return std::hypot(marginOf(tuning, hitsByPart(limit, strategy), hitsByPart(other, otherStrategy)),
+                    samplingMargin(tuning, limit, strategy, other, otherStrategy));
 }
 
 const ByPart& hitsByPart(const TunedLimit& limit, const std::string& strategy) {
   return strategy == strategies::kLeastRecentlyUsed ? limit.lruHitsByPart : limit.strategies.at(strategy).hitsByPart;
+}
+
+const ByGroup& hitsByGroup(const TunedLimit& limit, const std::string& strategy) {
+  return strategy == strategies::kLeastRecentlyUsed ? limit.lruHitsByGroup : limit.strategies.at(strategy).hitsByGroup;
 }
 
 std::vector<const TunedLimit*> limitsToShow(const Tuning& tuning) {

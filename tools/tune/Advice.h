@@ -31,7 +31,20 @@ Advice adviceOn(const Tuning& tuning);
 // the requests, or the difference of two. Infinite where a part has no requests.
 double marginOf(const Tuning& tuning, const ByPart& hits, const ByPart& otherHits = {});
 
+// What a sample of the keys adds to it; 0 without a sample. Half of the interval that has 95 % of the means of ten
+// groups of keys, and the distance of that mean from the figure itself: a group is a sample of a tenth of the rate, so
+// that this is what a smaller rate has changed already.
+double samplingMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy);
+double samplingMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy,
+                      const TunedLimit& other, const std::string& otherStrategy);
+
+// Of both kinds.
+double wholeMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy);
+double wholeMargin(const Tuning& tuning, const TunedLimit& limit, const std::string& strategy, const TunedLimit& other,
+                   const std::string& otherStrategy);
+
 const ByPart& hitsByPart(const TunedLimit& limit, const std::string& strategy);
+const ByGroup& hitsByGroup(const TunedLimit& limit, const std::string& strategy);
 
 // At most `kMostRows` of the listed limits: both ends, those that are marked or advised, and those where the hits of a
 // strategy change most. Ascending.

@@ -1,5 +1,6 @@
 #include "tune/AdviceText.h"
 
+#include <algorithm>
 #include <array>
 #include <cmath>
 #include <cstdint>
@@ -30,14 +31,17 @@ std::string gain(const Tuning& tuning, const TunedLimit& limit, const std::strin
   const std::uint64_t more = hitsOf(limit, strategy) - hitsOf(other, otherStrategy);
   const double part = share(more, tuning.requests);
   std::string text = formatCount(more, "more hit", "more hits") + " (" + percent(part) + " of the requests";
-  const double margin = marginOf(tuning, hitsByPart(limit, strategy), hitsByPart(other, otherStrategy));
+  const double margin = wholeMargin(tuning, limit, strategy, other, otherStrategy);
   if (std::isfinite(margin)) text += ", give or take " + percent(margin) + (margin >= part ? ": not certain" : "");
   return text + ")";
 }
 
 std::string shortText(const Tuning& tuning, const Advice& advice) {
-  return "The log is too short for advice: it has " + formatCount(tuning.requests, "request", "requests") + ", " +
-         formatCount(advice.repeated) + " of them for items that were there before; at least " +
+  const bool isWhole = tuning.sample.rate == 1;
+  const double repeated = std::round(static_cast<double>(advice.repeated) * tuning.sample.rate);
+  return std::string(isWhole ? "The log is too short" : "The sample is too small") + " for advice: it has " +
+         formatCount(isWhole ? tuning.requests : tuning.sample.requests, "request", "requests") + ", " +
+         formatCount(static_cast<std::uint64_t>(repeated)) + " of them for items that were there before; at least " +
          formatCount(advice.neededRequests) + " and " + formatCount(kFewestRepeated) + " are needed.";
 }
 
@@ -109,11 +113,28 @@ std::string costText(const Tuning& tuning) {
 std::string certaintyText(const Tuning& tuning) {
   const Advice advice = adviceOn(tuning);
   if (advice.isTooShort || advice.limit == nullptr) return "";
-  const double margin = marginOf(tuning, hitsByPart(*advice.limit, advice.strategy));
+  const double margin = wholeMargin(tuning, *advice.limit, advice.strategy);
   if (!std::isfinite(margin)) return "";
   return "hit rates are estimates: " + percent(share(hitsOf(*advice.limit, advice.strategy), tuning.requests)) +
          " at " + nameOf(*advice.limit, advice.strategy, isNamed(advice.strategy)) + ", give or take " +
-         percent(margin) + " (95 %, from ten equal parts of the log)";
+         percent(margin) + " (95 %, from ten equal parts of the log" +
+         (tuning.sample.rate == 1 ? ")" : ", and ten groups of the sampled keys)");
+}
+
+std::string sampleText(const Tuning& tuning) {
+  if (tuning.sample.rate == 1) return "";
+  std::string margins;
+  const auto add = [&](const std::string& strategy) {
+    double greatest = 0;
+    for (const TunedLimit& limit : tuning.limits)
+      greatest = std::max(greatest, samplingMargin(tuning, limit, strategy));
+    margins += (margins.empty() ? "" : ", ") + percent(greatest) + " for " + strategy;
+  };
+  add(strategies::kLeastRecentlyUsed);
+  for (const std::string& strategy : tuning.others) add(strategy);
+  return "a sample: " + formatCount(tuning.sample.requests, "request", "requests") + " of " +
+         formatCount(tuning.sample.keys, "key", "keys") + "; hit rates of the whole log may differ by up to " +
+         margins + " (95 %, from ten groups of keys)";
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

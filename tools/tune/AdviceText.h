@@ -18,4 +18,7 @@ std::string costText(const Tuning& tuning);
 // How sure the hit rates are; empty where that cannot be told.
 std::string certaintyText(const Tuning& tuning);
 
+// From what the figures are estimated, and how far they may differ from those of the whole log; empty without a sample.
+std::string sampleText(const Tuning& tuning);
+
 }  // namespace velmora::mobile::xplat::cellar::tools

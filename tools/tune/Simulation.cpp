@@ -8,6 +8,7 @@
 #include <thread>
 
 #include "tune/NextFetches.h"
+#include "tune/SampleScale.h"
 #include "tune/SimulatedCache.h"
 #include "tune/Trace.h"
 
@@ -27,25 +28,52 @@ struct Work {
   std::atomic<std::uint64_t> done = 0;
 };
 
-void run(Work& work, Simulation& simulation) {
-  const auto cache = simulatedCache(simulation.strategy, simulation.limit);
+// Calls `visit` with each access, its number, and the next fetch for a strategy that asks for it.
+void play(Work& work, const std::string& strategy,
+          const std::function<void(const Access&, std::uint64_t, std::uint64_t)>& visit) {
   std::unique_ptr<NextFetches::Reader> fetches;
-  if (simulation.strategy == strategies::kForesight) {
-    fetches = std::make_unique<NextFetches::Reader>(*work.fetches);
-  }
+  if (strategy == strategies::kForesight) fetches = std::make_unique<NextFetches::Reader>(*work.fetches);
   std::uint64_t number = 0;
-  Found found;
   work.trace.replay([&](const Access& access) {
-    const std::uint64_t fetch = fetches == nullptr ? SimulatedCache::kNever : fetches->next();
-    if (cache->access(access, fetch) && access.kind == AccessKind::Fetch) {
-      ++found.hits;
-      found.hitBytes += static_cast<std::uint64_t>(access.size);
-      ++found.hitsByPart[partOf(number, work.trace.accesses())];
-    }
+    visit(access, number, fetches == nullptr ? SimulatedCache::kNever : fetches->next());
     if (++number % kAccessesOfAStep == 0) work.done += kAccessesOfAStep;
   });
   work.done += number % kAccessesOfAStep;
-  simulation.found = found;
+}
+
+Found findOf(Work& work, const Simulation& simulation) {
+  const std::int64_t limit = sampledLimit(simulation.limit, work.trace.sample().rate());
+  const auto cache = simulatedCache(simulation.strategy, limit);
+  Found found;
+  play(work, simulation.strategy, [&](const Access& access, std::uint64_t number, std::uint64_t nextFetch) {
+    if (!cache->access(access, nextFetch) || access.kind != AccessKind::Fetch) return;
+    ++found.hits;
+    found.hitBytes += static_cast<std::uint64_t>(access.size);
+    ++found.hitsByPart[partOf(number, work.trace.accesses())];
+  });
+  return found;
+}
+
+ByGroup findByGroup(Work& work, const Simulation& simulation) {
+  const std::int64_t limit = sampledLimit(simulation.limit, work.trace.sample().rate() / Trace::kGroups);
+  std::vector<std::unique_ptr<SimulatedCache>> caches(Trace::kGroups);
+  for (auto& cache : caches) cache = simulatedCache(simulation.strategy, limit);
+  ByGroup hits = {};
+  play(work, simulation.strategy, [&](Access access, std::uint64_t, std::uint64_t nextFetch) {
+    if (access.kind == AccessKind::Clear) {
+      for (auto& cache : caches) (void)cache->access(access, nextFetch);
+      return;
+    }
+    const Trace::GroupedKey key = work.trace.groupedKey(access.key);
+    access.key = key.number;
+    if (caches[key.group]->access(access, nextFetch) && access.kind == AccessKind::Fetch) ++hits[key.group];
+  });
+  return hits;
+}
+
+void run(Work& work, Simulation& simulation) {
+  simulation.found = findOf(work, simulation);
+  if (!work.trace.sample().isWhole()) simulation.found.hitsByGroup = findByGroup(work, simulation);
 }
 
 // After a failure the others take nothing more.
@@ -75,7 +103,7 @@ void simulate(const Trace& trace, std::vector<Simulation>& simulations, unsigned
   for (std::size_t i = 0; i < std::min<std::size_t>(threads, simulations.size()); ++i) {
     runs.push_back(std::async(std::launch::async, [&work] { runAll(work); }));
   }
-  const std::uint64_t whole = simulations.size() * trace.accesses();
+  const std::uint64_t whole = simulations.size() * trace.accesses() * (trace.sample().isWhole() ? 1 : 2);
   for (std::future<void>& each : runs) {
     while (each.wait_for(kBetweenSteps) != std::future_status::ready) onProgress(work.done, whole);
   }

@@ -10,16 +10,20 @@ namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
 // So that no sum of sizes exceeds 64 bits.
-constexpr std::int64_t kMostBytes = std::int64_t{1} << 60;
+constexpr double kMostBytes = 1ULL << 60U;
 
 constexpr std::size_t kBlock = 4096;  // accesses that are read together
 
 }  // namespace
 
 void Trace::append(const std::string& key, Access access) {
+  noteDate(access.date);
+  if (access.kind == AccessKind::Fetch) ++requests_;
+  if (!sample_.has(key)) return;
   access.key = numberOf(key);
   if (access.size != Access::kUnknownSize) {
-    if (access.size > kMostBytes - bytes_) throw InputError("the sizes add up to more than can be counted");
+    if (access.size > static_cast<std::int64_t>(kMostBytes * sample_.rate()) - bytes_)
+      throw InputError("the sizes add up to more than can be counted");
     bytes_ += access.size;
     if (firstSizes_[access.key] == Access::kUnknownSize) firstSizes_[access.key] = access.size;
   }
@@ -33,10 +37,13 @@ void Trace::appendClear(std::int64_t date) {
   access.key = Access::kNoKey;
   access.date = date;
   access.size = 0;
+  noteDate(date);
   keep(access);
 }
 
-void Trace::mayBeEmpty(const std::string& key) { mayBeEmpty_[numberOf(key)] = true; }
+void Trace::mayBeEmpty(const std::string& key) {
+  if (sample_.has(key)) mayBeEmpty_[numberOf(key)] = true;
+}
 
 void Trace::replay(const std::function<void(const Access&)>& visit) const {
   std::vector<std::int64_t> sizes = startingSizes();
@@ -91,8 +98,21 @@ std::uint32_t Trace::numberOf(const std::string& key) {
     if (firstSizes_.size() >= mostKeys) throw InputError("there are too many keys");
     firstSizes_.push_back(Access::kUnknownSize);
     mayBeEmpty_.push_back(false);
+    if (!sample_.isWhole()) putIntoGroup(key);
   }
   return found->second;
+}
+
+void Trace::putIntoGroup(const std::string& key) {
+  const std::size_t group = KeySample::hashOf(key) % kGroups;
+  groups_.push_back(static_cast<std::uint8_t>(group));
+  numbersInGroup_.push_back(keysOfGroup_[group]++);
+}
+
+void Trace::noteDate(std::int64_t date) {
+  if (!hasDate_) firstDate_ = date;
+  hasDate_ = true;
+  lastDate_ = date;
 }
 
 std::vector<std::int64_t> Trace::startingSizes() const {
@@ -105,8 +125,6 @@ std::vector<std::int64_t> Trace::startingSizes() const {
 }
 
 void Trace::keep(const Access& access) {
-  if (accesses_ == 0) firstDate_ = access.date;
-  lastDate_ = access.date;
   file_.append(&access, sizeof access);
   ++accesses_;
 }

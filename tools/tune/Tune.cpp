@@ -16,8 +16,10 @@
 #include "TextFile.h"
 #include "tune/CsvReader.h"
 #include "tune/EventReader.h"
+#include "tune/KeySample.h"
 #include "tune/LineReader.h"
 #include "tune/Present.h"
+#include "tune/SampleScale.h"
 #include "tune/Trace.h"
 #include "tune/TunePage.h"
 #include "tune/TunePlot.h"
@@ -38,6 +40,7 @@ struct TuneOptions {
   std::string configuration;
   double worth = 1;  // percent
   std::int64_t unknownSize = -1;
+  std::string sample = "1";
   std::string svg;
   std::string html;
   bool json = false;
@@ -61,7 +64,7 @@ void readReportedEvents(const TuneOptions& options, LineReader& lines, Trace& tr
   const EventCounts counts = readEvents(lines, options.store, trace, onLine);
   const std::size_t stores = counts.accessesOfStores.size();
   if (stores == 0) throw InputError("no line of " + lines.name() + " is an access event of the host kit's sink");
-  if (trace.accesses() == 0) {
+  if (trace.isEmpty()) {
     throw InputError(lines.name() + " has no accesses to store '" + options.store + "', but to: " + listOf(counts));
   }
   if (options.store.empty() && stores > 1) {
@@ -69,7 +72,7 @@ void readReportedEvents(const TuneOptions& options, LineReader& lines, Trace& tr
   }
   report.store = options.store.empty() ? counts.accessesOfStores.begin()->first : options.store;
   report.reportedHits = counts.hits;
-  report.reportedFirstHits = counts.firstHits;
+  report.reportedFirstHits = SampleScale(trace.sample().rate(), 0, 0, 0).count(counts.firstHits);
   report.damagedLines = counts.damagedLines;
 }
 
@@ -84,9 +87,12 @@ void readTrace(const TuneOptions& options, Console& console, Trace& trace, TuneR
   report.store = options.store;
   if (options.csv) {
     readCsv(lines, options.columns, trace, onLine);
-    if (trace.accesses() == 0) throw InputError(lines.name() + " has no rows");
+    if (trace.isEmpty()) throw InputError(lines.name() + " has no rows");
   } else {
     readReportedEvents(options, lines, trace, report, onLine);
+  }
+  if (trace.keys() == 0 && !trace.sample().isWhole()) {
+    throw InputError("no key of " + lines.name() + " is in a sample of " + options.sample + ", choose a larger one");
   }
 }
 
@@ -117,7 +123,7 @@ void runTune(const TuneOptions& options) {
 
   Console console = Console::standardOutput();
   TuneReport report;
-  Trace trace;
+  Trace trace(KeySample(parseRate(options.sample)));
   if (options.unknownSize >= 0) trace.assumeSize(options.unknownSize);
   readTrace(options, console, trace, report);
   report.tuning = tuneTrace(settings, trace, console);
@@ -169,14 +175,17 @@ void addVideoOptions(CLI::App& tune, TuneOptions& options) {
           "SECONDS");
 }
 
-// Empty if it is one.
-std::string whyNotALimit(const std::string& text) {
-  try {
-    (void)parseLimit(text);
-    return "";
-  } catch (const InputError& error) {
-    return error.what();
-  }
+// Empty if `parse` takes it.
+template <class Parse> CLI::Validator checkedBy(Parse parse) {
+  const auto whyNot = [parse](const std::string& text) {
+    try {
+      (void)parse(text);
+      return std::string();
+    } catch (const InputError& error) {
+      return std::string(error.what());
+    }
+  };
+  return {whyNot, ""};
 }
 
 }  // namespace
@@ -192,7 +201,7 @@ void addTuneCommand(CLI::App& app, int& status) {
       ->type_name("NAME");
   CLI::Option* const limit =
       tune->add_option("--limit", options->limit, "The present limit, as a configuration has it (50MB), or in bytes")
-          ->check(CLI::Validator(whyNotALimit, ""))
+          ->check(checkedBy(parseLimit))
           ->type_name("SIZE");
   CLI::Option* const strategy =
       tune->add_option("--strategy", options->strategy, "The present prune_strategy: lru, greedy_dual, video_download")
@@ -214,6 +223,9 @@ void addTuneCommand(CLI::App& app, int& status) {
                    "Bytes of items that were never found; without it, the mean of the others")
       ->check(CLI::Range(std::int64_t{0}, std::int64_t{0xffffffff}).description(""))
       ->type_name("BYTES");
+  tune->add_option("--sample", options->sample, "Simulate this share of the keys (0.01 or 1%), for logs of many keys")
+      ->check(checkedBy(parseRate))
+      ->type_name("RATE");
   tune->add_option("--svg", options->svg, "Draw the hit rate over the limit into this file")->type_name("FILE");
   tune->add_option("--html", options->html, "Write the report with the drawing into this file, as one page")
       ->type_name("FILE");

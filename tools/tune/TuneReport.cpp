@@ -86,6 +86,7 @@ std::vector<std::string> notesOn(const TuneReport& report) {
     notes.push_back("the present strategy \"" + report.missingStrategy + "\" cannot be simulated without metadata; \"" +
                     tuning.strategy + "\" is taken instead");
   }
+  if (const std::string sample = sampleText(tuning); !sample.empty()) notes.push_back(sample);
   if (const std::string certainty = certaintyText(tuning); !certainty.empty()) notes.push_back(certainty);
   return notes;
 }
@@ -96,9 +97,12 @@ Json asJson(const Tuning& tuning, const TunedLimit& limit) {
                {"hit_rate", share(limit.lru.hits, tuning.requests)},
                {"hit_bytes", limit.lru.hitBytes},
                {"byte_hit_rate", share(limit.lru.hitBytes, tuning.requestedBytes)}};
+  const bool isSample = tuning.sample.rate < 1;
+  if (isSample) json["sampling_margin"] = samplingMargin(tuning, limit, strategies::kLeastRecentlyUsed);
   for (const auto& [strategy, found] : limit.strategies) {
     Json& figures = json["strategies"][strategy] = {{"hits", found.hits}};
     if (strategy != strategies::kVideoDownload) figures["hit_bytes"] = found.hitBytes;
+    if (isSample) figures["sampling_margin"] = samplingMargin(tuning, limit, strategy);
   }
   return json;
 }
@@ -112,13 +116,17 @@ Json adviceAsJson(const Tuning& tuning) {
   const Advice advice = adviceOn(tuning);
   if (advice.isTooShort || advice.limit == nullptr) return {};
   const std::uint64_t hits = hitsOf(*advice.limit, advice.strategy);
-  const double margin = marginOf(tuning, hitsByPart(*advice.limit, advice.strategy));
+  const double margin = wholeMargin(tuning, *advice.limit, advice.strategy);
   Json json = {{"strategy", advice.strategy},
                {"limit", advice.limit->lru.limit},
                {"hits", hits},
                {"hit_rate", share(hits, tuning.requests)}};
   if (std::isfinite(margin)) json["margin"] = margin;
   return json;
+}
+
+Json sampleAsJson(const SampleFigures& sample) {
+  return {{"rate", sample.rate}, {"requests", sample.requests}, {"keys", sample.keys}};
 }
 
 }  // namespace
@@ -167,6 +175,7 @@ Json tuningAsJson(const TuneReport& report) {
                {"strategy", tuning.strategy},
                {"advice", adviceAsJson(tuning)},
                {"damaged_lines", report.damagedLines}};
+  if (tuning.sample.rate < 1) json["sample"] = sampleAsJson(tuning.sample);
   if (report.reportedHits) {
     json["reported_hits"] = *report.reportedHits;
     json["reported_first_hits"] = report.reportedFirstHits;

@@ -1,8 +1,10 @@
 #include "tune/Tuning.h"
 
 #include <algorithm>
+#include <optional>
 
 #include "tune/Access.h"
+#include "tune/SampleScale.h"
 #include "tune/StackDistances.h"
 #include "tune/Trace.h"
 
@@ -73,27 +75,64 @@ struct Simulated {
   std::int64_t everything = 0;
 };
 
+// Of limits of the whole.
+class ScaledDistances {
+ public:
+  explicit ScaledDistances(double rate) : scale_(rate, 0, 0, 0) {}
+
+  // The least limit at which the item is found; empty also for an access that is not a use.
+  std::optional<std::int64_t> access(const Access& access) {
+    if (access.kind == AccessKind::Clear) {
+      distances_.clear();
+    } else if (access.kind == AccessKind::Remove) {
+      distances_.remove(access.key);
+    } else if (const auto least = distances_.use(access.key, access.size)) {
+      return scale_.limit(*least);
+    }
+    return std::nullopt;
+  }
+  std::int64_t peak() const { return scale_.limit(distances_.peak()); }
+
+ private:
+  const SampleScale scale_;
+  StackDistances distances_;
+};
+
 Simulated simulateLeastRecentlyUsed(const Trace& trace, std::int64_t present, const OnProgress& onProgress) {
   Simulated simulated{HitCurve(present), std::vector<HitCurve>(kParts, HitCurve(present))};
-  StackDistances distances;
+  ScaledDistances distances(trace.sample().rate());
   std::uint64_t number = 0;
   trace.replay([&](const Access& access) {
     HitCurve& part = simulated.parts[partOf(number, trace.accesses())];
-    if (access.kind == AccessKind::Clear) {
-      distances.clear();
-    } else if (access.kind == AccessKind::Remove) {
-      distances.remove(access.key);
-    } else {
-      const auto least = distances.use(access.key, access.size);
-      if (access.kind == AccessKind::Fetch) {
-        simulated.curve.add(least, access.size);
-        part.add(least, access.size);
-      }
+    const auto least = distances.access(access);
+    if (access.kind == AccessKind::Fetch) {
+      simulated.curve.add(least, access.size);
+      part.add(least, access.size);
     }
     onProgress(++number, trace.accesses());
   });
   simulated.everything = distances.peak();
   return simulated;
+}
+
+// Each group of keys as if there were no others.
+void simulateGroups(const Trace& trace, Tuning& tuning) {
+  std::vector<ScaledDistances> distances(Trace::kGroups, ScaledDistances(trace.sample().rate() / Trace::kGroups));
+  trace.replay([&](Access access) {
+    if (access.kind == AccessKind::Clear) {
+      for (ScaledDistances& each : distances) (void)each.access(access);
+      return;
+    }
+    const Trace::GroupedKey key = trace.groupedKey(access.key);
+    access.key = key.number;
+    const auto least = distances[key.group].access(access);
+    if (access.kind != AccessKind::Fetch) return;
+    ++tuning.sample.requestsByGroup[key.group];
+    for (auto limit = tuning.limits.rbegin(); least && limit != tuning.limits.rend() && limit->lru.limit >= *least;
+         ++limit) {
+      ++limit->lruHitsByGroup[key.group];
+    }
+  });
 }
 
 TunedLimit tunedLimit(const Simulated& simulated, std::int64_t limit) {
@@ -115,20 +154,36 @@ void simulateOthers(const Trace& trace, Tuning& tuning, unsigned threads, const 
   }
 }
 
-const TunedLimit* first(const Tuning& tuning, bool TunedLimit::*mark) {
-  const auto found =
-      std::find_if(tuning.limits.begin(), tuning.limits.end(), [&](const TunedLimit& limit) { return limit.*mark; });
-  return found == tuning.limits.end() ? nullptr : &*found;
+void scale(HitCurve::Point& point, const SampleScale& sample) {
+  point.hits = sample.hits(point.hits);
+  point.hitBytes = sample.hitBytes(point.hitBytes);
 }
 
-}  // namespace
+// From the figures of the sample to those of the whole.
+void scale(Tuning& tuning, const SampleScale& sample) {
+  for (TunedLimit& limit : tuning.limits) {
+    scale(limit.lru, sample);
+    for (auto& [strategy, found] : limit.strategies) {
+      found.hits = sample.hits(found.hits);
+      found.hitBytes = sample.hitBytes(found.hitBytes);
+    }
+  }
+  for (HitCurve::Point& point : tuning.curve) scale(point, sample);
+  tuning.requestedBytes = sample.requestedBytes();
+  tuning.keys = sample.count(tuning.keys);
+  tuning.keysOfUnknownSize = sample.count(tuning.keysOfUnknownSize);
+}
 
-Tuning tune(const Trace& trace, const TuneSettings& settings, const OnProgress& onProgress) {
+// The tables of the curves are gone again when the other strategies need memory.
+Tuning tuneLeastRecentlyUsed(const Trace& trace, const TuneSettings& settings, const OnProgress& onProgress) {
   const Simulated simulated = simulateLeastRecentlyUsed(trace, settings.present, onProgress);
   const HitCurve& curve = simulated.curve;
   const std::int64_t enough = roundedUp(curve.enough(settings.worth).limit);
   Tuning tuning;
-  tuning.requests = curve.requests();
+  tuning.sample.rate = trace.sample().rate();
+  tuning.sample.requests = curve.requests();
+  tuning.sample.keys = trace.keys();
+  tuning.requests = trace.requests();
   tuning.requestedBytes = curve.requestedBytes();
   tuning.keys = trace.keys();
   tuning.keysOfUnknownSize = trace.keysOfUnknownSize();
@@ -142,14 +197,29 @@ Tuning tune(const Trace& trace, const TuneSettings& settings, const OnProgress& 
     tuning.limits.back().isPresent = limit == settings.present;
     tuning.limits.back().isEnough = limit == enough;
   }
+  const std::int64_t last = powerOfTwoFrom(simulated.everything);
+  tuning.curve = pointsToPlot(curve, firstLimit(curve, last), last);
+  return tuning;
+}
+
+const TunedLimit* first(const Tuning& tuning, bool TunedLimit::*mark) {
+  const auto found =
+      std::find_if(tuning.limits.begin(), tuning.limits.end(), [&](const TunedLimit& limit) { return limit.*mark; });
+  return found == tuning.limits.end() ? nullptr : &*found;
+}
+
+}  // namespace
+
+Tuning tune(const Trace& trace, const TuneSettings& settings, const OnProgress& onProgress) {
+  Tuning tuning = tuneLeastRecentlyUsed(trace, settings, onProgress);
+  if (!trace.sample().isWhole()) simulateGroups(trace, tuning);
   tuning.others = {strategies::kGreedyDual};
   if (trace.hasMetadata()) tuning.others.emplace_back(strategies::kVideoDownload);
   tuning.others.emplace_back(strategies::kForesight);
   const bool isKnown = std::find(tuning.others.begin(), tuning.others.end(), settings.strategy) != tuning.others.end();
   if (isKnown) tuning.strategy = settings.strategy;
   simulateOthers(trace, tuning, settings.threads, onProgress);
-  const std::int64_t last = powerOfTwoFrom(simulated.everything);
-  tuning.curve = pointsToPlot(curve, firstLimit(curve, last), last);
+  scale(tuning, SampleScale(tuning.sample.rate, tuning.requests, tuning.sample.requests, tuning.requestedBytes));
   return tuning;
 }
 

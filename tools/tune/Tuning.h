@@ -17,13 +17,24 @@ class Trace;
 struct TunedLimit {
   HitCurve::Point lru;
   ByPart lruHitsByPart = {};
+  ByGroup lruHitsByGroup = {};
   std::map<std::string, Found> strategies;  // the other ones
   bool isPresent = false;
   bool isEnough = false;
 };
 
-// What follows from the accesses to one cache for its limit.
+// What the figures follow from where only a share of the keys was simulated.
+struct SampleFigures {
+  double rate = 1;
+  std::uint64_t requests = 0;
+  std::uint64_t keys = 0;
+  ByGroup requestsByGroup = {};
+};
+
+// What follows from the accesses to one cache for its limit. From a sample, counts are estimates for the whole, but for
+// `requests`, which were counted, and for the counts by part and by group, which are those of the sample.
 struct Tuning {
+  SampleFigures sample;
   std::uint64_t requests = 0;
   std::uint64_t requestedBytes = 0;
   std::uint64_t keys = 0;
