@@ -5,7 +5,7 @@ _cellar_options() {  # of a command
     demo) echo --root --help ;;
     check) echo --version-tag --locale --session --root --json --help ;;
     tune)
-      echo --store --limit --strategy --config --worth --unknown-size --sample --svg --html --json --csv --key --size --time --op \
+      echo --store --limit --strategy --config --worth --unknown-size --sample --merge --svg --html --json --csv --key --size --time --op \
         --store-op --remove-op --clear-op --chunk-second --item-type --priority-weight --early-seconds --help
       ;;
     inspect) echo --config --top --json --html --since --watch --every --help ;;
@@ -21,7 +21,7 @@ _cellar() {
   done
   COMPREPLY=()
   case $before in
-    --config | --svg | --html | --since)
+    --config | --svg | --html | --since | --merge)
       compopt -o filenames 2>/dev/null
       mapfile -t COMPREPLY < <(compgen -f -- "$word")
       return

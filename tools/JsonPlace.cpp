@@ -8,6 +8,7 @@
 namespace velmora::mobile::xplat::cellar::tools {
 
 bool JsonPlace::has(const std::string& name) const {
+  if (!value_.is_object()) fail("is not an object");
   const auto found = value_.find(name);
   return found != value_.end() && !found->is_null();
 }
@@ -28,16 +29,27 @@ std::size_t JsonPlace::size() const {
   return value_.size();
 }
 
+std::size_t JsonPlace::members() const {
+  if (!value_.is_object()) fail("is not an object");
+  return value_.size();
+}
+
 std::string JsonPlace::text() const {
   if (!value_.is_string()) fail("is not a text");
   return value_.get<std::string>();
 }
 
-std::uint64_t JsonPlace::count(std::uint64_t most) const {
-  if (!value_.is_number_integer() || value_ < 0 || value_ > most) {
-    fail("is not a whole number from 0 to " + std::to_string(most));
+std::uint64_t JsonPlace::count(std::uint64_t least, std::uint64_t most) const {
+  if (!value_.is_number_integer() || value_ < least || value_ > most) {
+    fail("is not a whole number from " + std::to_string(least) + " to " + std::to_string(most));
   }
   return value_.get<std::uint64_t>();
+}
+
+double JsonPlace::share() const {
+  const double share = value_.is_number() ? value_.get<double>() : 0;
+  if (share > 0 && share <= 1) return share;
+  fail("is not a share of more than 0 and at most 1");
 }
 
 void JsonPlace::fail(const std::string& text) const {

@@ -19,9 +19,11 @@ class JsonPlace {
   JsonPlace at(const std::string& name) const;
   JsonPlace at(std::size_t index) const;
 
-  std::size_t size() const;  // of an array
+  std::size_t size() const;     // of an array
+  std::size_t members() const;  // of an object
   std::string text() const;
-  std::uint64_t count(std::uint64_t most) const;
+  std::uint64_t count(std::uint64_t least, std::uint64_t most) const;
+  double share() const;  // more than 0, at most 1
 
   [[noreturn]] void fail(const std::string& text) const;
 

@@ -21,7 +21,7 @@ using Align = Table::Align;
 constexpr std::uint64_t kMost = std::uint64_t{1} << 53U;
 
 PartFigures figuresIn(const JsonPlace& part, const char* items, const char* held) {
-  return {part.at(items).count(kMost), part.at(held).count(kMost), part.at("allocated_bytes").count(kMost)};
+  return {part.at(items).count(0, kMost), part.at(held).count(0, kMost), part.at("allocated_bytes").count(0, kMost)};
 }
 
 bool isSame(const PartFigures& a, const PartFigures& b) {
@@ -72,7 +72,7 @@ void addRow(const std::string& title, const PartFigures& before, const PartFigur
 Moment momentOf(const nlohmann::json& document, const std::string& file) {
   const JsonPlace root(file, document);
   Moment moment;
-  moment.date = static_cast<std::int64_t>(root.at("inspected_at").count(kMost));
+  moment.date = static_cast<std::int64_t>(root.at("inspected_at").count(0, kMost));
   moment.depth = root.at("depth").text();
   const JsonPlace managers = root.at("managers");
   for (std::size_t i = 0; i < managers.size(); ++i) {

@@ -67,17 +67,6 @@ std::size_t indexOfDoubled(const Tuning& tuning, std::size_t index) {
   return index;
 }
 
-// By the same rule as `HitCurve::enough`, among the listed limits.
-const TunedLimit* enoughWith(const Tuning& tuning, const std::string& strategy) {
-  if (strategy == strategies::kLeastRecentlyUsed || tuning.limits.empty()) return enoughLimit(tuning);
-  std::size_t index = tuning.limits.size() - 1;
-  for (; index > 0; --index) {
-    const TunedLimit& doubled = tuning.limits[indexOfDoubled(tuning, index - 1)];
-    if (isWorthIt(tuning, hitsOf(doubled, strategy), hitsOf(tuning.limits[index - 1], strategy))) break;
-  }
-  return hitsOf(tuning.limits[index], strategy) == 0 ? nullptr : &tuning.limits[index];
-}
-
 // What finds most at the limit, if that is worth changing the present strategy for.
 std::string bestStrategy(const Tuning& tuning, const TunedLimit& limit) {
   std::string best = tuning.strategy;
@@ -128,6 +117,20 @@ Step greatestStep(const Tuning& tuning, const std::set<std::size_t>& shown) {
 }
 
 }  // namespace
+
+const TunedLimit* enoughAmongListed(const Tuning& tuning, const std::string& strategy) {
+  if (tuning.limits.empty()) return nullptr;
+  std::size_t index = tuning.limits.size() - 1;
+  for (; index > 0; --index) {
+    const TunedLimit& doubled = tuning.limits[indexOfDoubled(tuning, index - 1)];
+    if (isWorthIt(tuning, hitsOf(doubled, strategy), hitsOf(tuning.limits[index - 1], strategy))) break;
+  }
+  return hitsOf(tuning.limits[index], strategy) == 0 ? nullptr : &tuning.limits[index];
+}
+
+const TunedLimit* enoughWith(const Tuning& tuning, const std::string& strategy) {
+  return strategy == strategies::kLeastRecentlyUsed ? enoughLimit(tuning) : enoughAmongListed(tuning, strategy);
+}
 
 Advice adviceOn(const Tuning& tuning) {
   Advice advice;

@@ -27,6 +27,11 @@ struct Advice {
 };
 Advice adviceOn(const Tuning& tuning);
 
+// The least limit that is enough: that which is marked for "lru", and otherwise, by the same rule as
+// `HitCurve::enough`, a listed one. Null if nothing would have been found.
+const TunedLimit* enoughWith(const Tuning& tuning, const std::string& strategy);
+const TunedLimit* enoughAmongListed(const Tuning& tuning, const std::string& strategy);
+
 // Half of the interval that has 95 % of the means of ten parts, if these were independent of each other; for a share of
 // the requests, or the difference of two. Infinite where a part has no requests.
 double marginOf(const Tuning& tuning, const ByPart& hits, const ByPart& otherHits = {});

@@ -126,8 +126,9 @@ std::string sampleText(const Tuning& tuning) {
   std::string margins;
   const auto add = [&](const std::string& strategy) {
     double greatest = 0;
-    for (const TunedLimit& limit : tuning.limits)
+    for (const TunedLimit& limit : tuning.limits) {
       greatest = std::max(greatest, samplingMargin(tuning, limit, strategy));
+    }
     margins += (margins.empty() ? "" : ", ") + percent(greatest) + " for " + strategy;
   };
   add(strategies::kLeastRecentlyUsed);

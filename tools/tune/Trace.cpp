@@ -10,7 +10,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
 // So that no sum of sizes exceeds 64 bits.
-constexpr double kMostBytes = 1ULL << 60U;
+constexpr double kMostBytes = 0x1p60;
 
 constexpr std::size_t kBlock = 4096;  // accesses that are read together
 
@@ -22,8 +22,9 @@ void Trace::append(const std::string& key, Access access) {
   if (!sample_.has(key)) return;
   access.key = numberOf(key);
   if (access.size != Access::kUnknownSize) {
-    if (access.size > static_cast<std::int64_t>(kMostBytes * sample_.rate()) - bytes_)
+    if (access.size > static_cast<std::int64_t>(kMostBytes * sample_.rate()) - bytes_) {
       throw InputError("the sizes add up to more than can be counted");
+    }
     bytes_ += access.size;
     if (firstSizes_[access.key] == Access::kUnknownSize) firstSizes_[access.key] = access.size;
   }

@@ -2,9 +2,12 @@
 
 #include <CLI/CLI.hpp>
 #include <cstdint>
+#include <filesystem>
 #include <iostream>
 #include <memory>
+#include <set>
 #include <string>
+#include <vector>
 
 #include "Configuration.h"
 #include "Console.h"
@@ -21,10 +24,12 @@
 #include "tune/Present.h"
 #include "tune/SampleScale.h"
 #include "tune/Trace.h"
+#include "tune/TuneDocument.h"
 #include "tune/TunePage.h"
 #include "tune/TunePlot.h"
 #include "tune/TuneReport.h"
 #include "tune/Tuning.h"
+#include "tune/TuningMerge.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -43,6 +48,7 @@ struct TuneOptions {
   std::string sample = "1";
   std::string svg;
   std::string html;
+  std::vector<std::string> merge;
   bool json = false;
   bool csv = false;
   CsvColumns columns;
@@ -113,6 +119,16 @@ Tuning tuneTrace(const TuneSettings& settings, const Trace& trace, Console& cons
   return tune(trace, settings, [&](std::uint64_t done, std::uint64_t whole) { progress.advanceTo(done, whole); });
 }
 
+void write(const TuneReport& report, const TuneOptions& options, Console& console) {
+  if (!options.svg.empty()) writeTextFile(options.svg, tuningAsSvg(report));
+  if (!options.html.empty()) writeTextFile(options.html, tuningAsPage(report));
+  if (options.json) {
+    std::cout << printable(tuningAsJson(report), 2) << std::endl;
+  } else {
+    printTuning(report, console);
+  }
+}
+
 void runTune(const TuneOptions& options) {
   if (!options.configuration.empty() && options.store.empty()) {
     throw InputError("--config needs --store, to know which limit to read");
@@ -128,13 +144,35 @@ void runTune(const TuneOptions& options) {
   readTrace(options, console, trace, report);
   report.tuning = tuneTrace(settings, trace, console);
   if (report.tuning.strategy != settings.strategy) report.missingStrategy = settings.strategy;
-  if (!options.svg.empty()) writeTextFile(options.svg, tuningAsSvg(report));
-  if (!options.html.empty()) writeTextFile(options.html, tuningAsPage(report));
-  if (options.json) {
-    std::cout << printable(tuningAsJson(report), 2) << std::endl;
-  } else {
-    printTuning(report, console);
+  write(report, options, console);
+}
+
+// Each file once, by whatever names.
+void requireNew(const std::string& file, std::set<std::filesystem::path>& files) {
+  std::error_code ignored;
+  const std::filesystem::path path = std::filesystem::weakly_canonical(file, ignored);
+  if (!files.insert(path).second) throw InputError(file + ": is given twice");
+}
+
+void runMerge(const TuneOptions& options) {
+  Console console = Console::standardOutput();
+  TuningMerge merge;
+  std::set<std::filesystem::path> files;
+  {
+    Progress progress(console, "reading documents");
+    for (const std::string& file : options.merge) {
+      requireNew(file, files);
+      merge.add(file, readTuneDocument(file));
+      progress.advanceTo(files.size(), options.merge.size());
+    }
   }
+  const MergedTuning merged = merge.result();
+  TuneReport report;
+  report.source = formatCount(files.size(), "document", "documents");
+  report.store = merged.store;
+  report.fleet = merged.fleet;
+  report.tuning = merged.tuning;
+  write(report, options, console);
 }
 
 void addCsvOptions(CLI::App& tune, TuneOptions& options) {
@@ -175,6 +213,18 @@ void addVideoOptions(CLI::App& tune, TuneOptions& options) {
           "SECONDS");
 }
 
+// With it, nothing is simulated: of the other options only those that say where the report goes make sense.
+void addMergeOption(CLI::App& tune, TuneOptions& options) {
+  const std::vector<CLI::Option*> others = tune.get_options();
+  CLI::Option* const merge = tune.add_option(
+      "--merge", options.merge, "Instead of EVENTS: add up what tune --json wrote of many devices, a file each");
+  merge->expected(1, -1)->type_name("FILE ...");
+  for (CLI::Option* const other : others) {
+    const std::string name = other->get_name();
+    if (name != "--svg" && name != "--html" && name != "--json" && other != tune.get_help_ptr()) merge->excludes(other);
+  }
+}
+
 // Empty if `parse` takes it.
 template <class Parse> CLI::Validator checkedBy(Parse parse) {
   const auto whyNot = [parse](const std::string& text) {
@@ -195,7 +245,6 @@ void addTuneCommand(CLI::App& app, int& status) {
   CLI::App* const tune =
       app.add_subcommand("tune", "Find a cache's limit from the accesses that an application logged");
   tune->add_option("EVENTS", options->events, "What the host kit's sink has written, JSON lines; - for standard input")
-      ->required()
       ->type_name("FILE");
   tune->add_option("--store", options->store, "The store's name; not needed if all events are of one store")
       ->type_name("NAME");
@@ -232,14 +281,17 @@ void addTuneCommand(CLI::App& app, int& status) {
   tune->add_flag("--json", options->json, "Print one JSON object for machines");
   addCsvOptions(*tune, *options);
   addVideoOptions(*tune, *options);
+  addMergeOption(*tune, *options);
   tune->footer(
       "Computes for every size limit how many requests a cache would have found that is pruned as soon as it is over\n"
       "its limit, with each prune_strategy. docs/tuning.md explains the figures and their limits.\n\n"
       "Examples:\n"
       "  cellar tune analytics.jsonl --store thumbs --config storage.json --svg thumbs.svg\n"
+      "  cellar tune --merge devices/*.json --html devices.html\n"
       "  zcat trace.csv.gz | cellar tune - --csv --key lbn --size size --op op --store-op 2a");
   tune->callback([options, &status] {
-    runTune(*options);
+    if (options->events.empty() && options->merge.empty()) throw CLI::RequiredError("EVENTS");
+    options->merge.empty() ? runTune(*options) : runMerge(*options);
     status = 0;
   });
 }

@@ -8,6 +8,8 @@
 #include "Printable.h"
 #include "tune/Advice.h"
 #include "tune/AdviceText.h"
+#include "tune/FleetText.h"
+#include "tune/TuneDocument.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
 
@@ -63,6 +65,7 @@ std::vector<std::string> rowOf(const Tuning& tuning, const TunedLimit& limit, co
 
 std::vector<std::string> notesOn(const TuneReport& report) {
   const Tuning& tuning = report.tuning;
+  if (report.fleet) return fleetTexts(*report.fleet, tuning);
   std::vector<std::string> notes;
   notes.push_back(formatCount(tuning.requests, "request", "requests") + " of " +
                   formatCount(tuning.keys, "key", "keys") +
@@ -125,6 +128,39 @@ Json adviceAsJson(const Tuning& tuning) {
   return json;
 }
 
+Json limitsAsJson(const Tuning& tuning) {
+  Json limits = Json::array();
+  for (const TunedLimit& limit : tuning.limits) limits.push_back(asJson(tuning, limit));
+  return limits;
+}
+
+Json enoughAsJson(const Fleet& fleet) {
+  Json json = Json::object();
+  for (const auto& [strategy, limits] : fleet.enough) {
+    for (const unsigned share : kShownPercentiles) json[strategy][std::to_string(share)] = enoughFor(limits, share);
+  }
+  return json;
+}
+
+Json fleetAsJson(const TuneReport& report) {
+  const Tuning& tuning = report.tuning;
+  return {{"format", kTuneFormat},
+          {"source", report.source},
+          {"store", report.store},
+          {"devices", report.fleet->devices},
+          {"short_devices", report.fleet->shortDevices},
+          {"sampled_devices", report.fleet->sampledDevices},
+          {"requests", tuning.requests},
+          {"requested_bytes", tuning.requestedBytes},
+          {"worth", tuning.worth},
+          {"limits", limitsAsJson(tuning)},
+          {"enough", asJson(tuning, enoughLimit(tuning))},
+          {"enough_for_percent", enoughAsJson(*report.fleet)},
+          {"present", nullptr},
+          {"strategy", tuning.strategy},
+          {"advice", adviceAsJson(tuning)}};
+}
+
 Json sampleAsJson(const SampleFigures& sample) {
   return {{"rate", sample.rate}, {"requests", sample.requests}, {"keys", sample.keys}};
 }
@@ -157,9 +193,9 @@ void printTuning(const TuneReport& report, Console& console) {
 
 Json tuningAsJson(const TuneReport& report) {
   const Tuning& tuning = report.tuning;
-  Json limits = Json::array();
-  for (const TunedLimit& limit : tuning.limits) limits.push_back(asJson(tuning, limit));
-  Json json = {{"source", report.source},
+  if (report.fleet) return fleetAsJson(report);
+  Json json = {{"format", kTuneFormat},
+               {"source", report.source},
                {"store", report.store},
                {"requests", tuning.requests},
                {"requested_bytes", tuning.requestedBytes},
@@ -169,7 +205,7 @@ Json tuningAsJson(const TuneReport& report) {
                {"seconds", tuning.seconds},
                {"largest_total", tuning.everything},
                {"worth", tuning.worth},
-               {"limits", std::move(limits)},
+               {"limits", limitsAsJson(tuning)},
                {"enough", asJson(tuning, enoughLimit(tuning))},
                {"present", asJson(tuning, presentLimit(tuning))},
                {"strategy", tuning.strategy},

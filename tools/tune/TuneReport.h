@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "Table.h"
+#include "tune/Fleet.h"
 #include "tune/Tuning.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
@@ -20,6 +21,7 @@ struct TuneReport {
   std::uint64_t reportedFirstHits = 0;        // the first access to their key: items that were stored before
   std::uint64_t damagedLines = 0;
   std::string missingStrategy;  // the present one, if it could not be simulated
+  std::optional<Fleet> fleet;   // of the devices, if the figures are theirs together
   Tuning tuning;
 };
 
