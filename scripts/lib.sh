@@ -63,7 +63,7 @@ trap 'exit 143' TERM
 # ---- packages -----------------------------------------------------------------------------------------------------------
 
 build_packages=(g++ cmake ninja-build ccache git libsqlite3-dev zlib1g-dev libgoogle-glog-dev nlohmann-json3-dev
-  libgtest-dev libgmock-dev libcli11-dev libjs-chart.js)
+  libgtest-dev libgmock-dev libcli11-dev libjs-chart.js sqlite3)
 
 # Prints those of the named packages that are not installed.
 missing_packages() {
@@ -161,7 +161,7 @@ run_tests() {
   say "Testing build/$preset"
   ctest --preset "$preset" --output-on-failure --no-tests=error --timeout 300 -j "$jobs" "$@" >"$log" 2>&1 </dev/null || status=$?
   if ((status != 0)); then
-    sed -n '/% tests passed/q; /^ *Start /d; / Passed /d; p' "$log" | head -n 400
+    sed -n '/% tests passed/q; /^ *Start /d; / Passed /d; p' "$log" | { head -n 400 && cat >/dev/null; }
   fi
   sed -n '/% tests passed/,$p' "$log"
   return "$status"

@@ -335,7 +335,7 @@ TEST_F(FileUtilsTest, AFileThatCannotBeCreatedIsReported) {
 }
 
 TEST_F(FileUtilsTest, RunningOutOfDescriptorsIsReported) {
-#if defined(__SANITIZE_ADDRESS__)
+#if defined(CELLAR_SANITIZES_ADDRESSES)
   GTEST_SKIP() << "the sanitizers need descriptors of their own to look at memory";
 #endif
   const string path = directory_.write("file", "x");
@@ -925,7 +925,7 @@ TEST_F(FileUtilsTest, TheRemovalInsideATreeIsReportedAsARemoval) {
 }
 
 TEST_F(FileUtilsTest, ATreeDeeperThanTheDescriptorsReachFailsWithoutHarm) {
-#if defined(__SANITIZE_ADDRESS__)
+#if defined(CELLAR_SANITIZES_ADDRESSES)
   GTEST_SKIP() << "the sanitizers need descriptors of their own to look at memory";
 #endif
   directory_.write("1/2/3/4/5/6/7/8/9/10/file", "x");

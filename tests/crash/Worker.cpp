@@ -34,7 +34,7 @@ namespace {
 constexpr std::size_t kThreads = 3;
 
 // The sanitizers need descriptors of their own to look at memory.
-#if defined(__SANITIZE_ADDRESS__)
+#if defined(CELLAR_SANITIZES_ADDRESSES)
 constexpr bool kCanGoWithoutDescriptors = false;
 #else
 constexpr bool kCanGoWithoutDescriptors = true;

@@ -30,7 +30,7 @@ class NoDescriptors {
 };
 
 // The sanitizers need descriptors of their own to look at memory.
-#if defined(__SANITIZE_ADDRESS__)
+#if defined(CELLAR_SANITIZES_ADDRESSES)
 constexpr bool kCanGoWithoutDescriptors = false;
 #else
 constexpr bool kCanGoWithoutDescriptors = true;

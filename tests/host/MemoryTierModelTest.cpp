@@ -31,7 +31,7 @@ using test::watch;
 
 const std::string kMiss = "<miss>";
 
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__) || defined(__arm__)
+#if defined(CELLAR_SANITIZES_ADDRESSES) || defined(CELLAR_SANITIZES_THREADS) || defined(__arm__)
 constexpr bool kIsSlow = true;
 #else
 constexpr bool kIsSlow = false;

@@ -154,7 +154,8 @@ std::vector<unsigned char> UntouchedFiles::readFile(const std::string& path) {
     if (size > largest_) file.refuse("more than the " + formatSize(largest_) + " that are read of such a file");
   };
   requireRoom(file.size());
-  std::vector<unsigned char> bytes(file.size() + 1);  // so that the end is seen in a file that does not grow
+  std::vector<unsigned char> bytes(static_cast<std::size_t>(file.size()) +
+                                   1);  // so that the end is seen in a file that does not grow
   std::size_t filled = 0;
   while (const std::size_t count = file.readInto(bytes.data() + filled, bytes.size() - filled)) {
     filled += count;
