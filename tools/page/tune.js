@@ -10,11 +10,15 @@ function fillTexts() {
   for (const note of shown.texts.notes) document.getElementById("notes").append(make("p", { className: "quiet", textContent: note }));
 }
 
-// All columns but the last, which has remarks, are figures.
+// All columns but the last, which has remarks, are figures. On a phone there is room for the limit and the hit rates.
 function fillTable() {
   const { columns, rows } = shown.texts;
-  const cells = (name, texts) => texts.map((text, index) => (
-    make(name, { className: index + 1 < columns.length ? "number" : "remark", textContent: text })));
+  const kindOf = (column, index) => {
+    if (index + 1 === columns.length) return "remark";
+    return column === "of bytes" || column.startsWith("misses") ? "number secondary" : "number";
+  };
+  const kinds = columns.map(kindOf);
+  const cells = (name, texts) => texts.map((text, index) => make(name, { className: kinds[index], textContent: text }));
   document.querySelector("#limits tr").append(...cells("th", columns));
   document.querySelector("#limits tbody").append(...rows.map((row) => make("tr", {}, ...cells("td", row))));
 }
