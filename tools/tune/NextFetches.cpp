@@ -15,8 +15,8 @@ constexpr std::uint64_t kNever = SimulatedCache::kNever;
 }  // namespace
 
 NextFetches::NextFetches(const Trace& trace) : count_(trace.accesses()) {
-  std::vector<std::uint64_t> fetches(trace.keys(), kNever);  // by key
-  std::uint64_t cleared = kNever;                            // the earliest so far
+  std::vector<std::uint64_t> fetches(static_cast<std::size_t>(trace.keys()), kNever);  // by key
+  std::uint64_t cleared = kNever;                                                      // the earliest so far
   std::vector<std::uint64_t> block(kBlock);
   trace.replayBackwards([&](std::uint64_t number, const Access& access) {
     const std::size_t place = number % kBlock;
