@@ -207,6 +207,22 @@ TEST_F(TraceReadersTest, SizesThatCannotBeAddedUpAreRefused) {
   EXPECT_EQ(refusalOf(table, columns()), "the sizes add up to more than can be counted");
 }
 
+TEST_F(TraceReadersTest, SizesThatAreFilledInAreAddedUpToo) {
+  std::string table = "lbn,bytes\na,1125899906842624\n";
+  for (int i = 0; i < 1024; ++i) table += "a,\n";
+  readTable(table, columns());
+  EXPECT_THROW((void)linesOf(trace), InputError);
+}
+
+TEST_F(TraceReadersTest, ATimeThatNoClockHasIsNone) {
+  for (const char* const time : {"-9223372036854775808", "1125899906842625", "18446744073709551615", "7"}) {
+    lines << R"({"event":"qzpkvs_access","payload":{"store_name":"s","key":"k","hit":0,"size":1},"time":)" << time
+          << "}\n";
+  }
+  EXPECT_EQ(readLines().hits, 4U);
+  EXPECT_EQ(trace.seconds(), 7);
+}
+
 TEST_F(TraceReadersTest, AFileThatIsNotThereIsNamed) {
   try {
     const LineReader reader(directory.file("nothing"));

@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <nlohmann/json.hpp>
 #include <numeric>
@@ -236,6 +237,19 @@ TEST_F(TuningTest, ThePlotMarksBothLimitsAndEscapesTheStoresName) {
   EXPECT_THAT(svg, HasSubstr("present: 5 MB, 0.0 %"));
   EXPECT_THAT(svg, HasSubstr("enough: 10 MB, 99.0 %"));
   EXPECT_THAT(svg, Not(HasSubstr("nan")));
+}
+
+TEST_F(TuningTest, TheLargestSizesArePlottedAsFinelyAsOthers) {
+  constexpr std::int64_t largest = std::int64_t{1} << 59;
+  ask("a", largest);
+  ask("a", largest);
+  const Tuning tuning = tuned();
+  EXPECT_TRUE(std::is_sorted(tuning.curve.begin(), tuning.curve.end(),
+                             [](const auto& a, const auto& b) { return a.limit < b.limit; }));
+  EXPECT_EQ(std::count_if(tuning.curve.begin(), tuning.curve.end(),
+                          [&](const auto& point) { return point.limit > largest / 2 && point.limit < largest; }),
+            31);
+  EXPECT_EQ(tuning.curve.back().limit, largest);
 }
 
 TEST_F(TuningTest, EvenNothingCanBePlotted) {

@@ -15,6 +15,7 @@ using Json = nlohmann::json;
 
 constexpr const char* kAccessEvent = "qzpkvs_access";
 constexpr int kFound = 0;
+constexpr std::int64_t kMostSeconds = std::int64_t{1} << 50;
 
 struct AccessEvent {
   std::string store;
@@ -36,6 +37,12 @@ std::optional<std::string> text(const Json& object, const char* name) {
   return member->get<std::string>();
 }
 
+// 0 if there is none, or one that no clock has.
+std::int64_t timeOf(const Json& event) {
+  const std::int64_t seconds = integer(event, "time").value_or(0);
+  return seconds >= -kMostSeconds && seconds <= kMostSeconds ? seconds : 0;
+}
+
 // Empty if the event is not an access, or not one that a store reports.
 std::optional<AccessEvent> readAccess(const Json& event) {
   if (text(event, "event") != kAccessEvent) return std::nullopt;
@@ -46,7 +53,7 @@ std::optional<AccessEvent> readAccess(const Json& event) {
   const auto hit = integer(*payload, "hit");
   const auto size = integer(*payload, "size");
   if (!store || !key || !hit || !size || *size < 0) return std::nullopt;
-  return AccessEvent{*store, *key, *hit == kFound, *size, integer(event, "time").value_or(0)};
+  return AccessEvent{*store, *key, *hit == kFound, *size, timeOf(event)};
 }
 
 // A miss has no size, and neither has a use that is not a fetch, which is reported as a hit of 0 bytes.

@@ -9,8 +9,11 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 namespace {
 
-// So that no sum of sizes exceeds 64 bits.
-constexpr double kMostBytes = 0x1p60;
+// So that no sum of sizes exceeds 64 bits, nor an estimate from the sums of a sample of that rate.
+void addUp(std::int64_t& sum, std::int64_t size, double rate) {
+  if (size > static_cast<std::int64_t>(0x1p60 * rate) - sum) throw InputError("the sizes add up to more than can be counted");
+  sum += size;
+}
 
 constexpr std::size_t kBlock = 4096;  // accesses that are read together
 
@@ -22,10 +25,7 @@ void Trace::append(const std::string& key, Access access) {
   if (!sample_.has(key)) return;
   access.key = numberOf(key);
   if (access.size != Access::kUnknownSize) {
-    if (access.size > static_cast<std::int64_t>(kMostBytes * sample_.rate()) - bytes_) {
-      throw InputError("the sizes add up to more than can be counted");
-    }
-    bytes_ += access.size;
+    addUp(bytes_, access.size, sample_.rate());
     if (firstSizes_[access.key] == Access::kUnknownSize) firstSizes_[access.key] = access.size;
   }
   hasMetadata_ = hasMetadata_ || access.itemType != Access::kNoMetadata;
@@ -49,6 +49,7 @@ void Trace::mayBeEmpty(const std::string& key) {
 void Trace::replay(const std::function<void(const Access&)>& visit) const {
   std::vector<std::int64_t> sizes = startingSizes();
   std::vector<Access> block(kBlock);
+  std::int64_t bytes = 0;
   for (std::uint64_t first = 0; first < accesses_; first += kBlock) {
     const std::size_t count = readBlock(first, block);
     for (std::size_t i = 0; i < count; ++i) {
@@ -56,6 +57,7 @@ void Trace::replay(const std::function<void(const Access&)>& visit) const {
       if (access.kind != AccessKind::Clear) {
         if (access.size == Access::kUnknownSize) access.size = sizes[access.key];
         sizes[access.key] = access.size;
+        addUp(bytes, access.size, sample_.rate());
       }
       visit(access);
     }

@@ -34,8 +34,8 @@ class Trace {
   void assumeSize(std::int64_t bytes) { assumedSize_ = bytes; }
 
   // Calls `visit` with each access, every size filled in: if it is not known, from the last access of the key before
-  // it, or else from the first one after it. Throws `InputError` when the file cannot be read again. Several threads at
-  // once may call this, when none appends.
+  // it, or else from the first one after it. Throws `InputError` when the file cannot be read again, or the sizes add
+  // up to more than can be counted. Several threads at once may call this, when none appends.
   void replay(const std::function<void(const Access&)>& visit) const;
 
   // From the last to the first, with their numbers, from 0. Sizes are as they were appended.

@@ -61,7 +61,9 @@ std::vector<HitCurve::Point> pointsToPlot(const HitCurve& curve, std::int64_t fi
   for (std::int64_t octave = first; octave <= last; octave *= 2) {
     std::int64_t latest = 0;
     for (int i = 0; i < kPointsOfAnOctave; ++i) {
-      const std::int64_t limit = octave + octave * i / kPointsOfAnOctave;
+      const std::int64_t step =
+          octave < kPointsOfAnOctave ? octave * i / kPointsOfAnOctave : octave / kPointsOfAnOctave * i;
+      const std::int64_t limit = octave + step;
       if (limit > latest && limit <= last) points.push_back(curve.at(limit));
       latest = limit;
     }
