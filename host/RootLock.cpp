@@ -80,8 +80,10 @@ class RootLock::File {
     return isAlive ? owner : 0;
   }
 
-  // Only for messages, so a failure, for example on a full disk, is ignored.
+  // Only for messages, so a failure, for example on a full disk, is ignored. A file with another name may be anybody's.
   void writeOwner(const std::string& text) const {
+    struct stat status {};
+    if (::fstat(descriptor_, &status) != 0 || status.st_nlink > 1) return;
     if (::ftruncate(descriptor_, 0) != 0) return;
     (void)!::pwrite(descriptor_, text.data(), text.size(), 0);
   }

@@ -11,7 +11,8 @@ namespace velmora::mobile::xplat::cellar::host {
 
 // Lets one host at a time use a directory of storage: two hosts in one root would lose each other's values. It is an
 // advisory lock (`flock`) on the file "_cellar_lock" in the directory. The file contains the process id of the owner
-// and remains when the lock is released. For applications that build their own host; `Host` has such a lock.
+// (unless it has another name, too: then it is not written) and remains when the lock is released. For applications
+// that build their own host; `Host` has such a lock.
 //
 // The lock belongs to this object, not to the process: a second one is refused in the same process, too. The system
 // releases it when the process ends, for whatever reason. A child process inherits it by fork, not by exec: if the

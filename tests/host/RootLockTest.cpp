@@ -189,6 +189,18 @@ TEST_F(RootLockTest, ALinkInItsPlaceIsRefusedAndItsTargetLeftAlone) {
   EXPECT_EQ(directory_.read("target"), "mine");
 }
 
+TEST_F(RootLockTest, AFileWithAnotherNameIsLockedButNotWritten) {
+  directory_.write("another name", "mine");
+  std::filesystem::create_hard_link(directory_.file("another name"), directory_.file("_cellar_lock"));
+  {
+    const RootLock lock(directory_.path());
+    EXPECT_FALSE(isFree());
+    EXPECT_EQ(directory_.read("another name"), "mine");
+  }
+  EXPECT_TRUE(isFree());
+  EXPECT_EQ(directory_.read("another name"), "mine");
+}
+
 TEST_F(RootLockTest, ADirectoryInItsPlaceIsRefused) {
   directory_.makeDirectory("_cellar_lock");
   EXPECT_EQ(failure(), couldNotLock(EISDIR, "Is a directory"));
