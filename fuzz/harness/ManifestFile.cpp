@@ -64,17 +64,27 @@ bool ManifestFile::exec(const std::string& sql, const std::vector<Value>& values
   return result == SQLITE_DONE || result == SQLITE_ROW;
 }
 
-std::optional<std::string> ManifestFile::textOf(const std::string& sql) {
+std::vector<std::string> ManifestFile::textsOf(const std::string& sql) {
   sqlite3_stmt* statement = nullptr;
-  if (sqlite3_prepare_v2(database_, sql.c_str(), -1, &statement, nullptr) != SQLITE_OK) return std::nullopt;
-  std::optional<std::string> text;
-  if (sqlite3_step(statement) == SQLITE_ROW) {
+  if (sqlite3_prepare_v2(database_, sql.c_str(), -1, &statement, nullptr) != SQLITE_OK) return {};
+  std::vector<std::string> texts;
+  while (sqlite3_step(statement) == SQLITE_ROW) {
     const void* const bytes = sqlite3_column_blob(statement, 0);
     const auto length = static_cast<std::size_t>(sqlite3_column_bytes(statement, 0));
-    text = bytes == nullptr ? "" : std::string(static_cast<const char*>(bytes), length);
+    texts.push_back(bytes == nullptr ? "" : std::string(static_cast<const char*>(bytes), length));
   }
   (void)sqlite3_finalize(statement);
-  return text;
+  return texts;
+}
+
+std::optional<std::string> ManifestFile::textOf(const std::string& sql) {
+  const std::vector<std::string> texts = textsOf(sql);
+  return texts.empty() ? std::nullopt : std::make_optional(texts.front());
+}
+
+std::vector<std::string> ManifestFile::filesOfRecords() {
+  if (textOf("PRAGMA integrity_check(1)") != "ok") return {};
+  return textsOf("SELECT filename FROM LarderManifest WHERE has_inline_data = 0");
 }
 
 bool ManifestFile::hasFilesNamedAfterKeys() {

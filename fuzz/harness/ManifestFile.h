@@ -41,7 +41,11 @@ class ManifestFile {
   // Whether each record names the file that a store writes for its key.
   bool hasFilesNamedAfterKeys();
 
+  // The names in the records of values in files; none if SQLite finds something wrong with the file.
+  std::vector<std::string> filesOfRecords();
+
  private:
+  std::vector<std::string> textsOf(const std::string& sql);
   std::optional<std::string> textOf(const std::string& sql);
 
   sqlite3* database_ = nullptr;
