@@ -7,6 +7,7 @@
 #include <cstddef>
 #include <exception>
 #include <iostream>
+#include <map>
 #include <nlohmann/json.hpp>
 #include <sstream>
 
@@ -109,7 +110,9 @@ void checkJson(const std::string& text) {
 
 void checkPage(const std::string& text, const char* page) {
   static const std::string mark = "{}";
-  const std::string frame = tools::pageOf(page, mark);
+  static std::map<const char*, std::string> frames;
+  std::string& frame = frames[page];
+  if (frame.empty()) frame = tools::pageOf(page, mark);
   const std::string element = "id=\"document\">";
   const std::size_t begin = frame.find(element) + element.size();
   const std::size_t behind = frame.size() - begin - mark.size();
