@@ -5,7 +5,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
+#include <sstream>
 #include <system_error>
 
 #include "harness/Check.h"
@@ -70,8 +70,10 @@ std::string Scratch::write(const std::string& name, const std::string& bytes) co
 }
 
 std::string Scratch::read(const std::string& name) const {
-  std::ifstream stream(file(name), std::ios::binary);
-  return {std::istreambuf_iterator<char>(stream), std::istreambuf_iterator<char>()};
+  const std::ifstream stream(file(name), std::ios::binary);
+  std::ostringstream bytes;
+  bytes << stream.rdbuf();
+  return bytes.str();
 }
 
 std::string Scratch::makeDirectory(const std::string& name) const {

@@ -7,10 +7,10 @@
 #include <unistd.h>
 
 #include <array>
+#include <cstddef>
 #include <filesystem>
 #include <fstream>
 #include <functional>
-#include <iterator>
 #include <tuple>
 
 #include "harness/Check.h"
@@ -28,8 +28,9 @@ std::string textOf(const timespec& date) { return std::to_string(date.tv_sec) + 
 std::string contentOf(const std::string& path, const struct stat& status) {
   if (S_ISLNK(status.st_mode)) return fs::read_symlink(path).string();
   if (!S_ISREG(status.st_mode)) return "";
-  std::ifstream stream(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(stream), std::istreambuf_iterator<char>()};
+  std::string bytes(static_cast<std::size_t>(status.st_size), '\0');
+  std::ifstream(path, std::ios::binary).read(bytes.data(), status.st_size);
+  return bytes;
 }
 
 void setDates(const std::string& path, const timespec& access, const timespec& change) {
