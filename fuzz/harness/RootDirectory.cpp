@@ -15,6 +15,7 @@
 #include "SQLiteManifestPersistence.h"
 #include "harness/ManifestFile.h"
 #include "storage/SafeFiles.h"
+#include "storage/StoreFiles.h"
 
 namespace velmora::mobile::xplat::cellar::fuzz {
 
@@ -245,7 +246,8 @@ std::set<FileNumber> filesOfSoundRecords(const Scratch& scratch, const Tree& tre
     }
     for (const std::string& name : ManifestFile(copy).filesOfRecords()) {
       const auto file = tree.find(fs::path(path).parent_path().string() + "/" + name);
-      if (file != tree.end() && file->second.isFile) files.insert(file->second.number);
+      const bool isValue = file != tree.end() && file->second.isFile && !tools::isManifestFile(name);
+      if (isValue) files.insert(file->second.number);
     }
     fs::remove_all(scratch.file("copy"));
   }
