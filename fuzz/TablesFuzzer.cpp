@@ -31,6 +31,7 @@ std::vector<std::string> optionsFrom(ByteReader& input) {
   const std::size_t next = choices.size();
   if (isChosen(next)) options.push_back("--priority-weight=" + std::to_string(input.integer<std::int32_t>()));
   if (isChosen(next + 1)) options.push_back("--early-seconds=" + std::to_string(input.integer<std::int32_t>()));
+  if (isChosen(next + 2)) options.emplace_back("--sample=50%");
   return options;
 }
 

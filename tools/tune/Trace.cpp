@@ -11,11 +11,16 @@ namespace {
 
 // So that no sum of sizes exceeds 64 bits, nor an estimate from the sums of a sample of that rate.
 void addUp(std::int64_t& sum, std::int64_t size, double rate) {
-  if (size > static_cast<std::int64_t>(0x1p60 * rate) - sum) throw InputError("the sizes add up to more than can be counted");
+  if (size > static_cast<std::int64_t>(0x1p60 * rate) - sum)
+    throw InputError("the sizes add up to more than can be counted");
   sum += size;
 }
 
 constexpr std::size_t kBlock = 4096;  // accesses that are read together
+
+std::vector<Access> blockFor(std::uint64_t accesses) {
+  return std::vector<Access>(static_cast<std::size_t>(std::min<std::uint64_t>(kBlock, accesses)));
+}
 
 }  // namespace
 
@@ -48,7 +53,7 @@ void Trace::mayBeEmpty(const std::string& key) {
 
 void Trace::replay(const std::function<void(const Access&)>& visit) const {
   std::vector<std::int64_t> sizes = startingSizes();
-  std::vector<Access> block(kBlock);
+  std::vector<Access> block = blockFor(accesses_);
   std::int64_t bytes = 0;
   for (std::uint64_t first = 0; first < accesses_; first += kBlock) {
     const std::size_t count = readBlock(first, block);
