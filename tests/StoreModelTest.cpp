@@ -69,7 +69,7 @@ using ItemType = VideoDownloadExtendedMetadata::ItemType;
 constexpr std::time_t kStart = 1'700'000'000;
 const std::string kRefusal = "The queue takes no tasks.";
 
-#if defined(CELLAR_SANITIZES_ADDRESSES) || defined(CELLAR_SANITIZES_THREADS) || defined(__arm__)
+#if defined(CELLAR_RUNS_SLOWLY)
 constexpr unsigned int kDefaultRuns = 40;  // each takes ten times as long there
 #else
 constexpr unsigned int kDefaultRuns = 1000;

@@ -31,7 +31,7 @@ std::size_t openDescriptors() {
   return static_cast<std::size_t>(std::distance(begin(descriptors), end(descriptors)));
 }
 
-#if defined(CELLAR_SANITIZES_ADDRESSES) || defined(CELLAR_SANITIZES_THREADS) || defined(__arm__)
+#if defined(CELLAR_RUNS_SLOWLY)
 constexpr std::size_t kStrides = 4;  // a run takes several times as long there
 #else
 constexpr std::size_t kStrides = 1;

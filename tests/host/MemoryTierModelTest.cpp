@@ -31,7 +31,7 @@ using test::watch;
 
 const std::string kMiss = "<miss>";
 
-#if defined(CELLAR_SANITIZES_ADDRESSES) || defined(CELLAR_SANITIZES_THREADS) || defined(__arm__)
+#if defined(CELLAR_RUNS_SLOWLY)
 constexpr bool kIsSlow = true;
 #else
 constexpr bool kIsSlow = false;
