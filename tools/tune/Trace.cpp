@@ -11,8 +11,8 @@ namespace {
 
 // So that no sum of sizes exceeds 64 bits, nor an estimate from the sums of a sample of that rate.
 void addUp(std::int64_t& sum, std::int64_t size, double rate) {
-  if (size > static_cast<std::int64_t>(0x1p60 * rate) - sum)
-    throw InputError("the sizes add up to more than can be counted");
+  const auto most = static_cast<std::int64_t>(0x1p60 * rate);
+  if (size > most - sum) throw InputError("the sizes add up to more than can be counted");
   sum += size;
 }
 
