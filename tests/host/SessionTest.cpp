@@ -297,14 +297,14 @@ TEST_F(SessionTest, AMoveThatFailsFailsTheRequestAndTheNextOneTriesAgain) {
   const auto files = std::make_shared<FaultyFileUtils>();
   HostOptions faulty = options(Accounts::Kept);
   faulty.fileUtils = files;
-  Host host(std::move(faulty));
-  const Session alice = host.openSession("alice");
   std::atomic<bool> fails{true};
   files->onCall = [&](FaultyFileUtils::Operation operation, const std::string& path) {
     if (fails && operation == FaultyFileUtils::Operation::Rename && path == directory.file("caches/_store_alice")) {
       throw FileUtilsIoException(28, "No space left on device");
     }
   };
+  Host host(std::move(faulty));
+  const Session alice = host.openSession("alice");
   EXPECT_THROW(alice.manager("inbox"), FileUtilsIoException);
   EXPECT_TRUE(directory.exists("caches/_store_alice"));
   fails = false;
