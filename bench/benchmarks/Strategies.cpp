@@ -110,10 +110,10 @@ class Cache {
 
 using Measure = std::function<double(Strategy)>;
 
-Figures compared(const Context& context, const Place& place, std::size_t bytes, const Measure& measure) {
+Figures compared(const Place& place, int rounds, std::size_t bytes, const Measure& measure) {
   return interleaved(
       place, {{"ours", [&] { return measure(Strategy::GreedyDual); }}, {"lru", [&] { return measure(Strategy::LRU); }}},
-      context.scaled(9, 3), bytes);
+      rounds, bytes);
 }
 
 void measureLoads(const Context& context, const Place& place) {
@@ -128,7 +128,7 @@ void measureLoads(const Context& context, const Place& place) {
     if ((*store)->getManifest()->count() != items) throw std::runtime_error("not all records were loaded");
     return figure / static_cast<double>(items);
   };
-  const Figures time = compared(context, place, items * 300, [&](Strategy strategy) {
+  const Figures time = compared(place, context.scaled(9, 3), items * 300, [&](Strategy strategy) {
     return load(strategy, [](const auto& open) {
       const Stopwatch watch;
       open();
@@ -154,8 +154,9 @@ void measureStrategies(const Context& context) {
   const Place& place = context.places.front();
   const std::size_t items = context.scaled<std::size_t>(2'000, 500);
   const std::size_t fetches = context.scaled<std::size_t>(4'000, 1'000);
+  const int rounds = context.scaled(21, 3);  // a few hundredths are to be seen
   const auto add = [&](const std::string& what, const Measure& measure) {
-    const Figures figures = compared(context, place, sizeOfAll(items, mixedSize), measure);
+    const Figures figures = compared(place, rounds, sizeOfAll(items, mixedSize), measure);
     context.report.add(Row{what, place.name, cpuName(false), "us", figures, {{"lru", 1.05}}});
   };
   add("storing, 64 outstanding", [&](Strategy strategy) { return Cache(place, strategy, items).fill(); });
