@@ -215,7 +215,7 @@ TEST_F(TraceReadersTest, SizesThatAreFilledInAreAddedUpToo) {
 }
 
 TEST_F(TraceReadersTest, ATimeThatNoClockHasIsNone) {
-  for (const char* const time : {"-9223372036854775808", "1125899906842625", "18446744073709551615", "7"}) {
+  for (const char* const time : {"18446744073709551615", "-9223372036854775808", "1125899906842625", "7"}) {
     lines << R"({"event":"qzpkvs_access","payload":{"store_name":"s","key":"k","hit":0,"size":1},"time":)" << time
           << "}\n";
   }

@@ -28,7 +28,9 @@ struct AccessEvent {
 std::optional<std::int64_t> integer(const Json& object, const char* name) {
   const auto member = object.find(name);
   if (member == object.end() || !member->is_number_integer()) return std::nullopt;
-  return member->get<std::int64_t>();
+  const auto value = member->get<std::int64_t>();
+  if (member->is_number_unsigned() && value < 0) return std::nullopt;  // of more than 63 bits
+  return value;
 }
 
 std::optional<std::string> text(const Json& object, const char* name) {
