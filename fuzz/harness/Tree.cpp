@@ -29,7 +29,7 @@ std::string contentOf(const std::string& path, const struct stat& status) {
   if (S_ISLNK(status.st_mode)) return fs::read_symlink(path).string();
   if (!S_ISREG(status.st_mode)) return "";
   std::string bytes(static_cast<std::size_t>(status.st_size), '\0');
-  std::ifstream(path, std::ios::binary).read(bytes.data(), status.st_size);
+  std::ifstream(path, std::ios::binary).read(bytes.data(), static_cast<std::streamsize>(bytes.size()));
   return bytes;
 }
 
