@@ -55,11 +55,11 @@ class CELLAR_EXPORT ManifestSnapshot {
       const std::function<void(const std::string& key, const std::vector<unsigned char>& value)>& onValue) const;
 
   // What SQLite's integrity check, or opening the manifest as a store does, finds wrong with it, a line each; empty for
-  // a sound one.
+  // a sound one. Tables that somebody else has made are not checked: that may take any time and memory.
   std::vector<std::string> integrityErrors() const;
 
-  // What somebody else has put into the database: "trigger 'name'", "view 'name'". A store runs none of it. Throws
-  // `ManifestPersistenceException` for a damaged manifest.
+  // What somebody else has put into the database: "trigger 'name'", "view 'name'", "table 'name'". A store uses none of
+  // it. Throws `ManifestPersistenceException` for a damaged manifest.
   std::vector<std::string> foreignParts() const;
 
  private:

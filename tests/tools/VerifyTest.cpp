@@ -267,10 +267,19 @@ TEST_F(Verifying, FindsTriggersAndViewsThatSomebodyElseHasMade) {
   data_.run(kThumbs,
             "CREATE TRIGGER spy AFTER UPDATE ON LarderManifest BEGIN DELETE FROM LarderManifest; END;"
             "CREATE VIEW look AS SELECT key FROM LarderManifest");
-  EXPECT_THAT(findings(), ElementsAre("foreign part: the manifest has the trigger 'spy', which no store runs",
-                                      "foreign part: the manifest has the view 'look', which no store runs"));
+  EXPECT_THAT(findings(), ElementsAre("foreign part: the manifest has the trigger 'spy', which no store uses",
+                                      "foreign part: the manifest has the view 'look', which no store uses"));
   EXPECT_THAT(repairs(), testing::Each(testing::HasSubstr("; NOT REPAIRED: ")));
   EXPECT_THAT(data_.rows(kThumbs), ElementsAre("a 5 0 -"));
+}
+
+TEST_F(Verifying, DoesNotCheckATableThatSomebodyElseHasMade) {
+  data_.putItem(kThumbs, "a", "value");
+  data_.run(
+      kThumbs,
+      "CREATE TABLE other (x, y AS (length(hex(zeroblob(x)))), CHECK (x > 0)); PRAGMA ignore_check_constraints = 1;"
+      "INSERT INTO other VALUES (-1); INSERT INTO other VALUES (490000000)");
+  EXPECT_THAT(findings(), ElementsAre("foreign part: the manifest has the table 'other', which no store uses"));
 }
 
 TEST_F(Verifying, FindsAManifestThatIsMissingOrNoFile) {
@@ -286,6 +295,19 @@ TEST_F(Verifying, FindsAManifestThatIsMissingOrNoFile) {
   EXPECT_EQ(contentOf(kThumbs + "/a"), "value");
   fs::create_directory(data_.path(manifest));
   EXPECT_THAT(findings(), ElementsAre("cannot be read: not a regular file"));
+}
+
+TEST_F(Verifying, LeavesADamagedManifestToAStoreThatTheConfigurationCallsSafe) {
+  const ConfiguredStores configured(data_.directory().write("configuration.json", R"({"m": {"session_scoped": false,
+    "stores": { "thumbs": { "type": "disk_cache", "has_version": true, "durability": "safe", "inline_data": true } } } })"));
+  const std::string manifest = kThumbs + "/manifest_v1.sqlite";
+  data_.putFile(manifest, std::string(8192, 'x'));
+  const auto result = verify(
+      findLayout(data_.root()), configured, true, [](std::uint64_t) {}, [](const std::string&) {});
+  ASSERT_EQ(result.all.size(), 1U);
+  EXPECT_EQ(result.all.front().outcome,
+            "NOT REPAIRED: the store salvages it at its next start, if it is safe or synced");
+  EXPECT_TRUE(fs::exists(data_.path(manifest)));
 }
 
 TEST_F(Verifying, KnowsFromTheConfigurationWhichStoresHaveAManifest) {

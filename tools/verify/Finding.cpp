@@ -65,7 +65,7 @@ std::string describe(const Finding& finding) {
     case Finding::Kind::MissingManifest:
       return "missing manifest: there is no " + name + ", but " + printable(finding.detail);
     case Finding::Kind::ForeignPart:
-      return "foreign part: the manifest has the " + printable(finding.detail) + ", which no store runs";
+      return "foreign part: the manifest has the " + printable(finding.detail) + ", which no store uses";
     case Finding::Kind::Unreadable:
       return "cannot be read: " + printable(finding.detail);
     case Finding::Kind::DamagedAttributes:

@@ -20,7 +20,7 @@ struct Finding {
     UnfinishedFile,  // of a safe store: its writer was killed
     DamagedManifest,
     MissingManifest,     // of a store with keys
-    ForeignPart,         // of a manifest: a trigger, a view
+    ForeignPart,         // of a manifest: a trigger, a view, a table
     UnfinishedManifest,  // a safe store was killed while it made it,
     InterruptedSalvage,  // or before it put it in place
     Quarantine,          // of a safe store: what it could not use
