@@ -231,6 +231,21 @@ TEST_F(LookingAtASafeStore, RemovesWhatAKillHasLeftBesideASoundValue) {
   EXPECT_EQ(get("a"), "2");
 }
 
+TEST_F(LookingAtASafeStore, KeepsAFileThatItsRecordNamesInAnotherWay) {
+  open();
+  put("a", "1");
+  close();
+  const std::string file = onlyFile();
+  const std::string link = nameOf("a", 92, parseSafeFileName(file)->checksum);
+  fs::create_symlink(file, pathOf(link));
+  fs::create_directory_symlink(".", pathOf("sub"));
+  for (const std::string& name : {"'" + link + "'", "'sub/" + file + "'", "'" + file + "' || char(0) || 'x'"}) {
+    execute("UPDATE LarderManifest SET filename = " + name);
+    repairs();
+    EXPECT_TRUE(fs::is_regular_file(pathOf(file))) << name;
+  }
+}
+
 TEST_F(LookingAtASafeStore, KeepsFilesWhoseKeyHasNoOtherValue) {
   open();
   put("a", "1");

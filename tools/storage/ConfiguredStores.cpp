@@ -107,6 +107,12 @@ ConfiguredStore ConfiguredStores::find(const ManagerPlace& place, const std::str
   return found;
 }
 
+Durability durabilityOf(const StoreDefinition& definition) {
+  if (const auto* cache = dynamic_cast<const DiskCacheDefinition*>(&definition)) return cache->durability;
+  if (const auto* keyValue = dynamic_cast<const PKVSDefinition*>(&definition)) return keyValue->durability;
+  return Durability::Relaxed;
+}
+
 std::string durabilityName(Durability durability) {
   switch (durability) {
     case Durability::Safe:

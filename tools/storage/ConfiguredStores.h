@@ -41,6 +41,9 @@ class ConfiguredStores {
   std::vector<std::shared_ptr<const StoreManagerDefinition>> managers_;
 };
 
+// Relaxed for one without keys, which promises nothing.
+Durability durabilityOf(const StoreDefinition& definition);
+
 // "relaxed", "safe" or "synced", as it is written in a configuration.
 std::string durabilityName(Durability durability);
 

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <climits>
 #include <cstddef>
 #include <cstdio>
 #include <stdexcept>
@@ -22,9 +23,11 @@ constexpr mode_t kFileMode = 0666;
 constexpr off_t kSharedBytes = 0x40000002;
 constexpr off_t kSharedCount = 510;
 
-// "sunrise.jpg", "sunrise.jpg.1"
+// "sunrise.jpg", "sunrise.jpg.1"; of a name as long as a name may be, the end is left out.
 std::string numbered(const std::string& name, int number) {
-  return number == 0 ? name : name + "." + std::to_string(number);
+  if (number == 0) return name;
+  const std::string ending = "." + std::to_string(number);
+  return name.substr(0, NAME_MAX - ending.size()) + ending;
 }
 
 bool writeAll(int file, const std::vector<unsigned char>& bytes) {

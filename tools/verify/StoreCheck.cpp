@@ -1,11 +1,16 @@
 #include "verify/StoreCheck.h"
 
+#include <sys/stat.h>
+#include <sys/types.h>
+
 #include <algorithm>
 #include <cstddef>
 #include <exception>
 #include <filesystem>
 #include <memory>
 #include <optional>
+#include <set>
+#include <string>
 #include <unordered_map>
 #include <unordered_set>
 #include <utility>
@@ -38,6 +43,14 @@ std::optional<std::uint64_t> sizeOfValue(const std::string& directory, const std
   return error ? std::nullopt : std::make_optional<std::uint64_t>(size);
 }
 
+using FileId = std::pair<dev_t, ino_t>;
+
+// Of what a store reads there, links followed; zeros if there is nothing, which no file has.
+FileId idOf(const std::string& path) {
+  struct stat status = {};
+  return ::stat(path.c_str(), &status) == 0 ? FileId{status.st_dev, status.st_ino} : FileId{};
+}
+
 // A damaged manifest cannot always tell that it is a safe store's, but what lies beside it can. So may what cannot be
 // listed.
 bool looksSafe(const std::string& directory) try {
@@ -61,13 +74,14 @@ bool hasChecksums(const ManifestSnapshot& snapshot) {
 
 class StoreCheck {
  public:
-  StoreCheck(const std::string& directory, OnFile onFile) : directory_(directory), onFile_(std::move(onFile)) {}
+  StoreCheck(const std::string& directory, bool isConfiguredSafe, OnFile onFile)
+      : directory_(directory), isConfiguredSafe_(isConfiguredSafe), onFile_(std::move(onFile)) {}
 
   Findings check(const ManifestSnapshot& snapshot) {
     isSafe_ = hasChecksums(snapshot);
     const auto damages = snapshot.integrityErrors();
     if (!damages.empty()) {
-      isSafe_ = isSafe_ || looksSafe(directory_);
+      isSafe_ = isSafe_ || isConfiguredSafe_ || looksSafe(directory_);
       Finding finding = make(Finding::Kind::DamagedManifest, ManifestSnapshot::manifestName);
       finding.detail = damages.front();
       return {finding};
@@ -170,7 +184,7 @@ class StoreCheck {
       if (entry.type == Entry::Type::Directory) return;
       onFile_(entry.size);
       if (isManifestFile(below) || isAttributesFile(entry) || isStrangeAttributesFile(entry)) return;
-      if (valueFiles_.count(below) > 0) return;
+      if (valueFiles_.count(below) > 0 || isValueByAnotherName(below)) return;
       if (isInStoreQuarantine(below)) {
         ++quarantine.files;
         quarantine.actual += entry.size;
@@ -180,6 +194,14 @@ class StoreCheck {
     };
     walkTree(directory_, onEntry, [](const Unreadable& /*found with the attributes*/) {});
     if (quarantine.files > 0) findings_.push_back(std::move(quarantine));
+  }
+
+  // Whether a record leads there all the same, through a link for example.
+  bool isValueByAnotherName(const std::string& below) {
+    if (valueIds_.empty()) {
+      for (const std::string& file : valueFiles_) valueIds_.insert(idOf(directory_ + "/" + file));
+    }
+    return valueIds_.count(idOf(directory_ + "/" + below)) > 0;
   }
 
   // Whether a safe store has left it: unfinished, or as the file of a key whose value is another one or will be this.
@@ -229,10 +251,12 @@ class StoreCheck {
   }
 
   const std::string directory_;
+  const bool isConfiguredSafe_;
   const OnFile onFile_;
   Findings findings_;
   bool isSafe_ = false;                                             // or was: the manifest has checksums
   std::unordered_set<std::string> valueFiles_;                      // below the directory
+  std::set<FileId> valueIds_;                                       // of the same; empty until they are needed
   std::unordered_map<std::string, std::uint32_t> inlineChecksums_;  // of a safe store, by key
   std::unordered_set<std::string> soundKeys_;                       // of a safe store
   std::unordered_map<std::string, std::size_t> withoutFile_;        // findings of a safe store, by key
@@ -264,16 +288,16 @@ Findings checkMissingManifest(const StorePlace& place, bool hasKeys) {
   return {};
 }
 
-Findings checkReadableStore(const StorePlace& place, bool hasKeys, const std::string& temporaryDirectory,
-                            const OnFile& onFile) {
+Findings checkReadableStore(const StorePlace& place, const Configured& configured,
+                            const std::string& temporaryDirectory, const OnFile& onFile) {
   // Until it is in its place, the present one says little of the files.
   std::error_code error;
   if (fs::is_regular_file(fs::symlink_status(fs::path(place.path) / salvagedManifestName(), error))) {
     return {{Finding::Kind::InterruptedSalvage, place.path, salvagedManifestName()}};
   }
-  if (!place.hasManifest) return checkMissingManifest(place, hasKeys);
+  if (!place.hasManifest) return checkMissingManifest(place, configured.hasKeys);
   const ManifestSnapshot snapshot(place.path, temporaryDirectory, std::make_shared<UntouchedFiles>());
-  return StoreCheck(place.path, onFile).check(snapshot);
+  return StoreCheck(place.path, configured.isSafe, onFile).check(snapshot);
 }
 
 Findings checkAttributesFile(const std::string& directory, const std::string& below) {
@@ -294,10 +318,10 @@ Finding findingOf(const Unreadable& unreadable) {
   return finding;
 }
 
-Findings checkStore(const StorePlace& place, bool hasKeys, const std::string& temporaryDirectory,
+Findings checkStore(const StorePlace& place, const Configured& configured, const std::string& temporaryDirectory,
                     const OnFile& onFile) {
   try {
-    return checkReadableStore(place, hasKeys, temporaryDirectory, onFile);
+    return checkReadableStore(place, configured, temporaryDirectory, onFile);
   } catch (const std::exception& error) {
     return {findingOf(unreadableBy(error, place.path))};
   }

@@ -11,12 +11,18 @@ namespace velmora::mobile::xplat::cellar::tools {
 
 struct StorePlace;
 
+// What the configuration says of a store; nothing, if it does not have it.
+struct Configured {
+  bool hasKeys = false;  // it has a manifest once there is a value
+  bool isSafe = false;   // or synced
+};
+
 using OnFile = std::function<void(std::uint64_t bytes)>;  // called for each file that is looked at
 
 // Holds records and files of a store against each other; a store without a manifest has nothing to be held against.
 // `temporaryDirectory` is for the copy of the manifest: nothing else is written. What cannot be read is a finding.
-// `hasKeys`: the store is configured as one that has a manifest once there is a value.
-Findings checkStore(const StorePlace& place, bool hasKeys, const std::string& temporaryDirectory, const OnFile& onFile);
+Findings checkStore(const StorePlace& place, const Configured& configured, const std::string& temporaryDirectory,
+                    const OnFile& onFile);
 
 // The finding that this cannot be read.
 Finding findingOf(const Unreadable& unreadable);

@@ -42,7 +42,7 @@ class Verifier {
       const Quarantine quarantine = quarantineFor(layout_, manager);
       for (const StorePlace& store : manager.stores) {
         ++result_.stores;
-        settle(checkStore(store, hasKeys(manager, store), temporary_.path(), onFile_), quarantine);
+        settle(checkStore(store, configured(manager, store), temporary_.path(), onFile_), quarantine);
         settle(checkAttributes(store.path), quarantine);
       }
     }
@@ -77,9 +77,10 @@ class Verifier {
     }
   }
 
-  bool hasKeys(const ManagerPlace& manager, const StorePlace& store) const {
+  Configured configured(const ManagerPlace& manager, const StorePlace& store) const {
     const auto definition = configured_.find(manager, store.name).definition;
-    return definition != nullptr && definition->type != StoreDefinition::Type::Unmanaged;
+    if (definition == nullptr) return {};
+    return {definition->type != StoreDefinition::Type::Unmanaged, durabilityOf(*definition) != Durability::Relaxed};
   }
 
   const Layout& layout_;
