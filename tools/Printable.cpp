@@ -77,6 +77,29 @@ Character characterAt(const std::string& text, std::size_t place) {
   return {value, length};
 }
 
+// So that two texts that differ in such a byte are not the same afterwards.
+std::string withStrangeBytesShown(const std::string& text) {
+  std::string result;
+  for (std::size_t place = 0; place < text.size();) {
+    const Character character = characterAt(text, place);
+    if (character.length == 0) {
+      result += "\\x" + hexadecimal(character.value, 2);
+    } else {
+      result.append(text, place, character.length);
+    }
+    place += std::max<std::size_t>(1, character.length);
+  }
+  return result;
+}
+
+void showStrangeBytes(nlohmann::ordered_json& value) {
+  if (value.is_string()) {
+    value = withStrangeBytesShown(value.get_ref<const std::string&>());
+  } else if (value.is_structured()) {
+    for (auto& part : value) showStrangeBytes(part);
+  }
+}
+
 }  // namespace
 
 std::string printable(const std::string& text) {
@@ -96,7 +119,9 @@ std::string printable(const std::string& text) {
 }
 
 std::string printable(const nlohmann::ordered_json& document, int indentation) {
-  return document.dump(indentation, ' ', true, nlohmann::ordered_json::error_handler_t::replace);
+  nlohmann::ordered_json readable = document;
+  showStrangeBytes(readable);
+  return readable.dump(indentation, ' ', true, nlohmann::ordered_json::error_handler_t::replace);
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

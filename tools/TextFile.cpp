@@ -4,12 +4,15 @@
 #include <array>
 #include <cerrno>
 #include <cstdio>
+#include <filesystem>
 #include <memory>
 #include <system_error>
 
 #include "InputError.h"
 
 namespace velmora::mobile::xplat::cellar::tools {
+
+namespace fs = std::filesystem;
 
 namespace {
 
@@ -47,6 +50,26 @@ void writeTextFile(const std::string& path, const std::string& text) {
   const bool written = std::fwrite(text.data(), 1, text.size(), file.get()) == text.size();
   if (!written) fail("write", path, errno);
   if (std::fclose(file.release()) != 0) fail("write", path, errno);
+}
+
+void requireOther(const std::string& output, const std::vector<std::string>& others) {
+  if (output.empty()) return;
+  for (const std::string& other : others) {
+    if (!other.empty() && targetOf(output) == targetOf(other)) {
+      throw InputError("cannot write '" + output + "': it is given for something else as well");
+    }
+  }
+}
+
+std::string targetOf(const std::string& path) {
+  constexpr int mostLinks = 40;  // as many as the system follows
+  fs::path target = path;
+  std::error_code error;
+  for (int links = 0; links < mostLinks && fs::is_symlink(fs::symlink_status(target, error)); ++links) {
+    target = target.parent_path() / fs::read_symlink(target, error);
+  }
+  const fs::path whole = fs::weakly_canonical(target, error);
+  return error ? path : whole.string();
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -40,7 +40,7 @@ void describe(CLI::App& app) {
       "Examples:\n  cellar demo ~/Pictures\n  cellar check storage.json\n  cellar inspect /tmp/cellar-demo\n  cellar "
       "tune "
       "analytics.jsonl --store thumbs\n\nExit status: 0 without problems, 1 when a problem was found, 2 for usage and "
-      "input errors.");
+      "input errors and for an output that cannot be written, 3 when verify found ROOT empty.");
   app.set_version_flag("--version", tools::versionText());
   app.require_subcommand(1);
 }
@@ -99,7 +99,8 @@ int runProgram(int argc, char** argv) {
 int main(int argc, char** argv) {
   keepLogOffTheTerminal(argv[0]);
   try {
-    return runProgram(argc, argv);
+    const int status = runProgram(argc, argv);
+    return std::cout.flush() ? status : report("cannot write to the standard output");
   } catch (const tools::InputError& error) {
     return report(error.what());
   } catch (const std::exception& error) {

@@ -104,6 +104,9 @@ TEST_F(Growing, OtherDocumentsAreRefusedWithThePlace) {
   const nlohmann::json sound =
       surveyAsJson(makeSurvey(findLayout(data_.root()), ConfiguredStores(), 0, StoredData::kNow, [](std::uint64_t) {}));
   EXPECT_EQ(errorOf(sound), "no error");
+  nlohmann::json large = sound;  // as a sparse file makes it
+  large["managers"][0]["stores"][0]["held_bytes"] = (1ULL << 63U) - 1;
+  EXPECT_EQ(errorOf(large), "no error");
   EXPECT_EQ(errorOf(nlohmann::json::array()), "old.json: is not an object");
   EXPECT_EQ(errorOf({{"inspected_at", 1}}), "old.json: has no 'depth'");
 
@@ -116,9 +119,9 @@ TEST_F(Growing, OtherDocumentsAreRefusedWithThePlace) {
   EXPECT_EQ(changed("/managers/0/stores", "x"), "old.json: /managers/0/stores: is not an array");
   EXPECT_EQ(changed("/managers/0/stores/0", 1), "old.json: /managers/0/stores/0: is not an object");
   EXPECT_EQ(changed("/managers/0/stores/0/path", 1), "old.json: /managers/0/stores/0/path: is not a text");
-  for (const nlohmann::json& value : {nlohmann::json(-1), nlohmann::json(1.5), nlohmann::json((1ULL << 53U) + 1)}) {
+  for (const nlohmann::json& value : {nlohmann::json(-1), nlohmann::json(1.5), nlohmann::json(1ULL << 63U)}) {
     EXPECT_EQ(changed("/managers/0/stores/0/items", value),
-              "old.json: /managers/0/stores/0/items: is not a whole number from 0 to 9007199254740992");
+              "old.json: /managers/0/stores/0/items: is not a whole number from 0 to 9223372036854775807");
   }
 }
 

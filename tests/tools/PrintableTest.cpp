@@ -56,6 +56,8 @@ TEST(Printable, ChangesNothingTheSecondTime) { EXPECT_EQ(printable(kShown), kSho
 TEST(Printable, MakesDocumentsOfAscii) {
   const nlohmann::ordered_json document = {{kHostile, "\x7f"}};
   EXPECT_EQ(printable(document, -1), R"({"a\u001b[2Jb\u009b2Jc\nd\u202ee\ufffd":"\u007f"})");
+  const nlohmann::ordered_json texts = {{"paths", {"a\xff", "a\xfe", "caf\xc3\xa9"}}};
+  EXPECT_EQ(printable(texts, -1), R"({"paths":["a\\xff","a\\xfe","caf\u00e9"]})");
 }
 
 TEST(Printable, IsWhatTheConsoleAndTablesShow) {

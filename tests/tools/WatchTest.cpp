@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <csignal>
 #include <filesystem>
@@ -19,6 +20,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
 using test::StoredData;
+using testing::AllOf;
 using testing::ContainsRegex;
 using testing::HasSubstr;
 using testing::Not;
@@ -66,6 +68,18 @@ TEST_F(Watching, AllItemsOfANewStoreHaveCome) {
   (void)look();
   data_.putFile(kWeb + "/page", "p");
   EXPECT_THAT(look(), ContainsRegex("web_v1 +1 +1 +0 "));
+}
+
+TEST_F(Watching, AManifestThatIsRefusedForOneLookChangesNoCount) {
+  data_.putItem(kThumbs, "a", "one");
+  data_.putRecord(kThumbs, {"key", "file", 3, false, 1, 1, nullptr});
+  data_.putFile(kThumbs + "/file", "two");
+  (void)look();
+  const std::string log = data_.path(kThumbs) + "/manifest_v1.sqlite-journal";
+  ASSERT_EQ(::mkfifo(log.c_str(), 0600), 0);
+  EXPECT_THAT(look(), AllOf(ContainsRegex("thumbs_v1 +2 +0 +0 "), HasSubstr("1 part not readable")));
+  std::filesystem::remove(log);
+  EXPECT_THAT(look(), ContainsRegex("thumbs_v1 +2 +0 +0 "));
 }
 
 TEST_F(Watching, AManifestThatCannotBeReadChangesNoCount) {

@@ -17,11 +17,14 @@ namespace {
 
 using Align = Table::Align;
 
-// So much smaller than what can be counted that sums and differences can be counted, too.
+// So much smaller than what can be counted that sums and differences can be counted, too. A sparse file may claim more.
 constexpr std::uint64_t kMost = std::uint64_t{1} << 53U;
 
 PartFigures figuresIn(const JsonPlace& part, const char* items, const char* held) {
-  return {part.at(items).count(0, kMost), part.at(held).count(0, kMost), part.at("allocated_bytes").count(0, kMost)};
+  const auto countOf = [&](const char* name) {
+    return std::min(kMost, part.at(name).count(0, std::numeric_limits<std::int64_t>::max()));
+  };
+  return {countOf(items), countOf(held), countOf("allocated_bytes")};
 }
 
 bool isSame(const PartFigures& a, const PartFigures& b) {

@@ -4,6 +4,7 @@
 #include <algorithm>
 #include <ctime>
 #include <filesystem>
+#include <limits>
 #include <memory>
 #include <optional>
 #include <string>
@@ -12,6 +13,7 @@
 #include "FileUtils.h"
 #include "InputError.h"
 #include "JsonPlace.h"
+#include "NumberWithin.h"
 #include "Printable.h"
 #include "Progress.h"
 #include "TextFile.h"
@@ -72,9 +74,9 @@ void requireOutside(const std::string& root, const std::string& page) {
   std::error_code error;
   const fs::path outer = fs::canonical(root, error);
   if (error) return;
-  const fs::path inner = fs::weakly_canonical(page, error);
+  const fs::path inner = targetOf(page);
   const bool isInside = std::mismatch(outer.begin(), outer.end(), inner.begin(), inner.end()).first == outer.end();
-  if (!error && isInside) throw InputError("cannot write the page '" + page + "': it would be in ROOT");
+  if (isInside) throw InputError("cannot write the page '" + page + "': it would be in ROOT");
 }
 
 ConfiguredStores configuredBy(const InspectOptions& options) {
@@ -114,6 +116,7 @@ Growth growthUntil(const nlohmann::ordered_json& now, const std::string& since) 
 int runInspect(const InspectOptions& options) {
   const bool hasPage = !options.page.empty();
   if (hasPage) requireOutside(options.root, options.page);
+  requireOther(options.page, {options.configuration, options.since});
   Console console = Console::standardOutput();
   if (options.watch) return watch(options, console);
   const Survey result = survey(options, console);
@@ -148,6 +151,7 @@ void addInspectCommand(CLI::App& app, int& status) {
       ->type_name("CONFIG.json");
   inspect->add_option("--top", options->top, "How many of the largest items, and of the next to be evicted, are listed")
       ->type_name("N")
+      ->check(CLI::Range(0, std::numeric_limits<int>::max()).description(""))
       ->capture_default_str();
   CLI::Option* const json = inspect->add_flag("--json", options->json, "Print everything for machines");
   CLI::Option* const page =
@@ -161,7 +165,7 @@ void addInspectCommand(CLI::App& app, int& status) {
           ->excludes(json, page, since);
   inspect->add_option("--every", options->every, "How long to wait between two looks")
       ->type_name("SECONDS")
-      ->check(CLI::Range(0.1, 86400.0))
+      ->check(numberWithin(0.1, 86400))
       ->needs(watch)
       ->capture_default_str();
   inspect->footer(kFooter);

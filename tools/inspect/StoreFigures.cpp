@@ -184,6 +184,7 @@ void useKept(const StorePlace& place, const ConfiguredStore& configured, const s
     const std::string strangeness = strangenessOf(place.path + "/" + ManifestSnapshot::manifestName);
     if (!strangeness.empty()) {
       context.onUnreadable({place.path + "/" + ManifestSnapshot::manifestName, strangeness});
+      store.isUnread = true;
     }
     store.recordedBytes = keptSize(place.path);
     useFiles(values, context, store);
@@ -219,6 +220,7 @@ StoreSurvey surveyStore(const StorePlace& place, const ConfiguredStore& configur
     useKept(place, configured, values, context, store);
   } catch (const std::exception& error) {
     context.onUnreadable(unreadableBy(error, place.path));
+    store.isUnread = true;
     useFiles(values, context, store);
   }
   std::sort(store.keyHashes.begin(), store.keyHashes.end());

@@ -70,6 +70,7 @@ struct StoreSurvey {
   std::vector<Bucket> ages;
   std::vector<Bucket> sizes;
 
+  bool isUnread = false;               // its manifest could not be read: the items are its files
   std::string durability;              // by the configuration; else "checksums" when there are some, or empty
   std::uint64_t quarantinedFiles = 0;  // that a safe store could not use, in its own directory: not values
   std::uint64_t quarantinedBytes = 0;

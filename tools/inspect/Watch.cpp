@@ -74,7 +74,7 @@ void Watch::showManager(const ManagerSurvey& manager) {
 const Watch::Tally& Watch::tallyOf(const StoreSurvey& store) {
   const bool isNew = tallies_.count(store.path) == 0 && !isFirst_;
   Tally& tally = tallies_[store.path];
-  if (!store.damages.empty()) return tally;  // its files are not called as its items are
+  if (store.isUnread || !store.damages.empty()) return tally;  // its files are not called as its items are
   if (isNew) tally.keys.emplace();
   if (tally.keys) {
     tally.came += countWithout(store.keyHashes, *tally.keys);

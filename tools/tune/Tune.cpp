@@ -13,6 +13,7 @@
 #include "Console.h"
 #include "Format.h"
 #include "InputError.h"
+#include "NumberWithin.h"
 #include "Printable.h"
 #include "Progress.h"
 #include "PruneStrategy.h"
@@ -127,6 +128,14 @@ void write(const TuneReport& report, const TuneOptions& options, Console& consol
   } else {
     printTuning(report, console);
   }
+}
+
+void requireSeparateFiles(const TuneOptions& options) {
+  std::vector<std::string> others = options.merge;
+  others.insert(others.end(), {options.events, options.configuration});
+  requireOther(options.html, others);
+  others.push_back(options.html);
+  requireOther(options.svg, others);
 }
 
 void runTune(const TuneOptions& options) {
@@ -265,7 +274,7 @@ void addTuneCommand(CLI::App& app, int& status) {
       ->excludes(strategy);
   tune->add_option("--worth", options->worth,
                    "Percent of the requests that doubling a limit, or another strategy, has to turn into hits")
-      ->check(CLI::Range(0.001, 100.0).description(""))
+      ->check(numberWithin(0.001, 100))
       ->capture_default_str()
       ->type_name("PERCENT");
   tune->add_option("--unknown-size", options->unknownSize,
@@ -291,6 +300,7 @@ void addTuneCommand(CLI::App& app, int& status) {
       "  zcat trace.csv.gz | cellar tune - --csv --key lbn --size size --op op --store-op 2a");
   tune->callback([options, &status] {
     if (options->events.empty() && options->merge.empty()) throw CLI::RequiredError("EVENTS");
+    requireSeparateFiles(*options);
     options->merge.empty() ? runTune(*options) : runMerge(*options);
     status = 0;
   });
