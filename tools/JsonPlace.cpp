@@ -46,10 +46,11 @@ std::uint64_t JsonPlace::count(std::uint64_t least, std::uint64_t most) const {
   return value_.get<std::uint64_t>();
 }
 
-double JsonPlace::share() const {
+double JsonPlace::share(double least) const {
   const double share = value_.is_number() ? value_.get<double>() : 0;
-  if (share > 0 && share <= 1) return share;
-  fail("is not a share of more than 0 and at most 1");
+  if (share > 0 && share >= least && share <= 1) return share;
+  fail(least > 0 ? "is not a share from " + nlohmann::json(least).dump() + " to 1"
+                 : "is not a share of more than 0 and at most 1");
 }
 
 void JsonPlace::fail(const std::string& text) const {

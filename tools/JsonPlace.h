@@ -23,7 +23,7 @@ class JsonPlace {
   std::size_t members() const;  // of an object
   std::string text() const;
   std::uint64_t count(std::uint64_t least, std::uint64_t most) const;
-  double share() const;  // more than 0, at most 1
+  double share(double least = 0) const;  // more than 0, at least `least`, at most 1
 
   [[noreturn]] void fail(const std::string& text) const;
 

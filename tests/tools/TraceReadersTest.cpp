@@ -150,6 +150,15 @@ TEST_F(TraceReadersTest, ALineThatIsNoJsonIsCountedAndPassedOver) {
   EXPECT_EQ(trace.accesses(), 2U);
 }
 
+TEST_F(TraceReadersTest, ASizeThatNoItemHasIsCountedAndPassedOver) {
+  hit("s", "a", 4294967295);
+  for (const char* const size : {"4294967296", "576460752303423488", "9223372036854775807"}) {
+    lines << R"({"event":"qzpkvs_access","payload":{"store_name":"s","key":"b","hit":0,"size":)" << size << "}}\n";
+  }
+  EXPECT_EQ(readLines().damagedLines, 3U);
+  EXPECT_THAT(linesOf(trace), ElementsAre("fetch 0 4294967295"));
+}
+
 TEST_F(TraceReadersTest, ATableIsReadByTheNamesOfItsColumns) {
   readTable("bytes,when,lbn\r\n10,1,x\r\n20,2.5,\"y,\"\"z\"\n\n,61,x\n", [] {
     CsvColumns names = columns();
@@ -204,7 +213,7 @@ TEST_F(TraceReadersTest, WhatCannotBeReadIsNamedWithItsPlace) {
 TEST_F(TraceReadersTest, SizesThatCannotBeAddedUpAreRefused) {
   std::string table = "lbn,bytes\n";
   for (int i = 0; i < 1025; ++i) table += "a,1125899906842624\n";
-  EXPECT_EQ(refusalOf(table, columns()), "the sizes add up to more than can be counted");
+  EXPECT_EQ(refusalOf(table, columns()), ":1026: the sizes add up to more than can be counted");
 }
 
 TEST_F(TraceReadersTest, SizesThatAreFilledInAreAddedUpToo) {

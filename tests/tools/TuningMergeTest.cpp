@@ -204,7 +204,8 @@ TEST_F(MergingTunings, OtherDocumentsAreRefused) {
   EXPECT_EQ(errorWith("/limits/1/limit", 1), "/limits/1/limit: is not larger than the limit before it");
   EXPECT_EQ(errorWith("/limits/0/strategies/sieve", {}), "/limits/0/strategies: has a strategy that is not known");
   EXPECT_EQ(errorWith("/limits/1/strategies", nullptr), "/limits/1: has other strategies than the limit before it");
-  EXPECT_EQ(errorWith("/worth", 0), "/worth: is not a share of more than 0 and at most 1");
+  EXPECT_EQ(errorWith("/worth", 0), "/worth: is not a share from 1e-05 to 1");
+  EXPECT_EQ(errorWith("/worth", 1e-300), "/worth: is not a share from 1e-05 to 1");
   EXPECT_EQ(errorWith("/enough/limit", 3), "/enough/limit: is not one of the limits");
   EXPECT_EQ(errorWith("/store", 3), "/store: is not a text");
 }

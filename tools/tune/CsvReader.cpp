@@ -139,7 +139,7 @@ void readCsv(LineReader& lines, const CsvColumns& columns, Trace& trace, const s
     if (access.kind == AccessKind::Clear) {
       trace.appendClear(access.date);
     } else {
-      trace.append(row.text(layout.key), access);
+      lines.naming([&] { trace.append(row.text(layout.key), access); });
     }
   }
 }

@@ -1,5 +1,7 @@
 #include "tune/EventReader.h"
 
+#include <cstdint>
+#include <limits>
 #include <nlohmann/json.hpp>
 #include <optional>
 
@@ -16,6 +18,7 @@ using Json = nlohmann::json;
 constexpr const char* kAccessEvent = "qzpkvs_access";
 constexpr int kFound = 0;
 constexpr std::int64_t kMostSeconds = std::int64_t{1} << 50;
+constexpr std::int64_t kMostBytes = std::numeric_limits<std::uint32_t>::max();  // of an item of a store
 
 struct AccessEvent {
   std::string store;
@@ -80,10 +83,14 @@ EventCounts readEvents(LineReader& lines, const std::string& store, Trace& trace
     }
     const auto access = readAccess(event);
     if (!access) continue;
+    if (access->size > kMostBytes) {
+      ++counts.damagedLines;
+      continue;
+    }
     ++counts.accessesOfStores[access->store];
     if (!store.empty() && access->store != store) continue;
     const std::uint64_t keys = trace.keys();
-    append(*access, trace);
+    lines.naming([&] { append(*access, trace); });
     if (!access->isHit) continue;
     ++counts.hits;
     if (trace.keys() > keys) ++counts.firstHits;

@@ -5,6 +5,8 @@
 #include <memory>
 #include <string>
 
+#include "InputError.h"
+
 namespace velmora::mobile::xplat::cellar::tools {
 
 // The lines of a file, or of standard input when its name is "-".
@@ -26,6 +28,15 @@ class LineReader {
 
   // "trace.csv:12: " + text
   [[noreturn]] void fail(const std::string& text) const;
+
+  // What `use` throws of the line gets its place.
+  template <class Use> void naming(Use use) const {
+    try {
+      use();
+    } catch (const InputError& error) {
+      fail(error.what());
+    }
+  }
 
  private:
   struct CloseFile {

@@ -12,6 +12,7 @@ namespace velmora::mobile::xplat::cellar::tools {
 namespace {
 
 constexpr std::uint64_t kMost = std::uint64_t{1} << 62U;
+constexpr double kLeastWorth = 1e-5;  // as on the command line
 
 void checkFormat(const JsonPlace& root) {
   if (!root.has("format")) root.fail("is not a document of tune --json: it has no 'format'");
@@ -87,7 +88,7 @@ DeviceTuning readTuneDocument(const std::string& file) {
   Tuning& tuning = device.tuning;
   tuning.requests = root.at("requests").count(0, kMost);
   tuning.requestedBytes = root.at("requested_bytes").count(0, kMost);
-  tuning.worth = root.at("worth").share();
+  tuning.worth = root.at("worth").share(kLeastWorth);
   if (root.has("sample")) tuning.sample.rate = root.at("sample").at("rate").share();
   readLimits(root.at("limits"), tuning);
   markEnough(root, tuning);

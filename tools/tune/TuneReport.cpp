@@ -83,7 +83,7 @@ std::vector<std::string> notesOn(const TuneReport& report) {
                     " never found and have no known size: assumed to have " + bytes(tuning.assumedSize) + " each");
   }
   if (report.damagedLines > 0) {
-    notes.push_back(formatCount(report.damagedLines, "line is", "lines are") + " not JSON and not counted");
+    notes.push_back(formatCount(report.damagedLines, "line is", "lines are") + " damaged and not counted");
   }
   if (!report.missingStrategy.empty()) {
     notes.push_back("the present strategy \"" + report.missingStrategy + "\" cannot be simulated without metadata; \"" +
