@@ -1,6 +1,7 @@
 #include <glog/logging.h>
 
 #include <CLI/CLI.hpp>
+#include <csignal>
 #include <exception>
 #include <iostream>
 #include <string>
@@ -9,6 +10,7 @@
 #include "Console.h"
 #include "InputError.h"
 #include "Printable.h"
+#include "StopSignals.h"
 #include "Version.h"
 #include "check/Check.h"
 #include "demo/Demo.h"
@@ -103,6 +105,9 @@ int main(int argc, char** argv) {
     return std::cout.flush() ? status : report("cannot write to the standard output");
   } catch (const tools::InputError& error) {
     return report(error.what());
+  } catch (const tools::Interrupted& by) {
+    (void)std::raise(by.signal);  // to end as whoever sent it expects
+    return kFailed;
   } catch (const std::exception& error) {
     std::cerr << "cellar: " << tools::printable(std::string(error.what())) << std::endl;
     return kFailed;

@@ -1,13 +1,16 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <cstdint>
+#include <cstdlib>
 #include <filesystem>
 #include <string>
 #include <vector>
 
 #include <cellar/SQLiteManifestPersistence.h>
 
+#include "StopSignals.h"
 #include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
 #include "tools/StoredData.h"
@@ -280,6 +283,23 @@ TEST_F(Verifying, DoesNotCheckATableThatSomebodyElseHasMade) {
       "CREATE TABLE other (x, y AS (length(hex(zeroblob(x)))), CHECK (x > 0)); PRAGMA ignore_check_constraints = 1;"
       "INSERT INTO other VALUES (-1); INSERT INTO other VALUES (490000000)");
   EXPECT_THAT(findings(), ElementsAre("foreign part: the manifest has the table 'other', which no store uses"));
+}
+
+TEST_F(Verifying, LeavesNoCopyOfAManifestWhenItIsInterrupted) {
+  data_.putFile(kThumbs + "/stray", "x");
+  data_.makeStore(kThumbs);
+  const std::string temporary = data_.directory().file("temporary");
+  fs::create_directory(temporary);
+  ASSERT_EQ(::setenv("TMPDIR", temporary.c_str(), 1), 0);
+  bool hadCopy = false;
+  const auto interrupt = [&](std::uint64_t) {
+    hadCopy = !fs::is_empty(temporary);
+    throw Interrupted{SIGINT};
+  };
+  EXPECT_THROW(verify(findLayout(data_.root()), false, interrupt, [](const std::string&) {}), Interrupted);
+  EXPECT_EQ(::unsetenv("TMPDIR"), 0);
+  EXPECT_TRUE(hadCopy);
+  EXPECT_TRUE(fs::is_empty(temporary));
 }
 
 TEST_F(Verifying, FindsAManifestThatIsMissingOrNoFile) {

@@ -10,7 +10,7 @@
 #include <string>
 
 #include "Console.h"
-#include "inspect/StopSignals.h"
+#include "StopSignals.h"
 #include "inspect/Survey.h"
 #include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
@@ -113,6 +113,19 @@ TEST(StopSignals, EndAWaitAndAreNotLost) {
     EXPECT_TRUE(stop.comeWithin(3600));
     EXPECT_FALSE(stop.comeWithin(0));
   }
+}
+
+TEST(StopSignals, InterruptWhatLooksForThem) {
+  const StopSignals stop;
+  EXPECT_NO_THROW(stop.throwIfCome());
+  ASSERT_EQ(::raise(SIGTERM), 0);
+  try {
+    stop.throwIfCome();
+    FAIL() << "The signal was not seen.";
+  } catch (const Interrupted& by) {
+    EXPECT_EQ(by.signal, SIGTERM);
+  }
+  EXPECT_NO_THROW(stop.throwIfCome());
 }
 
 }  // namespace

@@ -16,9 +16,9 @@
 #include "NumberWithin.h"
 #include "Printable.h"
 #include "Progress.h"
+#include "StopSignals.h"
 #include "TextFile.h"
 #include "inspect/Growth.h"
-#include "inspect/StopSignals.h"
 #include "inspect/Survey.h"
 #include "inspect/SurveyJson.h"
 #include "inspect/SurveyText.h"
@@ -89,8 +89,12 @@ Survey survey(const InspectOptions& options, Console& console) {
   Progress progress(console, "looking at files");
   const std::uint64_t files = console.isTerminal() ? countFiles(layout.root) : 0;
   std::uint64_t seen = 0;
-  Survey result = makeSurvey(layout, configured, options.top, std::time(nullptr),
-                             [&](std::uint64_t /*bytes*/) { progress.advanceTo(++seen, files); });
+  const StopSignals stop;
+  const auto onFile = [&](std::uint64_t /*bytes*/) {
+    stop.throwIfCome();
+    progress.advanceTo(++seen, files);
+  };
+  Survey result = makeSurvey(layout, configured, options.top, std::time(nullptr), onFile);
   FileUtils fileUtils;
   result.fileSystemBytes = fileSystemSize(layout.root, fileUtils);
   return result;

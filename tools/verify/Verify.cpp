@@ -9,6 +9,7 @@
 #include "Format.h"
 #include "Printable.h"
 #include "Progress.h"
+#include "StopSignals.h"
 #include "host/RootLock.h"
 #include "storage/ConfiguredStores.h"
 #include "storage/Layout.h"
@@ -45,13 +46,16 @@ VerificationResult verifyOnConsole(const VerifyOptions& options, const Layout& l
   Progress progress(console, "looking at files");
   const std::uint64_t files = console.isTerminal() ? countFiles(layout.root) : 0;
   std::uint64_t seen = 0;
-  return verify(
-      layout, configured, options.repair, [&](std::uint64_t /*bytes*/) { progress.advanceTo(++seen, files); },
-      [&](const std::string& line) {
-        if (options.json) return;
-        if (console.isTerminal()) console.rewriteLine("");
-        console.raw(printable(line) + "\n");
-      });
+  const StopSignals stop;
+  const auto onFile = [&](std::uint64_t /*bytes*/) {
+    stop.throwIfCome();
+    progress.advanceTo(++seen, files);
+  };
+  return verify(layout, configured, options.repair, onFile, [&](const std::string& line) {
+    if (options.json) return;
+    if (console.isTerminal()) console.rewriteLine("");
+    console.raw(printable(line) + "\n");
+  });
 }
 
 void printVerdict(const VerifyOptions& options, const VerificationResult& result, Console& console) {
@@ -89,14 +93,14 @@ void addVerifyCommand(CLI::App& app, int& status) {
   verify->add_flag("--repair", options->repair, "Repair what is found, without losing a value");
   verify
       ->add_option("--config", options->configuration,
-                   "The configuration of the application: which stores have a manifest")
+                   "The configuration of the application: which stores have a manifest, and which are safe")
       ->type_name("CONFIG.json");
   verify->add_flag("--json", options->json, "Print everything for machines");
   verify->footer(
       "Each finding is one line: records without a file, files without a record, sizes that differ, values that do\n"
       "not have their checksum, traces of interrupted writes, damaged manifests, attributes that are not JSON,\n"
-      "triggers and views in a manifest, which no store runs, and manifests that are missing: where one of the\n"
-      "database's other files is left, or where --config says that the store has keys, and it has files.\n"
+      "triggers, views and further tables in a manifest, which no store uses, and manifests that are missing: where\n"
+      "one of the database's other files is left, or where --config says that the store has keys, and it has files.\n"
       "Without --repair nothing is changed.\n\n"
       "--repair gives a record the size of its file, and removes a record without a value. A file without a record\n"
       "is moved to \"_cellar_quarantine\" beside the managers' directories, and so is a damaged value, and a damaged\n"

@@ -1,4 +1,4 @@
-#include "inspect/StopSignals.h"
+#include "StopSignals.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -28,6 +28,12 @@ bool StopSignals::comeWithin(double seconds) const {
     if (sigtimedwait(&signals_, nullptr, &wait) > 0) return true;
     if (errno != EINTR) return false;
   }
+}
+
+void StopSignals::throwIfCome() const {
+  const timespec now{};
+  const int signal = sigtimedwait(&signals_, nullptr, &now);
+  if (signal > 0) throw Interrupted{signal};
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools
