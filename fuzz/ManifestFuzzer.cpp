@@ -163,7 +163,7 @@ void prune(Manifest& manifest, const Records& records, bool isSound) {
 
 bool isSound(const Manifest& manifest) {
   const std::string copy = manifest.path() + ".copy";
-  std::filesystem::copy_file(manifest.path(), copy);
+  copyFile(manifest.path(), copy);
   ManifestFile file(copy);
   return file.isSound();
 }

@@ -3,6 +3,7 @@
 #include <sqlite3.h>
 
 #include <algorithm>
+#include <fstream>
 
 #include "harness/Check.h"
 
@@ -102,6 +103,13 @@ bool ManifestFile::isSound() {
   const std::string sql =
       withoutSpaces(textOf("SELECT sql FROM sqlite_master WHERE name = 'LarderManifest'").value_or(""));
   return sql == withoutSpaces(kFirstVersionTable) || sql == withoutSpaces(kCurrentTable);
+}
+
+void copyFile(const std::string& from, const std::string& to) {
+  std::ifstream source(from, std::ios::binary);
+  std::ofstream copy(to, std::ios::binary);
+  if (source.peek() != std::ifstream::traits_type::eof()) copy << source.rdbuf();
+  check(copy.good(), "a file can be copied", from);
 }
 
 }  // namespace velmora::mobile::xplat::cellar::fuzz

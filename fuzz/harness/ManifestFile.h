@@ -14,6 +14,9 @@ namespace velmora::mobile::xplat::cellar::fuzz {
 extern const char* const kFirstVersionTable;
 extern const char* const kCurrentTable;
 
+// Piece by piece: as one system call, the fuzzer's own timer may interrupt it.
+void copyFile(const std::string& from, const std::string& to);
+
 // A database file, by a connection of the harness's own: it knows nothing of the classes under test, and answers for
 // any bytes at all. The connection is closed by the destructor.
 class ManifestFile {

@@ -98,7 +98,7 @@ void judge(const Scratch& scratch, StoreDirectory& store) {
       if (fs::exists(from, missing)) store.isSound = false;
       continue;
     }
-    fs::copy_file(from, copy / from.filename());
+    copyFile(from.string(), (copy / from.filename()).string());
   }
   const std::string path = (copy / kManifest).string();
   if (!fs::exists(path) || !store.isSound) return;
