@@ -30,7 +30,7 @@ std::vector<std::string> optionsFrom(std::uint8_t byte, const Scratch& scratch) 
                                                    "--locale=\u202e-\x07", "--session=alice",        "--session=../\n"};
   std::vector<std::string> options;
   for (std::size_t bit = 0; bit < choices.size(); ++bit) {
-    if (((byte >> bit) & 1U) != 0) options.push_back(choices[bit]);
+    if (((static_cast<unsigned>(byte) >> bit) & 1U) != 0) options.push_back(choices[bit]);
   }
   if ((byte & 128U) != 0) options.push_back("--root=" + scratch.path());
   return options;

@@ -20,7 +20,7 @@ const char* const kConfiguration =
     R"({"m": {"area": "caches", "stores": {"thumbs": {"type": "disk_cache", "lru_size_limit": "1KB"}}}})";
 
 std::vector<std::string> optionsFrom(std::uint8_t byte, const Scratch& scratch) {
-  const auto isSet = [byte](unsigned bit) { return ((byte >> bit) & 1U) != 0; };
+  const auto isSet = [byte](unsigned bit) { return ((static_cast<unsigned>(byte) >> bit) & 1U) != 0; };
   std::vector<std::string> options;
   if (isSet(0)) options.emplace_back("--store=thumbs");
   if (isSet(1)) options.emplace_back("--unknown-size=4294967295");

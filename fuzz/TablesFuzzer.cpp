@@ -23,7 +23,7 @@ std::vector<std::string> optionsFrom(ByteReader& input) {
       "--store=a\x1b[m",
   };
   const auto chosen = input.integer<std::uint16_t>();
-  const auto isChosen = [chosen](std::size_t bit) { return ((chosen >> bit) & 1U) != 0; };
+  const auto isChosen = [chosen](std::size_t bit) { return ((static_cast<unsigned>(chosen) >> bit) & 1U) != 0; };
   std::vector<std::string> options = {"--csv", "--key=k", "--size=s"};
   for (std::size_t bit = 0; bit < choices.size(); ++bit) {
     if (isChosen(bit)) options.push_back(choices[bit]);

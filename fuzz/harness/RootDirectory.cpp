@@ -197,7 +197,7 @@ class Builder {
 
   void addRecord(const std::string& directory, Durability durability, int number) {
     const std::uint8_t flags = input_.byte();
-    const auto isSet = [flags](unsigned bit) { return ((flags >> bit) & 1U) != 0; };
+    const auto isSet = [flags](unsigned bit) { return ((static_cast<unsigned>(flags) >> bit) & 1U) != 0; };
     const std::string key = input_.text().substr(0, kLongestKey);
     const std::string value = input_.text();
     DiskCacheItem item(key, key, static_cast<std::uint32_t>(value.size()), isSet(0), number, number, nullptr);
