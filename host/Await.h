@@ -52,4 +52,9 @@ template <class T> [[nodiscard]] T await(Future<T> future, std::chrono::millisec
   return value.get();
 }
 
+template <class T, class Rep, class Period>
+[[nodiscard]] T await(Future<T> future, std::chrono::duration<Rep, Period> timeout) {
+  return await(std::move(future), detail::inMilliseconds(timeout));
+}
+
 }  // namespace velmora::mobile::xplat::cellar::host

@@ -87,7 +87,16 @@ template <class T> class Awaiter {
     Resumption(const Resumption&) = delete;
     Resumption& operator=(const Resumption&) = delete;
     ~Resumption() {
-      if (coroutine_ != nullptr) mayDestroy_ ? coroutine_.destroy() : coroutine_.resume();
+      if (coroutine_ == nullptr) return;
+      if (mayDestroy_) {
+        coroutine_.destroy();
+        return;
+      }
+      try {
+        coroutine_.resume();
+      } catch (...) {
+        logException("A coroutine that was dropped has thrown: ");
+      }
     }
 
     void run() {

@@ -37,6 +37,14 @@ namespace velmora::mobile::xplat::cellar::host {
 
 namespace {
 
+// Longer ones do not fit into the nanoseconds that clocks count.
+constexpr std::chrono::seconds kLongestPatience = std::chrono::hours(24 * 365 * 100);
+constexpr long kLongestDelay = 2'000'000'000;  // seconds
+
+std::chrono::seconds within(std::chrono::seconds duration, std::chrono::seconds longest) {
+  return std::clamp(duration, std::chrono::seconds::zero(), longest);
+}
+
 std::vector<std::string> namesOfManagers(const std::string& configuration) {
   std::vector<std::string> names;
   for (const Outline& manager : outlineOf(configuration).members) names.push_back(manager.name);
@@ -120,7 +128,7 @@ Host::Host(HostOptions options)
       tagsTellKeys_(!options.sessionTagMapper),
       sessionTagMapper_(options.sessionTagMapper ? options.sessionTagMapper : nameOfSession),
       runMaintenance_(options.runMaintenance),
-      shutDownPatience_(options.shutDownPatience),
+      shutDownPatience_(within(options.shutDownPatience, kLongestPatience)),
       analytics_(reporterFor(std::move(options.analytics))),
       threads_(options.taskQueueFactory ? nullptr : std::make_shared<ThreadQueueFactory>()),
       taskQueueFactory_(threads_ ? threads_ : options.taskQueueFactory),
@@ -129,7 +137,8 @@ Host::Host(HostOptions options)
       attributes_(std::make_shared<AttributeStore>(fileUtils_)),
       measuredSizes_(std::make_shared<MeasuredSizes>(fileUtils_, attributes_, analytics_)),
       sizes_(measuredSizes_),
-      lazyWork_(LazyDispatcher::createLazyDispatcher(taskQueueFactory_, options.lazyDelaySeconds)),
+      lazyWork_(
+          LazyDispatcher::createLazyDispatcher(taskQueueFactory_, std::min(options.lazyDelaySeconds, kLongestDelay))),
       measuringQueue_(taskQueueFactory_->createWorkQueue()),
       incidentGate_(gateFor(std::move(options.onIncident))),
       incidents_(reporterThrough(incidentGate_, *taskQueueFactory_)),

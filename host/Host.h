@@ -67,10 +67,11 @@ struct HostOptions {
 
   std::unique_ptr<XAnalytics> analytics;  // null: nothing is reported
 
-  // Seconds until unused stores are created, and directories measured, in the background.
+  // Seconds until unused stores are created, and directories measured, in the background. More than 2,000,000,000 (63
+  // years) count as that.
   long lazyDelaySeconds = 10;
   bool runMaintenance = true;  // whether managers remove stale data and prune stores that are over their limits
-  std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for accepted work
+  std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for accepted work; 100 years at most
 
   // With `Promptly` a manager prunes `pruneDelay` after a limit has been exceeded by more than a tenth, if it still is:
   // its own limit or that of a disk cache, the configured one. It then prunes each disk cache that is over its own
@@ -116,8 +117,9 @@ struct HostOptions {
   // manager, and of a store that could not be created, when the request to the host is over; of a store's values, and
   // of the trash, perhaps within an operation of a store, so it must not use stores then.
   //
-  // What is reported before the host is destroyed is handed over before the destructor returns, unless the queues came
-  // with the options: what still waits there is dropped. The destructor waits for a call that is under way for
+  // What is reported before the host is destroyed is handed over before the destructor returns. What still waits is
+  // dropped if the queues came with the options, the patience has been used up, or the destructor runs on a thread of
+  // the host's own queues. The destructor waits for a call that is under way for
   // `shutDownPatience` at most, and not for one that it runs in. No call begins after it has returned.
   std::function<void(const Incident& incident)> onIncident;
 };
@@ -168,7 +170,9 @@ enum class TrashSize { Skipped, Measured };
 // and stores that are still held do no more work: their futures are broken promises.
 //
 // The destructor does not wait for queues that came with the options: let them finish before another host uses the
-// root. The destructor may run on one of the host's own queues; it does not wait then.
+// root. The destructor may run on one of the host's own queues, where it cannot wait: it ends as if its patience had
+// been used up. Writes that have yet to go to another queue fail, and the root is free for another host while tasks
+// that have begun still run. Keep the last reference elsewhere if the stores have data that cannot be fetched again.
 class CELLAR_EXPORT Host : public session::Invalidatable {
  public:
   // Throws what `Configuration` throws, and `ConfigurationException` when two managers of one area are both session

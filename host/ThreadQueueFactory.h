@@ -10,6 +10,20 @@
 
 namespace velmora::mobile::xplat::cellar::host {
 
+namespace detail {
+
+// Rounded up. What is beyond a hundred years becomes that, whatever the unit: it would be beyond the milliseconds'
+// range.
+template <class Rep, class Period>
+std::chrono::milliseconds inMilliseconds(std::chrono::duration<Rep, Period> duration) {
+  constexpr std::chrono::hours longest(24 * 365 * 100);
+  if (duration >= longest) return longest;
+  if (duration <= std::chrono::hours::zero()) return std::chrono::milliseconds::zero();
+  return std::chrono::ceil<std::chrono::milliseconds>(duration);
+}
+
+}  // namespace detail
+
 // Serial queues on a few threads, for applications that have no queues of their own. However many queues there are, the
 // threads are one for each processor that the creating thread may use, named "cellar-1", "cellar-2" and so on, one more
 // because tasks wait for the disk, and one for all timers ("cellar-timer"). Any thread may call, and a queue may be
@@ -68,6 +82,9 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   // than `patience`. Armed timers do not count. Says nothing about what other threads dispatch during the call. Called
   // from a task of these queues it would deadlock, so it returns false at once.
   bool drain(std::chrono::milliseconds patience);
+  template <class Rep, class Period> bool drain(std::chrono::duration<Rep, Period> patience) {
+    return drain(detail::inMilliseconds(patience));
+  }
 
   // From now on tasks that other threads dispatch are destroyed without running, on those threads, and timers are
   // dropped; tasks that were dispatched before run, and so do those that they dispatch. So `drain` ends, however busy

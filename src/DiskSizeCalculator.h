@@ -19,8 +19,8 @@ class FileUtils;
 // large file met on the way, can be reported to analytics. Links are neither counted nor followed; sockets, devices and
 // the like are not counted.
 //
-// Any thread may call; measurements run on the caller's thread and hold no lock. What is registered or excluded
-// meanwhile counts from the next measurement on. Two measurements of one tree at once are not kept apart: both write
+// Any thread may call; measurements run on the caller's thread and hold no lock. What is excluded meanwhile
+// counts from the next measurement on. Two measurements of one tree at once are not kept apart: both write
 // the same results.
 //
 // The result of a directory replaces whatever else its attributes held, the mark for trashing at start-up among them.
@@ -63,8 +63,8 @@ class CELLAR_EXPORT DiskSizeCalculator {
   // Leaves out every directory and file of that name (the last path component), at every depth.
   virtual void exclude(const std::string& name);
 
-  // Measures the registered directories, in no particular order, and forgets them: register again before the next
-  // start.
+  // Measures the registered directories, in no particular order, and forgets them, with what was registered meanwhile:
+  // register again before the next start.
   virtual void startDiskSizeCalculation();
 
   // The figures of one tree: the kept result while it is fresh, else measured now. A failure anywhere in the tree is

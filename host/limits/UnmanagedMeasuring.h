@@ -29,9 +29,9 @@ namespace host {
 // timer runs, and never for stores that are no caches or have no limit.
 //
 // The size is kept with the directory when it has changed, for the next time that the cache is opened, but not in place
-// of the mark for trashing at start-up. All directories of the cache are walked each time. Measurements run on the
-// queue, one at a time; before the next one of a cache passes at least a hundred times what the last one has taken. Any
-// thread may call.
+// of the mark for trashing at start-up, if that is not set in the same moment. All directories of the cache are walked
+// each time. Measurements run on the queue, one at a time; before the next one of a cache passes at least a hundred
+// times what the last one has taken. Any thread may call.
 class UnmanagedMeasuring : public std::enable_shared_from_this<UnmanagedMeasuring> {
  public:
   using Now = std::chrono::steady_clock::time_point (*)();

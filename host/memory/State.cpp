@@ -25,7 +25,13 @@ class MemoryTier::State::Clear {
   explicit Clear(std::shared_ptr<State> state) : state_(std::move(state)) {}
   Clear(const Clear&) = delete;
   Clear& operator=(const Clear&) = delete;
-  ~Clear() { end(std::make_exception_ptr(std::future_error(std::future_errc::broken_promise))); }
+  ~Clear() {
+    try {
+      end(std::make_exception_ptr(std::future_error(std::future_errc::broken_promise)));
+    } catch (...) {
+      LOG(ERROR) << "A callback of a clear has thrown: " << currentText();
+    }
+  }
 
   Future<void> future() { return promise_.getFuture(); }
 

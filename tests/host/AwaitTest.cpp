@@ -148,6 +148,8 @@ TEST(Await, ATimeoutThatIsNotReachedChangesNothing) {
   for (const milliseconds timeout : {milliseconds(std::chrono::hours(24 * 365)), milliseconds::max()}) {
     EXPECT_EQ(await(dispatchTask<int>(queue, [] { return 42; }), timeout), 42);
   }
+  EXPECT_EQ(await(dispatchTask<int>(queue, [] { return 42; }), std::chrono::seconds::max()), 42);
+  EXPECT_EQ(await(dispatchTask<int>(queue, [] { return 42; }), std::chrono::hours::max()), 42);
   EXPECT_NO_THROW(static_cast<void>(await(dispatchTask<void>(queue, [] {}), std::chrono::minutes(10))));
   EXPECT_THROW(static_cast<void>(await(dispatchTask<void>(queue, [] { throw std::out_of_range("far away"); }),
                                        std::chrono::minutes(10))),

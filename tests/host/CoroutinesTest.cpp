@@ -363,6 +363,36 @@ TEST_F(Coroutines, OfAnotherTypeFindABrokenPromiseWhenTheirResumptionIsDropped) 
   EXPECT_EQ(result, 0);
 }
 
+// One whose failure leaves whoever resumes it.
+struct Throwing {
+  struct promise_type {
+    Throwing get_return_object() { return Throwing(std::coroutine_handle<promise_type>::from_promise(*this)); }
+    std::suspend_never initial_suspend() noexcept { return {}; }
+    std::suspend_always final_suspend() noexcept { return {}; }
+    void return_void() {}
+    void unhandled_exception() { throw; }
+  };
+
+  explicit Throwing(std::coroutine_handle<promise_type> handle) : coroutine(handle) {}
+  Throwing(const Throwing&) = delete;
+  Throwing& operator=(const Throwing&) = delete;
+  ~Throwing() { coroutine.destroy(); }
+
+  const std::coroutine_handle<promise_type> coroutine;
+};
+
+Throwing waitOn(std::shared_ptr<AsyncExecutor> executor, Future<int> from) { (void)co_await resumeOn(from, executor); }
+
+TEST_F(Coroutines, WhatADroppedOneOfAnotherTypeThrowsIsOneErrorLine) {
+  Promise<int> promise;
+  const Throwing waiting = waitOn(queue_, promise.getFuture());
+  promise.setValue(4);
+  const test::LogCapture log;
+  queue_->dropAll();
+  ASSERT_EQ(log.messages().size(), 1U);
+  EXPECT_EQ(log.messages().front().rfind("A coroutine that was dropped has thrown: ", 0), 0U);
+}
+
 // --- Stores and threads ---
 
 using CoroutinesOfAStore = test::KeyValueStoreFixture;

@@ -11,6 +11,7 @@
 #include <fstream>
 #include <functional>
 #include <future>
+#include <limits>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -1141,6 +1142,34 @@ TEST_F(HostTest, DestroyingTheHostFinishesWhatIsQueuedAndWhatThatQueues) {
   }
   host.reset();
   EXPECT_EQ(ran, 100);
+}
+
+TEST_F(HostTest, ThePatienceMayHaveAnyLength) {
+  const Watchdog watchdog(kLongEnough);
+  const LogCapture log;
+  HostOptions patient = options();
+  patient.shutDownPatience = std::chrono::seconds::max();
+  patient.lazyDelaySeconds = std::numeric_limits<long>::max();
+  auto host = std::make_unique<Host>(std::move(patient));
+  host->manager("media");
+  const auto file = host->queues()->createQueue();
+  const auto work = host->queues()->createWorkQueue();
+  Latch begun(1);
+  std::atomic<int> ran{0};
+  work->dispatch([&] {
+    begun.wait();
+    file->dispatch([&] { ++ran; });
+  });
+  std::thread ending([&] { host.reset(); });
+  const auto isRefused = [&] {
+    return errorOf<std::future_error>([&] { dispatchTask<void>(file, [] {}).get(); }) != "no error";
+  };
+  while (!isRefused()) std::this_thread::yield();
+  begun.countDown();
+  ending.join();
+  EXPECT_EQ(ran, 1);
+  EXPECT_TRUE(log.messages().empty());
+  EXPECT_EQ(directory.names("caches/_sessionlessStore"), std::vector<std::string>{"tmp"});  // the lazy work was not due
 }
 
 TEST_F(HostTest, DestroyingTheHostRefusesNewWorkAndFinishesWhatItHadAccepted) {

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "host/MemoryTierFixture.h"
+#include "support/LogCapture.h"
 
 namespace velmora::mobile::xplat::cellar {
 namespace {
@@ -132,6 +133,17 @@ TEST_F(MemoryTierInterleaving, AClearThatTheQueueRefusesFails) {
   const Written cleared = watch(tier->clear());
   EXPECT_EQ(told(cleared), "<error> Store 'store', " + store->path + ": The queue takes no tasks.");
   work().throwOnDispatch(false);
+  keep("a", "value");
+  EXPECT_EQ(inMemory("a"), "value");
+}
+
+TEST_F(MemoryTierInterleaving, WhatACallbackOfADroppedClearThrowsIsOneErrorLine) {
+  openTier();
+  tier->clear().then(nullptr, [](std::future<void>& cleared) { cleared.get(); });
+  const test::LogCapture log;
+  work().dropAll();
+  ASSERT_EQ(log.messages().size(), 1U);
+  EXPECT_EQ(log.messages().front().rfind("A callback of a clear has thrown: ", 0), 0U) << log.messages().front();
   keep("a", "value");
   EXPECT_EQ(inMemory("a"), "value");
 }

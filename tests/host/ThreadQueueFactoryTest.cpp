@@ -911,6 +911,7 @@ TEST_F(ThreadQueueFactoryTest, DrainGivesUpWhenItsPatienceIsOver) {
   EXPECT_FALSE(factory->drain(std::chrono::milliseconds(2)));
   gate->countDown();
   EXPECT_TRUE(factory->drain(std::chrono::milliseconds::max()));
+  EXPECT_TRUE(factory->drain(std::chrono::seconds::max()));
 }
 
 TEST_F(ThreadQueueFactoryTest, DrainWaitsUntilTheLastTaskIsGoneNotOnlyRun) {
