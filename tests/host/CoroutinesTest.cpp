@@ -374,11 +374,13 @@ struct Throwing {
   };
 
   explicit Throwing(std::coroutine_handle<promise_type> handle) : coroutine(handle) {}
-  Throwing(const Throwing&) = delete;
-  Throwing& operator=(const Throwing&) = delete;
-  ~Throwing() { coroutine.destroy(); }
+  Throwing(Throwing&& other) noexcept : coroutine(std::exchange(other.coroutine, nullptr)) {}
+  Throwing& operator=(Throwing&&) = delete;
+  ~Throwing() {
+    if (coroutine != nullptr) coroutine.destroy();
+  }
 
-  const std::coroutine_handle<promise_type> coroutine;
+  std::coroutine_handle<promise_type> coroutine;
 };
 
 Throwing waitOn(std::shared_ptr<AsyncExecutor> executor, Future<int> from) { (void)co_await resumeOn(from, executor); }
