@@ -52,6 +52,7 @@ template <class T> [[nodiscard]] T await(Future<T> future, std::chrono::millisec
   return value.get();
 }
 
+// The same, in any unit; rounded up to milliseconds.
 template <class T, class Rep, class Period>
 [[nodiscard]] T await(Future<T> future, std::chrono::duration<Rep, Period> timeout) {
   return await(std::move(future), detail::inMilliseconds(timeout));

@@ -118,6 +118,8 @@ std::vector<std::string> foreignPartsOf(SQLiteStore& store) {
   return parts;
 }
 
+bool isTable(const std::string& foreignPart) { return foreignPart.rfind("table ", 0) == 0; }
+
 // What SQLite says names the file, which is the copy: nobody else knows that.
 std::string withoutPath(std::string text, const std::string& path) {
   const std::string place = " (" + path + ")";
@@ -187,9 +189,10 @@ std::vector<std::string> ManifestSnapshot::integrityErrors() const {
     SQLiteStore store(path_);
     throwIfTableCallsFunctions(store, "LarderManifest");
     // The checks and generated columns of a foreign table may call any function.
-    const bool isForeign = !foreignPartsOf(store).empty();
+    const auto parts = foreignPartsOf(store);
+    const bool hasForeignTable = std::any_of(parts.begin(), parts.end(), isTable);
     SQLiteStoreCursor cursor =
-        store.cursor(isForeign ? "PRAGMA integrity_check(LarderManifest);" : "PRAGMA integrity_check;");
+        store.cursor(hasForeignTable ? "PRAGMA integrity_check(LarderManifest);" : "PRAGMA integrity_check;");
     while (cursor.next()) lines.push_back(cursor.get<std::string>(0));
     if (lines == std::vector<std::string>{"ok"}) lines.clear();
   } catch (const SQLiteStoreCorruptedException& error) {

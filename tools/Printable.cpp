@@ -77,32 +77,8 @@ Character characterAt(const std::string& text, std::size_t place) {
   return {value, length};
 }
 
-// So that two texts that differ in such a byte are not the same afterwards.
-std::string withStrangeBytesShown(const std::string& text) {
-  std::string result;
-  for (std::size_t place = 0; place < text.size();) {
-    const Character character = characterAt(text, place);
-    if (character.length == 0) {
-      result += "\\x" + hexadecimal(character.value, 2);
-    } else {
-      result.append(text, place, character.length);
-    }
-    place += std::max<std::size_t>(1, character.length);
-  }
-  return result;
-}
-
-void showStrangeBytes(nlohmann::ordered_json& value) {
-  if (value.is_string()) {
-    value = withStrangeBytesShown(value.get_ref<const std::string&>());
-  } else if (value.is_structured()) {
-    for (auto& part : value) showStrangeBytes(part);
-  }
-}
-
-}  // namespace
-
-std::string printable(const std::string& text) {
+// With the characters that `isEscaped`, and bytes that are not UTF-8, shown by their numbers.
+std::string escapedIf(bool (*isEscaped)(char32_t), const std::string& text) {
   std::string result;
   for (std::size_t place = 0; place < text.size();) {
     const Character character = characterAt(text, place);
@@ -118,10 +94,24 @@ std::string printable(const std::string& text) {
   return result;
 }
 
-std::string printable(const nlohmann::ordered_json& document, int indentation) {
-  nlohmann::ordered_json readable = document;
-  showStrangeBytes(readable);
-  return readable.dump(indentation, ' ', true, nlohmann::ordered_json::error_handler_t::replace);
+bool isNever(char32_t /*character*/) { return false; }
+
+// JSON has its own way to show the characters.
+void showStrangeBytes(nlohmann::ordered_json& value) {
+  if (value.is_string()) {
+    value = escapedIf(isNever, value.get_ref<const std::string&>());
+  } else if (value.is_structured()) {
+    for (auto& part : value) showStrangeBytes(part);
+  }
+}
+
+}  // namespace
+
+std::string printable(const std::string& text) { return escapedIf(isEscaped, text); }
+
+std::string printable(nlohmann::ordered_json document, int indentation) {
+  showStrangeBytes(document);
+  return document.dump(indentation, ' ', true, nlohmann::ordered_json::error_handler_t::replace);
 }
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -11,7 +11,8 @@ namespace velmora::mobile::xplat::cellar::tools {
 std::string printable(const std::string& text);
 
 // The document for standard output or a page, all in ASCII, so that it cannot control a terminal either. Bytes that are
-// not UTF-8 become "\xff" in its texts, and U+FFFD in its names. `indentation` is -1 for a document in one line.
-std::string printable(const nlohmann::ordered_json& document, int indentation);
+// not UTF-8 are shown as "\xff" in its values, so that two paths that differ remain different, and as U+FFFD in its
+// names. `indentation` is -1 for a document in one line.
+std::string printable(nlohmann::ordered_json document, int indentation);
 
 }  // namespace velmora::mobile::xplat::cellar::tools

@@ -4,7 +4,7 @@
 
 namespace velmora::mobile::xplat::cellar::tools {
 
-// Thrown for a signal that has come. It is not an exception that could be taken for a fault of what is looked at.
+// Thrown when a signal has come. Not a `std::exception`: those are reported as faults of the files that are read.
 struct Interrupted {
   int signal;
 };

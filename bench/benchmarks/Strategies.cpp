@@ -154,7 +154,7 @@ void measureStrategies(const Context& context) {
   const Place& place = context.places.front();
   const std::size_t items = context.scaled<std::size_t>(2'000, 500);
   const std::size_t fetches = context.scaled<std::size_t>(4'000, 1'000);
-  const int rounds = context.scaled(21, 3);  // a few hundredths are to be seen
+  const int rounds = context.scaled(21, 3);  // enough to see a difference of a few hundredths
   const auto add = [&](const std::string& what, const Measure& measure) {
     const Figures figures = compared(place, rounds, sizeOfAll(items, mixedSize), measure);
     context.report.add(Row{what, place.name, cpuName(false), "us", figures, {{"lru", 1.05}}});

@@ -13,7 +13,7 @@
 
 using namespace velmora::mobile::xplat::cellar;  // NOLINT: an example may
 
-// "/work/max_size, line 1, column 23"
+// "/papers/max_size, line 1, column 25"
 std::string faultOf(const std::string& configuration, const std::string& directory) {
   try {
     const host::Host host(configuration, directory);
@@ -45,12 +45,12 @@ std::string culpritOf(host::Host& host) {
 
 int main(int argc, char** argv) {
   if (argc != 2) return EXIT_FAILURE;
-  const std::string fault = faultOf(R"({"work": {"max_size": "20mb"}})", argv[1]);
-  host::Host host(R"({"work": {"area": "documents", "stores": {"drafts": {"type": "pkvs", "has_version": true}}}})",
+  const std::string fault = faultOf(R"({"papers": {"max_size": "20mb"}})", argv[1]);
+  host::Host host(R"({"papers": {"area": "documents", "stores": {"drafts": {"type": "pkvs", "has_version": true}}}})",
                   argv[1]);
   const std::string culprit = culpritOf(host);
   std::cout << fault << '\n' << culprit << '\n';
-  const bool isRight =
-      fault == "/work/max_size, line 1, column 23" && culprit == "manifest_v1.sqlite in drafts_v1 can never be stored";
+  const bool isRight = fault == "/papers/max_size, line 1, column 25" &&
+                       culprit == "manifest_v1.sqlite in drafts_v1 can never be stored";
   return isRight ? EXIT_SUCCESS : EXIT_FAILURE;
 }

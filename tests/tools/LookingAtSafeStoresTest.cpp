@@ -246,6 +246,14 @@ TEST_F(LookingAtASafeStore, KeepsAFileThatItsRecordNamesInAnotherWay) {
   }
 }
 
+TEST_F(LookingAtASafeStore, FindsALinkToAValueThatNoRecordNames) {
+  open();
+  put("a", "1");
+  close();
+  fs::create_symlink(onlyFile(), pathOf("link"));
+  EXPECT_THAT(findings(), ElementsAre("file without record: 'link' (0 bytes)"));
+}
+
 TEST_F(LookingAtASafeStore, KeepsFilesWhoseKeyHasNoOtherValue) {
   open();
   put("a", "1");

@@ -206,6 +206,7 @@ TEST_F(MergingTunings, OtherDocumentsAreRefused) {
   EXPECT_EQ(errorWith("/limits/1/strategies", nullptr), "/limits/1: has other strategies than the limit before it");
   EXPECT_EQ(errorWith("/worth", 0), "/worth: is not a share from 1e-05 to 1");
   EXPECT_EQ(errorWith("/worth", 1e-300), "/worth: is not a share from 1e-05 to 1");
+  EXPECT_EQ(errorWith("/worth", 1e-5), "no error");
   EXPECT_EQ(errorWith("/enough/limit", 3), "/enough/limit: is not one of the limits");
   EXPECT_EQ(errorWith("/store", 3), "/store: is not a text");
 }

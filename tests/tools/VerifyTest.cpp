@@ -249,6 +249,17 @@ TEST_F(Verifying, OfAManagerOrStoreUsesTheQuarantineBesideTheManagers) {
   EXPECT_THAT(data_.directory().names("root/" + kQuarantined), ElementsAre("another", "stray"));
 }
 
+TEST_F(Verifying, HasRoomInTheQuarantineForEachFileOfTheLongestName) {
+  const std::string longest(255, 'n');
+  data_.makeStore(kThumbs);
+  for (const std::string content : {"first", "second"}) {
+    data_.putFile(kThumbs + "/" + longest, content);
+    EXPECT_THAT(repairs(), ElementsAre(testing::Not(testing::HasSubstr("NOT REPAIRED"))));
+  }
+  EXPECT_EQ(contentOf(kQuarantined + "/" + longest), "first");
+  EXPECT_EQ(contentOf(kQuarantined + "/" + longest.substr(2) + ".1"), "second");
+}
+
 TEST_F(Verifying, OfAStoreThatStandsByItselfUsesAQuarantineBesideIt) {
   data_.makeStore("pulled/thumbs_v1");
   data_.putFile("pulled/thumbs_v1/stray", "x");

@@ -82,6 +82,19 @@ TEST_F(Watching, AManifestThatIsRefusedForOneLookChangesNoCount) {
   EXPECT_THAT(look(), ContainsRegex("thumbs_v1 +2 +0 +0 "));
 }
 
+TEST_F(Watching, SomethingElseInPlaceOfTheManifestChangesNoCount) {
+  data_.putItem(kThumbs, "a", "one");
+  (void)look();
+  const std::string manifest = data_.path(kThumbs) + "/manifest_v1.sqlite";
+  const std::string kept = data_.directory().file("kept");
+  std::filesystem::rename(manifest, kept);
+  ASSERT_EQ(::mkfifo(manifest.c_str(), 0600), 0);
+  EXPECT_THAT(look(), AllOf(ContainsRegex("thumbs_v1 +[0-9]+ +0 +0 "), HasSubstr("1 part not readable")));
+  std::filesystem::remove(manifest);
+  std::filesystem::rename(kept, manifest);
+  EXPECT_THAT(look(), ContainsRegex("thumbs_v1 +1 +0 +0 "));
+}
+
 TEST_F(Watching, AManifestThatCannotBeReadChangesNoCount) {
   data_.putItem(kThumbs, "a", "one");
   const std::string manifest = data_.path(kThumbs) + "/manifest_v1.sqlite";

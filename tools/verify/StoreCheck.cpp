@@ -45,10 +45,11 @@ std::optional<std::uint64_t> sizeOfValue(const std::string& directory, const std
 
 using FileId = std::pair<dev_t, ino_t>;
 
-// Of what a store reads there, links followed; zeros if there is nothing, which no file has.
-FileId idOf(const std::string& path) {
+using Look = int (*)(const char* path, struct stat* status);  // `stat`, which follows links, or `lstat`
+
+std::optional<FileId> idOf(const std::string& path, Look look) {
   struct stat status = {};
-  return ::stat(path.c_str(), &status) == 0 ? FileId{status.st_dev, status.st_ino} : FileId{};
+  return look(path.c_str(), &status) == 0 ? std::make_optional<FileId>(status.st_dev, status.st_ino) : std::nullopt;
 }
 
 // A damaged manifest cannot always tell that it is a safe store's, but what lies beside it can. So may what cannot be
@@ -196,12 +197,18 @@ class StoreCheck {
     if (quarantine.files > 0) findings_.push_back(std::move(quarantine));
   }
 
-  // Whether a record leads there all the same, through a link for example.
+  // Whether it is the file that a record names in another way, through a link for example. A second name of a value's
+  // file, which has no bytes of its own, is taken for one as well.
   bool isValueByAnotherName(const std::string& below) {
-    if (valueIds_.empty()) {
-      for (const std::string& file : valueFiles_) valueIds_.insert(idOf(directory_ + "/" + file));
+    if (valueIds_.empty()) noteValueIds();
+    const auto id = idOf(directory_ + "/" + below, ::lstat);
+    return id && valueIds_.count(*id) > 0;
+  }
+
+  void noteValueIds() {
+    for (const std::string& file : valueFiles_) {
+      if (const auto id = idOf(directory_ + "/" + file, ::stat)) valueIds_.insert(*id);
     }
-    return valueIds_.count(idOf(directory_ + "/" + below)) > 0;
   }
 
   // Whether a safe store has left it: unfinished, or as the file of a key whose value is another one or will be this.
