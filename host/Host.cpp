@@ -7,6 +7,8 @@
 #include <exception>
 #include <mutex>
 #include <stdexcept>
+#include <system_error>
+#include <thread>
 #include <utility>
 
 #include "AnalyticsEventReporter.h"
@@ -38,12 +40,8 @@ namespace velmora::mobile::xplat::cellar::host {
 namespace {
 
 // Longer ones do not fit into the nanoseconds that clocks count.
-constexpr std::chrono::seconds kLongestPatience = std::chrono::hours(24 * 365 * 100);
+constexpr std::chrono::hours kLongestPatience(24 * 365 * 100);
 constexpr long kLongestDelay = 2'000'000'000;  // seconds
-
-std::chrono::seconds within(std::chrono::seconds duration, std::chrono::seconds longest) {
-  return std::clamp(duration, std::chrono::seconds::zero(), longest);
-}
 
 std::vector<std::string> namesOfManagers(const std::string& configuration) {
   std::vector<std::string> names;
@@ -78,11 +76,11 @@ class BuildError : public StoreError {
   }
 }
 
-std::unique_ptr<const RootLock> lockRoot(const HostOptions& options, FileUtils& fileUtils) {
+std::shared_ptr<const RootLock> lockRoot(const HostOptions& options, FileUtils& fileUtils) {
   if (options.root.empty()) throw std::invalid_argument("A host needs a root directory.");
   if (!options.lockRoot) return nullptr;
   fileUtils.createDirectory(options.root, true);
-  return std::make_unique<const RootLock>(options.root);
+  return std::make_shared<const RootLock>(options.root);
 }
 
 std::string nameOfSession(const std::string& sessionKey) {
@@ -103,6 +101,17 @@ std::shared_ptr<AnalyticsEventReporter> reporterFor(std::unique_ptr<XAnalytics> 
 std::shared_ptr<AsyncExecutor> pruningQueue(const HostOptions& options, TaskQueueFactory& queues) {
   const bool prunesPromptly = options.prune == Prune::Promptly && options.runMaintenance;
   return prunesPromptly ? queues.createWorkQueue() : nullptr;
+}
+
+// False if that takes longer: then the threads are left behind.
+bool finish(ThreadQueueFactory& threads, std::chrono::seconds patience) {
+  if (threads.drain(patience)) {
+    threads.shutDown();
+    return true;
+  }
+  LOG(ERROR) << "Host destroyed with work pending; its threads were detached.";
+  threads.abandon();
+  return false;
 }
 
 void refuseOnQueueThread(const std::string& operation) {
@@ -128,7 +137,8 @@ Host::Host(HostOptions options)
       tagsTellKeys_(!options.sessionTagMapper),
       sessionTagMapper_(options.sessionTagMapper ? options.sessionTagMapper : nameOfSession),
       runMaintenance_(options.runMaintenance),
-      shutDownPatience_(within(options.shutDownPatience, kLongestPatience)),
+      shutDownPatience_(
+          std::clamp<std::chrono::seconds>(options.shutDownPatience, std::chrono::seconds::zero(), kLongestPatience)),
       analytics_(reporterFor(std::move(options.analytics))),
       threads_(options.taskQueueFactory ? nullptr : std::make_shared<ThreadQueueFactory>()),
       taskQueueFactory_(threads_ ? threads_ : options.taskQueueFactory),
@@ -171,16 +181,20 @@ Host::~Host() {
   closeIncidentGate(haveThreadsEnded ? shutDownPatience_ : std::chrono::seconds(0));
 }
 
-// False when they were left behind.
+// False when they were left behind, or are to end later.
 bool Host::endThreads() {
   if (threads_ == nullptr) return true;
   threads_->refuseNewWork();
-  if (threads_->drain(shutDownPatience_)) {
-    threads_->shutDown();
-    return true;
+  if (!threads_->isOwnThread()) return finish(*threads_, shutDownPatience_);
+  // This thread has to run what would be waited for, so another one waits, and keeps the root until then.
+  try {
+    std::thread([threads = threads_, root = rootLock_, patience = shutDownPatience_] {
+      finish(*threads, patience);
+    }).detach();
+  } catch (const std::system_error& error) {
+    LOG(ERROR) << "Host destroyed on a thread of its own, and no other one can wait for its work: " << error.what();
+    threads_->abandon();
   }
-  LOG(ERROR) << "Host destroyed with work pending; its threads were detached.";
-  threads_->abandon();
   return false;
 }
 

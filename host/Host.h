@@ -71,7 +71,7 @@ struct HostOptions {
   // years) count as that.
   long lazyDelaySeconds = 10;
   bool runMaintenance = true;  // whether managers remove stale data and prune stores that are over their limits
-  std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for accepted work; 100 years at most
+  std::chrono::seconds shutDownPatience{30};  // how long the destructor waits for accepted work
 
   // With `Promptly` a manager prunes `pruneDelay` after a limit has been exceeded by more than a tenth, if it still is:
   // its own limit or that of a disk cache, the configured one. It then prunes each disk cache that is over its own
@@ -117,10 +117,10 @@ struct HostOptions {
   // manager, and of a store that could not be created, when the request to the host is over; of a store's values, and
   // of the trash, perhaps within an operation of a store, so it must not use stores then.
   //
-  // What is reported before the host is destroyed is handed over before the destructor returns. What still waits is
-  // dropped if the queues came with the options, the patience has been used up, or the destructor runs on a thread of
-  // the host's own queues. The destructor waits for a call that is under way for
-  // `shutDownPatience` at most, and not for one that it runs in. No call begins after it has returned.
+  // What is reported before the host is destroyed is handed over before the destructor returns, but not if the queues
+  // came with the options, the patience has been used up, or the destructor runs on a thread of the host's own queues:
+  // what still waits is dropped then. The destructor waits for a call that is under way for `shutDownPatience` at most,
+  // and not for one that it runs in. No call begins after it has returned.
   std::function<void(const Incident& incident)> onIncident;
 };
 
@@ -169,10 +169,12 @@ enum class TrashSize { Skipped, Measured };
 // detached and one error line is logged: a write that they do not reach fails, and its previous value remains. Managers
 // and stores that are still held do no more work: their futures are broken promises.
 //
+// The destructor may run on one of the host's own queues, in a callback that releases the last reference. It cannot
+// wait there: it returns at once, and all of the above happens on a thread of its own, for which a process that is to
+// end must leave the time. Until then the root is in use, for that callback, too.
+//
 // The destructor does not wait for queues that came with the options: let them finish before another host uses the
-// root. The destructor may run on one of the host's own queues, where it cannot wait: it ends as if its patience had
-// been used up. Writes that have yet to go to another queue fail, and the root is free for another host while tasks
-// that have begun still run. Keep the last reference elsewhere if the stores have data that cannot be fetched again.
+// root.
 class CELLAR_EXPORT Host : public session::Invalidatable {
  public:
   // Throws what `Configuration` throws, and `ConfigurationException` when two managers of one area are both session
@@ -291,7 +293,7 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   const std::shared_ptr<const Configuration> configuration_;
   const std::vector<std::string> managerNames_;  // sorted
   const std::shared_ptr<FileUtils> fileUtils_;
-  const std::unique_ptr<const RootLock> rootLock_;  // null without `lockRoot`; released after all that follows
+  const std::shared_ptr<const RootLock> rootLock_;  // null without `lockRoot`; released after all that follows
   const std::shared_ptr<StoreDirectoryNameBuilderFactory> nameBuilders_;
   const bool tagsTellKeys_;
   const std::function<std::string(const std::string&)> sessionTagMapper_;

@@ -1,6 +1,5 @@
 #include "host/ThreadQueueFactory.h"
 
-#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdint>
@@ -20,11 +19,6 @@ namespace velmora::mobile::xplat::cellar::host {
 namespace {
 
 using Task = std::function<void()>;
-
-std::chrono::nanoseconds inNanoseconds(std::chrono::milliseconds duration) {
-  constexpr std::chrono::milliseconds longest = std::chrono::hours(24 * 365 * 100);
-  return std::clamp(duration, std::chrono::milliseconds::zero(), longest);
-}
 
 // The handle of a queue that users own. The queue itself lives until its tasks have run.
 class QueueHandle : public AsyncExecutor, public std::enable_shared_from_this<QueueHandle> {
@@ -74,7 +68,7 @@ class ThreadQueueFactory::Threads {
 ThreadQueueFactory::ThreadQueueFactory() : threads_(std::make_unique<Threads>()) {}
 
 ThreadQueueFactory::~ThreadQueueFactory() {
-  if (threads_->pool->isOwnThread()) {
+  if (isOwnThread()) {
     abandon();
   } else {
     shutDown();
@@ -88,6 +82,8 @@ std::shared_ptr<AsyncExecutor> ThreadQueueFactory::createQueue() {
 std::shared_ptr<AsyncExecutor> ThreadQueueFactory::createWorkQueue() {
   return threads_->createQueue("work", threads_->workQueues);
 }
+
+bool ThreadQueueFactory::isOwnThread() const { return threads_->pool->isOwnThread(); }
 
 void ThreadQueueFactory::refuseOnQueueThread(const std::string& operation, const std::string& advice) {
   const bool isMarked = QueueThreadMark::tell(operation);
@@ -103,7 +99,7 @@ ThreadQueueFactory::Load ThreadQueueFactory::load() const {
 }
 
 bool ThreadQueueFactory::drain(std::chrono::milliseconds patience) {
-  return !threads_->pool->isOwnThread() && threads_->pool->waitUntilIdle(deadlineAfter(inNanoseconds(patience)));
+  return !isOwnThread() && threads_->pool->waitUntilIdle(deadlineAfter(detail::inMilliseconds(patience)));
 }
 
 void ThreadQueueFactory::refuseNewWork() {
@@ -113,7 +109,7 @@ void ThreadQueueFactory::refuseNewWork() {
 
 void ThreadQueueFactory::shutDown() {
   threads_->close();
-  if (!threads_->pool->isOwnThread()) threads_->pool->join();
+  if (!isOwnThread()) threads_->pool->join();
 }
 
 void ThreadQueueFactory::abandon() {

@@ -12,8 +12,7 @@ namespace velmora::mobile::xplat::cellar::host {
 
 namespace detail {
 
-// Rounded up. What is beyond a hundred years becomes that, whatever the unit: it would be beyond the milliseconds'
-// range.
+// Rounded up, from 0 to 100 years, so that longer durations of coarser units do not overflow.
 template <class Rep, class Period>
 std::chrono::milliseconds inMilliseconds(std::chrono::duration<Rep, Period> duration) {
   constexpr std::chrono::hours longest(24 * 365 * 100);
@@ -66,6 +65,9 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   std::shared_ptr<AsyncExecutor> createQueue() override;
   std::shared_ptr<AsyncExecutor> createWorkQueue() override;
 
+  // Whether the calling thread is one of this factory's.
+  bool isOwnThread() const;
+
   // Throws `std::logic_error` on a thread of any factory and under a `QueueThreadMark`: what `operation` waits for may
   // have to run there. The text names the operation and ends with the advice.
   static void refuseOnQueueThread(const std::string& operation, const std::string& advice);
@@ -82,6 +84,8 @@ class CELLAR_EXPORT ThreadQueueFactory : public TaskQueueFactory {
   // than `patience`. Armed timers do not count. Says nothing about what other threads dispatch during the call. Called
   // from a task of these queues it would deadlock, so it returns false at once.
   bool drain(std::chrono::milliseconds patience);
+
+  // The same, in any unit; rounded up to milliseconds.
   template <class Rep, class Period> bool drain(std::chrono::duration<Rep, Period> patience) {
     return drain(detail::inMilliseconds(patience));
   }

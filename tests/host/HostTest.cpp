@@ -1308,6 +1308,68 @@ TEST_F(HostTest, TheHostMayBeDestroyedByATaskOfItsOwnQueue) {
   EXPECT_TRUE(directory.exists("caches/_sessionlessStore/thumbs_250_v1"));
 }
 
+// Each of these writes needs a file queue, and then the work queue that the host is destroyed on.
+TEST_F(HostTest, DestroyedOnAQueueOfItsOwnItLosesNoValueAndKeepsTheRootUntilThen) {
+  const Watchdog watchdog(kLongEnough);
+  const LogCapture log;
+  constexpr std::size_t keys = 50;
+  const auto startWithValues = [this] {
+    HostOptions patient = options();
+    patient.configuration = kConfigurationOfValues;
+    patient.shutDownPatience = kLongPatience;
+    return std::make_shared<Host>(std::move(patient));
+  };
+  auto host = startWithValues();
+  auto letters = host->store<PersistentKeyValueStore>("letters");
+  const auto queue = host->queues()->createWorkQueue();
+  std::vector<Future<void>> writes;
+  int codeOfAnother = 0;
+  Latch destroyed(1);
+  Latch gate(1);
+  queue->dispatch([&, host = std::move(host), letters = std::move(letters)]() mutable {
+    for (std::size_t key = 0; key < keys; ++key) writes.push_back(letters->store("key" + std::to_string(key), {1}));
+    letters.reset();
+    host.reset();
+    codeOfAnother = codeOf(startWithValues);
+    destroyed.countDown();
+    gate.wait();
+  });
+  destroyed.wait();
+  EXPECT_EQ(codeOfAnother, EWOULDBLOCK);
+  EXPECT_EQ(codeOf(startWithValues), EWOULDBLOCK);
+  EXPECT_THROW(static_cast<void>(await(dispatchTask<void>(queue, [] {}))), std::future_error);
+  gate.countDown();
+  for (const auto& write : writes) EXPECT_NO_THROW(await(write));
+  while (codeOf([&] { host = startWithValues(); }) == EWOULDBLOCK) std::this_thread::yield();
+
+  const auto reopened = host->store<PersistentKeyValueStore>("letters");
+  for (std::size_t key = 0; key < keys; ++key) {
+    EXPECT_NE(await(reopened->fetch("key" + std::to_string(key))), nullptr) << key;
+  }
+  EXPECT_TRUE(log.messages().empty());
+}
+
+TEST_F(HostTest, DestroyedOnAQueueOfItsOwnItWaitsForNoLongerThanItsPatience) {
+  const Watchdog watchdog(kLongEnough);
+  const LogCapture log;
+  HostOptions impatient = options();
+  impatient.shutDownPatience = std::chrono::seconds(0);
+  auto host = std::make_shared<Host>(std::move(impatient));
+  const auto queue = host->queues()->createQueue();
+  const auto gate = std::make_shared<Latch>(1);
+  const auto over = std::make_shared<Latch>(1);
+  queue->dispatch([gate, over, host = std::move(host)]() mutable {
+    host.reset();
+    gate->wait();
+    over->countDown();
+  });
+  while (codeOf([this] { start(); }) == EWOULDBLOCK) std::this_thread::yield();
+  EXPECT_EQ(log.messages(), std::vector<std::string>{"Host destroyed with work pending; its threads were detached."});
+  EXPECT_FALSE(over->isOpen());
+  gate->countDown();
+  over->wait();
+}
+
 TEST_F(HostTest, QueuesThatWereBroughtAlongAreNotWaitedForAndGoOn) {
   const auto queues = std::make_shared<ManualQueueFactory>();
   HostOptions manual = options();
