@@ -3,6 +3,7 @@
 #include <chrono>
 #include <future>
 #include <stdexcept>
+#include <thread>
 #include <utility>
 
 #include <cellar/Export.h>
@@ -19,6 +20,41 @@ class CELLAR_EXPORT TimeoutError : public std::runtime_error {
   ~TimeoutError() override;
 };
 
+namespace detail {
+
+// One wait of this thread. While it `goesOn`, the thread yields instead of sleeping.
+class CELLAR_EXPORT Lookout {
+ public:
+  Lookout();
+  ~Lookout();
+  Lookout(const Lookout&) = delete;
+  Lookout& operator=(const Lookout&) = delete;
+
+  bool goesOn() const;
+
+ private:
+  bool isShort() const;
+
+  const std::chrono::steady_clock::time_point begin_;
+};
+
+template <class T> bool hasCome(const std::future<T>& value) {
+  return value.wait_for(std::chrono::seconds(0)) == std::future_status::ready;
+}
+
+// False when the time is over. A timeout of 0 or less does not wait, one of more than a year never ends.
+template <class T> bool arrives(const std::future<T>& value, std::chrono::milliseconds timeout) {
+  constexpr std::chrono::hours year(24 * 365);  // a later end is beyond the range of some clocks
+  if (timeout.count() <= 0) return hasCome(value);
+  const Lookout lookout;
+  while (lookout.goesOn() && !hasCome(value)) std::this_thread::yield();
+  if (timeout <= year) return value.wait_for(timeout) == std::future_status::ready;
+  value.wait();
+  return true;
+}
+
+}  // namespace detail
+
 // Blocks until the future has its value, and returns it or rethrows its exception (`std::future_error`, broken promise,
 // when the work was dropped). Throws `FutureMisuseError` for a future that is empty, that has a callback, or whose
 // value was already taken.
@@ -26,22 +62,14 @@ class CELLAR_EXPORT TimeoutError : public std::runtime_error {
 // Do not call it on the queue that does the work: it would deadlock. On the threads of the host kit's own queues, for
 // example in a callback of a store, it throws `std::logic_error` and leaves the future unchanged: use `Future::then`.
 // It throws there even when the value is available already, so that a program does not work or fail by chance.
+//
+// The thread sleeps. If the last value came within 100 microseconds, it first looks out for this one for as long.
 template <class T> [[nodiscard]] T await(Future<T> future) {
   ThreadQueueFactory::refuseOnQueueThread("await", "Use Future::then instead.");
-  return toStdFuture(std::move(future)).get();
+  std::future<T> value = toStdFuture(std::move(future));
+  detail::arrives(value, std::chrono::milliseconds::max());
+  return value.get();
 }
-
-namespace detail {
-
-// False when the time is over. A timeout of 0 or less does not wait, one of more than a year never ends.
-template <class T> bool arrives(const std::future<T>& value, std::chrono::milliseconds timeout) {
-  constexpr std::chrono::hours year(24 * 365);  // a later end is beyond the range of some clocks
-  if (timeout <= year) return value.wait_for(timeout) == std::future_status::ready;
-  value.wait();
-  return true;
-}
-
-}  // namespace detail
 
 // The same, for `timeout` at most; then it throws `TimeoutError`. The work is not cancelled: its value has been taken,
 // and is destroyed when it comes. A timeout of 0 or less does not wait, one of more than a year never ends.

@@ -16,10 +16,6 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-// The longest search for work before a thread sleeps. To wake one takes some tens of microseconds, longer than most
-// tasks, and whoever fetches one value after another comes back within this time.
-constexpr std::chrono::microseconds kLongestSearch(100);
-
 // The pool that this thread works for. Its threads keep a pool alive, so its address cannot be reused meanwhile.
 thread_local const ThreadPool* currentPool = nullptr;
 
@@ -129,7 +125,7 @@ void ThreadPool::schedule(std::shared_ptr<Work> work) {
 // Releases the lock.
 void ThreadPool::wakeOne(std::unique_lock<std::mutex>& lock) {
   if (sleepers_ == 0) return lock.unlock();
-  searchPays_ = hasOtherProcessors_ && Clock::now() - fellAsleep_ < kLongestSearch;
+  searchPays_ = hasOtherProcessors_ && Clock::now() - fellAsleep_ < kLongestLookout;
   lock.unlock();
   changed_.notify_one();
 }
@@ -161,7 +157,7 @@ std::shared_ptr<ThreadPool::Work> ThreadPool::take() {
 // thread is woken meanwhile: what goes from queue to queue, or comes right behind, finds this one.
 void ThreadPool::search() {
   if (!searchPays_ || hasReadyWork_ || isSearching_.exchange(true)) return;
-  const Clock::time_point end = Clock::now() + kLongestSearch;
+  const Clock::time_point end = Clock::now() + kLongestLookout;
   while (!hasReadyWork_ && searchPays_) {
     std::this_thread::yield();  // the thread that will schedule may need the processor
     if (Clock::now() >= end) searchPays_ = false;

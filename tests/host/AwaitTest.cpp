@@ -15,11 +15,15 @@
 #include "host/ThreadQueueFactory.h"
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
+#include "support/Watchdog.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 namespace {
 
 using test::Latch;
+using test::Watchdog;
+
+constexpr unsigned int kLongEnough = 60;  // seconds, for whatever does not hang
 
 template <class Operation> FutureError::Code codeOf(Operation operation) {
   try {
@@ -218,6 +222,29 @@ TEST(Await, AValueAndTheEndOfTheTimeMayMeet) {
     });
     ASSERT_EQ(outcomes, 1);
   }
+}
+
+// --- How it waits ---
+
+// Each on a thread of its own, as a thread remembers its last wait.
+TEST(AwaitLookout, BeginsWhenTheLastWaitWasShortAndEnds) {
+  const Watchdog watchdog(kLongEnough);
+  std::thread([] {
+    EXPECT_FALSE(detail::Lookout().goesOn());
+    bool hasBegun = false;
+    while (!hasBegun) {  // the processor may have been busy otherwise
+      { const detail::Lookout brief; }
+      const detail::Lookout next;
+      hasBegun = next.goesOn();
+      while (next.goesOn()) std::this_thread::yield();
+    }
+    EXPECT_FALSE(detail::Lookout().goesOn());  // that one took its time
+  }).join();
+}
+
+TEST(AwaitLookout, IsOneOfItsThreadAlone) {
+  { const detail::Lookout brief; }
+  std::thread([] { EXPECT_FALSE(detail::Lookout().goesOn()); }).join();
 }
 
 // --- Where it is refused ---
