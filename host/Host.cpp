@@ -187,6 +187,7 @@ bool Host::endThreads() {
   threads_->refuseNewWork();
   if (!threads_->isOwnThread()) return finish(*threads_, shutDownPatience_);
   // This thread has to run what would be waited for, so another one waits, and keeps the root until then.
+  if (rootLock_ != nullptr) rootLock_->announceEnd();
   try {
     std::thread([threads = threads_, root = rootLock_, patience = shutDownPatience_] {
       finish(*threads, patience);

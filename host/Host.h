@@ -171,7 +171,8 @@ enum class TrashSize { Skipped, Measured };
 //
 // The destructor may run on one of the host's own queues, in a callback that releases the last reference. It cannot
 // wait there: it returns at once, and all of the above happens on a thread of its own, for which a process that is to
-// end must leave the time. Until then the root is in use, for that callback, too.
+// end must leave the time. Until then the root is in use: another host waits for it in its constructor, and in that
+// callback is refused.
 //
 // The destructor does not wait for queues that came with the options: let them finish before another host uses the
 // root.
@@ -181,8 +182,9 @@ class CELLAR_EXPORT Host : public session::Invalidatable {
   // scoped or both not (they would share a directory and remove each other's stores); each of these is a
   // `ConfigurationError` of host/Errors.h as well, which tells line and column. `std::invalid_argument` when the root
   // is empty; `FileUtilsIoException` when the root cannot be created or locked, at once and with the owner's process id
-  // when another host uses it (code `EWOULDBLOCK`). Creates the root and its lock file; all other directories are
-  // created with the managers. Without `lockRoot` it does not access the disk.
+  // when another host uses it (code `EWOULDBLOCK`), unless that one is just ending on a queue of its own. Creates the
+  // root and its lock file; all other directories are created with the managers. Without `lockRoot` it does not access
+  // the disk.
   explicit Host(HostOptions options);
   Host(const std::string& configuration, const std::string& root);
   ~Host() override;

@@ -10,10 +10,12 @@
 #include <chrono>
 #include <csignal>
 #include <cstdlib>
+#include <string>
 #include <system_error>
 #include <thread>
 
 #include "LarderException.h"
+#include "host/queues/ThreadPool.h"
 
 namespace velmora::mobile::xplat::cellar::host {
 
@@ -33,6 +35,15 @@ constexpr std::chrono::milliseconds kBetweenAttempts(1);
   const int error = errno;
   fail(path, error, std::generic_category().message(error));
 }
+
+const char* const kEnding = " ending";  // behind the process id
+
+struct Owner {
+  pid_t process = 0;  // 0 if none is written, or one that has ended without removing it
+  bool isEnding = false;
+};
+
+bool isAlive(pid_t process) { return process > 0 && (::kill(process, 0) == 0 || errno != ESRCH); }
 
 [[noreturn]] void throwInUse(const std::string& root, pid_t owner) {
   const std::string who = owner == 0 ? "another process" : "process " + std::to_string(owner);
@@ -71,16 +82,17 @@ class RootLock::File {
   // Explicitly: closing does not release the lock while a forked child has the file open, too.
   void unlock() const { (void)::flock(descriptor_, LOCK_UN); }
 
-  // 0 if no process id is written, or that of a process that has ended without removing it.
-  pid_t livingOwner() const {
+  Owner livingOwner() const {
     std::array<char, 32> text{};
-    if (::pread(descriptor_, text.data(), text.size() - 1, 0) <= 0) return 0;
-    const auto owner = static_cast<pid_t>(std::strtol(text.data(), nullptr, 10));
-    const bool isAlive = owner > 0 && (::kill(owner, 0) == 0 || errno != ESRCH);
-    return isAlive ? owner : 0;
+    if (::pread(descriptor_, text.data(), text.size() - 1, 0) <= 0) return {};
+    char* end = nullptr;
+    const auto process = static_cast<pid_t>(std::strtol(text.data(), &end, 10));
+    if (!isAlive(process)) return {};
+    return {process, std::string(end).rfind(kEnding, 0) == 0};
   }
 
-  // Only for messages, so a failure, for example on a full disk, is ignored. A file with another name may be anybody's.
+  // Only for those who wait, so a failure, for example on a full disk, is ignored. A file with another name may be
+  // anybody's.
   void writeOwner(const std::string& text) const {
     struct stat status {};
     if (::fstat(descriptor_, &status) != 0 || status.st_nlink > 1) return;
@@ -106,13 +118,17 @@ const std::string RootLock::fileName = "_cellar_lock";
 RootLock::RootLock(const std::string& root)
     : owner_(::getpid()), file_(std::make_unique<const File>(inDirectory(root, fileName))) {
   file_->requireRegular();
-  for (int attempt = 1; !file_->tryLock(); ++attempt) {
-    const pid_t owner = file_->livingOwner();
-    if (owner != 0 || attempt == kAttempts) throwInUse(root, owner);
+  int attempts = 0;
+  while (!file_->tryLock()) {
+    const Owner owner = file_->livingOwner();
+    const bool isEndingHere = owner.isEnding && owner.process == owner_ && !ThreadPool::isThreadOfAnyPool();
+    if (!isEndingHere && (owner.process != 0 || ++attempts == kAttempts)) throwInUse(root, owner.process);
     std::this_thread::sleep_for(kBetweenAttempts);
   }
   file_->writeOwner(std::to_string(owner_) + "\n");
 }
+
+void RootLock::announceEnd() const { file_->writeOwner(std::to_string(owner_) + kEnding + "\n"); }
 
 RootLock::~RootLock() {
   if (::getpid() != owner_) return;

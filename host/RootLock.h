@@ -25,7 +25,13 @@ class CELLAR_EXPORT RootLock {
   // already, with the directory and the owner's process id in the text; else the code of the failed operation (for
   // example on a file system without locks), or 0 if the lock file is not a regular file. Links are not followed. The
   // directory must exist.
+  //
+  // An owner in this process that has announced its end is waited for, but not on threads of the host kit's queues: it
+  // may need them.
   explicit RootLock(const std::string& root);
+
+  // Says that this lock will be released without further calls, when some work is finished. Thread-safe.
+  void announceEnd() const;
 
   // Releases the lock in the process that acquired it; in a forked child it does nothing, and the parent keeps the
   // lock.

@@ -12,12 +12,15 @@
 #include <cerrno>
 #include <csignal>
 #include <filesystem>
+#include <future>
 #include <memory>
 #include <string>
+#include <thread>
 #include <utility>
 #include <vector>
 
 #include "LarderException.h"
+#include "host/ThreadQueueFactory.h"
 #include "support/TemporaryDirectory.h"
 #include "support/Watchdog.h"
 
@@ -117,6 +120,35 @@ TEST_F(RootLockTest, IsFreeAgainWhenItsOwnerIsDestroyed) {
   auto lock = std::make_unique<RootLock>(directory_.path());
   lock.reset();
   EXPECT_TRUE(isFree());
+}
+
+TEST_F(RootLockTest, OfAnOwnerThatHasAnnouncedItsEndIsWaitedFor) {
+  auto lock = std::make_unique<RootLock>(directory_.path());
+  lock->announceEnd();
+  EXPECT_EQ(directory_.read("_cellar_lock"), std::to_string(::getpid()) + " ending\n");
+  std::atomic<bool> isReleased{false};
+  std::thread ending([&] {
+    isReleased = true;
+    lock.reset();
+  });
+  const RootLock next(directory_.path());
+  EXPECT_TRUE(isReleased);
+  ending.join();
+  EXPECT_EQ(failure(), inUseBy(thisProcess()));
+}
+
+TEST_F(RootLockTest, OfAnOwnerThatHasAnnouncedItsEndIsRefusedOnAQueueThatItMayNeed) {
+  const RootLock lock(directory_.path());
+  lock.announceEnd();
+  ThreadQueueFactory queues;
+  std::promise<std::pair<int, std::string>> failed;
+  queues.createQueue()->dispatch([&] { failed.set_value(failure()); });
+  EXPECT_EQ(failed.get_future().get(), inUseBy(thisProcess()));
+}
+
+TEST_F(RootLockTest, OfAnotherProcessThatHasAnnouncedItsEndIsRefused) {
+  const Child child([&] { (new RootLock(directory_.path()))->announceEnd(); });
+  EXPECT_EQ(failure(), inUseBy("process " + std::to_string(child.process())));
 }
 
 TEST_F(RootLockTest, OfAnotherProcessIsRefusedWithItsIdUntilThatIsKilled) {
