@@ -153,7 +153,20 @@ build() {
   logged "$preset-build" ninja -C "build/$preset" -j "$jobs" "$@"
 }
 
-# Runs the tests of a tree. Prints what failed with its output, and ctest's own closing lines always:
+# What failed in a log of ctest, with its output, but without that of a program's tests that passed.
+failures_of() {
+  sed '/% tests passed/q; /^ *Start /d; / Passed /d; /^\[----------\]/d; /^$/d' "$1" | awk '
+    function flush() { if (held != "") print held; held = "" }
+    /^\[ RUN      \]/ { flush(); held = $0; next }
+    /^\[       OK \]/ { held = ""; next }
+    /^\[  FAILED  \]/ || /^ *[0-9]+\/[0-9]+ Test / { flush() }
+    held != "" { held = held "\n" $0; next }
+    { print }
+    END { flush() }'
+}
+
+# Runs the tests of a tree. Prints what failed with its output, and the numbers always. The test programs run in parts, which
+# ctest counts as one test each; what their tests are is what the programs say.
 # run_tests PRESET [CTEST_OPTION...]
 run_tests() {
   local preset=$1 log=$logs/$1-tests.log status=0
@@ -161,8 +174,13 @@ run_tests() {
   say "Testing build/$preset"
   ctest --preset "$preset" --output-on-failure --no-tests=error --timeout 300 -j "$jobs" "$@" >"$log" 2>&1 </dev/null || status=$?
   if ((status != 0)); then
-    sed -n '/% tests passed/q; /^ *Start /d; / Passed /d; p' "$log" | { head -n 400 && cat >/dev/null; }
+    failures_of "$log" | { head -n 400 && cat >/dev/null; }
   fi
   sed -n '/% tests passed/,$p' "$log"
+  awk '/^\[==========\] [0-9]+ tests? from .* ran\./ { ran += $2 }
+    /^\[  PASSED  \] [0-9]+ test/ { passed += $4 }
+    /^\[  SKIPPED \] .* \(/ { print "skipped: " $0; skipped++ }
+    END { printf "In these, the test programs ran %d tests: %d passed, %d skipped\n", ran, passed, skipped }' \
+    "build/$preset/Testing/Temporary/LastTest.log"
   return "$status"
 }

@@ -1359,13 +1359,16 @@ TEST_F(HostTest, DestroyedOnAQueueOfItsOwnItWaitsForNoLongerThanItsPatience) {
   impatient.shutDownPatience = std::chrono::seconds(0);
   auto host = std::make_shared<Host>(std::move(impatient));
   const auto queue = host->queues()->createQueue();
+  const auto destroyed = std::make_shared<Latch>(1);
   const auto gate = std::make_shared<Latch>(1);
   const auto over = std::make_shared<Latch>(1);
-  queue->dispatch([gate, over, host = std::move(host)]() mutable {
+  queue->dispatch([destroyed, gate, over, host = std::move(host)]() mutable {
     host.reset();
+    destroyed->countDown();
     gate->wait();
     over->countDown();
   });
+  destroyed->wait();
   start();
   EXPECT_EQ(log.messages(), std::vector<std::string>{"Host destroyed with work pending; its threads were detached."});
   EXPECT_FALSE(over->isOpen());
