@@ -13,6 +13,9 @@ mkdir -p "$logs"
 [[ -n ${CCACHE_DIR:-} || -w ${HOME:-/nonexistent} ]] || export CCACHE_DIR=$root/build/ccache
 # What one clone has compiled serves every other, wherever it lies.
 export CCACHE_BASEDIR=$root CCACHE_NOHASHDIR=1
+# In front of a compiler that is called by a script.
+launcher=()
+[[ -z $(command -v ccache) ]] || launcher=(ccache)
 
 # ---- saying what happens ------------------------------------------------------------------------------------------------
 
