@@ -160,7 +160,7 @@ TEST_F(Inspecting, ListsWhatGoesNextByTheConfiguredStrategyAndSaysWhy) {
   data_.putItem(kThumbs, "small and old", "s", 3 * kDay);
   data_.putItem(kThumbs, "large", std::string(100000, 'l'), 2 * kDay);
   data_.putItem(kThumbs, "small and new", "s", kDay);
-  EXPECT_THAT(text(), HasSubstr("thumbs_250_v1, next to be evicted by lru, as --config does not say otherwise:"));
+  EXPECT_THAT(text(), HasSubstr("thumbs_250_v1, next to be evicted by lru, as no configuration says otherwise:"));
   for (const char* const strategy : {"lru", "null", "video_download"}) {
     useStrategy(strategy);
     EXPECT_THAT(keysOf(storeIn(look(), kThumbs).nextToGo), ElementsAre("small and old", "large")) << strategy;

@@ -142,7 +142,7 @@ class Printer {
   }
 
   static std::string noteOfOrder(const StoreSurvey& store) {
-    if (!store.isOrderConfigured) return " by lru, as --config does not say otherwise";
+    if (!store.isOrderConfigured) return " by lru, as no configuration says otherwise";
     if (store.order == "greedy_dual") return " by greedy_dual, as after a restart";
     return store.order == "lru" ? "" : " by " + store.order + ", without the application's weights";
   }
