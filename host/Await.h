@@ -45,7 +45,8 @@ template <class T> bool hasCome(const std::future<T>& value) {
 // False when the time is over. A timeout of 0 or less does not wait, one of more than a year never ends.
 template <class T> bool arrives(const std::future<T>& value, std::chrono::milliseconds timeout) {
   constexpr std::chrono::hours year(24 * 365);  // a later end is beyond the range of some clocks
-  if (timeout.count() <= 0) return hasCome(value);
+  if (hasCome(value)) return true;
+  if (timeout.count() <= 0) return false;
   const Lookout lookout;
   while (lookout.goesOn() && !hasCome(value)) std::this_thread::yield();
   if (timeout <= year) return value.wait_for(timeout) == std::future_status::ready;

@@ -170,9 +170,9 @@ enum class TrashSize { Skipped, Measured };
 // and stores that are still held do no more work: their futures are broken promises.
 //
 // The destructor may run on one of the host's own queues, in a callback that releases the last reference. It cannot
-// wait there: it returns at once, and all of the above happens on a thread of its own, for which a process that is to
-// end must leave the time. Until then the root is in use: another host waits for it in its constructor, and in that
-// callback is refused.
+// wait there: it returns at once, and another thread waits and ends the queues. To a process that ends before that
+// happens what happens to one that is killed. Until then the root is in use: another host waits for it in its
+// constructor, and in that callback is refused.
 //
 // The destructor does not wait for queues that came with the options: let them finish before another host uses the
 // root.

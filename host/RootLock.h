@@ -30,7 +30,7 @@ class CELLAR_EXPORT RootLock {
   // may need them.
   explicit RootLock(const std::string& root);
 
-  // Says that this lock will be released without further calls, when some work is finished. Thread-safe.
+  // Announces that the lock will be released soon, so that it is waited for. Thread-safe.
   void announceEnd() const;
 
   // Releases the lock in the process that acquired it; in a forked child it does nothing, and the parent keeps the
