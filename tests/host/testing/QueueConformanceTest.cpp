@@ -314,20 +314,21 @@ TEST(QueueConformance, FindsAQueueThatKeepsTheTasksOfCancelledTimers) {
 TEST(QueueConformance, FindsQueuesThatRunOnAfterTheirFactory) {
   class Factory : public TaskQueueFactory {
    public:
-    std::shared_ptr<AsyncExecutor> createQueue() override { return kit().createQueue(); }
-    std::shared_ptr<AsyncExecutor> createWorkQueue() override { return kit().createWorkQueue(); }
+    explicit Factory(host::ThreadQueueFactory& longerLived) : longerLived_(longerLived) {}
+    std::shared_ptr<AsyncExecutor> createQueue() override { return longerLived_.createQueue(); }
+    std::shared_ptr<AsyncExecutor> createWorkQueue() override { return longerLived_.createWorkQueue(); }
 
    private:
-    static host::ThreadQueueFactory& kit() {
-      static host::ThreadQueueFactory forever;
-      return forever;
-    }
+    host::ThreadQueueFactory& longerLived_;
   };
-  EXPECT_THAT(check<Factory>(), IsEmpty());
+  host::ThreadQueueFactory kit;
+  const auto make = [&kit] { return std::make_shared<Factory>(kit); };
+  EXPECT_THAT(checkConformance(make), IsEmpty());
   QueueConformanceOptions options;
   options.closeWithFactory = true;
-  EXPECT_THAT(check<Factory>(options), Contains("Queues whose factory is destroyed: The task of a timer that had not "
-                                                "fired remained after closing."));
+  EXPECT_THAT(checkConformance(make, options),
+              Contains("Queues whose factory is destroyed: The task of a timer that had "
+                       "not fired remained after closing."));
 }
 
 // Factories
