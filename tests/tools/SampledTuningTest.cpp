@@ -25,7 +25,11 @@ namespace {
 using testing::HasSubstr;
 using testing::Not;
 
+#if defined(CELLAR_RUNS_SLOWLY)
+constexpr std::uint32_t kSeeds = 1;
+#else
 constexpr std::uint32_t kSeeds = 3;
+#endif
 
 struct Request {
   std::string key;
@@ -112,7 +116,7 @@ TEST(SampledTuning, ATenthOfTheKeysGivesEveryStrategysFiguresWithinTheStatedErro
       }
     }
   }
-  EXPECT_GT(compared, 100);
+  EXPECT_GT(compared, 33 * static_cast<int>(kSeeds));
   EXPECT_LE(outside, compared / 20);
 }
 
@@ -189,7 +193,7 @@ TEST(SampleScale, OfNothingThereIsNothing) {
 }
 
 TEST(SampledTuning, AReportSaysThatItIsEstimatedAndHowFarItMayBeOff) {
-  const std::vector<Request> requests = randomRequests(1, 30'000, 10'000);
+  const std::vector<Request> requests = randomRequests(1, 15'000, 5000);
   const Tuning whole = tunedAt(1, requests);
   EXPECT_EQ(sampleText(whole), "");
   EXPECT_FALSE(tuningAsJson(reportOf(whole)).contains("sample"));
@@ -206,11 +210,12 @@ TEST(SampledTuning, AReportSaysThatItIsEstimatedAndHowFarItMayBeOff) {
 
 TEST(SampledTuning, ASmallSampleOfALongLogGivesNoAdvice) {
   const std::vector<Request> requests = randomRequests(1, 20'000, 2000);
-  EXPECT_FALSE(adviceOn(tunedAt(1, requests)).isTooShort);
+  const Tuning whole = tunedAt(1, requests);
+  EXPECT_FALSE(adviceOn(whole).isTooShort);
+  EXPECT_THAT(adviceText(whole), Not(HasSubstr("too small")));
   const Tuning sample = tunedAt(0.01, requests);
   EXPECT_TRUE(adviceOn(sample).isTooShort);
   EXPECT_THAT(adviceText(sample), HasSubstr("The sample is too small for advice: it has "));
-  EXPECT_THAT(adviceText(tunedAt(1, requests)), Not(HasSubstr("too small")));
 }
 
 }  // namespace
