@@ -116,7 +116,7 @@ TEST(SampledTuning, ATenthOfTheKeysGivesEveryStrategysFiguresWithinTheStatedErro
       }
     }
   }
-  EXPECT_GT(compared, 33 * static_cast<int>(kSeeds));
+  EXPECT_GT(compared, 100 * static_cast<int>(kSeeds) / 3);
   EXPECT_LE(outside, compared / 20);
 }
 
