@@ -177,11 +177,11 @@ std::shared_ptr<UnmanagedMeasuring> Host::measuringEvery(std::chrono::seconds in
 
 Host::~Host() {
   lazyWork_->willBeTriggeredExternally();
-  const bool haveThreadsEnded = endThreads();  // if not, the patience is used up
-  closeIncidentGate(haveThreadsEnded ? shutDownPatience_ : std::chrono::seconds(0));
+  const bool isPatient = endThreads();
+  closeIncidentGate(isPatient ? shutDownPatience_ : std::chrono::seconds(0));
 }
 
-// False when they were left behind, or are to end later.
+// False when that has used the patience up.
 bool Host::endThreads() {
   if (threads_ == nullptr) return true;
   threads_->refuseNewWork();
@@ -196,7 +196,7 @@ bool Host::endThreads() {
     LOG(ERROR) << "Host destroyed on a thread of its own, and no other one can wait for its work: " << error.what();
     threads_->abandon();
   }
-  return false;
+  return true;
 }
 
 std::shared_ptr<StoreManager> Host::manager(const std::string& name, const std::optional<std::string>& sessionKey) {

@@ -119,8 +119,9 @@ struct HostOptions {
   //
   // What is reported before the host is destroyed is handed over before the destructor returns, but not if the queues
   // came with the options, the patience has been used up, or the destructor runs on a thread of the host's own queues:
-  // what still waits is dropped then. The destructor waits for a call that is under way for `shutDownPatience` at most,
-  // and not for one that it runs in. No call begins after it has returned.
+  // what still waits is dropped then. The destructor waits for a call that is under way for
+  // `shutDownPatience` at most, not at all if that has been used up, and not for one that it runs in. No call begins
+  // after it has returned.
   std::function<void(const Incident& incident)> onIncident;
 };
 
@@ -166,11 +167,12 @@ enum class TrashSize { Skipped, Measured };
 // with a broken promise in the future, work that waits for the lazy delay is dropped, and work that was accepted before
 // is finished, from queue to queue. Then the host's own threads end, and another host may use the root. If work is not
 // finished after `shutDownPatience` (a task that is stuck, callbacks that keep starting new work), the threads are
-// detached and one error line is logged: a write that they do not reach fails, and its previous value remains. Managers
+// detached and one error line is logged. They go on with what was dispatched, while another host may use the root
+// already: allow for the slowest disk. A write that they do not reach fails, and its previous value remains. Managers
 // and stores that are still held do no more work: their futures are broken promises.
 //
 // The destructor may run on one of the host's own queues, in a callback that releases the last reference. It cannot
-// wait there: it returns at once, and another thread waits and ends the queues. To a process that ends before that
+// wait there for the queues: another thread waits for them and ends them. To a process that ends before that
 // happens what happens to one that is killed. Until then the root is in use: another host waits for it in its
 // constructor, and in that callback is refused.
 //

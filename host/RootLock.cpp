@@ -96,8 +96,9 @@ class RootLock::File {
   void writeOwner(const std::string& text) const {
     struct stat status {};
     if (::fstat(descriptor_, &status) != 0 || status.st_nlink > 1) return;
-    if (::ftruncate(descriptor_, 0) != 0) return;
-    (void)!::pwrite(descriptor_, text.data(), text.size(), 0);
+    // A longer text fits into the block of a shorter one even when the disk is full.
+    if (::pwrite(descriptor_, text.data(), text.size(), 0) < 0) return;
+    (void)!::ftruncate(descriptor_, static_cast<off_t>(text.size()));
   }
 
  private:

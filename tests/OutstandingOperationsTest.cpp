@@ -4,9 +4,11 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <cstdlib>
+#include <future>
 #include <iostream>
 #include <memory>
 #include <new>
@@ -20,6 +22,7 @@
 #include "StoreOptions.h"
 #include "TrashCollector.h"
 #include "host/Await.h"
+#include "host/ThreadQueueFactory.h"
 #include "host/testing/ManualQueue.h"
 #include "support/MemoryPersistence.h"
 #include "support/TemporaryDirectory.h"
@@ -141,6 +144,24 @@ TEST_F(PersistentKeyValueStoreOutstandingOperations, OfAStoreThatGoesWithItsQueu
     for (auto& future : futures) host::await(std::move(future));
     EXPECT_TRUE(another.names("store").empty());
   }
+  EXPECT_LT(bytesInUse, before + 64 * 1024);
+}
+
+TEST(QueueOfTheKit, GivesBackTheMemoryOfARush) {
+  host::ThreadQueueFactory factory;
+  const auto queue = factory.createQueue();
+  const auto rush = [&](std::size_t tasks) {
+    std::promise<void> begin;
+    queue->dispatch([&begin] { begin.get_future().wait(); });
+    for (std::size_t i = 0; i < tasks; ++i) queue->dispatch([] {});
+    begin.set_value();
+    EXPECT_TRUE(factory.drain(std::chrono::hours(1)));
+    queue->dispatch([] {});  // behind whatever the queue does after a task
+    EXPECT_TRUE(factory.drain(std::chrono::hours(1)));
+  };
+  rush(1);
+  const std::size_t before = bytesInUse;
+  rush(10 * kOperations);
   EXPECT_LT(bytesInUse, before + 64 * 1024);
 }
 

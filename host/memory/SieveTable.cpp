@@ -51,7 +51,7 @@ void SieveTable::trim(std::size_t bytes) {
 }
 
 void SieveTable::clear() {
-  entries_ = {};
+  Entries().swap(entries_);  // assigning {} would keep its buckets
   newest_ = oldest_ = hand_ = nullptr;
   bytes_ = 0;
 }

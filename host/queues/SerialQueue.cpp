@@ -40,7 +40,7 @@ void SerialQueue::run() noexcept {
     pool_->taskEnds();
   }
   running_.clear();
-  if (running_.capacity() > kKeptCapacity) running_ = {};
+  if (running_.capacity() > kKeptCapacity) std::vector<Task>().swap(running_);  // assigning {} would keep its memory
   if (hasMore()) pool_->schedule(shared_from_this());
 }
 

@@ -18,6 +18,7 @@ using Clock = std::chrono::steady_clock;
 
 // The pool that this thread works for. Its threads keep a pool alive, so its address cannot be reused meanwhile.
 thread_local const ThreadPool* currentPool = nullptr;
+thread_local bool handsOutTimers = false;
 
 // Background work must not delay its callers: a batch thread does not preempt the thread that wakes it. If the system
 // refuses, that is ignored.
@@ -53,7 +54,10 @@ std::shared_ptr<ThreadPool> ThreadPool::start(const std::function<void()>& timer
     for (std::size_t number = 1; number <= pool->workers_; ++number) {
       pool->startThread("cellar-" + std::to_string(number), [&pool = *pool] { pool.runWork(); });
     }
-    pool->startThread("cellar-timer", timers);
+    pool->startThread("cellar-timer", [timers] {
+      handsOutTimers = true;
+      timers();
+    });
   } catch (...) {
     pool->close();
     pool->join();
@@ -80,7 +84,8 @@ bool ThreadPool::admitTask() {
   return false;
 }
 
-bool ThreadPool::takesTasks() const { return !isClosed_ && (!isClosedToOthers_ || isOwnThread()); }
+// A timer that is due just then is new work, though a thread of the pool hands it out.
+bool ThreadPool::takesTasks() const { return !isClosed_ && (!isClosedToOthers_ || (isOwnThread() && !handsOutTimers)); }
 
 void ThreadPool::taskEnds() {
   if (--unfinishedTasks_ > 0) return;

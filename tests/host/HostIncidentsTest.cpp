@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <chrono>
 #include <functional>
+#include <future>
 #include <memory>
 #include <stdexcept>
 #include <string>
@@ -24,6 +25,7 @@
 #include "TrashCollector.h"
 #include "host/Await.h"
 #include "host/Host.h"
+#include "host/RootLock.h"
 #include "host/ThreadQueueFactory.h"
 #include "host/testing/ManualQueue.h"
 #include "support/Barrier.h"
@@ -323,6 +325,29 @@ TEST_F(HostIncidents, HaveTheDestructorWaitForACallThatIsUnderWay) {
   EXPECT_TRUE(wasOver);
   EXPECT_TRUE(threads->drain(kLongPatience));
   EXPECT_LE(told.size(), 2U);  // the second call may have begun before the destructor
+}
+
+TEST_F(HostIncidents, HaveTheDestructorWaitForACallThatIsUnderWayOnAQueueOfTheHostToo) {
+  Latch begun(1);
+  Latch release(1);
+  std::atomic<bool> isOver{false};
+  onIncident = [&](const Incident&) {
+    begun.countDown();
+    release.wait();
+    isOver = true;
+  };
+  host = std::make_unique<Host>(options());
+  failToCreate();
+  begun.wait();
+  std::promise<bool> wasOver;
+  host->queues()->createQueue()->dispatch([&] {
+    host.reset();
+    wasOver.set_value(isOver);
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  release.countDown();
+  EXPECT_TRUE(wasOver.get_future().get());
+  const RootLock behindTheHost(directory.path());
 }
 
 TEST_F(HostIncidents, HaveTheDestructorWaitForNoLongerThanItsPatience) {

@@ -997,6 +997,26 @@ TEST_F(ThreadQueueFactoryTest, AQueueThatIsCreatedAfterTheRefusalWorksForTasksOn
   EXPECT_TRUE(ran);
 }
 
+// Also one that is being handed over just then.
+TEST_F(ThreadQueueFactoryTest, NoTimerFiresOnceTheFactoryIsDrainedAfterTheRefusal) {
+  constexpr std::chrono::microseconds delay(50);
+  for (int i = 0; i < 300; ++i) {
+    std::atomic<bool> isDrained{false};
+    std::atomic<bool> firedLate{false};
+    ThreadQueueFactory closing;
+    const auto queue = closing.createQueue();
+    const auto due = std::chrono::steady_clock::now() + delay;
+    const auto timer = queue->dispatchAfter(
+        std::chrono::nanoseconds(delay).count(), [&] { firedLate = isDrained.load(); }, nullptr);
+    while (std::chrono::steady_clock::now() < due + std::chrono::microseconds(i)) std::this_thread::yield();
+    closing.refuseNewWork();
+    EXPECT_TRUE(closing.drain(kLongPatience));
+    isDrained = true;
+    closing.shutDown();
+    ASSERT_FALSE(firedLate);
+  }
+}
+
 TEST_F(ThreadQueueFactoryTest, TheRefusalDropsTimersArmedBeforeAndAfterIt) {
   const auto queue = factory->createQueue();
   Latch gone(2);
