@@ -60,10 +60,10 @@ template <class T> bool arrives(const std::future<T>& value, std::chrono::millis
 // when the work was dropped). Throws `FutureMisuseError` for a future that is empty, that has a callback, or whose
 // value was already taken.
 //
-// Do not call it on the queue that does the work: it would deadlock. On the threads of the host kit's own queues, for
-// example in a callback of a store, it throws `std::logic_error` and takes no value from the future: use
-// `Future::then`. It throws there even when the value is available already, so that a program does not work or fail by
-// chance, and under a `QueueThreadMark`.
+// Do not call it on the queue that does the work: it would deadlock. On the threads of the host kit's own queues (in a
+// callback of a store, for example) and under a `QueueThreadMark` it throws `std::logic_error` and takes no value from
+// the future: use `Future::then`. It throws there even when the value is available already, so that a program does not
+// work or fail by chance.
 //
 // The thread sleeps. If the last value came within 100 microseconds, it first looks out for this one for as long.
 template <class T> [[nodiscard]] T await(Future<T> future) {

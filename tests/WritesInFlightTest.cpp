@@ -724,11 +724,7 @@ TEST_F(PersistentKeyValueStoreInEveryOrder, TwoOperationsLeaveWhatTheySay) {
 }
 
 TEST_F(PersistentKeyValueStoreInEveryOrder, ThreeOperationsLeaveWhatTheySay) {
-#if defined(CELLAR_RUNS_SLOWLY)
-  performAll(scripts("AFagCP", 3), {none, oldA});
-#else
   performAll(scripts("ABFabgCP", 3), {none, oldA, oldB});
-#endif
 }
 
 TEST_F(PersistentKeyValueStoreInEveryOrder, EvictingInBetweenLeavesNoHalves) {

@@ -88,6 +88,18 @@ class HostIncidents : public testing::Test {
   // On manual queues.
   void start() { host = std::make_unique<Host>(options(queues)); }
 
+  // A handler that is under way until it is released.
+  struct HeldHandler {
+    void hold() {
+      begun.countDown();
+      release.wait();
+      isOver = true;
+    }
+    Latch begun{1};
+    Latch release{1};
+    std::atomic<bool> isOver{false};
+  };
+
   // The queue that incidents wait on. Only before a manager is built.
   static std::shared_ptr<ManualExecutor> queueOfIncidents(const ManualQueueFactory& factory) {
     return factory.workQueue(factory.workQueueCount() - 1);
@@ -302,25 +314,19 @@ TEST_F(HostIncidents, KeepNothingOfTheHandlerOnceTheHostIsGone) {
 // On queues that the host does not wait for.
 TEST_F(HostIncidents, HaveTheDestructorWaitForACallThatIsUnderWay) {
   const auto threads = std::make_shared<ThreadQueueFactory>();
-  Latch begun(1);
-  Latch release(1);
-  std::atomic<bool> isOver{false};
-  onIncident = [&](const Incident&) {
-    begun.countDown();
-    release.wait();
-    isOver = true;
-  };
+  HeldHandler handler;
+  onIncident = [&](const Incident&) { handler.hold(); };
   host = std::make_unique<Host>(options(threads));
   failToCreate();
   failToCreate();
-  begun.wait();
+  handler.begun.wait();
   std::atomic<bool> wasOver{false};
   std::thread ending([&] {
     host.reset();
-    wasOver = isOver.load();
+    wasOver = handler.isOver.load();
   });
   std::this_thread::sleep_for(std::chrono::milliseconds(20));
-  release.countDown();
+  handler.release.countDown();
   ending.join();
   EXPECT_TRUE(wasOver);
   EXPECT_TRUE(threads->drain(kLongPatience));
@@ -328,24 +334,18 @@ TEST_F(HostIncidents, HaveTheDestructorWaitForACallThatIsUnderWay) {
 }
 
 TEST_F(HostIncidents, HaveTheDestructorWaitForACallThatIsUnderWayOnAQueueOfTheHostToo) {
-  Latch begun(1);
-  Latch release(1);
-  std::atomic<bool> isOver{false};
-  onIncident = [&](const Incident&) {
-    begun.countDown();
-    release.wait();
-    isOver = true;
-  };
+  HeldHandler handler;
+  onIncident = [&](const Incident&) { handler.hold(); };
   host = std::make_unique<Host>(options());
   failToCreate();
-  begun.wait();
+  handler.begun.wait();
   std::promise<bool> wasOver;
   host->queues()->createQueue()->dispatch([&] {
     host.reset();
-    wasOver.set_value(isOver);
+    wasOver.set_value(handler.isOver);
   });
   std::this_thread::sleep_for(std::chrono::milliseconds(20));
-  release.countDown();
+  handler.release.countDown();
   EXPECT_TRUE(wasOver.get_future().get());
   const RootLock behindTheHost(directory.path());
 }
